@@ -1,0 +1,18 @@
+# orv_add_library(NAME SOURCES ... PUBLIC ... PRIVATE ...): a shared library of ours; its public
+# headers lie in include/ beside its CMakeLists.txt.
+function(orv_add_library name)
+  cmake_parse_arguments(ARG "" "" "SOURCES;PUBLIC;PRIVATE" ${ARGN})
+  add_library(${name} SHARED ${ARG_SOURCES})
+  target_include_directories(${name} PUBLIC "${CMAKE_CURRENT_SOURCE_DIR}/include"
+                                     PRIVATE "${CMAKE_CURRENT_SOURCE_DIR}/src")
+  target_link_libraries(${name} PUBLIC ${ARG_PUBLIC} PRIVATE orv_warnings ${ARG_PRIVATE})
+endfunction()
+
+# orv_add_test(NAME SOURCES ... LIBS ...): a GoogleTest program; each TEST becomes a ctest case.
+function(orv_add_test name)
+  cmake_parse_arguments(ARG "" "" "SOURCES;LIBS;INCLUDES" ${ARGN})
+  add_executable(${name} ${ARG_SOURCES})
+  target_include_directories(${name} PRIVATE "${CMAKE_CURRENT_SOURCE_DIR}" ${ARG_INCLUDES})
+  target_link_libraries(${name} PRIVATE orv_warnings GTest::gmock_main ${ARG_LIBS})
+  gtest_discover_tests(${name} DISCOVERY_TIMEOUT 60 PROPERTIES TIMEOUT 120)
+endfunction()

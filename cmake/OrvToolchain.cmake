@@ -1,0 +1,40 @@
+# Language level, warnings, sanitizers and reproducible paths for every target.
+
+set(CMAKE_CXX_STANDARD 20)
+set(CMAKE_CXX_STANDARD_REQUIRED ON)
+set(CMAKE_CXX_EXTENSIONS OFF)
+set(CMAKE_POSITION_INDEPENDENT_CODE ON)
+set(CMAKE_EXPORT_COMPILE_COMMANDS ON)
+
+# Programs run from the build tree find the libraries and the plug-in beside them.
+set(CMAKE_RUNTIME_OUTPUT_DIRECTORY "${CMAKE_BINARY_DIR}/bin")
+set(CMAKE_LIBRARY_OUTPUT_DIRECTORY "${CMAKE_BINARY_DIR}/lib")
+
+# Installed programs find them in the same way.
+set(CMAKE_INSTALL_RPATH "$ORIGIN/../lib;$ORIGIN")
+
+if(NOT CMAKE_BUILD_TYPE)
+  set(CMAKE_BUILD_TYPE RelWithDebInfo CACHE STRING "" FORCE)
+endif()
+
+find_program(ORV_CCACHE ccache)
+if(ORV_CCACHE)
+  set(CMAKE_CXX_COMPILER_LAUNCHER "${ORV_CCACHE}")
+endif()
+
+# __FILE__ names a file by its path in the source tree, wherever that tree lies.
+add_compile_options("-fmacro-prefix-map=${CMAKE_SOURCE_DIR}/=")
+
+if(ORV_SANITIZE)
+  add_compile_options(-fsanitize=${ORV_SANITIZE} -fno-omit-frame-pointer
+                      -fno-sanitize-recover=all)
+  add_link_options(-fsanitize=${ORV_SANITIZE})
+endif()
+if(ORV_COVERAGE)
+  add_compile_options(--coverage -O0)
+  add_link_options(--coverage)
+endif()
+
+# Warnings for our own code only: system headers come in through SYSTEM includes.
+add_library(orv_warnings INTERFACE)
+target_compile_options(orv_warnings INTERFACE -Wall -Wextra -Wpedantic -Wconversion -Werror)
