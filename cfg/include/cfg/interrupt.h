@@ -1,0 +1,23 @@
+// Stopping a search from outside: a server sets a check for the thread that is about to run an
+// operation, the library polls it once per entry it looks at, and the search ends with 3.
+#pragma once
+
+namespace orv::cfg {
+
+// Returns true when the running search is to stop. Must be cheap and must not block or throw.
+using InterruptCheck = bool (*)(void* context) noexcept;
+
+// Installs a check for the calling thread for the lifetime of the object; nests.
+class InterruptScope {
+ public:
+  InterruptScope(InterruptCheck check, void* context) noexcept;
+  ~InterruptScope();
+  InterruptScope(const InterruptScope&) = delete;
+  InterruptScope& operator=(const InterruptScope&) = delete;
+
+ private:
+  InterruptCheck previous_check_;
+  void* previous_context_;
+};
+
+}  // namespace orv::cfg

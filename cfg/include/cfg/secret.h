@@ -1,0 +1,68 @@
+// Stored passwords: how they look in the file, how they are sealed, opened and verified.
+//
+// Forms of a stored value:
+//   {AES256}base64   sealed: AES-256-GCM under the key of the stash file; can be opened again
+//   {SSHA512}base64  salted SHA-512; also {SSHA256}, {SSHA}: can only be verified
+//   {PBKDF2-SHA256}iterations$salt$hash (base64 without padding), also -SHA512: can only be verified
+//   anything else    the clear text, unless it begins with "{" name "}" of an unknown scheme, which
+//                    never matches
+//
+// A sealed value is bound to the attribute and the entry it stands in (their names are part of what
+// is authenticated), so that a sealed text copied into another entry never matches there.
+//
+// All functions are thread-safe, do not throw, and wipe the clear text they handled in between.
+#pragma once
+
+#include <cstddef>
+#include <memory>
+#include <string>
+#include <string_view>
+
+namespace orv::cfg {
+
+class Key;  // 32 random bytes, wiped on destruction
+struct KeyDeleter {
+  void operator()(const Key* key) const noexcept;
+};
+using KeyPtr = std::unique_ptr<const Key, KeyDeleter>;
+
+// Reads a key stash file: "orv-key-1 " and 64 hexadecimal digits on one line. Refused unless it is a
+// regular file that only its owner may read or write. 0; 90; 1 with the cause in `why` (names the
+// file, never its content).
+int load_key_stash(const char* path, KeyPtr& key, std::string& why) noexcept;
+
+// Writes a new key stash with a random key, mode 0600; refuses to overwrite. 0, 90 or 1 with `why`.
+int create_key_stash(const char* path, std::string& why) noexcept;
+
+// Where a secret stands: canonical attribute type and normalised DN of its entry.
+struct SecretPlace {
+  std::string_view type;
+  std::string_view normal_dn;
+};
+
+// Seals a clear text. 0 or 90.
+int seal_secret(const Key& key, SecretPlace place, std::string_view clear, std::string& stored) noexcept;
+
+enum class OpenResult { opened, not_sealed, broken };
+
+// Opens a sealed value wherever it came from. `not_sealed` for clear and hashed values; `broken` for
+// a damaged value, a null or wrong key. `key` may be null.
+OpenResult open_secret(const Key* key, std::string_view stored, std::string& clear) noexcept;
+
+// Whether `clear` is the password stored as `stored` at `place`. Takes the same time for every wrong
+// password of the same length. False for an empty clear text, an unknown or malformed scheme, a
+// sealed value that belongs elsewhere, a missing key.
+bool verify_secret(const Key* key, SecretPlace place, std::string_view stored,
+                   std::string_view clear) noexcept;
+
+// Spends the time of a verification on nothing, for identities that do not exist.
+void verify_nothing(std::string_view clear) noexcept;
+
+// Makes a salted SHA-512 value. 0 or 90.
+int hash_secret(std::string_view clear, std::string& stored) noexcept;
+
+// Overwrites memory in a way that the compiler keeps.
+void wipe(void* memory, std::size_t length) noexcept;
+void wipe(std::string& text) noexcept;
+
+}  // namespace orv::cfg

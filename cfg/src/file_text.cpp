@@ -1,0 +1,168 @@
+#include "file_text.h"
+
+#include <fcntl.h>
+#include <sched.h>
+#include <sys/stat.h>
+
+#include <array>
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+#include <new>
+#include <utility>
+
+#include "file_descriptor.h"
+
+namespace orv::cfg {
+
+// ---- Recycled memory ----
+
+namespace {
+
+struct Block {
+  void* data = nullptr;
+  std::size_t capacity = 0;
+};
+
+struct SpareBlocks {
+  std::array<Block, 3> blocks;
+
+  SpareBlocks() = default;
+  ~SpareBlocks() {
+    for (const Block& block : blocks) std::free(block.data);
+  }
+  SpareBlocks(const SpareBlocks&) = delete;
+  SpareBlocks& operator=(const SpareBlocks&) = delete;
+};
+
+thread_local SpareBlocks spare_blocks;
+
+}  // namespace
+
+void RecycledMemory::reserve(std::size_t bytes, std::size_t used) {
+  if (bytes <= capacity_) return;
+  if (data_ == nullptr) {
+    const Block spare =
+        std::exchange(spare_blocks.blocks[static_cast<std::size_t>(kind_)], Block{});
+    data_ = spare.data;
+    capacity_ = spare.capacity;
+    if (bytes <= capacity_) return;
+  }
+  if (used == 0) {
+    // Nothing to keep: realloc would copy for nothing.
+    std::free(std::exchange(data_, nullptr));
+    capacity_ = 0;
+  }
+  void* const grown = std::realloc(data_, bytes);
+  if (grown == nullptr) throw std::bad_alloc();
+  data_ = grown;
+  capacity_ = bytes;
+}
+
+void RecycledMemory::release() noexcept {
+  Block mine{std::exchange(data_, nullptr), std::exchange(capacity_, 0)};
+  Block& spare = spare_blocks.blocks[static_cast<std::size_t>(kind_)];
+  if (mine.capacity > spare.capacity && mine.capacity <= kMaxKept) std::swap(mine, spare);
+  std::free(mine.data);
+}
+
+// ---- File ----
+
+namespace {
+
+FileIdentity identity_of(const struct stat& status) noexcept {
+  return {status.st_dev, status.st_ino, status.st_size, status.st_mtim};
+}
+
+std::string system_cause(const char* what, int error) {
+  std::array<char, 128> buffer{};
+  return std::string(what) + ": " + ::strerror_r(error, buffer.data(), buffer.size());
+}
+
+// Reads up to `wanted` bytes; fewer only at the end of the file. -1 with errno.
+ssize_t read_fully(int file, char* to, std::size_t wanted) noexcept {
+  std::size_t done = 0;
+  while (done < wanted) {
+    const ssize_t n = ::read(file, to + done, wanted - done);
+    if (n < 0 && errno == EINTR) continue;
+    if (n < 0) return -1;
+    done += static_cast<std::size_t>(n);
+    // A regular file reads short only at its end (or at a signal, where the next call tells).
+    if (n == 0) break;
+    if (done + 1 == wanted) break;
+  }
+  return static_cast<ssize_t>(done);
+}
+
+}  // namespace
+
+bool FileText::read(const char* path, std::string& cause) {
+  constexpr int kAttempts = 20;
+  for (int attempt = 0; attempt < kAttempts; ++attempt) {
+    const Outcome outcome = read_once(path, cause);
+    if (outcome != Outcome::changed) return outcome == Outcome::read;
+    ::sched_yield();
+  }
+  cause = "the file kept changing while it was read";
+  return false;
+}
+
+FileText::Outcome FileText::read_once(const char* path, std::string& cause) {
+  // O_NONBLOCK: opening a pipe that nobody writes to must not stop the server.
+  const FileDescriptor file(::open(path, O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
+  if (!file.is_open()) {
+    cause = system_cause("cannot be opened", errno);
+    return Outcome::failed;
+  }
+  return read_open(file.get(), cause);
+}
+
+FileText::Outcome FileText::read_open(int file, std::string& cause) {
+  struct stat before {};
+  if (::fstat(file, &before) != 0) {
+    cause = system_cause("cannot be examined", errno);
+    return Outcome::failed;
+  }
+  if (!S_ISREG(before.st_mode)) {
+    cause = S_ISDIR(before.st_mode) ? "is a directory, not a regular file" : "is not a regular file";
+    return Outcome::failed;
+  }
+  const auto expected = static_cast<std::size_t>(before.st_size);
+  if (expected > kMaxSize) {
+    cause = "is larger than 1 GiB";
+    return Outcome::failed;
+  }
+  memory_.reserve(expected + kPadding, 0);
+  // One byte more than expected shows a file that has grown.
+  const ssize_t got = read_fully(file, static_cast<char*>(memory_.data()), expected + 1);
+  if (got < 0) {
+    cause = system_cause("cannot be read", errno);
+    return Outcome::failed;
+  }
+  struct stat after {};
+  if (::fstat(file, &after) != 0) {
+    cause = system_cause("cannot be examined", errno);
+    return Outcome::failed;
+  }
+  identity_ = identity_of(before);
+  if (static_cast<std::size_t>(got) != expected || !(identity_of(after) == identity_)) {
+    return Outcome::changed;
+  }
+  terminate(expected);
+  return Outcome::read;
+}
+
+void FileText::assign(const char* text, std::size_t size) {
+  memory_.reserve(size + kPadding, 0);
+  if (size > 0) std::memcpy(memory_.data(), text, size);
+  terminate(size);
+}
+
+void FileText::terminate(std::size_t size) noexcept {
+  size_ = size;
+  char* const end = static_cast<char*>(memory_.data()) + size;
+  std::memset(end, 0, kPadding);
+  *end = '\n';
+}
+
+}  // namespace orv::cfg

@@ -1,0 +1,85 @@
+// The text of a file, read whole into private memory.
+#pragma once
+
+#include <sys/types.h>
+
+#include <cstddef>
+#include <ctime>
+#include <string>
+
+namespace orv::cfg {
+
+// Memory that one thread uses again and again: each operation of a server reads the configuration
+// anew, and fresh pages for it would cost more than reading it. Each thread keeps at most one block
+// of each kind, and none that is larger than `kMaxKept`. A block may be released by another thread
+// than the one that obtained it.
+enum class MemoryKind { text, entries, table };
+
+class RecycledMemory {
+ public:
+  static constexpr std::size_t kMaxKept = std::size_t{64} << 20;
+
+  explicit RecycledMemory(MemoryKind kind) noexcept : kind_(kind) {}
+  ~RecycledMemory() { release(); }
+  RecycledMemory(const RecycledMemory&) = delete;
+  RecycledMemory& operator=(const RecycledMemory&) = delete;
+
+  // Makes room for `bytes`, keeping the first `used` ones. Throws std::bad_alloc.
+  void reserve(std::size_t bytes, std::size_t used);
+  void release() noexcept;
+
+  [[nodiscard]] void* data() const noexcept { return data_; }
+  [[nodiscard]] std::size_t capacity() const noexcept { return capacity_; }
+
+ private:
+  MemoryKind kind_;
+  void* data_ = nullptr;
+  std::size_t capacity_ = 0;
+};
+
+// What tells one version of a file from the next.
+struct FileIdentity {
+  dev_t device = 0;
+  ino_t inode = 0;
+  off_t size = 0;
+  timespec modified{};
+
+  bool operator==(const FileIdentity& other) const noexcept {
+    return device == other.device && inode == other.inode && size == other.size &&
+           modified.tv_sec == other.modified.tv_sec && modified.tv_nsec == other.modified.tv_nsec;
+  }
+};
+
+class FileText {
+ public:
+  static constexpr std::size_t kMaxSize = std::size_t{1} << 30;
+  // So many bytes behind the text may be read; the first is a newline.
+  static constexpr std::size_t kPadding = 64;
+
+  // Reads the file at `path`, following symbolic links; only a regular file will do. A file that
+  // changes while it is read is read again, a few times. False with the cause in words; throws
+  // std::bad_alloc.
+  bool read(const char* path, std::string& cause);
+
+  // Takes a text that is in memory already.
+  void assign(const char* text, std::size_t size);
+
+  [[nodiscard]] const char* begin() const noexcept {
+    return static_cast<const char*>(memory_.data());
+  }
+  [[nodiscard]] const char* end() const noexcept { return begin() + size_; }
+  [[nodiscard]] std::size_t size() const noexcept { return size_; }
+  [[nodiscard]] const FileIdentity& identity() const noexcept { return identity_; }
+
+ private:
+  enum class Outcome { read, changed, failed };
+  Outcome read_once(const char* path, std::string& cause);
+  Outcome read_open(int file, std::string& cause);
+  void terminate(std::size_t size) noexcept;
+
+  RecycledMemory memory_{MemoryKind::text};
+  std::size_t size_ = 0;
+  FileIdentity identity_;
+};
+
+}  // namespace orv::cfg

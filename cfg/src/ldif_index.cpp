@@ -1,0 +1,490 @@
+#include "ldif_index.h"
+
+#include <algorithm>
+#include <cstring>
+#include <utility>
+
+#include "attribute_lookup.h"
+#include "cfg/text.h"
+#include "characters.h"
+#include "dn_text.h"
+
+namespace orv::cfg {
+
+// ---- Hash table ----
+
+std::string_view LdifIndex::dn(std::uint32_t entry, std::string& scratch) const {
+  LineReader reader = lines(entry);
+  AttributeLine line;
+  reader.next(line);
+  if (line.kind == ValueKind::plain && !line.folded) {
+    // The line may lie in the reader's own memory, which ends with it.
+    const char* const p = line.value.data();
+    if (p < text_->begin() || p > text_->end()) {
+      scratch = line.value;
+      return scratch;
+    }
+  }
+  return decoded(line, scratch);
+}
+
+std::size_t LdifIndex::line(std::uint32_t entry) const noexcept {
+  const char* const begin = text_->begin();
+  return 1 + static_cast<std::size_t>(std::count(begin, begin + entries()[entry].offset, '\n'));
+}
+
+bool LdifIndex::has_dn(std::uint32_t entry, std::string_view normal_dn) const {
+  std::string scratch;
+  std::string normal;
+  return normalize(dn(entry, scratch), DnText::any_code_page, normal) && normal == normal_dn;
+}
+
+std::uint32_t LdifIndex::find(std::string_view normal_dn, std::uint32_t hash) const {
+  if (table_size_ == 0) return kNone;
+  const std::uint32_t mask = table_size_ - 1;
+  for (std::uint32_t at = hash & mask; table()[at] != kNone; at = (at + 1) & mask) {
+    const std::uint32_t entry = table()[at];
+    if (entries()[entry].hash == hash && has_dn(entry, normal_dn)) return entry;
+  }
+  return kNone;
+}
+
+std::uint32_t LdifIndex::find(std::string_view normal_dn) const {
+  if (normal_dn.empty()) return kNone;
+  return find(normal_dn, hash_normal_dn(normal_dn));
+}
+
+void LdifIndex::grow_table() {
+  table_size_ = table_size_ == 0 ? 64 : table_size_ * 2;
+  table_.reserve(table_size_ * sizeof(std::uint32_t), 0);
+  std::memset(table_.data(), 0xFF, table_size_ * sizeof(std::uint32_t));
+  const std::uint32_t mask = table_size_ - 1;
+  for (std::uint32_t i = 0; i < size_; ++i) {
+    std::uint32_t at = entries()[i].hash & mask;
+    while (table()[at] != kNone) at = (at + 1) & mask;
+    table()[at] = i;
+  }
+}
+
+bool LdifIndex::append(const Entry& entry, std::string_view dn, std::uint32_t& existing) {
+  if (size_ >= table_size_ / 4 * 3) grow_table();
+  const std::uint32_t mask = table_size_ - 1;
+  std::uint32_t at = entry.hash & mask;
+  std::string normal;
+  for (; table()[at] != kNone; at = (at + 1) & mask) {
+    existing = table()[at];
+    if (entries()[existing].hash != entry.hash) continue;
+    if (normal.empty()) normalize(dn, DnText::any_code_page, normal);
+    if (has_dn(existing, normal)) return false;
+  }
+  const std::size_t used = size_ * sizeof(Entry);
+  if (used + sizeof(Entry) > entries_.capacity()) {
+    // Growing by a quarter bounds what an entry costs in the index.
+    entries_.reserve(std::max(used + used / 4, std::size_t{64} * sizeof(Entry)), used);
+  }
+  entries()[size_] = entry;
+  table()[at] = size_++;
+  return true;
+}
+
+// ---- Checks ----
+
+namespace {
+
+constexpr const char* kNoEntries = "the file holds no entries";
+constexpr const char* kNulByte = "a NUL byte in the file";
+constexpr const char* kLoneCarriageReturn = "a carriage return that does not end a line";
+constexpr const char* kNothingToContinue =
+    "a line begins with a blank, but there is no line before it to continue";
+constexpr const char* kNoColon = "the line has no colon behind an attribute name";
+constexpr const char* kBadName = "the attribute name is not well formed";
+constexpr const char* kOption = "attribute options are not allowed";
+constexpr const char* kUrl = "values given as a URL are not allowed";
+constexpr const char* kChangeRecord = "change records are not allowed, only entries";
+constexpr const char* kBadBase64 = "the base64 value is damaged or cut short";
+constexpr const char* kBase64Nul = "the base64 value holds a NUL byte";
+constexpr const char* kNoDnLine = "an entry must begin with a \"dn:\" line";
+constexpr const char* kSecondDn =
+    "a second \"dn:\" line in one entry: the blank line between entries is missing";
+constexpr const char* kBadDn = "the DN is not well formed";
+constexpr const char* kEmptyDn = "the DN is empty";
+constexpr const char* kNoParent = "no entry before this one has the DN of its parent";
+constexpr const char* kNoAttributes = "the entry has no attributes, it may be cut short";
+constexpr const char* kCutShort =
+    "the last line does not end with a newline, the file may be cut short";
+constexpr const char* kSecretSpelling =
+    "a secret attribute is given under another name than its own";
+constexpr const char* kSecretInDn = "a secret attribute in a DN";
+constexpr const char* kVersion = "only version 1 of LDIF is known";
+
+constexpr std::string_view kDn = "dn";
+constexpr std::string_view kChangeType = "changetype";
+
+bool is_name(std::string_view text, std::string_view name) noexcept {
+  return text.size() == name.size() && equals_ignore_ascii_case(text, name);
+}
+
+bool is_oid(std::string_view type) noexcept {
+  if (type.empty() || !is_ascii_digit(type.front()) || !is_ascii_digit(type.back())) return false;
+  if (type.find('.') == std::string_view::npos) return false;
+  if (type.find("..") != std::string_view::npos) return false;
+  return std::all_of(type.begin(), type.end(),
+                     [](char c) { return is_ascii_digit(c) || c == '.'; });
+}
+
+bool is_descriptor(std::string_view type) noexcept {
+  if (type.empty() || !is_ascii_letter(type.front())) return false;
+  return std::all_of(type.begin(), type.end(), [](char c) {
+    return is_ascii_letter(c) || is_ascii_digit(c) || c == '-';
+  });
+}
+
+// Where byte `offset` of the unfolded value stands in the text.
+const char* folded_position(std::string_view value, std::size_t offset) noexcept {
+  const char* p = value.data();
+  const char* const end = p + value.size();
+  while (p < end) {
+    const bool line_end = *p == '\n' || (*p == '\r' && p + 1 < end && p[1] == '\n');
+    if (line_end) {
+      p += *p == '\r' ? 3 : 2;
+    } else if (offset-- == 0) {
+      break;
+    } else {
+      ++p;
+    }
+  }
+  return p;
+}
+
+}  // namespace
+
+// ---- The pass ----
+
+class LdifIndex::Builder {
+ public:
+  Builder(LdifIndex& index, const FileText& text, FileFault& fault) noexcept
+      : index_(index),
+        text_(text),
+        fault_(fault),
+        start_(text.begin() + (has_mark(text) ? kByteOrderMark.size() : 0)),
+        lookup_(attribute_lookup()),
+        reader_(start_, text.end()) {}
+
+  bool run() {
+    if (!check_bytes()) return false;
+    skip_between_entries();
+    if (!at_end() && !check_version()) return false;
+    while (skip_between_entries(), !at_end()) {
+      if (!read_entry()) return false;
+    }
+    if (!check_last_line()) return false;
+    if (index_.size_ == 0) return refuse_file(kNoEntries);
+    return true;
+  }
+
+ private:
+  // What is known of the DN read last and of its parent, so that brothers and first children, nearly
+  // all entries of a file, need no more than their own RDN looked at.
+  struct Neighbour {
+    std::string_view dn;  // as spelled, in the text; empty when there is none
+    std::uint32_t entry = kNone;
+    std::size_t depth = 0;
+  };
+
+  static bool has_mark(const FileText& text) noexcept {
+    return std::string_view(text.begin(), text.size()).substr(0, kByteOrderMark.size()) ==
+           kByteOrderMark;
+  }
+
+  [[nodiscard]] bool at_end() const noexcept { return reader_.position() >= text_.end(); }
+
+  // -- Refusals --
+
+  bool refuse(const char* at, std::string cause) {
+    if (at > text_.end()) at = text_.end();
+    fault_.cause = std::move(cause);
+    fault_.line = 1 + static_cast<std::size_t>(std::count(start_, at, '\n'));
+    fault_.column = 1 + static_cast<std::size_t>(at - line_begin(at));
+    return false;
+  }
+
+  // The beginning of the physical line that `at` stands in or behind.
+  const char* line_begin(const char* at) const noexcept {
+    while (at > start_ && at[-1] != '\n') --at;
+    return at;
+  }
+
+  bool refuse_file(const char* cause) {
+    fault_ = FileFault{cause, 0, 0};
+    return false;
+  }
+
+  // -- The file as bytes --
+
+  bool check_bytes() {
+    const auto size = static_cast<std::size_t>(text_.end() - start_);
+    if (size == 0) return refuse_file("the file is empty");
+    const void* nul = std::memchr(start_, '\0', size);
+    if (nul != nullptr) return refuse(static_cast<const char*>(nul), kNulByte);
+    const char* p = start_;
+    while (p < text_.end()) {
+      const void* found = std::memchr(p, '\r', static_cast<std::size_t>(text_.end() - p));
+      if (found == nullptr) return true;
+      p = static_cast<const char*>(found) + 1;
+      if (p == text_.end() || *p != '\n') return refuse(p - 1, kLoneCarriageReturn);
+    }
+    return true;
+  }
+
+  // A comment may lack its newline; whatever carries meaning may not.
+  bool check_last_line() {
+    const char* const end = text_.end();
+    if (end[-1] == '\n' || last_line_is_comment_) return true;
+    return refuse(end, kCutShort);
+  }
+
+  // -- Between entries --
+
+  void skip_between_entries() noexcept {
+    while (!at_end()) {
+      const char* const p = reader_.position();
+      last_line_is_comment_ = *p == '#';
+      if (*p == '#') {
+        reader_.skip_comment();
+      } else if (*p == '\n' || (*p == '\r' && p[1] == '\n')) {
+        reader_.skip_blank_line();
+      } else {
+        break;
+      }
+    }
+  }
+
+  bool check_version() {
+    const LineReader saved = reader_;
+    const char* const at = reader_.position();
+    if (*at == ' ') return refuse(at, kNothingToContinue);
+    AttributeLine line;
+    reader_.next(line);
+    if (!line.has_colon || !is_name(line.type, "version")) {
+      reader_ = saved;
+      return true;
+    }
+    if (line.kind != ValueKind::plain || line.folded || line.value != "1") {
+      return refuse(at, kVersion);
+    }
+    return true;
+  }
+
+  // -- One entry --
+
+  bool read_entry() {
+    const char* const at = reader_.position();
+    if (*at == ' ') return refuse(at, kNothingToContinue);
+    last_line_is_comment_ = false;
+    AttributeLine line;
+    reader_.next(line);
+    if (!read_dn(at, line)) return false;
+    std::size_t attributes = 0;
+    const std::uint64_t lengths = lengths_to_check_;
+    const auto plain = [lengths](std::string_view type) { return needs_no_check(type, lengths); };
+    while (true) {
+      if (attributes > 0) reader_.pass_plain_lines(plain);
+      const char* const before = reader_.position();
+      if (!reader_.next(line)) break;
+      if (!check_line(before, line, attributes == 0)) return false;
+      ++attributes;
+    }
+    note_trailing_comment();
+    if (attributes == 0) return refuse(at, kNoAttributes);
+    return true;
+  }
+
+  // `next` skips comments silently; at the end of the text it matters whether one stood last.
+  void note_trailing_comment() noexcept {
+    const char* const end = text_.end();
+    if (reader_.position() < end || end[-1] == '\n') return;
+    const char* p = line_begin(end);
+    while (*p == ' ' && p > start_) p = line_begin(p - 1);
+    last_line_is_comment_ = *p == '#';
+  }
+
+  // Whether a type of letters, digits and hyphens cannot be one of those that are looked at below:
+  // none of them has this length.
+  static bool needs_no_check(std::string_view type, std::uint64_t lengths) noexcept {
+    return type.size() < 64 && (lengths >> type.size() & 1) == 0 && is_ascii_letter(type.front());
+  }
+
+  bool check_line(const char* at, const AttributeLine& line, bool first) {
+    if (!check_type(at, line)) return false;
+    if (is_name(line.type, kDn)) return refuse(line_start(at), kSecondDn);
+    if (is_name(line.type, kChangeType)) return refuse(line_start(at), kChangeRecord);
+    if (first && is_name(line.type, "control")) return refuse(line_start(at), kChangeRecord);
+    return line.kind == ValueKind::plain || check_encoded(at, line);
+  }
+
+  bool check_type(const char* at, const AttributeLine& line) {
+    if (!line.has_colon) return refuse(line_start(at), kNoColon);
+    if (!is_descriptor(line.type) && !is_oid(line.type)) {
+      const std::size_t option = line.type.find(';');
+      if (option != std::string_view::npos) return refuse(line_start(at) + option, kOption);
+      return refuse(line_start(at), kBadName);
+    }
+    if (!lookup_.may_be_secret_alias(line.type.size())) return true;
+    const KnownType* known = lookup_.find(line.type);
+    if (known != nullptr && known->secret && !equals_ignore_ascii_case(known->name, line.type)) {
+      return refuse(line_start(at), kSecretSpelling);
+    }
+    return true;
+  }
+
+  bool check_encoded(const char* at, const AttributeLine& line) {
+    const char* const start = line_start(at);
+    if (line.kind == ValueKind::url) return refuse(start + line.type.size(), kUrl);
+    std::string scratch;
+    std::string_view value;
+    std::size_t error_at = 0;
+    if (!decode_value(line, scratch, value, error_at)) {
+      return refuse(value_position(start, line, error_at), kBadBase64);
+    }
+    if (value.find('\0') != std::string_view::npos) {
+      return refuse(value_position(start, line, 0), kBase64Nul);
+    }
+    return true;
+  }
+
+  // The start of the content line that was read from `at` on, behind comments.
+  const char* line_start(const char* at) const noexcept {
+    LineReader reader(at, text_.end());
+    while (reader.position() < text_.end() && *reader.position() == '#') reader.skip_comment();
+    return reader.position();
+  }
+
+  // Where a byte of a line's unfolded value stands in the text. A line that is folded before its
+  // value was joined elsewhere; then the line itself has to do.
+  const char* value_position(const char* start, const AttributeLine& line,
+                             std::size_t offset) const noexcept {
+    const char* const p = line.value.data();
+    if (p < text_.begin() || p > text_.end()) return start;
+    return line.folded ? folded_position(line.value, offset) : p + offset;
+  }
+
+  // -- DNs --
+
+  bool read_dn(const char* at, const AttributeLine& line) {
+    if (!line.has_colon || !is_name(line.type, kDn)) return refuse(at, kNoDnLine);
+    std::string scratch;
+    std::string_view dn = line.value;
+    const bool plain = line.kind == ValueKind::plain && !line.folded && is_in_text(dn);
+    if (!plain) {
+      if (line.kind == ValueKind::url) return refuse(at + line.type.size(), kUrl);
+      std::size_t error_at = 0;
+      if (!decode_value(line, scratch, dn, error_at)) {
+        return refuse(value_position(at, line, error_at), kBadBase64);
+      }
+      if (dn.find('\0') != std::string_view::npos) return refuse(at, kBase64Nul);
+    }
+    return index_dn(at, value_position(at, line, 0), dn, plain);
+  }
+
+  [[nodiscard]] bool is_in_text(std::string_view view) const noexcept {
+    return view.data() >= text_.begin() && view.data() <= text_.end();
+  }
+
+  bool index_dn(const char* at, const char* dn_at, std::string_view dn, bool plain) {
+    Entry entry{static_cast<std::uint32_t>(at - text_.begin()), 0, kNone};
+    Neighbour parent;
+    if (plain && index_.size_ > 0 && dn.size() <= kMaxDnLength && read_plain_rdn(dn, rdn_) &&
+        find_neighbour(rdn_, parent)) {
+      if (rdn_.type != nullptr && rdn_.type->secret) return refuse(dn_at, kSecretInDn);
+      entry.parent = parent.entry;
+      entry.hash = combine_dn_hash(index_.entries()[parent.entry].hash,
+                                   std::string_view(rdn_.normal, rdn_.length));
+    } else if (!place(dn_at, dn, entry, parent)) {
+      return false;
+    }
+    std::uint32_t existing = kNone;
+    if (!index_.append(entry, dn, existing)) {
+      return refuse(dn_at, "line " + std::to_string(index_.line(existing)) +
+                               " has an entry with the same DN");
+    }
+    previous_ = Neighbour{plain ? dn : std::string_view(), index_.size_ - 1, parent.depth + 1};
+    previous_parent_ = parent;
+    return true;
+  }
+
+  bool find_neighbour(const LeadingRdn& rdn, Neighbour& parent) const noexcept {
+    if (rdn.last || rdn.rest.empty()) return false;
+    if (rdn.rest == previous_parent_.dn) {
+      parent = previous_parent_;
+    } else if (rdn.rest == previous_.dn) {
+      parent = previous_;
+    } else {
+      return false;
+    }
+    return parent.depth < kMaxRdns;
+  }
+
+  // The long way: the whole DN in normal form.
+  bool place(const char* dn_at, std::string_view dn, Entry& entry, Neighbour& parent) {
+    std::string normal;
+    if (!normalize(dn, DnText::any_code_page, normal)) return refuse(dn_at, kBadDn);
+    if (normal.empty()) return refuse(dn_at, kEmptyDn);
+    if (names_secret(dn)) return refuse(dn_at, kSecretInDn);
+    const std::string_view above = parent_of_normal_dn(normal);
+    const std::uint32_t above_hash = hash_normal_dn(above);
+    entry.hash = combine_dn_hash(above_hash, std::string_view(normal).substr(
+                                                 0, leading_rdn_length(normal)));
+    parent = Neighbour{};
+    parent.depth = depth_of(above);
+    if (index_.size_ == 0) return true;
+    entry.parent = above.empty() ? kNone : index_.find(above, above_hash);
+    if (entry.parent == kNone) {
+      // A second entry with the DN of the first is told apart when it is appended.
+      if (index_.find(normal, entry.hash) == kNone) return refuse(dn_at, kNoParent);
+    }
+    parent.entry = entry.parent;
+    LeadingRdn rdn;
+    if (is_in_text(dn) && read_plain_rdn(dn, rdn) && !rdn.last) parent.dn = rdn.rest;
+    return true;
+  }
+
+  static std::size_t depth_of(std::string_view normal) noexcept {
+    std::size_t depth = 0;
+    for (; !normal.empty(); normal = parent_of_normal_dn(normal)) ++depth;
+    return depth;
+  }
+
+  // Everybody who may search sees DNs.
+  bool names_secret(std::string_view dn) const {
+    Dn parsed;
+    if (!parse(dn, DnText::any_code_page, parsed) || parsed.empty()) return false;
+    return std::any_of(parsed.front().begin(), parsed.front().end(), [this](const Ava& ava) {
+      const KnownType* known = lookup_.find(ava.type);
+      return known != nullptr && known->secret;
+    });
+  }
+
+  LdifIndex& index_;
+  const FileText& text_;
+  FileFault& fault_;
+  const char* const start_;
+  const AttributeLookup& lookup_;
+  LineReader reader_;
+  // One bit for each length of a type that has to be looked at.
+  const std::uint64_t lengths_to_check_ = std::uint64_t{1} | std::uint64_t{1} << kDn.size() |
+                                          std::uint64_t{1} << kChangeType.size() |
+                                          lookup_.secret_alias_lengths();
+  LeadingRdn rdn_;  // of the DN read last
+  bool last_line_is_comment_ = false;
+  Neighbour previous_;
+  Neighbour previous_parent_;
+};
+
+bool LdifIndex::build(const FileText& text, FileFault& fault) {
+  text_ = &text;
+  size_ = 0;
+  table_size_ = 0;
+  return Builder(*this, text, fault).run();
+}
+
+}  // namespace orv::cfg

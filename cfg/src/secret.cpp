@@ -1,0 +1,362 @@
+#include "cfg/secret.h"
+
+#include <openssl/crypto.h>
+#include <openssl/evp.h>
+#include <openssl/rand.h>
+
+#include <array>
+#include <cstdint>
+#include <memory>
+#include <utility>
+
+#include "cfg/result_codes.h"
+#include "cfg/text.h"
+#include "characters.h"
+#include "secret_key.h"
+
+namespace orv::cfg {
+
+void wipe(void* memory, std::size_t length) noexcept {
+  if (memory != nullptr) OPENSSL_cleanse(memory, length);
+}
+
+void wipe(std::string& text) noexcept {
+  // The capacity too: a text that shrank leaves its tail behind.
+  text.resize(text.capacity());
+  wipe(text.data(), text.size());
+  text.clear();
+}
+
+namespace {
+
+const unsigned char* bytes_of(std::string_view text) noexcept {
+  return reinterpret_cast<const unsigned char*>(text.data());
+}
+unsigned char* bytes_of(std::string& text) noexcept {
+  return reinterpret_cast<unsigned char*>(text.data());
+}
+
+// ---- Schemes ----
+
+// The name between the braces at the start of a stored value; false when there is none.
+bool split_scheme(std::string_view stored, std::string_view& scheme, std::string_view& rest) noexcept {
+  if (stored.empty() || stored.front() != '{') return false;
+  const std::size_t end = stored.find('}');
+  if (end == std::string_view::npos || end == 1) return false;
+  scheme = stored.substr(1, end - 1);
+  for (const char c : scheme) {
+    const bool name = is_ascii_letter(c) || is_ascii_digit(c) || c == '-' || c == '_' || c == '.' ||
+                      c == '/' || c == '+';
+    if (!name) return false;
+  }
+  rest = stored.substr(end + 1);
+  return true;
+}
+
+constexpr std::string_view kSealedScheme = "AES256";
+
+// ---- Digests ----
+
+struct DigestDeleter {
+  void operator()(EVP_MD_CTX* context) const noexcept { EVP_MD_CTX_free(context); }
+};
+using DigestContext = std::unique_ptr<EVP_MD_CTX, DigestDeleter>;
+
+struct Digest {
+  std::array<unsigned char, EVP_MAX_MD_SIZE> bytes{};
+  unsigned length = 0;
+};
+
+// Digest of the two texts one after the other.
+bool digest(const EVP_MD* type, std::string_view first, std::string_view second,
+            Digest& out) noexcept {
+  const DigestContext context(EVP_MD_CTX_new());
+  return context != nullptr && EVP_DigestInit_ex(context.get(), type, nullptr) == 1 &&
+         EVP_DigestUpdate(context.get(), first.data(), first.size()) == 1 &&
+         EVP_DigestUpdate(context.get(), second.data(), second.size()) == 1 &&
+         EVP_DigestFinal_ex(context.get(), out.bytes.data(), &out.length) == 1;
+}
+
+// Compares texts of any lengths in a time that depends on neither's content.
+bool same_text(std::string_view a, std::string_view b) noexcept {
+  Digest digest_a;
+  Digest digest_b;
+  if (!digest(EVP_sha256(), a, "", digest_a) || !digest(EVP_sha256(), b, "", digest_b)) {
+    return false;
+  }
+  const bool same =
+      CRYPTO_memcmp(digest_a.bytes.data(), digest_b.bytes.data(), digest_a.length) == 0;
+  wipe(&digest_a, sizeof digest_a);
+  wipe(&digest_b, sizeof digest_b);
+  return same && a.size() == b.size();
+}
+
+// ---- Sealed values ----
+//
+// {AES256} base64 of: version byte, 16 bytes that name the place, nonce, ciphertext, tag. Version
+// and place are authenticated with the text.
+
+constexpr unsigned char kSealVersion = 1;
+constexpr std::size_t kPlaceLength = 16;
+constexpr std::size_t kHeaderLength = 1 + kPlaceLength;
+constexpr std::size_t kNonceLength = 12;
+constexpr std::size_t kTagLength = 16;
+constexpr std::size_t kMinSealedLength = kHeaderLength + kNonceLength + kTagLength;
+
+struct CipherDeleter {
+  void operator()(EVP_CIPHER_CTX* context) const noexcept { EVP_CIPHER_CTX_free(context); }
+};
+using CipherContext = std::unique_ptr<EVP_CIPHER_CTX, CipherDeleter>;
+
+// The header of a value sealed for `place`.
+bool make_header(SecretPlace place, std::array<unsigned char, kHeaderLength>& header) {
+  std::string type(place.type);
+  for (char& c : type) c = ascii_lower(c);
+  type += '\0';
+  Digest name;
+  if (!digest(EVP_sha256(), type, place.normal_dn, name)) return false;
+  header[0] = kSealVersion;
+  for (std::size_t i = 0; i < kPlaceLength; ++i) header[1 + i] = name.bytes[i];
+  return true;
+}
+
+bool seal(const Key& key, SecretPlace place, std::string_view clear, std::string& sealed) {
+  std::array<unsigned char, kHeaderLength> header{};
+  std::array<unsigned char, kNonceLength> nonce{};
+  std::array<unsigned char, kTagLength> tag{};
+  if (clear.size() > INT32_MAX || !make_header(place, header) ||
+      RAND_bytes(nonce.data(), static_cast<int>(nonce.size())) != 1) {
+    return false;
+  }
+  std::string text(clear.size(), '\0');
+  const CipherContext context(EVP_CIPHER_CTX_new());
+  int length = 0;
+  const bool done =
+      context != nullptr &&
+      EVP_EncryptInit_ex(context.get(), EVP_aes_256_gcm(), nullptr, key.data(), nonce.data()) == 1 &&
+      EVP_EncryptUpdate(context.get(), nullptr, &length, header.data(),
+                        static_cast<int>(header.size())) == 1 &&
+      EVP_EncryptUpdate(context.get(), bytes_of(text), &length, bytes_of(clear),
+                        static_cast<int>(clear.size())) == 1 &&
+      EVP_EncryptFinal_ex(context.get(), bytes_of(text) + length, &length) == 1 &&
+      EVP_CIPHER_CTX_ctrl(context.get(), EVP_CTRL_GCM_GET_TAG, kTagLength, tag.data()) == 1;
+  if (!done) return false;
+  sealed.assign(header.begin(), header.end());
+  sealed.append(nonce.begin(), nonce.end());
+  sealed += text;
+  sealed.append(tag.begin(), tag.end());
+  return true;
+}
+
+// Opens the bytes of a sealed value, wherever it was sealed for.
+bool open_sealed(const Key& key, std::string_view sealed, std::string& clear) {
+  if (sealed.size() < kMinSealedLength || sealed.size() > INT32_MAX ||
+      static_cast<unsigned char>(sealed[0]) != kSealVersion) {
+    return false;
+  }
+  const std::string_view header = sealed.substr(0, kHeaderLength);
+  const std::string_view nonce = sealed.substr(kHeaderLength, kNonceLength);
+  const std::string_view text = sealed.substr(kHeaderLength + kNonceLength,
+                                              sealed.size() - kMinSealedLength);
+  std::string tag(sealed.substr(sealed.size() - kTagLength));
+  std::string out(text.size() + kTagLength, '\0');
+  const WipeAtEnd wiped(out);
+  const CipherContext context(EVP_CIPHER_CTX_new());
+  int length = 0;
+  int rest = 0;
+  const bool done =
+      context != nullptr &&
+      EVP_DecryptInit_ex(context.get(), EVP_aes_256_gcm(), nullptr, key.data(), bytes_of(nonce)) ==
+          1 &&
+      EVP_DecryptUpdate(context.get(), nullptr, &length, bytes_of(header),
+                        static_cast<int>(header.size())) == 1 &&
+      EVP_DecryptUpdate(context.get(), bytes_of(out), &length, bytes_of(text),
+                        static_cast<int>(text.size())) == 1 &&
+      EVP_CIPHER_CTX_ctrl(context.get(), EVP_CTRL_GCM_SET_TAG, kTagLength, tag.data()) == 1 &&
+      EVP_DecryptFinal_ex(context.get(), bytes_of(out) + length, &rest) == 1;
+  if (!done) return false;
+  wipe(clear);
+  clear.assign(out, 0, text.size());
+  return true;
+}
+
+bool decode_base64(std::string_view text, std::string& bytes) noexcept {
+  std::size_t error_at = 0;
+  return base64_decode(text, bytes, error_at) == result::success;
+}
+
+bool verify_sealed(const Key* key, SecretPlace place, std::string_view encoded,
+                   std::string_view clear) {
+  std::string sealed;
+  std::string opened;
+  const WipeAtEnd wiped(opened);
+  std::array<unsigned char, kHeaderLength> header{};
+  if (key == nullptr || !decode_base64(encoded, sealed) || !make_header(place, header) ||
+      !open_sealed(*key, sealed, opened)) {
+    return false;
+  }
+  const bool here = CRYPTO_memcmp(sealed.data(), header.data(), header.size()) == 0;
+  return same_text(opened, clear) && here;
+}
+
+// ---- Hashed values ----
+
+constexpr std::size_t kMaxSaltLength = 256;
+
+struct SaltedScheme {
+  std::string_view name;
+  const EVP_MD* (*type)();
+};
+constexpr SaltedScheme kSaltedSchemes[] = {
+    {"SSHA512", &EVP_sha512}, {"SSHA256", &EVP_sha256}, {"SSHA", &EVP_sha1}};
+
+bool verify_salted(const EVP_MD* type, std::string_view encoded, std::string_view clear) {
+  std::string stored;
+  if (!decode_base64(encoded, stored)) return false;
+  const auto length = static_cast<std::size_t>(EVP_MD_get_size(type));
+  if (stored.size() <= length || stored.size() > length + kMaxSaltLength) return false;
+  Digest made;
+  if (!digest(type, clear, std::string_view(stored).substr(length), made)) return false;
+  return CRYPTO_memcmp(made.bytes.data(), stored.data(), length) == 0;
+}
+
+constexpr SaltedScheme kPbkdf2Schemes[] = {{"PBKDF2-SHA256", &EVP_sha256},
+                                           {"PBKDF2-SHA512", &EVP_sha512}};
+constexpr int kMaxIterations = 10'000'000;
+
+// A decimal number between 1 and kMaxIterations; 0 for anything else.
+int read_iterations(std::string_view text) noexcept {
+  if (text.empty() || text.size() > 8 || text.front() == '0') return 0;
+  int value = 0;
+  for (const char c : text) {
+    if (!is_ascii_digit(c)) return 0;
+    value = value * 10 + (c - '0');
+  }
+  return value <= kMaxIterations ? value : 0;
+}
+
+bool decode_unpadded(std::string_view text, std::string& bytes) {
+  std::string padded(text);
+  if (padded.find('=') != std::string::npos) return false;
+  padded.append((4 - padded.size() % 4) % 4, '=');
+  return decode_base64(padded, bytes);
+}
+
+bool verify_pbkdf2(const EVP_MD* type, std::string_view rest, std::string_view clear) {
+  const std::size_t first = rest.find('$');
+  const std::size_t second = first == std::string_view::npos ? first : rest.find('$', first + 1);
+  if (second == std::string_view::npos || clear.size() > INT32_MAX) return false;
+  const int iterations = read_iterations(rest.substr(0, first));
+  std::string salt;
+  std::string hash;
+  if (iterations == 0 || !decode_unpadded(rest.substr(first + 1, second - first - 1), salt) ||
+      !decode_unpadded(rest.substr(second + 1), hash)) {
+    return false;
+  }
+  std::array<unsigned char, EVP_MAX_MD_SIZE> made{};
+  if (salt.empty() || salt.size() > kMaxSaltLength || hash.size() < 16 ||
+      hash.size() > made.size()) {
+    return false;
+  }
+  if (PKCS5_PBKDF2_HMAC(clear.data(), static_cast<int>(clear.size()), bytes_of(salt),
+                        static_cast<int>(salt.size()), iterations, type,
+                        static_cast<int>(hash.size()), made.data()) != 1) {
+    return false;
+  }
+  return CRYPTO_memcmp(made.data(), hash.data(), hash.size()) == 0;
+}
+
+bool verify_scheme(const Key* key, SecretPlace place, std::string_view scheme, std::string_view rest,
+                   std::string_view clear) {
+  if (equals_ignore_ascii_case(scheme, kSealedScheme)) {
+    return verify_sealed(key, place, rest, clear);
+  }
+  for (const SaltedScheme& known : kSaltedSchemes) {
+    if (equals_ignore_ascii_case(scheme, known.name)) {
+      return verify_salted(known.type(), rest, clear);
+    }
+  }
+  for (const SaltedScheme& known : kPbkdf2Schemes) {
+    if (equals_ignore_ascii_case(scheme, known.name)) {
+      return verify_pbkdf2(known.type(), rest, clear);
+    }
+  }
+  return false;
+}
+
+}  // namespace
+
+int seal_secret(const Key& key, SecretPlace place, std::string_view clear,
+                std::string& stored) noexcept try {
+  std::string sealed;
+  std::string encoded;
+  if (!seal(key, place, clear, sealed) || base64_encode(sealed, encoded) != result::success) {
+    return result::no_memory;
+  }
+  std::string text = "{";
+  text += kSealedScheme;
+  text += '}';
+  text += encoded;
+  stored = std::move(text);
+  return result::success;
+} catch (...) {
+  return result::no_memory;
+}
+
+OpenResult open_secret(const Key* key, std::string_view stored, std::string& clear) noexcept try {
+  std::string_view scheme;
+  std::string_view rest;
+  if (!split_scheme(stored, scheme, rest) || !equals_ignore_ascii_case(scheme, kSealedScheme)) {
+    return OpenResult::not_sealed;
+  }
+  std::string sealed;
+  if (key == nullptr || !decode_base64(rest, sealed) || !open_sealed(*key, sealed, clear)) {
+    return OpenResult::broken;
+  }
+  return OpenResult::opened;
+} catch (...) {
+  return OpenResult::broken;
+}
+
+bool verify_secret(const Key* key, SecretPlace place, std::string_view stored,
+                   std::string_view clear) noexcept try {
+  if (clear.empty()) return false;
+  std::string_view scheme;
+  std::string_view rest;
+  if (!split_scheme(stored, scheme, rest)) return same_text(stored, clear);
+  return verify_scheme(key, place, scheme, rest, clear);
+} catch (...) {
+  return false;
+}
+
+void verify_nothing(std::string_view clear) noexcept try {
+  // The work of the sealed form, which new instances use.
+  static const Key key{Key::Bytes{}};
+  static const std::string sealed = [] {
+    std::string stored;
+    seal_secret(key, {"none", "CN=NONE"}, "none", stored);
+    return stored;
+  }();
+  verify_secret(&key, {"none", "CN=NONE"}, sealed, clear);
+} catch (...) {
+}
+
+int hash_secret(std::string_view clear, std::string& stored) noexcept try {
+  std::string salt(16, '\0');
+  Digest made;
+  if (RAND_bytes(bytes_of(salt), static_cast<int>(salt.size())) != 1 ||
+      !digest(EVP_sha512(), clear, salt, made)) {
+    return result::no_memory;
+  }
+  std::string bytes(made.bytes.begin(), made.bytes.begin() + made.length);
+  std::string encoded;
+  if (base64_encode(bytes + salt, encoded) != result::success) return result::no_memory;
+  std::string text = "{SSHA512}";
+  text += encoded;
+  stored = std::move(text);
+  return result::success;
+} catch (...) {
+  return result::no_memory;
+}
+
+}  // namespace orv::cfg
