@@ -1,0 +1,76 @@
+// Who may bind: the identities that the configuration file defines, and what each is granted.
+//
+//   primary administrator   orv-slapdAdminDN of CN=CONFIGURATION            flags 0x0C
+//   group member            entries of class orv-slapdAdminGroupMember below
+//                           CN=ADMINGROUP,CN=CONFIGURATION, while
+//                           orv-slapdAdminGroupEnabled is TRUE              flags 0x14 + role bits
+//   supplier of the server  CN=MASTER SERVER,CN=CONFIGURATION               flags 0x01
+//   supplier of a suffix    entries of class orv-slapdSupplier              flags 0x02
+//   everybody else                                                          flags 0x24
+//
+// Only the first value of an identity's DN and password counts. A DN that two entries claim binds as
+// neither. DNs inside CN=CONFIGURATION and the empty DN are nobody's.
+//
+// Threads: `Identities` is an immutable snapshot, shared freely; `IdentityStore` is thread-safe.
+#pragma once
+
+#include <memory>
+#include <mutex>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "cfg/secret.h"
+
+namespace orv::server {
+
+struct Identity {
+  std::string bound_dn;  // normal form
+  unsigned authority = 0x24;
+  unsigned roles = 0;
+  std::string entry_dn;  // normal form of the entry that defines it
+};
+
+// Role bits of a list of orv-slapdAdminRole values; 0 when "NoAdmin" is among them.
+unsigned role_bits(const std::vector<std::string>& roles) noexcept;
+
+class Identities {
+ public:
+  // Reads them with a session of its own. Null on failure, with the cause in `error`. Doubtful
+  // entries (a DN claimed twice, a member DN inside the configuration, second values) are described
+  // in `warnings`, without values of secrets.
+  static std::shared_ptr<const Identities> read(const char* config_file, const char* key_stash_file,
+                                                std::string& error,
+                                                std::vector<std::string>& warnings) noexcept;
+
+  // The identity that `name` (any spelling) and `password` prove; null when they prove none. Takes
+  // the time of one verification whether the name is known or not.
+  const Identity* authenticate(std::string_view name, std::string_view password) const noexcept;
+
+  ~Identities();
+
+ private:
+  Identities();
+  struct Data;
+  std::unique_ptr<Data> data_;
+};
+
+// The current snapshot. It is read again when the configuration file is not the file it was read from
+// any more (device, inode, size, times), and on reload(); when that fails the last good one stays.
+class IdentityStore {
+ public:
+  IdentityStore(std::string config_file, std::string key_stash_file);
+  ~IdentityStore();
+
+  // Reads anew whatever the file's times say. False (with the cause) when the last good one stays.
+  bool reload(std::string& error, std::vector<std::string>& warnings) noexcept;
+
+  // Never null after the first successful reload.
+  std::shared_ptr<const Identities> current() noexcept;
+
+ private:
+  struct State;
+  std::unique_ptr<State> state_;
+};
+
+}  // namespace orv::server

@@ -1,0 +1,37 @@
+// Reading the identities out of a configuration file, before anybody asks which of them are good.
+//
+// Threads: functions without state.
+#pragma once
+
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "auth/identities.h"
+
+namespace orv::server {
+
+// An entry that defines an identity, as the file has it.
+struct IdentityRecord {
+  Identity identity;            // bound DN, authority, roles, entry DN; all normalised
+  const char* password_type;    // canonical name of the attribute that holds the password
+  std::string stored_password;  // as stored; empty: none, never proves anything
+  bool enabled = true;          // false: member of a group that is switched off
+};
+
+struct IdentityRecords {
+  std::vector<IdentityRecord> records;
+  cfg::KeyPtr key;  // opens sealed passwords; null without a key stash
+};
+
+// Reads all of them with one session. Records whose DN is missing, no DN, empty, or inside the
+// configuration itself are left out with a warning. Returns false with the cause in `error`. Throws
+// std::bad_alloc.
+bool read_identity_records(const char* config_file, const char* key_stash_file,
+                           IdentityRecords& result, std::string& error,
+                           std::vector<std::string>& warnings);
+
+// Whether a normalised DN can be somebody's outside the configuration.
+bool may_be_bound(std::string_view normal_dn) noexcept;
+
+}  // namespace orv::server

@@ -1,0 +1,102 @@
+// The error log and the access log.
+//
+// Writers never wait for a disk or a terminal: lines go to a queue that a thread of its own empties;
+// when a sink stalls for long, the oldest lines are given up. Each event loop collects its access
+// lines in a lane of its own and hands them over in batches.
+//
+// Threads: `Logs` is thread-safe; an `AccessLane` belongs to one thread.
+#pragma once
+
+#include <atomic>
+#include <chrono>
+#include <cstdint>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "settings.h"
+
+namespace spdlog {
+class logger;
+namespace details {
+class thread_pool;
+}
+}  // namespace spdlog
+
+namespace orv::server {
+
+enum class LogLevel { error, warning, info, debug, off };
+
+class Logs {
+ public:
+  // Starts with the error log on standard error at level info and no access log. `guarded_files` are
+  // files that no log may share (the configuration file, its save file, the key stash).
+  explicit Logs(std::vector<std::string> guarded_files = {});
+  ~Logs();
+  Logs(const Logs&) = delete;
+  Logs& operator=(const Logs&) = delete;
+
+  // Opens what the settings name, also when they name the same files again (somebody may have moved
+  // them away). A log that cannot be opened keeps the one it had; the reasons are returned, one line
+  // each.
+  std::vector<std::string> open(const Settings& settings);
+
+  // Writes one line to the error log.
+  void write(LogLevel level, std::string_view line) noexcept;
+  void error(std::string_view line) noexcept { write(LogLevel::error, line); }
+  void warning(std::string_view line) noexcept { write(LogLevel::warning, line); }
+  void info(std::string_view line) noexcept { write(LogLevel::info, line); }
+
+  // Whether operations are to be written to the access log.
+  bool access_enabled() const noexcept { return access_on_.load(std::memory_order_relaxed); }
+
+  // Writes finished access lines.
+  void write_access(std::string_view lines) noexcept;
+
+  // Waits until everything written so far is out and closes the logs; later errors go straight to
+  // standard error. For the end of the process.
+  void finish() noexcept;
+
+ private:
+  using Logger = std::shared_ptr<spdlog::logger>;
+
+  Logger logger(const Logger& which) const;
+  std::string open_one(const std::string& path, const std::string& level, bool access);
+
+  const std::vector<std::string> guarded_files_;
+  std::shared_ptr<spdlog::details::thread_pool> writer_;
+  mutable std::mutex mutex_;
+  Logger error_;
+  Logger access_;
+  std::atomic<bool> access_on_{false};
+};
+
+// Access lines of one thread that are not handed over yet.
+class AccessLane {
+ public:
+  explicit AccessLane(Logs& logs) : logs_(logs) {}
+  ~AccessLane() { flush(); }
+
+  bool enabled() const noexcept { return logs_.access_enabled(); }
+
+  // Appends "TIME conn=N " and lets the caller append the rest; call end() afterwards.
+  std::string& begin(std::uint64_t connection);
+  void end();
+
+  // Hands over what is collected.
+  void flush() noexcept;
+
+ private:
+  Logs& logs_;
+  std::string lines_;
+  std::int64_t second_ = -1;
+  std::string second_text_;
+};
+
+// Appends `text` in double quotes, with quotes and control characters as \XX.
+void append_quoted(std::string& line, std::string_view text);
+void append_number(std::string& line, std::int64_t number);
+
+}  // namespace orv::server

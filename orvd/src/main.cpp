@@ -1,0 +1,254 @@
+// orvd: reads its configuration, loads the configuration backend and serves it over LDAP.
+#include <sys/prctl.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
+
+#include <csignal>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <ctime>
+#include <memory>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "auth/identities.h"
+#include "cfg/attribute_table.h"
+#include "cfg/diagnostics.h"
+#include "logs.h"
+#include "options.h"
+#include "plugin/loader.h"
+#include "publish/root_dse.h"
+#include "publish/subschema.h"
+#include "server.h"
+#include "settings.h"
+#include "slapi/codepage.h"
+#include "slapi/control.h"
+#include "slapi/globals.h"
+#include "slapi/log.h"
+#include "slapi/schema.h"
+#include "slapi/trace.h"
+
+namespace orv::server {
+namespace {
+
+constexpr const char* kSuffix = "CN=CONFIGURATION";
+constexpr const char* kEntryPoint = "config_backend_init";
+
+// ---- where the libraries write to
+
+Logs* sink_logs = nullptr;  // set while there are logs
+
+void message_to_log(int, int, int number, const char* text) noexcept {
+  if (!sink_logs) return;
+  try {
+    sink_logs->warning("message " + std::to_string(number) + ": " + text);
+  } catch (...) {
+  }
+}
+
+void diagnostics_to_log(const char* line) noexcept {
+  if (sink_logs) sink_logs->warning(line);
+}
+
+// ---- who may bind
+
+class StoredIdentities final : public Authenticator {
+ public:
+  StoredIdentities(const Options& options, Logs& logs)
+      : store_(options.config_file, options.key_stash_file), logs_(logs) {}
+
+  bool reload(std::string& error) {
+    std::vector<std::string> warnings;
+    const bool good = store_.reload(error, warnings);
+    for (const std::string& warning : warnings) logs_.warning(warning);
+    return good;
+  }
+
+  std::shared_ptr<const Identity> authenticate(std::string_view name,
+                                               std::string_view password) override {
+    const std::shared_ptr<const Identities> identities = store_.current();
+    if (!identities) return nullptr;
+    const Identity* const found = identities->authenticate(name, password);
+    if (!found) return nullptr;
+    return {identities, found};  // the snapshot lives as long as somebody is bound by it
+  }
+
+ private:
+  IdentityStore store_;
+  Logs& logs_;
+};
+
+// ---- the process
+
+void prepare_process() {
+  std::signal(SIGPIPE, SIG_IGN);
+  umask(077);
+  // Core dumps would hold passwords in clear.
+  prctl(PR_SET_DUMPABLE, 0);
+  rlimit files{};
+  if (getrlimit(RLIMIT_NOFILE, &files) == 0 && files.rlim_cur < files.rlim_max) {
+    files.rlim_cur = files.rlim_max;
+    setrlimit(RLIMIT_NOFILE, &files);
+  }
+}
+
+bool apply_options(const Options& options) {
+  g_srvType.store(options.server_type, std::memory_order_relaxed);
+  g_safe_mode.store(options.safe_mode ? 1 : 0, std::memory_order_relaxed);
+  set_ldap_debug(options.debug);
+  if (options.trace_mask) trcEvents.store(*options.trace_mask, std::memory_order_relaxed);
+  if (!options.trace_file.empty())
+    if (const int failure = set_trace_file(options.trace_file.c_str())) {
+      std::fprintf(stderr, "orvd: %s: %s\n", options.trace_file.c_str(), std::strerror(failure));
+      return false;
+    }
+  set_local_code_page(options.code_page.empty() ? nullptr : options.code_page.c_str());
+  open_message_catalogue((executable_directory() + "../share/orv/orvd.cat").c_str());
+  return true;
+}
+
+// ---- the backend
+
+// What the backend refers to for as long as the process lives.
+struct BackendPlace {
+  std::string config_file;
+  std::string key_stash_file;
+  const char* suffixes[2] = {kSuffix, nullptr};
+  Backend backend;
+};
+
+bool start_backend(const Options& options, BackendPlace& place) {
+  place.config_file = options.config_file;
+  place.key_stash_file = options.key_stash_file;
+  Backend& backend = place.backend;
+  backend.suffixes = place.suffixes;
+  backend.handlers = slapi_pblock_new();
+  if (!backend.handlers) {
+    std::fprintf(stderr, "orvd: out of memory\n");
+    return false;
+  }
+  PluginError error;
+  LoadedPlugin plugin =
+      load_plugin(options.plugin_file, kEntryPoint, backend.handlers, error);
+  if (!plugin) {
+    std::fprintf(stderr, "orvd: %s\n", error.text.c_str());
+    return false;
+  }
+  plugin.release();
+  auto* const startup = static_cast<BackendStartup*>(std::calloc(1, sizeof(BackendStartup)));
+  if (!startup) {
+    std::fprintf(stderr, "orvd: out of memory\n");
+    return false;
+  }
+  startup->config_file = place.config_file.c_str();
+  startup->key_stash_file = place.key_stash_file.empty() ? nullptr : place.key_stash_file.c_str();
+  backend.private_data = startup;
+  const InstanceStart start = slapi_pblock_instance_start(backend.handlers);
+  if (const int code = start(&backend)) {
+    std::fprintf(stderr, "orvd: the backend does not start: result %d\n", code);
+    return false;
+  }
+  return true;
+}
+
+// ---- the life of the server
+
+Publications publications() {
+  ServerFacts facts;
+  facts.naming_contexts = {"cn=configuration"};
+  facts.supported_features = {"1.3.6.1.4.1.4203.1.5.1"};  // all operational attributes, RFC 3673
+  facts.vendor_name = "orv";
+  facts.vendor_version = ORV_VERSION;
+  const std::time_t started = std::time(nullptr);
+  return {[facts] { return make_root_dse(facts); },
+          [started] { return make_subschema(builtin_schema(), started); }};
+}
+
+void report(Logs& logs, const std::vector<std::string>& problems) {
+  for (const std::string& problem : problems) logs.error(problem);
+}
+
+int serve(const Options& options, const Settings& settings, Logs& logs,
+          StoredIdentities& identities, BackendPlace& place) {
+  Server server({builtin_schema(), place.backend, identities, publications(), logs,
+                 slapi_supported_controls(), settings,
+                 std::max(1U, std::thread::hardware_concurrency()),
+                 [&](Settings& wanted) {
+                   std::string error;
+                   if (!read_settings(options.config_file, options.key_stash_file, wanted, error) ||
+                       !identities.reload(error)) {
+                     logs.error("settings not taken over: " + error);
+                     return false;
+                   }
+                   report(logs, logs.open(wanted));
+                   configfile_read.fetch_add(1, std::memory_order_relaxed);
+                   logs.info("settings taken over");
+                   return true;
+                 }});
+  std::string error;
+  const auto& addresses = options.addresses.empty() ? settings.addresses : options.addresses;
+  const auto port = options.port.value_or(static_cast<std::uint16_t>(settings.port));
+  if (!server.listen(addresses, port, error)) {
+    std::fprintf(stderr, "orvd: %s\n", error.c_str());
+    return 1;
+  }
+  server.handle_signals();
+  std::printf("orvd ready %s\n", server.url().c_str());
+  std::fflush(stdout);
+  return server.serve();
+}
+
+int run(const Options& options) {
+  if (!apply_options(options)) return 1;
+  if (cfg::register_attribute_types(builtin_schema().attribute_table()) != 0) return 1;
+  Settings settings;
+  std::string error;
+  if (!read_settings(options.config_file, options.key_stash_file, settings, error)) {
+    std::fprintf(stderr, "orvd: %s\n", error.c_str());
+    return 1;
+  }
+  configfile_read.store(1, std::memory_order_relaxed);
+
+  Logs logs({options.config_file, options.config_file + ".save", options.key_stash_file});
+  sink_logs = &logs;
+  set_message_sink(message_to_log);
+  cfg::set_diagnostics_sink(diagnostics_to_log);
+  int status = 1;
+  static BackendPlace place;  // referred to by what the backend keeps
+  {
+    StoredIdentities identities(options, logs);
+    if (!identities.reload(error)) {
+      std::fprintf(stderr, "orvd: %s\n", error.c_str());
+    } else if (start_backend(options, place)) {
+      if (options.check) {
+        std::printf("%s: good\n", options.config_file.c_str());
+        status = 0;
+      } else {
+        report(logs, logs.open(settings));
+        status = serve(options, settings, logs, identities, place);
+      }
+    }
+  }
+  logs.finish();
+  sink_logs = nullptr;
+  return status;
+}
+
+}  // namespace
+}  // namespace orv::server
+
+int main(int argc, char** argv) {
+  using namespace orv::server;
+  Options options;
+  int status = 0;
+  if (parse_options(argc, argv, options, status) == Parsed::exit) return status;
+  prepare_process();
+  try {
+    return run(options);
+  } catch (const std::exception& error) {
+    std::fprintf(stderr, "orvd: %s\n", error.what());
+    return 1;
+  }
+}

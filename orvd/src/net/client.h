@@ -1,0 +1,99 @@
+// A client's TCP connection: its socket, its buffers and its deadlines.
+//
+// Bytes are read when some are there and the session can take a message; answers are written at once
+// from the thread that made them, and by the event loop only when the client does not keep up. A
+// client that does not read its answers is not read from either.
+//
+// Threads: the loop's thread, except construction.
+#pragma once
+
+#include <asio/ip/tcp.hpp>
+#include <functional>
+#include <memory>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "net/limits.h"
+#include "net/loop.h"
+#include "ops/session.h"
+
+namespace orv::server {
+
+class Client final : public Session {
+ public:
+  // `socket` belongs to the loop's context.
+  Client(Loop& loop, Services& services, std::uint64_t number, asio::ip::tcp::socket socket,
+         ConnectionCounter::Ticket ticket);
+
+  // Begins to serve. On the loop's thread.
+  void start(const std::string& peer);
+
+  // Looks at the connection's deadlines.
+  void sweep(Clock::time_point now);
+
+  void disconnect(int code, std::string_view text) override;
+  bool lost_interest(PendingOperation& operation) noexcept override;
+
+ protected:
+  const Settings& settings() const noexcept override { return loop_.settings(); }
+  void post(std::function<void()> work) override;
+  void transmit(std::string& bytes) override;
+  void lend_storage(std::string& bytes) noexcept override;
+  void flush() override;
+  void drop() override { close("unbind"); }
+  void resume() override;
+  void settled() override;
+
+ private:
+  enum class State {
+    open,
+    parting,  // a notice of disconnection is on its way; what still comes in is thrown away
+    closed,
+  };
+
+  // ---- reading
+  bool may_read() const noexcept;
+  void read();
+  void received(const asio::error_code& error, std::size_t length);
+  void process();
+  bool process_one();
+  void make_room();
+  void consume(std::size_t length);
+  std::string_view unread() const noexcept { return {in_.data() + begin_, end_ - begin_}; }
+  std::shared_ptr<Client> self() { return std::static_pointer_cast<Client>(shared_from_this()); }
+
+  // ---- writing
+  std::size_t backlog() const noexcept { return out_.size() - out_sent_; }
+  void await_writable();
+  void all_sent();
+
+  // ---- ending
+  void part();
+  void close(std::string_view why) noexcept;
+
+  Loop& loop_;
+  asio::ip::tcp::socket socket_;
+  ConnectionCounter::Ticket ticket_;
+  State state_ = State::open;
+
+  std::vector<char> in_;  // bytes [begin_, end_) are received and not handled yet
+  std::size_t begin_ = 0;
+  std::size_t end_ = 0;
+  bool reading_ = false;
+  bool processing_ = false;
+  bool continuing_ = false;  // a continuation of process() is posted
+
+  std::string out_;  // bytes from out_sent_ on are to be written
+  std::size_t out_sent_ = 0;
+  bool writing_ = false;
+
+  // When each began; meaningful while the condition lasts.
+  Clock::time_point last_activity_ = Clock::now();   // nothing outstanding
+  Clock::time_point message_begun_ = Clock::now();   // part of a message is here
+  Clock::time_point write_progress_ = Clock::now();  // something is unwritten
+  Clock::time_point parting_since_{};
+  bool settled_ = false;
+};
+
+}  // namespace orv::server

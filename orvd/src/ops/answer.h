@@ -1,0 +1,78 @@
+// The answer to one operation: a buffer of finished LDAP messages with its budget and limits, filled
+// by the send operations that a backend calls through the `Connection`.
+//
+// Sending never blocks: it appends here, and the connection drains the buffer later. Threads: the
+// buffer belongs to the thread that runs the operation; only `abandon` may be called from others.
+#pragma once
+
+#include <atomic>
+#include <chrono>
+#include <cstdint>
+#include <string>
+#include <string_view>
+
+#include "ops/gate.h"
+#include "protocol/encoder.h"
+#include "slapi/connection.h"
+
+namespace orv::server {
+
+// What bounds an answer.
+struct AnswerLimits {
+  std::size_t bytes = 64 << 20;   // budget of the whole answer
+  std::int64_t entries = 0;       // 0: no limit
+  Clock::time_point deadline = Clock::time_point::max();  // of a search
+};
+
+class Answer {
+ public:
+  Answer(std::int32_t message_id, int response_tag, AnswerLimits limits)
+      : message_id_(message_id), response_tag_(response_tag), limits_(limits) {}
+
+  // Appends one search entry. 0; 4, 3, 11, 80 as SendSearchEntry says; 90 without memory. Nothing is
+  // appended on failure.
+  int entry(const orv::entry& e, char** attributes, bool types_only, LDAPControl** controls) noexcept;
+
+  // Appends the result, once: later results and results of an abandoned operation are dropped.
+  void result(int code, std::string_view matched_dn, std::string_view text) noexcept;
+
+  // A result with what only some responses carry.
+  void result(const ResultAnswer& answer) noexcept;
+
+  // Nobody wants the answer any more: nothing is sent from now on. Any thread.
+  void abandon() noexcept { abandoned_.store(true, std::memory_order_relaxed); }
+  bool abandoned() const noexcept { return abandoned_.load(std::memory_order_relaxed); }
+
+  bool answered() const noexcept { return answered_; }
+  int code() const noexcept { return code_; }
+  std::int64_t entries() const noexcept { return entries_; }
+  std::int32_t message_id() const noexcept { return message_id_; }
+  int response_tag() const noexcept { return response_tag_; }
+  const AnswerLimits& limits() const noexcept { return limits_; }
+  void set_limits(const AnswerLimits& limits) noexcept { limits_ = limits; }
+
+  // The finished messages.
+  std::string& bytes() noexcept { return bytes_; }
+
+ private:
+  bool select(char** attributes) noexcept;
+
+  const std::int32_t message_id_;
+  const int response_tag_;
+  AnswerLimits limits_;
+  std::string bytes_;
+  std::int64_t entries_ = 0;
+  int code_ = 0;
+  bool answered_ = false;
+  bool selected_ = false;  // selection_ stands for selected_list_
+  char** selected_list_ = nullptr;
+  AttributeSelection selection_;
+  std::atomic<bool> abandoned_{false};
+};
+
+// Installs the send operations in a connection. They reach the answer through `Operation::server`,
+// which must point to an `Answer`; one that is null drops everything, as a connection of the server's
+// own does.
+void install_senders(Connection& connection) noexcept;
+
+}  // namespace orv::server

@@ -1,0 +1,306 @@
+#include "ops/canonical.h"
+
+#include <algorithm>
+#include <cstdlib>
+#include <cstring>
+#include <new>
+#include <utility>
+
+#include "cfg/dn.h"
+#include "cfg/result_codes.h"
+#include "cfg/text.h"
+
+namespace orv::server {
+namespace {
+
+constexpr std::string_view kObjectClass = "objectClass";
+
+Refusal refuse(int code, std::string_view what, std::string_view name = "") {
+  std::string text(what);
+  if (!name.empty()) text.append(": ").append(name);
+  return {code, std::move(text)};
+}
+
+// ---- attribute types and values
+
+Refusal canonical_type(const Schema& schema, const std::string& name, std::string_view& type) {
+  if (name.find(';') != std::string::npos)
+    return refuse(result::undefined_attribute_type, "attribute options are not supported", name);
+  type = schema.canonical_attribute(name);
+  if (type.empty()) return refuse(result::undefined_attribute_type, "unknown attribute type", name);
+  return {};
+}
+
+Refusal check_value(std::string_view type, const std::string& value) {
+  if (value.find('\0') != std::string::npos)
+    return refuse(result::invalid_attribute_syntax, "value contains a NUL byte", type);
+  if (!cfg::is_valid_utf8(value))
+    return refuse(result::invalid_attribute_syntax, "value is not UTF-8", type);
+  return {};
+}
+
+// Canonical spelling of object class values; a class that the schema does not know stays for the
+// schema check to refuse.
+std::string canonical_value(const Schema& schema, std::string_view type, const std::string& value) {
+  if (type != kObjectClass) return value;
+  const std::string_view name = schema.canonical_object_class(value);
+  return name.empty() ? value : std::string(name);
+}
+
+struct CanonicalAttribute {
+  std::string_view type;  // lives in the schema
+  std::vector<std::string> values;
+};
+
+Refusal canonical_attribute(const Schema& schema, const Attribute& given, CanonicalAttribute& made) {
+  if (Refusal refusal = canonical_type(schema, given.type, made.type)) return refusal;
+  made.values.reserve(given.values.size());
+  for (const std::string& value : given.values) {
+    if (Refusal refusal = check_value(made.type, value)) return refusal;
+    made.values.push_back(canonical_value(schema, made.type, value));
+  }
+  std::vector<std::string_view> sorted(made.values.begin(), made.values.end());
+  std::sort(sorted.begin(), sorted.end());
+  if (std::adjacent_find(sorted.begin(), sorted.end()) != sorted.end())
+    return refuse(result::attribute_or_value_exists, "the same value twice", made.type);
+  return {};
+}
+
+// ---- malloc forms
+
+void* checked(void* memory) {
+  if (!memory) throw std::bad_alloc();
+  return memory;
+}
+
+void free_values(berval** values) noexcept {
+  if (!values) return;
+  for (berval** value = values; *value; ++value) {
+    std::free((*value)->bv_val);
+    std::free(*value);
+  }
+  std::free(values);
+}
+
+struct ValuesDeleter {
+  void operator()(berval** values) const noexcept { free_values(values); }
+};
+using Values = std::unique_ptr<berval*, ValuesDeleter>;
+
+// Null for an empty list.
+Values malloc_values(const std::vector<std::string>& values) {
+  if (values.empty()) return nullptr;
+  Values array(static_cast<berval**>(checked(std::calloc(values.size() + 1, sizeof(berval*)))));
+  for (std::size_t i = 0; i < values.size(); ++i) {
+    auto* const value = static_cast<berval*>(checked(std::calloc(1, sizeof(berval))));
+    array.get()[i] = value;
+    value->bv_val = malloc_text(values[i]).release();
+    value->bv_len = values[i].size();
+  }
+  return array;
+}
+
+// ---- entries
+
+Refusal canonical_attributes(const Schema& schema, const AddRequest& request,
+                             std::vector<CanonicalAttribute>& attributes) {
+  if (request.attributes.empty()) return refuse(result::protocol_error, "no attributes");
+  for (const Attribute& given : request.attributes) {
+    CanonicalAttribute made;
+    if (given.values.empty())
+      return refuse(result::protocol_error, "attribute without values", given.type);
+    if (Refusal refusal = canonical_attribute(schema, given, made)) return refusal;
+    for (const CanonicalAttribute& other : attributes)
+      if (other.type == made.type)
+        return refuse(result::attribute_or_value_exists, "the same attribute twice", made.type);
+    attributes.push_back(std::move(made));
+  }
+  // Rules of the backend look at the first attribute for the object classes.
+  std::stable_partition(attributes.begin(), attributes.end(),
+                        [](const CanonicalAttribute& a) { return a.type == kObjectClass; });
+  return {};
+}
+
+bool holds_rdn_value(const CanonicalAttribute& attribute, const std::string& value) {
+  return std::any_of(
+      attribute.values.begin(), attribute.values.end(),
+      [&](const std::string& held) { return cfg::equals_ignore_ascii_case(held, value); });
+}
+
+// RFC 4511, 4.7: values of the RDN that the list lacks are added.
+Refusal complete_rdn(const Schema& schema, const std::string& dn,
+                     std::vector<CanonicalAttribute>& attributes) {
+  cfg::Dn parsed;
+  if (const int code = cfg::parse_dn(dn, parsed)) return refuse(code, "not a DN");
+  if (parsed.empty()) return {};
+  for (const cfg::Ava& ava : parsed.front()) {
+    std::string_view type;
+    if (Refusal refusal = canonical_type(schema, ava.type, type)) return refusal;
+    auto found = std::find_if(attributes.begin(), attributes.end(),
+                              [&](const CanonicalAttribute& a) { return a.type == type; });
+    if (found == attributes.end()) found = attributes.insert(found, {type, {}});
+    if (!holds_rdn_value(*found, ava.value)) found->values.push_back(ava.value);
+  }
+  return {};
+}
+
+EntryPtr build_entry(const std::string& dn, const std::string& normal,
+                     const std::vector<CanonicalAttribute>& attributes) {
+  EntryPtr made(static_cast<entry*>(checked(std::calloc(1, sizeof(entry)))));
+  made->dn = malloc_text(dn).release();
+  made->normalized_dn = malloc_text(normal).release();
+  for (const CanonicalAttribute& attribute : attributes) {
+    const Values values = malloc_values(attribute.values);
+    if (attr_merge(made.get(), std::string(attribute.type).c_str(), values.get(), 1, 1, nullptr) ==
+        result::no_memory)
+      throw std::bad_alloc();
+  }
+  return made;
+}
+
+// ---- modifications
+
+struct ModificationsDeleter {
+  void operator()(ldapmod* first) const noexcept { free_modifications(first); }
+};
+using Modifications = std::unique_ptr<ldapmod, ModificationsDeleter>;
+
+ldapmod* malloc_modification(int operation, const CanonicalAttribute& attribute) {
+  Modifications made(static_cast<ldapmod*>(checked(std::calloc(1, sizeof(ldapmod)))));
+  made->mod_op = operation | kModBvalues;
+  made->mod_type = malloc_text(attribute.type).release();
+  made->mod_vals.modv_bvals = malloc_values(attribute.values).release();
+  return made.release();
+}
+
+// ---- filters
+
+// One item, as the text between its parentheses.
+struct FilterItem {
+  std::string_view attribute;  // with options; empty in an extensible match without a type
+  std::string_view before_value;  // attribute, matching rule and operator
+  std::string_view value;
+};
+
+FilterItem split_item(std::string_view item) {
+  const std::size_t equals = std::min(item.find('='), item.size());
+  FilterItem parts;
+  parts.before_value = item.substr(0, std::min(equals + 1, item.size()));
+  parts.value = item.substr(parts.before_value.size());
+  parts.attribute = item.substr(0, std::min(item.find_first_of("=~<>:;"), item.size()));
+  return parts;
+}
+
+bool hidden_from_members(const Schema& schema, std::string_view attribute) {
+  // An extensible match without a type looks at every attribute.
+  if (attribute.empty()) return true;
+  const std::string_view type = schema.canonical_attribute(attribute);
+  return type == "orv-slapdAdminDN" || type == "orv-slapdAdminGroupEnabled";
+}
+
+bool secret(const Schema& schema, std::string_view attribute) {
+  if (attribute.empty()) return true;
+  const SchemaAttribute* const found = schema.attribute(attribute);
+  return found && found->secret;
+}
+
+void rewrite_item(const Schema& schema, std::string_view item, FilterUse use, std::string& out) {
+  const FilterItem parts = split_item(item);
+  const bool presence = parts.value == "*" && parts.before_value.size() == parts.attribute.size() + 1;
+  if (presence) {
+    out += item;
+  } else if (use == FilterUse::show) {
+    out += secret(schema, parts.attribute) ? parts.before_value : item;
+    if (secret(schema, parts.attribute)) out += "***";
+  } else if (hidden_from_members(schema, parts.attribute)) {
+    // No value assertion on a password is ever true or false.
+    out += "orv-slapdAdminPW=-";
+  } else {
+    out += item;
+  }
+}
+
+}  // namespace
+
+void free_modifications(ldapmod* first) noexcept {
+  while (first) {
+    ldapmod* const next = first->mod_next;
+    std::free(first->mod_type);
+    if (first->mod_op & kModBvalues)
+      free_values(first->mod_vals.modv_bvals);
+    else
+      charray_free(first->mod_vals.modv_strvals);
+    std::free(first);
+    first = next;
+  }
+}
+
+MallocText malloc_text(std::string_view text) {
+  auto* const copy = static_cast<char*>(checked(std::malloc(text.size() + 1)));
+  std::memcpy(copy, text.data(), text.size());
+  copy[text.size()] = '\0';
+  return MallocText(copy);
+}
+
+TextArray canonical_names(const Schema& schema, const std::vector<std::string>& names) {
+  if (names.empty()) return nullptr;
+  TextArray array(static_cast<char**>(checked(std::calloc(names.size() + 1, sizeof(char*)))));
+  for (std::size_t i = 0; i < names.size(); ++i) {
+    const std::string_view known = schema.canonical_attribute(names[i]);
+    array.get()[i] = malloc_text(known.empty() ? std::string_view(names[i]) : known).release();
+  }
+  return array;
+}
+
+Refusal make_entry(const Schema& schema, const AddRequest& request, EntryPtr& made) {
+  std::string normal;
+  std::string dn;
+  if (const int code = cfg::normalize_dn(request.dn, normal)) return refuse(code, "not a DN");
+  if (const int code = cfg::canonicalize_dn_types(request.dn, dn)) return refuse(code, "not a DN");
+  std::vector<CanonicalAttribute> attributes;
+  if (Refusal refusal = canonical_attributes(schema, request, attributes)) return refusal;
+  if (Refusal refusal = complete_rdn(schema, request.dn, attributes)) return refusal;
+  made = build_entry(dn, normal, attributes);
+  return {};
+}
+
+Refusal make_modifications(const Schema& schema, const ModifyRequest& request, ldapmod*& first) {
+  if (request.modifications.empty()) return refuse(result::protocol_error, "no modifications");
+  Modifications list;
+  ldapmod* last = nullptr;
+  for (const Modification& given : request.modifications) {
+    CanonicalAttribute attribute;
+    if (Refusal refusal = canonical_attribute(schema, given.attribute, attribute)) return refusal;
+    if (given.operation == kModAdd && attribute.values.empty())
+      return refuse(result::protocol_error, "add without values", attribute.type);
+    ldapmod* const made = malloc_modification(given.operation, attribute);
+    if (last)
+      last->mod_next = made;
+    else
+      list.reset(made);
+    last = made;
+  }
+  first = list.release();
+  return {};
+}
+
+std::string rewrite_filter(const Schema& schema, std::string_view filter, FilterUse use) {
+  std::string out;
+  out.reserve(filter.size());
+  std::size_t at = 0;
+  while (at < filter.size()) {
+    const char c = filter[at];
+    const bool opens_item = c == '(' && at + 1 < filter.size() &&
+                            std::strchr("&|!()", filter[at + 1]) == nullptr;
+    out += c;
+    ++at;
+    if (!opens_item) continue;
+    // Parentheses inside values are escaped, so the next one closes the item.
+    const std::size_t end = std::min(filter.find(')', at), filter.size());
+    rewrite_item(schema, filter.substr(at, end - at), use, out);
+    at = end;
+  }
+  return out;
+}
+
+}  // namespace orv::server

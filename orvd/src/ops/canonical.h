@@ -1,0 +1,64 @@
+// One spelling: what a client wrote is brought to the form in which the backend compares bytes, or
+// refused.
+//
+// DNs are normalised, attribute types and object class values take their canonical schema names,
+// attribute options are refused, values with NUL bytes or invalid UTF-8 are refused. Everything that
+// is handed to a handler is from the malloc family.
+//
+// Nothing here throws but std::bad_alloc; all functions are thread-safe.
+#pragma once
+
+#include <memory>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "cfg/ldapmod.h"
+#include "protocol/message.h"
+#include "slapi/owners.h"
+#include "slapi/schema.h"
+
+namespace orv::server {
+
+// 0, or the code with which a request is refused and a reason for the client.
+struct Refusal {
+  int code = 0;
+  std::string text;
+  explicit operator bool() const noexcept { return code != 0; }
+};
+
+// A null-terminated array of malloced texts.
+struct TextArrayDeleter {
+  void operator()(char** array) const noexcept { charray_free(array); }
+};
+using TextArray = std::unique_ptr<char*, TextArrayDeleter>;
+
+// A linked list of modification records with everything in them; null is a no-op.
+void free_modifications(ldapmod* first) noexcept;
+
+// A malloced copy. Throws std::bad_alloc.
+MallocText malloc_text(std::string_view text);
+
+// The names that a search asked for, canonical where the schema knows them; null for an empty list.
+// Names that it does not know stay as they are: no entry has them.
+TextArray canonical_names(const Schema& schema, const std::vector<std::string>& names);
+
+// The entry of an add request: canonical types, each once, object classes first, the values of the
+// RDN completed. 34 no DN; 17 unknown type or an attribute option; 2 an attribute without values or an
+// empty list; 20 a type or a value twice; 21 a value that must not reach the backend.
+Refusal make_entry(const Schema& schema, const AddRequest& request, EntryPtr& made);
+
+// The modification records of a modify request, in the client's order: counted values, a null array
+// where there are none. 17, 20 and 21 as above; 2 an empty list, or an add without values.
+Refusal make_modifications(const Schema& schema, const ModifyRequest& request, ldapmod*& first);
+
+// What to do with an assertion on the value of an attribute.
+enum class FilterUse {
+  evaluate_for_administrators,  // hidden from everybody but the primary administrator: Undefined
+  show,                         // values of secret attributes are replaced by asterisks
+};
+
+// Rewrites the items of a filter (in the decoder's text form), item by item, leaving presence tests.
+std::string rewrite_filter(const Schema& schema, std::string_view filter, FilterUse use);
+
+}  // namespace orv::server

@@ -1,0 +1,92 @@
+// One operation of a client on its way through the backend: the arguments in the form that handlers
+// get, the wait at the gate, the call, and the answer.
+//
+// Threads: made and finished on the connection's loop thread; run on that thread or on a worker, by
+// one thread at a time.
+#pragma once
+
+#include <memory>
+#include <string>
+
+#include "cfg/interrupt.h"
+#include "ops/answer.h"
+#include "ops/canonical.h"
+#include "ops/gate.h"
+#include "ops/services.h"
+
+namespace orv::server {
+
+class PendingOperation;
+
+// The connection as its operations see it. It outlives them.
+class OperationHome {
+ public:
+  virtual ~OperationHome() = default;
+  virtual Connection& connection() noexcept = 0;
+
+  // The gate decided on a waiting operation. Any thread; must not run it at once.
+  virtual void decided(std::shared_ptr<PendingOperation> operation, Verdict verdict) noexcept = 0;
+
+  // Polled now and then while an operation runs on the connection's own thread, which cannot read
+  // meanwhile: whether the client left or gave the operation up, which is then marked abandoned.
+  virtual bool lost_interest(PendingOperation& operation) noexcept = 0;
+};
+
+class PendingOperation final : public GateWaiter,
+                               public std::enable_shared_from_this<PendingOperation> {
+ public:
+  PendingOperation(std::shared_ptr<OperationHome> home, std::shared_ptr<const Identity> identity,
+                   std::int32_t message_id, int response_tag, const AnswerLimits& limits);
+  ~PendingOperation() override;
+
+  // Take over a request. A refusal leaves the operation to be answered with it.
+  Refusal prepare_search(Services& services, SearchRequest& request, std::string_view normal_dn);
+  Refusal prepare_add(Services& services, const AddRequest& request, std::string_view normal_dn);
+  Refusal prepare_delete(Services& services, std::string_view normal_dn);
+  Refusal prepare_modify(Services& services, const ModifyRequest& request,
+                         std::string_view normal_dn);
+
+  // Calls the handler and makes sure that there is a result. The caller holds the gate, which is open
+  // or passed on afterwards. `on_home_thread`: the connection's thread runs it.
+  void run(Services& services, bool on_home_thread);
+
+  void gate_decided(Verdict verdict) noexcept override;
+
+  Answer& answer() noexcept { return answer_; }
+  const Answer& answer() const noexcept { return answer_; }
+  // Changes flush to disk, so they run on a worker thread.
+  bool wants_worker() const noexcept { return handler_ != parameter::search_function; }
+  bool long_running() const noexcept { return long_running_; }
+  Clock::time_point started() const noexcept { return started_; }
+
+  std::string log_text;  // what the access log says of the request; empty when it is off
+
+ private:
+  bool begin(Services& services, int handler, std::string_view normal_dn);
+  bool set(int number, void* value) noexcept;
+  static bool interrupted(void* self) noexcept;
+  bool must_stop() noexcept;
+
+  const std::shared_ptr<OperationHome> home_;
+  const std::shared_ptr<const Identity> identity_;  // null: anonymous
+  const Clock::time_point started_ = Clock::now();
+  Answer answer_;
+  Operation operation_;
+  int handler_ = 0;
+  bool long_running_ = false;
+
+  // Arguments of the handler, released with the operation.
+  PblockPtr parameters_;
+  MallocText dn_;
+  MallocText filter_;
+  TextArray names_;
+  EntryPtr entry_;
+
+  // For the check of a running search.
+  const std::atomic<bool>* stopping_ = nullptr;
+  bool on_home_thread_ = false;
+  unsigned polls_ = 0;
+  Clock::time_point next_look_{};
+};
+
+}  // namespace orv::server

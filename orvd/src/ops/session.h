@@ -1,0 +1,128 @@
+// What a connection means in LDAP: who is bound, which operations are outstanding, and what is done
+// with each message. How bytes come and go is its subclass's affair.
+//
+// Rules kept here (RFC 4511): a bind waits until nothing is outstanding, and nothing else is read
+// meanwhile; a failed bind leaves the connection anonymous; abandon and unbind have no answer;
+// unknown critical controls are refused. Callers without access to the configuration are refused
+// before the backend is entered.
+//
+// Threads: everything on the connection's loop thread, except `decided`.
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "ops/operation.h"
+#include "ops/services.h"
+#include "protocol/decoder.h"
+#include "protocol/message.h"
+#include "settings.h"
+
+namespace orv::server {
+
+class Session : public OperationHome, public std::enable_shared_from_this<Session> {
+ public:
+  Session(Services& services, AccessLane& access, std::uint64_t number);
+
+  Connection& connection() noexcept override { return connection_; }
+  void decided(std::shared_ptr<PendingOperation> operation, Verdict verdict) noexcept override;
+
+ protected:
+  // ---- what the subclass provides
+  virtual const Settings& settings() const noexcept = 0;
+  // Runs `work` on the loop's thread later. Any thread.
+  virtual void post(std::function<void()> work) = 0;
+  // Queues finished messages for the client; `bytes` is left empty, perhaps with other storage.
+  virtual void transmit(std::string& bytes) = 0;
+  // Lends an empty string with storage that was used before, if there is one.
+  virtual void lend_storage(std::string& bytes) noexcept = 0;
+  // Writes what is queued before something that may take long.
+  virtual void flush() = 0;
+  // Ends the connection with a notice of disconnection.
+  virtual void disconnect(int code, std::string_view text) = 0;
+  // Ends the connection without a word.
+  virtual void drop() = 0;
+  // Something that kept the session from taking messages may be over.
+  virtual void resume() = 0;
+  // Nothing is outstanding any more on a connection that has ended.
+  virtual void settled() = 0;
+
+  // ---- what the subclass calls
+  // Handles one whole message; `frame` need not outlive the call.
+  void handle(std::string_view frame);
+  // Whether the next message must wait.
+  bool busy() const noexcept;
+  // The client is gone: no answer reaches it, waiting operations are dropped.
+  void client_left() noexcept;
+  bool client_is_gone() const noexcept { return gone_; }
+  bool idle() const noexcept { return outstanding_.empty() && !bind_; }
+  // Gives up the operation of that message id, if it is outstanding.
+  void abandon(std::int32_t message_id) noexcept;
+  // Calls the unbind handler. Once, when the session has settled.
+  void unbind() noexcept;
+  // Starts an access line of this connection; null when the access log is off.
+  std::string* begin_access_line();
+  void end_access_line() { access_.end(); }
+
+  Services& services() noexcept { return services_; }
+
+ private:
+  // A bind request that waits or is being verified.
+  struct Bind {
+    std::int32_t message_id = 0;
+    BindRequest request;
+    Refusal refusal;  // decided already
+    bool started = false;
+    Clock::time_point received = Clock::now();
+  };
+  using OperationPtr = std::shared_ptr<PendingOperation>;
+
+  void take(Message& message);
+  bool control_is_unknown(const Message& message) const;
+
+  void search(std::int32_t id, SearchRequest& request);
+  void add(std::int32_t id, const AddRequest& request);
+  void remove(std::int32_t id, const DeleteRequest& request);
+  void modify(std::int32_t id, const ModifyRequest& request);
+  void search_published(std::int32_t id, const SearchRequest& request, EntryPtr published,
+                        std::string_view dn);
+
+  enum class Target { root_dse, subschema, configuration, nothing, not_a_dn };
+  Target find_target(std::string_view dn, std::string& normal) const;
+  Refusal refuse_change(Target target) const;
+
+  OperationPtr make_operation(std::int32_t id, int response_tag, std::int64_t time_limit,
+                              std::int64_t size_limit);
+  void submit(const OperationPtr& operation, Refusal refusal);
+  void run_here(const OperationPtr& operation);
+  void run_on_worker(OperationPtr operation);
+  void complete(const OperationPtr& operation);
+  void respond(std::int32_t id, int response_tag, int code, std::string_view text,
+               std::string_view what, std::string_view response_name = {});
+  void log_result(std::int32_t id, std::string_view what, int code, std::int64_t entries,
+                  Clock::time_point started);
+
+  void receive_bind(std::int32_t id, BindRequest& request, Refusal refusal);
+  void try_bind();
+  void start_bind();
+  void verify_password();
+  void ask_backend_to_bind();
+  void finish_bind(int code, std::string_view text, std::shared_ptr<const Identity> identity);
+  void become(std::shared_ptr<const Identity> identity) noexcept;
+  void settle_if_done();
+
+  Services& services_;
+  AccessLane& access_;
+  const std::uint64_t number_;
+  Connection connection_;
+  ConnectionAux aux_;
+  std::shared_ptr<const Identity> identity_;  // null: anonymous
+  std::vector<OperationPtr> outstanding_;
+  std::optional<Bind> bind_;
+  bool gone_ = false;
+};
+
+}  // namespace orv::server

@@ -1,0 +1,35 @@
+// The command line of the server.
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace orv::server {
+
+struct Options {
+  std::string config_file;     // absolute, symbolic links resolved
+  std::string key_stash_file;  // "" for none
+  std::string plugin_file;
+  std::vector<std::string> addresses;      // not empty: instead of the configured ones
+  std::optional<std::uint16_t> port;       // instead of the configured one
+  int server_type = 0;
+  bool safe_mode = false;
+  std::string code_page;                   // "": the environment's
+  std::optional<std::uint32_t> trace_mask;
+  std::string trace_file;                  // "": standard error
+  bool debug = false;
+  bool check = false;                      // read everything, report, do not serve
+};
+
+enum class Parsed { run, exit };
+
+// Reads the command line; `exit` when there is nothing to run (help, version, a mistake: told on
+// standard output or standard error), with the exit status in `status`.
+Parsed parse_options(int argc, char** argv, Options& options, int& status);
+
+// The directory of the running executable, with a slash at its end; "" when unknown.
+std::string executable_directory();
+
+}  // namespace orv::server

@@ -1,0 +1,117 @@
+#include "server.h"
+
+#include <asio/executor_work_guard.hpp>
+#include <asio/post.hpp>
+#include <csignal>
+#include <thread>
+#include <utility>
+
+#include "slapi/globals.h"
+
+namespace orv::server {
+namespace {
+
+constexpr std::size_t kWorkers = 2;
+// How often waiting operations are checked for their deadline.
+constexpr std::chrono::milliseconds kGateInterval{100};
+// How long a stopping server waits for the operation in hand, and for clients to leave.
+constexpr std::chrono::seconds kPatience{30};
+constexpr std::chrono::seconds kFarewell{3};
+
+}  // namespace
+
+Server::Server(ServerParts parts)
+    : parts_(std::move(parts)),
+      signals_(control_),
+      gate_timer_(control_),
+      workers_(kWorkers),
+      backend_(parts_.backend,
+               [this](std::string_view why) {
+                 parts_.logs.error("the backend threw: " + std::string(why) +
+                                   "; nothing is admitted any more");
+                 stop();
+               }),
+      services_{parts_.schema, backend_,           parts_.authenticator,      parts_.publications,
+                parts_.logs,   parts_.supported_controls, workers_, {}},
+      settings_(std::make_shared<const Settings>(parts_.settings)),
+      listeners_(control_, services_, counter_, loops_) {
+  for (unsigned i = 0; i < std::max(1U, parts_.loops); ++i)
+    loops_.push_back(std::make_unique<Loop>(parts_.logs, settings_));
+}
+
+Server::~Server() {
+  workers_.stop();
+  workers_.join();
+  for (const auto& loop : loops_) loop->stop();
+}
+
+bool Server::listen(const std::vector<std::string>& addresses, std::uint16_t port,
+                    std::string& error) {
+  return listeners_.open(addresses, port, error);
+}
+
+void Server::handle_signals() {
+  for (const int number : {SIGTERM, SIGINT, SIGHUP}) signals_.add(number);
+  await_signal();
+}
+
+void Server::await_signal() {
+  signals_.async_wait([this](const asio::error_code& error, int number) {
+    if (error) return;
+    if (number != SIGHUP) return stop();
+    reload();
+    await_signal();
+  });
+}
+
+int Server::serve() {
+  const auto work = asio::make_work_guard(control_);
+  watch_gate();
+  for (const auto& loop : loops_) loop->start();
+  listeners_.start(settings_);
+  control_.run();
+  wind_up();
+  return backend_.failed() ? 1 : 0;
+}
+
+void Server::stop() { control_.stop(); }
+
+void Server::watch_gate() {
+  gate_timer_.expires_after(kGateInterval);
+  gate_timer_.async_wait([this](const asio::error_code& error) {
+    if (error) return;
+    backend_.gate().expire(Clock::now());
+    watch_gate();
+  });
+}
+
+void Server::wind_up() {
+  parts_.logs.info("stopping");
+  listeners_.close();
+  services_.stopping.store(true, std::memory_order_relaxed);
+  const bool closed = backend_.close(kPatience);
+  if (!closed && !backend_.failed()) parts_.logs.error("an operation does not end; going anyway");
+  for (const auto& loop : loops_) loop->disconnect_all();
+  const Clock::time_point end = Clock::now() + kFarewell;
+  while (!backend_.failed() && counter_.count() > 0 && Clock::now() < end)
+    std::this_thread::sleep_for(std::chrono::milliseconds(5));
+  workers_.stop();
+  workers_.join();
+  for (const auto& loop : loops_) loop->stop();
+  parts_.logs.info("stopped");
+}
+
+void Server::reload() {
+  Settings wanted;
+  if (!parts_.reload || !parts_.reload(wanted)) return;
+  for (const std::string_view name : restart_needed(*settings_, wanted))
+    parts_.logs.warning(std::string(name) + " takes effect at the next start");
+  // What listens is not changed; the settings say what runs.
+  wanted.port = settings_->port;
+  wanted.addresses = settings_->addresses;
+  settings_ = std::make_shared<const Settings>(std::move(wanted));
+  listeners_.renew(settings_);
+  for (const auto& loop : loops_) loop->renew(settings_);
+}
+
+}  // namespace orv::server

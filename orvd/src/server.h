@@ -1,0 +1,86 @@
+// The server as a whole: what it is made of, and its life from start to stop.
+//
+//   Server server(parts)  ->  listen()  ->  serve()   (until stop() or a signal)
+//
+// Threads: one for the control of the server (whoever calls serve), one for each event loop, a few
+// workers. Functions are for the control thread, except stop().
+#pragma once
+
+#include <asio/io_context.hpp>
+#include <asio/signal_set.hpp>
+#include <asio/steady_timer.hpp>
+#include <functional>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "net/limits.h"
+#include "net/listener.h"
+#include "net/loop.h"
+#include "ops/services.h"
+#include "settings.h"
+
+namespace orv::server {
+
+// What a server is given from outside; all of it outlives the server.
+struct ServerParts {
+  const Schema& schema;
+  Backend& backend;  // started, with its handlers
+  Authenticator& authenticator;
+  Publications publications;
+  Logs& logs;
+  std::vector<std::string> supported_controls;
+  Settings settings;
+  unsigned loops = 1;
+  // Reads everything anew after SIGHUP; false keeps the settings. May be empty.
+  std::function<bool(Settings&)> reload;
+};
+
+class Server {
+ public:
+  explicit Server(ServerParts parts);
+  ~Server();
+  Server(const Server&) = delete;
+  Server& operator=(const Server&) = delete;
+
+  // Opens the listeners. False with the cause.
+  bool listen(const std::vector<std::string>& addresses, std::uint16_t port, std::string& error);
+  std::string url() const { return listeners_.url(); }
+  std::uint16_t port() const { return listeners_.port(); }
+
+  // Takes SIGTERM and SIGINT as stop, SIGHUP as reload.
+  void handle_signals();
+
+  // Accepts and serves until somebody stops the server, and winds up: no new connections, the
+  // operation in hand is finished, clients are told, the backend is closed. Returns the exit status
+  // of the process: 0, or 1 when the backend failed.
+  int serve();
+
+  // Ends serve(). Any thread.
+  void stop();
+
+  // Reads the settings again and takes them over. On the control thread.
+  void reload();
+
+  BackendHost& backend() noexcept { return backend_; }
+  std::int64_t connections() const { return counter_.count(); }
+
+ private:
+  void watch_gate();
+  void wind_up();
+  void await_signal();
+
+  ServerParts parts_;
+  asio::io_context control_{1};
+  asio::signal_set signals_;
+  asio::steady_timer gate_timer_;
+  asio::thread_pool workers_;
+  BackendHost backend_;
+  Services services_;
+  ConnectionCounter counter_;
+  std::shared_ptr<const Settings> settings_;
+  std::vector<std::unique_ptr<Loop>> loops_;
+  Listeners listeners_;
+};
+
+}  // namespace orv::server
