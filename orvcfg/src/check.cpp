@@ -1,0 +1,118 @@
+#include "check.h"
+
+#include <map>
+#include <utility>
+#include <vector>
+
+#include "cfg/dn.h"
+#include "cfg/secret.h"
+#include "file_session.h"
+#include "schema_check.h"
+
+namespace orv::orvcfg {
+
+namespace {
+
+constexpr const char* kSuffix = "CN=CONFIGURATION";
+
+class FileCheck {
+ public:
+  FileCheck(const cfg::Key* key, std::ostream& out) : key_(key), out_(out) {}
+
+  void check(const FileEntry& entry) {
+    for (const std::string& problem : schema_problems(builtin_schema(), entry)) {
+      report(entry, problem);
+    }
+    check_secrets(entry);
+    check_identity(entry, "orv-slapdAdminDN");
+    check_identity(entry, "orv-slapdMasterDN");
+  }
+
+  void report(const FileEntry& entry, const std::string& problem) {
+    out_ << entry.dn << ": " << problem << "\n";
+    ++problems_;
+  }
+
+  [[nodiscard]] int problems() const { return problems_; }
+
+ private:
+  void check_secrets(const FileEntry& entry) {
+    std::string place;
+    if (cfg::normalize_dn(entry.dn, place) != 0) return;
+    for (const FileAttribute& attribute : entry.attributes) {
+      const SchemaAttribute* type = builtin_schema().attribute(attribute.name);
+      if (type == nullptr || !type->secret) continue;
+      for (const std::string& value : attribute.values) {
+        check_secret(entry, {type->names.front(), place}, value);
+      }
+    }
+  }
+
+  // A sealed value is bound to its entry, so opening alone does not show that it may stand here.
+  void check_secret(const FileEntry& entry, cfg::SecretPlace place, const std::string& value) {
+    if (key_ == nullptr) return;
+    std::string clear;
+    const cfg::OpenResult opened = cfg::open_secret(key_, value, clear);
+    const bool belongs =
+        opened != cfg::OpenResult::opened || cfg::verify_secret(key_, place, value, clear);
+    cfg::wipe(clear);
+    if (opened == cfg::OpenResult::broken) {
+      report(entry, std::string(place.type) + " cannot be opened with this key stash");
+    } else if (!belongs) {
+      report(entry, std::string(place.type) + " was sealed for another entry");
+    }
+  }
+
+  void check_identity(const FileEntry& entry, const char* type) {
+    for (const std::string& value : entry.values(type)) {
+      std::string name;
+      if (cfg::normalize_dn(value, name) != 0 || name.empty()) {
+        report(entry, std::string(type) + " is not the DN of an administrator");
+      } else if (cfg::normal_dn_is_at_or_below(name, kSuffix)) {
+        report(entry, std::string(type) + " lies inside " + kSuffix + ", so nobody can bind as it");
+      } else if (const auto [owner, is_new] = owners_.emplace(name, entry.dn); !is_new) {
+        report(entry, std::string(type) + " is claimed by " + owner->second + " too");
+      }
+    }
+  }
+
+  const cfg::Key* key_;
+  std::ostream& out_;
+  std::map<std::string, std::string> owners_;  // normalised bind DN, entry that has it
+  int problems_ = 0;
+};
+
+bool conclude(const std::string& file, std::size_t entries, int problems, std::ostream& out) {
+  out << file << ": " << entries << " entries, ";
+  if (problems == 0) out << "nothing wrong\n";
+  if (problems == 1) out << "1 problem\n";
+  if (problems > 1) out << problems << " problems\n";
+  return problems == 0;
+}
+
+bool check_entries(const std::string& file, const std::vector<FileEntry>& entries,
+                   const cfg::Key* key, std::ostream& out) {
+  FileCheck check(key, out);
+  for (const FileEntry& entry : entries) check.check(entry);
+  return conclude(file, entries.size(), check.problems(), out);
+}
+
+}  // namespace
+
+bool check_file(const std::string& file, const std::string& key_stash, std::ostream& out) {
+  std::string why;
+  cfg::KeyPtr key;
+  if (!key_stash.empty() && cfg::load_key_stash(key_stash.c_str(), key, why) != 0) {
+    out << why << "\n";
+    return false;
+  }
+  const CfgSession session = open_file(file, "", why);
+  std::vector<FileEntry> entries;
+  if (!session || !read_entries(session.get(), kSuffix, entries, why)) {
+    out << (session ? file + ": " : "") << why << "\n";
+    return false;
+  }
+  return check_entries(file, entries, key.get(), out);
+}
+
+}  // namespace orv::orvcfg

@@ -1,0 +1,176 @@
+#include "instance.h"
+
+#include <fcntl.h>
+#include <sys/file.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdlib>
+#include <memory>
+#include <vector>
+
+#include "cfg/secret.h"
+#include "cfg/text.h"
+#include "config/default_config.h"
+#include "new_file.h"
+#include "password.h"
+#include "template.h"
+
+namespace orv::orvcfg {
+
+namespace {
+
+constexpr cfg::SecretPlace kAdminPasswordPlace{"orv-slapdAdminPW", "CN=CONFIGURATION"};
+
+// Removes what was made, the latest first, unless everything succeeded.
+class Undo {
+ public:
+  Undo() = default;
+  Undo(const Undo&) = delete;
+  Undo& operator=(const Undo&) = delete;
+  ~Undo() {
+    for (auto made = made_.rbegin(); made != made_.rend(); ++made) {
+      made->is_directory ? ::rmdir(made->path.c_str()) : ::unlink(made->path.c_str());
+    }
+  }
+  void file(std::string path) { made_.push_back({std::move(path), false}); }
+  void directory(std::string path) { made_.push_back({std::move(path), true}); }
+  void keep_all() noexcept { made_.clear(); }
+
+ private:
+  struct Made {
+    std::string path;
+    bool is_directory;
+  };
+  std::vector<Made> made_;
+};
+
+// Wipes a clear password when it goes out of scope.
+struct ClearText : std::string {
+  ClearText() = default;
+  ClearText(const ClearText&) = delete;
+  ClearText& operator=(const ClearText&) = delete;
+  ~ClearText() { cfg::wipe(*this); }
+};
+
+bool exists(const std::string& path) {
+  struct stat status {};
+  return ::lstat(path.c_str(), &status) == 0;
+}
+
+bool refuse_if_others_may_write(const std::string& path, std::string& why) {
+  struct stat status {};
+  if (::stat(path.c_str(), &status) != 0) {
+    why = system_failure("cannot examine", path);
+    return false;
+  }
+  if (!S_ISDIR(status.st_mode)) {
+    why = path + " is not a directory; name another one";
+    return false;
+  }
+  if ((status.st_mode & (S_IWGRP | S_IWOTH)) != 0) {
+    why = "others may write in " + path + "; take that right away first (chmod go-w)";
+    return false;
+  }
+  return true;
+}
+
+bool make_directory(const std::string& path, Undo& undo, std::string& why) {
+  if (::mkdir(path.c_str(), 0700) == 0) {
+    undo.directory(path);
+    if (::chmod(path.c_str(), 0700) == 0) return true;
+  } else if (errno == EEXIST) {
+    return refuse_if_others_may_write(path, why);
+  }
+  why = system_failure("cannot make the directory", path);
+  return false;
+}
+
+bool resolve(const std::string& path, std::string& absolute, std::string& why) {
+  const std::unique_ptr<char, decltype(&std::free)> real(::realpath(path.c_str(), nullptr),
+                                                         &std::free);
+  if (!real) {
+    why = system_failure("cannot resolve", path);
+    return false;
+  }
+  absolute = real.get();
+  if (cfg::is_valid_utf8(absolute)) return true;
+  why = "the path " + absolute + " is not valid UTF-8, which the configuration file needs";
+  return false;
+}
+
+// Two runs in the same directory would remove each other's temporary files.
+bool lock_directory(const Descriptor& directory, const std::string& path, std::string& why) {
+  if (directory.valid() && ::flock(directory.get(), LOCK_EX | LOCK_NB) == 0) return true;
+  why = errno == EWOULDBLOCK ? "another orvcfg init is at work in " + path
+                             : system_failure("cannot lock", path);
+  return false;
+}
+
+bool provide_key(const Instance& instance, Undo& undo, cfg::KeyPtr& key, std::string& why) {
+  const std::string path = instance.key_stash();
+  if (!exists(path)) {
+    if (cfg::create_key_stash(path.c_str(), why) != 0) return false;
+    undo.file(path);
+  }
+  return cfg::load_key_stash(path.c_str(), key, why) == 0;
+}
+
+bool provide_password(const Instance& instance, Undo& undo, ClearText& password, std::string& why) {
+  const std::string path = instance.admin_password();
+  if (exists(path)) {
+    if (!read_private_file(path, 1024, password, why)) return false;
+    if (!password.empty()) return true;
+    why = path + " is empty; remove it and try again";
+    return false;
+  }
+  if (!generate_password(password, why) || !write_new_file(path, password, why)) return false;
+  undo.file(path);
+  return true;
+}
+
+bool write_config(const Instance& instance, const cfg::Key& key, const ClearText& password,
+                  Undo& undo, std::string& why) {
+  std::string sealed;
+  std::string text;
+  if (cfg::seal_secret(key, kAdminPasswordPlace, password, sealed) != 0 ||
+      !fill_template(kDefaultConfigText, {instance.directory, sealed}, text)) {
+    why = "not enough memory for the configuration of " + instance.directory;
+    return false;
+  }
+  // The other files must have survived a power failure before this one says that they are there.
+  if (!flush_directory(instance.directory, why) || !write_new_file(instance.config(), text, why)) {
+    return false;
+  }
+  undo.file(instance.config());
+  return flush_directory(instance.directory, why);
+}
+
+bool refuse_if_made(const Instance& instance, std::string& why) {
+  if (!exists(instance.config())) return true;
+  why = instance.config() + " exists already; remove it, or name another directory";
+  return false;
+}
+
+}  // namespace
+
+bool create_instance(const std::string& directory, Instance& instance, std::string& why) {
+  Undo undo;
+  if (!make_directory(directory, undo, why) || !resolve(directory, instance.directory, why)) {
+    return false;
+  }
+  const Descriptor lock(::open(instance.directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  cfg::KeyPtr key;
+  ClearText password;
+  if (!lock_directory(lock, instance.directory, why) || !refuse_if_made(instance, why) ||
+      !make_directory(instance.log_directory(), undo, why) ||
+      !provide_key(instance, undo, key, why) || !provide_password(instance, undo, password, why) ||
+      !write_config(instance, *key, password, undo, why)) {
+    return false;
+  }
+  undo.keep_all();
+  return true;
+}
+
+}  // namespace orv::orvcfg
