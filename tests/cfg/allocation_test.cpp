@@ -1,0 +1,191 @@
+// Every allocation of a session fails once: the answer is 90 or a null result, nothing leaks.
+//
+// The program's own allocation functions stand in front of the system's and count what is out.
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+#include <new>
+
+#include "cfg/dn.h"
+#include "cfg_fixture.h"
+
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+extern "C" void* __interceptor_malloc(std::size_t size);
+extern "C" void* __interceptor_realloc(void* memory, std::size_t size);
+#define ORV_SYSTEM_MALLOC __interceptor_malloc
+#define ORV_SYSTEM_REALLOC __interceptor_realloc
+#else
+extern "C" void* __libc_malloc(std::size_t size);
+extern "C" void* __libc_realloc(void* memory, std::size_t size);
+#define ORV_SYSTEM_MALLOC __libc_malloc
+#define ORV_SYSTEM_REALLOC __libc_realloc
+#endif
+
+// The operators below pair up, through malloc and free; seen one by one, inlined, they do not.
+#pragma GCC diagnostic ignored "-Wmismatched-new-delete"
+
+namespace {
+
+thread_local long fail_at = -1;  // counts down to the allocation that fails; negative: none does
+thread_local bool failed = false;
+
+bool fails_now() noexcept {
+  if (fail_at < 0) return false;
+  if (fail_at-- > 0) return false;
+  failed = true;
+  return true;
+}
+
+}  // namespace
+
+extern "C" void* malloc(std::size_t size) {
+  return fails_now() ? nullptr : ORV_SYSTEM_MALLOC(size);
+}
+extern "C" void* realloc(void* memory, std::size_t size) {
+  return fails_now() ? nullptr : ORV_SYSTEM_REALLOC(memory, size);
+}
+void* operator new(std::size_t size) {
+  if (void* const memory = std::malloc(size == 0 ? 1 : size)) return memory;
+  throw std::bad_alloc();
+}
+void* operator new(std::size_t size, const std::nothrow_t&) noexcept {
+  return std::malloc(size == 0 ? 1 : size);
+}
+void operator delete(void* memory) noexcept {
+  std::free(memory);
+}
+void operator delete(void* memory, std::size_t) noexcept {
+  std::free(memory);
+}
+
+namespace orv::cfg_test {
+namespace {
+
+class AllocationTest : public CfgTest {
+ protected:
+  // Runs `body` with its n-th allocation failing, for n from 0 until none fails. `body` returns
+  // whether the outcome is one that a failed allocation may have.
+  template <class Body>
+  static void fail_each(Body body) {
+    for (long n = 0; n < 100000; ++n) {
+      failed = false;
+      fail_at = n;
+      const bool good = body();
+      fail_at = -1;
+      ASSERT_TRUE(good) << "allocation " << n;
+      if (!failed) return;
+    }
+    FAIL() << "it never succeeded";
+  }
+
+  // A failure that a library below can do without leaves a success.
+  static bool is_memory_or_success(int rc) { return rc == 0 || (rc == 90 && failed); }
+};
+
+constexpr const char* kContent =
+    "dn:: Y249dG9w\ncn: top\ndescri\n ption:: w6Q=\nmember: cn=\xC3\xA4,o=x\n\n"
+    "dn: cn=a+ou=\\61,cn=top\ncn: a\nunknown: long enough to need a block of its own\n"
+    "unknown: an\n  d folded\n\n";
+
+TEST_F(AllocationTest, OpenSearchAndWalkSurviveEveryFailedAllocation) {
+  write_file(path_, kContent);
+  const char* const path = path_.c_str();
+  fail_each([path] {
+    _CFG* const session = cfg_init(nullptr, 0);
+    if (session == nullptr) return false;
+    bool good = true;
+    int rc = cfg_set_option(session, kCfgOptConfigFile, path);
+    if (rc == 0) rc = cfg_bind_s(session, nullptr, nullptr, 128);
+    _CFGMessage* chain = nullptr;
+    if (rc == 0) {
+      const char* names[] = {"cn", "*", nullptr};
+      rc = cfg_search_s(
+          session, "2.5.4.3=\\54op", 2,
+          "(|(member=cn=\xC3\xA4, o=x)(&(cn=*a*)(!(number=x)))(unknown:dn:caseExactMatch:=x))",
+          const_cast<char**>(names), 0, &chain);
+      good = (chain == nullptr) == (rc != 0);
+    }
+    good = good && (rc == 0 || (rc == 90 && failed));
+    for (_CFGMessage* record = cfg_first_entry(session, chain); good && record != nullptr;
+         record = cfg_next_entry(session, record)) {
+      char* const dn = cfg_get_dn(session, record);
+      good = (dn != nullptr) == (cfg_get_errno(session) == 0);
+      cfg_memfree(dn);
+      _CFGBer* cursor = nullptr;
+      char* name = cfg_first_attribute(session, record, &cursor);
+      good = good && (name == nullptr) == (cursor == nullptr) &&
+             (name != nullptr || cfg_get_errno(session) == 90);
+      while (good && name != nullptr) {
+        char** const values = cfg_get_values(session, record, name);
+        good = (values != nullptr) ? cfg_get_errno(session) == 0 : cfg_get_errno(session) == 90;
+        cfg_value_free(values);
+        cfg_memfree(name);
+        name = cfg_next_attribute(session, record, cursor);
+        good = good &&
+               (name != nullptr || cfg_get_errno(session) == 0 || cfg_get_errno(session) == 90);
+      }
+      cfg_ber_free(cursor);
+    }
+    if (rc != 0 && cfg_dump_exception(session) == nullptr) good = false;
+    return good && cfg_unbind(session) == 0;
+  });
+}
+
+TEST_F(AllocationTest, ADamagedFileIsRefusedOrOutOfMemory) {
+  write_file(path_, "dn: cn=top\ncn: top\n\ndn: cn=a,cn=b\ncn: a\n");
+  const char* const path = path_.c_str();
+  fail_each([path] {
+    _CFG* const session = cfg_init(nullptr, 0);
+    bool good = true;
+    if (cfg_set_option(session, kCfgOptConfigFile, path) == 0) {
+      const int rc = cfg_bind_s(session, nullptr, nullptr, 128);
+      good = (rc == 1 || (rc == 90 && failed)) && cfg_dump_exception(session)[0] != '\0';
+    }
+    cfg_unbind(session);
+    return good;
+  });
+}
+
+TEST_F(AllocationTest, DnFunctionsAnswerNinety) {
+  for (const char* dn : {"cn=plain,o=x", "ou=\xC3\xA4+cn=\\61,2.5.4.3=#0c0161"}) {
+    fail_each([dn] {
+      std::string normal;
+      return is_memory_or_success(cfg::normalize_dn(dn, normal));
+    });
+    fail_each([dn] {
+      std::string light;
+      return is_memory_or_success(cfg::normalize_dn_light(dn, light));
+    });
+    fail_each([dn] {
+      std::string canonical;
+      return is_memory_or_success(cfg::canonicalize_dn_types(dn, canonical));
+    });
+    fail_each([dn] {
+      cfg::Dn parsed;
+      return is_memory_or_success(cfg::parse_dn(dn, parsed));
+    });
+  }
+}
+
+TEST_F(AllocationTest, WithoutMemoryTheReservedHandleAnswersNinety) {
+  failed = false;
+  fail_at = 0;
+  _CFG* const session = cfg_init(nullptr, 0);
+  fail_at = -1;
+  ASSERT_TRUE(failed);
+  ASSERT_NE(session, nullptr);
+  const char* value = nullptr;
+  _CFGMessage* chain = reinterpret_cast<_CFGMessage*>(&chain);
+  EXPECT_EQ(cfg_set_option(session, kCfgOptConfigFile, "x"), 90);
+  EXPECT_EQ(cfg_get_option(session, kCfgOptConfigFile, &value), 90);
+  EXPECT_STREQ(value, "");
+  EXPECT_EQ(cfg_bind_s(session, nullptr, nullptr, 128), 90);
+  EXPECT_EQ(cfg_get_errno(session), 90);
+  EXPECT_STREQ(cfg_dump_exception(session), "out of memory");
+  EXPECT_EQ(cfg_search_s(session, "", 0, nullptr, nullptr, 0, &chain), 90);
+  EXPECT_EQ(chain, nullptr);
+  EXPECT_EQ(cfg_unbind(session), 0);
+}
+
+}  // namespace
+}  // namespace orv::cfg_test

@@ -1,0 +1,31 @@
+"""Where the programs under test are, and how long they may take."""
+
+import os
+import pathlib
+
+SOURCE_DIR = pathlib.Path(__file__).resolve().parents[3]
+
+
+def bin_dir():
+    """The folder with orvd and orvcfg, from ORV_BIN_DIR."""
+    given = os.environ.get("ORV_BIN_DIR")
+    if not given:
+        raise RuntimeError("ORV_BIN_DIR must name the folder with orvd and orvcfg")
+    return pathlib.Path(given).resolve()
+
+
+def orvd():
+    return bin_dir() / "orvd"
+
+
+def orvcfg():
+    return bin_dir() / "orvcfg"
+
+
+def sanitized():
+    return bool(os.environ.get("ORV_SANITIZE"))
+
+
+# Seconds after which something that should have happened is a failure. Nothing waits this long
+# unless it fails.
+DEADLINE = 60.0 if sanitized() else 20.0

@@ -1,0 +1,305 @@
+"""The command line tool: what each command makes, prints, refuses and leaves behind."""
+
+import os
+import re
+import resource
+import signal
+import stat
+import subprocess
+import tempfile
+import unittest
+
+PROGRAM = os.path.join(os.environ["ORV_BIN_DIR"], "orvcfg")
+SOURCE = os.path.dirname(os.path.dirname(os.path.dirname(os.path.abspath(__file__))))
+FILES = ["admin.pw", "config.ldif", "key.stash"]
+
+
+class Tool(unittest.TestCase):
+    """Runs the tool in a temporary folder."""
+
+    def setUp(self):
+        folder = tempfile.TemporaryDirectory()
+        self.addCleanup(folder.cleanup)
+        self.top = os.path.realpath(folder.name)
+
+    def path(self, *names):
+        return os.path.join(self.top, *names)
+
+    def run_tool(self, *arguments, **options):
+        return subprocess.run([PROGRAM, *arguments], cwd=self.top, capture_output=True, text=True,
+                              stdin=subprocess.DEVNULL, timeout=60, **options)
+
+    def succeed(self, *arguments, **options):
+        result = self.run_tool(*arguments, **options)
+        self.assertEqual((result.returncode, result.stderr), (0, ""))
+        return result.stdout
+
+    def refuse(self, *arguments, status=1, **options):
+        result = self.run_tool(*arguments, **options)
+        self.assertEqual(result.returncode, status, result.stderr)
+        return result.stdout + result.stderr
+
+    def read(self, *names):
+        with open(self.path(*names), encoding="utf-8") as file:
+            return file.read()
+
+    def write(self, text, *names):
+        with open(self.path(*names), "w", encoding="utf-8") as file:
+            file.write(text)
+
+    def mode(self, *names):
+        return stat.S_IMODE(os.stat(self.path(*names)).st_mode)
+
+
+class Init(Tool):
+    def test_makes_private_files_whatever_the_umask(self):
+        for number, umask in enumerate((0, 0o022, 0o777)):
+            name = f"i{number}"
+            self.succeed("init", "--dir", name, umask=umask)
+            self.assertEqual(sorted(os.listdir(self.path(name))), [*FILES, "log"])
+            self.assertEqual([self.mode(name, file) for file in FILES], [0o600] * 3)
+            self.assertEqual((self.mode(name), self.mode(name, "log")), (0o700, 0o700))
+
+    def test_what_it_makes_has_nothing_wrong(self):
+        self.succeed("init", "--dir", "i")
+        text = self.succeed("check", "i/config.ldif", "--key-stash", "i/key.stash")
+        self.assertIn("nothing wrong", text)
+
+    def test_keeps_the_template_but_for_the_two_words(self):
+        self.succeed("init", "--dir", "i")
+        template = self.succeed("default").splitlines()
+        made = self.read("i", "config.ldif").splitlines()
+        differing = [new for old, new in zip(template, made, strict=True) if old != new]
+        self.assertEqual([line.split(":")[0] for line in differing],
+                         ["orv-slapdAdminPW", "orv-slapdLog", "orv-slapdLog"])
+        self.assertIn(f"orv-slapdLog: {self.path('i', 'log', 'access.log')}", differing)
+
+    def test_passwords_meet_the_default_policy_and_differ(self):
+        passwords = set()
+        for number in range(20):
+            self.succeed("init", "--dir", f"i{number}")
+            password = self.read(f"i{number}", "admin.pw")
+            self.assertRegex(password, r"\A[A-Za-z0-9_-]{28}\Z")
+            self.assertRegex(password, r"[A-Z].*[A-Z]")
+            self.assertRegex(password, r"[a-z].*[a-z]")
+            self.assertRegex(password, r"[0-9_-].*[0-9_-]")
+            self.assertTrue(all(password.count(c) <= 2 for c in password))
+            passwords.add(password)
+        self.assertEqual(len(passwords), 20)
+
+    def test_the_password_is_not_in_the_configuration_nor_in_the_output(self):
+        output = self.succeed("init", "--dir", "i")
+        password = self.read("i", "admin.pw")
+        self.assertNotIn(password, output + self.read("i", "config.ldif"))
+
+    def test_says_how_to_talk_to_the_server(self):
+        text = self.succeed("init", "--dir", "var", "--port", "4711")
+        self.assertIn("ldapsearch -x -H ldap://127.0.0.1:4711 -D cn=root -y var/admin.pw "
+                      "-b cn=configuration\n", text)
+        self.assertIn("'with blank/admin.pw'", self.succeed("init", "--dir", "with blank"))
+
+    def test_an_instance_is_never_made_twice(self):
+        self.succeed("init", "--dir", "i")
+        before = [self.read("i", file) for file in FILES]
+        self.assertIn("exists already", self.refuse("init", "--dir", "i"))
+        self.assertEqual([self.read("i", file) for file in FILES], before)
+
+    def test_goes_on_where_an_interrupted_run_stopped(self):
+        self.succeed("init", "--dir", "i")
+        kept = [self.read("i", file) for file in ("admin.pw", "key.stash")]
+        os.unlink(self.path("i", "config.ldif"))
+        self.write("half", "i", "config.ldif.new")
+        self.succeed("init", "--dir", "i")
+        self.assertEqual([self.read("i", file) for file in ("admin.pw", "key.stash")], kept)
+        self.assertEqual(sorted(os.listdir(self.path("i"))), [*FILES, "log"])
+        self.succeed("check", "i/config.ldif", "--key-stash", "i/key.stash")
+
+    def test_a_failed_write_leaves_nothing(self):
+        # Room for the key and the password, not for the configuration; then for none of them.
+        for limit in (1000, 10):
+            def prepare(limit=limit):
+                signal.signal(signal.SIGXFSZ, signal.SIG_IGN)
+                resource.setrlimit(resource.RLIMIT_FSIZE, (limit, limit))
+            self.assertIn(self.path("i"), self.refuse("init", "--dir", "i", preexec_fn=prepare))
+            self.assertFalse(os.path.exists(self.path("i")))
+
+    def test_a_failure_leaves_what_was_there_before(self):
+        os.mkdir(self.path("i"), 0o700)
+        self.write("no key", "i", "key.stash")
+        os.chmod(self.path("i", "key.stash"), 0o600)
+        self.assertIn("key.stash", self.refuse("init", "--dir", "i"))
+        self.assertEqual(os.listdir(self.path("i")), ["key.stash"])
+
+    def test_a_directory_that_others_may_write_is_refused(self):
+        os.mkdir(self.path("i"))
+        os.chmod(self.path("i"), 0o770)
+        self.assertIn("chmod go-w", self.refuse("init", "--dir", "i"))
+
+    def test_links_in_place_of_files_are_not_followed(self):
+        self.succeed("init", "--dir", "i")
+        os.unlink(self.path("i", "config.ldif"))
+        os.unlink(self.path("i", "admin.pw"))
+        self.write("secret of somebody else", "target")
+        os.symlink(self.path("target"), self.path("i", "admin.pw"))
+        self.refuse("init", "--dir", "i")
+        os.unlink(self.path("i", "admin.pw"))
+        os.symlink(self.path("target"), self.path("i", "config.ldif"))
+        self.assertIn("exists already", self.refuse("init", "--dir", "i"))
+        self.assertEqual(self.read("target"), "secret of somebody else")
+
+    def test_places_that_cannot_be_are_named(self):
+        self.assertIn("no/such", self.refuse("init", "--dir", "no/such"))
+        self.write("", "file")
+        self.assertIn("not a directory", self.refuse("init", "--dir", "file"))
+
+    def test_paths_outside_ascii_are_written_so_that_they_read_back(self):
+        self.succeed("init", "--dir", "blänk and ü")
+        text = self.succeed("show", "blänk and ü/config.ldif", "cn=access,cn=log management,"
+                            "cn=configuration")
+        self.assertIn("orv-slapdLog:: ", text)
+        self.succeed("check", "blänk and ü/config.ldif")
+
+    def test_a_path_that_is_not_utf8_is_refused(self):
+        directory = os.fsencode(self.top) + b"/\xff"
+        result = subprocess.run([PROGRAM, "init", "--dir", directory], capture_output=True)
+        self.assertEqual(result.returncode, 1)
+        self.assertIn(b"UTF-8", result.stderr)
+        self.assertEqual(os.listdir(self.top), [])
+
+    def test_of_two_at_once_one_makes_the_instance(self):
+        for number in range(10):
+            runs = [subprocess.Popen([PROGRAM, "init", "--dir", f"i{number}"], cwd=self.top,
+                                     stdout=subprocess.DEVNULL, stderr=subprocess.DEVNULL)
+                    for _ in range(4)]
+            self.assertEqual(sorted(run.wait(timeout=60) for run in runs), [0, 1, 1, 1])
+            self.succeed("check", f"i{number}/config.ldif", "--key-stash", f"i{number}/key.stash")
+
+
+class Check(Tool):
+    def setUp(self):
+        super().setUp()
+        self.succeed("init", "--dir", "i")
+        self.config = self.read("i", "config.ldif")
+
+    def found(self, old, new, *arguments):
+        """What check says after one edit."""
+        self.assertIn(old, self.config)
+        self.write(self.config.replace(old, new, 1), "i", "config.ldif")
+        return self.refuse("check", "i/config.ldif", *arguments)
+
+    def added(self, entry, *arguments):
+        self.write(self.config + "\n" + entry, "i", "config.ldif")
+        return self.refuse("check", "i/config.ldif", *arguments)
+
+    def test_names_file_and_line_of_what_cannot_be_read(self):
+        text = self.found("cn: Configuration\n", "cn Configuration\n")
+        line = self.config.splitlines().index("cn: Configuration") + 1
+        self.assertRegex(text, rf"i/config\.ldif\D+{line}\b")
+
+    def test_a_missing_file_is_named(self):
+        self.assertIn("nowhere", self.refuse("check", "nowhere"))
+
+    def test_finds_what_does_not_fit_the_schema(self):
+        for old, new, text in (
+                ("objectClass: container\n", "objectClass: box\n", "unknown object class box"),
+                ("orv-slapdAdminDN: cn=root\n", "", "missing attribute orv-slapdAdminDN"),
+                ("orv-slapdPort: 3389\n", "orv-slapdPort: 1\norv-slapdPort: 2\n",
+                 "orv-slapdPort has 2 values"),
+                ("orv-slapdPort: 3389\n", "orv-slapdPart: 3389\n",
+                 "unknown attribute type orv-slapdPart"),
+                ("cn: Digest\n", "cn: Digest\norv-slapdPort: 1\n", "orv-slapdPort is not allowed"),
+                ("objectClass: orv-slapdTop\n",
+                 "objectClass: orv-slapdTop\nobjectClass: container\n",
+                 "more than one structural object class")):
+            self.assertIn(text, self.found(old, new))
+
+    def test_a_class_by_its_number_is_found(self):
+        text = self.found("objectClass: container\n",
+                          "objectClass: 2.25.83817390626969804497818767862655265745.2.1\n")
+        self.assertIn("must be written as container", text)
+
+    def member(self, name, password):
+        return (f"dn: cn=m,CN=ADMINGROUP,CN=CONFIGURATION\nobjectClass: top\n"
+                f"objectClass: orv-slapdConfigEntry\nobjectClass: orv-slapdAdminGroupMember\n"
+                f"cn: m\norv-slapdAdminDN: {name}\norv-slapdAdminPW: {password}\n"
+                f"orv-slapdAdminRole: AuditAdmin\n")
+
+    def test_finds_identities_that_cannot_bind(self):
+        self.assertIn("claimed by CN=CONFIGURATION too", self.added(self.member("CN = Root", "x")))
+        self.assertIn("lies inside", self.added(self.member("cn=m,cn=configuration", "x")))
+
+    def test_finds_a_password_that_was_copied_from_another_entry(self):
+        sealed = re.search(r"^orv-slapdAdminPW: (.*)$", self.config, re.MULTILINE).group(1)
+        text = self.added(self.member("cn=m", sealed), "--key-stash", "i/key.stash")
+        self.assertIn("sealed for another entry", text)
+        self.assertNotIn(sealed, text)
+
+    def test_finds_a_password_that_the_key_does_not_open(self):
+        self.succeed("init", "--dir", "other")
+        text = self.refuse("check", "i/config.ldif", "--key-stash", "other/key.stash")
+        self.assertIn("cannot be opened", text)
+
+    def test_a_key_that_others_may_read_is_refused(self):
+        os.chmod(self.path("i", "key.stash"), 0o644)
+        self.assertIn("key.stash",
+                      self.refuse("check", "i/config.ldif", "--key-stash", "i/key.stash"))
+
+    def test_changes_nothing(self):
+        self.succeed("check", "i/config.ldif", "--key-stash", "i/key.stash")
+        self.assertEqual(self.read("i", "config.ldif"), self.config)
+        self.assertEqual(sorted(os.listdir(self.path("i"))), [*FILES, "log"])
+
+
+class Show(Tool):
+    def setUp(self):
+        super().setUp()
+        self.succeed("init", "--dir", "i")
+
+    def test_prints_every_entry_and_no_password(self):
+        text = self.succeed("show", "i/config.ldif")
+        config = self.read("i", "config.ldif")
+        shown = re.findall(r"^dn: .*$", text.replace("\n ", ""), re.MULTILINE)
+        self.assertEqual(shown, re.findall(r"^dn: .*$", config, re.MULTILINE))
+        self.assertNotIn("{AES256}", text)
+        self.assertIn("# orv-slapdAdminPW is set", text)
+
+    def test_prints_a_subtree_in_any_spelling_of_its_name(self):
+        text = self.succeed("show", "i/config.ldif", "cn = Log  Management, cn=configuration")
+        self.assertEqual(len(re.findall(r"^dn: ", text, re.MULTILINE)), 5)
+
+    def test_names_what_it_does_not_find(self):
+        self.assertIn("cn=x", self.refuse("show", "i/config.ldif", "cn=x"))
+        self.assertIn("not a DN", self.refuse("show", "i/config.ldif", "no dn"))
+
+    def test_folds_long_lines(self):
+        config = self.read("i", "config.ldif")
+        self.write(config.replace("cn: Digest\n", "cn: Digest\ndescription: " + "x" * 300 + "\n"),
+                   "i", "config.ldif")
+        text = self.succeed("show", "i/config.ldif", "cn=digest,cn=configuration")
+        self.assertTrue(all(len(line) <= 78 for line in text.splitlines()))
+        self.assertIn("description: " + "x" * 300, text.replace("\n ", ""))
+
+
+class CommandLine(Tool):
+    def test_default_is_the_file_in_the_repository(self):
+        with open(os.path.join(SOURCE, "config", "default.ldif"), encoding="utf-8") as file:
+            self.assertEqual(self.succeed("default"), file.read())
+
+    def test_wrong_arguments_are_a_usage_error(self):
+        for arguments in ((), ("init",), ("init", "--dir", "i", "--port", "65536"), ("nonsense",),
+                          ("check",), ("show", "a", "b", "c")):
+            self.assertIn("--help", self.refuse(*arguments, status=2))
+        self.assertEqual(os.listdir(self.top), [])
+
+    def test_help_is_a_success(self):
+        self.assertIn("init", self.succeed("--help"))
+
+    def test_output_that_cannot_be_written_is_a_failure(self):
+        with open("/dev/full", "w", encoding="utf-8") as full:
+            result = subprocess.run([PROGRAM, "default"], stdout=full, stderr=subprocess.PIPE)
+        self.assertEqual(result.returncode, 1)
+        self.assertIn(b"standard output", result.stderr)
+
+
+if __name__ == "__main__":
+    unittest.main()

@@ -1,0 +1,545 @@
+// Who may bind, and what is granted: read from real files, proven with real passwords.
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <filesystem>
+#include <fstream>
+#include <thread>
+
+#include "auth/identities.h"
+#include "cfg/dn.h"
+#include "slapi/codepage.h"
+#include "slapi/connection.h"
+#include "slapi/schema.h"
+
+namespace orv::server {
+namespace {
+
+using namespace std::string_literals;  // NOLINT: texts with NUL octets
+using ::testing::Contains;
+using ::testing::Each;
+using ::testing::ElementsAre;
+using ::testing::HasSubstr;
+using ::testing::IsEmpty;
+using ::testing::Not;
+
+class SchemaRegistration : public ::testing::Environment {
+ public:
+  void SetUp() override {
+    ASSERT_EQ(cfg::register_attribute_types(builtin_schema().attribute_table()), 0);
+  }
+};
+const auto* const kRegistration = ::testing::AddGlobalTestEnvironment(new SchemaRegistration);
+
+const std::string kTop =
+    "dn: cn=configuration\n"
+    "objectClass: orv-slapdTop\n"
+    "cn: configuration\n"
+    "orv-slapdAdminDN: cn=root\n"
+    "orv-slapdAdminPW: rootpw\n";
+const std::string kGroup =
+    "\ndn: cn=AdminGroup,cn=configuration\n"
+    "objectClass: container\n"
+    "cn: AdminGroup\n";
+
+std::string member(const std::string& name, const std::string& dn, const std::string& password,
+                   const std::string& more = "orv-slapdAdminRole: AuditAdmin\n") {
+  return "\ndn: cn=" + name + ",cn=AdminGroup,cn=configuration\n" +
+         "objectClass: orv-slapdAdminGroupMember\ncn: " + name + "\norv-slapdAdminDN: " + dn +
+         "\norv-slapdAdminPW: " + password + "\n" + more;
+}
+
+std::string supplier(const std::string& name, const std::string& object_class,
+                     const std::string& dn, const std::string& password) {
+  return "\ndn: cn=" + name + ",cn=configuration\nobjectClass: " + object_class + "\ncn: " + name +
+         "\norv-slapdMasterDN: " + dn + "\norv-slapdMasterPW: " + password + "\n";
+}
+
+class IdentitiesOfAFile : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    std::string pattern = ::testing::TempDir() + "/orv-auth-XXXXXX";
+    ASSERT_NE(mkdtemp(pattern.data()), nullptr);
+    folder_ = pattern;
+  }
+  void TearDown() override { std::filesystem::remove_all(folder_); }
+
+  std::string config() const { return folder_ + "/config.ldif"; }
+  std::string stash() const { return folder_ + "/key.stash"; }
+
+  void write(const std::string& text) { std::ofstream(config(), std::ios::trunc) << text; }
+
+  // As every writer of ours does it: a new file put in the old one's place.
+  void replace(const std::string& text) {
+    std::ofstream(config() + ".new", std::ios::trunc) << text;
+    std::filesystem::rename(config() + ".new", config());
+  }
+
+  std::shared_ptr<const Identities> read(const std::string& text) {
+    write(text);
+    error_.clear();
+    warnings_.clear();
+    return Identities::read(config().c_str(), use_stash_ ? stash().c_str() : "", error_, warnings_);
+  }
+
+  cfg::KeyPtr make_key() {
+    std::string why;
+    EXPECT_EQ(cfg::create_key_stash(stash().c_str(), why), 0) << why;
+    use_stash_ = true;
+    cfg::KeyPtr key;
+    EXPECT_EQ(cfg::load_key_stash(stash().c_str(), key, why), 0) << why;
+    return key;
+  }
+
+  static std::string sealed(const cfg::Key& key, const char* type, const char* entry_dn,
+                            const char* clear) {
+    std::string stored;
+    EXPECT_EQ(cfg::seal_secret(key, {type, entry_dn}, clear, stored), 0);
+    return stored;
+  }
+
+  std::string folder_;
+  std::string error_;
+  std::vector<std::string> warnings_;
+  bool use_stash_ = false;
+};
+
+void expect_identity(const Identity* identity, const char* bound_dn, unsigned flags, unsigned roles,
+                     const char* entry_dn) {
+  ASSERT_NE(identity, nullptr);
+  EXPECT_EQ(identity->bound_dn, bound_dn);
+  EXPECT_EQ(identity->authority, flags);
+  EXPECT_EQ(identity->roles, roles);
+  EXPECT_EQ(identity->entry_dn, entry_dn);
+}
+
+// ---- Roles
+
+TEST(RoleBits, EachRoleHasItsBits) {
+  EXPECT_EQ(role_bits({"AuditAdmin"}), 0x02U);
+  EXPECT_EQ(role_bits({"ReplicationAdmin"}), 0x0CU);
+  EXPECT_EQ(role_bits({"SchemaAdmin"}), 0x10U);
+  EXPECT_EQ(role_bits({"ServerConfigGroupMember"}), 0x20U);
+  EXPECT_EQ(role_bits({"auditadmin", "SCHEMAADMIN"}), 0x12U);
+  EXPECT_EQ(role_bits({}), 0U);
+  EXPECT_EQ(role_bits({"Wizard", ""}), 0U);
+}
+
+TEST(RoleBits, OtherRolesConcernNoPartOfTheConfiguration) {
+  unsigned seen = 0;
+  for (const char* name : {"DirDataAdmin", "PasswordAdmin", "ServerStartStopAdmin"}) {
+    const unsigned bits = role_bits({name});
+    EXPECT_NE(bits, 0U) << name;
+    EXPECT_EQ(bits & role::any_configuration, 0U) << name;
+    EXPECT_EQ(bits & 1U, 0U) << name;
+    EXPECT_EQ(bits & seen, 0U) << name;
+    seen |= bits;
+  }
+}
+
+TEST(RoleBits, NoAdminTakesAllAway) {
+  EXPECT_EQ(role_bits({"AuditAdmin", "noadmin"}), 0U);
+  EXPECT_EQ(role_bits({"NoAdmin", "SchemaAdmin"}), 0U);
+}
+
+// ---- Kinds of identities
+
+TEST_F(IdentitiesOfAFile, PrimaryAdministrator) {
+  const auto identities = read(kTop);
+  ASSERT_TRUE(identities) << error_;
+  EXPECT_THAT(warnings_, IsEmpty());
+  expect_identity(identities->authenticate("cn=root", "rootpw"), "CN=ROOT", 0x0C, 0,
+                  "CN=CONFIGURATION");
+}
+
+TEST_F(IdentitiesOfAFile, NameIsFoundInEverySpelling) {
+  const auto identities = read(kTop);
+  ASSERT_TRUE(identities) << error_;
+  for (const char* name :
+       {"CN=Root", "commonName=root", "2.5.4.3= root", "cn=\\72oot", "cn=#0404726F6F74"}) {
+    EXPECT_NE(identities->authenticate(name, "rootpw"), nullptr) << name;
+  }
+}
+
+TEST_F(IdentitiesOfAFile, GroupMemberWithRoles) {
+  const auto identities =
+      read(kTop + kGroup +
+           member("m", "cn=member,o=x", "mpw",
+                  "orv-slapdAdminRole: auditadmin\norv-slapdAdminRole: ServerConfigGroupMember\n"));
+  ASSERT_TRUE(identities) << error_;
+  expect_identity(identities->authenticate("cn=member,o=x", "mpw"), "CN=MEMBER,O=X", 0x14, 0x22,
+                  "CN=M,CN=ADMINGROUP,CN=CONFIGURATION");
+}
+
+TEST_F(IdentitiesOfAFile, MemberWithNoAdminBindsWithoutRoles) {
+  const auto identities = read(
+      kTop + kGroup +
+      member("m", "cn=m", "mpw", "orv-slapdAdminRole: NoAdmin\norv-slapdAdminRole: AuditAdmin\n"));
+  ASSERT_TRUE(identities) << error_;
+  expect_identity(identities->authenticate("cn=m", "mpw"), "CN=M", 0x14, 0,
+                  "CN=M,CN=ADMINGROUP,CN=CONFIGURATION");
+}
+
+TEST_F(IdentitiesOfAFile, MembersFarBelowTheGroupCount) {
+  const std::string below =
+      "\ndn: cn=inner,cn=m,cn=AdminGroup,cn=configuration\n"
+      "objectClass: orv-slapdAdminGroupMember\ncn: inner\norv-slapdAdminDN: cn=inner\n"
+      "orv-slapdAdminPW: ipw\norv-slapdAdminRole: AuditAdmin\n";
+  const auto identities = read(kTop + kGroup + member("m", "cn=m", "mpw") + below);
+  ASSERT_TRUE(identities) << error_;
+  EXPECT_NE(identities->authenticate("cn=inner", "ipw"), nullptr);
+}
+
+TEST_F(IdentitiesOfAFile, MemberClassElsewhereGrantsNothing) {
+  const auto identities =
+      read(kTop + std::string("\ndn: cn=fake,cn=configuration\nobjectClass: "
+                              "orv-slapdAdminGroupMember\ncn: fake\norv-slapdAdminDN: cn=fake\n"
+                              "orv-slapdAdminPW: pw\norv-slapdAdminRole: AuditAdmin\n"));
+  ASSERT_TRUE(identities) << error_;
+  EXPECT_EQ(identities->authenticate("cn=fake", "pw"), nullptr);
+}
+
+TEST_F(IdentitiesOfAFile, ContainerOfTheGroupIsNobodyWhateverItsClass) {
+  const auto identities =
+      read(kTop + std::string("\ndn: cn=AdminGroup,cn=configuration\nobjectClass: "
+                              "orv-slapdAdminGroupMember\ncn: AdminGroup\norv-slapdAdminDN: cn=g\n"
+                              "orv-slapdAdminPW: pw\n"));
+  ASSERT_TRUE(identities) << error_;
+  EXPECT_EQ(identities->authenticate("cn=g", "pw"), nullptr);
+}
+
+TEST_F(IdentitiesOfAFile, EntryOfAnotherClassInTheGroupGrantsNothing) {
+  const auto identities =
+      read(kTop + kGroup +
+           "\ndn: cn=x,cn=AdminGroup,cn=configuration\nobjectClass: orv-slapdConfigEntry\ncn: x\n"
+           "orv-slapdAdminDN: cn=x\norv-slapdAdminPW: pw\n");
+  ASSERT_TRUE(identities) << error_;
+  EXPECT_EQ(identities->authenticate("cn=x", "pw"), nullptr);
+}
+
+TEST_F(IdentitiesOfAFile, SuppliersOfServerAndSuffix) {
+  const auto identities =
+      read(kTop + supplier("Master Server", "orv-slapdReplication", "cn=master", "masterpw") +
+           supplier("s1", "orv-slapdSupplier", "cn=supplier", "supplierpw"));
+  ASSERT_TRUE(identities) << error_;
+  expect_identity(identities->authenticate("cn=master", "masterpw"), "CN=MASTER", 0x01, 0,
+                  "CN=MASTER SERVER,CN=CONFIGURATION");
+  expect_identity(identities->authenticate("cn=supplier", "supplierpw"), "CN=SUPPLIER", 0x02, 0,
+                  "CN=S1,CN=CONFIGURATION");
+}
+
+TEST_F(IdentitiesOfAFile, ReplicationClassElsewhereGrantsNothing) {
+  const auto identities = read(kTop + supplier("x", "orv-slapdReplication", "cn=x", "pw"));
+  ASSERT_TRUE(identities) << error_;
+  EXPECT_EQ(identities->authenticate("cn=x", "pw"), nullptr);
+}
+
+TEST_F(IdentitiesOfAFile, MasterServerOfSupplierClassIsOneIdentity) {
+  const auto identities =
+      read(kTop + supplier("Master Server", "orv-slapdSupplier", "cn=master", "pw"));
+  ASSERT_TRUE(identities) << error_;
+  EXPECT_THAT(warnings_, IsEmpty());
+  expect_identity(identities->authenticate("cn=master", "pw"), "CN=MASTER", 0x01, 0,
+                  "CN=MASTER SERVER,CN=CONFIGURATION");
+}
+
+// ---- The group's switch
+
+TEST_F(IdentitiesOfAFile, GroupSwitchDecidesWhetherMembersBind) {
+  const struct {
+    const char* line;
+    bool binds;
+  } kCases[] = {{"", true},
+                {"orv-slapdAdminGroupEnabled: TRUE\n", true},
+                {"orv-slapdAdminGroupEnabled: true\n", true},
+                {"orv-slapdAdminGroupEnabled: FALSE\n", false},
+                {"orv-slapdAdminGroupEnabled: yes\n", false}};
+  for (const auto& c : kCases) {
+    const auto identities = read(kTop + c.line + kGroup + member("m", "cn=m", "mpw"));
+    ASSERT_TRUE(identities) << error_;
+    EXPECT_EQ(identities->authenticate("cn=m", "mpw") != nullptr, c.binds) << c.line;
+    EXPECT_NE(identities->authenticate("cn=root", "rootpw"), nullptr) << c.line;
+  }
+}
+
+// ---- Who is nobody
+
+TEST_F(IdentitiesOfAFile, WrongPasswordsAndNamesProveNothing) {
+  const auto identities = read(kTop);
+  ASSERT_TRUE(identities) << error_;
+  EXPECT_EQ(identities->authenticate("cn=root", "wrong"), nullptr);
+  EXPECT_EQ(identities->authenticate("cn=root", "ROOTPW"), nullptr);
+  EXPECT_EQ(identities->authenticate("cn=root", "rootpw "), nullptr);
+  EXPECT_EQ(identities->authenticate("cn=root", "rootpw\0"s), nullptr);
+  EXPECT_EQ(identities->authenticate("cn=nobody", "rootpw"), nullptr);
+  EXPECT_EQ(identities->authenticate("not a dn", "rootpw"), nullptr);
+  EXPECT_EQ(identities->authenticate("cn=\xFF", "rootpw"), nullptr);
+  EXPECT_EQ(identities->authenticate("", "rootpw"), nullptr);
+}
+
+TEST_F(IdentitiesOfAFile, EmptyPasswordNeverMatches) {
+  const auto identities = read(
+      "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\n"
+      "orv-slapdAdminDN: cn=root\norv-slapdAdminPW:\n" +
+      supplier("s", "orv-slapdSupplier", "cn=s", "pw"));
+  if (identities) {
+    EXPECT_EQ(identities->authenticate("cn=root", ""), nullptr);
+    EXPECT_EQ(identities->authenticate("cn=s", ""), nullptr);
+  }
+  const auto usual = read(kTop);
+  ASSERT_TRUE(usual) << error_;
+  EXPECT_EQ(usual->authenticate("cn=root", ""), nullptr);
+}
+
+TEST_F(IdentitiesOfAFile, IdentityWithoutPasswordCannotBind) {
+  const auto identities = read(
+      "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\norv-slapdAdminDN: "
+      "cn=root\n");
+  ASSERT_TRUE(identities) << error_;
+  EXPECT_EQ(identities->authenticate("cn=root", "x"), nullptr);
+  EXPECT_EQ(identities->authenticate("cn=root", ""), nullptr);
+}
+
+TEST_F(IdentitiesOfAFile, NamesInsideTheConfigurationAreNobodysWithAWarning) {
+  const auto identities =
+      read(kTop + kGroup + member("m", "cn=m,cn=AdminGroup,cn=Configuration", "mpw") +
+           supplier("s", "orv-slapdSupplier", "cn=configuration", "spw"));
+  ASSERT_TRUE(identities) << error_;
+  EXPECT_EQ(identities->authenticate("cn=m,cn=admingroup,cn=configuration", "mpw"), nullptr);
+  EXPECT_EQ(identities->authenticate("cn=configuration", "spw"), nullptr);
+  EXPECT_THAT(warnings_,
+              ElementsAre(HasSubstr("CN=M,CN=ADMINGROUP,CN=CONFIGURATION: orv-slapdAdminDN"),
+                          HasSubstr("CN=S,CN=CONFIGURATION: orv-slapdMasterDN")));
+}
+
+TEST_F(IdentitiesOfAFile, NameThatTwoEntriesClaimBindsAsNeither) {
+  const auto identities =
+      read(kTop + kGroup + member("a", "cn=Twin,o=x", "apw") + member("b", "cn=twin, o=X", "bpw") +
+           member("c", "CN=TWIN,O=X", "cpw") + member("d", "cn=single", "dpw"));
+  ASSERT_TRUE(identities) << error_;
+  for (const char* password : {"apw", "bpw", "cpw"}) {
+    EXPECT_EQ(identities->authenticate("cn=twin,o=x", password), nullptr);
+  }
+  EXPECT_NE(identities->authenticate("cn=single", "dpw"), nullptr);
+  EXPECT_EQ(warnings_.size(), 2U);
+  EXPECT_THAT(warnings_, Contains(HasSubstr("another entry has the same bind DN")));
+}
+
+TEST_F(IdentitiesOfAFile, ClaimOnThePrimaryAdministratorsNameShutsBothOut) {
+  const auto identities = read(kTop + kGroup + member("m", "CN=ROOT", "mpw"));
+  ASSERT_TRUE(identities) << error_;
+  EXPECT_EQ(identities->authenticate("cn=root", "rootpw"), nullptr);
+  EXPECT_EQ(identities->authenticate("cn=root", "mpw"), nullptr);
+}
+
+TEST_F(IdentitiesOfAFile, OnlyFirstValuesCountWithAWarningThatNamesNoSecret) {
+  const auto identities = read(kTop + "orv-slapdAdminPW: secondpw\norv-slapdAdminDN: cn=second\n");
+  if (!identities) GTEST_SKIP() << "the library refuses second values itself: " << error_;
+  EXPECT_NE(identities->authenticate("cn=root", "rootpw"), nullptr);
+  EXPECT_EQ(identities->authenticate("cn=root", "secondpw"), nullptr);
+  EXPECT_EQ(identities->authenticate("cn=second", "rootpw"), nullptr);
+  EXPECT_EQ(warnings_.size(), 2U);
+  EXPECT_THAT(warnings_, Each(Not(HasSubstr("secondpw"))));
+}
+
+TEST_F(IdentitiesOfAFile, MemberWithoutANameIsLeftOutWithAWarning) {
+  const auto identities =
+      read(kTop + kGroup +
+           "\ndn: cn=m,cn=AdminGroup,cn=configuration\nobjectClass: orv-slapdAdminGroupMember\n"
+           "cn: m\norv-slapdAdminPW: pw\n");
+  ASSERT_TRUE(identities) << error_;
+  EXPECT_THAT(warnings_, ElementsAre(HasSubstr("has no orv-slapdAdminDN")));
+}
+
+// ---- Forms of stored passwords
+
+TEST_F(IdentitiesOfAFile, HashedPasswordIsVerified) {
+  std::string hashed;
+  ASSERT_EQ(cfg::hash_secret("hashedpw", hashed), 0);
+  const auto identities = read(
+      "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\n"
+      "orv-slapdAdminDN: cn=root\norv-slapdAdminPW: " +
+      hashed + "\n");
+  ASSERT_TRUE(identities) << error_;
+  EXPECT_NE(identities->authenticate("cn=root", "hashedpw"), nullptr);
+  EXPECT_EQ(identities->authenticate("cn=root", "other"), nullptr);
+  EXPECT_EQ(identities->authenticate("cn=root", hashed), nullptr);
+}
+
+TEST_F(IdentitiesOfAFile, SealedPasswordIsVerifiedAtItsPlaceOnly) {
+  const cfg::KeyPtr key = make_key();
+  const std::string admin = sealed(*key, "orv-slapdAdminPW", "CN=CONFIGURATION", "sealedpw");
+  const std::string good =
+      sealed(*key, "orv-slapdAdminPW", "CN=M,CN=ADMINGROUP,CN=CONFIGURATION", "mpw");
+  const auto identities = read(
+      "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\n"
+      "orv-slapdAdminDN: cn=root\norv-slapdAdminPW: " +
+      admin + "\n" + kGroup + member("m", "cn=m", good) + member("thief", "cn=thief", admin));
+  ASSERT_TRUE(identities) << error_;
+  EXPECT_NE(identities->authenticate("cn=root", "sealedpw"), nullptr);
+  EXPECT_NE(identities->authenticate("cn=m", "mpw"), nullptr);
+  EXPECT_EQ(identities->authenticate("cn=thief", "sealedpw"), nullptr);
+  EXPECT_EQ(identities->authenticate("cn=root", admin), nullptr);
+}
+
+TEST_F(IdentitiesOfAFile, SealedSupplierPasswordIsVerified) {
+  const cfg::KeyPtr key = make_key();
+  const std::string stored = sealed(*key, "orv-slapdMasterPW", "CN=S,CN=CONFIGURATION", "spw");
+  const auto identities = read(kTop + supplier("s", "orv-slapdSupplier", "cn=s", stored));
+  ASSERT_TRUE(identities) << error_;
+  EXPECT_NE(identities->authenticate("cn=s", "spw"), nullptr);
+}
+
+TEST_F(IdentitiesOfAFile, PasswordOfAnUnknownSchemeNeverMatches) {
+  const auto identities = read(
+      "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\n"
+      "orv-slapdAdminDN: cn=root\norv-slapdAdminPW: {WHIRL}abc\n");
+  ASSERT_TRUE(identities) << error_;
+  EXPECT_EQ(identities->authenticate("cn=root", "{WHIRL}abc"), nullptr);
+  EXPECT_EQ(identities->authenticate("cn=root", "abc"), nullptr);
+}
+
+TEST_F(IdentitiesOfAFile, NameOfBlanksIsNobodys) {
+  const auto identities = read(
+      "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\n"
+      "orv-slapdAdminDN:: IA==\norv-slapdAdminPW: rootpw\n");
+  if (!identities) return;
+  for (const char* name : {"", " "}) {
+    EXPECT_EQ(identities->authenticate(name, "rootpw"), nullptr);
+  }
+  EXPECT_EQ(warnings_.size(), 1U);
+}
+
+// Names and passwords come in UTF-8 and are kept in the file's code page.
+TEST_F(IdentitiesOfAFile, FileInAnotherCodePageIsUnderstood) {
+  set_local_code_page("ISO-8859-1");
+  ASSERT_EQ(initIconvHandle(), 0);
+  // cn=J\xFCrgen and p\xE4ss in that code page, in base64
+  const auto identities = read(
+      "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\n"
+      "orv-slapdAdminDN:: Y249SvxyZ2Vu\norv-slapdAdminPW:: cORzcw==\n");
+  EXPECT_TRUE(identities) << error_;
+  if (identities) {
+    EXPECT_NE(identities->authenticate("cn=j\xC3\xBCrgen", "p\xC3\xA4ss"), nullptr);
+    EXPECT_EQ(identities->authenticate("cn=j\xC3\xBCrgen", "p\xE4ss"), nullptr);
+    EXPECT_EQ(identities->authenticate("cn=j\xC3\xBCrgen", "p\xC3\xA4ss\0x"s), nullptr);
+    EXPECT_EQ(identities->authenticate("cn=j\xC3\xBCrgen", "\xE6\x97\xA5"), nullptr);
+  }
+  set_local_code_page("UTF-8");
+  ASSERT_EQ(initIconvHandle(), 0);
+}
+
+// ---- Files that cannot be used
+
+TEST_F(IdentitiesOfAFile, MissingOrDamagedFileIsAFailureWithItsCause) {
+  std::string error;
+  EXPECT_FALSE(Identities::read((folder_ + "/none").c_str(), nullptr, error, warnings_));
+  EXPECT_THAT(error, HasSubstr("none"));
+  EXPECT_FALSE(read("this is no LDIF\n"));
+  EXPECT_FALSE(error_.empty());
+  EXPECT_FALSE(read("dn: cn=other\nobjectClass: container\ncn: other\n"));
+  EXPECT_THAT(error_, HasSubstr("CN=CONFIGURATION"));
+}
+
+TEST_F(IdentitiesOfAFile, KeyStashThatCannotBeUsedIsAFailure) {
+  use_stash_ = true;
+  EXPECT_FALSE(read(kTop)) << "no stash there";
+  EXPECT_FALSE(error_.empty());
+  make_key();
+  ASSERT_EQ(chmod(stash().c_str(), 0644), 0);
+  EXPECT_FALSE(read(kTop)) << "readable by others";
+  ASSERT_EQ(chmod(stash().c_str(), 0600), 0);
+  EXPECT_TRUE(read(kTop)) << error_;
+}
+
+// ---- The store
+
+class Store : public IdentitiesOfAFile {
+ protected:
+  static std::string with_password(const std::string& password) {
+    return "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\n"
+           "orv-slapdAdminDN: cn=root\norv-slapdAdminPW: " +
+           password + "\n";
+  }
+  bool binds(IdentityStore& store, const char* password) {
+    const auto identities = store.current();
+    return identities != nullptr && identities->authenticate("cn=root", password) != nullptr;
+  }
+};
+
+TEST_F(Store, IsEmptyWhenTheFirstReadingFails) {
+  IdentityStore store(config(), "");
+  EXPECT_FALSE(store.reload(error_, warnings_));
+  EXPECT_FALSE(error_.empty());
+  EXPECT_EQ(store.current(), nullptr);
+}
+
+TEST_F(Store, ReadsTheFileAgainWhenItWasReplaced) {
+  write(with_password("one"));
+  IdentityStore store(config(), "");
+  ASSERT_TRUE(store.reload(error_, warnings_)) << error_;
+  EXPECT_TRUE(binds(store, "one"));
+  replace(with_password("two"));
+  EXPECT_TRUE(binds(store, "two"));
+  EXPECT_FALSE(binds(store, "one"));
+}
+
+TEST_F(Store, KeepsTheSameSnapshotWhileTheFileStays) {
+  write(with_password("one"));
+  IdentityStore store(config(), "");
+  ASSERT_TRUE(store.reload(error_, warnings_)) << error_;
+  EXPECT_EQ(store.current(), store.current());
+  const auto before = store.current();
+  ASSERT_TRUE(store.reload(error_, warnings_));
+  EXPECT_NE(store.current(), before) << "reload reads whatever the times say";
+}
+
+TEST_F(Store, KeepsTheLastGoodOneWhileTheFileIsDamaged) {
+  write(with_password("one"));
+  IdentityStore store(config(), "");
+  ASSERT_TRUE(store.reload(error_, warnings_)) << error_;
+  replace("damaged\n");
+  EXPECT_TRUE(binds(store, "one"));
+  EXPECT_FALSE(store.reload(error_, warnings_));
+  EXPECT_FALSE(error_.empty());
+  EXPECT_TRUE(binds(store, "one"));
+  std::filesystem::remove(config());
+  EXPECT_TRUE(binds(store, "one"));
+  replace(with_password("two"));
+  EXPECT_TRUE(binds(store, "two"));
+}
+
+TEST_F(Store, ReadsAgainWhenTheKeyStashChanges) {
+  const cfg::KeyPtr key = make_key();
+  write(with_password(sealed(*key, "orv-slapdAdminPW", "CN=CONFIGURATION", "one")));
+  IdentityStore store(config(), stash());
+  ASSERT_TRUE(store.reload(error_, warnings_)) << error_;
+  EXPECT_TRUE(binds(store, "one"));
+  std::filesystem::remove(stash());
+  make_key();
+  EXPECT_FALSE(binds(store, "one")) << "the new key does not open the old value";
+}
+
+TEST_F(Store, ServesManyThreadsWhileTheFileIsReplaced) {
+  write(with_password("stays"));
+  IdentityStore store(config(), "");
+  ASSERT_TRUE(store.reload(error_, warnings_)) << error_;
+  std::vector<std::thread> threads;
+  std::atomic<int> failures{0};
+  for (int i = 0; i < 4; ++i) {
+    threads.emplace_back([&] {
+      for (int n = 0; n < 50; ++n) {
+        if (!binds(store, "stays")) ++failures;
+      }
+    });
+  }
+  for (int n = 0; n < 50; ++n) replace(with_password("stays") + std::string(n % 3U, '\n'));
+  for (std::thread& thread : threads) thread.join();
+  EXPECT_EQ(failures, 0);
+}
+
+}  // namespace
+}  // namespace orv::server

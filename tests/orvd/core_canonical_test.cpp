@@ -1,0 +1,135 @@
+// One spelling: what clients write, as handlers get it.
+#include "ops/canonical.h"
+
+#include <gtest/gtest.h>
+
+#include "cfg/attribute_table.h"
+
+namespace orv::server {
+namespace {
+
+class Canonical : public testing::Test {
+ protected:
+  static void SetUpTestSuite() {
+    ASSERT_EQ(cfg::register_attribute_types(builtin_schema().attribute_table()), 0);
+  }
+  const Schema& schema = builtin_schema();
+
+  int add_code(const AddRequest& request) {
+    EntryPtr made;
+    return make_entry(schema, request, made).code;
+  }
+  int modify_code(const ModifyRequest& request) {
+    ldapmod* first = nullptr;
+    const int code = make_modifications(schema, request, first).code;
+    free_modifications(first);
+    return code;
+  }
+};
+
+std::vector<std::string> values_of(const attr* a) {
+  std::vector<std::string> values;
+  for (int i = 0; a && i < a->count; ++i) values.emplace_back(a->values[i]->bv_val);
+  return values;
+}
+
+TEST_F(Canonical, EntryHasCanonicalTypesAndClassesWithTheClassesFirst) {
+  EntryPtr made;
+  const AddRequest request{"CN=x, 2.5.4.3=Configuration",
+                           {{"CN", {"x"}}, {"OBJECTCLASS", {"TOP", "Container"}}}};
+  ASSERT_EQ(make_entry(schema, request, made).code, 0);
+  EXPECT_STREQ(made->normalized_dn, "CN=X,CN=CONFIGURATION");
+  EXPECT_STREQ(made->attributes->type, "objectClass");
+  EXPECT_EQ(made->object_classes, made->attributes);
+  EXPECT_EQ(values_of(made->object_classes), (std::vector<std::string>{"top", "container"}));
+  EXPECT_STREQ(made->attributes->next->type, "cn");
+}
+
+TEST_F(Canonical, EntryLacksNoValueOfItsRdn) {
+  EntryPtr made;
+  ASSERT_EQ(
+      make_entry(schema, {"cn=x,cn=configuration", {{"objectClass", {"container"}}}}, made).code,
+      0);
+  EXPECT_EQ(values_of(attr_find(made.get(), "cn", 0, 0)), std::vector<std::string>{"x"});
+}
+
+TEST_F(Canonical, EntryIsRefusedForWhatTheBackendMustNotSee) {
+  const std::string dn = "cn=x,cn=configuration";
+  EXPECT_EQ(add_code({"no dn", {{"cn", {"x"}}}}), 34);
+  EXPECT_EQ(add_code({dn, {}}), 2);
+  EXPECT_EQ(add_code({dn, {{"cn", {}}}}), 2);
+  EXPECT_EQ(add_code({dn, {{"noSuchType", {"x"}}}}), 17);
+  EXPECT_EQ(add_code({dn, {{"cn;lang-en", {"x"}}}}), 17);
+  EXPECT_EQ(add_code({dn, {{"cn", {std::string("x\0y", 3)}}}}), 21);
+  EXPECT_EQ(add_code({dn, {{"cn", {"\xC3("}}}}), 21);
+  EXPECT_EQ(add_code({dn, {{"cn", {"x"}}, {"2.5.4.3", {"y"}}}}), 20);
+  EXPECT_EQ(add_code({dn, {{"cn", {"x", "x"}}}}), 20);
+}
+
+TEST_F(Canonical, ModificationsKeepTheClientsOrderAndHaveCountedValues) {
+  ldapmod* first = nullptr;
+  const ModifyRequest request{"cn=configuration",
+                              {{2, {"ORV-SLAPDPORT", {"389"}}}, {1, {"description", {}}}}};
+  ASSERT_EQ(make_modifications(schema, request, first).code, 0);
+  EXPECT_EQ(first->mod_op, kModReplace | kModBvalues);
+  EXPECT_STREQ(first->mod_type, "orv-slapdPort");
+  EXPECT_STREQ(first->mod_vals.modv_bvals[0]->bv_val, "389");
+  EXPECT_EQ(first->mod_vals.modv_bvals[0]->bv_len, 3U);
+  EXPECT_EQ(first->mod_vals.modv_bvals[1], nullptr);
+  ASSERT_NE(first->mod_next, nullptr);
+  EXPECT_EQ(first->mod_next->mod_op, kModDelete | kModBvalues);
+  EXPECT_EQ(first->mod_next->mod_vals.modv_bvals, nullptr);  // no values: no array
+  EXPECT_EQ(first->mod_next->mod_next, nullptr);
+  free_modifications(first);
+}
+
+TEST_F(Canonical, ModificationsAreRefusedForWhatTheBackendMustNotSee) {
+  const std::string dn = "cn=configuration";
+  EXPECT_EQ(modify_code({dn, {}}), 2);
+  EXPECT_EQ(modify_code({dn, {{0, {"cn", {}}}}}), 2);
+  EXPECT_EQ(modify_code({dn, {{2, {"noSuchType", {"x"}}}}}), 17);
+  EXPECT_EQ(modify_code({dn, {{2, {"cn", {"x"}}}, {2, {"orv-slapdAdminPW;x", {"y"}}}}}), 17);
+  EXPECT_EQ(modify_code({dn, {{2, {"cn", {std::string("\0", 1)}}}}}), 21);
+}
+
+TEST_F(Canonical, RequestedNamesAreCanonicalAndUnknownOnesStay) {
+  const TextArray names = canonical_names(schema, {"CN", "2.5.4.0", "*", "bogus"});
+  EXPECT_STREQ(names.get()[0], "cn");
+  EXPECT_STREQ(names.get()[1], "objectClass");
+  EXPECT_STREQ(names.get()[2], "*");
+  EXPECT_STREQ(names.get()[3], "bogus");
+  EXPECT_EQ(names.get()[4], nullptr);
+  EXPECT_EQ(canonical_names(schema, {}), nullptr);
+}
+
+TEST_F(Canonical, HiddenAttributesCannotBeAskedForTheirValueInAnySpelling) {
+  const auto hidden = [&](std::string_view filter) {
+    return rewrite_filter(schema, filter, FilterUse::evaluate_for_administrators);
+  };
+  const std::string undefined = "(orv-slapdAdminPW=-)";
+  EXPECT_EQ(hidden("(orv-slapdAdminDN=cn=root)"), undefined);
+  EXPECT_EQ(hidden("(ORV-SLAPDADMINDN;x=cn=root)"), undefined);
+  EXPECT_EQ(hidden("(orv-slapdAdminDN=cn*)"), undefined);
+  EXPECT_EQ(hidden("(orv-slapdAdminDN>=a)"), undefined);
+  EXPECT_EQ(hidden("(orv-slapdAdminDN~=a)"), undefined);
+  EXPECT_EQ(hidden("(orv-slapdAdminDN:2.5.13.1:=cn=root)"), undefined);
+  EXPECT_EQ(hidden("(:2.5.13.2:=cn=root)"), undefined);
+  EXPECT_EQ(hidden("(orv-slapdAdminGroupEnabled=TRUE)"), undefined);
+  EXPECT_EQ(hidden("(!(orv-slapdAdminDN=cn=root))"), "(!" + undefined + ")");
+  EXPECT_EQ(hidden("(&(cn=a)(|(orv-slapdAdminDN=x)(cn=b\\29)))"),
+            "(&(cn=a)(|" + undefined + "(cn=b\\29)))");
+  EXPECT_EQ(hidden("(orv-slapdAdminDN=*)"), "(orv-slapdAdminDN=*)");
+  const SchemaAttribute* const known = schema.attribute("orv-slapdAdminDN");
+  ASSERT_NE(known, nullptr);
+  EXPECT_EQ(hidden("(" + known->oid + "=cn=root)"), undefined);
+}
+
+TEST_F(Canonical, FiltersAreShownWithoutValuesOfSecrets) {
+  EXPECT_EQ(rewrite_filter(schema, "(&(cn=a)(orv-slapdAdminPW=guess))", FilterUse::show),
+            "(&(cn=a)(orv-slapdAdminPW=***))");
+  EXPECT_EQ(rewrite_filter(schema, "(orv-slapdAdminPW=*)", FilterUse::show),
+            "(orv-slapdAdminPW=*)");
+}
+
+}  // namespace
+}  // namespace orv::server

@@ -1,0 +1,159 @@
+// The gate: one holder, first come first served, deadlines, closing.
+#include "ops/gate.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <functional>
+#include <thread>
+#include <vector>
+
+namespace orv::server {
+namespace {
+
+using namespace std::chrono_literals;
+
+constexpr Clock::time_point kNever = Clock::time_point::max();
+
+class Recorder final : public GateWaiter {
+ public:
+  explicit Recorder(std::function<void(Verdict)> on_verdict = {})
+      : on_verdict_(std::move(on_verdict)) {}
+  void gate_decided(Verdict verdict) noexcept override {
+    verdicts.push_back(verdict);
+    if (on_verdict_) on_verdict_(verdict);
+  }
+  std::vector<Verdict> verdicts;
+
+ private:
+  std::function<void(Verdict)> on_verdict_;
+};
+
+std::shared_ptr<Recorder> waiter(std::function<void(Verdict)> on_verdict = {}) {
+  return std::make_shared<Recorder>(std::move(on_verdict));
+}
+
+TEST(Gate, AdmitsTheFirstAtOnceAndQueuesTheSecond) {
+  Gate gate;
+  const auto first = waiter();
+  const auto second = waiter();
+  EXPECT_EQ(gate.enter(first, kNever), Gate::Entry::inside);
+  EXPECT_EQ(gate.enter(second, kNever), Gate::Entry::queued);
+  EXPECT_TRUE(first->verdicts.empty());
+  EXPECT_TRUE(second->verdicts.empty());
+  gate.leave();
+  EXPECT_EQ(second->verdicts, std::vector{Verdict::admitted});
+  gate.leave();
+  EXPECT_EQ(gate.enter(first, kNever), Gate::Entry::inside);
+}
+
+TEST(Gate, AdmitsWaitersInTheOrderTheyCame) {
+  Gate gate;
+  std::vector<int> order;
+  EXPECT_EQ(gate.enter(waiter(), kNever), Gate::Entry::inside);
+  for (int i = 0; i < 5; ++i) {
+    EXPECT_EQ(gate.enter(waiter([&order, i](Verdict) { order.push_back(i); }), kNever),
+              Gate::Entry::queued);
+  }
+  for (int i = 0; i < 5; ++i) gate.leave();
+  EXPECT_EQ(order, (std::vector{0, 1, 2, 3, 4}));
+}
+
+TEST(Gate, IsHandedOverSoThatNobodyWhoComesLaterOvertakes) {
+  Gate gate;
+  const auto waiting = waiter();
+  const auto later = waiter();
+  gate.enter(waiter(), kNever);
+  gate.enter(waiting, kNever);
+  gate.leave();
+  ASSERT_EQ(waiting->verdicts, std::vector{Verdict::admitted});
+  EXPECT_EQ(gate.enter(later, kNever), Gate::Entry::queued);
+}
+
+TEST(Gate, ElsewhereAsksTheWaiterEvenWhenItIsOpen) {
+  Gate gate;
+  const auto elsewhere = waiter();
+  EXPECT_EQ(gate.enter_elsewhere(elsewhere, kNever), Gate::Entry::queued);
+  EXPECT_EQ(elsewhere->verdicts, std::vector{Verdict::admitted});
+  EXPECT_EQ(gate.enter(waiter(), kNever), Gate::Entry::queued);
+}
+
+TEST(Gate, TellsThoseWhoseDeadlinePassedAndNobodyElse) {
+  Gate gate;
+  const Clock::time_point start{};
+  const auto short_wait = waiter();
+  const auto long_wait = waiter();
+  gate.enter(waiter(), kNever);
+  gate.enter(short_wait, start + 10s);
+  gate.enter(long_wait, start + 20s);
+  gate.expire(start + 9s);
+  EXPECT_TRUE(short_wait->verdicts.empty());
+  gate.expire(start + 10s);
+  EXPECT_EQ(short_wait->verdicts, std::vector{Verdict::late});
+  EXPECT_TRUE(long_wait->verdicts.empty());
+  gate.leave();
+  EXPECT_EQ(short_wait->verdicts.size(), 1U);
+  EXPECT_EQ(long_wait->verdicts, std::vector{Verdict::admitted});
+}
+
+TEST(Gate, WithdrawnWaitersHearNothing) {
+  Gate gate;
+  const auto first = waiter();
+  const auto second = waiter();
+  gate.enter(waiter(), kNever);
+  gate.enter(first, kNever);
+  gate.enter(second, kNever);
+  EXPECT_TRUE(gate.withdraw(*first));
+  EXPECT_FALSE(gate.withdraw(*first));
+  gate.leave();
+  EXPECT_TRUE(first->verdicts.empty());
+  EXPECT_EQ(second->verdicts, std::vector{Verdict::admitted});
+  EXPECT_FALSE(gate.withdraw(*second));
+}
+
+TEST(Gate, ClosedGateRefusesWaitersAndNewcomers) {
+  Gate gate;
+  const auto waiting = waiter();
+  gate.enter(waiter(), kNever);
+  gate.enter(waiting, kNever);
+  gate.close();
+  EXPECT_EQ(waiting->verdicts, std::vector{Verdict::closed});
+  EXPECT_EQ(gate.enter(waiter(), kNever), Gate::Entry::closed);
+  const auto elsewhere = waiter();
+  EXPECT_EQ(gate.enter_elsewhere(elsewhere, kNever), Gate::Entry::closed);
+  EXPECT_TRUE(elsewhere->verdicts.empty());
+}
+
+TEST(Gate, ClosingWaitsForTheHolder) {
+  Gate gate;
+  gate.enter(waiter(), kNever);
+  EXPECT_FALSE(gate.close_and_wait_until_empty(1ms));
+  std::thread holder([&gate] { gate.leave(); });
+  EXPECT_TRUE(gate.close_and_wait_until_empty(10s));
+  holder.join();
+}
+
+TEST(Gate, LetsOneAtATimeThroughFromManyThreads) {
+  Gate gate;
+  constexpr int kThreads = 4;
+  constexpr int kRounds = 2000;
+  int unguarded = 0;  // torn without the gate
+  std::atomic<int> left{kThreads * kRounds};
+  const auto work = [&] {
+    ++unguarded;
+    gate.leave();
+    --left;
+  };
+  std::vector<std::thread> threads;
+  for (int t = 0; t < kThreads; ++t)
+    threads.emplace_back([&] {
+      for (int i = 0; i < kRounds; ++i)
+        if (gate.enter(waiter([&](Verdict) { work(); }), kNever) == Gate::Entry::inside) work();
+    });
+  for (std::thread& thread : threads) thread.join();
+  EXPECT_EQ(left.load(), 0);
+  EXPECT_EQ(unguarded, kThreads * kRounds);
+}
+
+}  // namespace
+}  // namespace orv::server

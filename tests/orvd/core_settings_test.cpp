@@ -1,0 +1,186 @@
+// Settings: bounds, reading from a file, and the logs they name.
+#include "settings.h"
+
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <fstream>
+#include <set>
+#include <sstream>
+
+#include "cfg/attribute_table.h"
+#include "logs.h"
+#include "slapi/schema.h"
+
+namespace orv::server {
+namespace {
+
+class TemporaryDirectory {
+ public:
+  TemporaryDirectory() {
+    char name[] = "/tmp/orv-core-XXXXXX";
+    path_ = mkdtemp(name);
+  }
+  ~TemporaryDirectory() {
+    [[maybe_unused]] const int rc = std::system(("rm -rf " + path_).c_str());
+  }
+  std::string file(const std::string& name) const { return path_ + "/" + name; }
+  std::string write(const std::string& name, const std::string& content) const {
+    std::ofstream(file(name), std::ios::binary) << content;
+    return file(name);
+  }
+  std::string read(const std::string& name) const {
+    std::ostringstream all;
+    all << std::ifstream(file(name), std::ios::binary).rdbuf();
+    return all.str();
+  }
+
+ private:
+  std::string path_;
+};
+
+class SettingsTest : public testing::Test {
+ protected:
+  static void SetUpTestSuite() {
+    ASSERT_EQ(cfg::register_attribute_types(builtin_schema().attribute_table()), 0);
+  }
+  std::string configuration(const std::string& more, const std::string& entries = "") {
+    return directory.write("config.ldif",
+                           "dn: cn=configuration\nobjectClass: top\nobjectClass: orv-slapdTop\n"
+                           "cn: configuration\norv-slapdAdminDN: cn=root\n" +
+                               more + "\n" + entries);
+  }
+  TemporaryDirectory directory;
+  Settings settings;
+  std::string error;
+};
+
+TEST_F(SettingsTest, EveryRowAcceptsItsBoundsAndRefusesWhatIsBeyond) {
+  std::set<std::string_view> names;
+  for (const SettingRow& row : setting_rows()) {
+    SCOPED_TRACE(row.name);
+    EXPECT_TRUE(names.insert(row.name).second);
+    EXPECT_NE(builtin_schema().attribute(row.name), nullptr);
+    EXPECT_GE(settings.*row.member, row.minimum);
+    EXPECT_LE(settings.*row.member, row.maximum);
+    for (const std::int64_t bound : {row.minimum, row.maximum}) {
+      EXPECT_TRUE(apply_setting(row, std::to_string(bound), settings, error));
+      EXPECT_EQ(settings.*row.member, bound);
+    }
+    for (const std::string& bad :
+         {std::to_string(row.minimum - 1), std::to_string(row.maximum + 1), std::string(""),
+          std::string("1x"), std::string(" 1"), std::string("99999999999999999999")}) {
+      error.clear();
+      EXPECT_FALSE(apply_setting(row, bad, settings, error)) << bad;
+      EXPECT_NE(error.find(row.name), std::string::npos);
+    }
+    EXPECT_EQ(settings.*row.member, row.maximum);
+  }
+}
+
+TEST_F(SettingsTest, AreReadFromTheFileWithDefaultsForWhatItLacks) {
+  const std::string file = configuration(
+      "orv-slapdPort: 1389\norv-slapdIpAddress: 127.0.0.1\norv-slapdIpAddress: ::1\n",
+      "dn: cn=log management,cn=configuration\nobjectClass: container\ncn: log management\n\n"
+      "dn: cn=access,cn=log management,cn=configuration\nobjectClass: orv-slapdLogSettings\n"
+      "cn: access\norv-slapdLog: /var/log/orv/access.log\n");
+  ASSERT_TRUE(read_settings(file, "", settings, error)) << error;
+  EXPECT_EQ(settings.port, 1389);
+  EXPECT_EQ(settings.time_limit, 60);
+  EXPECT_EQ(settings.addresses, (std::vector<std::string>{"127.0.0.1", "::1"}));
+  EXPECT_EQ(settings.access_log, "/var/log/orv/access.log");
+  EXPECT_EQ(settings.access_log_level, "info");
+  EXPECT_EQ(settings.error_log, "");
+}
+
+TEST_F(SettingsTest, OfADamagedFileAreRefusedWithItsPlaceAndCause) {
+  const std::string file =
+      directory.write("config.ldif", "dn: cn=configuration\ncn: configuration\nno colon here\n");
+  EXPECT_FALSE(read_settings(file, "", settings, error));
+  EXPECT_NE(error.find(file), std::string::npos) << error;
+  EXPECT_NE(error.find("3"), std::string::npos) << error;
+  EXPECT_EQ(settings.port, Settings().port);
+}
+
+TEST_F(SettingsTest, WithoutTheTopEntryAreRefused) {
+  const std::string file = directory.write("config.ldif", "dn: cn=other\ncn: other\n");
+  EXPECT_FALSE(read_settings(file, "", settings, error));
+  EXPECT_NE(error.find("CN=CONFIGURATION"), std::string::npos) << error;
+}
+
+TEST_F(SettingsTest, OutOfBoundsAreRefusedByName) {
+  EXPECT_FALSE(read_settings(configuration("orv-slapdPort: 65536\n"), "", settings, error));
+  EXPECT_NE(error.find("orv-slapdPort"), std::string::npos) << error;
+}
+
+TEST_F(SettingsTest, RelativeLogPathIsRefused) {
+  const std::string file = configuration(
+      "",
+      "dn: cn=log management,cn=configuration\nobjectClass: container\ncn: log management\n\n"
+      "dn: cn=default,cn=log management,cn=configuration\n"
+      "objectClass: orv-slapdLogSettings\ncn: default\norv-slapdLog: error.log\n");
+  EXPECT_FALSE(read_settings(file, "", settings, error));
+  EXPECT_NE(error.find("absolute"), std::string::npos) << error;
+}
+
+TEST_F(SettingsTest, OfTheListenersNeedARestart) {
+  Settings wanted;
+  wanted.size_limit = 5;
+  EXPECT_TRUE(restart_needed(settings, wanted).empty());
+  wanted.port = 1;
+  wanted.addresses = {"::1"};
+  EXPECT_EQ(restart_needed(settings, wanted),
+            (std::vector<std::string_view>{"orv-slapdPort", "orv-slapdIpAddress"}));
+}
+
+// ---- logs
+
+TEST_F(SettingsTest, LogsAreOpenedAgainWhenTheirFilesWereMovedAway) {
+  settings.error_log = directory.file("error.log");
+  {
+    Logs logs;
+    EXPECT_TRUE(logs.open(settings).empty());
+    logs.error("before");
+    ASSERT_EQ(rename(settings.error_log.c_str(), directory.file("old.log").c_str()), 0);
+    EXPECT_TRUE(logs.open(settings).empty());
+    logs.error("after");
+  }
+  EXPECT_NE(directory.read("old.log").find("before"), std::string::npos);
+  EXPECT_EQ(directory.read("old.log").find("after"), std::string::npos);
+  EXPECT_NE(directory.read("error.log").find("after"), std::string::npos);
+}
+
+TEST_F(SettingsTest, LogIsNeverAFileOfTheServersOwnOrNoFileAtAll) {
+  const std::string config = configuration("");
+  const std::string before = directory.read("config.ldif");
+  ASSERT_EQ(link(config.c_str(), directory.file("alias").c_str()), 0);
+  ASSERT_EQ(mkfifo(directory.file("pipe").c_str(), 0600), 0);
+  Logs logs({config});
+  for (const std::string& target : {config, directory.file("alias"), directory.file("pipe"),
+                                    directory.file("missing/error.log")}) {
+    settings.error_log = target;
+    EXPECT_EQ(logs.open(settings).size(), 1U) << target;
+  }
+  logs.finish();
+  EXPECT_EQ(directory.read("config.ldif"), before);
+}
+
+TEST_F(SettingsTest, AccessLinesCarryTimeAndConnectionAndNoControlCharacters) {
+  settings.access_log = directory.file("access.log");
+  settings.access_log_level = "info";
+  {
+    Logs logs;
+    ASSERT_TRUE(logs.open(settings).empty());
+    AccessLane lane(logs);
+    ASSERT_TRUE(lane.enabled());
+    append_quoted(lane.begin(7), "a\nb\"c");
+    lane.end();
+  }
+  const std::string lines = directory.read("access.log");
+  EXPECT_NE(lines.find("Z conn=7 \"a\\0Ab\\22c\"\n"), std::string::npos) << lines;
+}
+
+}  // namespace
+}  // namespace orv::server

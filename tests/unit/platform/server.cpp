@@ -1,0 +1,426 @@
+// The server's side of the scripted platform: entries, names, code page, parameter block, trace.
+#include <cctype>
+#include <cstdarg>
+#include <cstring>
+
+#include "platform/platform.h"
+#include "platform/real.h"
+#include "slapi/codepage.h"
+#include "slapi/dn.h"
+#include "slapi/globals.h"
+#include "slapi/log.h"
+#include "slapi/strings.h"
+#include "slapi/trace.h"
+
+namespace orv {
+namespace {
+
+using scripted::Call;
+using scripted::Event;
+using scripted::Owned;
+using scripted::Platform;
+using scripted::Unobserved;
+
+Platform& platform() {
+  return *Platform::current();
+}
+
+std::string formatted(const char* format, std::va_list arguments) {
+  char text[8192];
+  std::vsnprintf(text, sizeof text, format, arguments);
+  return text;
+}
+
+}  // namespace
+
+// ---- Settings
+
+std::atomic<int> g_srvType{0};
+std::atomic<int> g_safe_mode{0};
+std::atomic<int> default_autolock{1};
+std::atomic<int> al_configfile_counter{0};
+std::atomic<int> configfile_read{1};
+std::atomic<std::uint32_t> trcEvents{0};
+
+const char* ldap_getenv(const char* name) {
+  const Call call("ldap_getenv", name);
+  const auto found = platform().environment.find(name);
+  return found == platform().environment.end() ? nullptr : found->second.c_str();
+}
+
+// ---- Trace and debug output
+
+ldtr_function_local::ldtr_function_local(std::uint32_t function) noexcept : function_(function) {
+  const Unobserved unobserved;
+  if ((trcEvents & kTraceEntry) == 0) return;
+  platform().record({Event::Kind::entry, {}, "", function_});
+}
+
+ldtr_function_local::ldtr_function_local(std::uint32_t function, const char* format, ...) noexcept
+    : function_(function) {
+  const Unobserved unobserved;
+  if ((trcEvents & kTraceEntry) == 0) return;
+  std::va_list arguments;
+  va_start(arguments, format);
+  platform().record({Event::Kind::entry, {}, formatted(format, arguments), function_});
+  va_end(arguments);
+}
+
+ldtr_function_local::~ldtr_function_local() {
+  const Unobserved unobserved;
+  if ((trcEvents & kTraceExit) == 0) return;
+  platform().record({Event::Kind::exit, {}, std::to_string(code_), function_});
+}
+
+void ldtr_function_local::debug(std::uint32_t category, const char* format, ...) const noexcept {
+  const Unobserved unobserved;
+  if (!debugging()) return;
+  std::va_list arguments;
+  va_start(arguments, format);
+  platform().record({Event::Kind::debug, {}, formatted(format, arguments), category});
+  va_end(arguments);
+}
+
+bool read_ldap_debug() {
+  return platform().server_debug;
+}
+
+void PrintDebug(std::uint32_t category, const char* format, ...) {
+  const Unobserved unobserved;
+  std::va_list arguments;
+  va_start(arguments, format);
+  platform().record({Event::Kind::print_debug, {}, formatted(format, arguments), category});
+  va_end(arguments);
+}
+
+// ---- Texts
+
+char* slapi_ch_strdup(const char* text) {
+  const Call call("slapi_ch_strdup", text);
+  if (text == nullptr || call.failure_or_no_memory()) return nullptr;
+  return platform().give_text(Owned::text, text);
+}
+
+std::size_t kel_strlcpy(char* target, const char* source, std::size_t size) {
+  const Call call("kel_strlcpy", source, size);
+  std::snprintf(target, size, "%s", source);
+  if (call.failure()) return static_cast<std::size_t>(*call.failure());
+  return std::strlen(source);
+}
+
+std::size_t kel_strlcat(char* target, const char* source, std::size_t size) {
+  const Call call("kel_strlcat", target, source, size);
+  const std::size_t before = std::strlen(target);
+  std::snprintf(target + before, size - before, "%s", source);
+  if (call.failure()) return static_cast<std::size_t>(*call.failure());
+  return before + std::strlen(source);
+}
+
+// ---- Code page: Latin-1, of which only the letter a-umlaut counts
+
+namespace {
+
+int convert(const Call& call, const char* text, const char* from, const char* to, char** result,
+            std::size_t* length) {
+  *result = nullptr;
+  *length = 0;
+  if (const auto failure = call.failure_or_no_memory()) return *failure;
+  std::string converted = text;
+  for (std::size_t at = converted.find(from); at != std::string::npos;
+       at = converted.find(from, at + std::strlen(to))) {
+    converted.replace(at, std::strlen(from), to);
+  }
+  *result = platform().give_text(Owned::text, converted);
+  *length = converted.size() + 1;
+  return 0;
+}
+
+constexpr const char* kLocalLetter = "\xE4";
+constexpr const char* kUtf8Letter = "\xC3\xA4";
+
+}  // namespace
+
+int initIconvHandle() {
+  const Call call("initIconvHandle");
+  return call.failure().value_or(0);
+}
+
+int xlate_localcp_to_utf8(const char* text, char** result, std::size_t* length) {
+  const Call call("xlate_localcp_to_utf8", text);
+  return convert(call, text, kLocalLetter, kUtf8Letter, result, length);
+}
+
+int xlate_utf8_to_localcp(const char* text, char** result, std::size_t* length) {
+  const Call call("xlate_utf8_to_localcp", text);
+  return convert(call, text, kUtf8Letter, kLocalLetter, result, length);
+}
+
+// ---- Names: blanks around separators go; the normal form is in upper case
+
+namespace {
+
+std::string cleaned(const char* dn, bool upper) {
+  std::string text;
+  for (const char* c = dn; *c != '\0'; ++c) {
+    const bool separator_before = !text.empty() && (text.back() == ',' || text.back() == '=');
+    if (*c == ' ' && separator_before) continue;
+    while ((*c == ',' || *c == '=') && !text.empty() && text.back() == ' ') text.pop_back();
+    text += upper ? static_cast<char>(std::toupper(static_cast<unsigned char>(*c))) : *c;
+  }
+  return text;
+}
+
+}  // namespace
+
+int replace_DN(char** dn, int fold) {
+  const Call call("replace_DN", *dn, fold);
+  if (const auto failure = call.failure_or_no_memory()) return *failure;
+  char* normalized = platform().give_text(Owned::text, cleaned(*dn, fold == 1));
+  platform().take_back(*dn, Owned::text, "replace_DN");
+  *dn = normalized;
+  return 0;
+}
+
+ldap_escDN* dn_normalize_light_esc(const char* dn) {
+  const Call call("dn_normalize_light_esc", dn);
+  if (call.failure_or_no_memory() && call.failure().value_or(0) == 0) return nullptr;
+  auto* escaped = static_cast<ldap_escDN*>(platform().give(Owned::escaped_dn, sizeof(ldap_escDN)));
+  escaped->error = call.failure().value_or(0);
+  if (escaped->error == 0) {
+    escaped->normalized = platform().give_text(Owned::part, cleaned(dn, false));
+  }
+  platform().name(escaped, "escaped DN");
+  return escaped;
+}
+
+void free_ldap_escDN(ldap_escDN* dn) {
+  const Call call("free_ldap_escDN", dn);
+  if (dn == nullptr) return;
+  platform().dispose(dn->normalized);
+  platform().take_back(dn, Owned::escaped_dn, "free_ldap_escDN");
+}
+
+int slapi_dn_compare_v3(const char* a, const char* b) {
+  const Call call("slapi_dn_compare_v3", a, b);
+  if (call.failure()) return *call.failure();
+  if (a == nullptr || b == nullptr) return -1;
+  return cleaned(a, true) == cleaned(b, true) ? 0 : 1;
+}
+
+// ---- Entries
+
+namespace {
+
+attr** place_of(entry* e, const char* type) {
+  attr** place = &e->attributes;
+  while (*place != nullptr && strcasecmp((*place)->type, type) != 0) place = &(*place)->next;
+  return place;
+}
+
+void dispose_attribute(attr* a) {
+  for (berval** value = a->values; value != nullptr && *value != nullptr; ++value) {
+    platform().dispose((*value)->bv_val);
+    platform().dispose(*value);
+  }
+  platform().dispose(a->values);
+  platform().dispose(a->type);
+  platform().dispose(a);
+}
+
+berval* copy_of(const berval& value) {
+  auto* copy = static_cast<berval*>(platform().give(Owned::part, sizeof(berval)));
+  const std::string bytes =
+      value.bv_val == nullptr ? std::string() : std::string(value.bv_val, value.bv_len);
+  copy->bv_len = bytes.size();
+  copy->bv_val = platform().give_text(Owned::part, bytes);
+  return copy;
+}
+
+attr* make_attribute(const char* type, berval** values) {
+  auto* a = static_cast<attr*>(platform().give(Owned::part, sizeof(attr)));
+  a->type = platform().give_text(Owned::part, type);
+  while (values[a->count] != nullptr) ++a->count;
+  const auto count = static_cast<std::size_t>(a->count);
+  a->values = static_cast<berval**>(platform().give(Owned::part, (count + 1) * sizeof(berval*)));
+  for (std::size_t i = 0; i < count; ++i) a->values[i] = copy_of(*values[i]);
+  return a;
+}
+
+std::string show_values(berval** values) {
+  std::string text;
+  for (berval** value = values; *value != nullptr; ++value) {
+    text += (value == values ? "" : ",");
+    text += (*value)->bv_val == nullptr ? "<null " + std::to_string((*value)->bv_len) + ">"
+                                        : std::string((*value)->bv_val, (*value)->bv_len);
+  }
+  return text;
+}
+
+}  // namespace
+
+void entry_free(entry* e) {
+  const Call call("entry_free", e == nullptr ? nullptr : "entry");
+  if (e == nullptr) return;
+  while (e->attributes != nullptr) {
+    attr* next = e->attributes->next;
+    dispose_attribute(e->attributes);
+    e->attributes = next;
+  }
+  platform().dispose(e->dn);
+  platform().dispose(e->normalized_dn);
+  platform().dispose(e->requested_dn);
+  platform().dispose(e);
+}
+
+attr* attr_find(const entry* e, const char* type, int reserved1, int reserved2) {
+  const Call call("attr_find", type, reserved1, reserved2);
+  return e == nullptr ? nullptr : *place_of(const_cast<entry*>(e), type);
+}
+
+int attr_merge(entry* e, const char* type, berval** values, int syntax_normalise,
+               int check_duplicates, void* old) {
+  const Call call("attr_merge", type, show_values(values).c_str(), syntax_normalise,
+                  check_duplicates, old);
+  if (const auto failure = call.failure_or_no_memory()) return *failure;
+  attr** place = place_of(e, type);
+  if (*place != nullptr) return 20;  // scripted records name each attribute once
+  *place = make_attribute(type, values);
+  return 0;
+}
+
+int attr_delete(entry* e, const char* type, void* old) {
+  const Call call("attr_delete", type, old);
+  if (call.failure()) return *call.failure();
+  attr** place = place_of(e, type);
+  attr* found = *place;
+  if (found == nullptr) return 1;
+  *place = found->next;
+  dispose_attribute(found);
+  return 0;
+}
+
+int value_find(const attr* a, const berval* value, int syntax, int normalise) {
+  const Call call("value_find", a->type, std::string(value->bv_val, value->bv_len).c_str(), syntax,
+                  normalise);
+  if (call.failure()) return *call.failure();
+  for (berval** v = a->values; v != nullptr && *v != nullptr; ++v) {
+    if ((*v)->bv_len == value->bv_len &&
+        std::memcmp((*v)->bv_val, value->bv_val, value->bv_len) == 0) {
+      return 0;
+    }
+  }
+  return 1;
+}
+
+entry* CFGMessage2Entry(_CFG* session, _CFGMessage* record) {
+  const Call call("CFGMessage2Entry", session, record);
+  if (call.failure_or_no_memory()) return nullptr;
+  entry* e = static_cast<entry*>(platform().give(Owned::part, sizeof(entry)));
+  e->dn = platform().give_text(Owned::part, "as the file spells it");
+  e->local_code_page = true;
+  return e;
+}
+
+// ---- Controls
+
+int ldap_insert_control(LDAPControl* control, LDAPControl*** list) {
+  const Call call("ldap_insert_control", control);
+  if (const auto failure = call.failure_or_no_memory()) return *failure;
+  *list = static_cast<LDAPControl**>(platform().give(Owned::text, 2 * sizeof(LDAPControl*)));
+  platform().name(*list, "controls");
+  (*list)[0] = control;
+  return 0;
+}
+
+int slapi_register_supported_control(const char* oid, int operations) {
+  const Call call("slapi_register_supported_control", oid, operations);
+  return call.failure().value_or(0);
+}
+
+// ---- The parameter block
+
+int slapi_pblock_get(pblock* pb, int number, void* value) {
+  const Call call("slapi_pblock_get", number);
+  if (call.failure()) return *call.failure();
+  const auto found = pb->values.find(number);
+  const bool required = number == 50 || number == 60 || (number >= 130 && number <= 132);
+  if (required && found == pb->values.end()) return -1;
+  const pblock::Value unset{nullptr, 0, number == 110 || number == 117};
+  const pblock::Value& stored = found == pb->values.end() ? unset : found->second;
+  if (stored.is_number) {
+    std::memcpy(value, &stored.number, sizeof stored.number);
+  } else {
+    std::memcpy(value, &stored.pointer, sizeof stored.pointer);
+  }
+  return 0;
+}
+
+int slapi_pblock_set(pblock* pb, int number, Handler value) {
+  const Call call("slapi_pblock_set", number, value);
+  if (call.failure()) return *call.failure();
+  pb->put(number, reinterpret_cast<const void*>(value));
+  return 0;
+}
+
+int slapi_pblock_set(pblock* pb, int number, InstanceStart value) {
+  const Call call("slapi_pblock_set", number, value);
+  if (call.failure()) return *call.failure();
+  pb->put(number, reinterpret_cast<const void*>(value));
+  return 0;
+}
+
+int slapi_pblock_set(pblock* pb, int number, std::nullptr_t value) {
+  const Call call("slapi_pblock_set", number, value);
+  if (call.failure()) return *call.failure();
+  pb->put(number, static_cast<const void*>(nullptr));
+  return 0;
+}
+
+// ---- Answers to the client
+
+int send_ldap_result(Connection* connection, Operation* operation, int code, const char* matched_dn,
+                     const char* text) {
+  const Call call("send_ldap_result", connection, operation, code, matched_dn, text);
+  if (connection == nullptr) return 80;
+  return call.failure().value_or(0);
+}
+
+namespace {
+
+int send_search_entry(Backend* backend, Connection* connection, Operation* operation, entry* e,
+                      char** attributes, int types_only, void* reserved1, void* reserved2,
+                      void* reserved3, LDAPControl** controls) {
+  const Call call("send_search_entry", backend, connection, operation, e->dn, attributes,
+                  types_only, reserved1, reserved2, reserved3,
+                  controls == nullptr ? static_cast<LDAPControl*>(nullptr) : controls[0]);
+  if (call.failure()) return *call.failure();
+  platform().sent.push_back(scripted::text_of(*e));
+  return 0;
+}
+
+int send_search_result(Connection* connection, Operation* operation, int code,
+                       const char* matched_dn, const char* text, int entries) {
+  const Call call("send_search_result", connection, operation, code, matched_dn, text, entries);
+  return call.failure().value_or(0);
+}
+
+}  // namespace
+
+namespace scripted {
+
+void connect(Connection& connection) {
+  connection.send_search_entry = send_search_entry;
+  connection.send_search_result = send_search_result;
+  connection.send_result = nullptr;  // only through send_ldap_result
+}
+
+std::string text_of(const entry& e) {
+  std::string text = e.dn == nullptr ? "<null>" : e.dn;
+  for (const attr* a = e.attributes; a != nullptr; a = a->next) {
+    text += "|" + std::string(a->type) + "=" + show_values(a->values);
+  }
+  return text;
+}
+
+}  // namespace scripted
+}  // namespace orv
