@@ -41,9 +41,8 @@ constexpr std::array<Slot, 14> kSlots = {{
 }};
 
 int store(pblock* pb, const Slot& slot) {
-  return std::visit(
-      [&](auto function) { return slapi_pblock_set(pb, slot.parameter, function); },
-      slot.function);
+  return std::visit([&](auto function) { return slapi_pblock_set(pb, slot.parameter, function); },
+                    slot.function);
 }
 
 // Stores the slots up to the first that fails; its number is then in `failed`.

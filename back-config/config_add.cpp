@@ -54,7 +54,7 @@ using ValueList = std::unique_ptr<char*, EachValueDeleter>;
 // What is looked for, and what becomes of it.
 struct Identity {
   const char* attribute;
-  const char* untraced;       // attribute whose values stay out of the trace, or null
+  const char* untraced;  // attribute whose values stay out of the trace, or null
   bool second_value_fails;
   // Makes the identity of the attribute's first value, in the file's code page.
   int (*take)(const char* value, MallocText& identity);
@@ -161,8 +161,7 @@ int walk(const ldtr_function_local& trace, _CFG* session, _CFGMessage* record,
 
 int search_entry(_CFG* session, const char* dn, CfgResult& chain) {
   _CFGMessage* found = nullptr;
-  const int rc =
-      cfg_search_s(session, dn, kScopeBase, config_names::any_entry, nullptr, 0, &found);
+  const int rc = cfg_search_s(session, dn, kScopeBase, config_names::any_entry, nullptr, 0, &found);
   chain.reset(found);
   return rc;
 }

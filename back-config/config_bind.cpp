@@ -27,15 +27,13 @@ constexpr const char* kBindFailedHint = "Turn on ldtrc for detail errors\n";
 
 constexpr int kBindFlags = 128;
 
-void set_file_option(const ldtr_function_local& trace, _CFG* handle, int option,
-                     const char* path) {
+void set_file_option(const ldtr_function_local& trace, _CFG* handle, int option, const char* path) {
   if (path == nullptr) return;
   trace.debug(trace::detail, kFileName, path);
   cfg_set_option(handle, option, path);
 }
 
-void name_files(const ldtr_function_local& trace, _CFG* handle,
-                const ConfigBackendPrivate& state) {
+void name_files(const ldtr_function_local& trace, _CFG* handle, const ConfigBackendPrivate& state) {
   set_file_option(trace, handle, kCfgOptConfigFile, state.config_file);
   // Twice, with the same value: the library and readers of its trace see both.
   set_file_option(trace, handle, kCfgOptSaveFile, state.save_file);

@@ -52,8 +52,8 @@ int overflow(const ldtr_function_local& trace, int place) {
   return result::operations_error;
 }
 
-// Puts the file that `configured` names into `path`: the target when it is a link (one level, as it is
-// written in the link), else itself. `length` receives the length.
+// Puts the file that `configured` names into `path`: the target when it is a link (one level, as it
+// is written in the link), else itself. `length` receives the length.
 int resolve_link(const ldtr_function_local& trace, const char* configured, char* path,
                  std::size_t& length) {
   const ssize_t read = readlink(configured, path, kLongestLink);

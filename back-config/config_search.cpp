@@ -43,7 +43,9 @@ constexpr useconds_t kShortPause = 100'000;  // microseconds
 constexpr int kLongAttempts = 570;
 constexpr useconds_t kLongPause = 1'000'000;
 
-int calling_thread() { return static_cast<int>(pthread_self()); }
+int calling_thread() {
+  return static_cast<int>(pthread_self());
+}
 
 void report_short_wait(pthread_mutex_t* mutex) {
   PrintDebug(trace::info, "%d failed to trylock1 %p, waiting 0.1s\n", calling_thread(),
@@ -78,8 +80,7 @@ void acquire_timed(pthread_mutex_t* mutex) {
 }
 
 int refreshed_lock_policy() {
-  const int policy =
-      AutoLock::ReadAndSetLockType(default_autolock.load(std::memory_order_relaxed));
+  const int policy = AutoLock::ReadAndSetLockType(default_autolock.load(std::memory_order_relaxed));
   default_autolock.store(policy, std::memory_order_relaxed);
   return policy;
 }
@@ -164,8 +165,8 @@ int hide(entry& e, const char* attribute) {
 }
 
 int hide_administrator(entry& e) {
-  for (const char* attribute : {config_names::admin_dn, config_names::admin_password,
-                                config_names::admin_group_enabled}) {
+  for (const char* attribute :
+       {config_names::admin_dn, config_names::admin_password, config_names::admin_group_enabled}) {
     const int rc = hide(e, attribute);
     if (rc != 0) return rc;
   }
@@ -180,8 +181,8 @@ int hide_password_of_another(entry& e, bool& send) {
   return rc;
 }
 
-// The bind DN of the member whose entry this is, from the entry or from the file; null with result 0
-// when the entry names one without saying which (a search for types only).
+// The bind DN of the member whose entry this is, from the entry or from the file; null with result
+// 0 when the entry names one without saying which (a search for types only).
 int member_dn(Connection* connection, const attr* named, const char* normalized_dn,
               MallocText& member) {
   if (named == nullptr) {

@@ -22,8 +22,8 @@ int init_cfg_ld(Connection* connection, ConfigBackendPrivate* state);
 // Releases `configMutex`.
 void config_end(ConfigBackendPrivate* state);
 
-// The session of one operation, as verbs. It does nothing by itself when it goes out of scope: when a
-// handler gives the lock back, and when it does not, is part of what the handler does.
+// The session of one operation, as verbs. It does nothing by itself when it goes out of scope: when
+// a handler gives the lock back, and when it does not, is part of what the handler does.
 class OperationSession {
  public:
   OperationSession(Connection* connection, ConfigBackendPrivate* state) noexcept
@@ -37,10 +37,10 @@ class OperationSession {
   // The handle in the connection's slot; null before `open`.
   [[nodiscard]] _CFG* handle() const noexcept { return connection_->config_session; }
 
-  // Unbinds what is in the slot, empties it and unlocks, also when `open` failed or was never called.
-  // A caller that holds no lock so releases the lock of whoever does: the server therefore admits one
-  // operation at a time. In return a handle or a lock that a failed operation left behind is
-  // cleaned away by the next search, even one that is refused.
+  // Unbinds what is in the slot, empties it and unlocks, also when `open` failed or was never
+  // called. A caller that holds no lock so releases the lock of whoever does: the server therefore
+  // admits one operation at a time. In return a handle or a lock that a failed operation left
+  // behind is cleaned away by the next search, even one that is refused.
   void release_without_taking();
 
  private:

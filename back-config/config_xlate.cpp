@@ -50,8 +50,7 @@ namespace {
 // A null-terminated list with one name, in the form that a search takes.
 class NameList {
  public:
-  explicit NameList(const char* name)
-      : list_(static_cast<char**>(std::calloc(2, sizeof(char*)))) {
+  explicit NameList(const char* name) : list_(static_cast<char**>(std::calloc(2, sizeof(char*)))) {
     if (list_ != nullptr) list_[0] = slapi_ch_strdup(name);
   }
   ~NameList() {
@@ -146,8 +145,8 @@ void take_dn(_CFG* session, _CFGMessage* record, entry& e) {
   cfg_xlate_localcp_to_utf8(dn.get(), &e.dn, &length);
 }
 
-// Adds one attribute to the entry. False when there is no memory for it; what the library cannot read
-// is only left out.
+// Adds one attribute to the entry. False when there is no memory for it; what the library cannot
+// read is only left out.
 bool take_attribute(_CFG* session, _CFGMessage* record, const char* name, entry& e) {
   CfgValues values(cfg_get_values(session, record, name));
   if (failed_in(session, "cfg_get_values") || values == nullptr) return true;
@@ -162,8 +161,8 @@ bool take_attribute(_CFG* session, _CFGMessage* record, const char* name, entry&
   return true;
 }
 
-// Without memory for a record's values, the record goes with the entry. It is taken out of its chain
-// first, so that the owner of the chain can still release that.
+// Without memory for a record's values, the record goes with the entry. It is taken out of its
+// chain first, so that the owner of the chain can still release that.
 void release_record_of_caller(_CFG* session, _CFGMessage* record) {
   cfg_msg_unlink(session, record);
   std::free(record);

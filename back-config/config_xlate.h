@@ -11,7 +11,8 @@
 namespace orv {
 
 // Converts a NUL-terminated text. On success `*result` is a new text, released with free, and
-// `*length` counts its bytes with the terminating NUL. 0, or the converter's code with `*result` null.
+// `*length` counts its bytes with the terminating NUL. 0, or the converter's code with `*result`
+// null.
 int cfg_xlate_localcp_to_utf8(const char* text, char** result, std::size_t* length);
 int cfg_xlate_utf8_to_localcp(const char* text, char** result, std::size_t* length);
 
@@ -20,15 +21,15 @@ int cfg_xlate_utf8_to_localcp(const char* text, char** result, std::size_t* leng
 int cfg_read_cfg_entry(_CFG* session, const char* dn, const char* attribute, int scope,
                        _CFGMessage** chain);
 
-// Makes a server entry of a record, in UTF-8. What the library cannot read (the DN, an attribute) is
-// left out and reported with `cfg_perror`. The entry is released with `entry_free`.
-// Null without memory. **The record itself may then have been released**, and taken out of its
-// chain: the caller must not touch it again, not even to find the one after it.
+// Makes a server entry of a record, in UTF-8. What the library cannot read (the DN, an attribute)
+// is left out and reported with `cfg_perror`. The entry is released with `entry_free`. Null without
+// memory. **The record itself may then have been released**, and taken out of its chain: the caller
+// must not touch it again, not even to find the one after it.
 entry* CFGMessage2EntryTrans(_CFG* session, _CFGMessage* record);
 
 // Fetches the entry `dn` as the file has it, without conversion, and notes `dn` in `requested_dn`.
-// 0 with `*out` for `entry_free`; otherwise `*out` is null: 32 no such entry, 1 it cannot be taken or
-// converted, 90 no memory, or the library's error number.
+// 0 with `*out` for `entry_free`; otherwise `*out` is null: 32 no such entry, 1 it cannot be taken
+// or converted, 90 no memory, or the library's error number.
 int retrieve_entry(_CFG* session, const char* dn, entry** out);
 
 // Whether an attribute has a value, by its own equality rule. **0 means present.**

@@ -1,5 +1,6 @@
-// The identifiers under which the backend's functions appear in the trace: 0x01000000, plus the number
-// of the source file shifted left by 16, plus the number of the function in it shifted left by 8.
+// The identifiers under which the backend's functions appear in the trace: 0x01000000, plus the
+// number of the source file shifted left by 16, plus the number of the function in it shifted left
+// by 8.
 //
 // The numbers are what a reader of an old trace looks up: a function keeps its number for good, a
 // new one takes the next that is free.
@@ -9,8 +10,8 @@
 
 namespace orv::function_id {
 
-// Groups of source files. Frame: backinit, config_init, config_close, config_bind, config_unbind, and
-// the delete handler.
+// Groups of source files. Frame: backinit, config_init, config_close, config_bind, config_unbind,
+// and the delete handler.
 enum class File : std::uint32_t { frame = 1, add = 2, modify = 3, search = 4, code_page = 5 };
 
 constexpr std::uint32_t make(File file, std::uint32_t function) {

@@ -25,8 +25,9 @@ namespace orv {
 // and 90, except when not even the instance state could be allocated.
 int config_back_init(Backend* backend);
 
-// Ends the instance: destroys `configMutex`. No operation may be running or come later. The instance
-// state itself stays. 0; 17 no backend, or one that was never started; -1 `pb` has no backend.
+// Ends the instance: destroys `configMutex`. No operation may be running or come later. The
+// instance state itself stays. 0; 17 no backend, or one that was never started; -1 `pb` has no
+// backend.
 int config_back_close(pblock* pb);
 
 // Refuses: nobody binds to the configuration. Always 49; takes no lock.
@@ -37,8 +38,8 @@ int config_back_bind(pblock* pb);
 // result of `cfg_unbind`.
 int config_back_unbind(pblock* pb);
 
-// Answers a search from the configuration file (see config_search.h). Releases `configMutex` on every
-// path but that of a client who is gone, even when it was never taken.
+// Answers a search from the configuration file (see config_search.h). Releases `configMutex` on
+// every path but that of a client who is gone, even when it was never taken.
 int config_back_search(pblock* pb);
 
 // Not offered: these answer 53 (unwilling to perform).

@@ -1,6 +1,6 @@
-// The attribute table as the library itself reads it: besides what cfg/attribute_table.h tells, each
-// type's name in upper case (for normal DNs) and a test that rules out, for nearly every line of a
-// file, that its type is another spelling of a secret.
+// The attribute table as the library itself reads it: besides what cfg/attribute_table.h tells,
+// each type's name in upper case (for normal DNs) and a test that rules out, for nearly every line
+// of a file, that its type is another spelling of a secret.
 #pragma once
 
 #include <atomic>

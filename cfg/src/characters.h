@@ -9,11 +9,15 @@ constexpr char ascii_upper(char c) noexcept {
 constexpr char ascii_lower(char c) noexcept {
   return c >= 'A' && c <= 'Z' ? static_cast<char>(c - 'A' + 'a') : c;
 }
-constexpr bool is_ascii_digit(char c) noexcept { return c >= '0' && c <= '9'; }
+constexpr bool is_ascii_digit(char c) noexcept {
+  return c >= '0' && c <= '9';
+}
 constexpr bool is_ascii_letter(char c) noexcept {
   return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z');
 }
-constexpr bool is_ascii(char c) noexcept { return static_cast<unsigned char>(c) < 0x80; }
+constexpr bool is_ascii(char c) noexcept {
+  return static_cast<unsigned char>(c) < 0x80;
+}
 constexpr bool is_control(char c) noexcept {
   return static_cast<unsigned char>(c) < 0x20 || c == 0x7F;
 }

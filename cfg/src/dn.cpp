@@ -21,7 +21,7 @@ namespace {
 // ---- Parser (RFC 4514, section 3; blanks around separators are allowed as in RFC 2253) ----
 
 struct ParsedAva {
-  std::string_view type;            // as spelled
+  std::string_view type;  // as spelled
   const KnownType* known = nullptr;
   std::string value;
 };
@@ -34,9 +34,8 @@ bool is_escapable(char c) noexcept {
 
 bool is_descriptor(std::string_view type) noexcept {
   if (type.empty() || !is_ascii_letter(type.front())) return false;
-  return std::all_of(type.begin(), type.end(), [](char c) {
-    return is_ascii_letter(c) || is_ascii_digit(c) || c == '-';
-  });
+  return std::all_of(type.begin(), type.end(),
+                     [](char c) { return is_ascii_letter(c) || is_ascii_digit(c) || c == '-'; });
 }
 
 // Two or more numbers without leading zeros, separated by dots (RFC 4512, 1.4).
@@ -330,8 +329,7 @@ constexpr std::array<bool, 256> kTypeCharacter = [] {
 
 // Writes the type and its "=" to the start of `rdn.normal`; false when it does not fit.
 bool write_type(std::string_view spelled, LeadingRdn& rdn) noexcept {
-  if (rdn.spelled_length != 0 &&
-      spelled == std::string_view(rdn.spelled, rdn.spelled_length)) {
+  if (rdn.spelled_length != 0 && spelled == std::string_view(rdn.spelled, rdn.spelled_length)) {
     return true;
   }
   rdn.spelled_length = 0;

@@ -1,5 +1,5 @@
-// DNs as the library itself needs them: in the file's code page, with the hash that the index keeps,
-// and a fast path for what nearly all DNs of a configuration look like.
+// DNs as the library itself needs them: in the file's code page, with the hash that the index
+// keeps, and a fast path for what nearly all DNs of a configuration look like.
 #pragma once
 
 #include <cstddef>
@@ -22,8 +22,8 @@ bool normalize(std::string_view text, DnText encoding, std::string& normal);
 // As `parse_dn`, but throws std::bad_alloc; false when it is not a DN.
 bool parse(std::string_view text, DnText encoding, Dn& dn);
 
-// The first RDN of a DN in plain spelling (ASCII, one part, no escapes), normalised. Used for one DN
-// after the other it saves looking up a type that is spelled like the one before.
+// The first RDN of a DN in plain spelling (ASCII, one part, no escapes), normalised. Used for one
+// DN after the other it saves looking up a type that is spelled like the one before.
 struct LeadingRdn {
   char normal[512];
   char spelled[16];                 // the type as spelled, when it fits

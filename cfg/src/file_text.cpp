@@ -124,7 +124,8 @@ FileText::Outcome FileText::read_open(int file, std::string& cause) {
     return Outcome::failed;
   }
   if (!S_ISREG(before.st_mode)) {
-    cause = S_ISDIR(before.st_mode) ? "is a directory, not a regular file" : "is not a regular file";
+    cause =
+        S_ISDIR(before.st_mode) ? "is a directory, not a regular file" : "is not a regular file";
     return Outcome::failed;
   }
   const auto expected = static_cast<std::size_t>(before.st_size);

@@ -21,9 +21,9 @@ class Filter {
  public:
   static constexpr int kMaxDepth = 64;
 
-  // Reads a filter: with or without its outer parentheses; a bare attribute name is a presence test.
-  // Blanks around filters are skipped. False when it cannot be read or nests deeper than kMaxDepth;
-  // throws std::bad_alloc.
+  // Reads a filter: with or without its outer parentheses; a bare attribute name is a presence
+  // test. Blanks around filters are skipped. False when it cannot be read or nests deeper than
+  // kMaxDepth; throws std::bad_alloc.
   bool parse(std::string_view text);
 
   // Whether the entry matches; Undefined is not a match. Throws std::bad_alloc.
@@ -44,8 +44,18 @@ class Filter {
       return known != nullptr ? known->equality : MatchingRule::case_ignore;
     }
   };
-  enum class Kind { all_of, any_of, negation, presence, equality, at_least, at_most, substrings,
-                    extensible, undefined };
+  enum class Kind {
+    all_of,
+    any_of,
+    negation,
+    presence,
+    equality,
+    at_least,
+    at_most,
+    substrings,
+    extensible,
+    undefined
+  };
   struct Node {
     Kind kind = Kind::undefined;
     std::vector<std::size_t> children;  // of all_of, any_of, negation

@@ -22,6 +22,8 @@ InterruptScope::~InterruptScope() {
   current_context = previous_context_;
 }
 
-bool interrupted() noexcept { return current_check != nullptr && current_check(current_context); }
+bool interrupted() noexcept {
+  return current_check != nullptr && current_check(current_context);
+}
 
 }  // namespace orv::cfg

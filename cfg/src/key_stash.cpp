@@ -143,7 +143,9 @@ int create(const char* path, std::string& why) {
 
 }  // namespace
 
-void KeyDeleter::operator()(const Key* key) const noexcept { delete key; }
+void KeyDeleter::operator()(const Key* key) const noexcept {
+  delete key;
+}
 
 int load_key_stash(const char* path, KeyPtr& key, std::string& why) noexcept try {
   if (path == nullptr) return refuse("", "no key stash is named", why);

@@ -119,6 +119,7 @@ constexpr const char* kVersion = "only version 1 of LDIF is known";
 
 constexpr std::string_view kDn = "dn";
 constexpr std::string_view kChangeType = "changetype";
+constexpr std::string_view kControl = "control";  // the first line of some change records
 
 bool is_name(std::string_view text, std::string_view name) noexcept {
   return text.size() == name.size() && equals_ignore_ascii_case(text, name);
@@ -134,9 +135,8 @@ bool is_oid(std::string_view type) noexcept {
 
 bool is_descriptor(std::string_view type) noexcept {
   if (type.empty() || !is_ascii_letter(type.front())) return false;
-  return std::all_of(type.begin(), type.end(), [](char c) {
-    return is_ascii_letter(c) || is_ascii_digit(c) || c == '-';
-  });
+  return std::all_of(type.begin(), type.end(),
+                     [](char c) { return is_ascii_letter(c) || is_ascii_digit(c) || c == '-'; });
 }
 
 // Where byte `offset` of the unfolded value stands in the text.
@@ -171,20 +171,20 @@ class LdifIndex::Builder {
         reader_(start_, text.end()) {}
 
   bool run() {
-    if (!check_bytes()) return false;
+    if (start_ == text_.end()) return refuse_file("the file is empty");
     skip_between_entries();
     if (!at_end() && !check_version()) return false;
     while (skip_between_entries(), !at_end()) {
-      if (!read_entry()) return false;
+      if (!check_bytes() || !read_entry()) return false;
     }
-    if (!check_last_line()) return false;
+    if (!check_bytes() || !check_last_line()) return false;
     if (index_.size_ == 0) return refuse_file(kNoEntries);
     return true;
   }
 
  private:
-  // What is known of the DN read last and of its parent, so that brothers and first children, nearly
-  // all entries of a file, need no more than their own RDN looked at.
+  // What is known of the DN read last and of its parent, so that brothers and first children,
+  // nearly all entries of a file, need no more than their own RDN looked at.
   struct Neighbour {
     std::string_view dn;  // as spelled, in the text; empty when there is none
     std::uint32_t entry = kNone;
@@ -221,14 +221,23 @@ class LdifIndex::Builder {
 
   // -- The file as bytes --
 
+  // Looks for bytes that must not be in the file, a piece ahead of the reader: what was just looked
+  // through is in the processor's cache when the lines are read.
   bool check_bytes() {
-    const auto size = static_cast<std::size_t>(text_.end() - start_);
-    if (size == 0) return refuse_file("the file is empty");
-    const void* nul = std::memchr(start_, '\0', size);
+    constexpr std::ptrdiff_t kPiece = 32 * 1024;
+    while (checked_ < text_.end() && checked_ <= reader_.position()) {
+      const char* const stop = checked_ + std::min(kPiece, text_.end() - checked_);
+      if (!check_piece(checked_, stop)) return false;
+      checked_ = stop;
+    }
+    return true;
+  }
+
+  bool check_piece(const char* p, const char* stop) {
+    const void* nul = std::memchr(p, '\0', static_cast<std::size_t>(stop - p));
     if (nul != nullptr) return refuse(static_cast<const char*>(nul), kNulByte);
-    const char* p = start_;
-    while (p < text_.end()) {
-      const void* found = std::memchr(p, '\r', static_cast<std::size_t>(text_.end() - p));
+    while (p < stop) {
+      const void* found = std::memchr(p, '\r', static_cast<std::size_t>(stop - p));
       if (found == nullptr) return true;
       p = static_cast<const char*>(found) + 1;
       if (p == text_.end() || *p != '\n') return refuse(p - 1, kLoneCarriageReturn);
@@ -279,30 +288,36 @@ class LdifIndex::Builder {
 
   bool read_entry() {
     const char* const at = reader_.position();
-    if (*at == ' ') return refuse(at, kNothingToContinue);
     last_line_is_comment_ = false;
-    AttributeLine line;
-    reader_.next(line);
-    if (!read_dn(at, line)) return false;
-    std::size_t attributes = 0;
+    std::string_view dn;
+    if (reader_.pass_plain_dn(dn)) {
+      if (!index_dn(at, dn.data(), dn, true)) return false;
+    } else if (!read_unusual_dn(at)) {
+      return false;
+    }
+    return read_attributes(at);
+  }
+
+  bool read_attributes(const char* entry_at) {
     const std::uint64_t lengths = lengths_to_check_;
     const auto plain = [lengths](std::string_view type) { return needs_no_check(type, lengths); };
+    std::size_t attributes = 0;
+    AttributeLine line;
     while (true) {
-      if (attributes > 0) reader_.pass_plain_lines(plain);
+      attributes += reader_.pass_plain_lines(plain);
       const char* const before = reader_.position();
       if (!reader_.next(line)) break;
       if (!check_line(before, line, attributes == 0)) return false;
       ++attributes;
     }
-    note_trailing_comment();
-    if (attributes == 0) return refuse(at, kNoAttributes);
-    return true;
+    if (at_end()) note_trailing_comment();
+    return attributes > 0 || refuse(entry_at, kNoAttributes);
   }
 
   // `next` skips comments silently; at the end of the text it matters whether one stood last.
   void note_trailing_comment() noexcept {
     const char* const end = text_.end();
-    if (reader_.position() < end || end[-1] == '\n') return;
+    if (end[-1] == '\n') return;
     const char* p = line_begin(end);
     while (*p == ' ' && p > start_) p = line_begin(p - 1);
     last_line_is_comment_ = *p == '#';
@@ -318,7 +333,7 @@ class LdifIndex::Builder {
     if (!check_type(at, line)) return false;
     if (is_name(line.type, kDn)) return refuse(line_start(at), kSecondDn);
     if (is_name(line.type, kChangeType)) return refuse(line_start(at), kChangeRecord);
-    if (first && is_name(line.type, "control")) return refuse(line_start(at), kChangeRecord);
+    if (first && is_name(line.type, kControl)) return refuse(line_start(at), kChangeRecord);
     return line.kind == ValueKind::plain || check_encoded(at, line);
   }
 
@@ -370,19 +385,21 @@ class LdifIndex::Builder {
 
   // -- DNs --
 
-  bool read_dn(const char* at, const AttributeLine& line) {
+  // A first line that is folded, encoded, spelled otherwise or no "dn:" line at all.
+  bool read_unusual_dn(const char* at) {
+    if (*at == ' ') return refuse(at, kNothingToContinue);
+    AttributeLine line;
+    reader_.next(line);
     if (!line.has_colon || !is_name(line.type, kDn)) return refuse(at, kNoDnLine);
+    if (line.kind == ValueKind::url) return refuse(at + line.type.size(), kUrl);
     std::string scratch;
-    std::string_view dn = line.value;
-    const bool plain = line.kind == ValueKind::plain && !line.folded && is_in_text(dn);
-    if (!plain) {
-      if (line.kind == ValueKind::url) return refuse(at + line.type.size(), kUrl);
-      std::size_t error_at = 0;
-      if (!decode_value(line, scratch, dn, error_at)) {
-        return refuse(value_position(at, line, error_at), kBadBase64);
-      }
-      if (dn.find('\0') != std::string_view::npos) return refuse(at, kBase64Nul);
+    std::string_view dn;
+    std::size_t error_at = 0;
+    if (!decode_value(line, scratch, dn, error_at)) {
+      return refuse(value_position(at, line, error_at), kBadBase64);
     }
+    if (dn.find('\0') != std::string_view::npos) return refuse(at, kBase64Nul);
+    const bool plain = line.kind == ValueKind::plain && !line.folded && is_in_text(dn);
     return index_dn(at, value_position(at, line, 0), dn, plain);
   }
 
@@ -432,8 +449,8 @@ class LdifIndex::Builder {
     if (names_secret(dn)) return refuse(dn_at, kSecretInDn);
     const std::string_view above = parent_of_normal_dn(normal);
     const std::uint32_t above_hash = hash_normal_dn(above);
-    entry.hash = combine_dn_hash(above_hash, std::string_view(normal).substr(
-                                                 0, leading_rdn_length(normal)));
+    entry.hash =
+        combine_dn_hash(above_hash, std::string_view(normal).substr(0, leading_rdn_length(normal)));
     parent = Neighbour{};
     parent.depth = depth_of(above);
     if (index_.size_ == 0) return true;
@@ -470,10 +487,11 @@ class LdifIndex::Builder {
   const char* const start_;
   const AttributeLookup& lookup_;
   LineReader reader_;
+  const char* checked_ = start_;  // up to here no forbidden byte
   // One bit for each length of a type that has to be looked at.
-  const std::uint64_t lengths_to_check_ = std::uint64_t{1} | std::uint64_t{1} << kDn.size() |
-                                          std::uint64_t{1} << kChangeType.size() |
-                                          lookup_.secret_alias_lengths();
+  const std::uint64_t lengths_to_check_ =
+      std::uint64_t{1} | std::uint64_t{1} << kDn.size() | std::uint64_t{1} << kChangeType.size() |
+      std::uint64_t{1} << kControl.size() | lookup_.secret_alias_lengths();
   LeadingRdn rdn_;  // of the DN read last
   bool last_line_is_comment_ = false;
   Neighbour previous_;

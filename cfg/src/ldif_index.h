@@ -1,8 +1,8 @@
 // The entries of a configuration file: where each begins, whose child it is, and how to find it by
 // its DN. Built in one pass that also checks the whole file.
 //
-// The index holds 12 bytes an entry (15 while it grows) and a hash table of at most 11; values are neither copied nor
-// decoded. DNs are not kept: a match of hashes is confirmed on the text.
+// The index holds 12 bytes an entry (15 while it grows) and a hash table of at most 11; values are
+// neither copied nor decoded. DNs are not kept: a match of hashes is confirmed on the text.
 #pragma once
 
 #include <cstdint>
@@ -15,8 +15,8 @@
 
 namespace orv::cfg {
 
-// Why a file was refused. `line` and `column` count from 1, bytes and without a byte-order mark; both
-// are 0 when the cause is not in one place.
+// Why a file was refused. `line` and `column` count from 1, bytes and without a byte-order mark;
+// both are 0 when the cause is not in one place.
 struct FileFault {
   std::string cause;
   std::size_t line = 0;
@@ -27,8 +27,8 @@ class LdifIndex {
  public:
   static constexpr std::uint32_t kNone = 0xFFFFFFFF;
 
-  // Reads `text`, which must outlive the index. The file holds one tree: its first entry is the top,
-  // every other stands behind its parent. False with `fault`; throws std::bad_alloc.
+  // Reads `text`, which must outlive the index. The file holds one tree: its first entry is the
+  // top, every other stands behind its parent. False with `fault`; throws std::bad_alloc.
   bool build(const FileText& text, FileFault& fault);
 
   [[nodiscard]] std::uint32_t size() const noexcept { return size_; }

@@ -25,8 +25,7 @@ void unfold(std::string_view text, std::string& unfolded) {
 }
 
 const char* LineReader::find_colon(const char* start, const char* stop) noexcept {
-  return static_cast<const char*>(
-      std::memchr(start, ':', static_cast<std::size_t>(stop - start)));
+  return static_cast<const char*>(std::memchr(start, ':', static_cast<std::size_t>(stop - start)));
 }
 
 const char* LineReader::skip_continuations() noexcept {

@@ -60,9 +60,9 @@ inline std::uint64_t newlines_in_block(const char* p) noexcept {
 // The first byte at or behind `p` that is no letter, digit or hyphen.
 inline const char* skip_name(const char* p) noexcept {
   while (true) {
-    const std::uint32_t found = simd::others(p) | simd::others(p + 16) << 16;
+    const std::uint32_t found = simd::others(p);
     if (found != 0) return p + std::countr_zero(found);
-    p += 32;
+    p += 16;
   }
 }
 
@@ -81,8 +81,8 @@ inline const char* skip_name(const char* p) noexcept {
 
 #endif
 
-// Gives the newlines from `at` on, one after the other. It runs ahead of whoever uses it a block at a
-// time: where one line ends must not have to be known before the search for the next can begin.
+// Gives the newlines from `at` on, one after the other. It runs ahead of whoever uses it a block at
+// a time: where one line ends must not have to be known before the search for the next can begin.
 class Newlines {
  public:
   explicit Newlines(const char* at) noexcept : next_block_(at) {}
@@ -106,8 +106,8 @@ class Newlines {
 
 enum class ValueKind { plain, base64, url };
 
-// One "type: value" line. The views point into the text, or into the reader's scratch memory when the
-// line is folded before its value begins.
+// One "type: value" line. The views point into the text, or into the reader's scratch memory when
+// the line is folded before its value begins.
 struct AttributeLine {
   std::string_view type;
   std::string_view value;  // as in the text: folded when `folded`, encoded when `kind` says so
@@ -134,14 +134,31 @@ class LineReader {
     return true;
   }
 
-  // Passes the lines of the plainest kind that follow, not folded and their value in clear, as long as
-  // `accept` wants their type. Nearly all lines of a file need no more. Works on copies of the
-  // reader's state, which the compiler keeps in registers.
+  // Passes a "dn:" line of the plainest kind, not folded and in clear; false, standing where it
+  // stood, for any other line.
+  bool pass_plain_dn(std::string_view& dn) noexcept {
+    if (end_ - at_ < 4 || at_[0] != 'd' || at_[1] != 'n' || at_[2] != ':') return false;
+    Newlines ahead = newlines_;
+    const char* const newline = ahead.next();
+    const char* value = at_ + 3;
+    while (*value == ' ') ++value;
+    if (*value == ':' || *value == '<' || *value == '\n' || newline[1] == ' ') return false;
+    const char* const stop = newline[-1] == '\r' ? newline - 1 : newline;
+    dn = {value, static_cast<std::size_t>(stop - value)};
+    newlines_ = ahead;
+    at_ = newline + 1;
+    return true;
+  }
+
+  // Passes the lines of the plainest kind that follow, not folded and their value in clear, as long
+  // as `accept` wants their type; the result is their number. Nearly all lines of a file need no
+  // more. Works on copies of the reader's state, which the compiler keeps in registers.
   template <class Accept>
-  void pass_plain_lines(Accept accept) noexcept {
+  std::size_t pass_plain_lines(Accept accept) noexcept {
     Newlines newlines = newlines_;
     const char* at = at_;
-    while (at < end_) {
+    std::size_t count = 0;
+    for (; at < end_; ++count) {
       Newlines ahead = newlines;
       const char* const newline = ahead.next();
       const char* const colon = skip_name(at);
@@ -152,6 +169,7 @@ class LineReader {
     }
     newlines_ = newlines;
     at_ = at;
+    return count;
   }
 
   // Where the reader stands: behind the last line read.
@@ -208,9 +226,9 @@ class LineReader {
   std::string scratch_;
 };
 
-// The value as it is meant: unfolded and decoded. The result points into the text or into `scratch`.
-// False when base64 is damaged, with the offset of the first offending character of the unfolded
-// value in `error_at`. Throws std::bad_alloc.
+// The value as it is meant: unfolded and decoded. The result points into the text or into
+// `scratch`. False when base64 is damaged, with the offset of the first offending character of the
+// unfolded value in `error_at`. Throws std::bad_alloc.
 bool decode_value(const AttributeLine& line, std::string& scratch, std::string_view& value,
                   std::size_t& error_at);
 

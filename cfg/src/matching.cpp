@@ -169,8 +169,8 @@ std::string canonical_object_identifier(std::string_view value) {
   return text;
 }
 
-// The form in which two values are equal exactly when their bytes are; nothing when the value is not
-// of the rule's syntax.
+// The form in which two values are equal exactly when their bytes are; nothing when the value is
+// not of the rule's syntax.
 std::optional<std::string> canonical(MatchingRule rule, std::string_view value) {
   switch (rule) {
     case MatchingRule::case_ignore:

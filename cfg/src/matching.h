@@ -1,4 +1,5 @@
-// Comparison of stored values with the values of a filter, by matching rule (RFC 4517, section 4.2).
+// Comparison of stored values with the values of a filter, by matching rule (RFC 4517,
+// section 4.2).
 #pragma once
 
 #include <string>

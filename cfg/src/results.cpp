@@ -162,8 +162,9 @@ class NameCollector {
   bool has(const KnownType* known, std::string_view spelled) const {
     if (!seen_.empty()) return seen_.count(key(known, spelled)) != 0;
     for (const _CFGBer::Name& name : cursor_.names) {
-      if (known != nullptr ? name.known == known
-                           : name.known == nullptr && equals_ignore_ascii_case(name.text, spelled)) {
+      if (known != nullptr
+              ? name.known == known
+              : name.known == nullptr && equals_ignore_ascii_case(name.text, spelled)) {
         return true;
       }
     }
@@ -346,9 +347,13 @@ void cfg_value_free(char** values) {
   std::free(values);
 }
 
-void cfg_memfree(void* memory) { std::free(memory); }
+void cfg_memfree(void* memory) {
+  std::free(memory);
+}
 
-void cfg_ber_free(_CFGBer* cursor) { delete cursor; }
+void cfg_ber_free(_CFGBer* cursor) {
+  delete cursor;
+}
 
 int cfg_msgfree(_CFGMessage* chain) {
   delete chain_of(chain);

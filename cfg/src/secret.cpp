@@ -39,7 +39,8 @@ unsigned char* bytes_of(std::string& text) noexcept {
 // ---- Schemes ----
 
 // The name between the braces at the start of a stored value; false when there is none.
-bool split_scheme(std::string_view stored, std::string_view& scheme, std::string_view& rest) noexcept {
+bool split_scheme(std::string_view stored, std::string_view& scheme,
+                  std::string_view& rest) noexcept {
   if (stored.empty() || stored.front() != '{') return false;
   const std::size_t end = stored.find('}');
   if (end == std::string_view::npos || end == 1) return false;
@@ -133,7 +134,8 @@ bool seal(const Key& key, SecretPlace place, std::string_view clear, std::string
   int length = 0;
   const bool done =
       context != nullptr &&
-      EVP_EncryptInit_ex(context.get(), EVP_aes_256_gcm(), nullptr, key.data(), nonce.data()) == 1 &&
+      EVP_EncryptInit_ex(context.get(), EVP_aes_256_gcm(), nullptr, key.data(), nonce.data()) ==
+          1 &&
       EVP_EncryptUpdate(context.get(), nullptr, &length, header.data(),
                         static_cast<int>(header.size())) == 1 &&
       EVP_EncryptUpdate(context.get(), bytes_of(text), &length, bytes_of(clear),
@@ -156,8 +158,8 @@ bool open_sealed(const Key& key, std::string_view sealed, std::string& clear) {
   }
   const std::string_view header = sealed.substr(0, kHeaderLength);
   const std::string_view nonce = sealed.substr(kHeaderLength, kNonceLength);
-  const std::string_view text = sealed.substr(kHeaderLength + kNonceLength,
-                                              sealed.size() - kMinSealedLength);
+  const std::string_view text =
+      sealed.substr(kHeaderLength + kNonceLength, sealed.size() - kMinSealedLength);
   std::string tag(sealed.substr(sealed.size() - kTagLength));
   std::string out(text.size() + kTagLength, '\0');
   const WipeAtEnd wiped(out);
@@ -266,8 +268,8 @@ bool verify_pbkdf2(const EVP_MD* type, std::string_view rest, std::string_view c
   return CRYPTO_memcmp(made.data(), hash.data(), hash.size()) == 0;
 }
 
-bool verify_scheme(const Key* key, SecretPlace place, std::string_view scheme, std::string_view rest,
-                   std::string_view clear) {
+bool verify_scheme(const Key* key, SecretPlace place, std::string_view scheme,
+                   std::string_view rest, std::string_view clear) {
   if (equals_ignore_ascii_case(scheme, kSealedScheme)) {
     return verify_sealed(key, place, rest, clear);
   }

@@ -217,7 +217,9 @@ const char* reason(int code) noexcept {
 
 }  // namespace
 
-bool is_reserved(const _CFG* handle) noexcept { return handle == &reserved_handle; }
+bool is_reserved(const _CFG* handle) noexcept {
+  return handle == &reserved_handle;
+}
 
 Session* session_of(_CFG* handle) noexcept {
   return handle == nullptr || is_reserved(handle) ? nullptr : static_cast<Session*>(handle);

@@ -96,7 +96,8 @@ struct Chain : _CFGMessage {
   Selection selection;
 };
 
-// The session behind a handle; null for null and for the reserved handle that stands for "no memory".
+// The session behind a handle; null for null and for the reserved handle that stands for "no
+// memory".
 Session* session_of(_CFG* handle) noexcept;
 
 // Whether this is the reserved handle.

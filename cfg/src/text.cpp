@@ -78,7 +78,9 @@ constexpr std::array<signed char, 256> kDigitOf = [] {
   return digits;
 }();
 
-int digit(char c) noexcept { return kDigitOf[static_cast<unsigned char>(c)]; }
+int digit(char c) noexcept {
+  return kDigitOf[static_cast<unsigned char>(c)];
+}
 
 // Number of characters before the padding when the text is well formed; else false with the offset
 // of the first offending character.

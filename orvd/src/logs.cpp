@@ -24,11 +24,16 @@ constexpr const char* kErrorPattern = "%Y-%m-%dT%H:%M:%S.%eZ %l %v";
 
 spdlog::level::level_enum spdlog_level(LogLevel level) {
   switch (level) {
-    case LogLevel::error: return spdlog::level::err;
-    case LogLevel::warning: return spdlog::level::warn;
-    case LogLevel::info: return spdlog::level::info;
-    case LogLevel::debug: return spdlog::level::debug;
-    case LogLevel::off: break;
+    case LogLevel::error:
+      return spdlog::level::err;
+    case LogLevel::warning:
+      return spdlog::level::warn;
+    case LogLevel::info:
+      return spdlog::level::info;
+    case LogLevel::debug:
+      return spdlog::level::debug;
+    case LogLevel::off:
+      break;
   }
   return spdlog::level::off;
 }
@@ -73,7 +78,9 @@ Logs::Logs(std::vector<std::string> guarded_files)
   open_one("", "info", false);
 }
 
-Logs::~Logs() { finish(); }
+Logs::~Logs() {
+  finish();
+}
 
 std::vector<std::string> Logs::open(const Settings& settings) {
   std::vector<std::string> problems;

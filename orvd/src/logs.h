@@ -1,8 +1,8 @@
 // The error log and the access log.
 //
-// Writers never wait for a disk or a terminal: lines go to a queue that a thread of its own empties;
-// when a sink stalls for long, the oldest lines are given up. Each event loop collects its access
-// lines in a lane of its own and hands them over in batches.
+// Writers never wait for a disk or a terminal: lines go to a queue that a thread of its own
+// empties; when a sink stalls for long, the oldest lines are given up. Each event loop collects its
+// access lines in a lane of its own and hands them over in batches.
 //
 // Threads: `Logs` is thread-safe; an `AccessLane` belongs to one thread.
 #pragma once
@@ -31,16 +31,16 @@ enum class LogLevel { error, warning, info, debug, off };
 
 class Logs {
  public:
-  // Starts with the error log on standard error at level info and no access log. `guarded_files` are
-  // files that no log may share (the configuration file, its save file, the key stash).
+  // Starts with the error log on standard error at level info and no access log. `guarded_files`
+  // are files that no log may share (the configuration file, its save file, the key stash).
   explicit Logs(std::vector<std::string> guarded_files = {});
   ~Logs();
   Logs(const Logs&) = delete;
   Logs& operator=(const Logs&) = delete;
 
   // Opens what the settings name, also when they name the same files again (somebody may have moved
-  // them away). A log that cannot be opened keeps the one it had; the reasons are returned, one line
-  // each.
+  // them away). A log that cannot be opened keeps the one it had; the reasons are returned, one
+  // line each.
   std::vector<std::string> open(const Settings& settings);
 
   // Writes one line to the error log.

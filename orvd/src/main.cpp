@@ -85,8 +85,10 @@ class StoredIdentities final : public Authenticator {
 void prepare_process() {
   std::signal(SIGPIPE, SIG_IGN);
   umask(077);
+#if !defined(__SANITIZE_ADDRESS__)  // the leak check attaches to its own process
   // Core dumps would hold passwords in clear.
   prctl(PR_SET_DUMPABLE, 0);
+#endif
   rlimit files{};
   if (getrlimit(RLIMIT_NOFILE, &files) == 0 && files.rlim_cur < files.rlim_max) {
     files.rlim_cur = files.rlim_max;
@@ -130,8 +132,7 @@ bool start_backend(const Options& options, BackendPlace& place) {
     return false;
   }
   PluginError error;
-  LoadedPlugin plugin =
-      load_plugin(options.plugin_file, kEntryPoint, backend.handlers, error);
+  LoadedPlugin plugin = load_plugin(options.plugin_file, kEntryPoint, backend.handlers, error);
   if (!plugin) {
     std::fprintf(stderr, "orvd: %s\n", error.text.c_str());
     return false;
@@ -174,8 +175,7 @@ int serve(const Options& options, const Settings& settings, Logs& logs,
           StoredIdentities& identities, BackendPlace& place) {
   Server server({builtin_schema(), place.backend, identities, publications(), logs,
                  slapi_supported_controls(), settings,
-                 std::max(1U, std::thread::hardware_concurrency()),
-                 [&](Settings& wanted) {
+                 std::max(1U, std::thread::hardware_concurrency()), [&](Settings& wanted) {
                    std::string error;
                    if (!read_settings(options.config_file, options.key_stash_file, wanted, error) ||
                        !identities.reload(error)) {
@@ -195,6 +195,7 @@ int serve(const Options& options, const Settings& settings, Logs& logs,
     return 1;
   }
   server.handle_signals();
+  logs.info("orvd " ORV_VERSION " serves " + options.config_file + " at " + server.url());
   std::printf("orvd ready %s\n", server.url().c_str());
   std::fflush(stdout);
   return server.serve();

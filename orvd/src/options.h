@@ -12,15 +12,15 @@ struct Options {
   std::string config_file;     // absolute, symbolic links resolved
   std::string key_stash_file;  // "" for none
   std::string plugin_file;
-  std::vector<std::string> addresses;      // not empty: instead of the configured ones
-  std::optional<std::uint16_t> port;       // instead of the configured one
+  std::vector<std::string> addresses;  // not empty: instead of the configured ones
+  std::optional<std::uint16_t> port;   // instead of the configured one
   int server_type = 0;
   bool safe_mode = false;
-  std::string code_page;                   // "": the environment's
+  std::string code_page;  // "": the environment's
   std::optional<std::uint32_t> trace_mask;
-  std::string trace_file;                  // "": standard error
+  std::string trace_file;  // "": standard error
   bool debug = false;
-  bool check = false;                      // read everything, report, do not serve
+  bool check = false;  // read everything, report, do not serve
 };
 
 enum class Parsed { run, exit };

@@ -1,8 +1,10 @@
 #include "server.h"
 
+#include <algorithm>
 #include <asio/executor_work_guard.hpp>
 #include <asio/post.hpp>
 #include <csignal>
+#include <cstdlib>
 #include <thread>
 #include <utility>
 
@@ -11,7 +13,8 @@
 namespace orv::server {
 namespace {
 
-constexpr std::size_t kWorkers = 2;
+constexpr std::size_t kChangeThreads = 1;  // the gate lets no more than one in
+constexpr std::size_t kVerifierThreads = 2;
 // How often waiting operations are checked for their deadline.
 constexpr std::chrono::milliseconds kGateInterval{100};
 // How long a stopping server waits for the operation in hand, and for clients to leave.
@@ -24,15 +27,23 @@ Server::Server(ServerParts parts)
     : parts_(std::move(parts)),
       signals_(control_),
       gate_timer_(control_),
-      workers_(kWorkers),
+      changes_(kChangeThreads),
+      verifiers_(kVerifierThreads),
       backend_(parts_.backend,
                [this](std::string_view why) {
                  parts_.logs.error("the backend threw: " + std::string(why) +
                                    "; nothing is admitted any more");
                  stop();
                }),
-      services_{parts_.schema, backend_,           parts_.authenticator,      parts_.publications,
-                parts_.logs,   parts_.supported_controls, workers_, {}},
+      services_{parts_.schema,
+                backend_,
+                parts_.authenticator,
+                parts_.publications,
+                parts_.logs,
+                parts_.supported_controls,
+                changes_,
+                verifiers_,
+                {}},
       settings_(std::make_shared<const Settings>(parts_.settings)),
       listeners_(control_, services_, counter_, loops_) {
   for (unsigned i = 0; i < std::max(1U, parts_.loops); ++i)
@@ -40,9 +51,15 @@ Server::Server(ServerParts parts)
 }
 
 Server::~Server() {
-  workers_.stop();
-  workers_.join();
+  stop_workers();
   for (const auto& loop : loops_) loop->stop();
+}
+
+void Server::stop_workers() {
+  for (asio::thread_pool* const pool : {&changes_, &verifiers_}) {
+    pool->stop();
+    pool->join();
+  }
 }
 
 bool Server::listen(const std::vector<std::string>& addresses, std::uint16_t port,
@@ -74,7 +91,9 @@ int Server::serve() {
   return backend_.failed() ? 1 : 0;
 }
 
-void Server::stop() { control_.stop(); }
+void Server::stop() {
+  control_.stop();
+}
 
 void Server::watch_gate() {
   gate_timer_.expires_after(kGateInterval);
@@ -90,13 +109,18 @@ void Server::wind_up() {
   listeners_.close();
   services_.stopping.store(true, std::memory_order_relaxed);
   const bool closed = backend_.close(kPatience);
-  if (!closed && !backend_.failed()) parts_.logs.error("an operation does not end; going anyway");
+  if (!closed && !backend_.failed()) {
+    parts_.logs.error("an operation does not end; its thread cannot be waited for");
+    parts_.logs.finish();
+    std::_Exit(1);
+  }
+  // The answer to the operation in hand goes to its loop before the farewell does.
+  changes_.join();
   for (const auto& loop : loops_) loop->disconnect_all();
   const Clock::time_point end = Clock::now() + kFarewell;
   while (!backend_.failed() && counter_.count() > 0 && Clock::now() < end)
     std::this_thread::sleep_for(std::chrono::milliseconds(5));
-  workers_.stop();
-  workers_.join();
+  stop_workers();
   for (const auto& loop : loops_) loop->stop();
   parts_.logs.info("stopped");
 }

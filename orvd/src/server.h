@@ -53,7 +53,8 @@ class Server {
 
   // Accepts and serves until somebody stops the server, and winds up: no new connections, the
   // operation in hand is finished, clients are told, the backend is closed. Returns the exit status
-  // of the process: 0, or 1 when the backend failed.
+  // of the process: 0, or 1 when the backend failed. When the operation in hand does not end, the
+  // process does.
   int serve();
 
   // Ends serve(). Any thread.
@@ -68,13 +69,15 @@ class Server {
  private:
   void watch_gate();
   void wind_up();
+  void stop_workers();
   void await_signal();
 
   ServerParts parts_;
   asio::io_context control_{1};
   asio::signal_set signals_;
   asio::steady_timer gate_timer_;
-  asio::thread_pool workers_;
+  asio::thread_pool changes_;
+  asio::thread_pool verifiers_;
   BackendHost backend_;
   Services services_;
   ConnectionCounter counter_;

@@ -18,7 +18,8 @@ constexpr std::int64_t kGigabyte = 1 << 30;
 
 constexpr SettingRow kRows[] = {
     {"orv-slapdPort", 0, 65535, &Settings::port, true},
-    {"orv-slapdSizeLimit", 0, std::numeric_limits<std::int32_t>::max(), &Settings::size_limit, false},
+    {"orv-slapdSizeLimit", 0, std::numeric_limits<std::int32_t>::max(), &Settings::size_limit,
+     false},
     {"orv-slapdTimeLimit", 0, kMaxSeconds, &Settings::time_limit, false},
     {"orv-slapdIdleTimeOut", 0, kMaxSeconds, &Settings::idle_timeout, false},
     {"orv-slapdMaxMessageSize", 1024, kGigabyte, &Settings::max_message_size, false},
@@ -118,7 +119,9 @@ bool read_integers(const FileEntry& top, Settings& settings, std::string& error)
 
 }  // namespace
 
-std::span<const SettingRow> setting_rows() noexcept { return kRows; }
+std::span<const SettingRow> setting_rows() noexcept {
+  return kRows;
+}
 
 bool apply_setting(const SettingRow& row, std::string_view value, Settings& settings,
                    std::string& error) {

@@ -13,32 +13,32 @@
 namespace orv::server {
 
 struct Settings {
-  std::int64_t port = 3389;                           // TCP; 0 lets the kernel choose
-  std::int64_t size_limit = 0;                        // entries of one search, 0 no limit
-  std::int64_t time_limit = 60;                       // seconds of one search, 0 no limit
-  std::int64_t idle_timeout = 600;                    // seconds, 0 no limit
-  std::int64_t max_message_size = 1048576;            // bytes
-  std::int64_t max_connections = 4096;                // in all
+  std::int64_t port = 3389;                 // TCP; 0 lets the kernel choose
+  std::int64_t size_limit = 0;              // entries of one search, 0 no limit
+  std::int64_t time_limit = 60;             // seconds of one search, 0 no limit
+  std::int64_t idle_timeout = 600;          // seconds, 0 no limit
+  std::int64_t max_message_size = 1048576;  // bytes
+  std::int64_t max_connections = 4096;      // in all
   std::int64_t max_connections_per_address = 1024;
-  std::int64_t max_pending_operations = 64;           // outstanding on one connection
+  std::int64_t max_pending_operations = 64;  // outstanding on one connection
   std::int64_t max_filter_depth = 32;
-  std::int64_t max_controls = 32;                     // in one message
-  std::int64_t max_attributes = 1024;                 // in one message
-  std::int64_t max_values = 10000;                    // in one message
-  std::int64_t max_result_size = 67108864;            // bytes of one answer
-  std::int64_t operation_wait = 30;                   // seconds until an operation that waits gets 51
-  std::int64_t write_timeout = 30;                    // seconds without progress of a slow reader
-  std::int64_t message_timeout = 30;                  // seconds to finish a message once begun
-  std::vector<std::string> addresses;                 // empty: every address
+  std::int64_t max_controls = 32;           // in one message
+  std::int64_t max_attributes = 1024;       // in one message
+  std::int64_t max_values = 10000;          // in one message
+  std::int64_t max_result_size = 67108864;  // bytes of one answer
+  std::int64_t operation_wait = 30;         // seconds until an operation that waits gets 51
+  std::int64_t write_timeout = 30;          // seconds without progress of a slow reader
+  std::int64_t message_timeout = 30;        // seconds to finish a message once begun
+  std::vector<std::string> addresses;       // empty: every address
 
-  std::string error_log;           // path; empty: standard error
+  std::string error_log;  // path; empty: standard error
   std::string error_log_level = "info";
-  std::string access_log;          // path; empty: standard error
+  std::string access_log;  // path; empty: standard error
   std::string access_log_level = "off";
 };
 
-// One integer setting: attribute, bounds and the member that holds it. The member's initial value is
-// the default.
+// One integer setting: attribute, bounds and the member that holds it. The member's initial value
+// is the default.
 struct SettingRow {
   std::string_view name;
   std::int64_t minimum;
@@ -50,13 +50,13 @@ struct SettingRow {
 // All integer settings, in the order of the documentation.
 std::span<const SettingRow> setting_rows() noexcept;
 
-// Takes one value over. False, with the reason in `error`, when `value` is not an integer within the
-// row's bounds.
+// Takes one value over. False, with the reason in `error`, when `value` is not an integer within
+// the row's bounds.
 bool apply_setting(const SettingRow& row, std::string_view value, Settings& settings,
                    std::string& error);
 
-// Reads the file (opened with the key stash when one is named; "" for none). False when it cannot be
-// read (`error` then names file, line, column and cause) or when a setting is out of its bounds.
+// Reads the file (opened with the key stash when one is named; "" for none). False when it cannot
+// be read (`error` then names file, line, column and cause) or when a setting is out of its bounds.
 bool read_settings(const std::string& config_file, const std::string& key_stash_file,
                    Settings& settings, std::string& error);
 

@@ -1,6 +1,5 @@
 #include "slapi/dn.h"
 
-#include <new>
 #include <string>
 #include <string_view>
 

@@ -14,6 +14,7 @@
 #include "memory.h"
 #include "slapi/codepage.h"
 #include "slapi/dn.h"
+#include "slapi/owners.h"
 
 namespace orv {
 namespace {
@@ -279,10 +280,6 @@ int read_attributes(_CFG* session, _CFGMessage* record, entry& e) noexcept {
   return cfg_get_errno(session) == result::no_memory ? result::no_memory : result::success;
 }
 
-struct EntryDeleter {
-  void operator()(entry* e) const noexcept { entry_free(e); }
-};
-
 }  // namespace
 
 void entry_free(entry* e) {
@@ -363,7 +360,7 @@ int value_find_short_list(const ShortValue* list, const char* bytes, std::size_t
 }
 
 entry* CFGMessage2Entry(_CFG* session, _CFGMessage* record) {
-  std::unique_ptr<entry, EntryDeleter> e(static_cast<entry*>(std::calloc(1, sizeof(entry))));
+  EntryPtr e(static_cast<entry*>(std::calloc(1, sizeof(entry))));
   if (e == nullptr) return nullptr;
   e->local_code_page = true;
   if (read_dn(session, record, *e) != result::success) return nullptr;

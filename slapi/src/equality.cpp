@@ -149,7 +149,8 @@ cfg::MatchingRule equality_of(std::string_view type) noexcept {
 }
 
 bool is_secret_type(std::string_view type) noexcept {
-  const SchemaAttribute* const known = current_schema().attribute(type);
+  const std::string_view without_options = type.substr(0, type.find(';'));
+  const SchemaAttribute* const known = current_schema().attribute(without_options);
   return known != nullptr && known->secret;
 }
 

@@ -17,7 +17,7 @@ bool find_matching_rule(std::string_view name_or_oid, cfg::MatchingRule& rule) n
 // Equality of an attribute type; unknown types ignore letter case.
 cfg::MatchingRule equality_of(std::string_view type) noexcept;
 
-// Whether a type's values are secret. Unknown types are not.
+// Whether a type's values are secret, with and without attribute options. Unknown types are not.
 bool is_secret_type(std::string_view type) noexcept;
 
 // A text that two values have in common exactly when they are equal under `rule`. Values that are

@@ -4,12 +4,9 @@
 #include <ldap_schema.h>
 
 #include <algorithm>
-#include <array>
-#include <exception>
 #include <memory>
 #include <new>
 #include <optional>
-#include <span>
 #include <string>
 #include <string_view>
 #include <utility>
@@ -330,11 +327,13 @@ class SchemaReader {
 
 std::unique_ptr<const Schema> Schema::parse(std::string_view text, std::string& error) {
   try {
-    return SchemaReader(text).run();
-  } catch (const SchemaError& refused) {
-    error = "line " + std::to_string(refused.line) + ": " + refused.cause;
+    try {
+      return SchemaReader(text).run();
+    } catch (const SchemaError& refused) {
+      error = "line " + std::to_string(refused.line) + ": " + refused.cause;
+    }
   } catch (const std::bad_alloc&) {
-    error = "no memory";
+    error = "no memory";  // short enough to need none
   }
   return nullptr;
 }

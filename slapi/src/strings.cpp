@@ -6,6 +6,8 @@
 #include <cstdlib>
 #include <cstring>
 
+#include "memory.h"
+
 namespace orv {
 namespace {
 
@@ -66,17 +68,20 @@ int kel_asprintf(char** result, const char* format, ...) {
   *result = nullptr;
   if (format == nullptr) return -1;
   std::va_list arguments;
+  std::va_list again;
   va_start(arguments, format);
-  char* text = nullptr;
-  const int length = vasprintf(&text, format, arguments);
+  va_copy(again, arguments);
+  const int length = std::vsnprintf(nullptr, 0, format, arguments);
   va_end(arguments);
-  if (length < 0) return -1;
-  *result = text;
-  return length;
+  if (length >= 0) *result = static_cast<char*>(std::malloc(static_cast<std::size_t>(length) + 1));
+  if (*result != nullptr)
+    std::vsnprintf(*result, static_cast<std::size_t>(length) + 1, format, again);
+  va_end(again);
+  return *result == nullptr ? -1 : length;
 }
 
 char* slapi_ch_strdup(const char* text) {
-  return text == nullptr ? nullptr : strdup(text);
+  return text == nullptr ? nullptr : slapi::copy_bytes(text);
 }
 
 // A size of 0 asks for the smallest block, never for a release: callers keep what they passed.

@@ -8,8 +8,8 @@
 //   supplier of a suffix    entries of class orv-slapdSupplier              flags 0x02
 //   everybody else                                                          flags 0x24
 //
-// Only the first value of an identity's DN and password counts. A DN that two entries claim binds as
-// neither. DNs inside CN=CONFIGURATION and the empty DN are nobody's.
+// Only the first value of an identity's DN and password counts. A DN that two entries claim binds
+// as neither. DNs inside CN=CONFIGURATION and the empty DN are nobody's.
 //
 // Threads: `Identities` is an immutable snapshot, shared freely; `IdentityStore` is thread-safe.
 #pragma once
@@ -55,8 +55,9 @@ class Identities {
   std::unique_ptr<Data> data_;
 };
 
-// The current snapshot. It is read again when the configuration file is not the file it was read from
-// any more (device, inode, size, times), and on reload(); when that fails the last good one stays.
+// The current snapshot. It is read again when the configuration file is not the file it was read
+// from any more (device, inode, size, times), and on reload(); when that fails the last good one
+// stays.
 class IdentityStore {
  public:
   IdentityStore(std::string config_file, std::string key_stash_file);

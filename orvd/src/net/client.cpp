@@ -6,6 +6,7 @@
 #include <asio/post.hpp>
 #include <cerrno>
 #include <cstring>
+#include <exception>
 #include <new>
 #include <utility>
 
@@ -49,7 +50,9 @@ void Client::start(const std::string& peer) {
   read();
 }
 
-void Client::post(std::function<void()> work) { asio::post(loop_.context(), std::move(work)); }
+void Client::post(std::function<void()> work) {
+  asio::post(loop_.context(), std::move(work));
+}
 
 // ---- reading
 
@@ -120,9 +123,9 @@ void Client::process() {
     } else {
       read();
     }
-  } catch (const std::bad_alloc&) {
+  } catch (const std::exception& error) {
     processing_ = false;
-    close("out of memory");
+    close(error.what());
   }
 }
 
@@ -133,14 +136,16 @@ bool Client::process_one() {
   const Frame frame =
       next_frame(bytes, static_cast<std::size_t>(loop_.settings().max_message_size));
   switch (frame.state) {
-    case FrameState::need_more: return false;
+    case FrameState::need_more:
+      return false;
     case FrameState::too_big:
       disconnect(result::protocol_error, "message too big");
       return false;
     case FrameState::malformed:
       disconnect(result::protocol_error, "not an LDAP message");
       return false;
-    case FrameState::complete: break;
+    case FrameState::complete:
+      break;
   }
   handle(bytes.substr(0, frame.length));
   if (state_ != State::open) return false;
@@ -189,8 +194,8 @@ bool gives_up(std::string_view bytes, std::int32_t message_id) {
 // Only looks: what is found here is read and handled in its turn, when the operation has ended.
 bool Client::lost_interest(PendingOperation& operation) noexcept {
   char bytes[512];
-  const ssize_t length = ::recv(socket_.native_handle(), bytes, sizeof bytes,
-                                MSG_PEEK | MSG_DONTWAIT);
+  const ssize_t length =
+      ::recv(socket_.native_handle(), bytes, sizeof bytes, MSG_PEEK | MSG_DONTWAIT);
   if (length == 0 || (length < 0 && errno != EAGAIN && errno != EINTR)) {
     operation.answer().abandon();
   } else if (length > 0) {
@@ -288,11 +293,18 @@ void Client::disconnect(int code, std::string_view text) {
   if (!processing_ && !reading_) read();
 }
 
+// Answers to what came before the unbind are still on their way.
+void Client::drop() {
+  flush();
+  close("unbind");
+}
+
 // The notice is written. Closing with unread input would make the system reset the connection and
 // throw the notice away, so the client is given time to close.
 void Client::part() {
   asio::error_code ignored;
   socket_.shutdown(asio::ip::tcp::socket::shutdown_send, ignored);
+  if (services().stopping.load(std::memory_order_relaxed)) close("server is stopping");
 }
 
 void Client::close(std::string_view why) noexcept {

@@ -1,8 +1,8 @@
 // A client's TCP connection: its socket, its buffers and its deadlines.
 //
-// Bytes are read when some are there and the session can take a message; answers are written at once
-// from the thread that made them, and by the event loop only when the client does not keep up. A
-// client that does not read its answers is not read from either.
+// Bytes are read when some are there and the session can take a message; answers are written at
+// once from the thread that made them, and by the event loop only when the client does not keep up.
+// A client that does not read its answers is not read from either.
 //
 // Threads: the loop's thread, except construction.
 #pragma once
@@ -41,7 +41,7 @@ class Client final : public Session {
   void transmit(std::string& bytes) override;
   void lend_storage(std::string& bytes) noexcept override;
   void flush() override;
-  void drop() override { close("unbind"); }
+  void drop() override;
   void resume() override;
   void settled() override;
 

@@ -59,8 +59,8 @@ bool Listeners::open_one(const std::string& address, std::uint16_t port, bool re
   if (!failure) acceptor.listen(1024, failure);
   if (failure) {
     if (!required) return true;
-    error = "cannot listen on " + address + " port " + std::to_string(port) + ": " +
-            failure.message();
+    error =
+        "cannot listen on " + address + " port " + std::to_string(port) + ": " + failure.message();
     return false;
   }
   listeners_.push_back(std::move(made));
@@ -75,8 +75,7 @@ void Listeners::start(std::shared_ptr<const Settings> settings) {
 void Listeners::accept(Listener& listener) {
   Loop& loop = *loops_[next_loop_++ % loops_.size()];
   listener.acceptor.async_accept(
-      loop.context(),
-      [this, &listener, &loop](const asio::error_code& error, tcp::socket socket) {
+      loop.context(), [this, &listener, &loop](const asio::error_code& error, tcp::socket socket) {
         if (error == asio::error::operation_aborted) return;
         if (!error) {
           accepted(loop, std::move(socket));

@@ -1,6 +1,8 @@
 #include "net/loop.h"
 
 #include <asio/post.hpp>
+#include <exception>
+#include <string>
 #include <utility>
 #include <vector>
 
@@ -19,10 +21,13 @@ constexpr std::chrono::microseconds kLookLonger{40};
 Loop::Loop(Logs& logs, std::shared_ptr<const Settings> settings)
     : work_(context_.get_executor()),
       timer_(context_),
+      logs_(logs),
       settings_(std::move(settings)),
       access_(logs) {}
 
-Loop::~Loop() { stop(); }
+Loop::~Loop() {
+  stop();
+}
 
 void Loop::start() {
   schedule_sweep();
@@ -35,13 +40,17 @@ void Loop::start() {
 void Loop::run() {
   Clock::time_point last_work{};
   while (!context_.stopped()) {
-    if (context_.poll() > 0) {
-      last_work = Clock::now();
-    } else if (Clock::now() - last_work < kLookLonger) {
-      std::this_thread::yield();
-    } else {
-      context_.run_one();
-      last_work = Clock::now();
+    try {
+      if (context_.poll() > 0) {
+        last_work = Clock::now();
+      } else if (Clock::now() - last_work < kLookLonger) {
+        std::this_thread::yield();
+      } else {
+        context_.run_one();
+        last_work = Clock::now();
+      }
+    } catch (const std::exception& error) {
+      logs_.error(std::string("event loop: ") + error.what());
     }
   }
 }
@@ -54,14 +63,17 @@ void Loop::stop() noexcept {
 }
 
 void Loop::renew(std::shared_ptr<const Settings> settings) {
-  asio::post(context_, [this, settings = std::move(settings)]() mutable {
-    settings_ = std::move(settings);
-  });
+  asio::post(context_,
+             [this, settings = std::move(settings)]() mutable { settings_ = std::move(settings); });
 }
 
-void Loop::add(std::shared_ptr<Client> client) { clients_.insert(std::move(client)); }
+void Loop::add(std::shared_ptr<Client> client) {
+  clients_.insert(std::move(client));
+}
 
-void Loop::remove(const std::shared_ptr<Client>& client) { clients_.erase(client); }
+void Loop::remove(const std::shared_ptr<Client>& client) {
+  clients_.erase(client);
+}
 
 void Loop::disconnect_all() {
   asio::post(context_, [this] {

@@ -53,6 +53,7 @@ class Loop {
   asio::io_context context_{1};
   asio::executor_work_guard<asio::io_context::executor_type> work_;
   asio::steady_timer timer_;
+  Logs& logs_;
   std::shared_ptr<const Settings> settings_;
   AccessLane access_;
   std::unordered_set<std::shared_ptr<Client>> clients_;

@@ -52,7 +52,9 @@ void Answer::result(const ResultAnswer& answer) noexcept {
 
 namespace {
 
-std::string_view view(const char* text) { return text ? std::string_view(text) : ""; }
+std::string_view view(const char* text) {
+  return text ? std::string_view(text) : "";
+}
 
 Answer* answer_of(Operation* operation) {
   return operation ? static_cast<Answer*>(operation->server) : nullptr;

@@ -1,5 +1,5 @@
-// The answer to one operation: a buffer of finished LDAP messages with its budget and limits, filled
-// by the send operations that a backend calls through the `Connection`.
+// The answer to one operation: a buffer of finished LDAP messages with its budget and limits,
+// filled by the send operations that a backend calls through the `Connection`.
 //
 // Sending never blocks: it appends here, and the connection drains the buffer later. Threads: the
 // buffer belongs to the thread that runs the operation; only `abandon` may be called from others.
@@ -19,8 +19,8 @@ namespace orv::server {
 
 // What bounds an answer.
 struct AnswerLimits {
-  std::size_t bytes = 64 << 20;   // budget of the whole answer
-  std::int64_t entries = 0;       // 0: no limit
+  std::size_t bytes = 64 << 20;                           // budget of the whole answer
+  std::int64_t entries = 0;                               // 0: no limit
   Clock::time_point deadline = Clock::time_point::max();  // of a search
 };
 
@@ -29,9 +29,10 @@ class Answer {
   Answer(std::int32_t message_id, int response_tag, AnswerLimits limits)
       : message_id_(message_id), response_tag_(response_tag), limits_(limits) {}
 
-  // Appends one search entry. 0; 4, 3, 11, 80 as SendSearchEntry says; 90 without memory. Nothing is
-  // appended on failure.
-  int entry(const orv::entry& e, char** attributes, bool types_only, LDAPControl** controls) noexcept;
+  // Appends one search entry. 0; 4, 3, 11, 80 as SendSearchEntry says; 90 without memory. Nothing
+  // is appended on failure.
+  int entry(const orv::entry& e, char** attributes, bool types_only,
+            LDAPControl** controls) noexcept;
 
   // Appends the result, once: later results and results of an abandoned operation are dropped.
   void result(int code, std::string_view matched_dn, std::string_view text) noexcept;
@@ -71,8 +72,8 @@ class Answer {
 };
 
 // Installs the send operations in a connection. They reach the answer through `Operation::server`,
-// which must point to an `Answer`; one that is null drops everything, as a connection of the server's
-// own does.
+// which must point to an `Answer`; one that is null drops everything, as a connection of the
+// server's own does.
 void install_senders(Connection& connection) noexcept;
 
 }  // namespace orv::server

@@ -4,11 +4,11 @@
 // A backend handler that could not open its session keeps the backend's lock and leaves the session
 // in the connection's slot; nobody else could enter after that. Such a handle is moved to a
 // connection of the server's own, and a search by a caller without access is run there: its refusal
-// ends the session, empties the slot and releases the lock. It must happen on the thread that ran the
-// handler, before the gate opens.
+// ends the session, empties the slot and releases the lock. It must happen on the thread that ran
+// the handler, before the gate opens.
 //
-// A handler that throws has left the backend in a state nobody knows. Nothing is admitted after that
-// and the process is to end.
+// A handler that throws has left the backend in a state nobody knows. Nothing is admitted after
+// that and the process is to end.
 //
 // Threads: `call_inside_gate` only by the holder of the gate; the rest from any thread.
 #pragma once
@@ -27,24 +27,24 @@ namespace orv::server {
 
 class BackendHost {
  public:
-  // `backend` (its `handlers` filled by the plug-in) must outlive the host. `on_failure` is told why
-  // when a handler threw; it must not throw. Throws std::bad_alloc.
+  // `backend` (its `handlers` filled by the plug-in) must outlive the host. `on_failure` is told
+  // why when a handler threw; it must not throw. Throws std::bad_alloc.
   BackendHost(Backend& backend, std::function<void(std::string_view)> on_failure);
 
   Gate& gate() noexcept { return gate_; }
   Backend& backend() noexcept { return backend_; }
   bool has(int handler) const noexcept { return handler_of(handler) != nullptr; }
 
-  // Runs a handler on a block for the connection in it, and brings the backend to rest. `leaves_slot`
-  // tells that the handler may end with the session slot filled (add, delete, modify). The gate is
-  // left open or passed on. Returns the handler's code; 52 when it threw.
+  // Runs a handler on a block for the connection in it, and brings the backend to rest.
+  // `leaves_slot` tells that the handler may end with the session slot filled (add, delete,
+  // modify). The gate is left open or passed on. Returns the handler's code; 52 when it threw.
   int call_inside_gate(int handler, pblock* parameters, Connection& connection, bool leaves_slot);
 
   // Runs a handler that needs no gate: bind and unbind.
   int call(int handler, pblock* parameters) noexcept;
 
-  // Closes the gate, waits for the holder, and runs the close handler. False when the holder has not
-  // left within `patience`; the close handler is then not called.
+  // Closes the gate, waits for the holder, and runs the close handler. False when the holder has
+  // not left within `patience`; the close handler is then not called.
   bool close(std::chrono::milliseconds patience);
 
   // A handler threw.

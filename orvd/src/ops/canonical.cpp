@@ -52,7 +52,8 @@ struct CanonicalAttribute {
   std::vector<std::string> values;
 };
 
-Refusal canonical_attribute(const Schema& schema, const Attribute& given, CanonicalAttribute& made) {
+Refusal canonical_attribute(const Schema& schema, const Attribute& given,
+                            CanonicalAttribute& made) {
   if (Refusal refusal = canonical_type(schema, given.type, made.type)) return refusal;
   made.values.reserve(given.values.size());
   for (const std::string& value : given.values) {
@@ -177,7 +178,7 @@ ldapmod* malloc_modification(int operation, const CanonicalAttribute& attribute)
 
 // One item, as the text between its parentheses.
 struct FilterItem {
-  std::string_view attribute;  // with options; empty in an extensible match without a type
+  std::string_view attribute;     // with options; empty in an extensible match without a type
   std::string_view before_value;  // attribute, matching rule and operator
   std::string_view value;
 };
@@ -206,7 +207,8 @@ bool secret(const Schema& schema, std::string_view attribute) {
 
 void rewrite_item(const Schema& schema, std::string_view item, FilterUse use, std::string& out) {
   const FilterItem parts = split_item(item);
-  const bool presence = parts.value == "*" && parts.before_value.size() == parts.attribute.size() + 1;
+  const bool presence =
+      parts.value == "*" && parts.before_value.size() == parts.attribute.size() + 1;
   if (presence) {
     out += item;
   } else if (use == FilterUse::show) {
@@ -290,8 +292,8 @@ std::string rewrite_filter(const Schema& schema, std::string_view filter, Filter
   std::size_t at = 0;
   while (at < filter.size()) {
     const char c = filter[at];
-    const bool opens_item = c == '(' && at + 1 < filter.size() &&
-                            std::strchr("&|!()", filter[at + 1]) == nullptr;
+    const bool opens_item =
+        c == '(' && at + 1 < filter.size() && std::strchr("&|!()", filter[at + 1]) == nullptr;
     out += c;
     ++at;
     if (!opens_item) continue;

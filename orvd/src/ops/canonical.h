@@ -2,8 +2,8 @@
 // refused.
 //
 // DNs are normalised, attribute types and object class values take their canonical schema names,
-// attribute options are refused, values with NUL bytes or invalid UTF-8 are refused. Everything that
-// is handed to a handler is from the malloc family.
+// attribute options are refused, values with NUL bytes or invalid UTF-8 are refused. Everything
+// that is handed to a handler is from the malloc family.
 //
 // Nothing here throws but std::bad_alloc; all functions are thread-safe.
 #pragma once
@@ -44,8 +44,8 @@ MallocText malloc_text(std::string_view text);
 TextArray canonical_names(const Schema& schema, const std::vector<std::string>& names);
 
 // The entry of an add request: canonical types, each once, object classes first, the values of the
-// RDN completed. 34 no DN; 17 unknown type or an attribute option; 2 an attribute without values or an
-// empty list; 20 a type or a value twice; 21 a value that must not reach the backend.
+// RDN completed. 34 no DN; 17 unknown type or an attribute option; 2 an attribute without values or
+// an empty list; 20 a type or a value twice; 21 a value that must not reach the backend.
 Refusal make_entry(const Schema& schema, const AddRequest& request, EntryPtr& made);
 
 // The modification records of a modify request, in the client's order: counted values, a null array
@@ -58,7 +58,8 @@ enum class FilterUse {
   show,                         // values of secret attributes are replaced by asterisks
 };
 
-// Rewrites the items of a filter (in the decoder's text form), item by item, leaving presence tests.
+// Rewrites the items of a filter (in the decoder's text form), item by item, leaving presence
+// tests.
 std::string rewrite_filter(const Schema& schema, std::string_view filter, FilterUse use);
 
 }  // namespace orv::server

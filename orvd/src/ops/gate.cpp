@@ -103,7 +103,8 @@ void Gate::close() noexcept {
 bool Gate::close_and_wait_until_empty(std::chrono::milliseconds patience) {
   close();
   std::unique_lock lock(mutex_);
-  return emptied_.wait_for(lock, patience, [this] { return !held_.load(std::memory_order_relaxed); });
+  return emptied_.wait_for(lock, patience,
+                           [this] { return !held_.load(std::memory_order_relaxed); });
 }
 
 std::size_t Gate::waiting() const {

@@ -32,9 +32,9 @@ class GateWaiter {
  public:
   virtual ~GateWaiter() = default;
 
-  // Called exactly once for a waiter that was queued and not withdrawn, on whatever thread opened the
-  // gate or noticed the deadline. Must only arrange for the work to go on elsewhere: the caller may be
-  // about to serve a client of its own.
+  // Called exactly once for a waiter that was queued and not withdrawn, on whatever thread opened
+  // the gate or noticed the deadline. Must only arrange for the work to go on elsewhere: the caller
+  // may be about to serve a client of its own.
   virtual void gate_decided(Verdict verdict) noexcept = 0;
 };
 

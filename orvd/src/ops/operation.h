@@ -46,8 +46,8 @@ class PendingOperation final : public GateWaiter,
   Refusal prepare_modify(Services& services, const ModifyRequest& request,
                          std::string_view normal_dn);
 
-  // Calls the handler and makes sure that there is a result. The caller holds the gate, which is open
-  // or passed on afterwards. `on_home_thread`: the connection's thread runs it.
+  // Calls the handler and makes sure that there is a result. The caller holds the gate, which is
+  // open or passed on afterwards. `on_home_thread`: the connection's thread runs it.
   void run(Services& services, bool on_home_thread);
 
   void gate_decided(Verdict verdict) noexcept override;

@@ -1,5 +1,5 @@
-// What connections and operations use of the server. Made once before the listeners open; everything
-// in it outlives every connection and is thread-safe.
+// What connections and operations use of the server. Made once before the listeners open;
+// everything in it outlives every connection and is thread-safe.
 #pragma once
 
 #include <asio/thread_pool.hpp>
@@ -22,7 +22,8 @@ namespace orv::server {
 class Authenticator {
  public:
   virtual ~Authenticator() = default;
-  // The identity that name (any spelling) and password prove, or null. May take long and read files.
+  // The identity that name (any spelling) and password prove, or null. May take long and read
+  // files.
   virtual std::shared_ptr<const Identity> authenticate(std::string_view name,
                                                        std::string_view password) = 0;
 };
@@ -40,7 +41,11 @@ struct Services {
   Publications publications;
   Logs& logs;
   std::vector<std::string> supported_controls;
-  asio::thread_pool& workers;  // for what waits: password checks, changes that flush to disk
+  // For what waits: changes, which flush to disk, and password checks, which cost time by
+  // intention. Apart, because whoever holds the gate must not queue behind strangers who try
+  // passwords.
+  asio::thread_pool& changes;
+  asio::thread_pool& verifiers;
   std::atomic<bool> stopping{false};  // running searches end
 };
 

@@ -37,15 +37,24 @@ int response_tag(const Request& request) {
 
 std::string_view operation_name(int tag) {
   switch (tag) {
-    case tag::bind_response: return "BIND";
-    case tag::search_done: return "SEARCH";
-    case tag::add_response: return "ADD";
-    case tag::delete_response: return "DELETE";
-    case tag::modify_response: return "MODIFY";
-    case tag::modify_dn_response: return "MODIFYDN";
-    case tag::compare_response: return "COMPARE";
-    case tag::extended_response: return "EXTENDED";
-    default: return "REQUEST";
+    case tag::bind_response:
+      return "BIND";
+    case tag::search_done:
+      return "SEARCH";
+    case tag::add_response:
+      return "ADD";
+    case tag::delete_response:
+      return "DELETE";
+    case tag::modify_response:
+      return "MODIFY";
+    case tag::modify_dn_response:
+      return "MODIFYDN";
+    case tag::compare_response:
+      return "COMPARE";
+    case tag::extended_response:
+      return "EXTENDED";
+    default:
+      return "REQUEST";
   }
 }
 
@@ -82,7 +91,9 @@ std::string describe_search(const Schema& schema, const SearchRequest& request) 
   return text;
 }
 
-bool has_no_access(unsigned authority) { return authority == authority::no_configuration_access; }
+bool has_no_access(unsigned authority) {
+  return authority == authority::no_configuration_access;
+}
 
 bool may_search(unsigned authority) {
   // A server of kind 3 has another rule first, which the backend applies.
@@ -169,8 +180,7 @@ void Session::search(std::int32_t id, SearchRequest& request) {
   if (target == Target::root_dse && request.scope == 0)
     return search_published(id, request, services_.publications.root_dse(), "");
   if (target == Target::subschema && request.scope != 1)
-    return search_published(id, request, services_.publications.subschema(),
-                            kSubschemaDn);
+    return search_published(id, request, services_.publications.subschema(), kSubschemaDn);
 
   const OperationPtr operation =
       make_operation(id, tag::search_done, stricter(settings().time_limit, request.time_limit),
@@ -273,7 +283,7 @@ void Session::run_here(const OperationPtr& operation) {
 }
 
 void Session::run_on_worker(OperationPtr operation) {
-  asio::post(services_.workers, [this, self = shared_from_this(), operation] {
+  asio::post(services_.changes, [this, self = shared_from_this(), operation] {
     operation->run(services_, false);
     post([this, self, operation] {
       complete(operation);
@@ -354,8 +364,7 @@ void Session::settle_if_done() {
 
 void Session::unbind() noexcept {
   Operation operation;
-  const PblockPtr parameters =
-      make_parameters(services_.backend.backend(), connection_, operation);
+  const PblockPtr parameters = make_parameters(services_.backend.backend(), connection_, operation);
   if (parameters) services_.backend.call(parameter::unbind_function, parameters.get());
   // The handler leaves the handle in the slot though it is released.
   connection_.config_session = nullptr;
@@ -399,8 +408,8 @@ void Session::start_bind() {
 }
 
 void Session::verify_password() {
-  asio::post(services_.workers, [this, self = shared_from_this(),
-                                 request = std::move(bind_->request)]() mutable {
+  asio::post(services_.verifiers, [this, self = shared_from_this(),
+                                   request = std::move(bind_->request)]() mutable {
     std::shared_ptr<const Identity> identity;
     int code = result::invalid_credentials;
     try {
@@ -422,8 +431,7 @@ void Session::ask_backend_to_bind() {
   Answer answer(bind_->message_id, tag::bind_response, {});
   Operation operation;
   operation.server = &answer;
-  const PblockPtr parameters =
-      make_parameters(services_.backend.backend(), connection_, operation);
+  const PblockPtr parameters = make_parameters(services_.backend.backend(), connection_, operation);
   int code = result::no_memory;
   if (parameters) code = services_.backend.call(parameter::bind_function, parameters.get());
   // Nobody becomes anybody here, whatever a backend may say.

@@ -33,8 +33,8 @@ struct SearchRequest {
   std::int32_t size_limit = 0;  // 0: the server's
   std::int32_t time_limit = 0;  // seconds, 0: the server's
   bool types_only = false;
-  // The filter rebuilt as RFC 4515 text: every ( ) * \ and NUL of a value escaped, well-formed UTF-8
-  // left as it is, other bytes as \XX.
+  // The filter rebuilt as RFC 4515 text: every ( ) * \ and NUL of a value escaped, well-formed
+  // UTF-8 left as it is, other bytes as \XX.
   std::string filter;
   std::vector<std::string> attributes;  // empty: all user attributes
 };
@@ -80,9 +80,9 @@ struct ExtendedRequest {
   std::optional<std::string> value;
 };
 
-using Request = std::variant<BindRequest, UnbindRequest, SearchRequest, AddRequest, DeleteRequest,
-                             ModifyRequest, ModifyDnRequest, CompareRequest, AbandonRequest,
-                             ExtendedRequest>;
+using Request =
+    std::variant<BindRequest, UnbindRequest, SearchRequest, AddRequest, DeleteRequest,
+                 ModifyRequest, ModifyDnRequest, CompareRequest, AbandonRequest, ExtendedRequest>;
 
 struct Message {
   std::int32_t id = 0;

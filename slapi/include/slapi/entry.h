@@ -47,12 +47,12 @@ void entry_free(entry* e);
 // reserved and 0. Null-safe.
 attr* attr_find(const entry* e, const char* type, int reserved1, int reserved2);
 
-// Adds copies of `values` to the attribute `type`, creating it at the end of the list when the entry
-// lacks it; an empty array creates it without values. `syntax_normalise` and `check_duplicates` are
-// passed as 1, `old` is reserved and null.
-// 0; 20 a value is there already (never said for secret types, nor when the attribute is new);
-// 90; -1 a null argument. The entry is unchanged on failure. Keeps the object class reference and
-// short list right.
+// Adds copies of `values` to the attribute `type`, creating it at the end of the list when the
+// entry lacks it; an empty array creates it without values. `syntax_normalise` and
+// `check_duplicates` are passed as 1, `old` is reserved and null. 0; 20 a value is there already
+// (never said for secret types, nor when the attribute is new); 21 the entry is in the local code
+// page, into which the values are converted, and that lacks a character; 90; -1 a null argument.
+// The entry is unchanged on failure. Keeps the object class reference and short list right.
 int attr_merge(entry* e, const char* type, berval** values, int syntax_normalise,
                int check_duplicates, void* old);
 
@@ -68,24 +68,24 @@ int value_find(const attr* a, const berval* value, int syntax, int normalise);
 int value_find_short_list(const ShortValue* list, const char* bytes, std::size_t length);
 
 // Makes an entry of a search result without converting its code page (and marks it
-// `local_code_page`): DN, normalised DN, attributes in the order of the file, object class reference
-// and short list. Null only without memory.
+// `local_code_page`): DN, normalised DN, attributes in the order of the file, object class
+// reference and short list. Null only without memory.
 entry* CFGMessage2Entry(_CFG* session, _CFGMessage* record);
 
 // Frees a null-terminated array of texts and each text; null is a no-op.
 void charray_free(char** array);
 
-// ---- Changes of entries. Declared for those who write against this interface; a program that calls
-// them does not link yet.
+// ---- Changes of entries. Declared for those who write against this interface; a program that
+// calls them does not link yet.
 
 // Applies a delete modification: without values the whole attribute goes, else each value by the
 // equality rule. 0; 16 attribute or value missing; 90. For a secret type the earliest value goes,
 // whatever the modification says, so that nothing can be learned from the code.
 int delete_values_from_entry(entry* e, ldapmod* modification);
 
-// The list form of attributes that the configuration-file library writes: a malloced null-terminated
-// array of add records with deep copies of type and values (strings, read up to their NUL), linked
-// through `mod_next` in array order. Null only for an empty list.
+// The list form of attributes that the configuration-file library writes: a malloced
+// null-terminated array of add records with deep copies of type and values (strings, read up to
+// their NUL), linked through `mod_next` in array order. Null only for an empty list.
 ldapmod** EntryToLDAPMod(attr* attributes);
 
 // Frees a linked list of records; null is a no-op. And an array of them: each record, and the array

@@ -32,19 +32,20 @@ struct SchemaAttribute {
   std::string equality;            // rule name, may be inherited
   std::string ordering;
   std::string substrings;
-  std::string syntax;              // numeric OID
+  std::string syntax;  // numeric OID
   bool single_valued = false;
   bool no_user_modification = false;
   bool operational = false;
-  bool secret = false;             // X-ORV-SECRET 'TRUE'
-  std::string description;         // as it was given, for publishing
+  bool secret = false;      // X-ORV-SECRET 'TRUE'
+  std::string description;  // as it was given, for publishing
 };
 
 class Schema {
  public:
   // Reads descriptions: lines that begin "attributeTypes:" or "objectClasses:" (LDIF folding and
-  // comments as in RFC 2849). Refuses what it cannot read whole, a duplicate name or OID, an unknown
-  // superior or type. Null on failure, with line and cause in `error`.
+  // comments as in RFC 2849). Refuses what it cannot read whole, a duplicate name or OID, an
+  // unknown superior or type. A superior stands before what derives from it. Null on failure, with
+  // line and cause in `error`.
   static std::unique_ptr<const Schema> parse(std::string_view text, std::string& error);
 
   // Look-up by any name or numeric OID, ignoring ASCII letter case; null when unknown.
@@ -72,7 +73,8 @@ class Schema {
   friend class SchemaReader;
 };
 
-// The schema that is built into the server (the files under schema/), parsed on first use. Never null.
+// The schema that is built into the server (the files under schema/), parsed on first use. Never
+// null.
 const Schema& builtin_schema();
 
 // The schema in force for entries of this process (value_find and the schema check use it): the
