@@ -107,6 +107,12 @@ bool apply_options(const Options& options) {
       return false;
     }
   set_local_code_page(options.code_page.empty() ? nullptr : options.code_page.c_str());
+  // The backend sets the converter up too, but cannot say what was wrong.
+  if (initIconvHandle() != 0) {
+    std::fprintf(stderr, "orvd: unknown code page: %s\n",
+                 options.code_page.empty() ? "the one of the locale" : options.code_page.c_str());
+    return false;
+  }
   open_message_catalogue((executable_directory() + "../share/orv/orvd.cat").c_str());
   return true;
 }

@@ -107,6 +107,10 @@ void Server::watch_gate() {
 void Server::wind_up() {
   parts_.logs.info("stopping");
   listeners_.close();
+  // What was cancelled holds sockets that belong to the loops, which end before the control
+  // context.
+  control_.restart();
+  control_.poll();
   services_.stopping.store(true, std::memory_order_relaxed);
   const bool closed = backend_.close(kPatience);
   if (!closed && !backend_.failed()) {

@@ -198,13 +198,17 @@ bool Client::lost_interest(PendingOperation& operation) noexcept {
       ::recv(socket_.native_handle(), bytes, sizeof bytes, MSG_PEEK | MSG_DONTWAIT);
   if (length == 0 || (length < 0 && errno != EAGAIN && errno != EINTR)) {
     operation.answer().abandon();
-  } else if (length > 0) {
-    try {
-      if (gives_up({bytes, static_cast<std::size_t>(length)}, operation.answer().message_id()))
-        operation.answer().abandon();
-    } catch (const std::bad_alloc&) {
-      // It is handled late, then.
+    return true;
+  }
+  const std::int32_t id = operation.answer().message_id();
+  try {
+    // What came in one packet with the operation's own message was read along with it.
+    if (gives_up(unread(), id) ||
+        (length > 0 && gives_up({bytes, static_cast<std::size_t>(length)}, id))) {
+      operation.answer().abandon();
     }
+  } catch (const std::bad_alloc&) {
+    // It is handled late, then.
   }
   return operation.answer().abandoned();
 }
