@@ -122,6 +122,26 @@ int search(const orv::CfgSession& session, const std::string& base, int scope, c
   return orv::cfg_count_entries(session.get(), chain);
 }
 
+// As a server answers a base search: every attribute with its values.
+int search_and_walk(const orv::CfgSession& session, const std::string& base) {
+  orv::_CFGMessage* chain = nullptr;
+  if (orv::cfg_search_s(session.get(), base.c_str(), 0, "objectclass=*", nullptr, 0, &chain) != 0) {
+    fail("a search failed");
+  }
+  const orv::CfgResult owned(chain);
+  orv::_CFGMessage* const entry = orv::cfg_first_entry(session.get(), chain);
+  orv::_CFGBer* walk = nullptr;
+  orv::CfgText name(orv::cfg_first_attribute(session.get(), entry, &walk));
+  const orv::CfgCursor cursor(walk);
+  int attributes = 0;
+  for (; name != nullptr; ++attributes) {
+    const orv::CfgValues values(orv::cfg_get_values(session.get(), entry, name.get()));
+    if (values == nullptr) fail("an attribute has no values");
+    name.reset(orv::cfg_next_attribute(session.get(), entry, walk));
+  }
+  return attributes;
+}
+
 // ---- Measuring ----
 
 struct Figure {
@@ -187,6 +207,7 @@ std::vector<Figure> measure_configuration(const std::string& path, std::size_t e
                                      std::to_string((entries - 2) / 50 * 50) + ",CN=CONFIGURATION";
   const std::string equality =
       "(orv-slapdAdminDN=cn=member-" + last + ",ou=operations,o=example corporation)";
+  const std::string part = "(description=*number " + last + " is*)";
   std::vector<char> memory;
   const auto expect = [](int count, std::size_t expected) {
     if (static_cast<std::size_t>(count) != expected) fail("a search found the wrong entries");
@@ -197,6 +218,8 @@ std::vector<Figure> measure_configuration(const std::string& path, std::size_t e
       {"open + base search",
        [&] { expect(search(open_session(path), base, 0, "objectclass=*"), 1); },
        entries == 10000 ? 3.0 : 0.0},
+      {"open + base search + walk of the entry",
+       [&] { expect(search_and_walk(open_session(path), base), 7); }, 0},
       {"open + subtree search, all entries",
        [&] {
          expect(search(open_session(path), "CN=CONFIGURATION", 2, "(objectclass=*)"), entries);
@@ -210,6 +233,8 @@ std::vector<Figure> measure_configuration(const std::string& path, std::size_t e
        [&] { expect(search(opened, "CN=CONFIGURATION", 2, "(objectclass=*)"), entries); }, 0},
       {"equality filter in an open session",
        [&] { expect(search(opened, "CN=CONFIGURATION", 2, equality.c_str()), 1); }, 0},
+      {"substring filter in an open session",
+       [&] { expect(search(opened, "CN=CONFIGURATION", 2, part.c_str()), 1); }, 0},
   };
   return measure(works, seconds);
 }

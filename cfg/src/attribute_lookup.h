@@ -1,8 +1,9 @@
 // The attribute table as the library itself reads it: besides what cfg/attribute_table.h tells,
-// each type's name in upper case (for normal DNs) and a test that rules out, for nearly every line
-// of a file, that its type is another spelling of a secret.
+// what comparing and recognising names costs least with, and a test that rules out, for nearly
+// every line of a file, that its type is another spelling of a secret.
 #pragma once
 
+#include <array>
 #include <atomic>
 #include <cstdint>
 #include <string>
@@ -13,25 +14,57 @@
 
 namespace orv::cfg {
 
-struct KnownType : AttributeType {
-  std::string upper_name;
+// A set of names that answers "certainly not" for nearly every name that is not in it, from the
+// length, the first and the last character alone and in any letter case.
+class NameFilter {
+ public:
+  void add(std::string_view name) noexcept {
+    const unsigned bit = bit_of(name);
+    bits_[bit / 64] |= std::uint64_t{1} << bit % 64;
+  }
+  [[nodiscard]] bool may_hold(std::string_view name) const noexcept {
+    const unsigned bit = bit_of(name);
+    return (bits_[bit / 64] >> bit % 64 & 1) != 0;
+  }
+
+ private:
+  static unsigned bit_of(std::string_view name) noexcept {
+    if (name.empty()) return 0;
+    const auto folded = [](char c) { return static_cast<unsigned>(c | 0x20) & 0xFF; };
+    return (static_cast<unsigned>(name.size()) * 37 + folded(name.front()) * 11 +
+            folded(name.back())) %
+           256;
+  }
+
+  std::array<std::uint64_t, 4> bits_{};
 };
+
+struct KnownType : AttributeType {
+  std::string upper_name;          // for normal DNs
+  std::uint32_t hash = 0;          // of its name
+  std::uint64_t name_lengths = 0;  // one bit for the length of each of its names, the last: 63 up
+
+  [[nodiscard]] bool may_be_called(std::string_view spelled) const noexcept {
+    return (name_lengths >> (spelled.size() < 63 ? spelled.size() : 63) & 1) != 0;
+  }
+};
+
+// Hash of an attribute's name without regard to letter case.
+std::uint32_t hash_attribute_name(std::string_view name) noexcept;
 
 class AttributeLookup {
  public:
   explicit AttributeLookup(std::vector<AttributeType> types);
 
-  [[nodiscard]] const KnownType* find(std::string_view name_or_oid) const noexcept;
-
-  // One bit for each length, up to 63, that an alias or OID of a secret type has.
-  [[nodiscard]] std::uint64_t secret_alias_lengths() const noexcept {
-    return secret_alias_lengths_;
+  [[nodiscard]] const KnownType* find(std::string_view name_or_oid) const noexcept {
+    return find(name_or_oid, hash_attribute_name(name_or_oid));
   }
+  // As above, for those who have the hash of the name.
+  [[nodiscard]] const KnownType* find(std::string_view name_or_oid,
+                                      std::uint32_t hash) const noexcept;
 
-  // False when no secret type has an alias or OID of this length.
-  [[nodiscard]] bool may_be_secret_alias(std::size_t length) const noexcept {
-    return length >= 64 || (secret_alias_lengths_ >> length & 1) != 0;
-  }
+  // Every alias and OID of a secret type.
+  [[nodiscard]] const NameFilter& secret_aliases() const noexcept { return secret_aliases_; }
 
  private:
   struct Slot {
@@ -45,13 +78,13 @@ class AttributeLookup {
 
   std::vector<KnownType> types_;
   std::vector<Slot> slots_;  // open addressing, a power of two, at most half full
-  std::uint64_t secret_alias_lengths_ = 0;
+  NameFilter secret_aliases_;
 };
 
 // The table in force; valid until the next registration.
 const AttributeLookup& attribute_lookup() noexcept;
 
 // Whether `spelled` is one of the type's names, its OID included.
-bool is_name_of(const AttributeType& type, std::string_view spelled) noexcept;
+bool is_name_of(const KnownType& type, std::string_view spelled) noexcept;
 
 }  // namespace orv::cfg

@@ -1,5 +1,6 @@
 #include "cfg/attribute_table.h"
 
+#include <algorithm>
 #include <bit>
 #include <cstring>
 #include <memory>
@@ -13,27 +14,6 @@
 namespace orv::cfg {
 
 namespace {
-
-// Hash without regard to letter case. Setting bit 5 folds the letters and leaves every other
-// character of an attribute name as it is; equality is checked exactly afterwards.
-std::uint32_t name_hash(std::string_view name) noexcept {
-  constexpr std::uint64_t kFold = 0x2020202020202020U;
-  constexpr std::uint64_t kFactor = 0x9E3779B97F4A7C15U;
-  std::uint64_t hash = name.size();
-  const char* p = name.data();
-  std::size_t left = name.size();
-  for (; left >= 8; p += 8, left -= 8) {
-    std::uint64_t word = 0;
-    std::memcpy(&word, p, 8);
-    hash = (std::rotl(hash, 23) ^ (word | kFold)) * kFactor;
-  }
-  std::uint64_t tail = 0;
-  for (std::size_t i = 0; i < left; ++i) {
-    tail = tail << 8 | static_cast<unsigned char>(p[i]);
-  }
-  hash = (std::rotl(hash, 23) ^ (tail | kFold)) * kFactor;
-  return static_cast<std::uint32_t>(hash >> 32);
-}
 
 std::string upper(std::string_view text) {
   std::string result(text);
@@ -75,13 +55,50 @@ std::atomic<const AttributeLookup*> current{owner().get()};
 
 }  // namespace
 
+// Setting bit 5 folds the letters and leaves every other
+// character of an attribute name as it is; equality is checked exactly afterwards.
+std::uint32_t hash_attribute_name(std::string_view name) noexcept {
+  constexpr std::uint64_t kFold = 0x2020202020202020U;
+  constexpr std::uint64_t kFactor = 0x9E3779B97F4A7C15U;
+  std::uint64_t hash = name.size();
+  const char* p = name.data();
+  std::size_t left = name.size();
+  for (; left >= 8; p += 8, left -= 8) {
+    std::uint64_t word = 0;
+    std::memcpy(&word, p, 8);
+    hash = (std::rotl(hash, 23) ^ (word | kFold)) * kFactor;
+  }
+  std::uint64_t tail = 0;
+  for (std::size_t i = 0; i < left; ++i) {
+    tail = tail << 8 | static_cast<unsigned char>(p[i]);
+  }
+  hash = (std::rotl(hash, 23) ^ (tail | kFold)) * kFactor;
+  return static_cast<std::uint32_t>(hash >> 32);
+}
+
+namespace {
+
+std::uint64_t lengths_of_names(const AttributeType& type) noexcept {
+  const auto bit = [](std::string_view name) {
+    return std::uint64_t{1} << (name.size() < 63 ? name.size() : 63);
+  };
+  std::uint64_t lengths = bit(type.name);
+  if (!type.oid.empty()) lengths |= bit(type.oid);
+  for (const std::string& alias : type.aliases) lengths |= bit(alias);
+  return lengths;
+}
+
+}  // namespace
+
 AttributeLookup::AttributeLookup(std::vector<AttributeType> types) {
   std::size_t names = 0;
   types_.reserve(types.size());
   for (AttributeType& type : types) {
     names += 2 + type.aliases.size();
     std::string upper_name = upper(type.name);
-    types_.push_back(KnownType{std::move(type), std::move(upper_name)});
+    const std::uint32_t hash = hash_attribute_name(type.name);
+    const std::uint64_t lengths = lengths_of_names(type);
+    types_.push_back(KnownType{std::move(type), std::move(upper_name), hash, lengths});
   }
   slots_.resize(std::bit_ceil(names * 2 + 2));
   for (std::uint32_t i = 0; i < types_.size(); ++i) insert(types_[i].name, i);
@@ -93,21 +110,22 @@ AttributeLookup::AttributeLookup(std::vector<AttributeType> types) {
 
 void AttributeLookup::insert(std::string_view name, std::uint32_t type) noexcept {
   if (name.empty() || find(name) != nullptr) return;
-  const std::uint32_t hash = name_hash(name);
+  const std::uint32_t hash = hash_attribute_name(name);
   std::size_t at = hash & (slots_.size() - 1);
   while (slots_[at].type != kFree) at = (at + 1) & (slots_.size() - 1);
   slots_[at] = Slot{hash, type, name};
   if (types_[type].secret && !equals_ignore_ascii_case(name, types_[type].name)) {
-    secret_alias_lengths_ |= std::uint64_t{1} << (name.size() < 64 ? name.size() : 63);
+    secret_aliases_.add(name);
   }
 }
 
-const KnownType* AttributeLookup::find(std::string_view name) const noexcept {
-  const std::uint32_t hash = name_hash(name);
+const KnownType* AttributeLookup::find(std::string_view name, std::uint32_t hash) const noexcept {
   for (std::size_t at = hash & (slots_.size() - 1); slots_[at].type != kFree;
        at = (at + 1) & (slots_.size() - 1)) {
     const Slot& slot = slots_[at];
-    if (slot.hash == hash && equals_ignore_ascii_case(slot.name, name)) return &types_[slot.type];
+    if (slot.hash == hash && (slot.name == name || equals_ignore_ascii_case(slot.name, name))) {
+      return &types_[slot.type];
+    }
   }
   return nullptr;
 }
@@ -129,13 +147,13 @@ const AttributeType* find_attribute_type(std::string_view name_or_oid) noexcept 
   return attribute_lookup().find(name_or_oid);
 }
 
-bool is_name_of(const AttributeType& type, std::string_view spelled) noexcept {
-  if (equals_ignore_ascii_case(type.name, spelled)) return true;
+bool is_name_of(const KnownType& type, std::string_view spelled) noexcept {
+  if (!type.may_be_called(spelled)) return false;
+  if (type.name == spelled || equals_ignore_ascii_case(type.name, spelled)) return true;
   if (equals_ignore_ascii_case(type.oid, spelled)) return true;
-  for (const std::string& alias : type.aliases) {
-    if (equals_ignore_ascii_case(alias, spelled)) return true;
-  }
-  return false;
+  return std::any_of(type.aliases.begin(), type.aliases.end(), [spelled](const std::string& alias) {
+    return equals_ignore_ascii_case(alias, spelled);
+  });
 }
 
 }  // namespace orv::cfg

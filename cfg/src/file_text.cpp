@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <sched.h>
+#include <sys/mman.h>
 #include <sys/stat.h>
 
 #include <array>
@@ -48,22 +49,51 @@ void RecycledMemory::reserve(std::size_t bytes, std::size_t used) {
     capacity_ = spare.capacity;
     if (bytes <= capacity_) return;
   }
-  if (used == 0) {
-    // Nothing to keep: realloc would copy for nothing.
-    std::free(std::exchange(data_, nullptr));
-    capacity_ = 0;
-  }
+  if (bytes > max_kept(kind_)) return reserve_mapped(bytes, used);
+  // Nothing to keep: realloc would copy for nothing.
+  if (used == 0) free_block();
   void* const grown = std::realloc(data_, bytes);
   if (grown == nullptr) throw std::bad_alloc();
   data_ = grown;
   capacity_ = bytes;
 }
 
+// A block of the C library's would go back to its own store, and stay there.
+void RecycledMemory::reserve_mapped(std::size_t bytes, std::size_t used) {
+  if (used == 0) free_block();
+  void* grown = MAP_FAILED;
+  if (is_mapped()) {
+    grown = ::mremap(data_, capacity_, bytes, MREMAP_MAYMOVE);
+    if (grown == MAP_FAILED) throw std::bad_alloc();
+  } else {
+    grown = ::mmap(nullptr, bytes, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+    if (grown == MAP_FAILED) throw std::bad_alloc();
+    // Few large pages cost less than many small ones; it does without if there are none.
+    ::madvise(grown, bytes, MADV_HUGEPAGE);
+    if (used > 0) std::memcpy(grown, data_, used);
+    free_block();
+  }
+  data_ = grown;
+  capacity_ = bytes;
+}
+
+void RecycledMemory::free_block() noexcept {
+  if (is_mapped()) {
+    ::munmap(data_, capacity_);
+  } else {
+    std::free(data_);
+  }
+  data_ = nullptr;
+  capacity_ = 0;
+}
+
 void RecycledMemory::release() noexcept {
-  Block mine{std::exchange(data_, nullptr), std::exchange(capacity_, 0)};
   Block& spare = spare_blocks.blocks[static_cast<std::size_t>(kind_)];
-  if (mine.capacity > spare.capacity && mine.capacity <= kMaxKept) std::swap(mine, spare);
-  std::free(mine.data);
+  if (!is_mapped() && capacity_ > spare.capacity) {
+    std::swap(spare.data, data_);
+    std::swap(spare.capacity, capacity_);
+  }
+  free_block();
 }
 
 // ---- File ----

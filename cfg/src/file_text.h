@@ -11,13 +11,17 @@ namespace orv::cfg {
 
 // Memory that one thread uses again and again: each operation of a server reads the configuration
 // anew, and fresh pages for it would cost more than reading it. Each thread keeps at most one block
-// of each kind, and none that is larger than `kMaxKept`. A block may be released by another thread
-// than the one that obtained it.
+// of each kind, and none that is larger than `max_kept`; larger ones come from the system and go
+// back to it at once. A block may be released by another thread than the one that obtained it.
 enum class MemoryKind { text, entries, table };
 
 class RecycledMemory {
  public:
-  static constexpr std::size_t kMaxKept = std::size_t{64} << 20;
+  // A configuration of 10,000 entries fits.
+  static constexpr std::size_t max_kept(MemoryKind kind) noexcept {
+    constexpr std::size_t kKilobyte = 1024;
+    return kind == MemoryKind::text ? 5 * 1024 * kKilobyte : 256 * kKilobyte;
+  }
 
   explicit RecycledMemory(MemoryKind kind) noexcept : kind_(kind) {}
   ~RecycledMemory() { release(); }
@@ -32,6 +36,10 @@ class RecycledMemory {
   [[nodiscard]] std::size_t capacity() const noexcept { return capacity_; }
 
  private:
+  [[nodiscard]] bool is_mapped() const noexcept { return capacity_ > max_kept(kind_); }
+  void reserve_mapped(std::size_t bytes, std::size_t used);
+  void free_block() noexcept;
+
   MemoryKind kind_;
   void* data_ = nullptr;
   std::size_t capacity_ = 0;

@@ -221,7 +221,7 @@ class FilterParser {
     Node& item = nodes_[node];
     item.dn_too = dn_too;
     item.rule = item.type.equality();
-    if (has_rule && !find_matching_rule(rule, item.rule)) item.kind = Kind::undefined;
+    if (has_rule && !find_filter_rule(rule, item.rule)) item.kind = Kind::undefined;
     set_assertion(item, item.rule, value);
     return true;
   }

@@ -8,9 +8,9 @@
 #include <variant>
 #include <vector>
 
+#include "assertion.h"
 #include "attribute_lookup.h"
 #include "ldif_index.h"
-#include "matching.h"
 
 namespace orv::cfg {
 

@@ -5,7 +5,10 @@
 
 #include <cerrno>
 #include <cstring>
+#include <ctime>
+#include <mutex>
 #include <new>
+#include <utility>
 
 #include "cfg/result_codes.h"
 #include "cfg/secret.h"
@@ -102,10 +105,10 @@ bool write_line(int file, const Line& line) noexcept {
   return ::fsync(file) == 0;
 }
 
-int load(const char* path, KeyPtr& key, std::string& why) {
+// `status` receives the file's status from before it was read.
+int load(const char* path, struct stat& status, KeyPtr& key, std::string& why) {
   const FileDescriptor file(::open(path, O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
   if (!file.is_open()) return refuse_errno(path, "the key stash cannot be opened", why);
-  struct stat status {};
   if (::fstat(file.get(), &status) != 0) {
     return refuse_errno(path, "the key stash cannot be examined", why);
   }
@@ -121,6 +124,63 @@ int load(const char* path, KeyPtr& key, std::string& why) {
   wipe(bytes.data(), bytes.size());
   if (!good) return refuse(path, "the key stash does not hold a key", why);
   return key != nullptr ? result::success : result::no_memory;
+}
+
+// ---- The key read last ----
+
+bool is_same(const timespec& a, const timespec& b) noexcept {
+  return a.tv_sec == b.tv_sec && a.tv_nsec == b.tv_nsec;
+}
+
+// Whether a file with these two statuses cannot have been changed, or replaced, in between.
+bool is_same_file(const struct stat& a, const struct stat& b) noexcept {
+  return a.st_ino == b.st_ino && a.st_dev == b.st_dev && a.st_size == b.st_size &&
+         a.st_mode == b.st_mode && a.st_uid == b.st_uid && is_same(a.st_mtim, b.st_mtim) &&
+         is_same(a.st_ctim, b.st_ctim);
+}
+
+// Whether the file was changed so lately that another change might leave it the same times. A time
+// in the future tells nothing.
+bool is_fresh(const struct stat& status) noexcept {
+  timespec now{};
+  ::clock_gettime(CLOCK_REALTIME, &now);
+  return now.tv_sec < status.st_ctim.tv_sec + 2;
+}
+
+class LastKey {
+ public:
+  SharedKey find(const struct stat& status) {
+    const std::lock_guard lock(mutex_);
+    return key_ != nullptr && is_same_file(status, status_) ? key_ : nullptr;
+  }
+
+  // Null forgets the key.
+  void keep(SharedKey key, const struct stat& status) {
+    const std::lock_guard lock(mutex_);
+    key_.swap(key);
+    status_ = status;
+  }
+
+ private:
+  std::mutex mutex_;
+  SharedKey key_;
+  struct stat status_ {};  // of the file it was read from
+};
+
+LastKey last_key;
+
+int share(const char* path, SharedKey& key, std::string& why) {
+  struct stat status {};
+  if (::stat(path, &status) == 0 && distrust(status) == nullptr) {
+    key = last_key.find(status);
+    if (key != nullptr) return result::success;
+  }
+  KeyPtr loaded;
+  const int rc = load(path, status, loaded, why);
+  SharedKey shared(std::move(loaded));
+  last_key.keep(rc == result::success && !is_fresh(status) ? shared : nullptr, status);
+  if (rc == result::success) key = std::move(shared);
+  return rc;
 }
 
 int create(const char* path, std::string& why) {
@@ -149,7 +209,14 @@ void KeyDeleter::operator()(const Key* key) const noexcept {
 
 int load_key_stash(const char* path, KeyPtr& key, std::string& why) noexcept try {
   if (path == nullptr) return refuse("", "no key stash is named", why);
-  return load(path, key, why);
+  struct stat status {};
+  return load(path, status, key, why);
+} catch (...) {
+  return result::no_memory;
+}
+
+int share_key_stash(const char* path, SharedKey& key, std::string& why) noexcept try {
+  return share(path, key, why);
 } catch (...) {
   return result::no_memory;
 }

@@ -1,6 +1,7 @@
 #include "ldif_index.h"
 
 #include <algorithm>
+#include <array>
 #include <cstring>
 #include <utility>
 
@@ -15,6 +16,8 @@ namespace orv::cfg {
 
 std::string_view LdifIndex::dn(std::uint32_t entry, std::string& scratch) const {
   LineReader reader = lines(entry);
+  std::string_view plain;
+  if (reader.pass_plain_dn(plain)) return plain;
   AttributeLine line;
   reader.next(line);
   if (line.kind == ValueKind::plain && !line.folded) {
@@ -35,8 +38,10 @@ std::size_t LdifIndex::line(std::uint32_t entry) const noexcept {
 
 bool LdifIndex::has_dn(std::uint32_t entry, std::string_view normal_dn) const {
   std::string scratch;
+  const std::string_view spelled = dn(entry, scratch);
+  if (spelled == normal_dn) return true;
   std::string normal;
-  return normalize(dn(entry, scratch), DnText::any_code_page, normal) && normal == normal_dn;
+  return normalize(spelled, DnText::any_code_page, normal) && normal == normal_dn;
 }
 
 std::uint32_t LdifIndex::find(std::string_view normal_dn, std::uint32_t hash) const {
@@ -183,8 +188,8 @@ class LdifIndex::Builder {
   }
 
  private:
-  // What is known of the DN read last and of its parent, so that brothers and first children,
-  // nearly all entries of a file, need no more than their own RDN looked at.
+  // What is known of the DN read last and of those above it, so that an entry below one of them,
+  // which nearly all entries of a file are, needs no more than its own RDN looked at.
   struct Neighbour {
     std::string_view dn;  // as spelled, in the text; empty when there is none
     std::uint32_t entry = kNone;
@@ -197,6 +202,13 @@ class LdifIndex::Builder {
   }
 
   [[nodiscard]] bool at_end() const noexcept { return reader_.position() >= text_.end(); }
+
+  // The types that have to be looked at: those with a meaning of their own, and secrets.
+  static NameFilter special_names(const AttributeLookup& lookup) noexcept {
+    NameFilter names = lookup.secret_aliases();
+    for (const std::string_view name : {kDn, kChangeType, kControl}) names.add(name);
+    return names;
+  }
 
   // -- Refusals --
 
@@ -299,8 +311,10 @@ class LdifIndex::Builder {
   }
 
   bool read_attributes(const char* entry_at) {
-    const std::uint64_t lengths = lengths_to_check_;
-    const auto plain = [lengths](std::string_view type) { return needs_no_check(type, lengths); };
+    const NameFilter special = special_names_;
+    const auto plain = [&special](std::string_view type) {
+      return is_ascii_letter(type.front()) && !special.may_hold(type);
+    };
     std::size_t attributes = 0;
     AttributeLine line;
     while (true) {
@@ -323,12 +337,6 @@ class LdifIndex::Builder {
     last_line_is_comment_ = *p == '#';
   }
 
-  // Whether a type of letters, digits and hyphens cannot be one of those that are looked at below:
-  // none of them has this length.
-  static bool needs_no_check(std::string_view type, std::uint64_t lengths) noexcept {
-    return type.size() < 64 && (lengths >> type.size() & 1) == 0 && is_ascii_letter(type.front());
-  }
-
   bool check_line(const char* at, const AttributeLine& line, bool first) {
     if (!check_type(at, line)) return false;
     if (is_name(line.type, kDn)) return refuse(line_start(at), kSecondDn);
@@ -344,7 +352,7 @@ class LdifIndex::Builder {
       if (option != std::string_view::npos) return refuse(line_start(at) + option, kOption);
       return refuse(line_start(at), kBadName);
     }
-    if (!lookup_.may_be_secret_alias(line.type.size())) return true;
+    if (!lookup_.secret_aliases().may_hold(line.type)) return true;
     const KnownType* known = lookup_.find(line.type);
     if (known != nullptr && known->secret && !equals_ignore_ascii_case(known->name, line.type)) {
       return refuse(line_start(at), kSecretSpelling);
@@ -411,8 +419,8 @@ class LdifIndex::Builder {
     Entry entry{static_cast<std::uint32_t>(at - text_.begin()), 0, kNone};
     Neighbour parent;
     if (plain && index_.size_ > 0 && dn.size() <= kMaxDnLength && read_plain_rdn(dn, rdn_) &&
-        find_neighbour(rdn_, parent)) {
-      if (rdn_.type != nullptr && rdn_.type->secret) return refuse(dn_at, kSecretInDn);
+        find_parent_on_path(rdn_, parent)) {
+      if (is_secret(rdn_.type)) return refuse(dn_at, kSecretInDn);
       entry.parent = parent.entry;
       entry.hash = combine_dn_hash(index_.entries()[parent.entry].hash,
                                    std::string_view(rdn_.normal, rdn_.length));
@@ -424,21 +432,32 @@ class LdifIndex::Builder {
       return refuse(dn_at, "line " + std::to_string(index_.line(existing)) +
                                " has an entry with the same DN");
     }
-    previous_ = Neighbour{plain ? dn : std::string_view(), index_.size_ - 1, parent.depth + 1};
-    previous_parent_ = parent;
+    extend_path(parent, {plain ? dn : std::string_view(), index_.size_ - 1, parent.depth + 1});
     return true;
   }
 
-  bool find_neighbour(const LeadingRdn& rdn, Neighbour& parent) const noexcept {
+  // Shortens the path to the parent when it is there.
+  bool find_parent_on_path(const LeadingRdn& rdn, Neighbour& parent) noexcept {
     if (rdn.last || rdn.rest.empty()) return false;
-    if (rdn.rest == previous_parent_.dn) {
-      parent = previous_parent_;
-    } else if (rdn.rest == previous_.dn) {
-      parent = previous_;
-    } else {
-      return false;
+    for (std::size_t i = path_length_; i-- > 0;) {
+      if (path_[i].dn != rdn.rest || path_[i].depth >= kMaxRdns) continue;
+      parent = path_[i];
+      path_length_ = i + 1;
+      return true;
     }
-    return parent.depth < kMaxRdns;
+    return false;
+  }
+
+  // Puts an entry behind its parent, with which a path begins anew that does not end there or is
+  // too long.
+  void extend_path(const Neighbour& parent, const Neighbour& entry) noexcept {
+    const bool goes_on = path_length_ > 0 && path_length_ < path_.size() &&
+                         path_[path_length_ - 1].entry == parent.entry;
+    if (!goes_on) {
+      path_[0] = parent;
+      path_length_ = 1;
+    }
+    path_[path_length_++] = entry;
   }
 
   // The long way: the whole DN in normal form.
@@ -446,7 +465,12 @@ class LdifIndex::Builder {
     std::string normal;
     if (!normalize(dn, DnText::any_code_page, normal)) return refuse(dn_at, kBadDn);
     if (normal.empty()) return refuse(dn_at, kEmptyDn);
-    if (names_secret(dn)) return refuse(dn_at, kSecretInDn);
+    LeadingRdn rdn;
+    const bool plain = read_plain_rdn(dn, rdn);
+    // What is above any other entry was looked at with its parent.
+    const bool leading_is_enough = plain && index_.size_ > 0;
+    if (leading_is_enough ? is_secret(rdn.type) : names_secret(dn))
+      return refuse(dn_at, kSecretInDn);
     const std::string_view above = parent_of_normal_dn(normal);
     const std::uint32_t above_hash = hash_normal_dn(above);
     entry.hash =
@@ -460,8 +484,7 @@ class LdifIndex::Builder {
       if (index_.find(normal, entry.hash) == kNone) return refuse(dn_at, kNoParent);
     }
     parent.entry = entry.parent;
-    LeadingRdn rdn;
-    if (is_in_text(dn) && read_plain_rdn(dn, rdn) && !rdn.last) parent.dn = rdn.rest;
+    if (plain && is_in_text(dn) && !rdn.last) parent.dn = rdn.rest;
     return true;
   }
 
@@ -471,14 +494,19 @@ class LdifIndex::Builder {
     return depth;
   }
 
-  // Everybody who may search sees DNs.
+  static bool is_secret(const KnownType* type) noexcept { return type != nullptr && type->secret; }
+
+  // Everybody who may search sees DNs. All of it counts: what is above the first entry is in none
+  // of its own.
   bool names_secret(std::string_view dn) const {
     Dn parsed;
-    if (!parse(dn, DnText::any_code_page, parsed) || parsed.empty()) return false;
-    return std::any_of(parsed.front().begin(), parsed.front().end(), [this](const Ava& ava) {
-      const KnownType* known = lookup_.find(ava.type);
-      return known != nullptr && known->secret;
-    });
+    if (!parse(dn, DnText::any_code_page, parsed)) return false;
+    for (const Rdn& rdn : parsed) {
+      for (const Ava& ava : rdn) {
+        if (is_secret(lookup_.find(ava.type))) return true;
+      }
+    }
+    return false;
   }
 
   LdifIndex& index_;
@@ -488,14 +516,11 @@ class LdifIndex::Builder {
   const AttributeLookup& lookup_;
   LineReader reader_;
   const char* checked_ = start_;  // up to here no forbidden byte
-  // One bit for each length of a type that has to be looked at.
-  const std::uint64_t lengths_to_check_ =
-      std::uint64_t{1} | std::uint64_t{1} << kDn.size() | std::uint64_t{1} << kChangeType.size() |
-      std::uint64_t{1} << kControl.size() | lookup_.secret_alias_lengths();
+  const NameFilter special_names_ = special_names(lookup_);
   LeadingRdn rdn_;  // of the DN read last
   bool last_line_is_comment_ = false;
-  Neighbour previous_;
-  Neighbour previous_parent_;
+  std::array<Neighbour, 8> path_;  // from some entry down to the one read last
+  std::size_t path_length_ = 0;
 };
 
 bool LdifIndex::build(const FileText& text, FileFault& fault) {

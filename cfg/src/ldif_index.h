@@ -49,6 +49,10 @@ class LdifIndex {
     return {text_->begin() + entries()[entry].offset, text_->end()};
   }
 
+  // The text that the index is of.
+  [[nodiscard]] const char* text_begin() const noexcept { return text_->begin(); }
+  [[nodiscard]] const char* text_end() const noexcept { return text_->end(); }
+
   // The DN as spelled; points into the text or into `scratch`.
   std::string_view dn(std::uint32_t entry, std::string& scratch) const;
 

@@ -150,15 +150,22 @@ class LineReader {
     return true;
   }
 
-  // Passes the lines of the plainest kind that follow, not folded and their value in clear, as long
-  // as `accept` wants their type; the result is their number. Nearly all lines of a file need no
-  // more. Works on copies of the reader's state, which the compiler keeps in registers.
+  // Passes comments and the lines of the plainest kind that follow, not folded and their value in
+  // clear, as long as `accept` wants their type; the result is the number of the latter. Nearly all
+  // lines of a file need no more. Works on copies of the reader's state, which the compiler keeps
+  // in registers.
   template <class Accept>
   std::size_t pass_plain_lines(Accept accept) noexcept {
     Newlines newlines = newlines_;
     const char* at = at_;
     std::size_t count = 0;
-    for (; at < end_; ++count) {
+    while (at < end_) {
+      if (*at == '#') {
+        do {
+          at = newlines.next() + 1;
+        } while (at < end_ && *at == ' ');
+        continue;
+      }
       Newlines ahead = newlines;
       const char* const newline = ahead.next();
       const char* const colon = skip_name(at);
@@ -166,6 +173,7 @@ class LineReader {
       if (!accept(std::string_view(at, static_cast<std::size_t>(colon - at)))) break;
       newlines = ahead;
       at = newline + 1;
+      ++count;
     }
     newlines_ = newlines;
     at_ = at;

@@ -1,9 +1,11 @@
-#include "matching.h"
+#include "cfg/matching.h"
 
 #include <algorithm>
 #include <cstdint>
 #include <optional>
 
+#include "assertion.h"
+#include "cfg/result_codes.h"
 #include "cfg/text.h"
 #include "characters.h"
 #include "dn_text.h"
@@ -11,7 +13,7 @@
 
 namespace orv::cfg {
 
-// ---- Preparation by rule ----
+// ---- Canonical values ----
 
 namespace {
 
@@ -169,9 +171,9 @@ std::string canonical_object_identifier(std::string_view value) {
   return text;
 }
 
-// The form in which two values are equal exactly when their bytes are; nothing when the value is
-// not of the rule's syntax.
-std::optional<std::string> canonical(MatchingRule rule, std::string_view value) {
+}  // namespace
+
+std::optional<std::string> canonical_form(MatchingRule rule, std::string_view value) {
   switch (rule) {
     case MatchingRule::case_ignore:
       return prepared_text(value, LetterCase::folded);
@@ -195,162 +197,29 @@ std::optional<std::string> canonical(MatchingRule rule, std::string_view value) 
   return std::nullopt;
 }
 
-enum class Quick { equal, unequal, undecided };
-
-// Compares without a copy as far as the stored value is ASCII; `prepared` is.
-Quick equals_quickly(std::string_view stored, std::string_view prepared) noexcept {
-  const std::string_view text = trim_blanks(stored);
-  std::size_t at = 0;
-  for (std::size_t i = 0; i < text.size(); ++i, ++at) {
-    if (text[i] == ' ') {
-      while (text[i + 1] == ' ') ++i;
-      if (!is_ascii(text[i + 1])) return Quick::undecided;
-    }
-    if (!is_ascii(text[i])) return Quick::undecided;
-    if (at == prepared.size() || ascii_upper(text[i]) != prepared[at]) return Quick::unequal;
-  }
-  return at == prepared.size() ? Quick::equal : Quick::unequal;
-}
-
-int compare_integers(std::string_view a, std::string_view b) noexcept {
-  const bool negative_a = a.front() == '-';
-  const bool negative_b = b.front() == '-';
-  if (negative_a != negative_b) return negative_a ? -1 : 1;
-  const int magnitudes = a.size() != b.size() ? (a.size() < b.size() ? -1 : 1) : a.compare(b);
-  return negative_a ? -magnitudes : magnitudes;
-}
-
-}  // namespace
-
-// ---- Equality and order ----
-
-Assertion::Assertion(MatchingRule rule, std::string_view value) : rule_(rule) {
-  std::optional<std::string> prepared = canonical(rule, value);
-  if (!prepared) return;
-  valid_ = true;
-  prepared_ = std::move(*prepared);
-  ascii_ = is_all_ascii(prepared_);
-}
-
-bool Assertion::equals(std::string_view stored) const {
-  if (rule_ == MatchingRule::octets) return stored == prepared_;
-  if (rule_ == MatchingRule::object_identifier) {
-    return equals_ignore_ascii_case(trim_blanks(stored), prepared_);
-  }
-  if (rule_ == MatchingRule::case_ignore && ascii_) {
-    const Quick quick = equals_quickly(stored, prepared_);
-    if (quick != Quick::undecided) return quick == Quick::equal;
-  }
-  const std::optional<std::string> other = canonical(rule_, stored);
-  return other && *other == prepared_;
-}
-
-Assertion::Order Assertion::order_of(std::string_view stored) const {
-  const std::optional<std::string> other = canonical(rule_, stored);
-  if (!other) return Order::unordered;
-  const int order = rule_ == MatchingRule::integer ? compare_integers(*other, prepared_)
-                                                   : other->compare(prepared_);
-  if (order == 0) return Order::same;
-  return order < 0 ? Order::below : Order::above;
-}
-
-bool Assertion::stored_is_at_least(std::string_view stored) const {
-  const Order order = order_of(stored);
-  return order == Order::same || order == Order::above;
-}
-
-bool Assertion::stored_is_at_most(std::string_view stored) const {
-  const Order order = order_of(stored);
-  return order == Order::same || order == Order::below;
-}
-
-// ---- Substrings ----
-
-namespace {
-
-// Where a part of a substring assertion stands.
-struct Anchors {
-  bool start;
-  bool end;
-};
-
-// Insignificant blanks of RFC 4518, 2.6.1: one at each end of a whole value, two between its words,
-// so that a part may begin or end with a blank at either side of the same gap.
-std::string spaced(std::string_view text, Anchors anchors) {
-  const std::string_view words = trim_blanks(text);
-  if (words.empty()) return " ";
-  std::string result;
-  if (anchors.start || text.front() == ' ') result += ' ';
-  for (const char c : words) {
-    if (c == ' ' && result.size() >= 2 && result.compare(result.size() - 2, 2, "  ") == 0) continue;
-    result += c;
-    if (c == ' ') result += ' ';
-  }
-  if (anchors.end || text.back() == ' ') result += ' ';
-  return result;
-}
-
-std::string substring_form(MatchingRule rule, std::string_view value, Anchors anchors) {
-  switch (rule) {
-    case MatchingRule::octets:
-      return std::string(value);
-    case MatchingRule::telephone_number:
-      return canonical_telephone(value);
-    case MatchingRule::case_exact:
-      return spaced(prepare(value, LetterCase::kept), anchors);
-    default:
-      return spaced(prepare(value, LetterCase::folded), anchors);
-  }
-}
-
-bool has_substring_form(MatchingRule rule) noexcept {
-  return rule == MatchingRule::case_ignore || rule == MatchingRule::case_exact ||
-         rule == MatchingRule::octets || rule == MatchingRule::telephone_number;
-}
-
-}  // namespace
-
-SubstringAssertion::SubstringAssertion(MatchingRule rule, const std::vector<std::string>& parts,
-                                       bool initial, bool final)
-    : rule_(rule), valid_(has_substring_form(rule)), initial_(initial), final_(final) {
-  if (!valid_) return;
-  for (std::size_t i = 0; i < parts.size(); ++i) {
-    const Anchors anchors{initial && i == 0, final && i + 1 == parts.size()};
-    parts_.push_back(substring_form(rule, parts[i], anchors));
-  }
-}
-
-bool SubstringAssertion::matches(std::string_view stored) const {
-  const std::string value = substring_form(rule_, stored, {true, true});
-  std::string_view rest = value;
-  std::size_t first = 0;
-  std::size_t last = parts_.size();
-  if (initial_ && first < last) {
-    const std::string& part = parts_[first++];
-    if (rest.substr(0, part.size()) != part) return false;
-    rest.remove_prefix(part.size());
-  }
-  if (final_ && first < last) {
-    const std::string& part = parts_[--last];
-    if (rest.size() < part.size() || rest.substr(rest.size() - part.size()) != part) return false;
-    rest.remove_suffix(part.size());
-  }
-  for (; first < last; ++first) {
-    const std::size_t found = rest.find(parts_[first]);
-    if (found == std::string_view::npos) return false;
-    rest.remove_prefix(found + parts_[first].size());
-  }
-  return true;
+int canonical_value(MatchingRule rule, std::string_view value, std::string& canonical) noexcept
+    try {
+  std::optional<std::string> form = canonical_form(rule, value);
+  if (!form) return result::invalid_attribute_syntax;
+  canonical = std::move(*form);
+  return result::success;
+} catch (...) {
+  return result::no_memory;
 }
 
 // ---- Names of matching rules ----
 
 namespace {
 
+// Whether a filter may name the rule. Not if its own comparison differs from the one that values of
+// the type get here: a rule for first components asserts a part of the value.
+enum class InFilters { no, yes };
+
 struct RuleName {
   std::string_view name;
   std::string_view oid;
   MatchingRule rule;
+  InFilters in_filters = InFilters::yes;
 };
 
 constexpr RuleName kRules[] = {
@@ -358,25 +227,46 @@ constexpr RuleName kRules[] = {
     {"distinguishedNameMatch", "2.5.13.1", MatchingRule::distinguished_name},
     {"caseIgnoreMatch", "2.5.13.2", MatchingRule::case_ignore},
     {"caseExactMatch", "2.5.13.5", MatchingRule::case_exact},
+    {"numericStringMatch", "2.5.13.8", MatchingRule::telephone_number, InFilters::no},
+    {"caseIgnoreListMatch", "2.5.13.11", MatchingRule::case_ignore, InFilters::no},
     {"booleanMatch", "2.5.13.13", MatchingRule::boolean},
     {"integerMatch", "2.5.13.14", MatchingRule::integer},
+    {"bitStringMatch", "2.5.13.16", MatchingRule::octets, InFilters::no},
     {"octetStringMatch", "2.5.13.17", MatchingRule::octets},
     {"telephoneNumberMatch", "2.5.13.20", MatchingRule::telephone_number},
+    {"uniqueMemberMatch", "2.5.13.23", MatchingRule::distinguished_name, InFilters::no},
     {"generalizedTimeMatch", "2.5.13.27", MatchingRule::generalized_time},
+    {"integerFirstComponentMatch", "2.5.13.29", MatchingRule::case_ignore, InFilters::no},
+    {"objectIdentifierFirstComponentMatch", "2.5.13.30", MatchingRule::case_ignore, InFilters::no},
+    {"directoryStringFirstComponentMatch", "2.5.13.31", MatchingRule::case_ignore, InFilters::no},
     {"caseExactIA5Match", "1.3.6.1.4.1.1466.109.114.1", MatchingRule::case_exact},
     {"caseIgnoreIA5Match", "1.3.6.1.4.1.1466.109.114.2", MatchingRule::case_ignore},
+    {"UUIDMatch", "1.3.6.1.1.16.2", MatchingRule::case_ignore, InFilters::no},
 };
+
+const RuleName* find_rule_name(std::string_view name_or_oid) noexcept {
+  for (const RuleName& known : kRules) {
+    if (equals_ignore_ascii_case(known.name, name_or_oid) || known.oid == name_or_oid) {
+      return &known;
+    }
+  }
+  return nullptr;
+}
 
 }  // namespace
 
 bool find_matching_rule(std::string_view name_or_oid, MatchingRule& rule) noexcept {
-  for (const RuleName& known : kRules) {
-    if (equals_ignore_ascii_case(known.name, name_or_oid) || known.oid == name_or_oid) {
-      rule = known.rule;
-      return true;
-    }
-  }
-  return false;
+  const RuleName* const known = find_rule_name(name_or_oid);
+  if (known == nullptr) return false;
+  rule = known->rule;
+  return true;
+}
+
+bool find_filter_rule(std::string_view name_or_oid, MatchingRule& rule) noexcept {
+  const RuleName* const known = find_rule_name(name_or_oid);
+  if (known == nullptr || known->in_filters == InFilters::no) return false;
+  rule = known->rule;
+  return true;
 }
 
 }  // namespace orv::cfg

@@ -1,9 +1,7 @@
 // Result chains: walking the entries that a search found, their attributes and values.
 #include <cstdlib>
 #include <cstring>
-#include <forward_list>
 #include <new>
-#include <unordered_set>
 #include <utility>
 
 #include "cfg/result_codes.h"
@@ -13,16 +11,14 @@
 
 namespace orv {
 
-// The attribute names of one entry, collected when the walk begins.
+// Where a walk over the attributes of an entry stands. The entry's record may be gone by then.
 // NOLINTNEXTLINE(bugprone-reserved-identifier): the name is part of the interface
 struct _CFGBer {
-  struct Name {
-    const cfg::KnownType* known;
-    std::string_view text;  // canonical, or as first spelled when unknown
-  };
-  std::vector<Name> names;
-  std::size_t next = 0;
-  std::forward_list<std::string> copies;  // of names whose line is folded within them
+  cfg::Session* session;
+  std::uint32_t entry;
+  std::uint32_t next;  // the attribute to give out
+  bool chooses;        // only some of the attributes were asked for: those in `chosen`
+  std::vector<std::uint32_t> chosen;
 };
 
 }  // namespace orv
@@ -123,93 +119,19 @@ char* copy_text(std::string_view text) {
   return copy;
 }
 
-// Collects each type of an entry once, in the order of first appearance.
-class NameCollector {
+// The values of one attribute; whoever does not take them loses them with it.
+class ValueList {
  public:
-  explicit NameCollector(_CFGBer& cursor) noexcept : cursor_(cursor) {}
-
-  void add(const LdifIndex& index, const Record& record) {
-    LineReader reader = index.lines(record.entry);
-    AttributeLine line;
-    reader.next(line);
-    std::string_view last;
-    while (true) {
-      const char* const at = reader.position();
-      if (!reader.next(line)) break;
-      // Values of one attribute mostly follow one another.
-      if (line.type == last) continue;
-      const bool in_text = line.type.data() >= at && line.type.data() < reader.position();
-      last = in_text ? line.type : std::string_view();
-      add(record.chain->selection, line.type, in_text);
-    }
+  explicit ValueList(std::uint32_t capacity)
+      : values_(static_cast<char**>(std::malloc((std::size_t{capacity} + 1) * sizeof(char*)))) {
+    if (values_ == nullptr) throw std::bad_alloc();
+    values_[0] = nullptr;
   }
-
- private:
-  void add(const Selection& selection, std::string_view spelled, bool in_text) {
-    const KnownType* const known = attribute_lookup().find(spelled);
-    if (!selection.has(known, spelled) || has(known, spelled)) return;
-    std::string_view text = spelled;
-    if (known != nullptr) {
-      text = known->name;
-    } else if (!in_text) {
-      text = cursor_.copies.emplace_front(spelled);
-    }
-    cursor_.names.push_back({known, text});
-    if (!seen_.empty() || cursor_.names.size() > kScanned) remember();
-  }
-
-  // A scan does for usual entries; one with very many types gets a set.
-  bool has(const KnownType* known, std::string_view spelled) const {
-    if (!seen_.empty()) return seen_.count(key(known, spelled)) != 0;
-    for (const _CFGBer::Name& name : cursor_.names) {
-      if (known != nullptr
-              ? name.known == known
-              : name.known == nullptr && equals_ignore_ascii_case(name.text, spelled)) {
-        return true;
-      }
-    }
-    return false;
-  }
-
-  static std::string key(const KnownType* known, std::string_view spelled) {
-    std::string text(known != nullptr ? std::string_view(known->name) : spelled);
-    for (char& c : text) c = ascii_lower(c);
-    return text;
-  }
-
-  void remember() {
-    for (; remembered_ < cursor_.names.size(); ++remembered_) {
-      const _CFGBer::Name& name = cursor_.names[remembered_];
-      seen_.insert(key(name.known, name.text));
-    }
-  }
-
-  static constexpr std::size_t kScanned = 64;
-  _CFGBer& cursor_;
-  std::unordered_set<std::string> seen_;
-  std::size_t remembered_ = 0;
-};
-
-// Collects the values of one attribute; whoever does not take them loses them with it.
-class ValueCollector {
- public:
-  ValueCollector() = default;
-  ~ValueCollector() { cfg_value_free(values_); }
-  ValueCollector(const ValueCollector&) = delete;
-  ValueCollector& operator=(const ValueCollector&) = delete;
-
-  void reserve_one() {
-    if (count_ + 1 < capacity_) return;
-    const std::size_t grown = capacity_ == 0 ? 4 : capacity_ * 2;
-    auto* const values = static_cast<char**>(std::realloc(values_, grown * sizeof(char*)));
-    if (values == nullptr) throw std::bad_alloc();
-    values_ = values;
-    capacity_ = grown;
-    values_[count_] = nullptr;
-  }
+  ~ValueList() { cfg_value_free(values_); }
+  ValueList(const ValueList&) = delete;
+  ValueList& operator=(const ValueList&) = delete;
 
   void add(std::string_view value) {
-    reserve_one();
     values_[count_] = copy_text(value);
     values_[++count_] = nullptr;
   }
@@ -217,39 +139,46 @@ class ValueCollector {
   char** take() noexcept { return std::exchange(values_, nullptr); }
 
  private:
-  char** values_ = nullptr;
+  char** values_;
   std::size_t count_ = 0;
-  std::size_t capacity_ = 0;
 };
 
 // The values of an attribute, null when the entry, or what was asked of it, lacks the attribute.
 char** collect_values(const Record& record, std::string_view name) {
-  const KnownType* const known = attribute_lookup().find(name);
-  if (!record.chain->selection.has(known, name)) return nullptr;
-  LineReader reader = record.chain->session->index.lines(record.entry);
-  AttributeLine line;
-  std::string scratch;
-  ValueCollector values;
-  reader.next(line);
-  while (reader.next(line)) {
-    const bool wanted = known != nullptr ? is_name_of(*known, line.type)
-                                         : equals_ignore_ascii_case(name, line.type);
-    if (!wanted) continue;
-    values.reserve_one();
-    if (record.chain->types_only) break;
-    values.add(decoded(line, scratch));
+  const Chain& chain = *record.chain;
+  AttributeMap& map = chain.session->attributes;
+  map.show(chain.session->index, record.entry);
+  const std::uint32_t attribute = map.find(name);
+  if (attribute == AttributeMap::kNone) return nullptr;
+  if (!chain.selection.has(map.known(attribute), name)) return nullptr;
+  ValueList values(chain.types_only ? 0 : map.count_values(attribute));
+  if (!chain.types_only) {
+    map.for_each_value(attribute, [&values](std::string_view value) { values.add(value); });
   }
   return values.take();
 }
 
 char* next_name(_CFGBer& cursor) {
-  if (cursor.next == cursor.names.size()) return nullptr;
-  return copy_text(cursor.names[cursor.next++].text);
+  AttributeMap& map = cursor.session->attributes;
+  map.show(cursor.session->index, cursor.entry);
+  if (cursor.next == (cursor.chooses ? cursor.chosen.size() : map.size())) return nullptr;
+  const std::uint32_t attribute = cursor.chooses ? cursor.chosen[cursor.next] : cursor.next;
+  ++cursor.next;
+  map.note_named(attribute);
+  return copy_text(map.name(attribute));
 }
 
 char* first_attribute(const Record& record, std::unique_ptr<_CFGBer>& cursor) {
-  cursor = std::make_unique<_CFGBer>();
-  NameCollector(*cursor).add(record.chain->session->index, record);
+  Session& session = *record.chain->session;
+  const Selection& selection = record.chain->selection;
+  cursor.reset(new _CFGBer{&session, record.entry, 0, !selection.has_all(), {}});
+  if (cursor->chooses) {
+    AttributeMap& map = session.attributes;
+    map.show(session.index, record.entry);
+    for (std::uint32_t i = 0; i < map.size(); ++i) {
+      if (selection.has(map.known(i), map.name(i))) cursor->chosen.push_back(i);
+    }
+  }
   return next_name(*cursor);
 }
 

@@ -2,6 +2,8 @@
 #pragma once
 
 #include <array>
+#include <memory>
+#include <string>
 
 #include "cfg/secret.h"
 
@@ -21,6 +23,13 @@ class Key {
  private:
   Bytes bytes_;
 };
+
+using SharedKey = std::shared_ptr<const Key>;
+
+// As load_key_stash, for those who ask again and again: while the file is the same as when it was
+// read last, and as trustworthy, the key is the same one. It is wiped when the file has changed and
+// nobody holds it any more. Thread-safe.
+int share_key_stash(const char* path, SharedKey& key, std::string& why) noexcept;
 
 // Wipes a buffer when the scope ends.
 class WipeAtEnd {

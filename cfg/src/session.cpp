@@ -77,7 +77,7 @@ int read_config_file(Session& session) {
 int load_key(Session& session) {
   if (session.key_stash_file.empty()) return result::success;
   std::string why;
-  const int rc = load_key_stash(session.key_stash_file.c_str(), session.owned_key, why);
+  const int rc = share_key_stash(session.key_stash_file.c_str(), session.owned_key, why);
   if (rc == result::no_memory) return rc;
   // `why` names the file itself.
   if (rc != result::success) return fail_bind(session, "", {std::move(why), 0, 0});

@@ -8,10 +8,11 @@
 #include <vector>
 
 #include "attribute_lookup.h"
-#include "cfg/secret.h"
+#include "attribute_map.h"
 #include "cfg/session.h"
 #include "file_text.h"
 #include "ldif_index.h"
+#include "secret_key.h"
 
 namespace orv {
 
@@ -43,7 +44,8 @@ struct Session : _CFG {
   int last_error = 0;
   FileText text;
   LdifIndex index;
-  KeyPtr owned_key;
+  AttributeMap attributes;  // of the entry whose record was looked at last
+  SharedKey owned_key;
   FileFault fault;
   std::string fault_file;  // the file the fault is about
   std::string dump;
@@ -56,6 +58,7 @@ class Selection {
   // `names` as for cfg_search_s. Throws std::bad_alloc.
   explicit Selection(char** names);
 
+  [[nodiscard]] bool has_all() const noexcept { return all_; }
   [[nodiscard]] bool has(const KnownType* known, std::string_view name) const noexcept;
 
  private:

@@ -99,12 +99,8 @@ bool is_object_class(std::string_view type) noexcept {
   return cfg::equals_ignore_ascii_case(type, "objectClass");
 }
 
-// The rule is kept in `attr::syntax` counted from 1, so that the 0 of a zeroed attribute means
-// "look it up".
-int syntax_of(std::string_view type) noexcept {
-  return static_cast<int>(slapi::equality_of(type)) + 1;
-}
-
+// The rule stands in `attr::syntax` counted from 1. Entries leave the 0 of a zeroed attribute
+// there, "look it up": most are only read and sent, and never compare a value.
 cfg::MatchingRule rule_of(const attr& a, int syntax) noexcept {
   constexpr int last = static_cast<int>(cfg::MatchingRule::generalized_time) + 1;
   if (syntax >= 1 && syntax <= last) return static_cast<cfg::MatchingRule>(syntax - 1);
@@ -127,11 +123,24 @@ using AttributePtr = std::unique_ptr<attr, AttributeDeleter>;
 AttributePtr make_attribute(slapi::MallocPtr<char> type, ValueList values) noexcept {
   AttributePtr made(static_cast<attr*>(std::calloc(1, sizeof(attr))));
   if (made == nullptr) return made;
-  made->syntax = syntax_of(type.get());
   made->count = static_cast<int>(count_values(values.get()));
   made->type = type.release();
   made->values = values.release();
   return made;
+}
+
+// The first letter settles most comparisons.
+bool is_type(const attr& a, std::string_view type) noexcept {
+  if (a.type == nullptr) return false;
+  if (!type.empty() && ((*a.type ^ type.front()) & ~0x20) != 0) return false;
+  return cfg::equals_ignore_ascii_case(a.type, type);
+}
+
+// The link to the attribute of that type, or the one at the end of the list, which is null.
+attr** link_of(entry& e, std::string_view type) noexcept {
+  attr** link = &e.attributes;
+  while (*link != nullptr && !is_type(**link, type)) link = &(*link)->next;
+  return link;
 }
 
 attr** end_of_attributes(entry& e) noexcept {
@@ -196,7 +205,8 @@ int append_values(entry& e, attr& present, ValueList added, std::size_t added_co
   return result::success;
 }
 
-int append_attribute(entry& e, AttributePtr added) noexcept {
+// `end` is the link at the end of the entry's list.
+int append_attribute(entry& e, attr** end, AttributePtr added) noexcept {
   const bool object_class = is_object_class(added->type);
   slapi::MallocPtr<ShortValue> list;
   if (object_class) {
@@ -205,17 +215,17 @@ int append_attribute(entry& e, AttributePtr added) noexcept {
   }
 
   attr* const placed = added.release();
-  *end_of_attributes(e) = placed;
+  *end = placed;
   if (object_class) set_object_classes(e, placed, std::move(list));
   return result::success;
 }
 
-int create_attribute(entry& e, const char* type, ValueList values) noexcept {
+int create_attribute(entry& e, attr** end, const char* type, ValueList values) noexcept {
   slapi::MallocPtr<char> name(slapi::copy_bytes(type));
   if (name == nullptr) return result::no_memory;
   AttributePtr created = make_attribute(std::move(name), std::move(values));
   if (created == nullptr) return result::no_memory;
-  return append_attribute(e, std::move(created));
+  return append_attribute(e, end, std::move(created));
 }
 
 // ---- Records of the configuration file -------------------------------------------------------
@@ -265,7 +275,8 @@ int read_attribute(_CFG* session, _CFGMessage* record, CfgText name, entry& e) n
   ValueList values;
   if (const int rc = adopt_texts(texts.get(), values); rc != result::success) return rc;
   AttributePtr read = make_attribute(slapi::MallocPtr<char>(name.release()), std::move(values));
-  return read == nullptr ? result::no_memory : append_attribute(e, std::move(read));
+  return read == nullptr ? result::no_memory
+                         : append_attribute(e, end_of_attributes(e), std::move(read));
 }
 
 int read_attributes(_CFG* session, _CFGMessage* record, entry& e) noexcept {
@@ -298,8 +309,9 @@ void entry_free(entry* e) {
 
 attr* attr_find(const entry* e, const char* type, int /*reserved1*/, int /*reserved2*/) {
   if (e == nullptr || type == nullptr) return nullptr;
+  const std::string_view wanted(type);
   for (attr* a = e->attributes; a != nullptr; a = a->next)
-    if (a->type != nullptr && cfg::equals_ignore_ascii_case(a->type, type)) return a;
+    if (is_type(*a, wanted)) return a;
   return nullptr;
 }
 
@@ -309,8 +321,9 @@ int attr_merge(entry* e, const char* type, berval** values, int /*syntax_normali
   const std::size_t count = count_values(values);
   ValueList copies;
   if (const int rc = copy_values(*e, values, count, copies); rc != result::success) return rc;
-  attr* const present = attr_find(e, type, 0, 0);
-  if (present == nullptr) return create_attribute(*e, type, std::move(copies));
+  attr** const link = link_of(*e, type);
+  attr* const present = *link;
+  if (present == nullptr) return create_attribute(*e, link, type, std::move(copies));
   try {
     // A secret's code must not depend on its content: whoever may not read it would learn it so.
     if (check_duplicates != 0 && count != 0 && !slapi::is_secret_type(type) &&
@@ -324,10 +337,9 @@ int attr_merge(entry* e, const char* type, berval** values, int /*syntax_normali
 
 int attr_delete(entry* e, const char* type, void* /*old*/) {
   if (e == nullptr || type == nullptr) return kBadArgument;
-  attr* const doomed = attr_find(e, type, 0, 0);
+  attr** const link = link_of(*e, type);
+  attr* const doomed = *link;
   if (doomed == nullptr) return 1;
-  attr** link = &e->attributes;
-  while (*link != doomed) link = &(*link)->next;
   *link = doomed->next;
   if (is_object_class(type)) set_object_classes(*e, nullptr, nullptr);
   free_attribute(doomed);

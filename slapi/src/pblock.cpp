@@ -52,10 +52,22 @@ constexpr std::array kParameters{
 
 constexpr std::size_t kUnknown = kParameters.size();
 
+constexpr int kLowest = -157;
+constexpr int kHighest = 210;
+
+// The row of each number between the lowest and the highest.
+constexpr auto kRows = [] {
+  std::array<unsigned char, kHighest - kLowest + 1> rows{};
+  for (unsigned char& row : rows) row = kUnknown;
+  for (std::size_t row = 0; row < kParameters.size(); ++row)
+    rows.at(static_cast<std::size_t>(kParameters[row].number - kLowest)) =
+        static_cast<unsigned char>(row);
+  return rows;
+}();
+
 constexpr std::size_t row_of(int number) noexcept {
-  std::size_t row = 0;
-  while (row < kParameters.size() && kParameters[row].number != number) ++row;
-  return row;
+  if (number < kLowest || number > kHighest) return kUnknown;
+  return kRows[static_cast<std::size_t>(number - kLowest)];
 }
 
 union Value {

@@ -30,7 +30,7 @@ cfg::AttributeType table_row(const SchemaAttribute& attribute) {
   row.name = attribute.names.front();
   row.oid = attribute.oid;
   row.aliases.assign(attribute.names.begin() + 1, attribute.names.end());
-  slapi::find_matching_rule(attribute.equality, row.equality);
+  slapi::find_equality(attribute.equality, row.equality);
   row.single_valued = attribute.single_valued;
   row.secret = attribute.secret;
   return row;

@@ -255,7 +255,7 @@ class SchemaReader {
     attribute.description = line.text.substr(offset);
     inherit(attribute, parsed->at_sup_oid, number);
     if (attribute.syntax.empty()) refuse(number, "neither SYNTAX nor SUP");
-    if (cfg::MatchingRule rule{}; !slapi::find_matching_rule(attribute.equality, rule))
+    if (cfg::MatchingRule rule{}; !slapi::find_equality(attribute.equality, rule))
       refuse(number, "unknown matching rule " + quoted(attribute.equality));
     add_names(schema_->index_->attributes, attribute.names, attribute.oid, number,
               schema_->attributes_.size());

@@ -12,7 +12,8 @@ std::atomic<std::uint32_t> trcEvents{0};
 namespace {
 
 // How plug-ins write "name: value" records: the name first, then the value, both texts.
-constexpr const char* kNamedValueFormats[] = {"%s: %s\n", " Attribute %s: has value %s \n"};
+constexpr const char* kNamedValueFormats[] = {trace::name_and_value,
+                                              " Attribute %s: has value %s \n"};
 constexpr char kMask[] = "********";
 
 bool trace_has(std::uint32_t bits) noexcept {
@@ -34,7 +35,7 @@ bool may_be_secret(const char* name) noexcept {
 void add_named_value(slapi::Record& record, const char* format, const char* name,
                      const char* value) noexcept {
   if (std::strcmp(format, kNamedValueFormats[0]) == 0)
-    record.add("%s: %s\n", name, value);
+    record.add(trace::name_and_value, name, value);
   else
     record.add(" Attribute %s: has value %s \n", name, value);
 }

@@ -7,6 +7,7 @@
 #include <new>
 
 #include "cfg/dn.h"
+#include "cfg/matching.h"
 #include "cfg_fixture.h"
 
 #if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
@@ -163,6 +164,19 @@ TEST_F(AllocationTest, DnFunctionsAnswerNinety) {
     fail_each([dn] {
       cfg::Dn parsed;
       return is_memory_or_success(cfg::parse_dn(dn, parsed));
+    });
+  }
+}
+
+TEST_F(AllocationTest, CanonicalValuesAnswerNinetyAndStayAsTheyWere) {
+  for (const cfg::MatchingRule rule :
+       {cfg::MatchingRule::case_ignore, cfg::MatchingRule::octets,
+        cfg::MatchingRule::distinguished_name, cfg::MatchingRule::telephone_number}) {
+    fail_each([rule] {
+      std::string form;
+      const int rc =
+          cfg::canonical_value(rule, "cn=\xC3\xA4 value that needs a block of its own,o=x", form);
+      return rc == 0 ? !form.empty() : rc == 90 && failed && form.empty();
     });
   }
 }

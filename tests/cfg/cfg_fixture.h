@@ -2,6 +2,7 @@
 #pragma once
 
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cstdio>
@@ -30,6 +31,9 @@ class TemporaryDirectory {
   ~TemporaryDirectory() { static_cast<void>(std::system(("rm -rf " + path_).c_str())); }
   TemporaryDirectory(const TemporaryDirectory&) = delete;
   TemporaryDirectory& operator=(const TemporaryDirectory&) = delete;
+
+  // Lets other users reach files whose names they know.
+  void let_everyone_pass() const { ASSERT_EQ(::chmod(path_.c_str(), 0711), 0); }
 
   [[nodiscard]] std::string file(const std::string& name) const { return path_ + "/" + name; }
 

@@ -51,6 +51,8 @@ const Damage kDamages[] = {
     {"SecretByAliasFirst", "dn: cn=top\nADMINPASSWORD:: eA==\n", 2, 1, "another name than its own"},
     {"SecretByFoldedAlias", "dn: cn=top\nadmin\n Password: x\n", 2, 1, "another name than its own"},
     {"SecretInTheFirstDn", "dn: orv-slapdAdminPW=x\ncn: top\n", 1, 5, "secret attribute in a DN"},
+    {"SecretAboveTheFirstEntry", "dn: cn=top,o=x+1.9.6=y,o=z\ncn: top\n", 1, 5,
+     "secret attribute in a DN"},
     {"SecretInADn", kTop + "dn: orv-slapdAdminPW=x,cn=top\ncn: x\n", 4, 5,
      "secret attribute in a DN"},
     {"SecretInAnRdn", kTop + "dn: cn=x+1.9.6=y,cn=top\ncn: x\n", 4, 5, "secret attribute in a DN"},

@@ -54,6 +54,8 @@ TEST_F(DnTest, EscapesStayOnlyWhereTheyAreNeeded) {
   EXPECT_EQ(normal("cn=a\\09b\\7f"), "CN=A\\09B\\7F");
   EXPECT_EQ(normal("cn=a\tb"), "CN=A\\09B");
   EXPECT_EQ(normal("cn=\\c2\\85"), "CN=\\C2\\85");
+  EXPECT_EQ(normal("cn=\\c2\\9f"), "CN=\\C2\\9F");
+  EXPECT_EQ(normal("cn=\\c2\\a1"), "CN=\xC2\xA1");
 }
 
 TEST_F(DnTest, HexValuesOfStringTypesAreDecoded) {
@@ -65,6 +67,9 @@ TEST_F(DnTest, HexValuesOfStringTypesAreDecoded) {
   EXPECT_EQ(normal("cn=#1401e4"), "CN=\xC3\x84");
   EXPECT_EQ(normal("cn=#0C81036162632"), "error 34");
   EXPECT_EQ(normal("cn=#0C8103616263"), "CN=ABC");
+  EXPECT_EQ(normal("cn=#0C8400000003616263"), "CN=ABC");
+  EXPECT_EQ(normal("cn=#0C850000000003616263"), "error 34");
+  EXPECT_EQ(normal("cn=#1C0400110000"), "error 34");
   for (const char* text :
        {"cn=#", "cn=#0", "cn=#0C", "cn=#0C04616263", "cn=#0C02616263", "cn=#020101",
         "cn=#3003616263", "cn=#0C80616263", "cn=#0C0100", "cn=#0C01FF", "cn=#xyz", "cn=#1e03006100",
@@ -139,6 +144,22 @@ TEST_F(DnTest, WhatIsNoDnIsRefused) {
   Dn dn;
   EXPECT_EQ(parse_dn(deep.substr(5), dn), 0);
   EXPECT_EQ(dn.size(), kMaxRdns);
+}
+
+// Short DNs take a path of their own.
+TEST_F(DnTest, TheLengthOfAValueDoesNotMatter) {
+  for (std::size_t length = 490; length < 530; ++length) {
+    const std::string a(length, 'a');
+    const std::string upper(length, 'A');
+    EXPECT_EQ(normal("cn=" + a), "CN=" + upper);
+    EXPECT_EQ(normal("ou=b, ou = " + a + " ,ou=c"), "OU=B,OU=" + upper + ",OU=C");
+  }
+}
+
+TEST_F(DnTest, ANormalFormIsNotLongerThanADnMayBe) {
+  const std::string fits((kMaxDnLength - 3) / 3, '=');
+  EXPECT_EQ(normal("cn=" + fits).size(), 3 + 3 * fits.size());
+  EXPECT_EQ(normal("cn==" + fits), "error 34");
 }
 
 TEST_F(DnTest, ParsedPartsHaveCanonicalTypesAndRawValues) {

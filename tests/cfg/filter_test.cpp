@@ -9,7 +9,7 @@ constexpr const char* kEntry =
     "cn:  Two   Words \ndescription:: w4RyZ2VyIFN0cmHDn2U=\nexactText: Mixed Case\n"
     "bytes: a b\nmember: CN = Some One , O=x\nnumber: 42\nnumber: -7\nflag: TRUE\n"
     "telephoneNumber: +49 30-12 34\nmoment: 20240229120000Z\norv-slapdAdminPW: topsecret\n"
-    "free: Text\nlong: one\n  two\n  three\no: a*b(c)d\\e\n";
+    "cn: Ghost \xE2\x80\x8B\nfree: Text\nlong: one\n  two\n  three\no: a*b(c)d\\e\n";
 
 struct FilterCase {
   const char* filter;
@@ -48,6 +48,8 @@ const FilterCase kCases[] = {
     {"(cn= top )", true},
     {"(cn=two words)", true},
     {"(cn=twowords)", false},
+    {"(cn=ghost)", true},
+    {"(cn=ghost x)", false},
     {"(cn=to)", false},
     {"(commonName=top)", true},
     {"(2.5.4.3=top)", true},
@@ -160,6 +162,9 @@ const FilterCase kCases[] = {
     {"(:caseIgnoreMatch:=unit)", false},
     {"(cn:unknownRule:=top)", false},
     {"(!(cn:unknownRule:=top))", false},
+    {"(objectClass:objectIdentifierFirstComponentMatch:=top)", false},
+    {"(!(objectClass:objectIdentifierFirstComponentMatch:=top))", false},
+    {"(!(number:2.5.13.29:=1))", false},
     {"(neverheard:=x)", false},
     {"(!(ou:=x))", true},
     // secrets

@@ -60,12 +60,12 @@ class Writer {
     for (int i = 0; i < 40; ++i) {
       const std::string parent = dns.empty() ? "" : dns[random_() % dns.size()];
       const std::string dn =
-          "cn=e" + std::to_string(i) + (parent.empty() ? "" : (chance(4) ? " , " : ",") + parent);
+          std::string("cn=e") + std::to_string(i) + (parent.empty() ? "" : (chance(4) ? " , " : ",") + parent);
       dns.push_back(dn);
-      if (chance(4)) out += fold("# comment " + word(), false);
+      if (chance(4)) out += fold(std::string("# comment ") + word(), false);
       out += line(chance(5) ? "DN" : "dn", dn);
       for (std::size_t n = 1 + random_() % 8; n > 0; --n) {
-        if (chance(6)) out += fold("#" + word(), false);
+        if (chance(6)) out += fold(std::string("#") + word(), false);
         const char* names[] = {"cn",          "COMMONNAME", "2.5.4.11", "ou",
                                "description", "Free-Type",  "x"};
         out += line(names[random_() % 7], value());
@@ -86,7 +86,7 @@ class Writer {
   }
   std::string value() {
     std::string text = word();
-    if (chance(4)) text += " " + word();
+    if (chance(4)) text.append(" ").append(word());
     if (chance(6)) text += "\xC3\xA4";
     if (chance(8)) text = std::string(1 + random_() % 3, '\t') + text + " ";
     return text;

@@ -1,4 +1,5 @@
 // Chains, records, cursors and values: who owns what, and what the error number says.
+#include <algorithm>
 #include <set>
 
 #include "cfg_fixture.h"
@@ -57,6 +58,34 @@ TEST_F(ResultsTest, AnUnlinkedRecordIsFreedByItsHolderAndTheChainStaysGood) {
     EXPECT_EQ(cfg_count_entries(session.get(), chain.get()), 3);
     EXPECT_EQ(read_chain(session.get(), chain.get()).size(), 3U);
   }
+}
+
+TEST_F(ResultsTest, RecordsAreUnlinkedInAnyOrder) {
+  std::vector<std::size_t> order = {0, 1, 2, 3};
+  do {
+    const CfgSession session = open(kTree);
+    const CfgResult chain(chain_of(session));
+    std::vector<_CFGMessage*> records;
+    for (_CFGMessage* record = cfg_first_entry(session.get(), chain.get()); record != nullptr;
+         record = cfg_next_entry(session.get(), record)) {
+      records.push_back(record);
+    }
+    ASSERT_EQ(records.size(), 4U);
+    std::size_t left = records.size();
+    for (const std::size_t victim : order) {
+      cfg_msg_unlink(session.get(), records[victim]);
+      std::free(std::exchange(records[victim], nullptr));
+      std::vector<_CFGMessage*> linked;
+      for (_CFGMessage* record = cfg_first_entry(session.get(), chain.get()); record != nullptr;
+           record = cfg_next_entry(session.get(), record)) {
+        linked.push_back(record);
+      }
+      ASSERT_EQ(linked.size(), --left);
+      ASSERT_TRUE(std::all_of(linked.begin(), linked.end(), [&](_CFGMessage* record) {
+        return std::count(records.begin(), records.end(), record) == 1;
+      }));
+    }
+  } while (std::next_permutation(order.begin(), order.end()));
 }
 
 TEST_F(ResultsTest, ARecordIsNoChainAndAChainNoRecord) {

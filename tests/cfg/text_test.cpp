@@ -61,7 +61,7 @@ TEST(Base64, RoundTripsAllBytes) {
 TEST(Base64, DamagedTextIsRefusedWithThePlaceOfTheDamage) {
   const std::pair<const char*, std::size_t> damaged[] = {
       {"Zg", 2}, {"Zg=", 3},  {"Zg==x", 4}, {"Z", 1},    {"Zm9v!", 4}, {"Zm 9", 2},
-      {"=", 0},  {"Zg=a", 3}, {"Zm9vZ", 5}, {"Zh==", 1}, {"Zm9=", 2}};
+      {"=", 0},  {"Zg=a", 3}, {"Zm9vZ", 5}, {"Zh==", 1}, {"Zo==", 1},  {"Zm9=", 2}};
   for (const auto& [text, place] : damaged) {
     std::string out = "kept";
     std::size_t at = 99;

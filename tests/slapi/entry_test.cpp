@@ -8,6 +8,7 @@
 #include <string>
 #include <vector>
 
+#include "cfg/matching.h"
 #include "slapi/codepage.h"
 #include "slapi/owners.h"
 #include "values.h"
@@ -107,6 +108,34 @@ TEST(AttrMerge, FoldsLettersBeyondAscii) {
   ASSERT_EQ(merge(e, "cn", {"J\xC3\xBCrgen"}), 0);
   EXPECT_EQ(merge(e, "cn", {"J\xC3\x9CRGEN"}), 20);
   EXPECT_EQ(merge(e, "cn", {"Jurgen"}), 0);
+}
+
+TEST(AttrMerge, ComparesValuesAsFiltersDo) {
+  const EntryPtr e = empty_entry();
+  ASSERT_EQ(merge(e, "orv-slapdPort", {"389"}), 0);
+  EXPECT_EQ(merge(e, "orv-slapdPort", {" 0389"}), 20);
+  ASSERT_EQ(merge(e, "createTimestamp", {"20240229120000Z"}), 0);
+  EXPECT_EQ(merge(e, "createTimestamp", {"2024022913+0100"}), 20);
+  ASSERT_EQ(merge(e, "vendorName", {"A\xCC\x88"}), 0);
+  EXPECT_EQ(merge(e, "vendorName", {"\xC3\x84"}), 20);
+}
+
+TEST(AttrMerge, TakesAValueOfAnotherSyntaxAsEqualToItselfOnly) {
+  const EntryPtr e = empty_entry();
+  ASSERT_EQ(merge(e, "orv-slapdPort", {"many", "1"}), 0);
+  EXPECT_EQ(merge(e, "orv-slapdPort", {"Many"}), 0);
+  EXPECT_EQ(merge(e, "orv-slapdPort", {"many"}), 20);
+  ASSERT_EQ(merge(e, "orv-slapdAdminDN", {"nobody"}), 0);
+  EXPECT_EQ(merge(e, "orv-slapdAdminDN", {"Nobody"}), 0);
+  EXPECT_EQ(merge(e, "orv-slapdAdminDN", {"nobody"}), 20);
+}
+
+TEST(AttrMerge, DoesNotTakeAValueOfAnotherSyntaxForACanonicalForm) {
+  const EntryPtr e = empty_entry();
+  std::string form;
+  ASSERT_EQ(cfg::canonical_value(cfg::MatchingRule::generalized_time, "19700101000000Z", form), 0);
+  ASSERT_EQ(merge(e, "createTimestamp", {"19700101000000Z"}), 0);
+  EXPECT_EQ(merge(e, "createTimestamp", {form}), 0);
 }
 
 TEST(AttrMerge, FindsAValueThatIsAddedTwiceAtOnce) {
@@ -231,6 +260,10 @@ TEST(ValueFind, KnowsAnObjectClassByItsOid) {
   const EntryPtr e = empty_entry();
   ASSERT_EQ(merge(e, "objectClass", {"top"}), 0);
   EXPECT_EQ(find(e->object_classes, "2.5.6.0"), 0);
+  EXPECT_EQ(find(e->object_classes, " TOP "), 0);
+  EXPECT_NE(find(e->object_classes, "2.5.6.1"), 0);
+  ASSERT_EQ(merge(e, "objectClass", {"noSuchClass"}), 0);
+  EXPECT_EQ(find(e->object_classes, "NOSUCHCLASS"), 0);
 }
 
 TEST(ValueFind, SaysAbsentForNullAndEmptyAttributes) {

@@ -12,11 +12,12 @@
 
 namespace orv::cfg {
 
-// How two values of an attribute are compared (the equality rules of RFC 4517 that the schema uses).
+// How two values of an attribute are compared (the equality rules of RFC 4517 that the schema
+// uses).
 enum class MatchingRule {
-  case_ignore,       // caseIgnoreMatch and caseIgnoreIA5Match; the default
-  case_exact,        // caseExactMatch, octetStringMatch: bytes, after space handling for strings
-  octets,            // octetStringMatch
+  case_ignore,  // caseIgnoreMatch and caseIgnoreIA5Match; the default
+  case_exact,   // caseExactMatch and caseExactIA5Match
+  octets,       // octetStringMatch
   distinguished_name,
   integer,
   boolean,

@@ -4,7 +4,7 @@
 // knows the other: a session handle instead of a connection, a file instead of a server.
 //
 // What a session sees: `cfg_bind_s` reads the file whole into private memory and checks that it is
-// well formed; all searches of the session answer from that text. Nothing is kept between sessions.
+// well formed; all searches of the session answer from that text, none of which is kept for others.
 // Readers take no lock on the file.
 //
 // Errors: functions return LDAP result codes; those that return a pointer give null and leave the
@@ -63,7 +63,8 @@ int cfg_get_option(_CFG* session, int option, const char** value);
 
 // Opens the file named by option 1005, reads it and checks it: RFC 2849 content records, parents
 // before children, no DN twice, no NUL bytes, secret attributes only under their own name. Then
-// loads the key stash, when one is named (refused unless only its owner may read it).
+// loads the key stash, when one is named (refused unless only its owner may read it); while that
+// file stays the same, sessions share one key in memory.
 // `who` and `credentials` are reserved and null; `flags` is passed as 128 and not examined.
 // 0; 90 when memory is short; 1 in every other case, with file, line, column and cause in
 // `cfg_dump_exception`. After a failure the handle still serves set and get option, dump and
@@ -88,8 +89,8 @@ const char* cfg_dump_exception(_CFG* session);
 //   types_only  non-zero: value arrays come back empty, and not null
 //   chain       receives the result chain, for `cfg_msgfree`; null on every non-zero return
 // Entries come base first, then in the order of the file. A base that exists but does not match is
-// a success with no entries. 0; 32 no such base; 34 `base` is not a DN; 18 or 2 a filter that cannot
-// be read; 3 interrupted (cfg/interrupt.h); 1 session not bound; 90.
+// a success with no entries. 0; 32 no such base; 34 `base` is not a DN; 2 a filter that cannot be
+// read; 3 interrupted (cfg/interrupt.h); 1 session not bound; 90.
 int cfg_search_s(_CFG* session, const char* base, int scope, const char* filter, char** attributes,
                  int types_only, _CFGMessage** chain);
 
@@ -106,7 +107,8 @@ char* cfg_get_dn(_CFG* session, _CFGMessage* entry);
 
 // Walks the attribute names of an entry: each once, under its canonical name, in the order of first
 // appearance. Names are released with `cfg_memfree`, the cursor with `cfg_ber_free`. `*cursor` is
-// null when nothing was returned.
+// null when nothing was returned. For a null entry: null, with error number 1. A walk with a null
+// cursor is at its end.
 char* cfg_first_attribute(_CFG* session, _CFGMessage* entry, _CFGBer** cursor);
 char* cfg_next_attribute(_CFG* session, _CFGMessage* entry, _CFGBer* cursor);
 

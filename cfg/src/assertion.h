@@ -2,11 +2,12 @@
 // section 4.2).
 #pragma once
 
+#include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
 
-#include "cfg/attribute_table.h"
+#include "cfg/matching.h"
 
 namespace orv::cfg {
 
@@ -48,6 +49,9 @@ class SubstringAssertion {
   [[nodiscard]] bool matches(std::string_view stored) const;
 
  private:
+  // `form` is the whole value, prepared.
+  [[nodiscard]] bool form_matches(std::string_view form) const;
+
   MatchingRule rule_;
   bool valid_ = false;
   bool initial_;
@@ -55,7 +59,11 @@ class SubstringAssertion {
   std::vector<std::string> parts_;
 };
 
-// The rule with this name or OID; false when the library does not know it.
-bool find_matching_rule(std::string_view name_or_oid, MatchingRule& rule) noexcept;
+// As `canonical_value`, but throws std::bad_alloc; nothing when the value is not of the rule's
+// syntax.
+std::optional<std::string> canonical_form(MatchingRule rule, std::string_view value);
+
+// The rule with this name or OID, if an extensible match may name it; else false.
+bool find_filter_rule(std::string_view name_or_oid, MatchingRule& rule) noexcept;
 
 }  // namespace orv::cfg
