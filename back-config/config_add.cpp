@@ -37,7 +37,6 @@ namespace {
 
 constexpr const char* kRetrieving = "Retrieving values for attribute %s ! \n";
 constexpr const char* kProblems = "Problems retrieving values for %s ! \n";
-constexpr const char* kValue = "%s: %s\n";
 constexpr const char* kWalkFailed = "cfg_first_attribute error ! \n";
 constexpr const char* kSecondAdminDn = "Error: more then one admin DN ";
 constexpr const char* kFailed = "Retrieving %s FAILED rc = %d\n";
@@ -105,7 +104,7 @@ int take_member_dn(const char* value, MallocText& identity) {
 
 void trace_values(const ldtr_function_local& trace, const char* name, char** values) {
   for (char** value = values; *value != nullptr; ++value) {
-    trace.debug(trace::detail, kValue, name, *value);
+    trace.debug(trace::detail, trace::name_and_value, name, *value);
   }
 }
 

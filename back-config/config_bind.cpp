@@ -1,3 +1,5 @@
+#include <pthread.h>
+
 #include <cstdio>
 
 #include "cfg/result_codes.h"
@@ -63,14 +65,16 @@ void report_failed_bind(const ldtr_function_local& trace, _CFG* handle, int rc) 
 int init_cfg_ld(Connection* connection, ConfigBackendPrivate* state) {
   ldtr_function_local trace(function_id::init_cfg_ld);
 
+  // 1. The lock: from here on the file belongs to this operation.
   if (pthread_mutex_lock(&state->configMutex) != 0) {
     trace.debug(trace::info, kNotLocked);
     return trace.exit(result::other);
   }
 
-  // A handle that an earlier operation left is used as it is, even one that was never bound.
+  // 2. A handle that an earlier operation left is used as it is, even one that was never bound.
   if (connection->config_session != nullptr) return trace.exit(result::success);
 
+  // 3. A handle. Other implementations of the library throw here, or give null.
   trace.debug(trace::detail, kMakingHandle);
   try {
     connection->config_session = cfg_init(nullptr, 0);
@@ -85,8 +89,10 @@ int init_cfg_ld(Connection* connection, ConfigBackendPrivate* state) {
     return trace.exit(result::no_memory);  // still locked
   }
 
+  // 4. The files; only an unbound handle takes them.
   name_files(trace, handle, *state);
 
+  // 5. The file is read and checked.
   trace.debug(trace::detail, kBinding);
   const int rc = cfg_bind_s(handle, nullptr, nullptr, kBindFlags);
   if (rc != 0) {
@@ -109,6 +115,8 @@ void OperationSession::release_without_taking() {
 
 int config_back_bind(pblock* pb) {
   ldtr_function_local trace(function_id::config_back_bind);
+
+  // 1. The parties.
   Backend* backend = nullptr;
   Connection* connection = nullptr;
   Operation* operation = nullptr;
@@ -116,6 +124,7 @@ int config_back_bind(pblock* pb) {
   slapi_pblock_get(pb, parameter::connection, &connection);
   slapi_pblock_get(pb, parameter::operation, &operation);
 
+  // 2. Nobody binds here, whatever the name and the credentials.
   trace.debug(trace::info, kEntering);
   send_ldap_result(connection, operation, result::invalid_credentials, nullptr, nullptr);
   return trace.exit(result::invalid_credentials);

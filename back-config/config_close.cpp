@@ -1,3 +1,5 @@
+#include <pthread.h>
+
 #include "cfg/result_codes.h"
 #include "config_private.h"
 #include "function_ids.h"
@@ -22,6 +24,7 @@ int config_back_close(pblock* pb) {
   ldtr_function_local trace(function_id::config_back_close);
   trace.debug(trace::info, kClosing);
 
+  // 1. The backend, and the instance that was started on it.
   Backend* backend = nullptr;
   if (slapi_pblock_get(pb, parameter::backend, &backend) != 0) {
     trace.debug(trace::info, kNoParameter);
@@ -36,7 +39,7 @@ int config_back_close(pblock* pb) {
     return trace.exit(kNothingToClose);
   }
 
-  // The state and its texts stay: whoever still reads them reads something valid.
+  // 2. The lock. The state and its texts stay: whoever still reads them reads something valid.
   pthread_mutex_destroy(&static_cast<ConfigBackendPrivate*>(backend->private_data)->configMutex);
   return trace.exit(result::success);
 }

@@ -1,3 +1,4 @@
+#include <pthread.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -91,8 +92,11 @@ int derive_save_name(const ldtr_function_local& trace, const char* path, std::si
 
 int config_back_init(Backend* backend) {
   ldtr_function_local trace(function_id::config_back_init);
+
+  // 1. What the server left for the start.
   auto* startup = static_cast<BackendStartup*>(backend->private_data);
 
+  // 2. The state, with its lock.
   StatePtr state = make_state(*startup);
   if (state == nullptr) {
     // The one failure after which the start-up record is gone.
@@ -100,22 +104,29 @@ int config_back_init(Backend* backend) {
     return trace.exit(result::no_memory);
   }
 
-  // Failures from here on leave the start-up record where it is: it still says what to start.
+  // 3. The file. Failures from here on leave the start-up record where it is: it still says what to
+  // start.
   MallocText path = zeroed_text(kPathBuffer);
   if (path == nullptr) return trace.exit(result::no_memory);
   std::size_t length = 0;
   int rc = resolve_link(trace, startup->config_file, path.get(), length);
   if (rc != 0) return trace.exit(rc);
+
+  // 4. The save file beside it.
   MallocText save;
   rc = derive_save_name(trace, path.get(), length, save);
   if (rc != 0) return trace.exit(rc);
 
+  // 5. The state takes the place of the start-up record.
   state->config_file = path.release();
   state->save_file = save.release();
   state->key_stash_file = startup->key_stash_file;
   backend->private_data = state.release();
+
+  // 6. The code page. Its failure is the result, but the instance is there.
   rc = initIconvHandle();
 
+  // 7. The start-up record was the server's gift.
   std::free(startup);
   return trace.exit(rc);
 }

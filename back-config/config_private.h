@@ -9,7 +9,7 @@ namespace orv {
 // Made by `config_back_init` (zero-filled, from calloc) and found in `Backend::private_data` from
 // then on. It is never released: the texts are read by every session until the process ends.
 struct ConfigBackendPrivate {
-  const char* config_file;      // absolute path, links resolved once; option 1005
+  const char* config_file;      // the path given at start or, of a link, its target; option 1005
   const char* save_file;        // the same path followed by ".save"; option 1006
   const char* key_stash_file;   // the server's text, or null; option 1007
   pthread_mutex_t configMutex;  // held from `init_cfg_ld` to `config_end`; default attributes

@@ -1,10 +1,12 @@
 #include "config_search.h"
 
+#include <pthread.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
+#include <memory>
 
 #include "auto_lock.h"
 #include "cfg/owners.h"
@@ -28,6 +30,9 @@ namespace orv {
 
 namespace {
 
+constexpr const char* kShortWait = "%d failed to trylock1 %p, waiting 0.1s\n";
+constexpr const char* kLongWait = "%d failed to trylock2 %p, waiting 1s\n";
+constexpr const char* kLine = "%s\n";
 constexpr const char* kStillBusy =
     "Couldn't get access to mutex controlled resource (still busy). Will wait for 30 more seconds.";
 constexpr const char* kGivenUp =
@@ -48,17 +53,15 @@ int calling_thread() {
 }
 
 void report_short_wait(pthread_mutex_t* mutex) {
-  PrintDebug(trace::info, "%d failed to trylock1 %p, waiting 0.1s\n", calling_thread(),
-             static_cast<void*>(mutex));
+  PrintDebug(trace::info, kShortWait, calling_thread(), static_cast<void*>(mutex));
 }
 
 void report_long_wait(pthread_mutex_t* mutex) {
-  PrintDebug(trace::info, "%d failed to trylock2 %p, waiting 1s\n", calling_thread(),
-             static_cast<void*>(mutex));
+  PrintDebug(trace::info, kLongWait, calling_thread(), static_cast<void*>(mutex));
 }
 
 void report(const char* text) {
-  if (read_ldap_debug()) PrintDebug(trace::info, "%s\n", text);
+  if (read_ldap_debug()) PrintDebug(trace::info, kLine, text);
 }
 
 bool acquire_within(pthread_mutex_t* mutex, int attempts, useconds_t pause,

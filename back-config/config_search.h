@@ -15,9 +15,8 @@ int has_search_authority(const Connection* connection, const Operation* operatio
 //   chain             released here, except when its first record cannot be taken: then the session
 //                     releases it when it is unbound
 //   attributes        requested attributes, null for all; handed to the sender with `types_only`
-//   full_view         1: every entry, without the credentials that the caller may not see. Any
-//   other
-//                     value: only the entry of the directory backend.
+//   full_view         1: every entry, without the credentials that the caller may not see.
+//                     Any other value: only the entry of the directory backend
 //   response_control  attached to each entry when the connection asks for it; or null
 // 0; 90 no memory; 16 a credential could not be taken out; 80 whose credentials an entry holds
 // cannot be told; the code with which the sender ended the search.

@@ -1,3 +1,5 @@
+#include <pthread.h>
+
 #include "cfg/result_codes.h"
 #include "config_session.h"
 #include "function_ids.h"
@@ -13,20 +15,24 @@ constexpr const char* kNotLocked = "Could not lock configMutex\n";
 
 int config_back_unbind(pblock* pb) {
   ldtr_function_local trace(function_id::config_back_unbind);
+
+  // 1. The parties.
   Backend* backend = nullptr;
   Connection* connection = nullptr;
   slapi_pblock_get(pb, parameter::backend, &backend);
   slapi_pblock_get(pb, parameter::connection, &connection);
 
-  // Most connections never used the backend: those take no lock.
+  // 2. Most connections never used the backend: those take no lock.
   if (connection->config_session == nullptr) return trace.exit(result::success);
 
+  // 3. The lock, as for every work on a session.
   auto* state = static_cast<ConfigBackendPrivate*>(backend->private_data);
   if (pthread_mutex_lock(&state->configMutex) != 0) {
     trace.debug(trace::info, kNotLocked);
     return trace.exit(result::other);
   }
-  // The slot keeps the dead handle: the connection ends here and nobody looks at it again.
+
+  // 4. The slot keeps the dead handle: the connection ends here and nobody looks at it again.
   const int rc = cfg_unbind(connection->config_session);
   config_end(state);
   return trace.exit(rc);

@@ -2,7 +2,8 @@
 //
 // Handlers are called from the server's worker threads, one call for each client operation. Each
 // reads its arguments from the parameter block, sends its own result to the client, and returns the
-// LDAP code of the operation. All but bind and the instance handlers work under `configMutex`.
+// LDAP code of the operation. Search and unbind take `configMutex` for as long as they work with a
+// session, and only then; the other handlers take no lock.
 #pragma once
 
 #include "slapi/pblock.h"
@@ -21,8 +22,10 @@ namespace orv {
 //   80  the path cannot be looked at
 //   90  no memory
 //   or the result of `initIconvHandle`; the instance state is then in place nevertheless.
-// On failure the process cannot serve this backend. The start-up record is still there after 1, 80
-// and 90, except when not even the instance state could be allocated.
+// On failure the process cannot serve this backend, and `backend->private_data` is not to be
+// touched any more, not even to release it: the result does not tell whether it holds the start-up
+// record (1, 80, most cases of 90), a start-up record that has been released (90 without memory for
+// the state) or the state (the codes of `initIconvHandle`, which may be the same numbers).
 int config_back_init(Backend* backend);
 
 // Ends the instance: destroys `configMutex`. No operation may be running or come later. The

@@ -195,6 +195,20 @@ TEST_F(ConvertRecord, WalksAndReleasesInOrder) {
           "cfg_next_attribute(session, record 1, cursor)", "cfg_ber_free(cursor)"));
 }
 
+// Allocations before the arrays: entry, DN, converted DN, attribute name, values.
+TEST_F(ConvertRecord, ReleasesPointersThenValuesThenTheirArray) {
+  of({"CN=X", {{"cn", {"a", "b"}}}});
+  platform.name_allocation(6, "pointers");
+  platform.name_allocation(7, "counted");
+  platform.name_allocation(8, "first value");
+  platform.name_allocation(9, "second value");
+  convert();
+  EXPECT_THAT(
+      platform.calls({"attr_merge", "free", "cfg_value_free"}),
+      ElementsAre("attr_merge(\"cn\", \"a,b\", 1, 1, null)", "free(pointers)", "free(first value)",
+                  "free(second value)", "free(counted)", "cfg_value_free()"));
+}
+
 TEST_F(ConvertRecord, DnThatCannotBeReadIsLeftOut) {
   of({"CN=X", {{"cn", {"a"}}}});
   platform.fail("cfg_get_dn", 1, 90);

@@ -178,7 +178,29 @@ TEST_F(Identities, EntryFoundWithoutARecordGivesNull) {
   platform.file[kConfiguration] = {};
   EXPECT_EQ(admin_dn(), "null");
   EXPECT_EQ(platform.count("cfg_get_dn"), 0);
+  EXPECT_THAT(platform.calls({"cfg_first_attribute", "cfg_next_attribute"}),
+              ElementsAre("cfg_first_attribute(session, null)"));
+  EXPECT_THAT(platform.debug_lines(),
+              ElementsAre(error("cfg_first_attribute error ! \n"),
+                          error("Retrieving orv-slapdAdminDN FAILED rc = 1\n")));
+}
+
+TEST_F(Identities, ValueWithoutAConversionGivesNullWithCodeZero) {
+  file(kConfiguration, {{"orv-slapdAdminDN", {"CN=A"}}});
+  file(kKerberos, {{"orv-slapdKrbAdminDN", {"CN=A"}}});
+  file(kDigest, {{"orv-slapdDigestAdminUser", {"a"}}});
+  file(kMember, {{"orv-slapdAdminDN", {"CN=A"}}});
+  platform.fail("xlate_localcp_to_utf8", 0, 0);
+  EXPECT_EQ(admin_dn(), "null");
   EXPECT_EQ(last_line(), error("Retrieving orv-slapdAdminDN FAILED rc = 0\n"));
+  EXPECT_EQ(kerberos_id(), "null");
+  EXPECT_EQ(last_line(), error("Retrieving orv-slapdKrbAdminDN FAILED rc = 0\n"));
+  EXPECT_EQ(digest_user(), "null");
+  EXPECT_EQ(last_line(), error("Retrieving orv-slapdDigestAdminUser FAILED rc = 0\n"));
+  EXPECT_EQ(member_dn(), "null");
+  EXPECT_EQ(last_line(), detail("orv-slapdAdminDN: CN=A\n"));
+  EXPECT_EQ(platform.count("replace_DN"), 0);
+  EXPECT_EQ(platform.count("dn_normalize_light_esc"), 0);
 }
 
 // ---- Failures
@@ -232,6 +254,28 @@ TEST_F(Identities, ErrorAtTheValuesGives1AndEndsTheWalk) {
                           error("Problems retrieving values for cn ! \n"),
                           error("Retrieving orv-slapdKrbAdminDN FAILED rc = 1\n")));
   EXPECT_EQ(platform.count("cfg_get_values"), 1);
+  EXPECT_EQ(platform.count("cfg_next_attribute"), 1);
+}
+
+TEST_F(Identities, WalkAdvancesOnceAfterAFailureAndEnds) {
+  file(kConfiguration, {{"orv-slapdAdminDN", {"CN=A", "CN=B"}}, {"cn", {"x"}}});
+  EXPECT_EQ(admin_dn(), "null");
+  EXPECT_EQ(platform.count("cfg_next_attribute"), 1);
+  EXPECT_EQ(platform.count("cfg_get_values"), 1);
+  expect_released_and_free_of_locks();
+}
+
+TEST_F(Identities, ErrorOfTheAdvanceAfterAFailureIsTheCode) {
+  file(kDigest, {{"orv-slapdDigestAdminUser", {"a"}}, {"cn", {"x"}}});
+  platform.fail("xlate_localcp_to_utf8", 1, 21);
+  platform.fail("cfg_next_attribute", 1, 80);
+  EXPECT_EQ(digest_user(), "null");
+  EXPECT_EQ(platform.count("cfg_next_attribute"), 1);
+  EXPECT_THAT(
+      platform.debug_lines(),
+      ElementsAre(detail("Retrieving values for attribute orv-slapdDigestAdminUser ! \n"),
+                  detail("orv-slapdDigestAdminUser: a\n"), error("cfg_first_attribute error ! \n"),
+                  error("Retrieving orv-slapdDigestAdminUser FAILED rc = 1\n")));
 }
 
 TEST_F(Identities, FailedConversionGivesNull) {

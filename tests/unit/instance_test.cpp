@@ -34,6 +34,7 @@ class Instance : public BackendTest {
     EXPECT_THAT(platform.leaks(), ElementsAre("text"));
     EXPECT_EQ(platform.count("free"), 0);
     EXPECT_EQ(platform.count("initIconvHandle"), 0);
+    EXPECT_EQ(platform.count("pthread_mutex_destroy"), 0);
     std::free(startup);
   }
 
@@ -79,6 +80,18 @@ TEST_F(Instance, StepsComeInTheirOrder) {
               ElementsAre("pthread_mutex_init(?, null)", "readlink(\"/b\", 4086)",
                           "kel_strlcpy(\"/a\", 8)", "kel_strlcat(\"/a\", \".save\", 8)",
                           "initIconvHandle()", "free(startup record)"));
+  EXPECT_EQ(platform.last_mutex_made(), &made().configMutex);
+  release_state();
+}
+
+TEST_F(Instance, LinesComeBetweenTheSteps) {
+  platform.link_errno = EINVAL;
+  EXPECT_EQ(start("/b"), 0);
+  EXPECT_THAT(platform.story({"readlink", "kel_strlcpy", "kel_strlcat", "initIconvHandle"}),
+              ElementsAre("readlink(\"/b\", 4086)", "debug: Readlink rc: -1\nPath:\n",
+                          "debug: File not a link.\n", "kel_strlcpy(\"/b\", 4096)",
+                          "kel_strlcpy(\"/b\", 8)", "kel_strlcat(\"/b\", \".save\", 8)",
+                          "debug: Save file name: /b.save\n", "initIconvHandle()"));
   release_state();
 }
 
@@ -193,6 +206,7 @@ TEST_F(Instance, WithoutMemoryForTheStateTheStartupRecordIsReleased) {
   platform.fail_allocation(1);
   EXPECT_EQ(start("/b"), 90);
   EXPECT_THAT(platform.calls(), ElementsAre("free(startup record)"));
+  EXPECT_EQ(platform.last_mutex_made(), nullptr);
   EXPECT_THAT(platform.debug_lines(), IsEmpty());
 }
 
@@ -244,6 +258,13 @@ TEST_F(Closing, DestroysTheMutexAndReleasesNothing) {
               ElementsAre("slapi_pblock_get(130)", "pthread_mutex_destroy(configMutex)"));
   EXPECT_THAT(platform.debug_lines(), ElementsAre(info("calling config_close...\n")));
   EXPECT_EQ(backend.private_data, &state);
+}
+
+TEST_F(Closing, IsToldBeforeTheBackendIsLookedAt) {
+  EXPECT_EQ(close(), 0);
+  EXPECT_THAT(platform.story({"slapi_pblock_get", "pthread_mutex_destroy"}),
+              ElementsAre("debug: calling config_close...\n", "slapi_pblock_get(130)",
+                          "pthread_mutex_destroy(configMutex)"));
 }
 
 TEST_F(Closing, IgnoresThatTheMutexIsBusy) {

@@ -62,6 +62,14 @@ TEST_F(Registration, EndsStoringAtTheFirstFailureAndStillAnnouncesTheControl) {
               ElementsAre(error("config backend initialization error. Function number=202\n")));
 }
 
+TEST_F(Registration, TellsTheFailureBeforeItAnnouncesTheControl) {
+  platform.fail("slapi_pblock_set", 14, 1);
+  EXPECT_EQ(load(), 1);
+  EXPECT_THAT(
+      platform.story({"slapi_register_supported_control"}),
+      ElementsAre("debug: config backend initialization error. Function number=-16\n", kRegister));
+}
+
 TEST_F(Registration, NamesTheSlotThatFailedForEverySlot) {
   const std::vector<int> slots = {200, 201, 202, 203, 204, 205, 206,
                                   207, -19, 209, 210, 208, -15, -16};

@@ -1,6 +1,9 @@
 // Search: authority, the path of an operation, and who sees which credentials.
 #include "config_search.h"
 
+#include <cerrno>
+#include <thread>
+
 #include "backend_test.h"
 #include "config_session.h"
 
@@ -233,6 +236,7 @@ TEST_F(Sending, DnIsNormalisedEvenForThePrimaryAdministrator) {
   platform.fail("replace_DN", 1, 34);
   EXPECT_EQ(send(), 34);
   EXPECT_EQ(platform.calls({"replace_DN"}), std::vector<std::string>{"replace_DN(\"cn=a\", 1)"});
+  EXPECT_EQ(final_result(), "send_search_result(connection, operation, 34, null, null, 0)");
 }
 
 // ---- Response control
@@ -343,6 +347,38 @@ TEST_F(Sending, EntriesBelowConfigurationKeepTheirAttributes) {
               ElementsAre("cn=x,cn=Configuration|orv-slapdAdminDN=d|orv-slapdAdminPW=p"));
 }
 
+TEST_F(Sending, LongerDnThatBeginsWithConfigurationKeepsItsAttributes) {
+  found({{"cn=Configuration,o=y", {{"orv-slapdAdminDN", {"d"}}, {"orv-slapdAdminPW", {"p"}}}}});
+  EXPECT_EQ(send(), 0);
+  EXPECT_THAT(platform.sent,
+              ElementsAre("cn=Configuration,o=y|orv-slapdAdminDN=d|orv-slapdAdminPW=p"));
+}
+
+// The normal form is in upper case: a text in lower case is not the normal form of these entries,
+// and not taken for them.
+TEST_F(Sending, ConfigurationIsRecognisedByteForByte) {
+  platform.keeps_letter_case = true;
+  found({{"cn=configuration", {{"orv-slapdAdminDN", {"d"}}, {"orv-slapdAdminPW", {"p"}}}}});
+  EXPECT_EQ(send(), 0);
+  EXPECT_THAT(platform.sent, ElementsAre("cn=configuration|orv-slapdAdminDN=d|orv-slapdAdminPW=p"));
+}
+
+TEST_F(Sending, GroupContainerIsRecognisedByteForByte) {
+  platform.keeps_letter_case = true;
+  found({{"cn=admingroup,cn=configuration", {{"orv-slapdAdminPW", {"p"}}}}});
+  EXPECT_EQ(send(), 0);
+  EXPECT_THAT(platform.sent, ElementsAre("cn=admingroup,cn=configuration|orv-slapdAdminPW=p"));
+  EXPECT_EQ(platform.count("attr_find"), 0);
+}
+
+TEST_F(Sending, EntryInsideTheGroupIsRecognisedByteForByte) {
+  platform.keeps_letter_case = true;
+  found({member("cn=you,o=orv", "cn=one,cn=admingroup,cn=configuration")});
+  EXPECT_EQ(send(), 0);
+  EXPECT_THAT(platform.sent.front(), testing::HasSubstr("orv-slapdAdminPW=pw"));
+  EXPECT_EQ(platform.count("attr_find"), 0);
+}
+
 TEST_F(Sending, GroupContainerIsSentUnchangedToEverybody) {
   found({{kGroup, {{"orv-slapdAdminDN", {"d"}}, {"orv-slapdAdminPW", {"p"}}}}});
   EXPECT_EQ(send(), 0);
@@ -395,6 +431,16 @@ TEST_F(Sending, EntriesBelowAMemberAreTreatedAsMembers) {
   EXPECT_THAT(platform.sent.front(), Not(testing::HasSubstr("orv-slapdAdminPW")));
 }
 
+TEST_F(Sending, EntriesThatHaveTheGroupAnywhereInTheirDnAreTreatedAsMembers) {
+  found({member("cn=you", "cn=x,cn=AdminGroup,cn=Configuration,o=y"),
+         member("cn=you", "cn=AdminGroup,cn=Configuration,o=y")});
+  EXPECT_EQ(send(), 0);
+  ASSERT_EQ(platform.sent.size(), 2U);
+  for (const std::string& sent : platform.sent) {
+    EXPECT_THAT(sent, Not(testing::HasSubstr("orv-slapdAdminPW")));
+  }
+}
+
 TEST_F(Sending, AnotherMembersEntryWithoutAPasswordLosesNothing) {
   found({{kMemberEntry, {{"orv-slapdAdminDN", {"cn=you"}}}}});
   EXPECT_EQ(send(), 0);
@@ -433,6 +479,14 @@ TEST_F(Sending, PasswordAloneIsSentToItsMember) {
                                   "\"CN=ONE,CN=ADMINGROUP,CN=CONFIGURATION\", 0"));
 }
 
+TEST_F(Sending, BoundDnIsComparedByteForByteWithTheMemberOfTheFile) {
+  as(kMember, "cn=me,o=orv");
+  platform.file[kMemberEntryNormal] = {{member("cn=me,o=orv")}};
+  found({password_only()});
+  EXPECT_EQ(send(), 0);
+  EXPECT_THAT(platform.sent, IsEmpty());
+}
+
 TEST_F(Sending, PasswordWithOtherAttributesLosesOnlyThePassword) {
   platform.file[kMemberEntryNormal] = {{member("cn=you,o=orv")}};
   found({{kMemberEntry, {{"cn", {"one"}}, {"orv-slapdAdminPW", {"p"}}}}});
@@ -453,6 +507,7 @@ TEST_F(Sending, PasswordOfAnotherThatCannotBeRemovedEndsWith16) {
   found({member("cn=you")});
   EXPECT_EQ(send(), 16);
   EXPECT_THAT(platform.sent, IsEmpty());
+  EXPECT_EQ(final_result(), "send_search_result(connection, operation, 16, null, null, 0)");
 }
 
 TEST_F(Sending, MembersDnThatCannotBeCopiedEndsWith90) {
@@ -460,6 +515,7 @@ TEST_F(Sending, MembersDnThatCannotBeCopiedEndsWith90) {
   found({member("cn=me,o=orv")});
   EXPECT_EQ(send(), 90);
   EXPECT_THAT(platform.sent, IsEmpty());
+  EXPECT_EQ(final_result(), "send_search_result(connection, operation, 90, null, null, 0)");
 }
 
 TEST_F(Sending, MembersDnThatCannotBeNormalisedEndsWithThatCode) {
@@ -467,13 +523,18 @@ TEST_F(Sending, MembersDnThatCannotBeNormalisedEndsWithThatCode) {
   found({member("cn=me,o=orv")});
   EXPECT_EQ(send(), 34);
   EXPECT_THAT(platform.sent, IsEmpty());
+  EXPECT_EQ(final_result(), "send_search_result(connection, operation, 34, null, null, 0)");
 }
 
 TEST_F(Sending, TypesOnlyMemberEntryHasNoDnToCompareAndLosesItsPassword) {
   platform.types_only_values = true;
-  found({member("cn=me,o=orv")});
-  EXPECT_EQ(send(), 0);
-  EXPECT_THAT(platform.sent, ElementsAre(std::string(kMemberEntry) + "|cn=|orv-slapdAdminDN="));
+  for (const bool null_lists : {false, true}) {
+    platform.forget();
+    platform.empty_lists_are_null = null_lists;
+    found({member("cn=me,o=orv")});
+    EXPECT_EQ(send(), 0);
+    EXPECT_THAT(platform.sent, ElementsAre(std::string(kMemberEntry) + "|cn=|orv-slapdAdminDN="));
+  }
 }
 
 // ---- The restricted view
@@ -520,6 +581,7 @@ TEST_F(Sending, RestrictedViewWithoutMemoryForTheBufferEndsWith90) {
   platform.fail_allocation(2);  // the first is the search that this test makes itself
   EXPECT_EQ(send(0), 90);
   EXPECT_THAT(platform.sent, IsEmpty());
+  EXPECT_EQ(final_result(), "send_search_result(connection, operation, 90, null, null, 0)");
 }
 
 TEST_F(Sending, LeavesAnExitRecord) {
@@ -540,7 +602,7 @@ class Search : public BackendTest {
     pb.put(parameter::target_dn, static_cast<const void*>("CN=K\xC3\xA4SE"));
     pb.put(parameter::search_filter, static_cast<const void*>(&pb));
     pb.put(parameter::search_filter_text, static_cast<const void*>("(cn=k\xC3\xA4se)"));
-    pb.put(parameter::search_scope, 1);
+    pb.put(parameter::search_scope, 2);
     pb.put(parameter::search_types_only, 1);
     pb.put(parameter::search_attributes, static_cast<const void*>(attributes));
     platform.file["CN=K\xE4SE"] = {{{"cn=a", {{"cn", {"a"}}}}}};
@@ -559,6 +621,13 @@ class Search : public BackendTest {
     ASSERT_GE(calls.size(), 3U);
     EXPECT_EQ(calls[calls.size() - 1], "pthread_mutex_unlock(configMutex)");
     EXPECT_THAT(calls[calls.size() - 2], testing::StartsWith("cfg_unbind("));
+  }
+
+  // The session failed: the file was not asked, and neither were its converters.
+  void expect_no_file_search() {
+    EXPECT_EQ(platform.count("xlate_utf8_to_localcp"), 0);
+    EXPECT_EQ(platform.count("cfg_search_s"), 0);
+    EXPECT_EQ(platform.count("send_search_result"), 0);
   }
 
   [[nodiscard]] std::vector<std::string> plain_results() const {
@@ -583,7 +652,19 @@ TEST_F(Search, RunsTheSameSearchOnTheFileInItsCodePage) {
   EXPECT_THAT(platform.calls({"cfg_search_s", "xlate_utf8_to_localcp"}),
               ElementsAre("xlate_utf8_to_localcp(\"CN=K\xC3\xA4SE\")",
                           "xlate_utf8_to_localcp(\"(cn=k\xC3\xA4se)\")",
-                          "cfg_search_s(session, \"CN=K\xE4SE\", 1, \"(cn=k\xE4se)\", [cn], 1)"));
+                          "cfg_search_s(session, \"CN=K\xE4SE\", 2, \"(cn=k\xE4se)\", [cn], 1)"));
+  expect_rest();
+}
+
+TEST_F(Search, AsksForEverythingAtTheBaseWhenTheClientDoes) {
+  pb.put(parameter::search_scope, 0);
+  pb.put(parameter::search_types_only, 0);
+  pb.put(parameter::search_attributes, static_cast<const void*>(nullptr));
+  EXPECT_EQ(search(), 0);
+  EXPECT_THAT(platform.calls({"cfg_search_s", "send_search_entry"}),
+              ElementsAre("cfg_search_s(session, \"CN=K\xE4SE\", 0, \"(cn=k\xE4se)\", null, 0)",
+                          "send_search_entry(backend, connection, operation, \"cn=a\", null, 0, "
+                          "null, null, null, null)"));
   expect_rest();
 }
 
@@ -617,17 +698,74 @@ TEST_F(Search, HoldsTheLockFromOpeningToTheEnd) {
 TEST_F(Search, StepsComeInTheirOrder) {
   EXPECT_EQ(search(), 0);
   EXPECT_THAT(
-      platform.calls({"pthread_mutex_lock", "pthread_mutex_unlock", "cfg_bind_s", "cfg_search_s",
-                      "send_search_result", "cfg_unbind"}),
+      platform.calls({"pthread_mutex_lock", "pthread_mutex_unlock", "cfg_bind_s",
+                      "xlate_utf8_to_localcp", "cfg_search_s", "send_search_result", "cfg_unbind"}),
       ElementsAre("pthread_mutex_lock(configMutex)", "cfg_bind_s(session, null, null, 128)",
+                  "xlate_utf8_to_localcp(\"CN=K\xC3\xA4SE\")",
+                  "xlate_utf8_to_localcp(\"(cn=k\xC3\xA4se)\")",
                   testing::StartsWith("cfg_search_s("), testing::StartsWith("send_search_result("),
                   "cfg_unbind(session)", "pthread_mutex_unlock(configMutex)"));
+}
+
+TEST_F(Search, SlotIsEmptyWhenTheLockIsReleased) {
+  bool empty = false;
+  const auto look = [&] { empty = connection.config_session == nullptr; };
+  platform.at("pthread_mutex_unlock", 1, look);
+  EXPECT_EQ(search(), 0);
+  EXPECT_TRUE(empty);
+
+  platform.forget();
+  platform.at("pthread_mutex_unlock", 1, look);
+  platform.fail("cfg_bind_s", 1, 1);
+  empty = false;
+  EXPECT_EQ(search(), 1);
+  EXPECT_TRUE(empty);
+
+  open_session();
+  platform.at("pthread_mutex_unlock", 1, look);
+  as(0x24);
+  empty = false;
+  EXPECT_EQ(search(), 50);
+  EXPECT_TRUE(empty);
 }
 
 TEST_F(Search, ResultOfTheEntriesIsTheResultOfTheSearch) {
   platform.fail("send_search_entry", 1, 3);
   EXPECT_EQ(search(), 3);
   expect_rest();
+}
+
+// A real mutex that knows its owner. The second thread would hang if the first had kept the lock,
+// and the lock could not be released by a thread that does not hold it.
+TEST_F(Search, ThreadsWithConnectionsOfTheirOwnFollowEachOtherOnARealMutex) {
+  platform.real_mutexes = true;
+  pthread_mutexattr_t attributes_of_mutex;
+  pthread_mutexattr_init(&attributes_of_mutex);
+  pthread_mutexattr_settype(&attributes_of_mutex, PTHREAD_MUTEX_ERRORCHECK);
+  pthread_mutex_init(&state.configMutex, &attributes_of_mutex);
+  pthread_mutexattr_destroy(&attributes_of_mutex);
+
+  int held_by_another = 0;
+  platform.at("cfg_search_s", 0, [&] {
+    std::thread([&] {
+      held_by_another += pthread_mutex_trylock(&state.configMutex) == EBUSY;
+    }).join();
+  });
+  Connection connections[2];
+  for (Connection& own : connections) {
+    scripted::connect(own);
+    pb.put(parameter::connection, &own);
+    int rc = -1;
+    std::thread([&] { rc = search(); }).join();
+    EXPECT_EQ(rc, 0);
+    EXPECT_EQ(own.config_session, nullptr);
+  }
+  EXPECT_EQ(held_by_another, 2);
+  EXPECT_EQ(platform.sent.size(), 2U);
+  EXPECT_THAT(platform.debug_lines(), Not(Contains(info("Could not unlock config mutex\n"))));
+  EXPECT_EQ(pthread_mutex_trylock(&state.configMutex), 0);
+  pthread_mutex_unlock(&state.configMutex);
+  pthread_mutex_destroy(&state.configMutex);
 }
 
 // ---- Clients who are gone
@@ -706,6 +844,7 @@ TEST_F(Search, LockFailureIsSentAndStillReleases) {
   EXPECT_EQ(search(), 80);
   EXPECT_THAT(plain_results(),
               ElementsAre("send_ldap_result(connection, operation, 80, null, \"\")"));
+  expect_no_file_search();
   expect_rest();
 }
 
@@ -715,6 +854,7 @@ TEST_F(Search, FailedBindIsSentAsOneAndLeavesNothing) {
   EXPECT_THAT(plain_results(),
               ElementsAre("send_ldap_result(connection, operation, 1, null, \"\")"));
   EXPECT_EQ(platform.calls({"cfg_unbind"}), std::vector<std::string>{"cfg_unbind(session)"});
+  expect_no_file_search();
   expect_rest();
 }
 
@@ -723,12 +863,16 @@ TEST_F(Search, NullHandleIsSentAs90AndReleasesTheLock) {
   EXPECT_EQ(search(), 90);
   EXPECT_THAT(plain_results(),
               ElementsAre("send_ldap_result(connection, operation, 90, null, \"\")"));
+  expect_no_file_search();
   expect_rest();
 }
 
 TEST_F(Search, ExceptionOfTheLibraryIsSentAsOne) {
   platform.at("cfg_init", 1, [] { throw 1; });
   EXPECT_EQ(search(), 1);
+  EXPECT_THAT(plain_results(),
+              ElementsAre("send_ldap_result(connection, operation, 1, null, \"\")"));
+  expect_no_file_search();
   expect_rest();
 }
 
@@ -746,6 +890,8 @@ TEST_F(Search, FilterThatCannotBeConvertedEndsBeforeTheSearch) {
   platform.fail("xlate_utf8_to_localcp", 2, 21);
   EXPECT_EQ(search(), 21);
   EXPECT_EQ(platform.count("cfg_search_s"), 0);
+  EXPECT_THAT(plain_results(),
+              ElementsAre("send_ldap_result(connection, operation, 21, null, \"\")"));
   expect_rest();
 }
 

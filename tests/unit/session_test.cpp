@@ -106,6 +106,26 @@ TEST_F(Session, AnyExceptionOfTheLibraryUnlocksAndGives1) {
   }
 }
 
+TEST_F(Session, ExceptionIsToldBeforeTheLockIsReleased) {
+  platform.at("cfg_init", 1, [] { throw 42; });
+  EXPECT_EQ(open(), 1);
+  EXPECT_THAT(platform.story({"pthread_mutex_lock", "cfg_init", "pthread_mutex_unlock"}),
+              ElementsAre("pthread_mutex_lock(configMutex)", "debug: Initing config32 handle \n",
+                          "cfg_init(null, 0)",
+                          "debug: CFG32 Threw an exception binding to the config file!\n",
+                          "pthread_mutex_unlock(configMutex)"));
+}
+
+TEST_F(Session, UnlockThatFailsAfterAnExceptionIsNotTold) {
+  platform.at("cfg_init", 1, [] { throw 42; });
+  platform.fail("pthread_mutex_unlock", 1, 1);
+  EXPECT_EQ(open(), 1);
+  EXPECT_THAT(platform.debug_lines(),
+              ElementsAre(detail("Initing config32 handle \n"),
+                          error("CFG32 Threw an exception binding to the config file!\n")));
+  rest();
+}
+
 TEST_F(Session, NullHandleIsStoredAndGives90WithTheLockHeld) {
   platform.fail("cfg_init", 1, 0);
   EXPECT_EQ(open(), 90);
@@ -224,6 +244,14 @@ TEST_F(BindAndUnbind, BindIsRefusedWith49WithoutASession) {
               ElementsAre("slapi_pblock_get(130)", "slapi_pblock_get(131)", "slapi_pblock_get(132)",
                           "send_ldap_result(connection, operation, 49, null, null)"));
   EXPECT_THAT(platform.debug_lines(), ElementsAre(info("entering config_back_bind...\n")));
+}
+
+TEST_F(BindAndUnbind, BindIsToldBeforeItIsAnswered) {
+  EXPECT_EQ(bind(), 49);
+  EXPECT_THAT(platform.story({"slapi_pblock_get", "send_ldap_result"}),
+              ElementsAre("slapi_pblock_get(130)", "slapi_pblock_get(131)", "slapi_pblock_get(132)",
+                          "debug: entering config_back_bind...\n",
+                          "send_ldap_result(connection, operation, 49, null, null)"));
 }
 
 TEST_F(BindAndUnbind, ConnectionThatNeverUsedTheBackendTakesNoLock) {

@@ -65,7 +65,7 @@ const scripted::ScriptedAttribute* find(const _CFGMessage* entry, const char* at
 
 // The name of the attribute that the walk has come to, or the walk's end.
 char* name_at(const _CFGMessage* entry, std::size_t position) {
-  if (entry == nullptr || position >= entry->script->attributes.size()) return none(0);
+  if (position >= entry->script->attributes.size()) return none(0);
   done(0);
   return platform().give_text(Owned::cfg_text, entry->script->attributes[position].type);
 }
@@ -162,6 +162,7 @@ char* cfg_first_attribute(_CFG* session, _CFGMessage* entry, _CFGBer** cursor) {
   const Call call("cfg_first_attribute", session, entry);
   *cursor = nullptr;
   if (const auto failure = call.failure_or_no_memory()) return none(*failure);
+  if (entry == nullptr) return none(1);
   char* name = name_at(entry, 0);
   if (name != nullptr) {
     *cursor = static_cast<_CFGBer*>(platform().give(Owned::cursor, sizeof(_CFGBer)));
@@ -173,6 +174,7 @@ char* cfg_first_attribute(_CFG* session, _CFGMessage* entry, _CFGBer** cursor) {
 char* cfg_next_attribute(_CFG* session, _CFGMessage* entry, _CFGBer* cursor) {
   const Call call("cfg_next_attribute", session, entry, cursor);
   if (const auto failure = call.failure_or_no_memory()) return none(*failure);
+  if (cursor == nullptr) return none(0);
   return name_at(entry, ++cursor->position);
 }
 

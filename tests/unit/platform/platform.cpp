@@ -124,6 +124,7 @@ void Platform::forget() {
   failures_.clear();
   actions_.clear();
   sent.clear();
+  allocation_names_.clear();
   failing_allocation_ = 0;
   allocations_ = 0;
   unlocks_of_free_ = 0;
@@ -273,6 +274,8 @@ char* Platform::give_text(Owned kind, const std::string& text) {
 
 void Platform::note(void* block, Owned kind) {
   blocks_[block] = kind;
+  const auto named = allocation_names_.find(allocations_);
+  if (named != allocation_names_.end()) names_[block] = named->second;
 }
 
 std::optional<Owned> Platform::owner(const void* block) const {

@@ -106,9 +106,12 @@ class Platform {
   std::string link_target;             // what readlink finds
   int link_errno = 0;                  // or why it fails
   std::map<std::string, std::string> environment;
-  bool server_debug = false;       // read_ldap_debug()
-  pthread_t thread = 0;            // pthread_self()
-  bool types_only_values = false;  // value arrays come back empty
+  bool server_debug = false;          // read_ldap_debug()
+  pthread_t thread = 0;               // pthread_self()
+  bool types_only_values = false;     // value arrays come back empty
+  bool empty_lists_are_null = false;  // entries have a null list where there are no values
+  bool keeps_letter_case = false;     // replace_DN does not fold
+  bool real_mutexes = false;          // mutexes are taken, and not only modelled
 
   // The n-th call of a function (from 1; 0 for each) gives `result`: the code it returns, or null
   // with that error number for functions that return a pointer.
@@ -118,6 +121,8 @@ class Platform {
   // The n-th allocation fails: by the code under test itself or, on its behalf, by the platform.
   void fail_allocation(int nth) { failing_allocation_ = nth; }
   [[nodiscard]] int allocations() const { return allocations_; }
+  // What the n-th allocation gives is known by that name; its release with free is then a call.
+  void name_allocation(int nth, const std::string& name) { allocation_names_[nth] = name; }
   // Forgets calls and script of failures, and starts counting again. What is owned and locked
   // stays.
   void forget();
@@ -144,6 +149,7 @@ class Platform {
   void set_held(const pthread_mutex_t* mutex, bool held);
   [[nodiscard]] int unlocks_of_free_mutexes() const { return unlocks_of_free_; }
   [[nodiscard]] int mutexes_alive() const { return mutexes_alive_; }
+  [[nodiscard]] const pthread_mutex_t* last_mutex_made() const { return last_mutex_made_; }
 
   // What has not been released, one word each ("cursor", "cfg_values"...), and wrong releases.
   [[nodiscard]] std::vector<std::string> leaks() const;
@@ -175,7 +181,11 @@ class Platform {
   int lock(const pthread_mutex_t* mutex);
   int try_lock(const pthread_mutex_t* mutex);
   int unlock(const pthread_mutex_t* mutex);
-  void mutex_made() { ++mutexes_alive_; }
+  void mutex_made(const pthread_mutex_t* mutex) {
+    ++mutexes_alive_;
+    last_mutex_made_ = mutex;
+    mutexes_[mutex] = false;
+  }
   void mutex_gone() { --mutexes_alive_; }
 
   int error = 0;  // cfg_get_errno
@@ -216,6 +226,8 @@ class Platform {
   int allocations_ = 0;
   int unlocks_of_free_ = 0;
   int mutexes_alive_ = 0;
+  const pthread_mutex_t* last_mutex_made_ = nullptr;
+  std::map<int, std::string> allocation_names_;
 };
 
 // Whether the calling thread is inside code under test, and not inside the platform.

@@ -175,7 +175,8 @@ std::string cleaned(const char* dn, bool upper) {
 int replace_DN(char** dn, int fold) {
   const Call call("replace_DN", *dn, fold);
   if (const auto failure = call.failure_or_no_memory()) return *failure;
-  char* normalized = platform().give_text(Owned::text, cleaned(*dn, fold == 1));
+  char* normalized =
+      platform().give_text(Owned::text, cleaned(*dn, fold == 1 && !platform().keeps_letter_case));
   platform().take_back(*dn, Owned::text, "replace_DN");
   *dn = normalized;
   return 0;
@@ -240,6 +241,7 @@ attr* make_attribute(const char* type, berval** values) {
   auto* a = static_cast<attr*>(platform().give(Owned::part, sizeof(attr)));
   a->type = platform().give_text(Owned::part, type);
   while (values[a->count] != nullptr) ++a->count;
+  if (a->count == 0 && platform().empty_lists_are_null) return a;
   const auto count = static_cast<std::size_t>(a->count);
   a->values = static_cast<berval**>(platform().give(Owned::part, (count + 1) * sizeof(berval*)));
   for (std::size_t i = 0; i < count; ++i) a->values[i] = copy_of(*values[i]);
@@ -248,7 +250,7 @@ attr* make_attribute(const char* type, berval** values) {
 
 std::string show_values(berval** values) {
   std::string text;
-  for (berval** value = values; *value != nullptr; ++value) {
+  for (berval** value = values; value != nullptr && *value != nullptr; ++value) {
     text += (value == values ? "" : ",");
     text += (*value)->bv_val == nullptr ? "<null " + std::to_string((*value)->bv_len) + ">"
                                         : std::string((*value)->bv_val, (*value)->bv_len);

@@ -86,9 +86,9 @@ int __real_pthread_mutex_init(pthread_mutex_t* mutex, const pthread_mutexattr_t*
 int __wrap_pthread_mutex_init(pthread_mutex_t* mutex, const pthread_mutexattr_t* attributes) {
   if (!observed()) return __real_pthread_mutex_init(mutex, attributes);
   const Call call("pthread_mutex_init", mutex, attributes);
-  Platform::current()->mutex_made();
-  Platform::current()->set_held(mutex, false);
-  return call.failure().value_or(0);
+  Platform::current()->mutex_made(mutex);
+  if (call.failure()) return *call.failure();
+  return Platform::current()->real_mutexes ? __real_pthread_mutex_init(mutex, attributes) : 0;
 }
 
 int __real_pthread_mutex_destroy(pthread_mutex_t* mutex);
@@ -96,7 +96,8 @@ int __wrap_pthread_mutex_destroy(pthread_mutex_t* mutex) {
   if (!observed()) return __real_pthread_mutex_destroy(mutex);
   const Call call("pthread_mutex_destroy", mutex);
   Platform::current()->mutex_gone();
-  return call.failure().value_or(0);
+  if (call.failure()) return *call.failure();
+  return Platform::current()->real_mutexes ? __real_pthread_mutex_destroy(mutex) : 0;
 }
 
 int __real_pthread_mutex_lock(pthread_mutex_t* mutex);
@@ -104,6 +105,7 @@ int __wrap_pthread_mutex_lock(pthread_mutex_t* mutex) {
   if (!observed()) return __real_pthread_mutex_lock(mutex);
   const Call call("pthread_mutex_lock", mutex);
   if (call.failure()) return *call.failure();
+  if (Platform::current()->real_mutexes) return __real_pthread_mutex_lock(mutex);
   return Platform::current()->lock(mutex);
 }
 
@@ -112,6 +114,7 @@ int __wrap_pthread_mutex_trylock(pthread_mutex_t* mutex) {
   if (!observed()) return __real_pthread_mutex_trylock(mutex);
   const Call call("pthread_mutex_trylock", mutex);
   if (call.failure()) return *call.failure();
+  if (Platform::current()->real_mutexes) return __real_pthread_mutex_trylock(mutex);
   return Platform::current()->try_lock(mutex);
 }
 
@@ -120,6 +123,7 @@ int __wrap_pthread_mutex_unlock(pthread_mutex_t* mutex) {
   if (!observed()) return __real_pthread_mutex_unlock(mutex);
   const Call call("pthread_mutex_unlock", mutex);
   if (call.failure()) return *call.failure();
+  if (Platform::current()->real_mutexes) return __real_pthread_mutex_unlock(mutex);
   return Platform::current()->unlock(mutex);
 }
 
