@@ -1,25 +1,32 @@
 #include "logs.h"
 
 #include <fcntl.h>
+#include <poll.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <charconv>
+#include <condition_variable>
 #include <cstdio>
 #include <cstring>
 #include <ctime>
+#include <deque>
+#include <mutex>
+#include <thread>
+#include <utility>
 
-#include <spdlog/async.h>
+#include <spdlog/details/null_mutex.h>
+#include <spdlog/logger.h>
 #include <spdlog/pattern_formatter.h>
-#include <spdlog/sinks/basic_file_sink.h>
-#include <spdlog/sinks/stdout_sinks.h>
+#include <spdlog/sinks/base_sink.h>
 
 namespace orv::server {
 namespace {
 
-constexpr std::size_t kQueuedMessages = 1024;
 constexpr std::size_t kLaneBytes = 32 * 1024;
+// What a queued line costs beside its text.
+constexpr std::size_t kLineBytes = 128;
 constexpr const char* kErrorPattern = "%Y-%m-%dT%H:%M:%S.%eZ %l %v";
 
 spdlog::level::level_enum spdlog_level(LogLevel level) {
@@ -46,36 +53,253 @@ LogLevel level_of(std::string_view name) {
   return LogLevel::info;
 }
 
-bool same_file(const struct stat& a, const std::string& path) {
-  struct stat b {};
-  return stat(path.c_str(), &b) == 0 && a.st_dev == b.st_dev && a.st_ino == b.st_ino;
+// ---- files
+
+class Descriptor {
+ public:
+  explicit Descriptor(int number = -1) noexcept : number_(number) {}
+  Descriptor(Descriptor&& other) noexcept : number_(std::exchange(other.number_, -1)) {}
+  Descriptor& operator=(Descriptor&& other) noexcept {
+    std::swap(number_, other.number_);
+    return *this;
+  }
+  ~Descriptor() {
+    if (number_ >= 0) ::close(number_);
+  }
+  int get() const noexcept { return number_; }
+
+ private:
+  int number_;
+};
+
+bool same_file(const struct stat& a, const struct stat& b) noexcept {
+  return a.st_dev == b.st_dev && a.st_ino == b.st_ino;
 }
 
-// Why a path cannot be a log, or "". Creates the file, for its owner only, when it is not there.
-std::string refuse_target(const std::string& path, const std::vector<std::string>& guarded) {
-  // O_NONBLOCK: a named pipe without a reader must not hold the server up.
-  const int fd = ::open(path.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC | O_NONBLOCK, 0600);
-  if (fd < 0) return std::strerror(errno);
-  struct stat found {};
-  const bool known = fstat(fd, &found) == 0;
-  ::close(fd);
-  if (!known || !S_ISREG(found.st_mode)) return "not a regular file";
-  for (const std::string& other : guarded)
-    if (same_file(found, other)) return "the same file as " + other;
+// A log file that was opened, and which file it turned out to be.
+struct LogFile {
+  Descriptor descriptor;
+  struct stat status {};
+  bool made = false;
+};
+
+// O_NONBLOCK: a named pipe without a reader must not hold the server up. A file that is not there
+// is made for its owner only.
+bool open_log_file(const std::string& path, LogFile& file) {
+  constexpr int kFlags = O_WRONLY | O_APPEND | O_CLOEXEC | O_NONBLOCK | O_NOCTTY;
+  int fd = ::open(path.c_str(), kFlags);
+  if (fd < 0 && errno == ENOENT) {
+    fd = ::open(path.c_str(), kFlags | O_CREAT | O_EXCL, 0600);
+    file.made = fd >= 0;
+    if (fd < 0 && errno == EEXIST) fd = ::open(path.c_str(), kFlags | O_CREAT, 0600);
+  }
+  file.descriptor = Descriptor(fd);
+  return fd >= 0;
+}
+
+// Why the opened file cannot be a log, or "".
+std::string refuse(const LogFile& file, const std::vector<std::string>& guarded) {
+  if (!S_ISREG(file.status.st_mode)) return "not a regular file";
+  for (const std::string& other : guarded) {
+    struct stat status {};
+    if (stat(other.c_str(), &status) == 0 && same_file(file.status, status))
+      return "the same file as " + other;
+  }
   return "";
 }
 
-std::shared_ptr<spdlog::sinks::sink> make_sink(const std::string& path) {
-  if (path.empty()) return std::make_shared<spdlog::sinks::stderr_sink_mt>();
-  return std::make_shared<spdlog::sinks::basic_file_sink_mt>(path);
+// Opens a log that is none of the guarded files. It is examined once it is open: what its name
+// meant before may be something else by now.
+std::string open_guarded(const std::string& path, const std::vector<std::string>& guarded,
+                         LogFile& file) {
+  if (!open_log_file(path, file) || fstat(file.descriptor.get(), &file.status) != 0)
+    return std::strerror(errno);
+  std::string reason = refuse(file, guarded);
+  if (!reason.empty() && file.made) ::unlink(path.c_str());
+  return reason;
+}
+
+// ---- sinks
+
+void write_all(int fd, const char* text, std::size_t length) noexcept {
+  constexpr int kPatience = 1000;  // milliseconds; only the thread of the logs waits
+  while (length > 0) {
+    const ssize_t written = ::write(fd, text, length);
+    if (written >= 0) {
+      text += written;
+      length -= static_cast<std::size_t>(written);
+      continue;
+    }
+    if (errno == EINTR) continue;
+    pollfd polled{fd, POLLOUT, 0};
+    if (errno != EAGAIN || ::poll(&polled, 1, kPatience) <= 0) return;
+  }
+}
+
+// Standard error, or a file of its own. One thread writes.
+class Sink final : public spdlog::sinks::base_sink<spdlog::details::null_mutex> {
+ public:
+  Sink() : number_(STDERR_FILENO) {}
+  explicit Sink(Descriptor file) : file_(std::move(file)), number_(file_.get()) {}
+
+ protected:
+  void sink_it_(const spdlog::details::log_msg& message) override {
+    spdlog::memory_buf_t text;
+    formatter_->format(message, text);
+    write_all(number_, text.data(), text.size());
+  }
+  void flush_() override {}
+
+ private:
+  Descriptor file_;
+  int number_;
+};
+
+}  // namespace
+
+// ---- the queue
+
+// One of the two logs: where it goes now, and what waits to be written, each to where it went when
+// it was said.
+struct Logs::Log {
+  struct Line {
+    std::shared_ptr<spdlog::logger> logger;
+    spdlog::log_clock::time_point time;
+    spdlog::level::level_enum level;
+    std::string text;
+  };
+
+  std::shared_ptr<spdlog::logger> logger;
+  struct stat file {};  // st_ino 0: no file
+  std::deque<Line> lines;
+  std::size_t bytes = 0;
+  std::uint64_t lost = 0;
+
+  void push(Line line) {
+    const std::size_t size = line.text.size() + kLineBytes;
+    while (!lines.empty() && bytes + size > kMaxQueuedBytes) {
+      drop_front();
+      ++lost;
+    }
+    if (size > kMaxQueuedBytes) {
+      ++lost;
+      return;
+    }
+    lines.push_back(std::move(line));
+    bytes += size;
+  }
+
+  Line pop() {
+    Line line = std::move(lines.front());
+    bytes -= line.text.size() + kLineBytes;
+    lines.pop_front();
+    return line;
+  }
+
+ private:
+  void drop_front() {
+    bytes -= lines.front().text.size() + kLineBytes;
+    lines.pop_front();
+  }
+};
+
+struct Logs::Writer {
+  std::mutex mutex;  // guards all
+  std::condition_variable changed;
+  Log error;
+  Log access;
+  bool ending = false;
+  bool ended = false;
+
+  Log& log(bool of_access) noexcept { return of_access ? access : error; }
+
+  void run() noexcept {
+    std::unique_lock lock(mutex);
+    while (wait(lock)) write_one(lock);
+    ended = true;
+    changed.notify_all();
+  }
+
+ private:
+  // False at the end, when everything is written.
+  bool wait(std::unique_lock<std::mutex>& lock) {
+    changed.wait(lock, [this] { return !error.lines.empty() || !access.lines.empty() || ending; });
+    return !error.lines.empty() || !access.lines.empty();
+  }
+
+  void write_one(std::unique_lock<std::mutex>& lock) noexcept {
+    try {
+      say_what_was_lost();
+      const Log::Line line = (error.lines.empty() ? access : error).pop();
+      lock.unlock();
+      line.logger->log(line.time, {}, line.level, line.text);
+    } catch (...) {
+      // Without memory the line is lost.
+    }
+    if (!lock.owns_lock()) lock.lock();
+  }
+
+  void say_what_was_lost() {
+    const std::uint64_t lost = std::exchange(error.lost, 0) + std::exchange(access.lost, 0);
+    if (lost == 0 || !error.logger) return;
+    error.push({error.logger, spdlog::log_clock::now(), spdlog::level::warn,
+                std::to_string(lost) + " pieces of log were given up, they could not be written"});
+  }
+};
+
+// ---- opening
+
+namespace {
+
+// What one log is to become.
+struct Candidate {
+  LogFile file;  // with a path and a level only
+  std::string path;
+  LogLevel level = LogLevel::off;
+  std::string reason;  // it is refused
+
+  bool accepted() const { return reason.empty(); }
+};
+
+Candidate examine(const std::string& path, const std::string& level,
+                  const std::vector<std::string>& guarded) {
+  Candidate wanted;
+  wanted.path = path;
+  wanted.level = level_of(level);
+  if (path.empty() || wanted.level == LogLevel::off) return wanted;
+  wanted.reason = open_guarded(path, guarded, wanted.file);
+  return wanted;
+}
+
+void refuse_if_same(Candidate& wanted, const struct stat& other, const char* other_name) {
+  if (!wanted.accepted() || other.st_ino == 0 || !same_file(wanted.file.status, other)) return;
+  wanted.reason = std::string("the same file as the ") + other_name;
+}
+
+std::shared_ptr<spdlog::logger> make_logger(Candidate& wanted, bool access) {
+  std::shared_ptr<Sink> sink;
+  if (wanted.file.descriptor.get() >= 0)
+    sink = std::make_shared<Sink>(std::move(wanted.file.descriptor));
+  else
+    sink = std::make_shared<Sink>();
+  auto made = std::make_shared<spdlog::logger>(access ? "access" : "error", std::move(sink));
+  const bool on = wanted.level != LogLevel::off;
+  made->set_level(access && on ? spdlog::level::info : spdlog_level(wanted.level));
+  // Access lines come finished, with their own time and newline.
+  made->set_formatter(std::make_unique<spdlog::pattern_formatter>(
+      access ? "%v" : kErrorPattern, spdlog::pattern_time_type::utc, access ? "" : "\n"));
+  return made;
 }
 
 }  // namespace
 
 Logs::Logs(std::vector<std::string> guarded_files)
     : guarded_files_(std::move(guarded_files)),
-      writer_(std::make_shared<spdlog::details::thread_pool>(kQueuedMessages, 1)) {
-  open_one("", "info", false);
+      writer_(std::make_shared<Writer>()),
+      thread_([writer = writer_] { writer->run(); }) {
+  Candidate standard_error;
+  standard_error.level = LogLevel::info;
+  writer_->error.logger = make_logger(standard_error, false);
 }
 
 Logs::~Logs() {
@@ -84,52 +308,47 @@ Logs::~Logs() {
 
 std::vector<std::string> Logs::open(const Settings& settings) {
   std::vector<std::string> problems;
-  for (const bool access : {false, true}) {
-    const std::string& path = access ? settings.access_log : settings.error_log;
-    const std::string reason =
-        open_one(path, access ? settings.access_log_level : settings.error_log_level, access);
-    if (!reason.empty()) problems.push_back("cannot log to " + path + ": " + reason);
+  try {
+    Candidate error = examine(settings.error_log, settings.error_log_level, guarded_files_);
+    Candidate access = examine(settings.access_log, settings.access_log_level, guarded_files_);
+    const std::lock_guard lock(writer_->mutex);
+    // Who is refused keeps what it had, which the other one may not take either.
+    if (error.accepted()) refuse_if_same(access, error.file.status, "error log");
+    if (!access.accepted()) refuse_if_same(error, writer_->access.file, "access log");
+    if (!error.accepted()) refuse_if_same(access, writer_->error.file, "error log");
+    for (Candidate* const wanted : {&error, &access}) {
+      if (!wanted->accepted()) {
+        problems.push_back("cannot log to " + wanted->path + ": " + wanted->reason);
+        continue;
+      }
+      Log& log = writer_->log(wanted == &access);
+      log.logger = make_logger(*wanted, wanted == &access);
+      log.file = wanted->file.status;
+    }
+    if (access.accepted())
+      access_on_.store(access.level == LogLevel::info || access.level == LogLevel::debug,
+                       std::memory_order_relaxed);
+  } catch (const std::exception& e) {
+    problems.emplace_back(e.what());
   }
   return problems;
 }
 
-std::string Logs::open_one(const std::string& path, const std::string& level, bool access) {
-  const LogLevel wanted = level_of(level);
-  try {
-    if (!path.empty() && wanted != LogLevel::off) {
-      std::string reason = refuse_target(path, guarded_files_);
-      if (!reason.empty()) return reason;
-    }
-    auto made = std::make_shared<spdlog::async_logger>(
-        access ? "access" : "error", make_sink(wanted == LogLevel::off ? "" : path), writer_,
-        spdlog::async_overflow_policy::overrun_oldest);
-    made->set_level(access && wanted != LogLevel::off ? spdlog::level::info : spdlog_level(wanted));
-    // Access lines come finished, with their own time and newline.
-    made->set_formatter(std::make_unique<spdlog::pattern_formatter>(
-        access ? "%v" : kErrorPattern, spdlog::pattern_time_type::utc, access ? "" : "\n"));
-    // Errors are to be seen at once; access lines come in batches anyway.
-    made->flush_on(spdlog::level::trace);
-    const std::lock_guard lock(mutex_);
-    (access ? access_ : error_) = std::move(made);
-    if (access)
-      access_on_.store(wanted == LogLevel::info || wanted == LogLevel::debug,
-                       std::memory_order_relaxed);
-    return "";
-  } catch (const std::exception& e) {
-    return e.what();
-  }
-}
+// ---- writing
 
-Logs::Logger Logs::logger(const Logger& which) const {
-  const std::lock_guard lock(mutex_);
-  return which;
+bool Logs::queue(bool access, LogLevel level, std::string_view text) {
+  const std::lock_guard lock(writer_->mutex);
+  Log& log = writer_->log(access);
+  if (!log.logger || writer_->ending) return false;
+  if (!log.logger->should_log(spdlog_level(level))) return true;
+  log.push({log.logger, spdlog::log_clock::now(), spdlog_level(level), std::string(text)});
+  writer_->changed.notify_all();
+  return true;
 }
 
 void Logs::write(LogLevel level, std::string_view line) noexcept {
   try {
-    if (const Logger log = logger(error_))
-      log->log(spdlog_level(level), spdlog::string_view_t(line.data(), line.size()));
-    else if (level <= LogLevel::warning)
+    if (!queue(false, level, line) && level <= LogLevel::warning)
       std::fprintf(stderr, "%.*s\n", static_cast<int>(line.size()), line.data());
   } catch (...) {
     // Without memory the line is lost; the server goes on.
@@ -138,20 +357,30 @@ void Logs::write(LogLevel level, std::string_view line) noexcept {
 
 void Logs::write_access(std::string_view lines) noexcept {
   try {
-    if (const Logger access = logger(access_))
-      access->info(spdlog::string_view_t(lines.data(), lines.size()));
+    queue(true, LogLevel::info, lines);
   } catch (...) {
   }
 }
 
-void Logs::finish() noexcept {
-  std::shared_ptr<spdlog::details::thread_pool> drained;
-  Logger loggers[2];
-  const std::lock_guard lock(mutex_);
+std::size_t Logs::queued_bytes() const {
+  const std::lock_guard lock(writer_->mutex);
+  return writer_->error.bytes + writer_->access.bytes;
+}
+
+bool Logs::finish(std::chrono::milliseconds patience) noexcept {
   access_on_.store(false, std::memory_order_relaxed);
-  loggers[0].swap(error_);
-  loggers[1].swap(access_);
-  drained.swap(writer_);  // its thread writes what is queued before it ends
+  if (!thread_.joinable()) return true;
+  std::unique_lock lock(writer_->mutex);
+  writer_->ending = true;
+  writer_->changed.notify_all();
+  const bool ended = writer_->changed.wait_for(lock, patience, [this] { return writer_->ended; });
+  lock.unlock();
+  // A thread that a file system or a reader holds up goes with the process.
+  if (ended)
+    thread_.join();
+  else
+    thread_.detach();
+  return ended;
 }
 
 std::string& AccessLane::begin(std::uint64_t connection) {

@@ -1,8 +1,9 @@
 // The error log and the access log.
 //
-// Writers never wait for a disk or a terminal: lines go to a queue that a thread of its own
-// empties; when a sink stalls for long, the oldest lines are given up. Each event loop collects its
-// access lines in a lane of its own and hands them over in batches.
+// Writers never wait for a disk or a terminal: lines go to queues that a thread of its own empties.
+// Each queue is bounded by bytes; when a sink stalls for long, the oldest lines are given up, and
+// the error log says how many. Each event loop collects its access lines in a lane of its own and
+// hands them over in batches.
 //
 // Threads: `Logs` is thread-safe; an `AccessLane` belongs to one thread.
 #pragma once
@@ -11,19 +12,12 @@
 #include <chrono>
 #include <cstdint>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <string_view>
+#include <thread>
 #include <vector>
 
 #include "settings.h"
-
-namespace spdlog {
-class logger;
-namespace details {
-class thread_pool;
-}
-}  // namespace spdlog
 
 namespace orv::server {
 
@@ -31,6 +25,11 @@ enum class LogLevel { error, warning, info, debug, off };
 
 class Logs {
  public:
+  // The most that one queue holds.
+  static constexpr std::size_t kMaxQueuedBytes = 8 * 1024 * 1024;
+  // How long finish() waits for what is queued.
+  static constexpr std::chrono::milliseconds kPatience{3000};
+
   // Starts with the error log on standard error at level info and no access log. `guarded_files`
   // are files that no log may share (the configuration file, its save file, the key stash).
   explicit Logs(std::vector<std::string> guarded_files = {});
@@ -39,8 +38,8 @@ class Logs {
   Logs& operator=(const Logs&) = delete;
 
   // Opens what the settings name, also when they name the same files again (somebody may have moved
-  // them away). A log that cannot be opened keeps the one it had; the reasons are returned, one
-  // line each.
+  // them away). A log that cannot be opened, or is a guarded file or the other log under whatever
+  // name, keeps the file it had; the reasons are returned, one line each.
   std::vector<std::string> open(const Settings& settings);
 
   // Writes one line to the error log.
@@ -55,21 +54,25 @@ class Logs {
   // Writes finished access lines.
   void write_access(std::string_view lines) noexcept;
 
+  // Bytes that wait to be written.
+  std::size_t queued_bytes() const;
+
   // Waits until everything written so far is out and closes the logs; later errors go straight to
-  // standard error. For the end of the process.
-  void finish() noexcept;
+  // standard error. False when something was still waiting after `patience`: the thread that writes
+  // is then left behind, and the process should end without destructors. For the end of the
+  // process.
+  bool finish(std::chrono::milliseconds patience = kPatience) noexcept;
 
  private:
-  using Logger = std::shared_ptr<spdlog::logger>;
+  struct Log;
+  struct Writer;
 
-  Logger logger(const Logger& which) const;
-  std::string open_one(const std::string& path, const std::string& level, bool access);
+  // False when the log is not open or closed again.
+  bool queue(bool access, LogLevel level, std::string_view text);
 
   const std::vector<std::string> guarded_files_;
-  std::shared_ptr<spdlog::details::thread_pool> writer_;
-  mutable std::mutex mutex_;
-  Logger error_;
-  Logger access_;
+  std::shared_ptr<Writer> writer_;  // shared with its thread
+  std::thread thread_;
   std::atomic<bool> access_on_{false};
 };
 

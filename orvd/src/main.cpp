@@ -1,7 +1,9 @@
 // orvd: reads its configuration, loads the configuration backend and serves it over LDAP.
+#include <fcntl.h>
 #include <sys/prctl.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <csignal>
 #include <cstdio>
@@ -11,9 +13,11 @@
 #include <memory>
 #include <string>
 #include <thread>
+#include <utility>
 #include <vector>
 
 #include "auth/identities.h"
+#include "broken_file.h"
 #include "cfg/attribute_table.h"
 #include "cfg/diagnostics.h"
 #include "logs.h"
@@ -29,6 +33,7 @@
 #include "slapi/log.h"
 #include "slapi/schema.h"
 #include "slapi/trace.h"
+#include "standard_error.h"
 
 namespace orv::server {
 namespace {
@@ -54,10 +59,23 @@ void diagnostics_to_log(const char* line) noexcept {
 
 // ---- who may bind
 
+// What was found in a file that changed.
+void tell(Logs& logs, const std::string& error, const std::vector<std::string>& warnings) noexcept {
+  try {
+    if (!error.empty()) logs.error("the identities stay as they were: " + error);
+  } catch (...) {
+  }
+  for (const std::string& warning : warnings) logs.warning(warning);
+}
+
 class StoredIdentities final : public Authenticator {
  public:
   StoredIdentities(const Options& options, Logs& logs)
-      : store_(options.config_file, options.key_stash_file), logs_(logs) {}
+      : store_(options.config_file, options.key_stash_file,
+               [&logs](const std::string& error, const std::vector<std::string>& warnings) {
+                 tell(logs, error, warnings);
+               }),
+        logs_(logs) {}
 
   bool reload(std::string& error) {
     std::vector<std::string> warnings;
@@ -75,6 +93,13 @@ class StoredIdentities final : public Authenticator {
     return {identities, found};  // the snapshot lives as long as somebody is bound by it
   }
 
+  std::uint64_t generation() const noexcept override { return store_.generation(); }
+
+  bool still_valid(const Identity& bound) const noexcept override {
+    const std::shared_ptr<const Identities> identities = store_.latest();
+    return identities && identities->still_valid(bound);
+  }
+
  private:
   IdentityStore store_;
   Logs& logs_;
@@ -82,7 +107,16 @@ class StoredIdentities final : public Authenticator {
 
 // ---- the process
 
+// A file of the server's must never become what the libraries take for standard error.
+void open_standard_descriptors() {
+  int opened = 0;
+  do opened = open("/dev/null", O_RDWR);
+  while (opened >= 0 && opened <= STDERR_FILENO);
+  if (opened >= 0) close(opened);
+}
+
 void prepare_process() {
+  open_standard_descriptors();
   std::signal(SIGPIPE, SIG_IGN);
   umask(077);
 #if !defined(__SANITIZE_ADDRESS__)  // the leak check attaches to its own process
@@ -96,10 +130,32 @@ void prepare_process() {
   }
 }
 
+// Files that nothing may be written to but what belongs there.
+std::vector<std::string> own_files(const Options& options) {
+  const std::string& config = options.config_file;
+  return {config, config + ".save", options.key_stash_file,
+          config.substr(0, config.rfind('/') + 1) + "admin.pw"};
+}
+
+bool may_be_traced_to(const Options& options) {
+  struct stat trace {};
+  struct stat own {};
+  if (options.trace_file.empty() || stat(options.trace_file.c_str(), &trace) != 0) return true;
+  for (const std::string& file : own_files(options)) {
+    if (stat(file.c_str(), &own) != 0 || own.st_dev != trace.st_dev || own.st_ino != trace.st_ino)
+      continue;
+    std::fprintf(stderr, "orvd: %s: the same file as %s\n", options.trace_file.c_str(),
+                 file.c_str());
+    return false;
+  }
+  return true;
+}
+
 bool apply_options(const Options& options) {
   g_srvType.store(options.server_type, std::memory_order_relaxed);
   g_safe_mode.store(options.safe_mode ? 1 : 0, std::memory_order_relaxed);
   set_ldap_debug(options.debug);
+  if (!may_be_traced_to(options)) return false;
   if (options.trace_mask) trcEvents.store(*options.trace_mask, std::memory_order_relaxed);
   if (!options.trace_file.empty())
     if (const int failure = set_trace_file(options.trace_file.c_str())) {
@@ -168,9 +224,10 @@ Publications publications() {
   facts.supported_features = {"1.3.6.1.4.1.4203.1.5.1"};  // all operational attributes, RFC 3673
   facts.vendor_name = "orv";
   facts.vendor_version = ORV_VERSION;
-  const std::time_t started = std::time(nullptr);
-  return {[facts] { return make_root_dse(facts); },
-          [started] { return make_subschema(builtin_schema(), started); }};
+  // The schema does not change while the server runs, and making the entry costs more than a
+  // search.
+  std::shared_ptr<const entry> subschema = make_subschema(builtin_schema(), std::time(nullptr));
+  return {[facts] { return make_root_dse(facts); }, [subschema] { return subschema; }};
 }
 
 void report(Logs& logs, const std::vector<std::string>& problems) {
@@ -179,9 +236,11 @@ void report(Logs& logs, const std::vector<std::string>& problems) {
 
 int serve(const Options& options, const Settings& settings, Logs& logs,
           StoredIdentities& identities, BackendPlace& place) {
+  BrokenFileReporter broken_file(options.config_file, options.key_stash_file, logs);
   Server server({builtin_schema(), place.backend, identities, publications(), logs,
                  slapi_supported_controls(), settings,
-                 std::max(1U, std::thread::hardware_concurrency()), [&](Settings& wanted) {
+                 std::max(1U, std::thread::hardware_concurrency()),
+                 [&](Settings& wanted) {
                    std::string error;
                    if (!read_settings(options.config_file, options.key_stash_file, wanted, error) ||
                        !identities.reload(error)) {
@@ -192,7 +251,8 @@ int serve(const Options& options, const Settings& settings, Logs& logs,
                    configfile_read.fetch_add(1, std::memory_order_relaxed);
                    logs.info("settings taken over");
                    return true;
-                 }});
+                 },
+                 [&broken_file] { broken_file.note_failure(); }});
   std::string error;
   const auto& addresses = options.addresses.empty() ? settings.addresses : options.addresses;
   const auto port = options.port.value_or(static_cast<std::uint16_t>(settings.port));
@@ -218,7 +278,9 @@ int run(const Options& options) {
   }
   configfile_read.store(1, std::memory_order_relaxed);
 
-  Logs logs({options.config_file, options.config_file + ".save", options.key_stash_file});
+  std::vector<std::string> guarded = own_files(options);
+  if (!options.trace_file.empty()) guarded.push_back(options.trace_file);
+  Logs logs(std::move(guarded));
   sink_logs = &logs;
   set_message_sink(message_to_log);
   cfg::set_diagnostics_sink(diagnostics_to_log);
@@ -238,8 +300,9 @@ int run(const Options& options) {
       }
     }
   }
-  logs.finish();
+  const bool finished = logs.finish();
   sink_logs = nullptr;
+  if (!finished) std::_Exit(status);  // something still holds on to what destructors take away
   return status;
 }
 
@@ -252,6 +315,7 @@ int main(int argc, char** argv) {
   int status = 0;
   if (parse_options(argc, argv, options, status) == Parsed::exit) return status;
   prepare_process();
+  const StandardError standard_error;
   try {
     return run(options);
   } catch (const std::exception& error) {

@@ -9,6 +9,8 @@
 #include <utility>
 
 #include "slapi/globals.h"
+#include "standard_error.h"
+#include "stop_watchdog.h"
 
 namespace orv::server {
 namespace {
@@ -20,6 +22,17 @@ constexpr std::chrono::milliseconds kGateInterval{100};
 // How long a stopping server waits for the operation in hand, and for clients to leave.
 constexpr std::chrono::seconds kPatience{30};
 constexpr std::chrono::seconds kFarewell{3};
+// What all the rest of a stop may take before the process is ended.
+constexpr std::chrono::seconds kWindUp{30};
+// The same for handlers that may wait for the lock of a backend that has failed.
+constexpr std::chrono::seconds kLockPatience{1};
+
+// For a process with a thread that nobody can wait for.
+[[noreturn]] void end_at_once(Logs& logs) noexcept {
+  logs.finish();
+  drain_standard_error(StandardError::kPatience);
+  std::_Exit(1);
+}
 
 }  // namespace
 
@@ -46,6 +59,7 @@ Server::Server(ServerParts parts)
                 {}},
       settings_(std::make_shared<const Settings>(parts_.settings)),
       listeners_(control_, services_, counter_, loops_) {
+  services_.note_failure = parts_.note_failure;
   for (unsigned i = 0; i < std::max(1U, parts_.loops); ++i)
     loops_.push_back(std::make_unique<Loop>(parts_.logs, settings_));
 }
@@ -76,8 +90,8 @@ void Server::await_signal() {
   signals_.async_wait([this](const asio::error_code& error, int number) {
     if (error) return;
     if (number != SIGHUP) return stop();
-    reload();
     await_signal();
+    reload();
   });
 }
 
@@ -86,9 +100,19 @@ int Server::serve() {
   watch_gate();
   for (const auto& loop : loops_) loop->start();
   listeners_.start(settings_);
-  control_.run();
+  control();
   wind_up();
   return backend_.failed() ? 1 : 0;
+}
+
+// What fails on the control thread (a connection that could not be taken in, a reload) fails alone.
+void Server::control() {
+  for (;;) try {
+      control_.run();
+      return;
+    } catch (const std::exception& error) {
+      parts_.logs.error(std::string("not done: ") + error.what());
+    }
 }
 
 void Server::stop() {
@@ -99,24 +123,27 @@ void Server::watch_gate() {
   gate_timer_.expires_after(kGateInterval);
   gate_timer_.async_wait([this](const asio::error_code& error) {
     if (error) return;
-    backend_.gate().expire(Clock::now());
     watch_gate();
+    backend_.gate().expire(Clock::now());
   });
 }
 
 void Server::wind_up() {
+  const StopWatchdog watchdog(kPatience + kWindUp);
   parts_.logs.info("stopping");
   listeners_.close();
-  // What was cancelled holds sockets that belong to the loops, which end before the control
-  // context.
+  // What was cancelled is told so.
   control_.restart();
   control_.poll();
   services_.stopping.store(true, std::memory_order_relaxed);
   const bool closed = backend_.close(kPatience);
   if (!closed && !backend_.failed()) {
     parts_.logs.error("an operation does not end; its thread cannot be waited for");
-    parts_.logs.finish();
-    std::_Exit(1);
+    end_at_once(parts_.logs);
+  }
+  if (backend_.failed() && !backend_.calls_ended(kLockPatience)) {
+    parts_.logs.error("the backend holds a thread; it cannot be waited for");
+    end_at_once(parts_.logs);
   }
   // The answer to the operation in hand goes to its loop before the farewell does.
   changes_.join();

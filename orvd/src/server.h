@@ -34,6 +34,8 @@ struct ServerParts {
   unsigned loops = 1;
   // Reads everything anew after SIGHUP; false keeps the settings. May be empty.
   std::function<bool(Settings&)> reload;
+  // Told when an operation failed because the backend could not open its session. May be empty.
+  std::function<void()> note_failure{};
 };
 
 class Server {
@@ -67,6 +69,7 @@ class Server {
   std::int64_t connections() const { return counter_.count(); }
 
  private:
+  void control();
   void watch_gate();
   void wind_up();
   void stop_workers();

@@ -1,40 +1,42 @@
 #include "settings.h"
 
 #include <charconv>
-#include <limits>
 #include <optional>
 
 #include "cfg/owners.h"
 #include "cfg/result_codes.h"
 #include "cfg/session.h"
 #include "cfg/text.h"
+#include "config/setting_ranges.h"
 
 namespace orv::server {
 namespace {
 
-constexpr std::int64_t kMaxSeconds = 86400;
-constexpr std::int64_t kMaxCount = 1000000;
-constexpr std::int64_t kGigabyte = 1 << 30;
+// A row with the bounds that the tools know too; a setting without any does not compile.
+consteval SettingRow row(std::string_view name, std::int64_t Settings::*member,
+                         bool needs_restart = false) {
+  for (const SettingRange& range : kSettingRanges)
+    if (range.name == name) return {name, range.minimum, range.maximum, member, needs_restart};
+  throw "a setting without a range";
+}
 
 constexpr SettingRow kRows[] = {
-    {"orv-slapdPort", 0, 65535, &Settings::port, true},
-    {"orv-slapdSizeLimit", 0, std::numeric_limits<std::int32_t>::max(), &Settings::size_limit,
-     false},
-    {"orv-slapdTimeLimit", 0, kMaxSeconds, &Settings::time_limit, false},
-    {"orv-slapdIdleTimeOut", 0, kMaxSeconds, &Settings::idle_timeout, false},
-    {"orv-slapdMaxMessageSize", 1024, kGigabyte, &Settings::max_message_size, false},
-    {"orv-slapdMaxConnections", 1, kMaxCount, &Settings::max_connections, false},
-    {"orv-slapdMaxConnectionsPerAddress", 1, kMaxCount, &Settings::max_connections_per_address,
-     false},
-    {"orv-slapdMaxPendingOperations", 1, kMaxCount, &Settings::max_pending_operations, false},
-    {"orv-slapdMaxFilterDepth", 1, 1024, &Settings::max_filter_depth, false},
-    {"orv-slapdMaxControls", 1, kMaxCount, &Settings::max_controls, false},
-    {"orv-slapdMaxAttributes", 1, kMaxCount, &Settings::max_attributes, false},
-    {"orv-slapdMaxValues", 1, kMaxCount, &Settings::max_values, false},
-    {"orv-slapdMaxResultSize", 1024, kGigabyte, &Settings::max_result_size, false},
-    {"orv-slapdOperationWait", 1, kMaxSeconds, &Settings::operation_wait, false},
-    {"orv-slapdWriteTimeOut", 1, kMaxSeconds, &Settings::write_timeout, false},
-    {"orv-slapdMessageTimeOut", 1, kMaxSeconds, &Settings::message_timeout, false},
+    row("orv-slapdPort", &Settings::port, true),
+    row("orv-slapdSizeLimit", &Settings::size_limit),
+    row("orv-slapdTimeLimit", &Settings::time_limit),
+    row("orv-slapdIdleTimeOut", &Settings::idle_timeout),
+    row("orv-slapdMaxMessageSize", &Settings::max_message_size),
+    row("orv-slapdMaxConnections", &Settings::max_connections),
+    row("orv-slapdMaxConnectionsPerAddress", &Settings::max_connections_per_address),
+    row("orv-slapdMaxPendingOperations", &Settings::max_pending_operations),
+    row("orv-slapdMaxFilterDepth", &Settings::max_filter_depth),
+    row("orv-slapdMaxControls", &Settings::max_controls),
+    row("orv-slapdMaxAttributes", &Settings::max_attributes),
+    row("orv-slapdMaxValues", &Settings::max_values),
+    row("orv-slapdMaxResultSize", &Settings::max_result_size),
+    row("orv-slapdOperationWait", &Settings::operation_wait),
+    row("orv-slapdWriteTimeOut", &Settings::write_timeout),
+    row("orv-slapdMessageTimeOut", &Settings::message_timeout),
 };
 
 constexpr const char* kConfiguration = "CN=CONFIGURATION";
@@ -103,7 +105,7 @@ bool read_log(_CFG* session, const char* dn, std::string& path, std::string& lev
     error = std::string(dn) + ": orv-slapdLog is not an absolute path";
     return false;
   }
-  for (const std::string_view known : {"error", "warning", "info", "debug", "off"})
+  for (const std::string_view known : kLogLevels)
     if (level == known) return true;
   error = std::string(dn) + ": orv-slapdLogLevel is none of error, warning, info, debug, off";
   return false;
@@ -135,6 +137,11 @@ bool apply_setting(const SettingRow& row, std::string_view value, Settings& sett
   error = std::string(row.name) + " must be an integer from " + std::to_string(row.minimum) +
           " to " + std::to_string(row.maximum);
   return false;
+}
+
+bool can_open(const std::string& config_file, const std::string& key_stash_file,
+              std::string& cause) {
+  return open_session(config_file, key_stash_file, cause) != nullptr;
 }
 
 bool read_settings(const std::string& config_file, const std::string& key_stash_file,

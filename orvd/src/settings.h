@@ -60,6 +60,10 @@ bool apply_setting(const SettingRow& row, std::string_view value, Settings& sett
 bool read_settings(const std::string& config_file, const std::string& key_stash_file,
                    Settings& settings, std::string& error);
 
+// Whether a session on the file can be opened; the cause (file, line, column, in words) when not.
+bool can_open(const std::string& config_file, const std::string& key_stash_file,
+              std::string& cause);
+
 // The settings that a reload cannot change while the server runs and in which the two differ, by
 // attribute name.
 std::vector<std::string_view> restart_needed(const Settings& running, const Settings& wanted);

@@ -541,5 +541,173 @@ TEST_F(Store, ServesManyThreadsWhileTheFileIsReplaced) {
   EXPECT_EQ(failures, 0);
 }
 
+// ---- What a try costs
+
+// Which stored passwords were verified, in their order.
+std::vector<std::string>& verified() {
+  static std::vector<std::string> stored;
+  return stored;
+}
+
+bool record_and_refuse(const cfg::Key*, cfg::SecretPlace, std::string_view stored,
+                       std::string_view) noexcept {
+  verified().emplace_back(stored);
+  return false;
+}
+
+class CostOfATry : public IdentitiesOfAFile {
+ protected:
+  const std::string cheap_ = "cheappw";
+  const std::string few_ = "{PBKDF2-SHA256}1000$c2FsdHNhbHQ$MDEyMzQ1Njc4OTAxMjM0NQ";
+  const std::string many_ = "{pbkdf2-sha512}600000$c2FsdHNhbHQ$MDEyMzQ1Njc4OTAxMjM0NQ";
+
+  std::vector<std::string> tried(const Identities& identities, const char* name,
+                                 const char* password = "guess") {
+    verified().clear();
+    EXPECT_EQ(identities.authenticate(name, password, record_and_refuse), nullptr);
+    return verified();
+  }
+};
+
+TEST_F(CostOfATry, OfAnUnknownNameIsThatOfTheCostliestPassword) {
+  const auto identities = read(kTop + kGroup + member("a", "cn=a", few_) +
+                               member("b", "cn=b", many_) + member("c", "cn=c", cheap_));
+  ASSERT_TRUE(identities) << error_;
+  for (const char* name : {"cn=nobody", "not a dn", "cn=x,cn=configuration"})
+    EXPECT_THAT(tried(*identities, name), ElementsAre(many_)) << name;
+}
+
+TEST_F(CostOfATry, OfAKnownNameIsThatOfItsOwnPasswordAndTheCostliestWhenItsOwnIsCheap) {
+  const auto identities =
+      read(kTop + kGroup + member("b", "cn=b", many_) + member("c", "cn=c", cheap_));
+  ASSERT_TRUE(identities) << error_;
+  EXPECT_THAT(tried(*identities, "cn=b"), ElementsAre(many_));
+  EXPECT_THAT(tried(*identities, "cn=c"), ElementsAre(cheap_, many_));
+}
+
+TEST_F(CostOfATry, IsOneVerificationWhereAllPasswordsAreCheap) {
+  const auto identities = read(kTop + kGroup + member("c", "cn=c", cheap_));
+  ASSERT_TRUE(identities) << error_;
+  EXPECT_THAT(tried(*identities, "cn=c"), ElementsAre(cheap_));
+  EXPECT_EQ(tried(*identities, "cn=nobody").size(), 1U);
+}
+
+TEST_F(CostOfATry, CountsNoNumberOfIterationsThatIsNeverComputed) {
+  const auto identities =
+      read(kTop + kGroup + member("a", "cn=a", many_) +
+           member("b", "cn=b", "{PBKDF2-SHA256}99999999$c2FsdHNhbHQ$MDEyMzQ1Njc4OTAxMjM0NQ"));
+  ASSERT_TRUE(identities) << error_;
+  EXPECT_THAT(tried(*identities, "cn=nobody"), ElementsAre(many_));
+}
+
+TEST_F(CostOfATry, NeverMakesTheAnswerOfAnotherPasswordCount) {
+  const auto identities = read(kTop);
+  ASSERT_TRUE(identities) << error_;
+  EXPECT_EQ(identities->authenticate("cn=nobody", "rootpw"), nullptr);
+  EXPECT_EQ(identities->authenticate("cn=nobody", "rootpw",
+                                     [](const cfg::Key*, cfg::SecretPlace, std::string_view,
+                                        std::string_view) noexcept { return true; }),
+            nullptr);
+}
+
+// ---- Grants that still stand
+
+class Grants : public IdentitiesOfAFile {
+ protected:
+  const std::string before_ = kTop + kGroup + member("m", "cn=m", "mpw");
+
+  // Whether what cn=m proved by `before_` stands by `after`.
+  bool stands(const std::string& after) {
+    const auto old = read(before_);
+    EXPECT_TRUE(old) << error_;
+    const Identity* const bound = old->authenticate("cn=m", "mpw");
+    EXPECT_NE(bound, nullptr);
+    const auto fresh = read(after);
+    EXPECT_TRUE(fresh) << error_;
+    return bound != nullptr && fresh != nullptr && fresh->still_valid(*bound);
+  }
+};
+
+TEST_F(Grants, StandWhileNothingOfTheIdentityChanges) {
+  EXPECT_TRUE(stands(before_));
+  EXPECT_TRUE(stands("# a comment\n" + before_ + member("other", "cn=other", "opw")));
+  EXPECT_TRUE(stands(kTop + "orv-slapdSizeLimit: 5\n" + kGroup + member("m", "CN = M", "mpw")));
+}
+
+TEST_F(Grants, FallWithTheEntryItsNameItsRolesItsPasswordAndTheGroup) {
+  EXPECT_FALSE(stands(kTop + kGroup));
+  EXPECT_FALSE(stands(kTop + kGroup + member("n", "cn=m", "mpw"))) << "another entry";
+  EXPECT_FALSE(stands(kTop + kGroup + member("m", "cn=n", "mpw"))) << "another name";
+  EXPECT_FALSE(
+      stands(kTop + kGroup + member("m", "cn=m", "mpw", "orv-slapdAdminRole: SchemaAdmin\n")));
+  EXPECT_FALSE(stands(kTop + kGroup + member("m", "cn=m", "new"))) << "another password";
+  EXPECT_FALSE(
+      stands(kTop + "orv-slapdAdminGroupEnabled: FALSE\n" + kGroup + member("m", "cn=m", "mpw")));
+  EXPECT_FALSE(stands(before_ + member("twin", "cn=m", "mpw"))) << "claimed twice";
+}
+
+TEST_F(Grants, FallWithTheFlags) {
+  const auto identities = read(before_);
+  ASSERT_TRUE(identities) << error_;
+  Identity bound = *identities->authenticate("cn=m", "mpw");
+  EXPECT_TRUE(identities->still_valid(bound));
+  bound.authority = authority::primary_administrator;
+  EXPECT_FALSE(identities->still_valid(bound));
+}
+
+// ---- What the store tells
+
+TEST_F(Store, TellsTheCauseOfADamageOnceForEachStateOfTheFile) {
+  write(with_password("one"));
+  std::vector<std::string> told;
+  IdentityStore store(config(), "",
+                      [&](const std::string& error, const auto&) { told.push_back(error); });
+  ASSERT_TRUE(store.reload(error_, warnings_)) << error_;
+  const auto generation = store.generation();
+  EXPECT_TRUE(binds(store, "one"));
+  replace("damaged\n");
+  EXPECT_TRUE(binds(store, "one"));
+  EXPECT_TRUE(binds(store, "one"));
+  EXPECT_THAT(told, ElementsAre(HasSubstr(config())));
+  EXPECT_EQ(store.generation(), generation);
+  replace("damaged otherwise\n");
+  EXPECT_TRUE(binds(store, "one"));
+  EXPECT_EQ(told.size(), 2U);
+  replace(with_password("one"));
+  EXPECT_TRUE(binds(store, "one"));
+  EXPECT_EQ(told.size(), 2U);
+  EXPECT_GT(store.generation(), generation);
+  EXPECT_EQ(store.latest(), store.current());
+}
+
+TEST_F(Store, TellsDoubtsOnceForEachStateOfTheFile) {
+  write(with_password("one"));
+  std::vector<std::string> told;
+  IdentityStore store(config(), "", [&](const std::string& error, const auto& warnings) {
+    EXPECT_EQ(error, "");
+    told.insert(told.end(), warnings.begin(), warnings.end());
+  });
+  ASSERT_TRUE(store.reload(error_, warnings_)) << error_;
+  replace(kTop + kGroup + member("a", "cn=a", "x") + member("b", "cn=a", "y"));
+  for (int i = 0; i < 3; ++i) store.current();
+  EXPECT_THAT(told, ElementsAre(HasSubstr("same bind DN")));
+}
+
+TEST_F(Store, NoticesThatAMissingFileCameAndWentAgain) {
+  write(with_password("one"));
+  int told = 0;
+  IdentityStore store(config(), "", [&](const std::string&, const auto&) { ++told; });
+  ASSERT_TRUE(store.reload(error_, warnings_)) << error_;
+  std::filesystem::remove(config());
+  store.current();
+  store.current();
+  EXPECT_EQ(told, 1);
+  replace(with_password("one"));
+  store.current();
+  std::filesystem::remove(config());
+  store.current();
+  EXPECT_EQ(told, 2);
+}
+
 }  // namespace
 }  // namespace orv::server

@@ -70,6 +70,24 @@ TEST(Gate, IsHandedOverSoThatNobodyWhoComesLaterOvertakes) {
   EXPECT_EQ(gate.enter(later, kNever), Gate::Entry::queued);
 }
 
+TEST(Gate, PrefersWaitersOfTheThreadThatLeavesButLetsNobodyWaitForLong) {
+  Gate gate;
+  EXPECT_EQ(gate.enter(waiter(), kNever), Gate::Entry::inside);
+  const auto elsewhere = waiter();
+  std::thread([&] { gate.enter(elsewhere, kNever); }).join();
+  int own_admitted = 0;
+  constexpr int kOwn = 100;
+  for (int i = 0; i < kOwn; ++i)
+    EXPECT_EQ(gate.enter(waiter([&](Verdict) { ++own_admitted; }), kNever), Gate::Entry::queued);
+  gate.leave();
+  EXPECT_EQ(own_admitted, 1);
+  EXPECT_TRUE(elsewhere->verdicts.empty());
+  while (elsewhere->verdicts.empty()) gate.leave();
+  EXPECT_LT(own_admitted, 20);
+  while (gate.waiting() > 0) gate.leave();
+  EXPECT_EQ(own_admitted, kOwn);
+}
+
 TEST(Gate, ElsewhereAsksTheWaiterEvenWhenItIsOpen) {
   Gate gate;
   const auto elsewhere = waiter();

@@ -75,7 +75,7 @@ class ServerTest : public testing::Test {
                       reload};
     server.emplace(std::move(parts));
     std::string error;
-    ASSERT_TRUE(server->listen({"127.0.0.1"}, 0, error)) << error;
+    ASSERT_TRUE(server->listen(addresses, 0, error)) << error;
     if (reload) server->handle_signals();
     control = std::thread([this] { status = server->serve(); });
   }
@@ -106,6 +106,7 @@ class ServerTest : public testing::Test {
   Settings settings;
   Logs logs;
   std::function<bool(Settings&)> reload;
+  std::vector<std::string> addresses{"127.0.0.1"};
   std::optional<Server> server;
   std::thread control;
   int status = -1;
@@ -409,6 +410,31 @@ TEST_F(BlockedServerTest, TooManyOutstandingOperationsWaitWithoutBeingRead) {
   for (int id = 2; id <= 4; ++id) EXPECT_EQ(client.receive()->id, id);
 }
 
+TEST_F(BlockedServerTest, MessageIdStillInUseEndsTheConnectionWithANotice) {
+  block();
+  WireClient client(port());
+  bind_as(client, kRoot);
+  client.send(test::search(2, kTop));
+  ASSERT_TRUE(wait_for_waiters(1));
+  client.send(test::search(2, ""));
+  const std::optional<Reply> notice = client.receive();
+  ASSERT_TRUE(notice);
+  EXPECT_EQ(notice->id, 0);
+  EXPECT_EQ(notice->tag, kNotice);
+  EXPECT_EQ(notice->code, 2);
+  EXPECT_TRUE(client.closed());
+  EXPECT_TRUE(wait_for_waiters(0));
+}
+
+TEST_F(BlockedServerTest, MessageIdOfAnAbandonedOperationMayBeUsedAgain) {
+  block();
+  holder->send(test::abandon(3, 2) + test::search(2, ""));
+  const std::vector<Reply> replies = holder->receive_result();
+  ASSERT_FALSE(replies.empty());
+  EXPECT_EQ(replies.back().id, 2);
+  EXPECT_EQ(replies.back().code, 0);
+}
+
 TEST_F(ServerTest, UnbindHandlerIsCalledOnceForEachConnection) {
   backend.on_unbind = [&](pblock*) {
     unbound.happen();
@@ -425,7 +451,7 @@ TEST_F(ServerTest, UnbindHandlerIsCalledOnceForEachConnection) {
   EXPECT_EQ(backend.calls(parameter::unbind_function), 1);
 }
 
-// A search in the library that goes on until it is interrupted.
+// A search in the library that goes on until it is interrupted. With scope 0 it runs on the loop.
 class LongSearchTest : public ServerTest {
  protected:
   LongSearchTest() {
@@ -469,7 +495,7 @@ TEST_F(LongSearchTest, EndsWhenItIsAbandonedThoughItsThreadIsBusy) {
   start(1);
   WireClient client(port());
   bind_as(client, kRoot);
-  client.send(test::search(2, kTop, 2));
+  client.send(test::search(2, kTop));
   ASSERT_TRUE(entered.wait());
   client.send(test::abandon(3, 2) + test::search(4, ""));
   EXPECT_EQ(client.receive_result().back().id, 4);
@@ -484,7 +510,7 @@ TEST_F(LongSearchTest, EndsWhenItsClientLeft) {
   start(1);
   WireClient client(port());
   bind_as(client, kRoot);
-  client.send(test::search(2, kTop, 2));
+  client.send(test::search(2, kTop));
   ASSERT_TRUE(entered.wait());
   client.close();
   ASSERT_TRUE(unbound.wait());
@@ -658,6 +684,58 @@ TEST_F(ServerTest, ConnectionsBeyondTheLimitAreRefusedWithANotice) {
   EXPECT_EQ(code_of(first, test::search(2, "")), 0);
 }
 
+TEST_F(ServerTest, ConnectionsOfOneAddressBeyondItsLimitAreRefusedAndOthersAreNot) {
+  settings.max_connections_per_address = 1;
+  start();
+  std::optional<WireClient> first(std::in_place, "127.0.0.1", port(), "127.0.0.2");
+  EXPECT_EQ(code_of(*first, test::search(1, "")), 0);
+  WireClient second("127.0.0.1", port(), "127.0.0.2");
+  const std::optional<Reply> notice = second.receive();
+  ASSERT_TRUE(notice);
+  EXPECT_EQ(notice->tag, kNotice);
+  EXPECT_EQ(notice->code, 51);
+  EXPECT_TRUE(second.closed());
+  WireClient elsewhere("127.0.0.1", port(), "127.0.0.3");
+  EXPECT_EQ(code_of(elsewhere, test::search(1, "")), 0);
+  // The place is free again once the first has left.
+  first.reset();
+  const auto end = Clock::now() + 10s;
+  while (server->connections() != 1 && Clock::now() < end) std::this_thread::yield();
+  WireClient third("127.0.0.1", port(), "127.0.0.2");
+  EXPECT_EQ(code_of(third, test::search(1, "")), 0);
+}
+
+// A host without IPv6 answers the same through its IPv4 listener.
+TEST_F(ServerTest, ListensOnAnIpv6AddressBesideAnIpv4One) {
+  const bool ipv6 = test::host_has_ipv6();
+  if (ipv6) addresses = {"::1", "127.0.0.1"};
+  start();
+  EXPECT_EQ(server->url(), (ipv6 ? "ldap://[::1]:" : "ldap://127.0.0.1:") + std::to_string(port()));
+  for (const std::string& address : addresses) {
+    WireClient client(address, port());
+    EXPECT_EQ(code_of(client, test::search(1, "")), 0) << address;
+  }
+}
+
+TEST_F(ServerTest, WithoutAddressesItListensOnAllOfTheHost) {
+  addresses.clear();
+  start();
+  std::vector<std::string> reachable{"127.0.0.1", "127.0.0.2"};
+  if (test::host_has_ipv6()) reachable.push_back("::1");
+  for (const std::string& address : reachable) {
+    WireClient client(address, port());
+    EXPECT_EQ(code_of(client, test::search(1, "")), 0) << address;
+  }
+}
+
+TEST_F(ServerTest, AddressThatIsNotOfThisHostIsAnErrorThatNamesIt) {
+  addresses = {"127.0.0.1"};
+  start();
+  std::string error;
+  EXPECT_FALSE(server->listen({"192.0.2.1"}, 0, error));
+  EXPECT_NE(error.find("192.0.2.1"), std::string::npos);
+}
+
 TEST(ConnectionCounter, CountsInAllAndByAddressAndTakesTicketsBack) {
   ConnectionCounter counter;
   auto a1 = counter.admit("a", 3, 2);
@@ -713,6 +791,25 @@ TEST_F(BlockedServerTest, StopFinishesTheOperationInHandAndClosesTheBackend) {
   ASSERT_TRUE(reply);
   EXPECT_EQ(reply->code, 53);
   EXPECT_EQ(client->receive()->tag, kNotice);
+}
+
+TEST_F(ServerTest, StopTellsIdleClientsAndDoesNotWaitForThemToLeave) {
+  start();
+  WireClient idle(port());
+  EXPECT_EQ(code_of(idle, test::search(1, "")), 0);
+  // One that was told to leave before, and has not.
+  WireClient parting(port());
+  parting.send("not LDAP at all");
+  EXPECT_EQ(parting.receive()->tag, kNotice);
+  const auto begin = Clock::now();
+  stop();
+  EXPECT_LT(Clock::now() - begin, 1500ms);
+  const std::optional<Reply> notice = idle.receive();
+  ASSERT_TRUE(notice);
+  EXPECT_EQ(notice->tag, kNotice);
+  EXPECT_EQ(notice->code, 52);
+  EXPECT_TRUE(idle.closed());
+  EXPECT_TRUE(parting.closed());
 }
 
 TEST_F(ServerTest, HandlerThatThrowsEndsTheServerWithAFailure) {

@@ -127,13 +127,50 @@ std::string control(std::string_view oid, bool critical) {
   return tlv(0x30, tlv(0x04, oid) + boolean(critical));
 }
 
-WireClient::WireClient(std::uint16_t port) : socket_(::socket(AF_INET, SOCK_STREAM, 0)) {
-  sockaddr_in address{};
-  address.sin_family = AF_INET;
-  address.sin_port = htons(port);
-  address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  if (::connect(socket_, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0)
-    throw std::runtime_error("cannot connect");
+namespace {
+
+struct Address {
+  sockaddr_storage storage{};
+  socklen_t length = 0;
+  const sockaddr* get() const { return reinterpret_cast<const sockaddr*>(&storage); }
+};
+
+Address address_of(const std::string& text, std::uint16_t port) {
+  Address address;
+  auto* const v4 = reinterpret_cast<sockaddr_in*>(&address.storage);
+  auto* const v6 = reinterpret_cast<sockaddr_in6*>(&address.storage);
+  if (::inet_pton(AF_INET, text.c_str(), &v4->sin_addr) == 1) {
+    v4->sin_family = AF_INET;
+    v4->sin_port = htons(port);
+    address.length = sizeof *v4;
+  } else if (::inet_pton(AF_INET6, text.c_str(), &v6->sin6_addr) == 1) {
+    v6->sin6_family = AF_INET6;
+    v6->sin6_port = htons(port);
+    address.length = sizeof *v6;
+  }
+  return address;
+}
+
+}  // namespace
+
+bool host_has_ipv6() {
+  const int socket = ::socket(AF_INET6, SOCK_STREAM, 0);
+  const Address loopback = address_of("::1", 0);
+  const bool has = socket >= 0 && ::bind(socket, loopback.get(), loopback.length) == 0;
+  if (socket >= 0) ::close(socket);
+  return has;
+}
+
+WireClient::WireClient(std::uint16_t port) : WireClient("127.0.0.1", port) {}
+
+WireClient::WireClient(const std::string& address, std::uint16_t port, const std::string& from) {
+  const Address to = address_of(address, port);
+  socket_ = ::socket(to.storage.ss_family, SOCK_STREAM, 0);
+  const Address own = from.empty() ? Address{} : address_of(from, 0);
+  const bool bound = own.length == 0 || ::bind(socket_, own.get(), own.length) == 0;
+  if (bound && ::connect(socket_, to.get(), to.length) == 0) return;
+  close();
+  throw std::runtime_error("cannot connect to " + address);
 }
 
 WireClient::~WireClient() {

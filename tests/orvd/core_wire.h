@@ -35,9 +35,15 @@ struct Reply {
   std::string body;
 };
 
+// Whether this host has the IPv6 loopback address.
+bool host_has_ipv6();
+
 class WireClient {
  public:
   explicit WireClient(std::uint16_t port);
+  // To a literal IPv4 or IPv6 address, from a certain one of this host ("": any). Throws
+  // std::runtime_error when there is no connection.
+  WireClient(const std::string& address, std::uint16_t port, const std::string& from = "");
   ~WireClient();
   WireClient(const WireClient&) = delete;
   WireClient& operator=(const WireClient&) = delete;

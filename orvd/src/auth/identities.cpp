@@ -1,11 +1,16 @@
 #include "auth/identities.h"
 
+#include <openssl/evp.h>
+
 #include <algorithm>
+#include <charconv>
+#include <new>
 #include <unordered_map>
 #include <utility>
 
 #include "auth/identity_reader.h"
 #include "cfg/dn.h"
+#include "cfg/text.h"
 #include "slapi/codepage.h"
 #include "slapi/owners.h"
 
@@ -39,19 +44,53 @@ class Secret {
   std::string text;
 };
 
+// ---- What a verification costs
+
+// Iterations of a stored password that is hashed with many; 0 for all others, which cost nothing
+// beside it, and for numbers beyond those that are computed at all.
+std::uint64_t cost_of(std::string_view stored) noexcept {
+  constexpr std::uint64_t kMost = 10'000'000;
+  constexpr std::string_view kSchemes[] = {"{PBKDF2-SHA256}", "{PBKDF2-SHA512}"};
+  for (const std::string_view scheme : kSchemes) {
+    if (!cfg::equals_ignore_ascii_case(stored.substr(0, scheme.size()), scheme)) continue;
+    const std::string_view count = stored.substr(scheme.size(), stored.find('$') - scheme.size());
+    std::uint64_t iterations = 0;
+    std::from_chars(count.data(), count.data() + count.size(), iterations);
+    return iterations <= kMost ? iterations : 0;
+  }
+  return 0;
+}
+
+void digest_password(IdentityRecord& record) {
+  const std::string& stored = record.stored_password;
+  if (EVP_Digest(stored.data(), stored.size(), record.identity.password_digest.data(), nullptr,
+                 EVP_sha256(), nullptr) != 1) {
+    throw std::bad_alloc();
+  }
+}
+
+bool same_grant(const Identity& a, const Identity& b) noexcept {
+  return a.entry_dn == b.entry_dn && a.bound_dn == b.bound_dn && a.authority == b.authority &&
+         a.roles == b.roles && a.password_digest == b.password_digest;
+}
+
 }  // namespace
 
 struct Identities::Data {
   cfg::KeyPtr key;
   std::vector<IdentityRecord> records;
   std::unordered_map<std::string_view, const IdentityRecord*> by_dn;  // null: claimed twice
+  const IdentityRecord* costliest = nullptr;                          // null: nobody has a password
+  std::uint64_t highest_cost = 0;
 
   ~Data() {
     for (IdentityRecord& record : records) cfg::wipe(record.stored_password);
   }
 
   void index(std::vector<std::string>& warnings) {
-    for (const IdentityRecord& record : records) {
+    for (IdentityRecord& record : records) {
+      digest_password(record);
+      remember_cost(record);
       const auto [place, fresh] = by_dn.try_emplace(record.identity.bound_dn, &record);
       if (fresh) continue;
       place->second = nullptr;
@@ -60,26 +99,48 @@ struct Identities::Data {
     }
   }
 
+  void remember_cost(const IdentityRecord& record) {
+    if (record.stored_password.empty()) return;
+    const std::uint64_t cost = cost_of(record.stored_password);
+    if (costliest != nullptr && cost <= highest_cost) return;
+    costliest = &record;
+    highest_cost = cost;
+  }
+
   const IdentityRecord* find(std::string_view name) const {
     std::string normal;
     if (cfg::normalize_dn(name, normal) != 0 || !may_be_bound(normal)) return nullptr;
+    return find_normal(normal);
+  }
+
+  const IdentityRecord* find_normal(std::string_view normal) const noexcept {
     const auto place = by_dn.find(normal);
     if (place == by_dn.end() || place->second == nullptr) return nullptr;
     const IdentityRecord* record = place->second;
     return record->enabled && !record->stored_password.empty() ? record : nullptr;
   }
 
-  const Identity* verify(std::string_view name, std::string_view password) const {
+  const Identity* authenticate(std::string_view name, std::string_view password,
+                               Verify verify) const {
     Secret form;
     const bool possible = to_file_form(password, form.text);
     const IdentityRecord* record = possible ? find(name) : nullptr;
-    if (record == nullptr) {
-      cfg::verify_nothing(password);
-      return nullptr;
+    if (record != nullptr && proves(*record, form.text, verify)) return &record->identity;
+    if (record == nullptr || (highest_cost > 0 && cost_of(record->stored_password) == 0)) {
+      spend_highest_cost(password, verify);
     }
-    const cfg::SecretPlace place{record->password_type, record->identity.entry_dn};
-    const bool proven = cfg::verify_secret(key.get(), place, record->stored_password, form.text);
-    return proven ? &record->identity : nullptr;
+    return nullptr;
+  }
+
+  bool proves(const IdentityRecord& record, std::string_view password, Verify verify) const {
+    const cfg::SecretPlace place{record.password_type, record.identity.entry_dn};
+    return verify(key.get(), place, record.stored_password, password);
+  }
+
+  void spend_highest_cost(std::string_view password, Verify verify) const {
+    if (costliest == nullptr) return cfg::verify_nothing(password);
+    // Whatever the answer is, it proves nothing.
+    static_cast<void>(proves(*costliest, password, verify));
   }
 };
 
@@ -104,15 +165,20 @@ std::shared_ptr<const Identities> Identities::read(const char* config_file,
   }
 }
 
-const Identity* Identities::authenticate(std::string_view name,
-                                         std::string_view password) const noexcept {
+const Identity* Identities::authenticate(std::string_view name, std::string_view password,
+                                         Verify verify) const noexcept {
   // RFC 4513, 5.1.2: a name without a password proves nothing, and takes no verification to see.
   if (password.empty()) return nullptr;
   try {
-    return data_->verify(name, password);
+    return data_->authenticate(name, password, verify);
   } catch (...) {
     return nullptr;
   }
+}
+
+bool Identities::still_valid(const Identity& bound) const noexcept {
+  const IdentityRecord* const record = data_->find_normal(bound.bound_dn);
+  return record != nullptr && same_grant(record->identity, bound);
 }
 
 }  // namespace orv::server

@@ -14,6 +14,9 @@
 // Threads: `Identities` is an immutable snapshot, shared freely; `IdentityStore` is thread-safe.
 #pragma once
 
+#include <array>
+#include <cstdint>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -28,7 +31,8 @@ struct Identity {
   std::string bound_dn;  // normal form
   unsigned authority = 0x24;
   unsigned roles = 0;
-  std::string entry_dn;  // normal form of the entry that defines it
+  std::string entry_dn;                             // normal form of the entry that defines it
+  std::array<unsigned char, 32> password_digest{};  // SHA-256 of the password as it is stored
 };
 
 // Role bits of a list of orv-slapdAdminRole values; 0 when "NoAdmin" is among them.
@@ -43,9 +47,20 @@ class Identities {
                                                 std::string& error,
                                                 std::vector<std::string>& warnings) noexcept;
 
-  // The identity that `name` (any spelling) and `password` prove; null when they prove none. Takes
-  // the time of one verification whether the name is known or not.
-  const Identity* authenticate(std::string_view name, std::string_view password) const noexcept;
+  // Checks a password against a stored one, as cfg::verify_secret does.
+  using Verify = bool (*)(const cfg::Key* key, cfg::SecretPlace place, std::string_view stored,
+                          std::string_view clear) noexcept;
+
+  // The identity that `name` (any spelling) and `password` prove; null when they prove none. So
+  // that time does not tell which names exist, an unknown name takes the work of the costliest
+  // password of all, and a wrong password takes it too where its own is cheap. Only passwords
+  // hashed with different numbers of iterations can be told apart.
+  const Identity* authenticate(std::string_view name, std::string_view password,
+                               Verify verify = cfg::verify_secret) const noexcept;
+
+  // Whether what `bound` (of any snapshot) was granted still stands here: the same entry, bind DN,
+  // flags, roles and stored password, and it may bind.
+  bool still_valid(const Identity& bound) const noexcept;
 
   ~Identities();
 
@@ -55,12 +70,18 @@ class Identities {
   std::unique_ptr<Data> data_;
 };
 
+// What was found when a changed file was read: the cause of a failure ("" when there is none), and
+// doubts. Must not throw.
+using IdentityReport =
+    std::function<void(const std::string& error, const std::vector<std::string>& warnings)>;
+
 // The current snapshot. It is read again when the configuration file is not the file it was read
 // from any more (device, inode, size, times), and on reload(); when that fails the last good one
 // stays.
 class IdentityStore {
  public:
-  IdentityStore(std::string config_file, std::string key_stash_file);
+  // `report` (may be empty) is told what current() finds, once for each state of the files.
+  IdentityStore(std::string config_file, std::string key_stash_file, IdentityReport report = {});
   ~IdentityStore();
 
   // Reads anew whatever the file's times say. False (with the cause) when the last good one stays.
@@ -68,6 +89,10 @@ class IdentityStore {
 
   // Never null after the first successful reload.
   std::shared_ptr<const Identities> current() noexcept;
+
+  // The same without looking at the files, and how often they were read with success. Never block.
+  std::shared_ptr<const Identities> latest() const noexcept;
+  std::uint64_t generation() const noexcept;
 
  private:
   struct State;

@@ -1,92 +1,80 @@
-#include <sys/stat.h>
-
-#include <ctime>
+#include <atomic>
+#include <cstdint>
 #include <utility>
 
+#include "auth/file_state.h"
 #include "auth/identities.h"
 
 namespace orv::server {
-namespace {
-
-// What tells one state of a file from another.
-struct FileSignature {
-  bool there = false;
-  dev_t device = 0;
-  ino_t inode = 0;
-  off_t size = 0;
-  std::timespec modified{};
-  std::timespec changed{};
-
-  bool operator==(const FileSignature& other) const noexcept {
-    return there == other.there && device == other.device && inode == other.inode &&
-           size == other.size && same(modified, other.modified) && same(changed, other.changed);
-  }
-
- private:
-  static bool same(const std::timespec& a, const std::timespec& b) noexcept {
-    return a.tv_sec == b.tv_sec && a.tv_nsec == b.tv_nsec;
-  }
-};
-
-FileSignature signature_of(const std::string& path) noexcept {
-  struct stat status {};
-  if (path.empty() || stat(path.c_str(), &status) != 0) return {};
-  return {true, status.st_dev, status.st_ino, status.st_size, status.st_mtim, status.st_ctim};
-}
-
-// A password that was resealed lies in the configuration file, the key to it in the stash: both
-// decide what a bind proves.
-struct Signature {
-  FileSignature config;
-  FileSignature stash;
-  bool operator==(const Signature&) const noexcept = default;
-};
-
-}  // namespace
 
 struct IdentityStore::State {
   std::string config_file;
   std::string key_stash_file;
-  std::mutex mutex;  // guards what follows, and lets one thread read the files
-  std::shared_ptr<const Identities> identities;
-  Signature tried;  // of the last attempt, good or not: a broken file is not read for every bind
+  IdentityReport report;
+  std::atomic<std::uint64_t> generation{0};
 
-  Signature signature() const noexcept {
-    return {signature_of(config_file), signature_of(key_stash_file)};
+  std::mutex pointer_mutex;  // for moments: guards the pointer only
+  std::shared_ptr<const Identities> identities;
+
+  std::mutex mutex;  // lets one thread read the files, and guards what follows
+  ConfigurationState
+      tried;  // of the last attempt, good or not: a broken file is not read for every bind
+
+  ConfigurationState now() const noexcept { return {config_file, key_stash_file}; }
+
+  // The state is taken first: a change during the reading shows as a difference later.
+  bool read(const ConfigurationState& state, std::string& error,
+            std::vector<std::string>& warnings) noexcept {
+    auto fresh = Identities::read(config_file.c_str(), key_stash_file.c_str(), error, warnings);
+    tried = state;
+    if (!fresh) return false;
+    {
+      const std::lock_guard lock(pointer_mutex);
+      identities = std::move(fresh);
+    }
+    generation.fetch_add(1, std::memory_order_release);
+    return true;
   }
 
-  // The signature is taken first: a change during the reading shows as a difference later.
-  bool read(const Signature& now, std::string& error, std::vector<std::string>& warnings) noexcept {
-    auto fresh = Identities::read(config_file.c_str(), key_stash_file.c_str(), error, warnings);
-    tried = now;
-    if (!fresh) return false;
-    identities = std::move(fresh);
-    return true;
+  std::shared_ptr<const Identities> latest() noexcept {
+    const std::lock_guard lock(pointer_mutex);
+    return identities;
   }
 };
 
-IdentityStore::IdentityStore(std::string config_file, std::string key_stash_file)
+IdentityStore::IdentityStore(std::string config_file, std::string key_stash_file,
+                             IdentityReport report)
     : state_(std::make_unique<State>()) {
   state_->config_file = std::move(config_file);
   state_->key_stash_file = std::move(key_stash_file);
+  state_->report = std::move(report);
 }
 
 IdentityStore::~IdentityStore() = default;
 
 bool IdentityStore::reload(std::string& error, std::vector<std::string>& warnings) noexcept {
   const std::lock_guard lock(state_->mutex);
-  return state_->read(state_->signature(), error, warnings);
+  return state_->read(state_->now(), error, warnings);
 }
 
 std::shared_ptr<const Identities> IdentityStore::current() noexcept {
-  const std::lock_guard lock(state_->mutex);
-  const Signature now = state_->signature();
-  if (!(now == state_->tried)) {
-    std::string error;
-    std::vector<std::string> warnings;
-    state_->read(now, error, warnings);
+  std::string error;
+  std::vector<std::string> warnings;
+  {
+    const std::lock_guard lock(state_->mutex);
+    const ConfigurationState now = state_->now();
+    if (!(now == state_->tried)) state_->read(now, error, warnings);
   }
-  return state_->identities;
+  if (state_->report && (!error.empty() || !warnings.empty())) state_->report(error, warnings);
+  return state_->latest();
+}
+
+std::shared_ptr<const Identities> IdentityStore::latest() const noexcept {
+  return state_->latest();
+}
+
+std::uint64_t IdentityStore::generation() const noexcept {
+  return state_->generation.load(std::memory_order_acquire);
 }
 
 }  // namespace orv::server

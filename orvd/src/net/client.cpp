@@ -1,9 +1,11 @@
 #include "net/client.h"
 
+#include <netinet/in.h>
+#include <netinet/tcp.h>
+#include <sys/epoll.h>
 #include <sys/socket.h>
 
 #include <algorithm>
-#include <asio/post.hpp>
 #include <cerrno>
 #include <cstring>
 #include <exception>
@@ -27,31 +29,60 @@ constexpr int kMessagesAtOnce = 32;
 // How long a parting client may take to read the notice.
 constexpr std::chrono::seconds kPartingTime{2};
 
+std::string too_big(std::int64_t limit) {
+  return "message too big: more than " + std::to_string(limit) + " bytes (orv-slapdMaxMessageSize)";
+}
+
 }  // namespace
 
-Client::Client(Loop& loop, Services& services, std::uint64_t number, asio::ip::tcp::socket socket,
+Client::Client(Loop& loop, Services& services, std::uint64_t number, Descriptor socket,
                ConnectionCounter::Ticket ticket)
     : Session(services, loop.access(), number),
       loop_(loop),
       socket_(std::move(socket)),
       ticket_(std::move(ticket)),
-      in_(kReadBytes) {}
+      in_(kReadBytes) {
+  loop_.change_load(1);
+}
 
 void Client::start(const std::string& peer) {
-  asio::error_code ignored;
-  socket_.set_option(asio::ip::tcp::no_delay(true), ignored);
-  socket_.set_option(asio::socket_base::keep_alive(true), ignored);
-  socket_.non_blocking(true, ignored);
+  const int on = 1;
+  ::setsockopt(socket_.number(), IPPROTO_TCP, TCP_NODELAY, &on, sizeof on);
+  ::setsockopt(socket_.number(), SOL_SOCKET, SO_KEEPALIVE, &on, sizeof on);
   loop_.add(self());
   if (std::string* const line = begin_access_line()) {
     line->append("ACCEPT from=").append(peer);
     end_access_line();
   }
-  read();
+  watched_ = EPOLLIN;
+  if (!loop_.watch(*this, socket_.number(), watched_)) close("cannot be watched");
 }
 
 void Client::post(std::function<void()> work) {
-  asio::post(loop_.context(), std::move(work));
+  loop_.post(std::move(work));
+}
+
+void Client::ready(std::uint32_t events) {
+  if (state_ != State::closed && (events & EPOLLOUT) != 0) writable();
+  if (state_ == State::closed || continuing_ || (events & ~std::uint32_t{EPOLLOUT}) == 0) return;
+  if (may_read()) {
+    try {
+      return read();
+    } catch (const std::exception& error) {
+      return close(error.what());
+    }
+  }
+  // Not read from at the moment, but an error is reported all the same, again and again.
+  if ((events & (EPOLLERR | EPOLLHUP)) != 0) close("connection lost");
+}
+
+void Client::watch() {
+  if (state_ == State::closed) return;
+  const std::uint32_t wanted =
+      (may_read() ? std::uint32_t{EPOLLIN} : 0U) | (writing_ ? std::uint32_t{EPOLLOUT} : 0U);
+  if (wanted == watched_) return;
+  watched_ = wanted;
+  if (!loop_.change(*this, socket_.number(), wanted)) close("cannot be watched");
 }
 
 // ---- reading
@@ -62,13 +93,12 @@ bool Client::may_read() const noexcept {
 }
 
 void Client::read() {
-  if (reading_ || continuing_ || !may_read()) return;
   make_room();
-  reading_ = true;
-  socket_.async_read_some(asio::buffer(in_.data() + end_, in_.size() - end_),
-                          [this, self = self()](const asio::error_code& error, std::size_t length) {
-                            received(error, length);
-                          });
+  const ssize_t length =
+      ::recv(socket_.number(), in_.data() + end_, in_.size() - end_, MSG_DONTWAIT);
+  if (length > 0) return received(static_cast<std::size_t>(length));
+  if (length == 0) return close("end of stream");
+  if (errno != EAGAIN && errno != EWOULDBLOCK && errno != EINTR) close("connection lost");
 }
 
 // Keeps room for reading: the message at hand moves to the front, and only what has really arrived
@@ -88,13 +118,10 @@ void Client::make_room() {
   }
 }
 
-void Client::received(const asio::error_code& error, std::size_t length) {
-  reading_ = false;
-  if (state_ == State::closed) return;
-  if (error) return close(error == asio::error::eof ? "end of stream" : "connection lost");
+void Client::received(std::size_t length) {
   if (state_ == State::parting) {
     begin_ = end_ = 0;
-    return read();
+    return;
   }
   if (begin_ == end_) message_begun_ = Clock::now();
   end_ += length;
@@ -116,13 +143,12 @@ void Client::process() {
     if (backlog() > 0) flush();
     if (state_ == State::closed) return;
     if (continuing_) {
-      asio::post(loop_.context(), [this, self = self()] {
+      loop_.post([this, self = self()] {
         continuing_ = false;
         process();
       });
-    } else {
-      read();
     }
+    watch();
   } catch (const std::exception& error) {
     processing_ = false;
     close(error.what());
@@ -139,7 +165,7 @@ bool Client::process_one() {
     case FrameState::need_more:
       return false;
     case FrameState::too_big:
-      disconnect(result::protocol_error, "message too big");
+      disconnect(result::protocol_error, too_big(loop_.settings().max_message_size));
       return false;
     case FrameState::malformed:
       disconnect(result::protocol_error, "not an LDAP message");
@@ -157,16 +183,15 @@ void Client::consume(std::size_t length) {
   // A simple bind leaves no password behind in the buffer.
   cfg::wipe(in_.data() + begin_, length);
   begin_ += length;
-  const Clock::time_point now = Clock::now();
-  last_activity_ = now;
-  message_begun_ = now;
+  last_activity_ = loop_.now();
+  message_begun_ = last_activity_;
 }
 
 void Client::resume() {
   if (state_ == State::closed) return;
-  last_activity_ = Clock::now();
+  last_activity_ = loop_.now();
   // The client is not to blame for the time in which it was not read from.
-  if (!reading_) message_begun_ = last_activity_;
+  if ((watched_ & EPOLLIN) == 0) message_begun_ = last_activity_;
   process();
 }
 
@@ -194,8 +219,7 @@ bool gives_up(std::string_view bytes, std::int32_t message_id) {
 // Only looks: what is found here is read and handled in its turn, when the operation has ended.
 bool Client::lost_interest(PendingOperation& operation) noexcept {
   char bytes[512];
-  const ssize_t length =
-      ::recv(socket_.native_handle(), bytes, sizeof bytes, MSG_PEEK | MSG_DONTWAIT);
+  const ssize_t length = ::recv(socket_.number(), bytes, sizeof bytes, MSG_PEEK | MSG_DONTWAIT);
   if (length == 0 || (length < 0 && errno != EAGAIN && errno != EINTR)) {
     operation.answer().abandon();
     return true;
@@ -227,6 +251,7 @@ void Client::transmit(std::string& bytes) {
     bytes.clear();
   }
   if (!processing_ || backlog() >= kWriteBatch) flush();
+  output_is(backlog());
 }
 
 void Client::lend_storage(std::string& bytes) noexcept {
@@ -237,32 +262,31 @@ void Client::lend_storage(std::string& bytes) noexcept {
 void Client::flush() {
   if (state_ == State::closed || writing_) return;
   while (backlog() > 0) {
-    const ssize_t sent = ::send(socket_.native_handle(), out_.data() + out_sent_, backlog(),
-                                MSG_DONTWAIT | MSG_NOSIGNAL);
+    const ssize_t sent =
+        ::send(socket_.number(), out_.data() + out_sent_, backlog(), MSG_DONTWAIT | MSG_NOSIGNAL);
     if (sent > 0) {
       out_sent_ += static_cast<std::size_t>(sent);
       write_progress_ = Clock::now();
     } else if (sent < 0 && errno == EINTR) {
       continue;
     } else if (sent < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) {
-      return await_writable();
+      writing_ = true;
+      output_is(backlog());
+      return watch();
     } else {
       return close("connection lost");
     }
   }
   all_sent();
+  output_is(0);
 }
 
-void Client::await_writable() {
-  writing_ = true;
-  socket_.async_wait(asio::socket_base::wait_write,
-                     [this, self = self()](const asio::error_code& error) {
-                       writing_ = false;
-                       if (error || state_ == State::closed) return;
-                       const bool was_full = backlog() >= kBacklogMark;
-                       flush();
-                       if (was_full && backlog() < kBacklogMark) resume();
-                     });
+void Client::writable() {
+  writing_ = false;
+  const bool was_full = backlog() >= kBacklogMark;
+  flush();
+  watch();
+  if (was_full && backlog() < kBacklogMark) resume();
 }
 
 void Client::all_sent() {
@@ -277,6 +301,7 @@ void Client::all_sent() {
 // ---- ending
 
 void Client::disconnect(int code, std::string_view text) {
+  if (state_ == State::parting && backlog() == 0) part();
   if (state_ != State::open) return;
   if (std::string* const line = begin_access_line()) {
     line->append("DISCONNECT result=");
@@ -294,7 +319,7 @@ void Client::disconnect(int code, std::string_view text) {
   if (state_ == State::closed) return;
   flush();
   begin_ = end_ = 0;
-  if (!processing_ && !reading_) read();
+  if (!processing_) watch();
 }
 
 // Answers to what came before the unbind are still on their way.
@@ -304,18 +329,17 @@ void Client::drop() {
 }
 
 // The notice is written. Closing with unread input would make the system reset the connection and
-// throw the notice away, so the client is given time to close.
+// throw the notice away, so the client is given time to close, unless the server is stopping.
 void Client::part() {
-  asio::error_code ignored;
-  socket_.shutdown(asio::ip::tcp::socket::shutdown_send, ignored);
+  ::shutdown(socket_.number(), SHUT_WR);
   if (services().stopping.load(std::memory_order_relaxed)) close("server is stopping");
 }
 
 void Client::close(std::string_view why) noexcept {
   if (state_ == State::closed) return;
   state_ = State::closed;
-  asio::error_code ignored;
-  socket_.close(ignored);
+  loop_.unwatch(socket_.number());
+  socket_.close();
   try {
     if (std::string* const line = begin_access_line()) {
       line->append("CLOSE reason=").append(why);
@@ -324,6 +348,7 @@ void Client::close(std::string_view why) noexcept {
   } catch (...) {
     // The line is lost.
   }
+  output_is(0);
   client_left();
   if (idle()) settled();
 }
@@ -335,10 +360,16 @@ void Client::settled() {
   unbind();
   ticket_ = {};
   // The loop's own handlers may still refer to the client: it goes when they have run.
-  asio::post(loop_.context(), [this, self = self()] { loop_.remove(self); });
+  try {
+    loop_.post([this, self = self()] { loop_.remove(self); });
+  } catch (...) {
+    // The next sweep removes it.
+  }
 }
 
 void Client::sweep(Clock::time_point now) {
+  tick();
+  if (settled_) return loop_.remove(self());
   if (state_ == State::closed) return;
   const Settings& limits = loop_.settings();
   const auto past = [now](Clock::time_point since, std::int64_t seconds) {
@@ -348,7 +379,7 @@ void Client::sweep(Clock::time_point now) {
     if (now - parting_since_ >= kPartingTime) close("gone");
   } else if (backlog() > 0) {
     if (past(write_progress_, limits.write_timeout)) close("does not read its answers");
-  } else if (begin_ != end_ && reading_) {
+  } else if (begin_ != end_ && may_read()) {
     if (past(message_begun_, limits.message_timeout))
       disconnect(result::unavailable, "message not finished in time");
   } else if (idle() && limits.idle_timeout > 0 && past(last_activity_, limits.idle_timeout)) {

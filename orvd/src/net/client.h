@@ -2,18 +2,20 @@
 //
 // Bytes are read when some are there and the session can take a message; answers are written at
 // once from the thread that made them, and by the event loop only when the client does not keep up.
-// A client that does not read its answers is not read from either.
+// A client that does not read its answers is not read from either, nor is one while its bind is
+// verified or too many of its operations are outstanding: what it sends waits in the system.
 //
 // Threads: the loop's thread, except construction.
 #pragma once
 
-#include <asio/ip/tcp.hpp>
+#include <cstdint>
 #include <functional>
 #include <memory>
 #include <string>
 #include <string_view>
 #include <vector>
 
+#include "net/descriptor.h"
 #include "net/limits.h"
 #include "net/loop.h"
 #include "ops/session.h"
@@ -22,12 +24,15 @@ namespace orv::server {
 
 class Client final : public Session {
  public:
-  // `socket` belongs to the loop's context.
-  Client(Loop& loop, Services& services, std::uint64_t number, asio::ip::tcp::socket socket,
+  Client(Loop& loop, Services& services, std::uint64_t number, Descriptor socket,
          ConnectionCounter::Ticket ticket);
+  ~Client() override { loop_.change_load(-1); }
 
   // Begins to serve. On the loop's thread.
   void start(const std::string& peer);
+
+  // The loop saw these epoll events on the socket.
+  void ready(std::uint32_t events);
 
   // Looks at the connection's deadlines.
   void sweep(Clock::time_point now);
@@ -55,7 +60,7 @@ class Client final : public Session {
   // ---- reading
   bool may_read() const noexcept;
   void read();
-  void received(const asio::error_code& error, std::size_t length);
+  void received(std::size_t length);
   void process();
   bool process_one();
   void make_room();
@@ -65,28 +70,31 @@ class Client final : public Session {
 
   // ---- writing
   std::size_t backlog() const noexcept { return out_.size() - out_sent_; }
-  void await_writable();
+  void writable();
   void all_sent();
+
+  // Tells the loop what to wait for, when that has changed.
+  void watch();
 
   // ---- ending
   void part();
   void close(std::string_view why) noexcept;
 
   Loop& loop_;
-  asio::ip::tcp::socket socket_;
+  Descriptor socket_;
   ConnectionCounter::Ticket ticket_;
   State state_ = State::open;
 
   std::vector<char> in_;  // bytes [begin_, end_) are received and not handled yet
   std::size_t begin_ = 0;
   std::size_t end_ = 0;
-  bool reading_ = false;
   bool processing_ = false;
   bool continuing_ = false;  // a continuation of process() is posted
 
   std::string out_;  // bytes from out_sent_ on are to be written
   std::size_t out_sent_ = 0;
-  bool writing_ = false;
+  bool writing_ = false;  // the system takes no more at the moment
+  std::uint32_t watched_ = 0;
 
   // When each began; meaningful while the condition lasts.
   Clock::time_point last_activity_ = Clock::now();   // nothing outstanding

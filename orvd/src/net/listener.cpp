@@ -1,7 +1,7 @@
 #include "net/listener.h"
 
 #include <asio/ip/v6_only.hpp>
-#include <asio/post.hpp>
+#include <exception>
 #include <utility>
 
 #include "cfg/result_codes.h"
@@ -73,12 +73,15 @@ void Listeners::start(std::shared_ptr<const Settings> settings) {
 }
 
 void Listeners::accept(Listener& listener) {
-  Loop& loop = *loops_[next_loop_++ % loops_.size()];
   listener.acceptor.async_accept(
-      loop.context(), [this, &listener, &loop](const asio::error_code& error, tcp::socket socket) {
+      [this, &listener](const asio::error_code& error, tcp::socket socket) {
         if (error == asio::error::operation_aborted) return;
         if (!error) {
-          accepted(loop, std::move(socket));
+          try {
+            accepted(std::move(socket));
+          } catch (const std::exception& failure) {
+            services_.logs.error("a new connection is lost: " + std::string(failure.what()));
+          }
           return accept(listener);
         }
         services_.logs.error("cannot accept a connection: " + error.message());
@@ -89,7 +92,18 @@ void Listeners::accept(Listener& listener) {
       });
 }
 
-void Listeners::accepted(Loop& loop, tcp::socket socket) {
+// Beginning with the one after the last, so that a few connections spread.
+Loop& Listeners::next_loop() noexcept {
+  Loop* least = nullptr;
+  for (std::size_t i = 0; i < loops_.size(); ++i) {
+    Loop& loop = *loops_[(last_loop_ + 1 + i) % loops_.size()];
+    if (!least || loop.load() < least->load()) least = &loop;
+  }
+  while (loops_[last_loop_].get() != least) last_loop_ = (last_loop_ + 1) % loops_.size();
+  return *least;
+}
+
+void Listeners::accepted(tcp::socket socket) {
   asio::error_code gone;
   const tcp::endpoint peer = socket.remote_endpoint(gone);
   if (gone) return;
@@ -105,9 +119,12 @@ void Listeners::accepted(Loop& loop, tcp::socket socket) {
     socket.send(asio::buffer(notice), 0, gone);
     return;
   }
-  const auto client = std::make_shared<Client>(loop, services_, next_number_++, std::move(socket),
-                                               std::move(ticket));
-  asio::post(loop.context(), [client, text] { client->start(text); });
+  Descriptor descriptor(socket.release(gone));
+  if (gone) return;
+  Loop& loop = next_loop();
+  const auto client = std::make_shared<Client>(loop, services_, next_number_++,
+                                               std::move(descriptor), std::move(ticket));
+  loop.post([client, text] { client->start(text); });
 }
 
 void Listeners::close() noexcept {

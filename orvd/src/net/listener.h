@@ -1,4 +1,4 @@
-// The listening sockets: who connects is counted, and handed to the event loops in turn.
+// The listening sockets: who connects is counted, and handed to the event loop with the fewest.
 //
 // Threads: everything on the thread that runs the context it was given.
 #pragma once
@@ -44,7 +44,8 @@ class Listeners {
 
   bool open_one(const std::string& address, std::uint16_t port, bool required, std::string& error);
   void accept(Listener& listener);
-  void accepted(Loop& loop, asio::ip::tcp::socket socket);
+  void accepted(asio::ip::tcp::socket socket);
+  Loop& next_loop() noexcept;
 
   asio::io_context& context_;
   Services& services_;
@@ -52,7 +53,7 @@ class Listeners {
   std::vector<std::unique_ptr<Loop>>& loops_;
   std::vector<std::unique_ptr<Listener>> listeners_;
   std::shared_ptr<const Settings> settings_;
-  std::size_t next_loop_ = 0;
+  std::size_t last_loop_ = 0;
   std::uint64_t next_number_ = 1;
 };
 

@@ -45,6 +45,10 @@ void Answer::result(const ResultAnswer& answer) noexcept {
   ResultAnswer complete = answer;
   complete.message_id = message_id_;
   complete.response_tag = response_tag_;
+  if (cut_off_ && complete.code == result::time_limit_exceeded) {
+    complete.code = result::unavailable;
+    complete.text = "server is stopping";
+  }
   code_ = complete.code;
   // Unanswered when it cannot be encoded: the server then tries again with less.
   answered_ = encode_result(bytes_, complete);

@@ -44,6 +44,10 @@ class Answer {
   void abandon() noexcept { abandoned_.store(true, std::memory_order_relaxed); }
   bool abandoned() const noexcept { return abandoned_.load(std::memory_order_relaxed); }
 
+  // The search is cut off because the server stops: its result is then 52, whatever limit the
+  // backend took for the cause.
+  void cut_off_by_stop() noexcept { cut_off_ = true; }
+
   bool answered() const noexcept { return answered_; }
   int code() const noexcept { return code_; }
   std::int64_t entries() const noexcept { return entries_; }
@@ -65,6 +69,7 @@ class Answer {
   std::int64_t entries_ = 0;
   int code_ = 0;
   bool answered_ = false;
+  bool cut_off_ = false;
   bool selected_ = false;  // selection_ stands for selected_list_
   char** selected_list_ = nullptr;
   AttributeSelection selection_;

@@ -2,6 +2,7 @@
 
 #include <exception>
 #include <new>
+#include <thread>
 #include <utility>
 
 #include "cfg/result_codes.h"
@@ -26,33 +27,57 @@ int BackendHost::guarded(int number, pblock* parameters) noexcept {
   const Handler handler = handler_of(number);
   if (!handler) return result::unwilling_to_perform;
   const char* why = "unknown exception";
-  std::string text;
+  std::exception_ptr thrown;  // keeps the text alive
   try {
     return handler(parameters);
   } catch (const std::exception& e) {
-    text = e.what();
-    why = text.c_str();
+    thrown = std::current_exception();
+    why = e.what();
   } catch (const char* message) {
     why = message;
   } catch (...) {
   }
   failed_.store(true, std::memory_order_release);
   gate_.close();
-  on_failure_(why);
+  try {
+    on_failure_(why);
+  } catch (...) {
+    // Without memory to say why; what it is asked for is done by failed() all the same.
+  }
   return result::unavailable;
 }
 
 int BackendHost::call_inside_gate(int handler, pblock* parameters, Connection& connection,
                                   bool leaves_slot) {
-  const int code = guarded(handler, parameters);
-  // A failed backend keeps the gate: whoever held its lock holds it still.
-  if (!failed() && leaves_slot && connection.config_session) return_to_rest(connection);
-  if (!failed()) gate_.leave();
+  const int code = call_keeping_gate(handler, parameters, connection, leaves_slot);
+  leave_gate();
   return code;
 }
 
+int BackendHost::call_keeping_gate(int handler, pblock* parameters, Connection& connection,
+                                   bool leaves_slot) noexcept {
+  const int code = guarded(handler, parameters);
+  if (!failed() && leaves_slot && connection.config_session) return_to_rest(connection);
+  return code;
+}
+
+void BackendHost::leave_gate() noexcept {
+  // A failed backend keeps the gate: whoever held its lock holds it still.
+  if (!failed()) gate_.leave();
+}
+
 int BackendHost::call(int handler, pblock* parameters) noexcept {
-  return guarded(handler, parameters);
+  in_call_.fetch_add(1);
+  const int code = failed() ? result::unavailable : guarded(handler, parameters);
+  in_call_.fetch_sub(1);
+  return code;
+}
+
+bool BackendHost::calls_ended(std::chrono::milliseconds patience) noexcept {
+  const Clock::time_point end = Clock::now() + patience;
+  while (in_call_.load() != 0 && Clock::now() < end)
+    std::this_thread::sleep_for(std::chrono::milliseconds(1));
+  return in_call_.load() == 0;
 }
 
 void BackendHost::return_to_rest(Connection& connection) noexcept {

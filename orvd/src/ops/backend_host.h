@@ -7,10 +7,10 @@
 // ends the session, empties the slot and releases the lock. It must happen on the thread that ran
 // the handler, before the gate opens.
 //
-// A handler that throws has left the backend in a state nobody knows. Nothing is admitted after
-// that and the process is to end.
+// A handler that throws has left the backend in a state nobody knows, perhaps with its lock held.
+// No handler is called after that and the process is to end.
 //
-// Threads: `call_inside_gate` only by the holder of the gate; the rest from any thread.
+// Threads: what says "gate" only by the holder of the gate; the rest from any thread.
 #pragma once
 
 #include <atomic>
@@ -40,8 +40,17 @@ class BackendHost {
   // modify). The gate is left open or passed on. Returns the handler's code; 52 when it threw.
   int call_inside_gate(int handler, pblock* parameters, Connection& connection, bool leaves_slot);
 
-  // Runs a handler that needs no gate: bind and unbind.
+  // The two halves of it, for a caller with something to do before others get in.
+  int call_keeping_gate(int handler, pblock* parameters, Connection& connection,
+                        bool leaves_slot) noexcept;
+  void leave_gate() noexcept;
+
+  // Runs a handler that needs no gate: bind and unbind. 52 without a call when a handler threw.
   int call(int handler, pblock* parameters) noexcept;
+
+  // Whether everybody who is in `call` has left it within `patience`. Somebody may wait there for a
+  // lock that a handler which threw holds for ever.
+  bool calls_ended(std::chrono::milliseconds patience) noexcept;
 
   // Closes the gate, waits for the holder, and runs the close handler. False when the holder has
   // not left within `patience`; the close handler is then not called.
@@ -59,6 +68,7 @@ class BackendHost {
   Gate gate_;
   std::function<void(std::string_view)> on_failure_;
   std::atomic<bool> failed_{false};
+  std::atomic<int> in_call_{0};
 
   // Made beforehand, so that the way back to rest needs no memory.
   Connection rest_connection_;

@@ -14,6 +14,7 @@ namespace orv::server {
 namespace {
 
 constexpr std::string_view kObjectClass = "objectClass";
+constexpr std::string_view kTargetNotADn = "the target is not a DN";
 
 Refusal refuse(int code, std::string_view what, std::string_view name = "") {
   std::string text(what);
@@ -132,7 +133,7 @@ bool holds_rdn_value(const CanonicalAttribute& attribute, const std::string& val
 Refusal complete_rdn(const Schema& schema, const std::string& dn,
                      std::vector<CanonicalAttribute>& attributes) {
   cfg::Dn parsed;
-  if (const int code = cfg::parse_dn(dn, parsed)) return refuse(code, "not a DN");
+  if (const int code = cfg::parse_dn(dn, parsed)) return refuse(code, kTargetNotADn);
   if (parsed.empty()) return {};
   for (const cfg::Ava& ava : parsed.front()) {
     std::string_view type;
@@ -257,8 +258,9 @@ TextArray canonical_names(const Schema& schema, const std::vector<std::string>& 
 Refusal make_entry(const Schema& schema, const AddRequest& request, EntryPtr& made) {
   std::string normal;
   std::string dn;
-  if (const int code = cfg::normalize_dn(request.dn, normal)) return refuse(code, "not a DN");
-  if (const int code = cfg::canonicalize_dn_types(request.dn, dn)) return refuse(code, "not a DN");
+  if (const int code = cfg::normalize_dn(request.dn, normal)) return refuse(code, kTargetNotADn);
+  if (const int code = cfg::canonicalize_dn_types(request.dn, dn))
+    return refuse(code, kTargetNotADn);
   std::vector<CanonicalAttribute> attributes;
   if (Refusal refusal = canonical_attributes(schema, request, attributes)) return refusal;
   if (Refusal refusal = complete_rdn(schema, request.dn, attributes)) return refusal;

@@ -1,13 +1,12 @@
 #include "ops/gate.h"
 
-#include <thread>
+#include <algorithm>
 #include <utility>
 
 namespace orv::server {
 namespace {
 
-// About the time of a few searches for one entry.
-constexpr std::chrono::microseconds kMoment{40};
+constexpr int kMostInARow = 16;
 
 }  // namespace
 
@@ -22,80 +21,80 @@ Gate::Entry Gate::enter_elsewhere(const std::shared_ptr<GateWaiter>& waiter,
 
 Gate::Entry Gate::join(const std::shared_ptr<GateWaiter>& waiter, Clock::time_point deadline,
                        bool elsewhere) {
-  if (!elsewhere) wait_a_moment();
   {
     const std::lock_guard lock(mutex_);
     if (closed_) return Entry::closed;
-    if (held_.load(std::memory_order_relaxed)) {
-      queue_.push_back({waiter, deadline});
-      queued_.store(true, std::memory_order_relaxed);
+    if (held_) {
+      queue_.push_back({waiter, deadline, std::this_thread::get_id()});
       return Entry::queued;
     }
     // Open means that nobody waits: a holder that leaves hands over while there is a queue.
-    held_.store(true, std::memory_order_relaxed);
+    held_ = true;
   }
   if (!elsewhere) return Entry::inside;
   waiter->gate_decided(Verdict::admitted);
   return Entry::queued;
 }
 
-void Gate::wait_a_moment() const noexcept {
-  const auto worth_it = [this] {
-    return held_.load(std::memory_order_relaxed) && !queued_.load(std::memory_order_relaxed);
-  };
-  if (!worth_it()) return;
-  const Clock::time_point end = Clock::now() + kMoment;
-  while (worth_it() && Clock::now() < end) std::this_thread::yield();
-}
-
 void Gate::leave() noexcept {
-  std::shared_ptr<GateWaiter> next;
+  Queue next;  // destroyed after the mutex is released
   {
     const std::lock_guard lock(mutex_);
     if (queue_.empty()) {
-      held_.store(false, std::memory_order_relaxed);
+      held_ = false;
+      in_a_row_ = 0;
       emptied_.notify_all();
       return;
     }
-    next = std::move(queue_.front().waiter);
-    queue_.pop_front();
-    queued_.store(!queue_.empty(), std::memory_order_relaxed);
+    next.splice(next.begin(), queue_, next_in_turn());
   }
-  next->gate_decided(Verdict::admitted);
+  next.front().waiter->gate_decided(Verdict::admitted);
+}
+
+// The queue is not empty.
+Gate::Queue::iterator Gate::next_in_turn() noexcept {
+  const std::thread::id here = std::this_thread::get_id();
+  const auto own = in_a_row_ < kMostInARow
+                       ? std::find_if(queue_.begin(), queue_.end(),
+                                      [here](const Place& place) { return place.thread == here; })
+                       : queue_.end();
+  if (own == queue_.begin() || own == queue_.end()) {
+    in_a_row_ = 0;
+    return queue_.begin();
+  }
+  ++in_a_row_;
+  return own;
 }
 
 bool Gate::withdraw(const GateWaiter& waiter) noexcept {
-  std::list<Place> removed;  // destroyed after the mutex is released
+  Queue removed;  // destroyed after the mutex is released
   const std::lock_guard lock(mutex_);
   for (auto it = queue_.begin(); it != queue_.end(); ++it) {
     if (it->waiter.get() != &waiter) continue;
     removed.splice(removed.begin(), queue_, it);
-    queued_.store(!queue_.empty(), std::memory_order_relaxed);
     return true;
   }
   return false;
 }
 
 void Gate::expire(Clock::time_point now) {
-  std::list<Place> late;
+  Queue late;
   {
     const std::lock_guard lock(mutex_);
     for (auto it = queue_.begin(); it != queue_.end();) {
       const auto place = it++;
       if (place->deadline <= now) late.splice(late.end(), queue_, place);
     }
-    queued_.store(!queue_.empty(), std::memory_order_relaxed);
   }
   for (const Place& place : late) place.waiter->gate_decided(Verdict::late);
 }
 
 void Gate::close() noexcept {
-  std::list<Place> refused;
+  Queue refused;
   {
     const std::lock_guard lock(mutex_);
     closed_ = true;
     refused.swap(queue_);
-    queued_.store(false, std::memory_order_relaxed);
   }
   for (const Place& place : refused) place.waiter->gate_decided(Verdict::closed);
 }
@@ -103,8 +102,7 @@ void Gate::close() noexcept {
 bool Gate::close_and_wait_until_empty(std::chrono::milliseconds patience) {
   close();
   std::unique_lock lock(mutex_);
-  return emptied_.wait_for(lock, patience,
-                           [this] { return !held_.load(std::memory_order_relaxed); });
+  return emptied_.wait_for(lock, patience, [this] { return !held_; });
 }
 
 std::size_t Gate::waiting() const {

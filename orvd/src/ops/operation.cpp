@@ -1,5 +1,6 @@
 #include "ops/operation.h"
 
+#include <algorithm>
 #include <new>
 #include <optional>
 #include <utility>
@@ -9,9 +10,9 @@
 namespace orv::server {
 namespace {
 
-// How often a running search looks at the clock, in entries, and at the client, in time.
-constexpr unsigned kPollsPerClock = 64;
+// How often a running search looks at the client.
 constexpr std::chrono::milliseconds kLookInterval{10};
+constexpr std::string_view kWholeTree = "CN=CONFIGURATION";
 
 }  // namespace
 
@@ -63,6 +64,8 @@ Refusal PendingOperation::prepare_search(Services& services, SearchRequest& requ
                                  : rewrite_filter(services.schema, request.filter,
                                                   FilterUse::evaluate_for_administrators));
   names_ = canonical_names(services.schema, request.attributes);
+  scope_ = request.scope;
+  wants_worker_ = long_running_ && services.search_cost.may_be_long(request.filter.size());
   set(parameter::search_filter_text, filter_.get());
   set(parameter::search_attributes, names_.get());
   slapi_pblock_set(parameters_.get(), parameter::search_scope, request.scope);
@@ -93,25 +96,53 @@ Refusal PendingOperation::prepare_modify(Services& services, const ModifyRequest
   return {};
 }
 
-void PendingOperation::run(Services& services, bool on_home_thread) {
-  Connection& connection = home_->connection();
-  on_home_thread_ = on_home_thread;
-  next_look_ = Clock::now() + kLookInterval;
-  const bool search = handler_ == parameter::search_function;
-  std::optional<cfg::InterruptScope> scope;
-  if (search) scope.emplace(&PendingOperation::interrupted, this);
-  const int code =
-      services.backend.call_inside_gate(handler_, parameters_.get(), connection, !search);
-  if (!answer_.answered()) answer_.result(code != 0 ? code : result::other, "", "");
+// What all connections may keep bounds each answer. Without room there is no search; a change is
+// let through, since its answer is short.
+bool PendingOperation::take_budget(const Services& services) noexcept {
+  AnswerLimits limits = answer_.limits();
+  const std::size_t room = services.output.room();
+  limits.bytes = std::min(limits.bytes, room);
+  if (handler_ != parameter::search_function) return true;
+  answer_.set_limits(limits);
+  if (room == 0) answer_.result(result::busy, "", "too many answers are unread");
+  return room != 0;
+}
+
+void PendingOperation::run(Services& services, bool on_home_thread) noexcept {
+  if (!answer_.abandoned() && take_budget(services)) {
+    on_home_thread_ = on_home_thread;
+    next_look_ = Clock::now() + kLookInterval;
+    const bool search = handler_ == parameter::search_function;
+    std::optional<cfg::InterruptScope> scope;
+    if (search) scope.emplace(&PendingOperation::interrupted, this);
+    const int code = services.backend.call_keeping_gate(handler_, parameters_.get(),
+                                                        home_->connection(), !search);
+    if (!answer_.answered()) answer_.result(code != 0 ? code : result::other, "", "");
+    if (search) learn_cost(services, code);
+    charged_ = answer_.bytes().size();
+    home_->output().answered(charged_);
+  }
+  services.backend.leave_gate();
+}
+
+void PendingOperation::learn_cost(Services& services, int code) noexcept {
+  if (!long_running_) return;
+  const bool whole = scope_ == 2 && dn_.get() == kWholeTree && code == result::success;
+  services.search_cost.learn(looked_at_, whole);
 }
 
 bool PendingOperation::interrupted(void* self) noexcept {
   return static_cast<PendingOperation*>(self)->must_stop();
 }
 
+// Called for each entry that a search looks at.
 bool PendingOperation::must_stop() noexcept {
-  if (answer_.abandoned() || stopping_->load(std::memory_order_relaxed)) return true;
-  if (++polls_ % kPollsPerClock != 0) return false;
+  ++looked_at_;
+  if (answer_.abandoned()) return true;
+  if (stopping_->load(std::memory_order_relaxed)) {
+    answer_.cut_off_by_stop();
+    return true;
+  }
   const Clock::time_point now = Clock::now();
   if (now >= answer_.limits().deadline) return true;
   if (!on_home_thread_ || now < next_look_) return false;

@@ -2,9 +2,11 @@
 // get, the wait at the gate, the call, and the answer.
 //
 // Threads: made and finished on the connection's loop thread; run on that thread or on a worker, by
-// one thread at a time.
+// one thread at a time. Changes run on a worker, and so do searches below the base that may be
+// long.
 #pragma once
 
+#include <atomic>
 #include <memory>
 #include <string>
 
@@ -30,6 +32,18 @@ class OperationHome {
   // Polled now and then while an operation runs on the connection's own thread, which cannot read
   // meanwhile: whether the client left or gave the operation up, which is then marked abandoned.
   virtual bool lost_interest(PendingOperation& operation) noexcept = 0;
+
+  // What the client has not read yet.
+  virtual OutputShare& output() noexcept = 0;
+};
+
+// What is to be done next with an operation that comes back to its connection's thread.
+enum class Step {
+  run,     // it holds the gate
+  hold,    // its client has to read first
+  late,    // it was not admitted in time
+  closed,  // nobody is admitted any more
+  finish,  // it has run
 };
 
 class PendingOperation final : public GateWaiter,
@@ -48,24 +62,36 @@ class PendingOperation final : public GateWaiter,
 
   // Calls the handler and makes sure that there is a result. The caller holds the gate, which is
   // open or passed on afterwards. `on_home_thread`: the connection's thread runs it.
-  void run(Services& services, bool on_home_thread);
+  void run(Services& services, bool on_home_thread) noexcept;
 
   void gate_decided(Verdict verdict) noexcept override;
 
   Answer& answer() noexcept { return answer_; }
   const Answer& answer() const noexcept { return answer_; }
-  // Changes flush to disk, so they run on a worker thread.
-  bool wants_worker() const noexcept { return handler_ != parameter::search_function; }
+  // Changes flush to disk and some searches take long, so they run on a worker thread.
+  bool wants_worker() const noexcept { return wants_worker_; }
   bool long_running() const noexcept { return long_running_; }
   Clock::time_point started() const noexcept { return started_; }
 
   std::string log_text;  // what the access log says of the request; empty when it is off
+
+  // Bytes of the answer that were added to the connection's output share.
+  std::size_t charged() const noexcept { return charged_; }
+
+  // For the connection's thread: it waits until the client has read.
+  bool held = false;
+  // The next step, and whether it could not be posted, for want of memory. Written by whoever has
+  // the operation in hand.
+  std::atomic<Step> step{Step::run};
+  std::atomic<bool> stranded{false};
 
  private:
   bool begin(Services& services, int handler, std::string_view normal_dn);
   bool set(int number, void* value) noexcept;
   static bool interrupted(void* self) noexcept;
   bool must_stop() noexcept;
+  bool take_budget(const Services& services) noexcept;
+  void learn_cost(Services& services, int code) noexcept;
 
   const std::shared_ptr<OperationHome> home_;
   const std::shared_ptr<const Identity> identity_;  // null: anonymous
@@ -73,7 +99,10 @@ class PendingOperation final : public GateWaiter,
   Answer answer_;
   Operation operation_;
   int handler_ = 0;
+  int scope_ = 0;
   bool long_running_ = false;
+  bool wants_worker_ = true;
+  std::size_t charged_ = 0;
 
   // Arguments of the handler, released with the operation.
   PblockPtr parameters_;
@@ -85,7 +114,7 @@ class PendingOperation final : public GateWaiter,
   // For the check of a running search.
   const std::atomic<bool>* stopping_ = nullptr;
   bool on_home_thread_ = false;
-  unsigned polls_ = 0;
+  std::size_t looked_at_ = 0;
   Clock::time_point next_look_{};
 };
 

@@ -4,6 +4,7 @@
 
 #include <asio/thread_pool.hpp>
 #include <atomic>
+#include <cstdint>
 #include <functional>
 #include <memory>
 #include <string>
@@ -13,6 +14,8 @@
 #include "auth/identities.h"
 #include "logs.h"
 #include "ops/backend_host.h"
+#include "ops/output_meter.h"
+#include "ops/search_cost.h"
 #include "slapi/owners.h"
 #include "slapi/schema.h"
 
@@ -26,12 +29,19 @@ class Authenticator {
   // files.
   virtual std::shared_ptr<const Identity> authenticate(std::string_view name,
                                                        std::string_view password) = 0;
+
+  // A number that changes whenever the identities were read anew. Cheap; must not block.
+  virtual std::uint64_t generation() const noexcept { return 0; }
+
+  // Whether what an identity proved when it bound still holds by the identities read last: it is
+  // there, with the same flags, roles, entry and password. Must not read files.
+  virtual bool still_valid(const Identity&) const noexcept { return true; }
 };
 
 // Entries of the server's own outside every backend; null without memory.
 struct Publications {
-  std::function<EntryPtr()> root_dse;
-  std::function<EntryPtr()> subschema;
+  std::function<std::shared_ptr<const entry>()> root_dse;
+  std::function<std::shared_ptr<const entry>()> subschema;
 };
 
 struct Services {
@@ -41,12 +51,16 @@ struct Services {
   Publications publications;
   Logs& logs;
   std::vector<std::string> supported_controls;
-  // For what waits: changes, which flush to disk, and password checks, which cost time by
-  // intention. Apart, because whoever holds the gate must not queue behind strangers who try
-  // passwords.
+  // For what takes long: changes, which flush to disk, with long searches, and password checks,
+  // which cost time by intention. Apart, because whoever holds the gate must not queue behind
+  // strangers who try passwords.
   asio::thread_pool& changes;
   asio::thread_pool& verifiers;
   std::atomic<bool> stopping{false};  // running searches end
+  // Told when the backend could not open its session (code 1). May be empty; returns at once.
+  std::function<void()> note_failure{};
+  OutputMeter output{};
+  SearchCost search_cost{};
 };
 
 }  // namespace orv::server

@@ -8,6 +8,7 @@
 #include "cfg/dn.h"
 #include "cfg/result_codes.h"
 #include "cfg/secret.h"
+#include "ops/log_text.h"
 #include "publish/match.h"
 #include "publish/root_dse.h"
 #include "slapi/globals.h"
@@ -17,6 +18,9 @@ namespace {
 
 constexpr std::string_view kSuffix = "CN=CONFIGURATION";
 constexpr std::string_view kNotOffered = "operation not supported";
+constexpr std::string_view kStopping = "server is stopping";
+// Stands for "no result" in the access log.
+constexpr int kAbandoned = -1;
 
 // The tag of the answer to a request, 0 for requests without one.
 int response_tag(const Request& request) {
@@ -74,11 +78,11 @@ std::int64_t stricter(std::int64_t a, std::int64_t b) {
   return std::min(a, b);
 }
 
-// "NAME base="..."".
+// NAME dn="...".
 std::string describe(std::string_view name, std::string_view dn) {
   std::string text(name);
   text += " dn=";
-  append_quoted(text, dn);
+  append_client_text(text, dn);
   return text;
 }
 
@@ -87,8 +91,25 @@ std::string describe_search(const Schema& schema, const SearchRequest& request) 
   text += " scope=";
   append_number(text, request.scope);
   text += " filter=";
-  append_quoted(text, rewrite_filter(schema, request.filter, FilterUse::show));
+  // Cut before it is rewritten: a long filter costs no more than a short one.
+  append_client_text(text, rewrite_filter(schema, logged_part(request.filter), FilterUse::show));
+  if (request.filter.size() > kLoggedBytes) text += "...";
   return text;
+}
+
+void wipe_credentials(BindRequest& request) noexcept {
+  cfg::wipe(request.password);
+  if (request.credentials) cfg::wipe(*request.credentials);
+}
+
+// Copies, because a moved-from short text still holds its characters.
+void take_over(BindRequest& from, BindRequest& to) {
+  to.version = from.version;
+  to.name = from.name;
+  to.simple = from.simple;
+  to.mechanism = from.mechanism;
+  to.password = from.password;
+  to.credentials = from.credentials;
 }
 
 bool has_no_access(unsigned authority) {
@@ -104,7 +125,7 @@ bool may_search(unsigned authority) {
 }  // namespace
 
 Session::Session(Services& services, AccessLane& access, std::uint64_t number)
-    : services_(services), access_(access), number_(number) {
+    : services_(services), access_(access), number_(number), output_(services.output) {
   connection_.aux = &aux_;
   connection_.server = this;
   install_senders(connection_);
@@ -113,7 +134,11 @@ Session::Session(Services& services, AccessLane& access, std::uint64_t number)
 // ---- messages
 
 void Session::handle(std::string_view frame) {
-  Message message;
+  struct WipedMessage : Message {
+    ~WipedMessage() {
+      if (auto* const bind = std::get_if<BindRequest>(&request)) wipe_credentials(*bind);
+    }
+  } message;
   const Decoded decoded = decode(frame, decoder_limits(settings()), message);
   if (decoded.state == DecodeState::fatal) return disconnect(decoded.code, decoded.text);
   if (decoded.state == DecodeState::decoded) return take(message);
@@ -130,8 +155,11 @@ void Session::take(Message& message) {
   const std::int32_t id = message.id;
   Request& request = message.request;
   if (std::holds_alternative<UnbindRequest>(request)) return drop();
+  // RFC 4511, 4.1.1.1: answers could not be told apart.
+  if (outstanding(id)) return disconnect(result::protocol_error, "message ID is in use");
   if (const auto* given_up = std::get_if<AbandonRequest>(&request))
     return abandon(given_up->message_id);
+  if (!identity_holds()) return;
   const int answer_tag = response_tag(request);
   Refusal refusal;
   if (control_is_unknown(message))
@@ -158,7 +186,7 @@ bool Session::control_is_unknown(const Message& message) const {
 }
 
 bool Session::busy() const noexcept {
-  return bind_.has_value() ||
+  return bind_ != nullptr ||
          outstanding_.size() >= static_cast<std::size_t>(settings().max_pending_operations);
 }
 
@@ -179,7 +207,7 @@ void Session::search(std::int32_t id, SearchRequest& request) {
   const Target target = find_target(request.base, normal);
   if (target == Target::root_dse && request.scope == 0)
     return search_published(id, request, services_.publications.root_dse(), "");
-  if (target == Target::subschema && request.scope != 1)
+  if (target == Target::subschema)
     return search_published(id, request, services_.publications.subschema(), kSubschemaDn);
 
   const OperationPtr operation =
@@ -187,19 +215,21 @@ void Session::search(std::int32_t id, SearchRequest& request) {
                      stricter(settings().size_limit, request.size_limit));
   if (services_.logs.access_enabled())
     operation->log_text = describe_search(services_.schema, request);
-  if (target == Target::not_a_dn) return submit(operation, {result::invalid_dn_syntax, "base"});
+  if (target == Target::not_a_dn)
+    return submit(operation, {result::invalid_dn_syntax, "the base object is not a DN"});
   if (target != Target::configuration) return submit(operation, {result::no_such_object, ""});
   if (!may_search(connection_.authority))
     return submit(operation, {result::insufficient_access, ""});
   submit(operation, operation->prepare_search(services_, request, normal));
 }
 
-void Session::search_published(std::int32_t id, const SearchRequest& request, EntryPtr published,
-                               std::string_view dn) {
+void Session::search_published(std::int32_t id, const SearchRequest& request,
+                               const std::shared_ptr<const entry>& published, std::string_view dn) {
   Answer answer(id, tag::search_done, {});
   const Clock::time_point started = Clock::now();
   int code = published ? result::success : result::no_memory;
-  if (published && entry_matches(*published, request.filter)) {
+  // It has no children: only the searches that begin with the base itself find something.
+  if (published && request.scope != 1 && entry_matches(*published, request.filter)) {
     const TextArray names = canonical_names(services_.schema, request.attributes);
     code = answer.entry(*published, names.get(), request.types_only, nullptr);
   }
@@ -212,7 +242,7 @@ void Session::search_published(std::int32_t id, const SearchRequest& request, En
 // ---- changes
 
 Refusal Session::refuse_change(Target target) const {
-  if (target == Target::not_a_dn) return {result::invalid_dn_syntax, "not a DN"};
+  if (target == Target::not_a_dn) return {result::invalid_dn_syntax, "the target is not a DN"};
   if (target == Target::nothing) return {result::no_such_object, ""};
   if (target != Target::configuration) return {result::unwilling_to_perform, "cannot be changed"};
   if (has_no_access(connection_.authority)) return {result::insufficient_access, ""};
@@ -262,64 +292,217 @@ Session::OperationPtr Session::make_operation(std::int32_t id, int response_tag,
 
 void Session::submit(const OperationPtr& operation, Refusal refusal) {
   outstanding_.push_back(operation);
-  if (refusal) {
-    operation->answer().result(refusal.code, "", refusal.text);
-    return complete(operation);
-  }
+  if (refusal) return answer_and_complete(operation, refusal.code, refusal.text);
+  start(operation);
+}
+
+// Goes to the gate, or waits for the client to read.
+void Session::start(const OperationPtr& operation) {
+  if (output_.full()) return hold(operation);
   Gate& gate = services_.backend.gate();
-  const auto deadline = operation->started() + std::chrono::seconds(settings().operation_wait);
-  const Gate::Entry entry = operation->wants_worker() ? gate.enter_elsewhere(operation, deadline)
-                                                      : gate.enter(operation, deadline);
+  const auto deadline = Clock::now() + std::chrono::seconds(settings().operation_wait);
+  Gate::Entry entry = Gate::Entry::closed;
+  try {
+    entry = operation->wants_worker() ? gate.enter_elsewhere(operation, deadline)
+                                      : gate.enter(operation, deadline);
+  } catch (const std::bad_alloc&) {
+    return answer_and_complete(operation, result::no_memory, "");
+  }
   if (entry == Gate::Entry::inside) return run_here(operation);
-  if (entry == Gate::Entry::queued) return;
-  operation->answer().result(result::unavailable, "", "server is stopping");
+  if (entry == Gate::Entry::closed) answer_and_complete(operation, result::unavailable, kStopping);
+}
+
+void Session::answer_and_complete(const OperationPtr& operation, int code, std::string_view text) {
+  operation->answer().result(code, "", text);
   complete(operation);
 }
 
 void Session::run_here(const OperationPtr& operation) {
-  if (operation->long_running()) flush();
+  if (output_.full()) {
+    services_.backend.leave_gate();
+    return hold(operation);
+  }
+  try {
+    if (operation->long_running()) flush();
+  } catch (...) {
+    services_.backend.leave_gate();
+    throw;
+  }
   operation->run(services_, true);
   complete(operation);
 }
 
-void Session::run_on_worker(OperationPtr operation) {
-  asio::post(services_.changes, [this, self = shared_from_this(), operation] {
-    operation->run(services_, false);
-    post([this, self, operation] {
-      complete(operation);
-      resume();
-    });
-  });
+void Session::run_on_worker(const OperationPtr& operation) noexcept {
+  try {
+    asio::post(services_.changes,
+               [this, self = shared_from_this(), operation] { work(operation); });
+  } catch (...) {
+    // It keeps the gate until the tick tries again.
+    operation->step.store(Step::run);
+    operation->stranded.store(true);
+    stranded_.store(true);
+  }
+}
+
+// On a worker, inside the gate.
+void Session::work(const OperationPtr& operation) noexcept {
+  if (output_.full() && !operation->answer().abandoned()) {
+    services_.backend.leave_gate();
+    return hand_back(operation, Step::hold);
+  }
+  operation->run(services_, false);
+  hand_back(operation, Step::finish);
 }
 
 void Session::decided(std::shared_ptr<PendingOperation> operation, Verdict verdict) noexcept {
+  if (verdict == Verdict::admitted) {
+    if (operation->wants_worker()) return run_on_worker(operation);
+    return hand_back(operation, Step::run);
+  }
+  hand_back(operation, verdict == Verdict::late ? Step::late : Step::closed);
+}
+
+// Any thread.
+void Session::hand_back(const OperationPtr& operation, Step step) noexcept {
+  operation->step.store(step);
   try {
-    if (verdict == Verdict::admitted && operation->wants_worker()) return run_on_worker(operation);
-    post([this, self = shared_from_this(), operation, verdict] {
-      if (verdict == Verdict::admitted) {
-        run_here(operation);
-      } else {
-        const bool late = verdict == Verdict::late;
-        operation->answer().result(late ? result::busy : result::unavailable, "",
-                                   late ? "the configuration is busy" : "server is stopping");
-        complete(operation);
-      }
-      resume();
-    });
+    post([this, self = shared_from_this(), operation] { take_step_or_end(operation); });
   } catch (...) {
-    // Without memory to go on: whoever was admitted must not keep the gate.
-    if (verdict == Verdict::admitted) services_.backend.gate().leave();
+    operation->stranded.store(true);
+    stranded_.store(true);
+  }
+}
+
+void Session::take_step(const OperationPtr& operation) {
+  switch (operation->step.load()) {
+    case Step::run:
+      if (operation->wants_worker()) return run_on_worker(operation);
+      run_here(operation);
+      break;
+    case Step::hold:
+      hold(operation);
+      break;
+    case Step::late:
+      answer_and_complete(operation, result::busy, "the configuration is busy");
+      break;
+    case Step::closed:
+      answer_and_complete(operation, result::unavailable, kStopping);
+      break;
+    case Step::finish:
+      complete(operation);
+      break;
+  }
+  resume();
+}
+
+void Session::take_step_or_end(const OperationPtr& operation) noexcept {
+  try {
+    take_step(operation);
+  } catch (...) {
+    end_for_want_of_memory();
+  }
+}
+
+// The client cannot be told what became of its request, so it must not wait for it either.
+void Session::end_for_want_of_memory() noexcept {
+  try {
+    return disconnect(result::no_memory, "out of memory");
+  } catch (...) {
+  }
+  try {
+    drop();
+  } catch (...) {
   }
 }
 
 void Session::complete(const OperationPtr& operation) {
   std::erase(outstanding_, operation);
-  Answer& answer = operation->answer();
-  if (!gone_ && !answer.abandoned()) transmit(answer.bytes());
-  log_result(answer.message_id(), operation->log_text, answer.code(), answer.entries(),
+  if (operation->held) {
+    operation->held = false;
+    --held_;
+  }
+  const Answer& answer = operation->answer();
+  if (answer.code() == result::operations_error && services_.note_failure) services_.note_failure();
+  log_result(answer.message_id(), operation->log_text,
+             answer.abandoned() ? kAbandoned : answer.code(), answer.entries(),
              operation->started());
+  deliver(*operation);
+  start_held_later();
   if (bind_ && !gone_) try_bind();
   settle_if_done();
+}
+
+void Session::deliver(PendingOperation& operation) {
+  struct Settle {
+    ~Settle() { share.settled(bytes); }
+    OutputShare& share;
+    std::size_t bytes;
+  } const settle{output_, operation.charged()};
+  if (gone_ || operation.answer().abandoned()) return;
+  output_.queued(operation.charged());
+  transmit(operation.answer().bytes());
+}
+
+// ---- waiting for the client to read
+
+void Session::hold(const OperationPtr& operation) {
+  if (gone_ || operation->answer().abandoned()) return complete(operation);
+  operation->held = true;
+  ++held_;
+  start_held_later();
+}
+
+void Session::start_held() {
+  if (starting_held_) return;
+  struct Flag {
+    explicit Flag(bool& f) : flag(f) { flag = true; }
+    ~Flag() { flag = false; }
+    bool& flag;
+  } const starting(starting_held_);
+  while (held_ > 0 && !output_.full()) {
+    const auto found = std::find_if(outstanding_.begin(), outstanding_.end(),
+                                    [](const OperationPtr& operation) { return operation->held; });
+    const OperationPtr operation = *found;
+    operation->held = false;
+    --held_;
+    start(operation);
+  }
+}
+
+void Session::start_held_later() noexcept {
+  if (held_ == 0 || starting_held_ || output_.full()) return;
+  try {
+    post([this, self = shared_from_this()] {
+      try {
+        start_held();
+      } catch (...) {
+        end_for_want_of_memory();
+      }
+    });
+  } catch (...) {
+    stranded_.store(true);
+  }
+}
+
+void Session::output_is(std::size_t unwritten) noexcept {
+  output_.unwritten(unwritten);
+  start_held_later();
+}
+
+// ---- now and then
+
+void Session::tick() {
+  pick_up_stranded();
+  if (!gone_) identity_holds();
+}
+
+void Session::pick_up_stranded() {
+  if (!stranded_.exchange(false)) return;
+  const std::vector<OperationPtr> all = outstanding_;
+  for (const OperationPtr& operation : all)
+    if (operation->stranded.exchange(false)) take_step_or_end(operation);
+  if (bind_ && bind_->verified.load()) verified(bind_);
+  start_held();
 }
 
 void Session::respond(std::int32_t id, int response_tag, int code, std::string_view text,
@@ -335,16 +518,25 @@ void Session::respond(std::int32_t id, int response_tag, int code, std::string_v
   log_result(id, what, code, 0, started);
 }
 
-void Session::abandon(std::int32_t message_id) noexcept {
-  const auto found =
-      std::find_if(outstanding_.begin(), outstanding_.end(), [&](const OperationPtr& operation) {
-        return operation->answer().message_id() == message_id;
-      });
-  if (found == outstanding_.end()) return;
-  const OperationPtr operation = *found;
+// One that was given up does not count: its client does not wait for it any more.
+Session::OperationPtr Session::outstanding(std::int32_t message_id) const noexcept {
+  for (const OperationPtr& operation : outstanding_) {
+    const Answer& answer = operation->answer();
+    if (answer.message_id() == message_id && !answer.abandoned()) return operation;
+  }
+  return nullptr;
+}
+
+void Session::abandon(std::int32_t message_id) {
+  const OperationPtr operation = outstanding(message_id);
+  if (operation && give_up(operation)) complete(operation);
+}
+
+// Whether nobody has it in hand any more. One that is being run, or was just admitted, finishes and
+// is dropped then.
+bool Session::give_up(const OperationPtr& operation) noexcept {
   operation->answer().abandon();
-  // One that is being run, or was just admitted, finishes and is dropped then.
-  if (services_.backend.gate().withdraw(*operation)) complete(operation);
+  return operation->held || services_.backend.gate().withdraw(*operation);
 }
 
 void Session::client_left() noexcept {
@@ -352,9 +544,19 @@ void Session::client_left() noexcept {
   gone_ = true;
   connection_.state.store(0, std::memory_order_relaxed);
   aux_.client_gone.store(1, std::memory_order_relaxed);
-  const std::vector<OperationPtr> all = outstanding_;
-  for (const OperationPtr& operation : all) abandon(operation->answer().message_id());
-  if (bind_ && !bind_->started) bind_.reset();
+  for (std::size_t i = 0; i < outstanding_.size();) {
+    const OperationPtr operation = outstanding_[i];
+    // With the client gone, completing is forgetting: nothing in it can throw.
+    if (give_up(operation))
+      complete(operation);
+    else
+      ++i;
+  }
+  if (bind_ && !bind_->started) {
+    log_result(bind_->message_id, operation_name(tag::bind_response), kAbandoned, 0,
+               bind_->received);
+    bind_.reset();
+  }
   settle_if_done();
 }
 
@@ -372,11 +574,17 @@ void Session::unbind() noexcept {
 
 // ---- bind
 
+Session::Bind::~Bind() {
+  wipe_credentials(request);
+}
+
 void Session::receive_bind(std::int32_t id, BindRequest& request, Refusal refusal) {
-  bind_.emplace();
-  bind_->message_id = id;
-  bind_->request = std::move(request);
-  bind_->refusal = std::move(refusal);
+  auto bind = std::make_shared<Bind>();
+  bind->message_id = id;
+  take_over(request, bind->request);
+  wipe_credentials(request);
+  bind->refusal = std::move(refusal);
+  bind_ = std::move(bind);
   try_bind();
 }
 
@@ -388,7 +596,8 @@ void Session::try_bind() {
 }
 
 void Session::start_bind() {
-  const BindRequest& request = bind_->request;
+  const BindPtr bind = bind_;  // outlives the answer to it
+  const BindRequest& request = bind->request;
   if (bind_->refusal) return finish_bind(bind_->refusal.code, bind_->refusal.text, nullptr);
   if (request.version != 3)
     return finish_bind(result::protocol_error, "only LDAP version 3 is supported", nullptr);
@@ -397,7 +606,7 @@ void Session::start_bind() {
   std::string normal;
   const Target target = find_target(request.name, normal);
   if (target == Target::not_a_dn)
-    return finish_bind(result::invalid_dn_syntax, "name is not a DN", nullptr);
+    return finish_bind(result::invalid_dn_syntax, "the bind name is not a DN", nullptr);
   if (target == Target::root_dse && request.password.empty())
     return finish_bind(result::success, "", nullptr);
   if (request.password.empty())
@@ -408,23 +617,46 @@ void Session::start_bind() {
 }
 
 void Session::verify_password() {
-  asio::post(services_.verifiers, [this, self = shared_from_this(),
-                                   request = std::move(bind_->request)]() mutable {
-    std::shared_ptr<const Identity> identity;
-    int code = result::invalid_credentials;
-    try {
-      identity = services_.authenticator.authenticate(request.name, request.password);
-      if (identity) code = result::success;
-    } catch (const std::bad_alloc&) {
-      code = result::no_memory;
-    }
-    cfg::wipe(request.password);
-    post([this, self, code, identity = std::move(identity), name = std::move(request.name)] {
-      bind_->request.name = name;  // for the access log
-      finish_bind(code, "", identity);
-      resume();
+  try {
+    asio::post(services_.verifiers,
+               [this, self = shared_from_this(), bind = bind_] { verify(bind); });
+  } catch (const std::bad_alloc&) {
+    finish_bind(result::no_memory, "", nullptr);
+  }
+}
+
+// On a worker.
+void Session::verify(const BindPtr& bind) noexcept {
+  bind->code = result::invalid_credentials;
+  bind->generation = services_.authenticator.generation();
+  try {
+    bind->identity =
+        services_.authenticator.authenticate(bind->request.name, bind->request.password);
+    if (bind->identity) bind->code = result::success;
+  } catch (const std::bad_alloc&) {
+    bind->code = result::no_memory;
+  } catch (...) {
+    bind->code = result::other;
+  }
+  wipe_credentials(bind->request);
+  bind->verified.store(true);
+  try {
+    post([this, self = shared_from_this(), bind] {
+      try {
+        verified(bind);
+      } catch (...) {
+        end_for_want_of_memory();
+      }
     });
-  });
+  } catch (...) {
+    stranded_.store(true);
+  }
+}
+
+void Session::verified(const BindPtr& bind) {
+  if (bind_ != bind) return;
+  finish_bind(bind->code, "", bind->identity);
+  resume();
 }
 
 void Session::ask_backend_to_bind() {
@@ -440,24 +672,38 @@ void Session::ask_backend_to_bind() {
 
 void Session::finish_bind(int code, std::string_view text,
                           std::shared_ptr<const Identity> identity) {
-  Bind bind = std::move(*bind_);
-  bind_.reset();
-  cfg::wipe(bind.request.password);
-  if (gone_) return settle_if_done();
+  const BindPtr bind = std::move(bind_);
+  bind_ = nullptr;
+  wipe_credentials(bind->request);
   std::string what;
   if (services_.logs.access_enabled())
-    what = describe("BIND", bind.request.name) + (bind.request.simple ? " simple" : " sasl");
+    what = describe("BIND", bind->request.name) + (bind->request.simple ? " simple" : " sasl");
+  log_result(bind->message_id, what, gone_ ? kAbandoned : code, 0, bind->received);
+  if (gone_) return settle_if_done();
   become(std::move(identity));
-  Answer answer(bind.message_id, tag::bind_response, {});
+  identity_checked_ = bind->generation;
+  Answer answer(bind->message_id, tag::bind_response, {});
   answer.result(code, "", text);
   transmit(answer.bytes());
-  log_result(bind.message_id, what, code, 0, bind.received);
 }
 
 void Session::become(std::shared_ptr<const Identity> identity) noexcept {
   identity_ = std::move(identity);
   connection_.authority = identity_ ? identity_->authority : authority::no_configuration_access;
   connection_.roles = identity_ ? identity_->roles : 0;
+}
+
+// Ends the connection when the identities were read anew and the bound one is not what it was.
+bool Session::identity_holds() {
+  if (!identity_) return true;
+  const std::uint64_t generation = services_.authenticator.generation();
+  if (generation == identity_checked_) return true;
+  if (services_.authenticator.still_valid(*identity_)) {
+    identity_checked_ = generation;
+    return true;
+  }
+  disconnect(result::stronger_auth_required, "the bound identity has changed or is gone");
+  return false;
 }
 
 // ---- access log
@@ -467,20 +713,27 @@ std::string* Session::begin_access_line() {
 }
 
 void Session::log_result(std::int32_t id, std::string_view what, int code, std::int64_t entries,
-                         Clock::time_point started) {
+                         Clock::time_point started) noexcept try {
   std::string* const line = begin_access_line();
   if (!line) return;
   using std::chrono::duration_cast;
   using std::chrono::microseconds;
   *line += "op=";
   append_number(*line, id);
-  line->append(" ").append(what).append(" result=");
-  append_number(*line, code);
+  line->append(" ").append(what);
+  if (code == kAbandoned) {
+    *line += " abandoned";
+  } else {
+    *line += " result=";
+    append_number(*line, code);
+  }
   *line += " entries=";
   append_number(*line, entries);
   *line += " us=";
   append_number(*line, duration_cast<microseconds>(Clock::now() - started).count());
   end_access_line();
+} catch (...) {
+  // Without memory the line is lost.
 }
 
 }  // namespace orv::server

@@ -2,15 +2,15 @@
 // with each message. How bytes come and go is its subclass's affair.
 //
 // Rules kept here (RFC 4511): a bind waits until nothing is outstanding, and nothing else is read
-// meanwhile; a failed bind leaves the connection anonymous; abandon and unbind have no answer;
-// unknown critical controls are refused. Callers without access to the configuration are refused
-// before the backend is entered.
+// meanwhile; a failed bind leaves the connection anonymous; abandon and unbind have no answer; a
+// message ID that is still in use ends the connection; unknown critical controls are refused.
+// Callers without access to the configuration are refused before the backend is entered.
 //
 // Threads: everything on the connection's loop thread, except `decided`.
 #pragma once
 
+#include <atomic>
 #include <memory>
-#include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -29,6 +29,7 @@ class Session : public OperationHome, public std::enable_shared_from_this<Sessio
 
   Connection& connection() noexcept override { return connection_; }
   void decided(std::shared_ptr<PendingOperation> operation, Verdict verdict) noexcept override;
+  OutputShare& output() noexcept override { return output_; }
 
  protected:
   // ---- what the subclass provides
@@ -59,8 +60,10 @@ class Session : public OperationHome, public std::enable_shared_from_this<Sessio
   void client_left() noexcept;
   bool client_is_gone() const noexcept { return gone_; }
   bool idle() const noexcept { return outstanding_.empty() && !bind_; }
-  // Gives up the operation of that message id, if it is outstanding.
-  void abandon(std::int32_t message_id) noexcept;
+  // The subclass has so many bytes to write now. To be called whenever that changes.
+  void output_is(std::size_t unwritten) noexcept;
+  // To be called a few times a second, also when the client is gone.
+  void tick();
   // Calls the unbind handler. Once, when the session has settled.
   void unbind() noexcept;
   // Starts an access line of this connection; null when the access log is off.
@@ -70,25 +73,36 @@ class Session : public OperationHome, public std::enable_shared_from_this<Sessio
   Services& services() noexcept { return services_; }
 
  private:
-  // A bind request that waits or is being verified.
+  // A bind request that waits or is being verified. It does not move, so that the password is in
+  // one place, and is wiped there.
   struct Bind {
+    ~Bind();
     std::int32_t message_id = 0;
     BindRequest request;
     Refusal refusal;  // decided already
     bool started = false;
     Clock::time_point received = Clock::now();
+
+    // The verification's outcome; valid from `verified` on.
+    int code = 0;
+    std::shared_ptr<const Identity> identity;
+    std::uint64_t generation = 0;  // of the identities, not newer than what was asked
+    std::atomic<bool> verified{false};
   };
+  using BindPtr = std::shared_ptr<Bind>;
   using OperationPtr = std::shared_ptr<PendingOperation>;
 
   void take(Message& message);
+  OperationPtr outstanding(std::int32_t message_id) const noexcept;
   bool control_is_unknown(const Message& message) const;
+  void abandon(std::int32_t message_id);
 
   void search(std::int32_t id, SearchRequest& request);
   void add(std::int32_t id, const AddRequest& request);
   void remove(std::int32_t id, const DeleteRequest& request);
   void modify(std::int32_t id, const ModifyRequest& request);
-  void search_published(std::int32_t id, const SearchRequest& request, EntryPtr published,
-                        std::string_view dn);
+  void search_published(std::int32_t id, const SearchRequest& request,
+                        const std::shared_ptr<const entry>& published, std::string_view dn);
 
   enum class Target { root_dse, subschema, configuration, nothing, not_a_dn };
   Target find_target(std::string_view dn, std::string& normal) const;
@@ -97,21 +111,38 @@ class Session : public OperationHome, public std::enable_shared_from_this<Sessio
   OperationPtr make_operation(std::int32_t id, int response_tag, std::int64_t time_limit,
                               std::int64_t size_limit);
   void submit(const OperationPtr& operation, Refusal refusal);
+  void start(const OperationPtr& operation);
+  void answer_and_complete(const OperationPtr& operation, int code, std::string_view text);
   void run_here(const OperationPtr& operation);
-  void run_on_worker(OperationPtr operation);
+  void run_on_worker(const OperationPtr& operation) noexcept;
+  void work(const OperationPtr& operation) noexcept;
+  void hand_back(const OperationPtr& operation, Step step) noexcept;
+  void take_step(const OperationPtr& operation);
+  void take_step_or_end(const OperationPtr& operation) noexcept;
   void complete(const OperationPtr& operation);
+  void deliver(PendingOperation& operation);
+  bool give_up(const OperationPtr& operation) noexcept;
+  void hold(const OperationPtr& operation);
+  void start_held();
+  void start_held_later() noexcept;
+  void pick_up_stranded();
+  void end_for_want_of_memory() noexcept;
   void respond(std::int32_t id, int response_tag, int code, std::string_view text,
                std::string_view what, std::string_view response_name = {});
+  // `code` kAbandoned: there was no result.
   void log_result(std::int32_t id, std::string_view what, int code, std::int64_t entries,
-                  Clock::time_point started);
+                  Clock::time_point started) noexcept;
 
   void receive_bind(std::int32_t id, BindRequest& request, Refusal refusal);
   void try_bind();
   void start_bind();
   void verify_password();
+  void verify(const BindPtr& bind) noexcept;
+  void verified(const BindPtr& bind);
   void ask_backend_to_bind();
   void finish_bind(int code, std::string_view text, std::shared_ptr<const Identity> identity);
   void become(std::shared_ptr<const Identity> identity) noexcept;
+  bool identity_holds();
   void settle_if_done();
 
   Services& services_;
@@ -120,9 +151,14 @@ class Session : public OperationHome, public std::enable_shared_from_this<Sessio
   Connection connection_;
   ConnectionAux aux_;
   std::shared_ptr<const Identity> identity_;  // null: anonymous
+  std::uint64_t identity_checked_ = 0;        // the generation by which it was good
+  OutputShare output_;
   std::vector<OperationPtr> outstanding_;
-  std::optional<Bind> bind_;
+  BindPtr bind_;
   bool gone_ = false;
+  bool starting_held_ = false;
+  std::size_t held_ = 0;               // of the outstanding ones
+  std::atomic<bool> stranded_{false};  // something could not be posted
 };
 
 }  // namespace orv::server

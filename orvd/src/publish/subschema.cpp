@@ -56,8 +56,8 @@ constexpr const char* kMatchingRules[] = {
     "( 2.5.13.30 NAME 'objectIdentifierFirstComponentMatch' SYNTAX 1.3.6.1.4.1.1466.115.121.1.38 )",
     "( 1.3.6.1.4.1.1466.109.114.1 NAME 'caseExactIA5Match' SYNTAX 1.3.6.1.4.1.1466.115.121.1.26 )",
     "( 1.3.6.1.4.1.1466.109.114.2 NAME 'caseIgnoreIA5Match' SYNTAX 1.3.6.1.4.1.1466.115.121.1.26 )",
-    "( 1.3.6.1.4.1.1466.109.114.3 NAME 'caseIgnoreIA5SubstringsMatch'"
-    " SYNTAX 1.3.6.1.4.1.1466.115.121.1.58 )",
+    ("( 1.3.6.1.4.1.1466.109.114.3 NAME 'caseIgnoreIA5SubstringsMatch'"
+     " SYNTAX 1.3.6.1.4.1.1466.115.121.1.58 )"),
     "( 1.3.6.1.1.16.2 NAME 'UUIDMatch' SYNTAX 1.3.6.1.1.16.1 )",
     "( 1.3.6.1.1.16.3 NAME 'UUIDOrderingMatch' SYNTAX 1.3.6.1.1.16.1 )",
 };
@@ -65,6 +65,7 @@ constexpr const char* kMatchingRules[] = {
 template <typename Descriptions>
 std::vector<std::string> descriptions_of(const Descriptions& elements) {
   std::vector<std::string> texts;
+  texts.reserve(elements.size());
   for (const auto& element : elements) texts.push_back(element.description);
   return texts;
 }

@@ -1,0 +1,40 @@
+"""A server of kind 3 shows its configuration to callers with a mark that LDAP does not carry."""
+
+import ldap
+import pytest
+
+from orv_e2e import clients
+
+
+@pytest.fixture(name="kind_3")
+def kind_3_fixture(instance):
+    instance.config.add_member("auditor", "auditorpassword", roles=("AuditAdmin",))
+    return instance.start("--server-type", "3")
+
+
+def code_of_search(client, scope):
+    try:
+        clients.search(client, scope=scope)
+        return 0
+    except ldap.LDAPError as error:
+        return error.args[0]["result"]
+
+
+@pytest.mark.parametrize("scope", [ldap.SCOPE_BASE, ldap.SCOPE_ONELEVEL, ldap.SCOPE_SUBTREE])
+def test_search_is_answered_32_for_every_administrator(kind_3, scope):
+    assert code_of_search(clients.bind(kind_3), scope) == 32
+    assert code_of_search(clients.bind(kind_3, "cn=auditor", "auditorpassword"), scope) == 32
+
+
+def test_search_of_strangers_is_answered_32_too(kind_3):
+    assert code_of_search(clients.connect(kind_3), ldap.SCOPE_SUBTREE) == 32
+
+
+def test_server_itself_is_found_by_everybody(kind_3):
+    assert clients.connect(kind_3).search_s("", ldap.SCOPE_BASE)
+
+
+@pytest.mark.parametrize("kind", ["0", "1", "2", "4"])
+def test_other_kinds_show_it(instance, kind):
+    instance.start("--server-type", kind)
+    assert code_of_search(clients.bind(instance), ldap.SCOPE_SUBTREE) == 0

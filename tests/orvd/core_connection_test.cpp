@@ -1,0 +1,488 @@
+// Rules of one connection: message ids, texts, the access log, identities that change, and what
+// happens when the backend fails or memory runs out.
+#include <gtest/gtest.h>
+
+#include <unistd.h>
+#include <asio/thread_pool.hpp>
+
+#include <cstdlib>
+#include <deque>
+#include <fstream>
+#include <mutex>
+#include <new>
+#include <semaphore>
+#include <sstream>
+
+#include "cfg/owners.h"
+#include "core_server_fixture.h"
+#include "ops/log_text.h"
+#include "ops/session.h"
+
+namespace orv::server {
+namespace {
+
+using namespace std::chrono_literals;
+using test::Event;
+using test::kRoot;
+using test::kSecret;
+using test::kTop;
+using test::Reply;
+using test::WireClient;
+
+constexpr int kNotice = 0x78;
+
+class ConnectionTest : public test::LoopbackServer {
+ protected:
+  // One client's change is inside the backend until `go_on`.
+  void block() {
+    backend.on_change = [this](pblock* parameters) {
+      entered.happen();
+      go_on.wait();
+      send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 53, nullptr,
+                       "");
+      return 53;
+    };
+    start();
+    holder.emplace(port());
+    bind_as_root(*holder);
+    holder->send(test::delete_entry(2, kTop));
+    ASSERT_TRUE(entered.wait());
+  }
+  ~ConnectionTest() override {
+    go_on.happen();
+    stop();
+  }
+  Event entered;
+  Event go_on;
+  std::optional<WireClient> holder;
+};
+
+// ---- message ids
+
+TEST_F(ConnectionTest, MessageIdThatIsStillOutstandingEndsTheConnection) {
+  block();
+  WireClient client(port());
+  bind_as_root(client);
+  client.send(test::search(2, kTop) + test::search(2, kTop));
+  const std::optional<Reply> notice = client.receive();
+  ASSERT_TRUE(notice);
+  EXPECT_EQ(notice->id, 0);
+  EXPECT_EQ(notice->tag, kNotice);
+  EXPECT_EQ(notice->code, 2);
+  EXPECT_TRUE(client.closed());
+  EXPECT_TRUE(wait_for_waiters(0));
+}
+
+TEST_F(ConnectionTest, MessageIdMayBeUsedAgainAfterTheAnswerAndAfterAnAbandon) {
+  block();
+  WireClient client(port());
+  bind_as_root(client);
+  EXPECT_EQ(code_of(client, test::search(2, "")), 0);
+  EXPECT_EQ(code_of(client, test::search(2, "")), 0);
+  client.send(test::search(3, kTop) + test::abandon(4, 3) + test::search(3, ""));
+  EXPECT_EQ(client.receive_result().back().id, 3);
+  // The one in hand is given up, too, and nothing will come for it.
+  holder->send(test::abandon(3, 2) + test::search(2, ""));
+  EXPECT_EQ(holder->receive_result().back().code, 0);
+}
+
+// ---- published entries
+
+TEST_F(ConnectionTest, SubschemaHasNoChildrenAndTheRootDseIsFoundByABaseSearchOnly) {
+  start();
+  WireClient client(port());
+  client.send(test::search(1, "cn=subschema", 1));
+  const std::vector<Reply> replies = client.receive_result();
+  ASSERT_EQ(replies.size(), 1U);
+  EXPECT_EQ(replies[0].code, 0);
+  client.send(test::search(2, "cn=subschema", 2));
+  EXPECT_EQ(client.receive_result().size(), 2U);
+  EXPECT_EQ(code_of(client, test::search(3, "", 1)), 32);
+  EXPECT_EQ(code_of(client, test::search(4, "", 2)), 32);
+}
+
+// ---- texts
+
+TEST_F(ConnectionTest, RefusalsSayWhichNameIsNoDn) {
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  const auto text_of = [&](const std::string& request) {
+    client.send(request);
+    const std::optional<Reply> reply = client.receive();
+    EXPECT_TRUE(reply);
+    EXPECT_EQ(reply->code, 34);
+    return reply->body;
+  };
+  EXPECT_NE(text_of(test::search(2, "no dn")).find("the base object is not a DN"),
+            std::string::npos);
+  EXPECT_NE(text_of(test::delete_entry(3, "no dn")).find("the target is not a DN"),
+            std::string::npos);
+  EXPECT_NE(text_of(test::bind(4, "no dn", "x")).find("the bind name is not a DN"),
+            std::string::npos);
+}
+
+TEST_F(ConnectionTest, MessageBeyondTheLimitIsToldTheLimitAndItsSetting) {
+  settings.max_message_size = 2048;
+  start();
+  WireClient client(port());
+  client.send(test::search(1, std::string(4096, 'x')));
+  const std::optional<Reply> notice = client.receive();
+  ASSERT_TRUE(notice);
+  EXPECT_NE(notice->body.find("2048"), std::string::npos);
+  EXPECT_NE(notice->body.find("orv-slapdMaxMessageSize"), std::string::npos);
+}
+
+// ---- access log
+
+std::string logged(std::string_view text) {
+  std::string line;
+  append_client_text(line, text);
+  return line;
+}
+
+TEST(ClientText, IsQuotedAndEscaped) {
+  EXPECT_EQ(logged("cn=a"), R"("cn=a")");
+  EXPECT_EQ(logged("a\"b\\c\nd\x7F"), R"("a\22b\5Cc\0Ad\7F")");
+  EXPECT_EQ(logged("gr\xC3\xBC\xC3\x9F"), "\"gr\xC3\xBC\xC3\x9F\"");
+}
+
+TEST(ClientText, ControlCharactersBeyondAsciiAndBytesThatAreNoUtf8AreEscaped) {
+  EXPECT_EQ(logged("\xC2\x9B"
+                   "31m"),
+            R"("\C2\9B31m")");
+  EXPECT_EQ(logged("\x9B"
+                   "31m"),
+            R"("\9B31m")");
+  EXPECT_EQ(logged("\xC3"), R"("\C3")");
+  EXPECT_EQ(logged("\xC2\xA0"), "\"\xC2\xA0\"");
+}
+
+TEST(ClientText, IsCutWithAMarkBetweenCharacters) {
+  EXPECT_EQ(logged(std::string(kLoggedBytes, 'x')).size(), kLoggedBytes + 2);
+  const std::string cut = logged(std::string(100000, 'x'));
+  EXPECT_LT(cut.size(), kLoggedBytes + 40);
+  EXPECT_NE(cut.find("...(100000 bytes)"), std::string::npos);
+  const std::string wide =
+      logged(std::string(kLoggedBytes - 1, 'x') + "\xE2\x82\xAC" + std::string(50, 'y'));
+  EXPECT_EQ(wide.find('\\'), std::string::npos);
+  EXPECT_EQ(wide.find('\xE2'), std::string::npos);
+}
+
+class AccessLogTest : public ConnectionTest {
+ protected:
+  AccessLogTest() {
+    char name[] = "/tmp/orv-core-XXXXXX";
+    ::close(mkstemp(name));
+    settings.access_log = name;
+    settings.access_log_level = "info";
+  }
+  ~AccessLogTest() override {
+    go_on.happen();
+    stop();
+    unlink(settings.access_log.c_str());
+  }
+  std::string written() {
+    go_on.happen();
+    stop();
+    std::ostringstream text;
+    text << std::ifstream(settings.access_log).rdbuf();
+    return text.str();
+  }
+};
+
+TEST_F(AccessLogTest, LongTextsOfStrangersMakeShortLines) {
+  start();
+  WireClient client(port());
+  EXPECT_EQ(code_of(client, test::search(1, "cn=" + std::string(500000, 'x'))), 34);
+  EXPECT_EQ(code_of(client, test::bind(2, "cn=" + std::string(500000, 'x'), "no")), 34);
+  EXPECT_LT(written().size(), 8192U);
+}
+
+TEST_F(AccessLogTest, AbandonedOperationsAreLoggedAsAbandoned) {
+  block();
+  WireClient client(port());
+  bind_as_root(client);
+  client.send(test::search(7, kTop));
+  ASSERT_TRUE(wait_for_waiters(1));
+  client.send(test::abandon(8, 7) + test::search(9, ""));
+  EXPECT_EQ(client.receive_result().back().id, 9);
+  const std::string log = written();
+  const std::size_t at = log.find("op=7 ");
+  ASSERT_NE(at, std::string::npos) << log;
+  const std::string line = log.substr(at, log.find('\n', at) - at);
+  EXPECT_NE(line.find(" abandoned "), std::string::npos) << line;
+  EXPECT_EQ(line.find("result="), std::string::npos) << line;
+}
+
+TEST_F(AccessLogTest, OperationsOfAClientThatLeftAreLoggedAsAbandoned) {
+  block();
+  {
+    WireClient client(port());
+    bind_as_root(client);
+    client.send(test::search(7, kTop));
+    ASSERT_TRUE(wait_for_waiters(1));
+  }
+  ASSERT_TRUE(wait_for_waiters(0));
+  const std::string log = written();
+  const std::size_t at = log.find("op=7 ");
+  ASSERT_NE(at, std::string::npos) << log;
+  EXPECT_NE(log.substr(at, log.find('\n', at) - at).find(" abandoned "), std::string::npos);
+}
+
+// ---- identities
+
+TEST_F(ConnectionTest, ConnectionWhoseIdentityChangedIsEndedWithANotice) {
+  start();
+  WireClient bound(port());
+  WireClient stranger(port());
+  bind_as_root(bound);
+  EXPECT_EQ(code_of(stranger, test::search(1, "")), 0);
+  authenticator.change(false);
+  const std::optional<Reply> notice = bound.receive();
+  ASSERT_TRUE(notice);
+  EXPECT_EQ(notice->tag, kNotice);
+  EXPECT_EQ(notice->code, 8);
+  EXPECT_TRUE(bound.closed());
+  EXPECT_EQ(code_of(stranger, test::search(2, "")), 0);
+}
+
+TEST_F(ConnectionTest, NoOperationRunsWithAnIdentityThatChanged) {
+  start();
+  WireClient bound(port());
+  bind_as_root(bound);
+  authenticator.change(false);
+  bound.send(test::search(2, kTop));
+  EXPECT_EQ(bound.receive()->tag, kNotice);
+  EXPECT_EQ(backend.calls(parameter::search_function), 0);
+}
+
+TEST_F(ConnectionTest, ConnectionWhoseIdentityIsTheSameInTheNewSnapshotStays) {
+  start();
+  WireClient bound(port());
+  bind_as_root(bound);
+  authenticator.change(true);
+  EXPECT_EQ(code_of(bound, test::search(2, kTop)), 0);
+  authenticator.valid = false;  // asked only once for each snapshot
+  EXPECT_EQ(code_of(bound, test::search(3, kTop)), 0);
+}
+
+// ---- failures
+
+TEST_F(ConnectionTest, ReloadThatThrowsDoesNotEndTheServer) {
+  std::atomic<int> reloads{0};
+  Event twice;
+  reload = [&](Settings&) -> bool {
+    if (++reloads == 2) twice.happen();
+    throw std::bad_alloc();
+  };
+  start();
+  std::raise(SIGHUP);
+  const auto end = Clock::now() + 10s;
+  while (reloads == 0 && Clock::now() < end) std::this_thread::yield();
+  std::raise(SIGHUP);
+  EXPECT_TRUE(twice.wait());
+  WireClient client(port());
+  EXPECT_EQ(code_of(client, test::search(1, "")), 0);
+  stop();
+  EXPECT_EQ(status, 0);
+}
+
+TEST_F(ConnectionTest, BackendThatFailedWithItsLockHeldIsNotAskedToUnbind) {
+  std::binary_semaphore lock(1);
+  backend.on_search = [&](pblock*) -> int {
+    lock.acquire();
+    throw 1;
+  };
+  backend.on_unbind = [&](pblock*) {
+    if (lock.try_acquire_for(8s)) lock.release();
+    return 0;
+  };
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  client.send(test::search(2, kTop));
+  const auto begun = Clock::now();
+  control.join();
+  EXPECT_EQ(status, 1);
+  EXPECT_LT(Clock::now() - begun, 5s);
+  EXPECT_EQ(backend.calls(parameter::unbind_function), 0);
+}
+
+// A session without a socket; what it posts is run by the test, and posting can be made to fail.
+class BareSession final : public Session {
+ public:
+  BareSession(Services& services, AccessLane& lane, const Settings& settings)
+      : Session(services, lane, 1), settings_(settings) {}
+
+  using Session::client_left;
+  using Session::handle;
+  using Session::idle;
+  using Session::output_is;
+  using Session::tick;
+
+  // Runs what was posted until `done`, for ten seconds at most.
+  bool run_until(const std::function<bool()>& done) {
+    const auto end = Clock::now() + 10s;
+    while (!done() && Clock::now() < end) {
+      std::unique_lock lock(mutex_);
+      if (posted_.empty()) {
+        lock.unlock();
+        tick();
+        std::this_thread::yield();
+        continue;
+      }
+      const auto work = std::move(posted_.front());
+      posted_.pop_front();
+      lock.unlock();
+      work();
+    }
+    return done();
+  }
+  void fail_to_post(int times) { failing_ = times; }
+  int failed_posts() const { return failed_; }
+
+  bool lost_interest(PendingOperation&) noexcept override { return false; }
+  std::string sent;
+  bool ended = false;
+
+ protected:
+  const Settings& settings() const noexcept override { return settings_; }
+  void post(std::function<void()> work) override {
+    const std::lock_guard lock(mutex_);
+    if (failing_ > 0) {
+      --failing_;
+      ++failed_;
+      throw std::bad_alloc();
+    }
+    posted_.push_back(std::move(work));
+  }
+  void transmit(std::string& bytes) override {
+    sent += bytes;
+    bytes.clear();
+    output_is(sent.size());
+  }
+  void lend_storage(std::string&) noexcept override {}
+  void flush() override {}
+  void disconnect(int, std::string_view) override { ended = true; }
+  void drop() override { ended = true; }
+  void resume() override {}
+  void settled() override {}
+
+ private:
+  const Settings& settings_;
+  std::mutex mutex_;
+  std::deque<std::function<void()>> posted_;
+  std::atomic<int> failing_{0};
+  std::atomic<int> failed_{0};
+};
+
+class BareSessionTest : public testing::Test {
+ protected:
+  static void SetUpTestSuite() {
+    ASSERT_EQ(cfg::register_attribute_types(builtin_schema().attribute_table()), 0);
+  }
+  explicit BareSessionTest(std::size_t ceiling = OutputMeter::kDefaultCeiling)
+      : services{builtin_schema(),    host, authenticator, {}, logs, {}, changes, verifiers, {}, {},
+                 OutputMeter(ceiling)} {
+    settings.error_log_level = "off";
+    logs.open(settings);
+    session = std::make_shared<BareSession>(services, lane, settings);
+  }
+  ~BareSessionTest() override {
+    changes.join();
+    verifiers.join();
+  }
+  void bind_as_root() {
+    session->handle(test::bind(1, kRoot, kSecret));
+    ASSERT_TRUE(session->run_until([this] { return session->idle(); }));
+    session->sent.clear();
+    session->output_is(0);
+  }
+  static Reply result_in(std::string_view bytes) {
+    // SEQUENCE, message id, operation: all short here.
+    Reply reply;
+    reply.id = bytes.at(4);
+    reply.tag = static_cast<unsigned char>(bytes.at(5));
+    reply.code = bytes.at(9);
+    return reply;
+  }
+
+  test::FakeBackend backend;
+  BackendHost host{backend.record(), [](std::string_view) {}};
+  test::ScriptedAuthenticator authenticator;
+  Settings settings;
+  Logs logs;
+  AccessLane lane{logs};
+  asio::thread_pool changes{1};
+  asio::thread_pool verifiers{1};
+  Services services;
+  std::shared_ptr<BareSession> session;
+};
+
+TEST_F(BareSessionTest, BindWhoseOutcomeCannotBePostedIsPickedUpLater) {
+  session->fail_to_post(1);
+  session->handle(test::bind(1, kRoot, kSecret));
+  ASSERT_TRUE(session->run_until([this] { return session->idle(); }));
+  EXPECT_EQ(session->failed_posts(), 1);
+  EXPECT_EQ(result_in(session->sent).code, 0);
+}
+
+TEST_F(BareSessionTest, OperationWhoseEndCannotBePostedIsPickedUpLater) {
+  bind_as_root();
+  session->fail_to_post(1);
+  session->handle(test::delete_entry(2, kTop));
+  ASSERT_TRUE(session->run_until([this] { return session->idle(); }));
+  EXPECT_EQ(session->failed_posts(), 1);
+  EXPECT_EQ(result_in(session->sent).code, 53);
+}
+
+TEST_F(BareSessionTest, AdmissionThatCannotBePostedKeepsTheGateAndIsPickedUpLater) {
+  bind_as_root();
+  class NoWaiter final : public GateWaiter {
+    void gate_decided(Verdict) noexcept override {}
+  };
+  ASSERT_EQ(host.gate().enter(std::make_shared<NoWaiter>(), Clock::time_point::max()),
+            Gate::Entry::inside);
+  session->handle(test::search(2, kTop));
+  EXPECT_FALSE(session->idle());
+  session->fail_to_post(1);
+  host.gate().leave();
+  ASSERT_TRUE(session->run_until([this] { return session->idle(); }));
+  EXPECT_EQ(session->failed_posts(), 1);
+  EXPECT_EQ(result_in(session->sent).code, 0);
+  EXPECT_TRUE(host.gate().close_and_wait_until_empty(1s));
+}
+
+class FullServerTest : public BareSessionTest {
+ protected:
+  FullServerTest() : BareSessionTest(4096) {
+    backend.on_search = [](pblock* parameters) {
+      const EntryPtr entry = test::make_test_entry("CN=CONFIGURATION", 3000);
+      const int code = test::send_test_entry(parameters, *entry);
+      return test::finish_search(parameters, code, 1);
+    };
+  }
+  int code_of(int id) {
+    session->sent.clear();
+    session->handle(test::search(id, kTop));
+    EXPECT_TRUE(session->run_until([this] { return session->idle(); }));
+    return session->sent.size() > 1000 ? 0 : result_in(session->sent).code;
+  }
+};
+
+TEST_F(FullServerTest, SearchGetsWhatIsLeftOfTheCeilingAndIsRefusedWhenNothingIs) {
+  bind_as_root();
+  EXPECT_EQ(code_of(2), 0);
+  EXPECT_EQ(code_of(3), 11);  // the client has not read the first
+  OutputShare other(services.output);
+  other.answered(4096);
+  EXPECT_EQ(code_of(4), 51);
+  other.settled(4096);
+  session->sent.clear();
+  session->output_is(0);
+  EXPECT_EQ(code_of(5), 0);
+}
+
+}  // namespace
+}  // namespace orv::server
