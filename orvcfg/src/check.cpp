@@ -66,7 +66,8 @@ class FileCheck {
   void check_identity(const FileEntry& entry, const char* type) {
     for (const std::string& value : entry.values(type)) {
       std::string name;
-      if (cfg::normalize_dn(value, name) != 0 || name.empty()) {
+      if (cfg::normalize_dn(value, name) != 0) continue;  // told already
+      if (name.empty()) {
         report(entry, std::string(type) + " is not the DN of an administrator");
       } else if (cfg::normal_dn_is_at_or_below(name, kSuffix)) {
         report(entry, std::string(type) + " lies inside " + kSuffix + ", so nobody can bind as it");

@@ -4,6 +4,7 @@
 #include <set>
 
 #include "cfg/text.h"
+#include "value_check.h"
 
 namespace orv::orvcfg {
 
@@ -79,6 +80,10 @@ class EntryCheck {
     if (type->single_valued && attribute.values.size() > 1) {
       problems_.push_back(attribute.name + " has " + std::to_string(attribute.values.size()) +
                           " values, only one is allowed");
+    }
+    for (const std::string& value : attribute.values) {
+      const std::string problem = value_problem(*type, value);
+      if (!problem.empty()) problems_.push_back(type->names.front() + " " + problem);
     }
     if (!type->operational && !is_allowed(*type)) {
       problems_.push_back(attribute.name + " is not allowed by the object classes of the entry");

@@ -213,6 +213,74 @@ class Check(Tool):
                  "more than one structural object class")):
             self.assertIn(text, self.found(old, new))
 
+    def test_finds_values_that_are_not_what_their_type_asks_for(self):
+        for old, new, text in (
+                ("orv-slapdSizeLimit: 0\n", "orv-slapdSizeLimit: many\n",
+                 "orv-slapdSizeLimit is not an integer"),
+                ("orv-slapdSizeLimit: 0\n", "orv-slapdSizeLimit: 007\n",
+                 "orv-slapdSizeLimit is not an integer"),
+                ("orv-slapdSizeLimit: 0\n", "orv-slapdSizeLimit:\n",
+                 "orv-slapdSizeLimit is not an integer"),
+                ("orv-slapdPort: 3389\n", "orv-slapdPort: 65536\n",
+                 "orv-slapdPort must be an integer from 0 to 65535"),
+                ("orv-slapdPort: 3389\n", "orv-slapdPort: 99999999999999999999999\n",
+                 "orv-slapdPort must be an integer from 0 to 65535"),
+                ("orv-slapdMaxFilterDepth: 32\n", "orv-slapdMaxFilterDepth: 1024\n",
+                 "orv-slapdMaxFilterDepth must be an integer from 1 to 64"),
+                ("orv-slapdMaxControls: 32\n", "orv-slapdMaxControls: -1\n",
+                 "orv-slapdMaxControls must be an integer"),
+                ("pwdMinLength: 12\n", "pwdMinLength: -12\n", "pwdMinLength must be an integer"),
+                ("orv-slapdAdminGroupEnabled: TRUE\n", "orv-slapdAdminGroupEnabled: yes\n",
+                 "orv-slapdAdminGroupEnabled is neither TRUE nor FALSE"),
+                ("pwdLockout: TRUE\n", "pwdLockout: 1\n", "pwdLockout is neither TRUE nor FALSE"),
+                ("orv-slapdAdminDN: cn=root\n", "orv-slapdAdminDN: root\n",
+                 "orv-slapdAdminDN is not a DN"),
+                ("orv-slapdSuffix: CN=CONFIGURATION\n", "orv-slapdSuffix: here\n",
+                 "orv-slapdSuffix is not a DN"),
+                ("orv-slapdIpAddress: 127.0.0.1\n", "orv-slapdIpAddress: h\u00f6st\n",
+                 "orv-slapdIpAddress holds characters outside ASCII"),
+                ("orv-slapdLogLevel: info\n", "orv-slapdLogLevel: loud\n",
+                 "orv-slapdLogLevel is none of"),
+                (f"orv-slapdLog: {self.path('i', 'log', 'audit.log')}\n",
+                 "orv-slapdLog: audit.log\n",
+                 "orv-slapdLog is not an absolute path")):
+            with self.subTest(new):
+                self.assertIn(text, self.found(old, new))
+
+    def test_finds_a_role_that_nobody_knows(self):
+        self.assertIn("orv-slapdAdminRole is none of",
+                      self.added(self.member("cn=m", "x").replace("AuditAdmin", "Wizard")))
+
+    def test_takes_words_in_any_letter_case_and_bounds_themselves(self):
+        self.write(self.config.replace("LogLevel: info", "LogLevel: INFO")
+                   .replace("orv-slapdMaxFilterDepth: 32", "orv-slapdMaxFilterDepth: 64")
+                   .replace("orv-slapdPort: 3389", "orv-slapdPort: 65535"), "i", "config.ldif")
+        self.assertIn("nothing wrong", self.succeed("check", "i/config.ldif"))
+
+    def test_types_by_their_numbers_and_second_names_are_what_they_name(self):
+        oid = "2.25.83817390626969804497818767862655265745.1.20"
+        self.write(self.config.replace("orv-slapdSizeLimit: 0\n", f"{oid}: 0\n")
+                   .replace("cn: Digest\n", "commonName: Digest\n")
+                   .replace("cn: Audit\n", "2.5.4.3: Audit\n"), "i", "config.ldif")
+        self.assertIn("nothing wrong", self.succeed("check", "i/config.ldif"))
+        self.assertIn("orv-slapdSizeLimit is not an integer",
+                      self.found("orv-slapdSizeLimit: 0\n", f"{oid}: many\n"))
+        self.assertIn("orv-slapdPort is not allowed",
+                      self.found("cn: Digest\n",
+                                 "cn: Digest\n2.25.83817390626969804497818767862655265745.1.18: 1\n"))
+
+    def test_finds_second_values_of_a_single_valued_type_under_two_names(self):
+        oid = "2.25.83817390626969804497818767862655265745.1.20"
+        text = self.found("orv-slapdSizeLimit: 0\n", f"orv-slapdSizeLimit: 0\n{oid}: 1\n")
+        self.assertRegex(text, "orv-slapdSizeLimit")
+
+    def test_finds_a_pass_through_entry_without_a_subtree(self):
+        text = self.added("dn: cn=p,CN=PASSTHROUGH AUTHENTICATION,CN=CONFIGURATION\n"
+                          "objectClass: top\nobjectClass: orv-slapdConfigEntry\n"
+                          "objectClass: orv-slapdPta\ncn: p\n"
+                          "orv-slapdPtaURL: ldap://127.0.0.1\n")
+        self.assertIn("missing attribute orv-slapdPtaSubtree", text)
+
     def test_a_class_by_its_number_is_found(self):
         text = self.found("objectClass: container\n",
                           "objectClass: 2.25.83817390626969804497818767862655265745.2.1\n")

@@ -1,0 +1,62 @@
+// What the values of settings may be: for the server that reads them and for the tools that examine
+// a file before a server does.
+#pragma once
+
+#include <cstdint>
+#include <limits>
+#include <string_view>
+
+namespace orv {
+
+struct SettingRange {
+  std::string_view name;  // canonical name of an attribute of INTEGER syntax
+  std::int64_t minimum;
+  std::int64_t maximum;
+};
+
+namespace setting_bounds {
+inline constexpr std::int64_t seconds = 86400;
+inline constexpr std::int64_t count = 1000000;
+inline constexpr std::int64_t bytes = 1 << 30;
+inline constexpr std::int64_t any = std::numeric_limits<std::int32_t>::max();
+}  // namespace setting_bounds
+
+// All integer settings.
+inline constexpr SettingRange kSettingRanges[] = {
+    {"orv-slapdPort", 0, 65535},
+    {"orv-slapdSizeLimit", 0, setting_bounds::any},
+    {"orv-slapdTimeLimit", 0, setting_bounds::seconds},
+    {"orv-slapdIdleTimeOut", 0, setting_bounds::seconds},
+    {"orv-slapdMaxMessageSize", 1024, setting_bounds::bytes},
+    {"orv-slapdMaxConnections", 1, setting_bounds::count},
+    {"orv-slapdMaxConnectionsPerAddress", 1, setting_bounds::count},
+    {"orv-slapdMaxPendingOperations", 1, setting_bounds::count},
+    // The library that evaluates filters reads no deeper ones.
+    {"orv-slapdMaxFilterDepth", 1, 64},
+    {"orv-slapdMaxControls", 1, setting_bounds::count},
+    {"orv-slapdMaxAttributes", 1, setting_bounds::count},
+    {"orv-slapdMaxValues", 1, setting_bounds::count},
+    {"orv-slapdMaxResultSize", 1024, setting_bounds::bytes},
+    {"orv-slapdOperationWait", 1, setting_bounds::seconds},
+    {"orv-slapdWriteTimeOut", 1, setting_bounds::seconds},
+    {"orv-slapdMessageTimeOut", 1, setting_bounds::seconds},
+    {"pwdMinLength", 0, setting_bounds::any},
+    {"passwordMinAlphaChars", 0, setting_bounds::any},
+    {"passwordMinOtherChars", 0, setting_bounds::any},
+    {"passwordMaxRepeatedChars", 0, setting_bounds::any},
+    {"passwordMinDiffChars", 0, setting_bounds::any},
+    {"pwdMaxFailure", 0, setting_bounds::any},
+    {"pwdFailureCountInterval", 0, setting_bounds::any},
+    {"pwdLockoutDuration", 0, setting_bounds::any},
+};
+
+// Values of orv-slapdLogLevel, in any letter case.
+inline constexpr std::string_view kLogLevels[] = {"error", "warning", "info", "debug", "off"};
+
+// Values of orv-slapdAdminRole, in any letter case.
+inline constexpr std::string_view kAdminRoles[] = {
+    "AuditAdmin",   "ReplicationAdmin", "SchemaAdmin",          "ServerConfigGroupMember",
+    "DirDataAdmin", "PasswordAdmin",    "ServerStartStopAdmin", "NoAdmin",
+};
+
+}  // namespace orv
