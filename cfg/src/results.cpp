@@ -171,6 +171,7 @@ char* next_name(_CFGBer& cursor) {
 char* first_attribute(const Record& record, std::unique_ptr<_CFGBer>& cursor) {
   Session& session = *record.chain->session;
   const Selection& selection = record.chain->selection;
+  // NOLINTNEXTLINE(modernize-make-unique): clang 14 makes no aggregates that way
   cursor.reset(new _CFGBer{&session, record.entry, 0, !selection.has_all(), {}});
   if (cursor->chooses) {
     AttributeMap& map = session.attributes;

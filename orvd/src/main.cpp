@@ -227,7 +227,8 @@ Publications publications() {
   // The schema does not change while the server runs, and making the entry costs more than a
   // search.
   std::shared_ptr<const entry> subschema = make_subschema(builtin_schema(), std::time(nullptr));
-  return {[facts] { return make_root_dse(facts); }, [subschema] { return subschema; }};
+  return {[facts] { return make_root_dse(facts); },
+          [subschema] { return std::shared_ptr<const entry>(subschema); }};
 }
 
 void report(Logs& logs, const std::vector<std::string>& problems) {

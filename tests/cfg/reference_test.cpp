@@ -59,8 +59,8 @@ class Writer {
     std::string out;
     for (int i = 0; i < 40; ++i) {
       const std::string parent = dns.empty() ? "" : dns[random_() % dns.size()];
-      const std::string dn =
-          std::string("cn=e") + std::to_string(i) + (parent.empty() ? "" : (chance(4) ? " , " : ",") + parent);
+      const std::string dn = std::string("cn=e") + std::to_string(i) +
+                             (parent.empty() ? "" : (chance(4) ? " , " : ",") + parent);
       dns.push_back(dn);
       if (chance(4)) out += fold(std::string("# comment ") + word(), false);
       out += line(chance(5) ? "DN" : "dn", dn);

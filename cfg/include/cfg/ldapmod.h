@@ -32,8 +32,8 @@ struct ldapmod {
   int mod_op;
   char* mod_type;
   union {
-    char** modv_strvals;    // without kModBvalues
-    berval** modv_bvals;    // with kModBvalues
+    char** modv_strvals;  // without kModBvalues
+    berval** modv_bvals;  // with kModBvalues
   } mod_vals;
   ldapmod* mod_next;
 

@@ -8,14 +8,14 @@ namespace orv::result {
 
 enum Code : int {
   success = 0,
-  operations_error = 1,        // also: the configuration file could not be opened or read
-  protocol_error = 2,          // the request is not what RFC 4511 allows
-  time_limit_exceeded = 3,     // the search ran past its deadline
-  size_limit_exceeded = 4,     // more entries matched than may be sent
+  operations_error = 1,     // also: the configuration file could not be opened or read
+  protocol_error = 2,       // the request is not what RFC 4511 allows
+  time_limit_exceeded = 3,  // the search ran past its deadline
+  size_limit_exceeded = 4,  // more entries matched than may be sent
   auth_method_not_supported = 7,
   stronger_auth_required = 8,
-  no_such_record = 9,          // the library: the entry to change, or the parent to add under, is missing
-  admin_limit_exceeded = 11,   // the answer outgrew its budget
+  no_such_record = 9,  // the library: the entry to change, or the parent to add under, is missing
+  admin_limit_exceeded = 11,  // the answer outgrew its budget
   unavailable_critical_extension = 12,
   confidentiality_required = 13,
   sasl_bind_in_progress = 14,
@@ -42,8 +42,9 @@ enum Code : int {
   object_class_mods_prohibited = 69,
   other = 80,
   no_memory = 90,
-  replication_context = 92,    // the entry would be a replication context, which this subtree never holds
-  canceled = 118,              // RFC 3909
+  replication_context =
+      92,          // the entry would be a replication context, which this subtree never holds
+  canceled = 118,  // RFC 3909
   no_such_operation = 119,
   too_late = 120,
   cannot_cancel = 121,

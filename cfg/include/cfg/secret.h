@@ -3,8 +3,9 @@
 // Forms of a stored value:
 //   {AES256}base64   sealed: AES-256-GCM under the key of the stash file; can be opened again
 //   {SSHA512}base64  salted SHA-512; also {SSHA256}, {SSHA}: can only be verified
-//   {PBKDF2-SHA256}iterations$salt$hash (base64 without padding), also -SHA512: can only be verified
-//   anything else    the clear text, unless it begins with "{" name "}" of an unknown scheme, which
+//   {PBKDF2-SHA256}iterations$salt$hash (base64 without padding), also -SHA512: can only be
+//   verified anything else    the clear text, unless it begins with "{" name "}" of an unknown
+//   scheme, which
 //                    never matches
 //
 // A sealed value is bound to the attribute and the entry it stands in (their names are part of what
@@ -26,8 +27,8 @@ struct KeyDeleter {
 };
 using KeyPtr = std::unique_ptr<const Key, KeyDeleter>;
 
-// Reads a key stash file: "orv-key-1 " and 64 hexadecimal digits on one line. Refused unless it is a
-// regular file that only its owner may read or write. 0; 90; 1 with the cause in `why` (names the
+// Reads a key stash file: "orv-key-1 " and 64 hexadecimal digits on one line. Refused unless it is
+// a regular file that only its owner may read or write. 0; 90; 1 with the cause in `why` (names the
 // file, never its content).
 int load_key_stash(const char* path, KeyPtr& key, std::string& why) noexcept;
 
@@ -41,17 +42,18 @@ struct SecretPlace {
 };
 
 // Seals a clear text. 0 or 90.
-int seal_secret(const Key& key, SecretPlace place, std::string_view clear, std::string& stored) noexcept;
+int seal_secret(const Key& key, SecretPlace place, std::string_view clear,
+                std::string& stored) noexcept;
 
 enum class OpenResult { opened, not_sealed, broken };
 
-// Opens a sealed value wherever it came from. `not_sealed` for clear and hashed values; `broken` for
-// a damaged value, a null or wrong key. `key` may be null.
+// Opens a sealed value wherever it came from. `not_sealed` for clear and hashed values; `broken`
+// for a damaged value, a null or wrong key. `key` may be null.
 OpenResult open_secret(const Key* key, std::string_view stored, std::string& clear) noexcept;
 
-// Whether `clear` is the password stored as `stored` at `place`. Takes the same time for every wrong
-// password of the same length. False for an empty clear text, an unknown or malformed scheme, a
-// sealed value that belongs elsewhere, a missing key.
+// Whether `clear` is the password stored as `stored` at `place`. Takes the same time for every
+// wrong password of the same length. False for an empty clear text, an unknown or malformed scheme,
+// a sealed value that belongs elsewhere, a missing key.
 bool verify_secret(const Key* key, SecretPlace place, std::string_view stored,
                    std::string_view clear) noexcept;
 

@@ -81,7 +81,8 @@ const char* cfg_dump_exception(_CFG* session);
 
 // Searches below `base` (a DN in the file's code page, in any spelling).
 //   scope       0 the entry itself, 1 its direct children, 2 the whole subtree with the base first
-//   filter      RFC 4515, with or without the outer parentheses; a bare attribute name is a presence
+//   filter      RFC 4515, with or without the outer parentheses; a bare attribute name is a
+//   presence
 //               test; null means every entry. Comparison follows the attribute's matching rule.
 //               An assertion on the value of a secret attribute is Undefined.
 //   attributes  null-terminated list of names, null for all; "*" all, "1.1" none. An entry that
@@ -132,8 +133,8 @@ void cfg_msg_unlink(_CFG* session, _CFGMessage* record);
 // The outcome of the last call on the handle; 1 for a null handle.
 int cfg_get_errno(_CFG* session);
 
-// Writes "text: reason" for the handle's error number to the diagnostics stream (cfg/diagnostics.h).
-// `text` may be null.
+// Writes "text: reason" for the handle's error number to the diagnostics stream
+// (cfg/diagnostics.h). `text` may be null.
 void cfg_perror(_CFG* session, const char* text);
 
 // Changes. Declared for those who write against this interface; a program that calls them does not

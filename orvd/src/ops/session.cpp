@@ -255,7 +255,7 @@ void Session::add(std::int32_t id, const AddRequest& request) {
   const OperationPtr operation = make_operation(id, tag::add_response, 0, 0);
   if (services_.logs.access_enabled()) operation->log_text = describe("ADD", request.dn);
   if (!refusal) refusal = operation->prepare_add(services_, request, normal);
-  submit(operation, std::move(refusal));
+  submit(operation, refusal);
 }
 
 void Session::remove(std::int32_t id, const DeleteRequest& request) {
@@ -264,7 +264,7 @@ void Session::remove(std::int32_t id, const DeleteRequest& request) {
   const OperationPtr operation = make_operation(id, tag::delete_response, 0, 0);
   if (services_.logs.access_enabled()) operation->log_text = describe("DELETE", request.dn);
   if (!refusal) refusal = operation->prepare_delete(services_, normal);
-  submit(operation, std::move(refusal));
+  submit(operation, refusal);
 }
 
 void Session::modify(std::int32_t id, const ModifyRequest& request) {
@@ -273,7 +273,7 @@ void Session::modify(std::int32_t id, const ModifyRequest& request) {
   const OperationPtr operation = make_operation(id, tag::modify_response, 0, 0);
   if (services_.logs.access_enabled()) operation->log_text = describe("MODIFY", request.dn);
   if (!refusal) refusal = operation->prepare_modify(services_, request, normal);
-  submit(operation, std::move(refusal));
+  submit(operation, refusal);
 }
 
 // ---- the way of an operation
@@ -290,7 +290,7 @@ Session::OperationPtr Session::make_operation(std::int32_t id, int response_tag,
   return operation;
 }
 
-void Session::submit(const OperationPtr& operation, Refusal refusal) {
+void Session::submit(const OperationPtr& operation, const Refusal& refusal) {
   outstanding_.push_back(operation);
   if (refusal) return answer_and_complete(operation, refusal.code, refusal.text);
   start(operation);

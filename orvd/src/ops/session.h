@@ -110,7 +110,7 @@ class Session : public OperationHome, public std::enable_shared_from_this<Sessio
 
   OperationPtr make_operation(std::int32_t id, int response_tag, std::int64_t time_limit,
                               std::int64_t size_limit);
-  void submit(const OperationPtr& operation, Refusal refusal);
+  void submit(const OperationPtr& operation, const Refusal& refusal);
   void start(const OperationPtr& operation);
   void answer_and_complete(const OperationPtr& operation, int code, std::string_view text);
   void run_here(const OperationPtr& operation);

@@ -1,10 +1,10 @@
 // The code-page converter: the configuration file is in the machine's local code page, the server
 // works in UTF-8.
 //
-// The local code page is the one named with set_local_code_page, else the codeset of the locale that
-// the environment names (LC_ALL, LC_CTYPE, LANG), read without changing the process's own "C"
-// locale; the "C" and "POSIX" locales mean UTF-8. When it is UTF-8 (or a subset of it) conversion is a
-// checked copy. Conversion descriptors are per thread.
+// The local code page is the one named with set_local_code_page, else the codeset of the locale
+// that the environment names (LC_ALL, LC_CTYPE, LANG), read without changing the process's own "C"
+// locale; the "C" and "POSIX" locales mean UTF-8. When it is UTF-8 (or a subset of it) conversion
+// is a checked copy. Conversion descriptors are per thread.
 #pragma once
 
 #include <cstddef>

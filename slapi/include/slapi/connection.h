@@ -31,17 +31,17 @@ inline constexpr unsigned primary = 0x08;
 inline constexpr unsigned group_member = 0x10;
 inline constexpr unsigned restricted = 0x20;
 
-inline constexpr unsigned primary_administrator = administrator | primary;  // 0x0C
-inline constexpr unsigned admin_group_member = administrator | group_member;  // 0x14
+inline constexpr unsigned primary_administrator = administrator | primary;       // 0x0C
+inline constexpr unsigned admin_group_member = administrator | group_member;     // 0x14
 inline constexpr unsigned no_configuration_access = administrator | restricted;  // 0x24
 }  // namespace authority
 
 // Role bits of administrative group members; 0 for everybody else.
 namespace role {
-inline constexpr unsigned audit = 0x02;           // AuditAdmin
-inline constexpr unsigned replication = 0x0C;     // ReplicationAdmin: 0x04 and 0x08
-inline constexpr unsigned schema = 0x10;          // SchemaAdmin
-inline constexpr unsigned server_config = 0x20;   // ServerConfigGroupMember
+inline constexpr unsigned audit = 0x02;          // AuditAdmin
+inline constexpr unsigned replication = 0x0C;    // ReplicationAdmin: 0x04 and 0x08
+inline constexpr unsigned schema = 0x10;         // SchemaAdmin
+inline constexpr unsigned server_config = 0x20;  // ServerConfigGroupMember
 inline constexpr unsigned any_configuration = 0x3E;
 }  // namespace role
 
@@ -70,8 +70,8 @@ struct ConnectionAux {
 // accept calls on a dead or abandoned connection (and drop them), and never keep an argument.
 
 // Sends one search entry with the requested attributes (null: all; with types_only, names without
-// values). 0, or the code that ends the search: 4 past the entry limit, 3 past the deadline, 11 past
-// the answer's budget, 80 abandoned or gone.
+// values). 0, or the code that ends the search: 4 past the entry limit, 3 past the deadline, 11
+// past the answer's budget, 80 abandoned or gone.
 using SendSearchEntry = int (*)(Backend* backend, Connection* connection, Operation* operation,
                                 entry* e, char** attributes, int types_only, void* reserved1,
                                 void* reserved2, void* reserved3, LDAPControl** controls);
@@ -97,16 +97,16 @@ struct Connection {
 struct Operation {
   unsigned authority = authority::no_configuration_access;
   unsigned roles = 0;
-  const char* bound_dn = "";         // normalised; "" for the anonymous
-  int server_kind_marker = 0;        // 1: may search on a server of kind 3
-  int master_server_result = 0;      // last answer of checkMasterSrvDn
-  pblock* parameters = nullptr;      // the operation's own parameter block
-  void* server = nullptr;            // the server's own record of the operation
+  const char* bound_dn = "";     // normalised; "" for the anonymous
+  int server_kind_marker = 0;    // 1: may search on a server of kind 3
+  int master_server_result = 0;  // last answer of checkMasterSrvDn
+  pblock* parameters = nullptr;  // the operation's own parameter block
+  void* server = nullptr;        // the server's own record of the operation
 };
 
 // Sends a plain result through the connection's send operation and returns what that returned; 80,
 // without sending, when the connection is null.
-int send_ldap_result(Connection* connection, Operation* operation, int code,
-                     const char* matched_dn, const char* text);
+int send_ldap_result(Connection* connection, Operation* operation, int code, const char* matched_dn,
+                     const char* text);
 
 }  // namespace orv

@@ -11,13 +11,13 @@ namespace orv {
 // A control as it came, or as it is to be sent.
 struct LDAPControl {
   char* oid;
-  berval value;    // bv_val null: no value
+  berval value;  // bv_val null: no value
   char critical;
 };
 
-// Appends `control` (not copied, not owned) to the null-terminated array at `*list`, which is null or
-// a malloc block; the array grows by reallocation and is released with free. 0; 80 a null argument;
-// 90, with the array as it was.
+// Appends `control` (not copied, not owned) to the null-terminated array at `*list`, which is null
+// or a malloc block; the array grows by reallocation and is released with free. 0; 80 a null
+// argument; 90, with the array as it was.
 int ldap_insert_control(LDAPControl* control, LDAPControl*** list);
 
 // Announces a control in the root DSE. `operations` is the set of operations it applies to, -1 for

@@ -1,15 +1,15 @@
-// Distinguished names as plug-ins use them: C texts in, C texts out. The rules of the normal form are
-// those of cfg/dn.h; every DN that reaches a handler is in that form.
-// All functions are thread-safe.
+// Distinguished names as plug-ins use them: C texts in, C texts out. The rules of the normal form
+// are those of cfg/dn.h; every DN that reaches a handler is in that form. All functions are
+// thread-safe.
 #pragma once
 
 namespace orv {
 
 struct Backend;
 
-// Normalises `*dn` in place: the old text (a malloc block) is freed and replaced by a new one. `fold`
-// is passed as 1 and asks for upper case. 0; 34 not a DN; 90; 80 a null argument. On failure `*dn` is
-// untouched and still the caller's. "" succeeds.
+// Normalises `*dn` in place: the old text (a malloc block) is freed and replaced by a new one.
+// `fold` is passed as 1 and asks for upper case. 0; 34 not a DN; 90; 80 a null argument. On failure
+// `*dn` is untouched and still the caller's. "" succeeds.
 int replace_DN(char** dn, int fold);
 
 // A DN in the light form of cfg/dn.h: spelling cleaned, letter case, type names and order kept.
@@ -29,8 +29,8 @@ char* dn_parent_norm(const Backend* backend, const char* normalized_dn);
 // everything. Null arguments: 0.
 int are_nested_dn(const char* a, const char* b);
 
-// 0 when the two are the same DN after normalisation, non-zero otherwise (also when either is null or
-// not a DN).
+// 0 when the two are the same DN after normalisation, non-zero otherwise (also when either is null
+// or not a DN).
 int slapi_dn_compare_v3(const char* a, const char* b);
 
 }  // namespace orv

@@ -6,7 +6,7 @@
 
 namespace orv {
 
-extern std::atomic<int> g_srvType;    // kind of server: 0 ordinary; 1 and 3 change rules named there
+extern std::atomic<int> g_srvType;  // kind of server: 0 ordinary; 1 and 3 change rules named there
 extern std::atomic<int> g_safe_mode;  // 1: started in safe mode
 
 // Lock policy of AutoLock: 1 timed try-lock, 0 plain blocking lock.

@@ -18,8 +18,8 @@ void set_ldap_debug(bool on);
 // when its conversions are those of the built-in text. Thread-safe.
 void PrintMessage(int severity, int set, int number, ...);
 
-// Opens the message catalogue at `path` (null: the environment's NLSPATH and the name "orvd"). False
-// when there is none; the built-in texts then serve. Call before threads start.
+// Opens the message catalogue at `path` (null: the environment's NLSPATH and the name "orvd").
+// False when there is none; the built-in texts then serve. Call before threads start.
 bool open_message_catalogue(const char* path);
 
 // Receives each finished message: `text` without a newline. The server points it at its error log;

@@ -23,8 +23,8 @@ struct PblockDeleter {
   void operator()(pblock* pb) const noexcept { slapi_pblock_destroy(pb); }
 };
 
-using MallocText = std::unique_ptr<char, FreeDeleter>;          // released with free
-using EntryPtr = std::unique_ptr<entry, EntryDeleter>;          // released with entry_free
+using MallocText = std::unique_ptr<char, FreeDeleter>;  // released with free
+using EntryPtr = std::unique_ptr<entry, EntryDeleter>;  // released with entry_free
 using EscapedDn = std::unique_ptr<ldap_escDN, EscapedDnDeleter>;
 using PblockPtr = std::unique_ptr<pblock, PblockDeleter>;
 

@@ -1,5 +1,5 @@
-// The parameter block: how the server hands arguments to a plug-in's handlers and how a plug-in hands
-// its handlers to the server. Parameters are known by number.
+// The parameter block: how the server hands arguments to a plug-in's handlers and how a plug-in
+// hands its handlers to the server. Parameters are known by number.
 //
 // Threads: a block belongs to one thread at a time, except the global block, whose values are set
 // before the listeners open and only read afterwards.
@@ -18,11 +18,11 @@ using InstanceStart = int (*)(Backend*);
 
 namespace parameter {
 // arguments of handlers                     value
-inline constexpr int target_dn = 50;          // const char*, normalised
-inline constexpr int add_entry = 60;          // entry*
-inline constexpr int modifications = 90;      // ldapmod*, or null
-inline constexpr int search_scope = 110;      // int
-inline constexpr int search_filter = 114;     // void*, the parsed filter
+inline constexpr int target_dn = 50;            // const char*, normalised
+inline constexpr int add_entry = 60;            // entry*
+inline constexpr int modifications = 90;        // ldapmod*, or null
+inline constexpr int search_scope = 110;        // int
+inline constexpr int search_filter = 114;       // void*, the parsed filter
 inline constexpr int search_filter_text = 115;  // const char*, RFC 4515
 inline constexpr int search_attributes = 116;   // char**, or null for all
 inline constexpr int search_types_only = 117;   // int
@@ -56,16 +56,16 @@ pblock* slapi_pblock_new();
 void slapi_pblock_destroy(pblock* pb);
 
 // Copies the value of a parameter into `*value`, a pointer or an int as listed above.
-// 0; -1 for a null argument, an unknown number, and for the parameters 50, 60, 130, 131 and 132 when
-// they are unset: null never comes with 0 there. Other unset parameters give 0 and null or 0.
+// 0; -1 for a null argument, an unknown number, and for the parameters 50, 60, 130, 131 and 132
+// when they are unset: null never comes with 0 there. Other unset parameters give 0 and null or 0.
 // `*value` is left alone on failure.
 int slapi_pblock_get(pblock* pb, int number, void* value);
 
 // The server's cached form: the same answers.
 int slapi_pblock_iget(pblock* pb, int number, void* value);
 
-// Stores a parameter; takes no ownership. 0; -1 for a null block, an unknown number or a value of the
-// wrong kind for it.
+// Stores a parameter; takes no ownership. 0; -1 for a null block, an unknown number or a value of
+// the wrong kind for it.
 int slapi_pblock_set(pblock* pb, int number, void* value);
 int slapi_pblock_set(pblock* pb, int number, const void* value);
 int slapi_pblock_set(pblock* pb, int number, int value);

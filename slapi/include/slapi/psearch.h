@@ -12,8 +12,8 @@ class PSearchMonitor {
   PSearchMonitor& operator=(const PSearchMonitor&) = delete;
 
   // The number of persistent searches running, read under the monitor's mutex; 0 when the mutex
-  // cannot be taken. Thread-safe. Declared for those who write against this interface; a program that
-  // calls it does not link yet.
+  // cannot be taken. Thread-safe. Declared for those who write against this interface; a program
+  // that calls it does not link yet.
   int get_num_current_psearches();
 
  private:

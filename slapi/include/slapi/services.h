@@ -1,8 +1,8 @@
 // Services of the server that guard identities, passwords, addresses and back ends. Declared for
 // those who write against this interface; a program that calls them does not link yet.
 //
-// None of them enters a backend, waits for the server's admission of operations, or blocks: they are
-// called from inside handlers.
+// None of them enters a backend, waits for the server's admission of operations, or blocks: they
+// are called from inside handlers.
 #pragma once
 
 #include <cstddef>
@@ -11,15 +11,15 @@
 
 namespace orv {
 
-// Non-zero when `dn` is the master server identity of `suffix`, or of the whole server when suffix is
-// null.
+// Non-zero when `dn` is the master server identity of `suffix`, or of the whole server when suffix
+// is null.
 int checkMasterSrvDn(const char* suffix, const char* dn);
 
 // The administrator password policy, handed around by value.
 struct _Admin_pwdPolicy {  // NOLINT(bugprone-reserved-identifier) the name is part of the interface
   char enabled;
   char pwdLockout;
-  int pwdLockoutDuration;       // seconds
+  int pwdLockoutDuration;  // seconds
   int pwdMaxFailure;
   int pwdFailureCountInterval;  // seconds
   int pwdMinLength;
@@ -35,8 +35,8 @@ bool pwdIsAdminPasswordLockoutOn();
 _Admin_pwdPolicy getGlobalAdminPWDPolicyLocal();
 // 0 acceptable, 19 the limits are out of range or contradict one another.
 int validate_new_settings(_Admin_pwdPolicy policy, bool check_all);
-// 0 the new password complies, 19 it does not (the reason goes to the error log). `old_password` may
-// be null, a clear text or a stored hash.
+// 0 the new password complies, 19 it does not (the reason goes to the error log). `old_password`
+// may be null, a clear text or a stored hash.
 int verify_admin_password(char* new_password, char* old_password, Operation* operation);
 
 // The server's record of an administrator's failures; lives as long as the process.

@@ -11,8 +11,8 @@ int kel_strcasecmp(const char* a, const char* b);
 // The first occurrence of `needle` in `text` under the same rule, or null.
 const char* kel_strcasestr(const char* text, const char* needle);
 
-// Bounded copy and append: `size` is that of the whole buffer; the result is always terminated (when
-// size is not 0). Both return the length that was asked for; `size` or more means it was cut.
+// Bounded copy and append: `size` is that of the whole buffer; the result is always terminated
+// (when size is not 0). Both return the length that was asked for; `size` or more means it was cut.
 std::size_t kel_strlcpy(char* target, const char* source, std::size_t size);
 std::size_t kel_strlcat(char* target, const char* source, std::size_t size);
 

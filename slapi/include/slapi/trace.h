@@ -30,13 +30,14 @@ inline constexpr std::uint32_t kTraceDebug = 0x04000000;
 
 // Categories of debug lines.
 namespace trace {
-inline constexpr std::uint32_t error = 0xC8110000;   // texts beginning "Error - " and other failures
+inline constexpr std::uint32_t error = 0xC8110000;  // texts beginning "Error - " and other failures
 inline constexpr std::uint32_t detail = 0xC80D0000;
-inline constexpr std::uint32_t info = 0xC8010000;    // general flow
-inline constexpr std::uint32_t close = 0xC8030000;   // the close handler's invalid-backend messages
+inline constexpr std::uint32_t info = 0xC8010000;   // general flow
+inline constexpr std::uint32_t close = 0xC8030000;  // the close handler's invalid-backend messages
 
-// For a value that may be a secret: the attribute's name, then the value. The writer knows records by
-// this text and masks the value where it has to; with any other text the value would stand there.
+// For a value that may be a secret: the attribute's name, then the value. The writer knows records
+// by this text and masks the value where it has to; with any other text the value would stand
+// there.
 inline constexpr const char* name_and_value = "%s: %s\n";
 }  // namespace trace
 
