@@ -10,8 +10,10 @@ set(CMAKE_EXPORT_COMPILE_COMMANDS ON)
 set(CMAKE_RUNTIME_OUTPUT_DIRECTORY "${CMAKE_BINARY_DIR}/bin")
 set(CMAKE_LIBRARY_OUTPUT_DIRECTORY "${CMAKE_BINARY_DIR}/lib")
 
-# Installed programs find them in the same way.
+# Installed programs find them in the same way. One search path for both: the one that CMake makes
+# for a build tree may end in empty elements, which stand for the current directory.
 set(CMAKE_INSTALL_RPATH "$ORIGIN/../lib;$ORIGIN")
+set(CMAKE_BUILD_WITH_INSTALL_RPATH ON)
 
 if(NOT CMAKE_BUILD_TYPE)
   set(CMAKE_BUILD_TYPE RelWithDebInfo CACHE STRING "" FORCE)
@@ -24,6 +26,10 @@ endif()
 
 # __FILE__ names a file by its path in the source tree, wherever that tree lies.
 add_compile_options("-fmacro-prefix-map=${CMAKE_SOURCE_DIR}/=")
+
+# Symbols are bound at start: binding one at its first call saves the registers on the stack, and with
+# them pieces of a password that a vector instruction held, where nobody wipes them.
+add_link_options(-Wl,-z,relro,-z,now)
 
 if(ORV_SANITIZE)
   add_compile_options(-fsanitize=${ORV_SANITIZE} -fno-omit-frame-pointer

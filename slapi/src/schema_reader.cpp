@@ -31,7 +31,9 @@ struct SchemaError {
 }
 
 std::string quoted(std::string_view text) {
-  return "'" + std::string(text) + "'";
+  std::string out = "'";
+  out += text;
+  return out += '\'';
 }
 
 // ---- Lines -----------------------------------------------------------------------------------
