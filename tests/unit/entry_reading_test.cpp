@@ -85,7 +85,7 @@ TEST_F(ReadOneAttribute, MissingEntryStays32) {
 }
 
 TEST_F(ReadOneAttribute, OtherFailuresBecome80) {
-  for (const int code : {1, 3, 34, 90}) {
+  for (const int code : {-1, 1, 3, 9, 31, 33, 34, 90}) {
     platform.forget();
     platform.fail("cfg_search_s", 1, code);
     EXPECT_EQ(read(), 80);
@@ -216,6 +216,15 @@ TEST_F(ConvertRecord, DnThatCannotBeReadIsLeftOut) {
   EXPECT_THAT(platform.calls({"cfg_perror"}), ElementsAre("cfg_perror(session, \"cfg_get_dn\")"));
 }
 
+TEST_F(ConvertRecord, DnThatComesWithAnErrorIsLeftOutAndReleased) {
+  of({"CN=X", {{"cn", {"a"}}}});
+  platform.fail("cfg_get_errno", 1, 1);
+  EXPECT_EQ(convert(), "<null>|cn=a");
+  EXPECT_THAT(platform.calls({"cfg_perror"}), ElementsAre("cfg_perror(session, \"cfg_get_dn\")"));
+  EXPECT_THAT(platform.calls({"cfg_memfree"}),
+              ElementsAre("cfg_memfree(\"CN=X\")", "cfg_memfree(\"cn\")"));
+}
+
 TEST_F(ConvertRecord, NoDnWithoutAnErrorIsSilent) {
   of({"CN=X", {{"cn", {"a"}}}});
   platform.fail("cfg_get_dn", 1, 0);
@@ -252,6 +261,24 @@ TEST_F(ConvertRecord, ErrorAtValuesSkipsThatAttributeOnly) {
   EXPECT_THAT(platform.calls({"cfg_perror"}),
               ElementsAre("cfg_perror(session, \"cfg_get_values\")"));
   EXPECT_THAT(platform.calls({"cfg_memfree"}), Contains("cfg_memfree(\"cn\")"));
+}
+
+// Error numbers asked for: after the DN, the first attribute, its values, the next attribute.
+TEST_F(ConvertRecord, ValuesThatComeWithAnErrorAreSkippedAndReleased) {
+  of({"CN=X", {{"cn", {"a"}}, {"sn", {"b"}}}});
+  platform.fail("cfg_get_errno", 3, 1);
+  EXPECT_EQ(convert(), "CN=X|sn=b");
+  EXPECT_THAT(platform.calls({"cfg_perror"}),
+              ElementsAre("cfg_perror(session, \"cfg_get_values\")"));
+  EXPECT_EQ(platform.count("cfg_value_free"), 2);
+}
+
+TEST_F(ConvertRecord, NextAttributeThatComesWithAnErrorIsReportedAndTaken) {
+  of({"CN=X", {{"cn", {"a"}}, {"sn", {"b"}}}});
+  platform.fail("cfg_get_errno", 4, 1);
+  EXPECT_EQ(convert(), "CN=X|cn=a|sn=b");
+  EXPECT_THAT(platform.calls({"cfg_perror"}),
+              ElementsAre("cfg_perror(session, \"cfg_next_attribute\")"));
 }
 
 TEST_F(ConvertRecord, NoValuesWithoutAnErrorIsSilent) {
@@ -396,6 +423,13 @@ TEST_F(RetrieveEntry, ErrorNumberAtTheFirstRecordComesBackUnchanged) {
   EXPECT_THAT(platform.debug_lines(), IsEmpty());
 }
 
+TEST_F(RetrieveEntry, RecordThatComesWithAnErrorNumberIsNotConverted) {
+  platform.file["CN=X"] = {{{"CN=X", {}}}};
+  platform.fail("cfg_get_errno", 1, 53);
+  EXPECT_EQ(retrieve(), 53);
+  EXPECT_EQ(platform.count("CFGMessage2Entry"), 0);
+}
+
 TEST_F(RetrieveEntry, NoFirstRecordGives1) {
   platform.file["CN=X"] = {{{"CN=X", {}}}};
   platform.fail("cfg_first_entry", 1, 0);
@@ -438,6 +472,15 @@ TEST_F(Reading, ValueFindAsksTheServerWithTheAttributesSyntax) {
   EXPECT_THAT(platform.calls(), ElementsAre("value_find(\"cn\", \"present\", 17, 1)",
                                             "value_find(\"cn\", \"absent\", 17, 1)",
                                             "value_find(\"cn\", \"present\", 17, 1)"));
+}
+
+TEST_F(Reading, ValueFindLeavesAnExitRecord) {
+  trcEvents = kTraceExit;
+  char type[] = "cn";
+  attr a{type, nullptr, 0, 17, nullptr};
+  platform.fail("value_find", 1, 1);
+  platform.run([&] { return cfg_value_find(&a, "absent"); });
+  EXPECT_THAT(platform.records(), ElementsAre("entry 01050600 ", "exit 01050600 1"));
 }
 
 }  // namespace

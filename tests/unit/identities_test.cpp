@@ -125,6 +125,18 @@ TEST_F(Identities, WalkReadsAndReleasesInOrder) {
                           "cfg_msgfree(chain)", "cfg_memfree(\"CN=CONFIGURATION\")"));
 }
 
+// Allocations before the values: search, DN, attribute name.
+TEST_F(Identities, ValuesAreReleasedAfterTheWalkHasAdvanced) {
+  file(kConfiguration, {{"orv-slapdAdminDN", {"CN=A"}}});
+  platform.name_allocation(4, "values");
+  EXPECT_EQ(admin_dn(), "CN=A");
+  EXPECT_THAT(platform.calls({"cfg_get_values", "cfg_memfree", "cfg_next_attribute", "free"}),
+              ElementsAre("cfg_get_values(session, record 1, \"orv-slapdAdminDN\")",
+                          "cfg_memfree(\"orv-slapdAdminDN\")",
+                          "cfg_next_attribute(session, record 1, cursor)", "free(values)",
+                          "free(values)", "cfg_memfree(\"CN=CONFIGURATION\")"));
+}
+
 // ---- Several values, no value
 
 TEST_F(Identities, SecondAdminDnFailsTheLookup) {
@@ -164,6 +176,7 @@ TEST_F(Identities, AbsentAttributeGivesNullWithCodeZero) {
 TEST_F(Identities, AttributeWithoutValuesGivesNull) {
   for (const char* dn : {kConfiguration, kMember}) file(dn, {{"orv-slapdAdminDN", {}}});
   EXPECT_EQ(admin_dn(), "null");
+  EXPECT_EQ(last_line(), error("Retrieving orv-slapdAdminDN FAILED rc = 0\n"));
   EXPECT_EQ(member_dn(), "null");
 }
 
@@ -257,6 +270,31 @@ TEST_F(Identities, ErrorAtTheValuesGives1AndEndsTheWalk) {
   EXPECT_EQ(platform.count("cfg_next_attribute"), 1);
 }
 
+// Error numbers asked for: after the first attribute, its values, the next attribute.
+TEST_F(Identities, ErrorNumberCountsThoughSomethingCame) {
+  file(kConfiguration, {{"orv-slapdAdminDN", {"CN=A"}}, {"cn", {"x"}}});
+  const DebugLine asked = detail("Retrieving values for attribute orv-slapdAdminDN ! \n");
+  const DebugLine failed = error("Retrieving orv-slapdAdminDN FAILED rc = 1\n");
+
+  platform.fail("cfg_get_errno", 1, 80);
+  EXPECT_EQ(admin_dn(), "null");
+  EXPECT_THAT(platform.debug_lines(), ElementsAre(error("cfg_first_attribute error ! \n"), failed));
+
+  platform.forget();
+  platform.fail("cfg_get_errno", 2, 80);
+  EXPECT_EQ(admin_dn(), "null");
+  EXPECT_THAT(
+      platform.debug_lines(),
+      ElementsAre(asked, error("Problems retrieving values for orv-slapdAdminDN ! \n"), failed));
+
+  platform.forget();
+  platform.fail("cfg_get_errno", 3, 80);
+  EXPECT_EQ(admin_dn(), "null");
+  EXPECT_THAT(platform.debug_lines(), ElementsAre(asked, detail("orv-slapdAdminDN: CN=A\n"),
+                                                  error("cfg_first_attribute error ! \n"), failed));
+  expect_released_and_free_of_locks();
+}
+
 TEST_F(Identities, WalkAdvancesOnceAfterAFailureAndEnds) {
   file(kConfiguration, {{"orv-slapdAdminDN", {"CN=A", "CN=B"}}, {"cn", {"x"}}});
   EXPECT_EQ(admin_dn(), "null");
@@ -284,6 +322,25 @@ TEST_F(Identities, FailedConversionGivesNull) {
   EXPECT_EQ(admin_dn(), "null");
   EXPECT_EQ(last_line(), error("Retrieving orv-slapdAdminDN FAILED rc = 21\n"));
   EXPECT_EQ(platform.count("replace_DN"), 0);
+}
+
+TEST_F(Identities, TextOfAFailedConversionIsNotUsed) {
+  file(kConfiguration, {{"orv-slapdAdminDN", {"CN=A"}}});
+  file(kKerberos, {{"orv-slapdKrbAdminDN", {"CN=A"}}});
+  file(kDigest, {{"orv-slapdDigestAdminUser", {"a"}}});
+  file(kMember, {{"orv-slapdAdminDN", {"CN=A"}}});
+  platform.failed_text_is_left = true;
+  platform.fail("xlate_localcp_to_utf8", 0, 21);
+  EXPECT_EQ(admin_dn(), "null");
+  EXPECT_EQ(last_line(), error("Retrieving orv-slapdAdminDN FAILED rc = 21\n"));
+  EXPECT_EQ(kerberos_id(), "null");
+  EXPECT_EQ(last_line(), error("Retrieving orv-slapdKrbAdminDN FAILED rc = 21\n"));
+  EXPECT_EQ(digest_user(), "null");
+  EXPECT_EQ(last_line(), error("Retrieving orv-slapdDigestAdminUser FAILED rc = 21\n"));
+  EXPECT_EQ(member_dn(), "null");
+  EXPECT_EQ(platform.count("replace_DN"), 0);
+  EXPECT_EQ(platform.count("dn_normalize_light_esc"), 0);
+  expect_released_and_free_of_locks();
 }
 
 TEST_F(Identities, FailedNormalisationGivesNullAndItsCode) {
@@ -407,6 +464,15 @@ TEST_F(Identities, MemberWhoseEntryCannotBeTakenIsReported) {
                 ElementsAre("cfg_perror(session, \"cfg_first_entry\")"));
     expect_released_and_free_of_locks();
   }
+}
+
+TEST_F(Identities, MembersEntryThatComesWithAnErrorIsReportedAndNotUsed) {
+  file(kMember, {{"orv-slapdAdminDN", {"CN=M"}}});
+  platform.fail("cfg_get_errno", 1, 1);
+  EXPECT_EQ(member_dn(), "null");
+  EXPECT_THAT(platform.calls({"cfg_perror"}),
+              ElementsAre("cfg_perror(session, \"cfg_first_entry\")"));
+  expect_released_and_free_of_locks();
 }
 
 TEST_F(Identities, MemberFoundIsDiscardedByALaterError) {

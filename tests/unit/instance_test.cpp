@@ -1,5 +1,6 @@
 // Start and stop of the backend's instance.
 #include <cerrno>
+#include <cstddef>
 
 #include "backend_test.h"
 
@@ -81,6 +82,20 @@ TEST_F(Instance, StepsComeInTheirOrder) {
                           "kel_strlcpy(\"/a\", 8)", "kel_strlcat(\"/a\", \".save\", 8)",
                           "initIconvHandle()", "free(startup record)"));
   EXPECT_EQ(platform.last_mutex_made(), &made().configMutex);
+  release_state();
+}
+
+TEST_F(Instance, StateHoldsTheConfiguredPathFromItsBeginning) {
+  platform.link_target = "/a";
+  std::string at_first;
+  platform.at("readlink", 1, [&] {
+    const char* made_mutex = reinterpret_cast<const char*>(platform.last_mutex_made());
+    const auto* state_made = reinterpret_cast<const ConfigBackendPrivate*>(
+        made_mutex - offsetof(ConfigBackendPrivate, configMutex));
+    at_first = state_made->config_file;
+  });
+  EXPECT_EQ(start("/b"), 0);
+  EXPECT_EQ(at_first, "/b");
   release_state();
 }
 
@@ -206,6 +221,7 @@ TEST_F(Instance, WithoutMemoryForTheStateTheStartupRecordIsReleased) {
   platform.fail_allocation(1);
   EXPECT_EQ(start("/b"), 90);
   EXPECT_THAT(platform.calls(), ElementsAre("free(startup record)"));
+  EXPECT_EQ(backend.private_data, startup);  // not looked at again by anybody
   EXPECT_EQ(platform.last_mutex_made(), nullptr);
   EXPECT_THAT(platform.debug_lines(), IsEmpty());
 }

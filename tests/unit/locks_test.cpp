@@ -187,6 +187,14 @@ TEST_F(Locks, SaysItWaitsBeforeItSleeps) {
   EXPECT_TRUE(said);
 }
 
+TEST_F(Locks, TakingReadingThePolicyAndReleasingLeaveRecords) {
+  trcEvents = kTraceEntry;
+  lock_and_release(&mutex, true);
+  EXPECT_THAT(platform.records(),
+              ElementsAre("entry 01040400 ", "entry 01040600 ", "exit 01040600 1",
+                          "exit 01040400 0", "entry 01040500 ", "exit 01040500 0"));
+}
+
 // ---- Policy
 
 class LockPolicy : public BackendTest {
@@ -217,6 +225,13 @@ TEST_F(LockPolicy, IsReadOnceForEachReload) {
   EXPECT_EQ(platform.calls(), std::vector<std::string>{"ldap_getenv(\"AUTOLOCKTYPE\")"});
 }
 
+TEST_F(LockPolicy, ExitRecordsCarryThePolicyThatStayed) {
+  trcEvents = 0x00020000;
+  al_configfile_counter = 1;
+  EXPECT_EQ(policy(5), 5);
+  EXPECT_THAT(platform.records(), ElementsAre("exit 01040600 5"));
+}
+
 TEST_F(LockPolicy, ExactWordMeansBlocking) {
   platform.environment["AUTOLOCKTYPE"] = "REGULARLOCK";
   EXPECT_EQ(policy(1), 0);
@@ -237,6 +252,18 @@ TEST_F(LockPolicy, UnsetMeansTimed) {
 // ---- AutoFree
 
 class Buffers : public BackendTest {};
+
+TEST_F(Buffers, MakingReadingAndReleasingLeaveRecords) {
+  trcEvents = 0x00020000;
+  char buffer[] = "text";
+  platform.run([&] {
+    AutoFree<char> owner(buffer, [](void*) {});
+    owner.get();
+  });
+  EXPECT_THAT(platform.records(),
+              ElementsAre("exit 01040700 0", "exit 01040400 0", "exit 01040500 0",
+                          "exit 01040800 0", "exit 01040900 0"));
+}
 
 TEST_F(Buffers, AreReleasedBeforeTheirMutexIsDestroyed) {
   static std::vector<std::string>* order;

@@ -173,6 +173,26 @@ TEST_F(Sending, ErrorAtTheFirstEntryStillSendsAFinalSuccessAndKeepsTheChain) {
   cfg_msgfree(chain);
 }
 
+TEST_F(Sending, FirstEntryThatComesWithAnErrorIsNotSent) {
+  found({{"cn=a", {}}});
+  platform.fail("cfg_get_errno", 1, 1);
+  EXPECT_EQ(send(), 0);
+  EXPECT_THAT(platform.calls({"cfg_perror", "cfg_msgfree", "send_search_entry"}),
+              ElementsAre("cfg_perror(session, \"cfg_first_entry\")"));
+  EXPECT_EQ(final_result(), "send_search_result(connection, operation, 0, null, null, 0)");
+  cfg_msgfree(chain);
+}
+
+// Error numbers asked for: after the first entry, its DN, its first attribute, the next entry.
+TEST_F(Sending, NextEntryThatComesWithAnErrorIsReportedAndSent) {
+  found({{"cn=a", {}}, {"cn=b", {}}});
+  platform.fail("cfg_get_errno", 4, 1);
+  EXPECT_EQ(send(), 0);
+  EXPECT_THAT(platform.calls({"cfg_perror"}),
+              ElementsAre("cfg_perror(session, \"cfg_next_entry\")"));
+  EXPECT_THAT(platform.sent, ElementsAre("cn=a", "cn=b"));
+}
+
 TEST_F(Sending, ErrorAtTheNextEntryIsReportedAndEndsTheEntries) {
   found({{"cn=a", {}}, {"cn=b", {}}});
   platform.fail("cfg_next_entry", 1, 1);
@@ -243,12 +263,16 @@ TEST_F(Sending, DnIsNormalisedEvenForThePrimaryAdministrator) {
 
 TEST_F(Sending, ResponseControlIsAttachedWhenTheConnectionAsks) {
   found({{"cn=a", {}}, {"cn=b", {}}});
-  aux.attach_response_control = 1;
   response_control = &control;
-  EXPECT_EQ(send(), 0);
-  EXPECT_EQ(platform.count("ldap_insert_control"), 1);
-  for (const std::string& call : platform.calls({"send_search_entry"})) {
-    EXPECT_THAT(call, testing::EndsWith("null, null, null, control)"));
+  for (const unsigned char flag : std::initializer_list<unsigned char>{1, 2, 255}) {
+    platform.forget();
+    aux.attach_response_control = flag;
+    EXPECT_EQ(send(), 0);
+    EXPECT_EQ(platform.count("ldap_insert_control"), 1);
+    EXPECT_EQ(platform.sent.size(), 2U);
+    for (const std::string& call : platform.calls({"send_search_entry"})) {
+      EXPECT_THAT(call, testing::EndsWith("null, null, null, control)"));
+    }
   }
 }
 
@@ -410,6 +434,16 @@ TEST_F(Sending, BoundDnIsComparedByteForByte) {
   EXPECT_THAT(platform.sent.front(), Not(testing::HasSubstr("orv-slapdAdminPW")));
 }
 
+TEST_F(Sending, BoundDnIsComparedWhole) {
+  for (const char* dn : {"cn=me,o=orvx", "cn=me,o=or", "cn=xcn=me,o=orv", "cn=x,cn=me,o=orv"}) {
+    platform.forget();
+    platform.file[kMemberEntryNormal] = {{member(dn)}};
+    found({member(dn), password_only()});
+    EXPECT_EQ(send(), 0);
+    EXPECT_THAT(platform.sent, ElementsAre(Not(testing::HasSubstr("orv-slapdAdminPW")))) << dn;
+  }
+}
+
 TEST_F(Sending, PrimaryAdministratorSeesEveryMembersPassword) {
   as(kPrimary, "CN=ROOT");
   found({member("cn=you,o=orv"), password_only()});
@@ -557,6 +591,16 @@ TEST_F(Sending, RestrictedViewComparesTheEntrysOwnDnWithTheServersComparison) {
   EXPECT_EQ(send(0), 0);
   EXPECT_THAT(platform.calls({"slapi_dn_compare_v3"}),
               ElementsAre(std::string("slapi_dn_compare_v3(\"cn=x\", \"") + kDirectory + "\")"));
+}
+
+TEST_F(Sending, RestrictedViewTakesOnlyZeroForTheSameDn) {
+  found({{kDirectory, {}}});
+  for (const int code : {-1, 1}) {
+    platform.forget();
+    platform.fail("slapi_dn_compare_v3", 1, code);
+    EXPECT_EQ(send(0), 0);
+    EXPECT_THAT(platform.sent, IsEmpty());
+  }
 }
 
 TEST_F(Sending, EveryFlagButOneMeansTheRestrictedView) {
@@ -772,9 +816,22 @@ TEST_F(Search, ThreadsWithConnectionsOfTheirOwnFollowEachOtherOnARealMutex) {
 
 TEST_F(Search, ClientWhoIsGoneHearsNothingAndNoLockIsTouched) {
   connection.state = 0;
+  for (const unsigned char flag : std::initializer_list<unsigned char>{1, 2, 255}) {
+    platform.forget();
+    aux.client_gone = flag;
+    EXPECT_EQ(search(), 0);
+    EXPECT_THAT(platform.calls(), ElementsAre("slapi_pblock_get(130)", "slapi_pblock_get(131)"));
+  }
+}
+
+TEST_F(Search, EveryStateButZeroIsAnOpenConnection) {
   aux.client_gone = 1;
-  EXPECT_EQ(search(), 0);
-  EXPECT_THAT(platform.calls(), ElementsAre("slapi_pblock_get(130)", "slapi_pblock_get(131)"));
+  for (const std::uint16_t open : std::initializer_list<std::uint16_t>{2, 0x0100, 0xFFFF}) {
+    platform.forget();
+    connection.state = open;
+    EXPECT_EQ(search(), 0);
+    EXPECT_EQ(platform.count("send_search_result"), 1) << open;
+  }
 }
 
 TEST_F(Search, ClientWhoIsGoneIsNoticedBeforeAuthority) {

@@ -201,6 +201,13 @@ TEST_F(Session, EndUnlocksAndNothingElse) {
   EXPECT_THAT(platform.debug_lines(), IsEmpty());
 }
 
+TEST_F(Session, EndLeavesAnExitRecord) {
+  trcEvents = kTraceEntry;
+  platform.set_held(&state.configMutex, true);
+  end();
+  EXPECT_THAT(platform.records(), ElementsAre("entry 01010500 ", "exit 01010500 0"));
+}
+
 TEST_F(Session, EndThatCannotUnlockSaysSo) {
   platform.fail("pthread_mutex_unlock", 1, 1);
   end();

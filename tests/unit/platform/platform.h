@@ -111,6 +111,7 @@ class Platform {
   bool types_only_values = false;     // value arrays come back empty
   bool empty_lists_are_null = false;  // entries have a null list where there are no values
   bool keeps_letter_case = false;     // replace_DN does not fold
+  bool failed_text_is_left = false;   // a conversion that fails by the script gives a text as well
   bool real_mutexes = false;          // mutexes are taken, and not only modelled
 
   // The n-th call of a function (from 1; 0 for each) gives `result`: the code it returns, or null

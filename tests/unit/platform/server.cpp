@@ -1,5 +1,6 @@
 // The server's side of the scripted platform: entries, names, code page, parameter block, trace.
 #include <cctype>
+#include <cerrno>
 #include <cstdarg>
 #include <cstring>
 
@@ -79,6 +80,7 @@ void ldtr_function_local::debug(std::uint32_t category, const char* format, ...)
   va_start(arguments, format);
   platform().record({Event::Kind::debug, {}, formatted(format, arguments), category});
   va_end(arguments);
+  errno = EIO;  // as output may: whoever needs the number has kept it
 }
 
 bool read_ldap_debug() {
@@ -124,7 +126,8 @@ int convert(const Call& call, const char* text, const char* from, const char* to
             std::size_t* length) {
   *result = nullptr;
   *length = 0;
-  if (const auto failure = call.failure_or_no_memory()) return *failure;
+  const auto failure = call.failure_or_no_memory();
+  if (failure && !(call.failure() && platform().failed_text_is_left)) return *failure;
   std::string converted = text;
   for (std::size_t at = converted.find(from); at != std::string::npos;
        at = converted.find(from, at + std::strlen(to))) {
@@ -132,7 +135,7 @@ int convert(const Call& call, const char* text, const char* from, const char* to
   }
   *result = platform().give_text(Owned::text, converted);
   *length = converted.size() + 1;
-  return 0;
+  return failure.value_or(0);
 }
 
 constexpr const char* kLocalLetter = "\xE4";
