@@ -73,16 +73,17 @@ configure() {
     cmake --preset "$1" "${fresh[@]}") || exit 1
 }
 
-# build PRESET [TARGET...]: configures and builds; one run at a time for each repository.
+# build PRESET [TARGET...]: configures and builds; one run at a time for each preset. What a preset
+# writes is its own: its tree, and its logs.
 build() {
   local preset=$1 targets=() text="building ($1)"
   shift
   [ $# -gt 0 ] && targets=(--target "$@")
   [ -e "$root/build/$preset/.ninja_log" ] || text+="; the first time takes some minutes"
   mkdir -p "$root/build" || die "cannot make $root/build"
-  exec 9>"$root/build/.lock"
+  exec 9>"$root/build/.lock-$preset"
   flock -n 9 || {
-    say "waiting for another build of this repository"
+    say "waiting for another build of this tree ($preset)"
     flock 9
   }
   configure "$preset"

@@ -23,6 +23,7 @@
 #include <vector>
 
 #include "cfg/attribute_table.h"
+#include "cfg/object_class_table.h"
 #include "cfg/owners.h"
 #include "cfg/session.h"
 
@@ -71,6 +72,9 @@ void register_types() {
   types[2].oid = "2.25.1";
   types[2].secret = true;
   orv::cfg::register_attribute_types(std::move(types));
+  orv::cfg::register_object_classes({{"top", "2.5.6.0", {}},
+                                     {"orv-slapdConfigEntry", "2.25.2", {}},
+                                     {"orv-slapdTop", "2.25.3", {}}});
 }
 
 // ---- What is measured ----

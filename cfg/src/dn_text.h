@@ -12,8 +12,7 @@
 
 namespace orv::cfg {
 
-// Which bytes a DN may hold. The file may be in a code page other than UTF-8; then letters outside
-// ASCII are not folded.
+// Which bytes a DN may hold. Outside ASCII, letters of a text that is not UTF-8 are not folded.
 enum class DnText { utf8, any_code_page };
 
 // As `normalize_dn`, but throws std::bad_alloc; false when it is not a DN.

@@ -5,7 +5,8 @@
 
 #include "cfg/text.h"
 #include "characters.h"
-#include "dn_text.h"
+#include "interrupt_poll.h"
+#include "local_text.h"
 
 namespace orv::cfg {
 
@@ -267,109 +268,147 @@ bool Filter::Type::is(std::string_view spelled) const noexcept {
   return is_name_of(*known, spelled);
 }
 
-Truth Filter::evaluate(std::size_t at, const LdifIndex& index, std::uint32_t entry) const {
-  const Node& node = nodes_[at];
-  switch (node.kind) {
-    case Kind::all_of: {
-      Truth result = Truth::yes;
-      for (const std::size_t child : node.children) {
-        result = std::min(result, evaluate(child, index, entry));
-        if (result == Truth::no) break;
+// One entry's evaluation.
+class Filter::Evaluation {
+ public:
+  Evaluation(const std::vector<Node>& nodes, const LdifIndex& index, std::uint32_t entry) noexcept
+      : nodes_(nodes), index_(index), entry_(entry) {}
+
+  // Without meaning once it was stopped.
+  Truth of(std::size_t at) {
+    const Node& node = nodes_[at];
+    switch (node.kind) {
+      case Kind::all_of: {
+        Truth result = Truth::yes;
+        for (std::size_t i = 0; i < node.children.size() && result != Truth::no; ++i) {
+          if (should_stop()) break;
+          result = std::min(result, of(node.children[i]));
+        }
+        return result;
       }
-      return result;
-    }
-    case Kind::any_of: {
-      Truth result = Truth::no;
-      for (const std::size_t child : node.children) {
-        result = std::max(result, evaluate(child, index, entry));
-        if (result == Truth::yes) break;
+      case Kind::any_of: {
+        Truth result = Truth::no;
+        for (std::size_t i = 0; i < node.children.size() && result != Truth::yes; ++i) {
+          if (should_stop()) break;
+          result = std::max(result, of(node.children[i]));
+        }
+        return result;
       }
-      return result;
+      case Kind::negation: {
+        const Truth inner = of(node.children.front());
+        if (inner == Truth::undefined) return inner;
+        return inner == Truth::yes ? Truth::no : Truth::yes;
+      }
+      case Kind::undefined:
+        return Truth::undefined;
+      case Kind::extensible:
+        return of_extensible(node);
+      default:
+        return of_item(node);
     }
-    case Kind::negation: {
-      const Truth inner = evaluate(node.children.front(), index, entry);
-      if (inner == Truth::undefined) return inner;
-      return inner == Truth::yes ? Truth::no : Truth::yes;
+  }
+
+  [[nodiscard]] bool was_stopped() const noexcept { return stopped_; }
+
+ private:
+  // Asks every so much work, of which a look at a line and one at an item of a list are a unit: the
+  // question costs more than either.
+  bool should_stop() noexcept {
+    constexpr std::size_t kUnits = 1024;
+    if (++work_ >= kUnits && !stopped_) {
+      work_ = 0;
+      stopped_ = interrupted();
     }
-    case Kind::undefined:
-      return Truth::undefined;
-    case Kind::extensible:
-      return evaluate_extensible(node, index, entry);
-    default:
-      return evaluate_item(node, index, entry);
+    return stopped_;
   }
-}
 
-bool Filter::value_matches(const Node& node, std::string_view value) {
-  switch (node.kind) {
-    case Kind::presence:
-      return true;
-    case Kind::substrings:
-      return node.parts->matches(value);
-    case Kind::at_least:
-      return node.assertion->stored_is_at_least(value);
-    case Kind::at_most:
-      return node.assertion->stored_is_at_most(value);
-    default:
-      return node.assertion->equals(value);
+  // The value of a line, decoded and in UTF-8, wherever that is.
+  std::string_view value_of(const AttributeLine& line) {
+    return as_utf8(decoded(line, scratch_), utf8_);
   }
-}
 
-Truth Filter::evaluate_item(const Node& node, const LdifIndex& index, std::uint32_t entry) const {
-  LineReader reader = index.lines(entry);
-  AttributeLine line;
-  std::string scratch;
-  bool present = false;
-  reader.next(line);
-  while (reader.next(line)) {
-    if (!node.type.is(line.type)) continue;
-    present = true;
-    if (node.kind == Kind::presence) return Truth::yes;
-    if (value_matches(node, decoded(line, scratch))) return Truth::yes;
-  }
-  // A type that neither the schema nor the entry knows is not recognised (RFC 4511, 4.5.1.7).
-  return present || node.type.known != nullptr ? Truth::no : Truth::undefined;
-}
-
-Truth Filter::evaluate_extensible(const Node& node, const LdifIndex& index,
-                                  std::uint32_t entry) const {
-  LineReader reader = index.lines(entry);
-  AttributeLine line;
-  std::string scratch;
-  bool present = false;
-  reader.next(line);
-  while (reader.next(line)) {
-    if (!node.type.name.empty()) {
+  Truth of_item(const Node& node) {
+    LineReader reader = index_.lines(entry_);
+    AttributeLine line;
+    bool present = false;
+    reader.next(line);
+    for (; reader.next(line); ++work_) {
       if (!node.type.is(line.type)) continue;
-    } else {
-      // Without a type the rule asks every attribute that compares by it; secrets never answer.
-      const KnownType* known = attribute_lookup().find(line.type);
-      const MatchingRule own = known != nullptr ? known->equality : MatchingRule::case_ignore;
-      if (own != node.rule || (known != nullptr && known->secret)) continue;
+      present = true;
+      if (node.kind == Kind::presence) return Truth::yes;
+      if (value_matches(node, value_of(line))) return Truth::yes;
     }
-    present = true;
-    if (node.assertion->equals(decoded(line, scratch))) return Truth::yes;
+    // A type that neither the schema nor the entry knows is not recognised (RFC 4511, 4.5.1.7).
+    return present || node.type.known != nullptr ? Truth::no : Truth::undefined;
   }
-  if (node.dn_too && dn_matches(node, index, entry)) return Truth::yes;
-  const bool recognised = present || node.type.known != nullptr || node.type.name.empty();
-  return recognised ? Truth::no : Truth::undefined;
-}
 
-bool Filter::dn_matches(const Node& node, const LdifIndex& index, std::uint32_t entry) {
-  std::string scratch;
-  Dn dn;
-  cfg::parse(index.dn(entry, scratch), DnText::any_code_page, dn);
-  for (const Rdn& rdn : dn) {
-    for (const Ava& ava : rdn) {
-      const KnownType* known = attribute_lookup().find(ava.type);
-      const MatchingRule own = known != nullptr ? known->equality : MatchingRule::case_ignore;
-      const bool asked = node.type.name.empty() ? own == node.rule : node.type.is(ava.type);
-      if (asked && !(known != nullptr && known->secret) && node.assertion->equals(ava.value)) {
+  static bool value_matches(const Node& node, std::string_view value) {
+    switch (node.kind) {
+      case Kind::presence:
         return true;
+      case Kind::substrings:
+        return node.parts->matches(value);
+      case Kind::at_least:
+        return node.assertion->stored_is_at_least(value);
+      case Kind::at_most:
+        return node.assertion->stored_is_at_most(value);
+      default:
+        return node.assertion->equals(value);
+    }
+  }
+
+  Truth of_extensible(const Node& node) {
+    LineReader reader = index_.lines(entry_);
+    AttributeLine line;
+    bool present = false;
+    reader.next(line);
+    for (; reader.next(line); ++work_) {
+      if (!node.type.name.empty()) {
+        if (!node.type.is(line.type)) continue;
+      } else {
+        // Without a type the rule asks every attribute that compares by it; secrets never answer.
+        const KnownType* known = attribute_lookup().find(line.type);
+        const MatchingRule own = known != nullptr ? known->equality : MatchingRule::case_ignore;
+        if (own != node.rule || (known != nullptr && known->secret)) continue;
+      }
+      present = true;
+      if (node.assertion->equals(value_of(line))) return Truth::yes;
+    }
+    if (node.dn_too && dn_matches(node)) return Truth::yes;
+    const bool recognised = present || node.type.known != nullptr || node.type.name.empty();
+    return recognised ? Truth::no : Truth::undefined;
+  }
+
+  bool dn_matches(const Node& node) {
+    Dn dn;
+    parse_local(index_.dn(entry_, scratch_), dn);
+    for (const Rdn& rdn : dn) {
+      for (const Ava& ava : rdn) {
+        const KnownType* known = attribute_lookup().find(ava.type);
+        const MatchingRule own = known != nullptr ? known->equality : MatchingRule::case_ignore;
+        const bool asked = node.type.name.empty() ? own == node.rule : node.type.is(ava.type);
+        if (asked && !(known != nullptr && known->secret) && node.assertion->equals(ava.value)) {
+          return true;
+        }
       }
     }
+    return false;
   }
-  return false;
+
+  const std::vector<Node>& nodes_;
+  const LdifIndex& index_;
+  const std::uint32_t entry_;
+  std::size_t work_ = 0;
+  bool stopped_ = false;
+  std::string scratch_;
+  std::string utf8_;
+};
+
+Filter::Match Filter::match(const LdifIndex& index, std::uint32_t entry) const {
+  Evaluation evaluation(nodes_, index, entry);
+  const Truth truth = evaluation.of(0);
+  if (evaluation.was_stopped()) return Match::interrupted;
+  return truth == Truth::yes ? Match::yes : Match::no;
 }
 
 }  // namespace orv::cfg

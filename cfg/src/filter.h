@@ -1,4 +1,5 @@
-// Search filters (RFC 4515): read once, evaluated on the text of each candidate entry.
+// Search filters (RFC 4515): read once, evaluated on the text of each candidate entry. Filters are
+// in UTF-8, whatever code page the entries are in.
 #pragma once
 
 #include <cstddef>
@@ -26,9 +27,13 @@ class Filter {
   // kMaxDepth; throws std::bad_alloc.
   bool parse(std::string_view text);
 
-  // Whether the entry matches; Undefined is not a match. Throws std::bad_alloc.
+  // Whether the entry matches; Undefined is not a match. A filter of many items is a search of its
+  // own within one entry: the answer is `interrupted` when the check of cfg/interrupt.h says so on
+  // the way. Throws std::bad_alloc.
+  enum class Match : unsigned char { no, yes, interrupted };
+  [[nodiscard]] Match match(const LdifIndex& index, std::uint32_t entry) const;
   [[nodiscard]] bool matches(const LdifIndex& index, std::uint32_t entry) const {
-    return evaluate(0, index, entry) == Truth::yes;
+    return match(index, entry) == Match::yes;
   }
 
  private:
@@ -66,13 +71,7 @@ class Filter {
     bool dn_too = false;                            // extensible
   };
 
-  [[nodiscard]] Truth evaluate(std::size_t node, const LdifIndex& index, std::uint32_t entry) const;
-  [[nodiscard]] Truth evaluate_item(const Node& node, const LdifIndex& index,
-                                    std::uint32_t entry) const;
-  [[nodiscard]] Truth evaluate_extensible(const Node& node, const LdifIndex& index,
-                                          std::uint32_t entry) const;
-  static bool value_matches(const Node& node, std::string_view value);
-  static bool dn_matches(const Node& node, const LdifIndex& index, std::uint32_t entry);
+  class Evaluation;
 
   std::vector<Node> nodes_;  // the first is the root
 };

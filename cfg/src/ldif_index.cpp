@@ -9,6 +9,8 @@
 #include "cfg/text.h"
 #include "characters.h"
 #include "dn_text.h"
+#include "local_text.h"
+#include "object_class_lookup.h"
 
 namespace orv::cfg {
 
@@ -41,7 +43,7 @@ bool LdifIndex::has_dn(std::uint32_t entry, std::string_view normal_dn) const {
   const std::string_view spelled = dn(entry, scratch);
   if (spelled == normal_dn) return true;
   std::string normal;
-  return normalize(spelled, DnText::any_code_page, normal) && normal == normal_dn;
+  return normalize_local(spelled, normal) && normal == normal_dn;
 }
 
 std::uint32_t LdifIndex::find(std::string_view normal_dn, std::uint32_t hash) const {
@@ -79,7 +81,7 @@ bool LdifIndex::append(const Entry& entry, std::string_view dn, std::uint32_t& e
   for (; table()[at] != kNone; at = (at + 1) & mask) {
     existing = table()[at];
     if (entries()[existing].hash != entry.hash) continue;
-    if (normal.empty()) normalize(dn, DnText::any_code_page, normal);
+    if (normal.empty()) normalize_local(dn, normal);
     if (has_dn(existing, normal)) return false;
   }
   const std::size_t used = size_ * sizeof(Entry);
@@ -112,6 +114,7 @@ constexpr const char* kNoDnLine = "an entry must begin with a \"dn:\" line";
 constexpr const char* kSecondDn =
     "a second \"dn:\" line in one entry: the blank line between entries is missing";
 constexpr const char* kBadDn = "the DN is not well formed";
+constexpr const char* kNotInCodePage = "the DN holds bytes that are no text of the code page";
 constexpr const char* kEmptyDn = "the DN is empty";
 constexpr const char* kNoParent = "no entry before this one has the DN of its parent";
 constexpr const char* kNoAttributes = "the entry has no attributes, it may be cut short";
@@ -121,10 +124,12 @@ constexpr const char* kSecretSpelling =
     "a secret attribute is given under another name than its own";
 constexpr const char* kSecretInDn = "a secret attribute in a DN";
 constexpr const char* kVersion = "only version 1 of LDIF is known";
+constexpr const char* kClassSpelling = "the object class must be written as ";
 
 constexpr std::string_view kDn = "dn";
 constexpr std::string_view kChangeType = "changetype";
 constexpr std::string_view kControl = "control";  // the first line of some change records
+constexpr std::string_view kObjectClass = "objectClass";
 
 bool is_name(std::string_view text, std::string_view name) noexcept {
   return text.size() == name.size() && equals_ignore_ascii_case(text, name);
@@ -173,6 +178,8 @@ class LdifIndex::Builder {
         fault_(fault),
         start_(text.begin() + (has_mark(text) ? kByteOrderMark.size() : 0)),
         lookup_(attribute_lookup()),
+        classes_(object_class_lookup()),
+        object_class_(lookup_.find(kObjectClass)),
         reader_(start_, text.end()) {}
 
   bool run() {
@@ -203,10 +210,14 @@ class LdifIndex::Builder {
 
   [[nodiscard]] bool at_end() const noexcept { return reader_.position() >= text_.end(); }
 
-  // The types that have to be looked at: those with a meaning of their own, and secrets.
-  static NameFilter special_names(const AttributeLookup& lookup) noexcept {
-    NameFilter names = lookup.secret_aliases();
-    for (const std::string_view name : {kDn, kChangeType, kControl}) names.add(name);
+  // The types that have to be looked at: those with a meaning of their own, secrets, and the one
+  // whose values are names.
+  [[nodiscard]] NameFilter special_names() const noexcept {
+    NameFilter names = lookup_.secret_aliases();
+    for (const std::string_view name : {kDn, kChangeType, kControl, kObjectClass}) names.add(name);
+    if (object_class_ != nullptr) {
+      for (const std::string& alias : object_class_->aliases) names.add(alias);
+    }
     return names;
   }
 
@@ -312,8 +323,11 @@ class LdifIndex::Builder {
 
   bool read_attributes(const char* entry_at) {
     const NameFilter special = special_names_;
-    const auto plain = [&special](std::string_view type) {
-      return is_ascii_letter(type.front()) && !special.may_hold(type);
+    const ObjectClassLookup& classes = classes_;
+    const auto plain = [&special, &classes](std::string_view type, std::string_view value) {
+      if (!is_ascii_letter(type.front())) return false;
+      if (!special.may_hold(type)) return true;
+      return type == kObjectClass && classes.is_surely_own_name(plain_value(value));
     };
     std::size_t attributes = 0;
     AttributeLine line;
@@ -342,7 +356,8 @@ class LdifIndex::Builder {
     if (is_name(line.type, kDn)) return refuse(line_start(at), kSecondDn);
     if (is_name(line.type, kChangeType)) return refuse(line_start(at), kChangeRecord);
     if (first && is_name(line.type, kControl)) return refuse(line_start(at), kChangeRecord);
-    return line.kind == ValueKind::plain || check_encoded(at, line);
+    if (line.kind != ValueKind::plain && !check_encoded(at, line)) return false;
+    return !is_object_class(line.type) || check_class(at, line);
   }
 
   bool check_type(const char* at, const AttributeLine& line) {
@@ -373,6 +388,27 @@ class LdifIndex::Builder {
       return refuse(value_position(start, line, 0), kBase64Nul);
     }
     return true;
+  }
+
+  // -- Object classes --
+
+  [[nodiscard]] bool is_object_class(std::string_view type) const noexcept {
+    return object_class_ != nullptr ? is_name_of(*object_class_, type)
+                                    : is_name(type, kObjectClass);
+  }
+
+  // Of what stands behind the colon of a plain line.
+  static std::string_view plain_value(std::string_view rest) noexcept {
+    while (!rest.empty() && rest.front() == ' ') rest.remove_prefix(1);
+    if (!rest.empty() && rest.back() == '\r') rest.remove_suffix(1);
+    return rest;
+  }
+
+  bool check_class(const char* at, const AttributeLine& line) {
+    std::string scratch;
+    const std::string* const name = classes_.required_name(decoded(line, scratch));
+    if (name == nullptr) return true;
+    return refuse(value_position(line_start(at), line, 0), kClassSpelling + *name);
   }
 
   // The start of the content line that was read from `at` on, behind comments.
@@ -418,8 +454,8 @@ class LdifIndex::Builder {
   bool index_dn(const char* at, const char* dn_at, std::string_view dn, bool plain) {
     Entry entry{static_cast<std::uint32_t>(at - text_.begin()), 0, kNone};
     Neighbour parent;
-    if (plain && index_.size_ > 0 && dn.size() <= kMaxDnLength && read_plain_rdn(dn, rdn_) &&
-        find_parent_on_path(rdn_, parent)) {
+    if (plain && index_.size_ > 0 && dn.size() <= kMaxDnLength && is_same_in_utf8(dn) &&
+        read_plain_rdn(dn, rdn_) && find_parent_on_path(rdn_, parent)) {
       if (is_secret(rdn_.type)) return refuse(dn_at, kSecretInDn);
       entry.parent = parent.entry;
       entry.hash = combine_dn_hash(index_.entries()[parent.entry].hash,
@@ -434,6 +470,12 @@ class LdifIndex::Builder {
     }
     extend_path(parent, {plain ? dn : std::string_view(), index_.size_ - 1, parent.depth + 1});
     return true;
+  }
+
+  // Whether what a plain RDN may hold means the same in UTF-8. Some code pages have an overline in
+  // the place of the tilde; their currency sign in the place of the backslash is never plain.
+  [[nodiscard]] bool is_same_in_utf8(std::string_view dn) const noexcept {
+    return !decodes_ || dn.find('~') == std::string_view::npos;
   }
 
   // Shortens the path to the parent when it is there.
@@ -463,7 +505,9 @@ class LdifIndex::Builder {
   // The long way: the whole DN in normal form.
   bool place(const char* dn_at, std::string_view dn, Entry& entry, Neighbour& parent) {
     std::string normal;
-    if (!normalize(dn, DnText::any_code_page, normal)) return refuse(dn_at, kBadDn);
+    if (!normalize_local(dn, normal)) {
+      return refuse(dn_at, is_local_text(dn) ? kBadDn : kNotInCodePage);
+    }
     if (normal.empty()) return refuse(dn_at, kEmptyDn);
     LeadingRdn rdn;
     const bool plain = read_plain_rdn(dn, rdn);
@@ -500,7 +544,7 @@ class LdifIndex::Builder {
   // of its own.
   bool names_secret(std::string_view dn) const {
     Dn parsed;
-    if (!parse(dn, DnText::any_code_page, parsed)) return false;
+    if (!parse_local(dn, parsed)) return false;
     for (const Rdn& rdn : parsed) {
       for (const Ava& ava : rdn) {
         if (is_secret(lookup_.find(ava.type))) return true;
@@ -514,10 +558,13 @@ class LdifIndex::Builder {
   FileFault& fault_;
   const char* const start_;
   const AttributeLookup& lookup_;
+  const ObjectClassLookup& classes_;
+  const KnownType* const object_class_;  // null when the table does not know the type
   LineReader reader_;
   const char* checked_ = start_;  // up to here no forbidden byte
-  const NameFilter special_names_ = special_names(lookup_);
+  const NameFilter special_names_ = special_names();
   LeadingRdn rdn_;  // of the DN read last
+  const bool decodes_ = text_decoder() != nullptr;
   bool last_line_is_comment_ = false;
   std::array<Neighbour, 8> path_;  // from some entry down to the one read last
   std::size_t path_length_ = 0;

@@ -151,9 +151,9 @@ class LineReader {
   }
 
   // Passes comments and the lines of the plainest kind that follow, not folded and their value in
-  // clear, as long as `accept` wants their type; the result is the number of the latter. Nearly all
-  // lines of a file need no more. Works on copies of the reader's state, which the compiler keeps
-  // in registers.
+  // clear, as long as `accept` wants their type and what stands behind the colon up to the newline;
+  // the result is the number of the latter. Nearly all lines of a file need no more. Works on
+  // copies of the reader's state, which the compiler keeps in registers.
   template <class Accept>
   std::size_t pass_plain_lines(Accept accept) noexcept {
     Newlines newlines = newlines_;
@@ -170,7 +170,10 @@ class LineReader {
       const char* const newline = ahead.next();
       const char* const colon = skip_name(at);
       if (*colon != ':' || colon[1] == ':' || colon[1] == '<' || newline[1] == ' ') break;
-      if (!accept(std::string_view(at, static_cast<std::size_t>(colon - at)))) break;
+      if (!accept(std::string_view(at, static_cast<std::size_t>(colon - at)),
+                  std::string_view(colon + 1, static_cast<std::size_t>(newline - colon - 1)))) {
+        break;
+      }
       newlines = ahead;
       at = newline + 1;
       ++count;

@@ -66,9 +66,12 @@ std::string map_characters(const std::string& text, Change change) {
   return result;
 }
 
-std::string compose(const std::string& text, bool fold) {
-  int options = UTF8PROC_STABLE | UTF8PROC_COMPAT | UTF8PROC_COMPOSE;
-  if (fold) options |= UTF8PROC_CASEFOLD;
+constexpr int kComposed = UTF8PROC_STABLE | UTF8PROC_COMPAT | UTF8PROC_COMPOSE;
+constexpr int kFoldedApart =
+    UTF8PROC_STABLE | UTF8PROC_COMPAT | UTF8PROC_DECOMPOSE | UTF8PROC_CASEFOLD;
+
+// By options of the Unicode library.
+std::string normalized(const std::string& text, int options) {
   utf8proc_uint8_t* mapped = nullptr;
   const utf8proc_ssize_t length = utf8proc_map(
       reinterpret_cast<const utf8proc_uint8_t*>(text.data()),
@@ -79,13 +82,14 @@ std::string compose(const std::string& text, bool fold) {
   return {reinterpret_cast<const char*>(mapped), static_cast<std::size_t>(length)};
 }
 
-// One round. Full folding before simple upper-casing gives full upper-casing: sharp s becomes "ss"
-// first, then "SS".
-std::string prepared_once(const std::string& value, LetterCase letter_case) {
+// Upper-cases by full rules: folding makes "ss" of sharp s, and letters that have no upper case as
+// one character are taken apart from their marks, so that the simple upper case of each character
+// is enough. Prepared once, a text does not change any more.
+std::string prepared_characters(const std::string& value, LetterCase letter_case) {
   const std::string kept =
       map_characters(value, [](utf8proc_int32_t c) { return is_dropped(c) ? -1 : c; });
-  if (letter_case == LetterCase::kept) return compose(kept, false);
-  return compose(map_characters(compose(kept, true), &utf8proc_toupper), false);
+  if (letter_case == LetterCase::kept) return normalized(kept, kComposed);
+  return normalized(map_characters(normalized(kept, kFoldedApart), &utf8proc_toupper), kComposed);
 }
 
 }  // namespace
@@ -106,15 +110,7 @@ bool is_all_ascii(std::string_view value) noexcept {
 
 std::string prepare(std::string_view value, LetterCase letter_case) {
   if (is_all_ascii(value) || !is_valid_utf8(value)) return ascii_prepared(value, letter_case);
-  // Upper-casing can open a new composition; a few rounds reach the form that no longer changes.
-  constexpr int kMaxRounds = 8;
-  std::string result = prepared_once(std::string(value), letter_case);
-  for (int round = 1; round < kMaxRounds; ++round) {
-    std::string next = prepared_once(result, letter_case);
-    if (next == result) break;
-    result = std::move(next);
-  }
-  return result;
+  return prepared_characters(std::string(value), letter_case);
 }
 
 void fold_blanks(std::string& value) noexcept {

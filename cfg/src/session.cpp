@@ -11,6 +11,7 @@
 #include "dn_text.h"
 #include "filter.h"
 #include "interrupt_poll.h"
+#include "local_text.h"
 #include "session_state.h"
 
 namespace orv::cfg {
@@ -120,7 +121,10 @@ struct Search {
 
   int look_at(std::uint32_t entry) {
     if (interrupted()) return result::time_limit_exceeded;
-    if (filter == nullptr || filter->matches(session.index, entry)) chain.append(entry);
+    const Filter::Match match =
+        filter == nullptr ? Filter::Match::yes : filter->match(session.index, entry);
+    if (match == Filter::Match::interrupted) return result::time_limit_exceeded;
+    if (match == Filter::Match::yes) chain.append(entry);
     return result::success;
   }
 
@@ -167,7 +171,7 @@ struct Search {
 
 int find_base(const Session& session, const char* base, std::uint32_t& entry) {
   std::string normal;
-  if (!normalize(base == nullptr ? "" : base, DnText::any_code_page, normal)) {
+  if (!normalize_local(base == nullptr ? "" : base, normal)) {
     return result::invalid_dn_syntax;
   }
   entry = session.index.find(normal);
@@ -178,7 +182,10 @@ int search(Session& session, const char* base, int scope, const char* filter_tex
            char** attributes, bool types_only, _CFGMessage** result) {
   if (session.state != Session::State::bound || result == nullptr) return result::operations_error;
   Filter filter;
-  if (filter_text != nullptr && !filter.parse(filter_text)) return result::protocol_error;
+  if (filter_text != nullptr) {
+    std::string utf8;
+    if (!filter.parse(as_utf8(filter_text, utf8))) return result::protocol_error;
+  }
   std::uint32_t entry = LdifIndex::kNone;
   int rc = find_base(session, base, entry);
   if (rc != result::success) return rc;

@@ -1,6 +1,7 @@
 #include "file_session.h"
 
 #include "cfg/attribute_table.h"
+#include "cfg/object_class_table.h"
 #include "cfg/result_codes.h"
 #include "cfg/text.h"
 #include "slapi/schema.h"
@@ -57,7 +58,8 @@ const std::vector<std::string>& FileEntry::values(std::string_view name) const {
 }
 
 CfgSession open_file(const std::string& file, const std::string& key_stash, std::string& why) {
-  if (cfg::register_attribute_types(builtin_schema().attribute_table()) != 0) {
+  if (cfg::register_attribute_types(builtin_schema().attribute_table()) != 0 ||
+      cfg::register_object_classes(builtin_schema().object_class_table()) != 0) {
     why = "not enough memory for the schema";
     return nullptr;
   }

@@ -36,12 +36,7 @@ class EntryCheck {
   void check_class_values() {
     for (const std::string& value : entry_.values("objectClass")) {
       const ObjectClass* object_class = schema_.object_class(value);
-      if (object_class == nullptr) {
-        problems_.push_back("unknown object class " + value);
-      } else if (!cfg::equals_ignore_ascii_case(value, object_class->names.front())) {
-        problems_.push_back("object class " + value + " must be written as " +
-                            object_class->names.front());
-      }
+      if (object_class == nullptr) problems_.push_back("unknown object class " + value);
       add_with_superiors(schema_, object_class, classes_);
     }
   }

@@ -20,6 +20,7 @@
 #include "broken_file.h"
 #include "cfg/attribute_table.h"
 #include "cfg/diagnostics.h"
+#include "cfg/object_class_table.h"
 #include "logs.h"
 #include "options.h"
 #include "plugin/loader.h"
@@ -271,6 +272,7 @@ int serve(const Options& options, const Settings& settings, Logs& logs,
 int run(const Options& options) {
   if (!apply_options(options)) return 1;
   if (cfg::register_attribute_types(builtin_schema().attribute_table()) != 0) return 1;
+  if (cfg::register_object_classes(builtin_schema().object_class_table()) != 0) return 1;
   Settings settings;
   std::string error;
   if (!read_settings(options.config_file, options.key_stash_file, settings, error)) {

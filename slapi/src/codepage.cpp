@@ -12,9 +12,11 @@
 #include <cstring>
 #include <memory>
 #include <new>
+#include <string>
 #include <string_view>
 #include <utility>
 
+#include "cfg/code_page.h"
 #include "cfg/result_codes.h"
 #include "cfg/text.h"
 #include "memory.h"
@@ -229,6 +231,23 @@ int convert(bool to_utf8, const char* text, char** result, std::size_t* length) 
   return result::success;
 }
 
+// As the configuration-file library compares texts.
+int decode_for_library(std::string_view text, std::string& utf8) noexcept try {
+  Descriptor* const open = descriptor(true);
+  Output output;
+  if (open == nullptr || !output.reserve(text.size() + text.size() / 2 + 8)) {
+    return result::no_memory;
+  }
+  const int rc = convert_all(open->get(), text.data(), text.size(), output);
+  if (rc != result::success) return rc;
+  std::size_t length = 0;
+  const MallocPtr<char> converted(output.finish(&length));
+  utf8.assign(converted.get(), length - 1);
+  return result::success;
+} catch (...) {
+  return result::no_memory;
+}
+
 int checked_copy(const char* text, char** result, std::size_t* length) noexcept {
   const std::string_view bytes(text);
   if (!cfg::is_valid_utf8(bytes)) return result::invalid_attribute_syntax;
@@ -277,6 +296,7 @@ void put_in_force(const char* name, bool utf8) noexcept {
   copy_name(page().name, name);
   page().utf8.store(utf8, std::memory_order_release);
   page().generation.fetch_add(1, std::memory_order_release);
+  cfg::set_text_decoder(utf8 ? nullptr : &decode_for_library);
 }
 
 }  // namespace

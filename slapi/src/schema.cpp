@@ -68,6 +68,15 @@ std::vector<cfg::AttributeType> Schema::attribute_table() const {
   return table;
 }
 
+std::vector<cfg::ObjectClassNames> Schema::object_class_table() const {
+  std::vector<cfg::ObjectClassNames> table;
+  table.reserve(object_classes_.size());
+  for (const ObjectClass& known : object_classes_) {
+    table.push_back({known.names.front(), known.oid, {known.names.begin() + 1, known.names.end()}});
+  }
+  return table;
+}
+
 const Schema& builtin_schema() {
   static const Schema* const schema = read_builtin_schema();
   return *schema;

@@ -40,8 +40,6 @@ def test_filter_of_the_client_finds_text_of_the_file(instance, filter_text):
     assert clients.names(client, filter_text) == {SHELF}
 
 
-@pytest.mark.xfail(strict=True, reason="the library compares DNs beyond ASCII as UTF-8 only; a base "
-                                       "arrives in upper case and meets the file's spelling")
 def test_base_beyond_ascii_is_found(instance):
     dn = "cn=Ærø,cn=schemas,cn=configuration"
     instance.config.append(record(dn.encode("latin-1"), [

@@ -3,7 +3,6 @@
 import base64
 import os
 import re
-import shutil
 
 import ldap
 import pytest
@@ -62,6 +61,11 @@ DAMAGES = {
     "continuation of nothing": (lambda text: b" folded\n" + text, "1"),
     "DN that is none": (
         lambda text: text + b"\n" + record("cn=shelf,,cn=configuration", [CONTAINER]), None),
+    "object class by its number": (
+        damaged_entry(b"objectClass: 2.16.840.1.113730.3.2.6"), "@LAST"),
+    "object class with a blank behind it": (damaged_entry(b"objectClass: referral "), "@LAST"),
+    "object class by its number in base64": (
+        damaged_entry(b"objectClass:: " + base64.b64encode(b"2.16.840.1.113730.3.2.6")), "@LAST"),
     "value from a file": (damaged_entry(b"description:< file:///etc/hostname"), "@LAST"),
     "change record": (
         lambda text: text + b"\ndn: " + SHELF.encode() + b"\nchangetype: delete\n", "@LAST"),
@@ -158,10 +162,7 @@ def without_override():
     """What takes root's right to read everything away, so that file modes mean something."""
     if os.geteuid() != 0:
         return []
-    setpriv = shutil.which("setpriv")
-    if not setpriv:
-        pytest.skip("running as root without setpriv")
-    return [setpriv, "--bounding-set=-dac_override,-dac_read_search",
+    return ["setpriv", "--bounding-set=-dac_override,-dac_read_search",
             "--inh-caps=-dac_override,-dac_read_search"]
 
 

@@ -1,6 +1,11 @@
 """What the first start makes, and that the second start leaves it alone."""
 
+import contextlib
+import fcntl
+import os
 import re
+import shutil
+import signal
 import stat
 import subprocess
 
@@ -90,6 +95,12 @@ def test_check_accepts_a_new_instance_without_listening(instance):
     assert b"orvd ready" not in checked.stdout
 
 
+def test_name_in_the_place_of_an_address_is_refused_with_what_is_wanted(instance):
+    exit_code, stderr = instance.start_refused("--address", "localhost")
+    assert exit_code == 1
+    assert "'localhost': not an IP address" in stderr
+
+
 def test_port_and_address_of_the_file_hold_without_options(instance):
     with clients_port() as port:
         instance.config.set(clients.BASE, "orv-slapdPort", str(port))
@@ -113,40 +124,84 @@ class clients_port:  # pylint: disable=invalid-name
         self.socket.close()
 
 
-SERVE = programs.SOURCE_DIR / "serve"
+def serve_script(tmp_path):
+    """./serve for the programs under test. Those of another build tree than its own it gets to see in
+    a copy of the repository's scripts, as a tree in which there is nothing left to build."""
+    if programs.bin_dir() == programs.SOURCE_DIR / "build/dev/bin":
+        return programs.SOURCE_DIR / "serve"
+    return copied_scripts(tmp_path / "copy") / "serve"
 
 
-def serve(directory):
-    """Runs ./serve, which starts the daemon in its place, and waits for the ready line."""
+def copied_scripts(root):
+    (root / ".ci").mkdir(parents=True)
+    for name in ["serve", "packages.txt", "CMakePresets.json", ".ci/build.sh"]:
+        shutil.copy2(programs.SOURCE_DIR / name, root / name)
+    tree = root / "build/dev"
+    tree.mkdir(parents=True)
+    (tree / "bin").symlink_to(programs.bin_dir())
+    (tree / "CMakeCache.txt").write_text("CMAKE_HOME_DIRECTORY:INTERNAL=%s\n" % root)
+    # Targets of the names that ./serve asks for, of which none needs anything done.
+    (tree / "build.ninja").write_text("build orvd orvcfg back-config orv_catalogue: phony\n")
+    return root
+
+
+@contextlib.contextmanager
+def serve(script, directory):
+    """./serve, which starts the daemon in its place, for the length of the block; ends in order."""
     process = subprocess.Popen(
-        [SERVE, "--dir", directory, "--port", "0"], stdin=subprocess.DEVNULL,
+        [script, "--dir", directory, "--port", "0"], stdin=subprocess.DEVNULL,
         stdout=subprocess.PIPE, stderr=subprocess.PIPE, cwd=directory.parent, start_new_session=True)
-    stdout, stderr = LineCollector(process.stdout), LineCollector(process.stderr)
-    ready = stdout.wait_for(READY.match, 300)
-    assert ready, stderr.text()
-    return process, stdout, int(READY.match(ready).group("port"))
+    try:
+        yield LineCollector(process.stdout), LineCollector(process.stderr)
+    except BaseException:
+        os.killpg(process.pid, signal.SIGKILL)
+        process.wait()
+        raise
+    process.terminate()
+    assert process.wait(programs.DEADLINE) == 0
 
 
-@pytest.mark.skipif(programs.bin_dir() != programs.SOURCE_DIR / "build/dev/bin",
-                    reason="./serve would build another tree than the one under test")
 def test_serve_makes_an_instance_once_and_serves_it(tmp_path):
     directory = tmp_path / "var"
-    process, stdout, port = serve(directory)
-    try:
-        ready = [bool(READY.match(line)) for line in stdout.lines()].index(True)
-        assert any("ldapsearch" in line for line in stdout.lines()[:ready])
+    script = serve_script(tmp_path)
+    with serve(script, directory) as (stdout, stderr):
+        ready = stdout.wait_for(READY.match, 300)  # it may have to build first
+        assert ready, stderr.text()
+        said_before = stdout.lines()[:stdout.lines().index(ready)]
+        assert any("ldapsearch" in line for line in said_before)
         assert [mode(directory / name) for name in MADE] == [0o600] * 3
         made = contents(directory)
+        port = int(READY.match(ready).group("port"))
         found = subprocess.run(
             ["ldapsearch", "-x", "-H", "ldap://127.0.0.1:%d" % port, "-D", "cn=root", "-y",
              directory / "admin.pw", "-b", "cn=configuration"], stdout=subprocess.PIPE,
             timeout=programs.DEADLINE, check=True)
         assert b"orv-slapdAdminPW" in found.stdout
-    finally:
-        process.terminate()
-    assert process.wait(programs.DEADLINE) == 0
 
-    process, _, _ = serve(directory)
-    process.terminate()
-    assert process.wait(programs.DEADLINE) == 0
+    with serve(script, directory) as (stdout, stderr):
+        assert stdout.wait_for(READY.match), stderr.text()
     assert contents(directory) == made
+
+
+def hold_lock(path):
+    """As a build that runs holds it, for as long as the file is open."""
+    file = path.open("w", encoding="utf-8")
+    fcntl.flock(file, fcntl.LOCK_EX | fcntl.LOCK_NB)
+    return file
+
+
+def test_serve_does_not_wait_for_the_build_of_another_preset(tmp_path):
+    root = copied_scripts(tmp_path / "copy")
+    with hold_lock(root / "build/.lock-asan"), hold_lock(root / "build/.lock"), \
+            serve(root / "serve", tmp_path / "var") as (stdout, stderr):
+        assert stdout.wait_for(READY.match), stderr.text()
+
+
+def test_serve_waits_for_a_build_of_its_own_tree_and_says_so(tmp_path):
+    root = copied_scripts(tmp_path / "copy")
+    lock = hold_lock(root / "build/.lock-dev")
+    with serve(root / "serve", tmp_path / "var") as (stdout, stderr):
+        assert stderr.wait_for(lambda line: "waiting for another build" in line)
+        assert stdout.lines() == []
+        lock.close()
+        assert stdout.wait_for(READY.match), stderr.text()

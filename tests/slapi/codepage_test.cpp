@@ -9,6 +9,7 @@
 #include <thread>
 #include <vector>
 
+#include "configuration_file.h"
 #include "slapi/owners.h"
 
 namespace orv {
@@ -120,6 +121,37 @@ TEST_F(CodePage, ConvertsTextsThatGrow) {
 TEST_F(CodePage, EndsAShiftedTextInItsInitialState) {
   ASSERT_EQ(use("ISO-2022-JP"), 0);
   expect_both_ways("\x1B$B@_\x1B(B", "\xE8\xA8\xAD");
+}
+
+// A file of one entry in the code page, and what a search for it by another spelling gives.
+class CodePageOfAFile : public CodePage {
+ protected:
+  static int search_for(const std::string& entry_dn, const std::string& base) {
+    test::ConfigurationFile file("dn: " + entry_dn + "\ncn: x\n");
+    _CFGMessage* found = nullptr;
+    const int rc =
+        cfg_search_s(file.session(), base.c_str(), kScopeBase, nullptr, nullptr, 0, &found);
+    cfg_msgfree(found);
+    return rc;
+  }
+};
+
+TEST_F(CodePageOfAFile, LetterCaseOfNamesIsFoldedInTheCodePageInForce) {
+  ASSERT_EQ(use("ISO-8859-1"), 0);
+  EXPECT_EQ(search_for("cn=\xE6r\xF8", "CN=\xC6R\xD8"), 0);
+  EXPECT_EQ(search_for("cn=\xE6r\xF8", "CN=\xC6R\xD9"), 32);
+  ASSERT_EQ(use("ISO-8859-5"), 0);
+  EXPECT_EQ(search_for("cn=\xE6r\xF8", "CN=\xC6R\xA8"), 0);  // letters of another script
+  EXPECT_EQ(search_for("cn=\xE6r\xF8", "CN=\xC6R\xD8"), 32);
+  ASSERT_EQ(use("UTF-8"), 0);
+  EXPECT_EQ(search_for("cn=\xC3\xA6", "CN=\xC3\x86"), 0);
+  EXPECT_EQ(search_for("cn=\xE6r\xF8", "CN=\xC6R\xD8"), 32);
+}
+
+TEST_F(CodePageOfAFile, CharactersOfTwoBytesMayHoldBytesOfTheSyntax) {
+  ASSERT_EQ(use("SHIFT_JIS"), 0);
+  // U+8868, whose second byte is that of the backslash.
+  EXPECT_EQ(search_for("cn=\x95\x5C", "CN=\x95\x5C"), 0);
 }
 
 TEST_F(CodePage, RecoversAfterAnInvalidText) {

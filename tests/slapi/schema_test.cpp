@@ -3,6 +3,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <atomic>
 #include <string>
 #include <thread>
@@ -137,6 +138,21 @@ TEST(Schema, GivesTheRowsOfTheAttributeTable) {
   EXPECT_TRUE(table[3].secret);
   EXPECT_EQ(table[3].equality, cfg::MatchingRule::octets);
   EXPECT_EQ(table[4].equality, cfg::MatchingRule::octets) << "a type without an equality rule";
+}
+
+TEST(Schema, GivesTheRowsOfTheObjectClassTable) {
+  const auto schema = parse(kSmall);
+  const auto table = schema->object_class_table();
+  ASSERT_EQ(table.size(), 3U);
+  for (std::size_t i = 0; i < table.size(); ++i) {
+    const ObjectClass& known = schema->object_classes()[i];
+    EXPECT_EQ(table[i].name, known.names.front());
+    EXPECT_EQ(table[i].oid, known.oid);
+  }
+  const auto thing =
+      std::find_if(table.begin(), table.end(), [](const auto& row) { return row.name == "thing"; });
+  ASSERT_NE(thing, table.end());
+  EXPECT_THAT(thing->aliases, ElementsAre("cosa"));
 }
 
 TEST(Schema, MapsEachEqualityRuleToItsComparison) {

@@ -1,5 +1,6 @@
 // Stopping a search from outside: a server sets a check for the thread that is about to run an
-// operation, the library polls it once per entry it looks at, and the search ends with 3.
+// operation, the library polls it for each entry it looks at, and within an entry when the filter
+// has much to compare, and the search ends with 3.
 #pragma once
 
 namespace orv::cfg {

@@ -14,7 +14,8 @@ namespace orv {
 // Names the code page before initIconvHandle; null or "" asks the environment. Not thread-safe.
 void set_local_code_page(const char* name);
 
-// Sets the converter up. 0; 80 when the system knows no such code page; 90.
+// Sets the converter up, and the configuration-file library to compare texts in that code page. 0;
+// 80 when the system knows no such code page; 90.
 int initIconvHandle();
 
 // Name of the code page in force ("UTF-8" by default), and whether it is UTF-8.

@@ -11,6 +11,7 @@
 #include <vector>
 
 #include "cfg/attribute_table.h"
+#include "cfg/object_class_table.h"
 
 namespace orv {
 
@@ -61,6 +62,9 @@ class Schema {
 
   // The rows for cfg::register_attribute_types.
   std::vector<cfg::AttributeType> attribute_table() const;
+
+  // The rows for cfg::register_object_classes.
+  std::vector<cfg::ObjectClassNames> object_class_table() const;
 
   ~Schema();
 
