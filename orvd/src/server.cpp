@@ -40,8 +40,6 @@ Server::Server(ServerParts parts)
     : parts_(std::move(parts)),
       signals_(control_),
       gate_timer_(control_),
-      changes_(kChangeThreads),
-      verifiers_(kVerifierThreads),
       backend_(parts_.backend,
                [this](std::string_view why) {
                  parts_.logs.error("the backend threw: " + std::string(why) +
@@ -58,6 +56,8 @@ Server::Server(ServerParts parts)
                 verifiers_,
                 {}},
       settings_(std::make_shared<const Settings>(parts_.settings)),
+      changes_(kChangeThreads),
+      verifiers_(kVerifierThreads),
       listeners_(control_, services_, counter_, loops_) {
   services_.note_failure = parts_.note_failure;
   for (unsigned i = 0; i < std::max(1U, parts_.loops); ++i)

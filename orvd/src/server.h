@@ -79,13 +79,14 @@ class Server {
   asio::io_context control_{1};
   asio::signal_set signals_;
   asio::steady_timer gate_timer_;
-  asio::thread_pool changes_;
-  asio::thread_pool verifiers_;
   BackendHost backend_;
   Services services_;
   ConnectionCounter counter_;
   std::shared_ptr<const Settings> settings_;
   std::vector<std::unique_ptr<Loop>> loops_;
+  // After the loops: work that was never done goes with the pools and holds connections.
+  asio::thread_pool changes_;
+  asio::thread_pool verifiers_;
   Listeners listeners_;
 };
 

@@ -3,11 +3,13 @@
 import base64
 import hashlib
 import os
+import re
+import subprocess
 
 import ldap
 import pytest
 
-from orv_e2e import clients
+from orv_e2e import clients, programs
 
 MASTER = "cn=master server,cn=configuration"
 
@@ -222,6 +224,22 @@ def test_member_added_by_hand_binds_at_once(server):
     assert bind_code(server, "cn=alice", "in the open") == 0
 
 
+def test_example_member_of_the_default_configuration_needs_only_a_password(server):
+    text = server.config.read()
+    commented = b"# dn: cn=alice,CN=ADMINGROUP,CN=CONFIGURATION\n"
+    start = text.index(commented)
+    example, rest = text[start:].split(b"\n\n", 1)
+    lines = [line[2:] for line in example.split(b"\n")]
+    chosen = [b"orv-slapdAdminPW: chosen" if line.startswith(b"orv-slapdAdminPW:") else line
+              for line in lines]
+    assert chosen != lines
+    # The line that was "#" alone separates the record from the comment above it.
+    server.config.replace(text[:start].removesuffix(b"#\n") + b"\n" + b"\n".join(chosen) + b"\n\n"
+                          + rest)
+    assert bind_code(server, "cn=alice", "chosen") == 0
+    assert bind_code(server, clients.ADMINISTRATOR, server.password) == 0
+
+
 def test_member_removed_by_hand_is_gone_at_once(instance):
     instance.config.add_member("alice", "in the open")
     instance.start()
@@ -234,3 +252,12 @@ def test_administrator_cannot_bind_under_another_key_than_the_sealing_one(instan
     instance.key_stash.write_text("orv-key-1 " + "5a" * 32 + "\n")
     instance.start()
     assert bind_code(instance, "cn=root", instance.password) == 49
+    assert instance.stderr.wait_for(
+        re.compile("warning CN=CONFIGURATION: orv-slapdAdminPW does not open with the key").search)
+
+
+def test_server_without_a_key_says_whose_password_it_cannot_open(instance):
+    command = [str(programs.orvd()), "--config", str(instance.config.path), "--check"]
+    done = subprocess.run(command, check=True, text=True, stdout=subprocess.PIPE,
+                          stderr=subprocess.PIPE, timeout=programs.DEADLINE)
+    assert "CN=CONFIGURATION: orv-slapdAdminPW is sealed, and no key stash is named" in done.stderr

@@ -109,6 +109,8 @@ def test_one_level_search_below_a_leaf_is_empty(admin):
     ("(cn:=one)", books("one")),
     ("(objectClass=container)", books(*BOOKS) | {SHELF}),
     ("(objectClass=CONTAINER)", books(*BOOKS) | {SHELF}),
+    ("(objectClass=2.5.6.0)", books(*BOOKS) | {SHELF}),
+    ("(objectClass:objectIdentifierMatch:=2.5.6.0)", books(*BOOKS) | {SHELF}),
     ("(objectClass=person)", set()),
     ("(nosuchattribute=one)", set()),
     ("(nosuchattribute=*)", set()),

@@ -5,6 +5,7 @@ import time
 
 import ldap
 import pytest
+from ldap.extop import ExtendedRequest
 
 from orv_e2e import clients, wire
 from orv_e2e.config_file import record
@@ -144,12 +145,14 @@ def test_access_log_names_operations_but_no_password(server):
         clients.bind(server, password="a very wrong password")
     with pytest.raises(ldap.UNWILLING_TO_PERFORM):
         client.compare_s(clients.BASE, "orv-slapdAdminPW", b"a guessed password")
+    with pytest.raises(ldap.PROTOCOL_ERROR):
+        client.extop_s(ExtendedRequest("1.2.3.4", b"an extended password"))
     clients.search(client, filter_text="(orv-slapdAdminPW=a filtered password)")
     password = server.password.encode()
     server.stop()
     logged = server.access_log.read_bytes() + server.stderr.text().encode()
     assert b"audit" in logged.lower()
-    for secret in (password, b"a very wrong", b"a guessed", b"a filtered"):
+    for secret in (password, b"a very wrong", b"a guessed", b"a filtered", b"an extended"):
         assert secret not in logged
 
 

@@ -34,12 +34,13 @@ class SchemaRegistration : public ::testing::Environment {
 };
 const auto* const kRegistration = ::testing::AddGlobalTestEnvironment(new SchemaRegistration);
 
-const std::string kTop =
-    "dn: cn=configuration\n"
-    "objectClass: orv-slapdTop\n"
-    "cn: configuration\n"
-    "orv-slapdAdminDN: cn=root\n"
-    "orv-slapdAdminPW: rootpw\n";
+std::string top_with(const std::string& stored_password) {
+  return "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\n"
+         "orv-slapdAdminDN: cn=root\norv-slapdAdminPW: " +
+         stored_password + "\n";
+}
+
+const std::string kTop = top_with("rootpw");
 const std::string kGroup =
     "\ndn: cn=AdminGroup,cn=configuration\n"
     "objectClass: container\n"
@@ -354,15 +355,32 @@ TEST_F(IdentitiesOfAFile, MemberWithoutANameIsLeftOutWithAWarning) {
   EXPECT_THAT(warnings_, ElementsAre(HasSubstr("has no orv-slapdAdminDN")));
 }
 
+TEST_F(IdentitiesOfAFile, SealedPasswordThatProvesNothingIsToldOfWithoutShowingIt) {
+  const auto expect_doubt = [&](const std::string& stored, const char* why) {
+    EXPECT_TRUE(read(top_with(stored))) << error_;
+    EXPECT_THAT(warnings_, ElementsAre(HasSubstr(why)));
+    EXPECT_THAT(warnings_, Each(HasSubstr("CN=CONFIGURATION: orv-slapdAdminPW ")));
+    EXPECT_THAT(warnings_, Each(Not(HasSubstr(stored))));
+  };
+  const cfg::KeyPtr first = make_key();
+  const std::string here = sealed(*first, "orv-slapdAdminPW", "CN=CONFIGURATION", "pw");
+  const std::string elsewhere = sealed(*first, "orv-slapdAdminPW", "CN=M,CN=CONFIGURATION", "pw");
+  EXPECT_TRUE(read(top_with(here))) << error_;
+  EXPECT_THAT(warnings_, IsEmpty());
+  expect_doubt(elsewhere, "sealed for another entry");
+  std::filesystem::remove(stash());
+  const cfg::KeyPtr second = make_key();
+  expect_doubt(here, "does not open");
+  use_stash_ = false;
+  expect_doubt(here, "no key stash is named");
+}
+
 // ---- Forms of stored passwords
 
 TEST_F(IdentitiesOfAFile, HashedPasswordIsVerified) {
   std::string hashed;
   ASSERT_EQ(cfg::hash_secret("hashedpw", hashed), 0);
-  const auto identities = read(
-      "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\n"
-      "orv-slapdAdminDN: cn=root\norv-slapdAdminPW: " +
-      hashed + "\n");
+  const auto identities = read(top_with(hashed));
   ASSERT_TRUE(identities) << error_;
   EXPECT_NE(identities->authenticate("cn=root", "hashedpw"), nullptr);
   EXPECT_EQ(identities->authenticate("cn=root", "other"), nullptr);
@@ -374,10 +392,8 @@ TEST_F(IdentitiesOfAFile, SealedPasswordIsVerifiedAtItsPlaceOnly) {
   const std::string admin = sealed(*key, "orv-slapdAdminPW", "CN=CONFIGURATION", "sealedpw");
   const std::string good =
       sealed(*key, "orv-slapdAdminPW", "CN=M,CN=ADMINGROUP,CN=CONFIGURATION", "mpw");
-  const auto identities = read(
-      "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\n"
-      "orv-slapdAdminDN: cn=root\norv-slapdAdminPW: " +
-      admin + "\n" + kGroup + member("m", "cn=m", good) + member("thief", "cn=thief", admin));
+  const auto identities = read(top_with(admin) + kGroup + member("m", "cn=m", good) +
+                               member("thief", "cn=thief", admin));
   ASSERT_TRUE(identities) << error_;
   EXPECT_NE(identities->authenticate("cn=root", "sealedpw"), nullptr);
   EXPECT_NE(identities->authenticate("cn=m", "mpw"), nullptr);
@@ -394,9 +410,7 @@ TEST_F(IdentitiesOfAFile, SealedSupplierPasswordIsVerified) {
 }
 
 TEST_F(IdentitiesOfAFile, PasswordOfAnUnknownSchemeNeverMatches) {
-  const auto identities = read(
-      "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\n"
-      "orv-slapdAdminDN: cn=root\norv-slapdAdminPW: {WHIRL}abc\n");
+  const auto identities = read(top_with("{WHIRL}abc"));
   ASSERT_TRUE(identities) << error_;
   EXPECT_EQ(identities->authenticate("cn=root", "{WHIRL}abc"), nullptr);
   EXPECT_EQ(identities->authenticate("cn=root", "abc"), nullptr);
@@ -406,7 +420,7 @@ TEST_F(IdentitiesOfAFile, NameOfBlanksIsNobodys) {
   const auto identities = read(
       "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\n"
       "orv-slapdAdminDN:: IA==\norv-slapdAdminPW: rootpw\n");
-  if (!identities) return;
+  ASSERT_TRUE(identities) << error_;
   for (const char* name : {"", " "}) {
     EXPECT_EQ(identities->authenticate(name, "rootpw"), nullptr);
   }
@@ -459,11 +473,6 @@ TEST_F(IdentitiesOfAFile, KeyStashThatCannotBeUsedIsAFailure) {
 
 class Store : public IdentitiesOfAFile {
  protected:
-  static std::string with_password(const std::string& password) {
-    return "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\n"
-           "orv-slapdAdminDN: cn=root\norv-slapdAdminPW: " +
-           password + "\n";
-  }
   bool binds(IdentityStore& store, const char* password) {
     const auto identities = store.current();
     return identities != nullptr && identities->authenticate("cn=root", password) != nullptr;
@@ -478,17 +487,17 @@ TEST_F(Store, IsEmptyWhenTheFirstReadingFails) {
 }
 
 TEST_F(Store, ReadsTheFileAgainWhenItWasReplaced) {
-  write(with_password("one"));
+  write(top_with("one"));
   IdentityStore store(config(), "");
   ASSERT_TRUE(store.reload(error_, warnings_)) << error_;
   EXPECT_TRUE(binds(store, "one"));
-  replace(with_password("two"));
+  replace(top_with("two"));
   EXPECT_TRUE(binds(store, "two"));
   EXPECT_FALSE(binds(store, "one"));
 }
 
 TEST_F(Store, KeepsTheSameSnapshotWhileTheFileStays) {
-  write(with_password("one"));
+  write(top_with("one"));
   IdentityStore store(config(), "");
   ASSERT_TRUE(store.reload(error_, warnings_)) << error_;
   EXPECT_EQ(store.current(), store.current());
@@ -498,7 +507,7 @@ TEST_F(Store, KeepsTheSameSnapshotWhileTheFileStays) {
 }
 
 TEST_F(Store, KeepsTheLastGoodOneWhileTheFileIsDamaged) {
-  write(with_password("one"));
+  write(top_with("one"));
   IdentityStore store(config(), "");
   ASSERT_TRUE(store.reload(error_, warnings_)) << error_;
   replace("damaged\n");
@@ -508,13 +517,13 @@ TEST_F(Store, KeepsTheLastGoodOneWhileTheFileIsDamaged) {
   EXPECT_TRUE(binds(store, "one"));
   std::filesystem::remove(config());
   EXPECT_TRUE(binds(store, "one"));
-  replace(with_password("two"));
+  replace(top_with("two"));
   EXPECT_TRUE(binds(store, "two"));
 }
 
 TEST_F(Store, ReadsAgainWhenTheKeyStashChanges) {
   const cfg::KeyPtr key = make_key();
-  write(with_password(sealed(*key, "orv-slapdAdminPW", "CN=CONFIGURATION", "one")));
+  write(top_with(sealed(*key, "orv-slapdAdminPW", "CN=CONFIGURATION", "one")));
   IdentityStore store(config(), stash());
   ASSERT_TRUE(store.reload(error_, warnings_)) << error_;
   EXPECT_TRUE(binds(store, "one"));
@@ -524,7 +533,7 @@ TEST_F(Store, ReadsAgainWhenTheKeyStashChanges) {
 }
 
 TEST_F(Store, ServesManyThreadsWhileTheFileIsReplaced) {
-  write(with_password("stays"));
+  write(top_with("stays"));
   IdentityStore store(config(), "");
   ASSERT_TRUE(store.reload(error_, warnings_)) << error_;
   std::vector<std::thread> threads;
@@ -536,7 +545,7 @@ TEST_F(Store, ServesManyThreadsWhileTheFileIsReplaced) {
       }
     });
   }
-  for (int n = 0; n < 50; ++n) replace(with_password("stays") + std::string(n % 3U, '\n'));
+  for (int n = 0; n < 50; ++n) replace(top_with("stays") + std::string(n % 3U, '\n'));
   for (std::thread& thread : threads) thread.join();
   EXPECT_EQ(failures, 0);
 }
@@ -658,7 +667,7 @@ TEST_F(Grants, FallWithTheFlags) {
 // ---- What the store tells
 
 TEST_F(Store, TellsTheCauseOfADamageOnceForEachStateOfTheFile) {
-  write(with_password("one"));
+  write(top_with("one"));
   std::vector<std::string> told;
   IdentityStore store(config(), "",
                       [&](const std::string& error, const auto&) { told.push_back(error); });
@@ -673,7 +682,7 @@ TEST_F(Store, TellsTheCauseOfADamageOnceForEachStateOfTheFile) {
   replace("damaged otherwise\n");
   EXPECT_TRUE(binds(store, "one"));
   EXPECT_EQ(told.size(), 2U);
-  replace(with_password("one"));
+  replace(top_with("one"));
   EXPECT_TRUE(binds(store, "one"));
   EXPECT_EQ(told.size(), 2U);
   EXPECT_GT(store.generation(), generation);
@@ -681,7 +690,7 @@ TEST_F(Store, TellsTheCauseOfADamageOnceForEachStateOfTheFile) {
 }
 
 TEST_F(Store, TellsDoubtsOnceForEachStateOfTheFile) {
-  write(with_password("one"));
+  write(top_with("one"));
   std::vector<std::string> told;
   IdentityStore store(config(), "", [&](const std::string& error, const auto& warnings) {
     EXPECT_EQ(error, "");
@@ -694,7 +703,7 @@ TEST_F(Store, TellsDoubtsOnceForEachStateOfTheFile) {
 }
 
 TEST_F(Store, NoticesThatAMissingFileCameAndWentAgain) {
-  write(with_password("one"));
+  write(top_with("one"));
   int told = 0;
   IdentityStore store(config(), "", [&](const std::string&, const auto&) { ++told; });
   ASSERT_TRUE(store.reload(error_, warnings_)) << error_;
@@ -702,7 +711,7 @@ TEST_F(Store, NoticesThatAMissingFileCameAndWentAgain) {
   store.current();
   store.current();
   EXPECT_EQ(told, 1);
-  replace(with_password("one"));
+  replace(top_with("one"));
   store.current();
   std::filesystem::remove(config());
   store.current();

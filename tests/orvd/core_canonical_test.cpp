@@ -124,6 +124,28 @@ TEST_F(Canonical, HiddenAttributesCannotBeAskedForTheirValueInAnySpelling) {
   EXPECT_EQ(hidden("(" + known->oid + "=cn=root)"), undefined);
 }
 
+TEST_F(Canonical, ObjectClassesAreAskedForUnderTheirCanonicalNames) {
+  for (const FilterUse use : {FilterUse::evaluate, FilterUse::evaluate_for_administrators}) {
+    const auto evaluated = [&](std::string_view filter) {
+      return rewrite_filter(schema, filter, use);
+    };
+    EXPECT_EQ(evaluated("(objectClass=2.5.6.0)"), "(objectClass=top)");
+    EXPECT_EQ(evaluated("(2.5.4.0=2.5.6.0)"), "(2.5.4.0=top)");
+    EXPECT_EQ(evaluated("(objectClass=2\\2e5.6.0)"), "(objectClass=top)");
+    EXPECT_EQ(evaluated("(&(cn=2.5.6.0)(!(OBJECTCLASS=TOP)))"),
+              "(&(cn=2.5.6.0)(!(OBJECTCLASS=top)))");
+    EXPECT_EQ(evaluated("(objectClass:2.5.13.0:=2.5.6.0)"), "(objectClass:2.5.13.0:=top)");
+    EXPECT_EQ(evaluated("(objectClass=*)"), "(objectClass=*)");
+    EXPECT_EQ(evaluated("(objectClass=2.5.6*)"), "(objectClass=2.5.6*)");
+    EXPECT_EQ(evaluated("(objectClass=bogus\\2a)"), "(objectClass=bogus\\2a)");
+  }
+}
+
+TEST_F(Canonical, ValuesThatAreHiddenFromMembersAreEvaluatedForWhoSeesThem) {
+  EXPECT_EQ(rewrite_filter(schema, "(orv-slapdAdminDN=cn=root)", FilterUse::evaluate),
+            "(orv-slapdAdminDN=cn=root)");
+}
+
 TEST_F(Canonical, FiltersAreShownWithoutValuesOfSecrets) {
   EXPECT_EQ(rewrite_filter(schema, "(&(cn=a)(orv-slapdAdminPW=guess))", FilterUse::show),
             "(&(cn=a)(orv-slapdAdminPW=***))");

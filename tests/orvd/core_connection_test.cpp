@@ -14,6 +14,7 @@
 #include <sstream>
 
 #include "cfg/owners.h"
+#include "core_bare_session.h"
 #include "core_server_fixture.h"
 #include "ops/log_text.h"
 #include "ops/session.h"
@@ -22,40 +23,16 @@ namespace orv::server {
 namespace {
 
 using namespace std::chrono_literals;
+using test::BareSessionTest;
 using test::Event;
+using test::kNotice;
 using test::kRoot;
 using test::kSecret;
 using test::kTop;
 using test::Reply;
 using test::WireClient;
 
-constexpr int kNotice = 0x78;
-
-class ConnectionTest : public test::LoopbackServer {
- protected:
-  // One client's change is inside the backend until `go_on`.
-  void block() {
-    backend.on_change = [this](pblock* parameters) {
-      entered.happen();
-      go_on.wait();
-      send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 53, nullptr,
-                       "");
-      return 53;
-    };
-    start();
-    holder.emplace(port());
-    bind_as_root(*holder);
-    holder->send(test::delete_entry(2, kTop));
-    ASSERT_TRUE(entered.wait());
-  }
-  ~ConnectionTest() override {
-    go_on.happen();
-    stop();
-  }
-  Event entered;
-  Event go_on;
-  std::optional<WireClient> holder;
-};
+class ConnectionTest : public test::BlockedServer {};
 
 // ---- message ids
 
@@ -196,7 +173,28 @@ TEST_F(AccessLogTest, LongTextsOfStrangersMakeShortLines) {
   WireClient client(port());
   EXPECT_EQ(code_of(client, test::search(1, "cn=" + std::string(500000, 'x'))), 34);
   EXPECT_EQ(code_of(client, test::bind(2, "cn=" + std::string(500000, 'x'), "no")), 34);
+  EXPECT_EQ(code_of(client, test::compare(3, "cn=" + std::string(500000, 'x'))), 53);
+  EXPECT_EQ(code_of(client, test::extended(4, "1." + std::string(500000, '1'))), 2);
   EXPECT_LT(written().size(), 8192U);
+}
+
+TEST_F(AccessLogTest, RequestsThatAreAnsweredOnTheSpotAreLoggedWithTheirTarget) {
+  start();
+  WireClient client(port());
+  const std::string unknown = test::control("1.2.3.4", true);
+  const std::string target = test::tlv(0x04, "cn=there");
+  EXPECT_EQ(code_of(client, test::search(1, "")), 0);
+  EXPECT_EQ(code_of(client, test::compare(2, "cn=there")), 53);
+  EXPECT_EQ(code_of(client, test::message(3, test::tlv(0x6C, target + target + "\x01\x01\xFF"))),
+            53);
+  EXPECT_EQ(code_of(client, test::extended(4, "1.2.3.4")), 2);
+  EXPECT_EQ(code_of(client, test::message(5, test::tlv(0x4A, "cn=there"), unknown)), 12);
+  const std::string log = written();
+  for (const char* const line :
+       {"op=1 SEARCH dn=\"\" scope=0 filter=\"(objectClass=*)\" result=0",
+        "op=2 COMPARE dn=\"cn=there\" result=53", "op=3 MODIFYDN dn=\"cn=there\" result=53",
+        "op=4 EXTENDED oid=\"1.2.3.4\" result=2", "op=5 DELETE dn=\"cn=there\" result=12"})
+    EXPECT_NE(log.find(line), std::string::npos) << line << "\nis not in\n" << log;
 }
 
 TEST_F(AccessLogTest, AbandonedOperationsAreLoggedAsAbandoned) {
@@ -308,117 +306,6 @@ TEST_F(ConnectionTest, BackendThatFailedWithItsLockHeldIsNotAskedToUnbind) {
   EXPECT_LT(Clock::now() - begun, 5s);
   EXPECT_EQ(backend.calls(parameter::unbind_function), 0);
 }
-
-// A session without a socket; what it posts is run by the test, and posting can be made to fail.
-class BareSession final : public Session {
- public:
-  BareSession(Services& services, AccessLane& lane, const Settings& settings)
-      : Session(services, lane, 1), settings_(settings) {}
-
-  using Session::client_left;
-  using Session::handle;
-  using Session::idle;
-  using Session::output_is;
-  using Session::tick;
-
-  // Runs what was posted until `done`, for ten seconds at most.
-  bool run_until(const std::function<bool()>& done) {
-    const auto end = Clock::now() + 10s;
-    while (!done() && Clock::now() < end) {
-      std::unique_lock lock(mutex_);
-      if (posted_.empty()) {
-        lock.unlock();
-        tick();
-        std::this_thread::yield();
-        continue;
-      }
-      const auto work = std::move(posted_.front());
-      posted_.pop_front();
-      lock.unlock();
-      work();
-    }
-    return done();
-  }
-  void fail_to_post(int times) { failing_ = times; }
-  int failed_posts() const { return failed_; }
-
-  bool lost_interest(PendingOperation&) noexcept override { return false; }
-  std::string sent;
-  bool ended = false;
-
- protected:
-  const Settings& settings() const noexcept override { return settings_; }
-  void post(std::function<void()> work) override {
-    const std::lock_guard lock(mutex_);
-    if (failing_ > 0) {
-      --failing_;
-      ++failed_;
-      throw std::bad_alloc();
-    }
-    posted_.push_back(std::move(work));
-  }
-  void transmit(std::string& bytes) override {
-    sent += bytes;
-    bytes.clear();
-    output_is(sent.size());
-  }
-  void lend_storage(std::string&) noexcept override {}
-  void flush() override {}
-  void disconnect(int, std::string_view) override { ended = true; }
-  void drop() override { ended = true; }
-  void resume() override {}
-  void settled() override {}
-
- private:
-  const Settings& settings_;
-  std::mutex mutex_;
-  std::deque<std::function<void()>> posted_;
-  std::atomic<int> failing_{0};
-  std::atomic<int> failed_{0};
-};
-
-class BareSessionTest : public testing::Test {
- protected:
-  static void SetUpTestSuite() {
-    ASSERT_EQ(cfg::register_attribute_types(builtin_schema().attribute_table()), 0);
-  }
-  explicit BareSessionTest(std::size_t ceiling = OutputMeter::kDefaultCeiling)
-      : services{builtin_schema(),    host, authenticator, {}, logs, {}, changes, verifiers, {}, {},
-                 OutputMeter(ceiling)} {
-    settings.error_log_level = "off";
-    logs.open(settings);
-    session = std::make_shared<BareSession>(services, lane, settings);
-  }
-  ~BareSessionTest() override {
-    changes.join();
-    verifiers.join();
-  }
-  void bind_as_root() {
-    session->handle(test::bind(1, kRoot, kSecret));
-    ASSERT_TRUE(session->run_until([this] { return session->idle(); }));
-    session->sent.clear();
-    session->output_is(0);
-  }
-  static Reply result_in(std::string_view bytes) {
-    // SEQUENCE, message id, operation: all short here.
-    Reply reply;
-    reply.id = bytes.at(4);
-    reply.tag = static_cast<unsigned char>(bytes.at(5));
-    reply.code = bytes.at(9);
-    return reply;
-  }
-
-  test::FakeBackend backend;
-  BackendHost host{backend.record(), [](std::string_view) {}};
-  test::ScriptedAuthenticator authenticator;
-  Settings settings;
-  Logs logs;
-  AccessLane lane{logs};
-  asio::thread_pool changes{1};
-  asio::thread_pool verifiers{1};
-  Services services;
-  std::shared_ptr<BareSession> session;
-};
 
 TEST_F(BareSessionTest, BindWhoseOutcomeCannotBePostedIsPickedUpLater) {
   session->fail_to_post(1);

@@ -19,6 +19,7 @@ int FakeBackend::handle(pblock* parameters) {
 
 FakeBackend::FakeBackend() : handlers_(slapi_pblock_new()) {
   current = this;
+  calls_.reserve(4096);  // what the handlers do themselves takes no memory, as a rule
   using namespace parameter;
   slapi_pblock_set(handlers_.get(), bind_function, &handle<bind_function>);
   slapi_pblock_set(handlers_.get(), unbind_function, &handle<unbind_function>);

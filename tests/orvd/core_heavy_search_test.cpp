@@ -80,7 +80,7 @@ class HeavySearch : public test::LoopbackServer {
 
 TEST_F(HeavySearch, LeavesTheOtherClientsOfItsLoopServed) {
   block_searches();
-  start(1);
+  start();
   WireClient heavy(port());
   bind_as_root(heavy);
   heavy.send(test::search(2, kTop, 2));
@@ -94,7 +94,7 @@ TEST_F(HeavySearch, LeavesTheOtherClientsOfItsLoopServed) {
 TEST_F(HeavySearch, LeavesWaitersOfItsLoopToBeToldBusyInTime) {
   settings.operation_wait = 1;
   block_searches();
-  start(1);
+  start();
   WireClient heavy(port());
   bind_as_root(heavy);
   heavy.send(test::search(2, kTop, 1));
@@ -108,7 +108,7 @@ TEST_F(HeavySearch, LeavesWaitersOfItsLoopToBeToldBusyInTime) {
 
 TEST_F(HeavySearch, IsAbandonedByItsClientWhileItRuns) {
   block_searches();
-  start(1);
+  start();
   WireClient client(port());
   bind_as_root(client);
   client.send(test::search(2, kTop, 2));
@@ -157,7 +157,7 @@ class FileSearch : public test::LoopbackServer {
 };
 
 TEST_F(FileSearch, SmallTreeIsSearchedOnTheLoopOnceItIsKnownToBeSmall) {
-  start(1);
+  start();
   WireClient client(port());
   bind_as_root(client);
   EXPECT_EQ(code_of(client, test::search(2, kTop, 0)), 0);
@@ -175,7 +175,7 @@ TEST_F(FileSearch, TimeLimitIsLookedAtForEveryEntry) {
   before_search = [&] {
     while (Clock::now() < begun + 1500ms) std::this_thread::yield();
   };
-  start(1);
+  start();
   WireClient client(port());
   bind_as_root(client);
   EXPECT_EQ(code_of(client, test::search(2, kTop, 2, 0, 1)), 3);
@@ -191,7 +191,7 @@ TEST_F(FileSearch, CutOffByTheStopOfTheServerIsAnsweredUnavailable) {
     while (code == 0 && Clock::now() < end) code = search_once();
     return test::finish_search(parameters, code, 0);
   };
-  start(1);
+  start();
   WireClient client(port());
   bind_as_root(client);
   client.send(test::search(2, kTop, 2));
@@ -274,7 +274,7 @@ class UnreadAnswers : public test::LoopbackServer {
 
 TEST_F(UnreadAnswers, KeepTheConnectionsOtherOperationsFromBeingStarted) {
   answer_much();
-  start(1);
+  start();
   WireClient client(port());
   bind_as_root(client);
   std::string all;
@@ -304,7 +304,7 @@ TEST_F(UnreadAnswers, OfAClientThatLeavesAreForgottenWithItsOtherOperations) {
     return 0;
   };
   answer_much();
-  start(1);
+  start();
   WireClient other(port());
   {
     WireClient client(port());

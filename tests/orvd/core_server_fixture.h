@@ -20,18 +20,22 @@
 namespace orv::server::test {
 
 inline constexpr const char* kRoot = "cn=root";
+inline constexpr const char* kMember = "cn=member";
 inline constexpr const char* kSecret = "secret";
 inline constexpr const char* kTop = "cn=configuration";
+inline constexpr const char* kManageDsaIt = "2.16.840.1.113730.3.4.2";
+inline constexpr int kNotice = 0x78;  // the tag of a notice of disconnection
 
+// Knows the primary administrator and one member, both with kSecret.
 class ScriptedAuthenticator final : public Authenticator {
  public:
-  std::shared_ptr<const Identity> authenticate(std::string_view,
+  std::shared_ptr<const Identity> authenticate(std::string_view name,
                                                std::string_view password) override {
+    ++asked;
     if (password != kSecret) return nullptr;
-    auto identity = std::make_shared<Identity>();
-    identity->bound_dn = "CN=ROOT";
-    identity->authority = 0x0C;
-    return identity;
+    if (name == kRoot) return std::make_shared<Identity>(Identity{"CN=ROOT", 0x0C, 0, ""});
+    if (name == kMember) return std::make_shared<Identity>(Identity{"CN=MEMBER", 0x14, 0x20, ""});
+    return nullptr;
   }
   std::uint64_t generation() const noexcept override { return generation_; }
   bool still_valid(const Identity&) const noexcept override { return valid; }
@@ -42,6 +46,7 @@ class ScriptedAuthenticator final : public Authenticator {
     ++generation_;
   }
   std::atomic<bool> valid{true};
+  std::atomic<int> asked{0};
 
  private:
   std::atomic<std::uint64_t> generation_{1};
@@ -60,7 +65,7 @@ class LoopbackServer : public testing::Test {
   }
   ~LoopbackServer() override { stop(); }
 
-  void start(unsigned loops = 1) {
+  void start() {
     logs.open(settings);
     server.emplace(ServerParts{builtin_schema(),
                                backend.record(),
@@ -70,12 +75,12 @@ class LoopbackServer : public testing::Test {
                                 },
                                 [] { return make_subschema(builtin_schema(), 0); }},
                                logs,
-                               {},
+                               {kManageDsaIt},
                                settings,
                                loops,
                                reload});
     std::string error;
-    ASSERT_TRUE(server->listen({"127.0.0.1"}, 0, error)) << error;
+    ASSERT_TRUE(server->listen(addresses, 0, error)) << error;
     if (reload) server->handle_signals();
     control = std::thread([this] { status = server->serve(); });
   }
@@ -87,8 +92,9 @@ class LoopbackServer : public testing::Test {
   }
   std::uint16_t port() const { return server->port(); }
 
-  void bind_as_root(WireClient& client) {
-    client.send(bind(1, kRoot, kSecret));
+  void bind_as_root(WireClient& client) { bind_as(client, kRoot); }
+  void bind_as(WireClient& client, const char* name) {
+    client.send(bind(1, name, kSecret));
     const std::optional<Reply> reply = client.receive();
     ASSERT_TRUE(reply);
     ASSERT_EQ(reply->code, 0);
@@ -105,14 +111,46 @@ class LoopbackServer : public testing::Test {
     return server->backend().gate().waiting() == count;
   }
 
+  // What handlers refer to outlives the server.
+  Event unbound;
+  std::atomic<int> state_at_unbind{-1};
   FakeBackend backend;
   ScriptedAuthenticator authenticator;
   Settings settings;
   Logs logs;
   std::function<bool(Settings&)> reload;
+  std::vector<std::string> addresses{"127.0.0.1"};
+  unsigned loops = 1;
   std::optional<Server> server;
   std::thread control;
   int status = -1;
+};
+
+// One client's change is inside the backend until `go_on`.
+class BlockedServer : public LoopbackServer {
+ protected:
+  ~BlockedServer() override {
+    go_on.happen();
+    stop();
+  }
+
+  void block() {
+    backend.on_change = [this](pblock* parameters) {
+      entered.happen();
+      go_on.wait();
+      send_ldap_result(connection_of(parameters), operation_of(parameters), 53, nullptr, "");
+      return 53;
+    };
+    start();
+    holder.emplace(port());
+    bind_as_root(*holder);
+    holder->send(delete_entry(2, kTop));
+    ASSERT_TRUE(entered.wait());
+  }
+
+  Event entered;
+  Event go_on;
+  std::optional<WireClient> holder;
 };
 
 }  // namespace orv::server::test

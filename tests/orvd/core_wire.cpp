@@ -153,14 +153,6 @@ Address address_of(const std::string& text, std::uint16_t port) {
 
 }  // namespace
 
-bool host_has_ipv6() {
-  const int socket = ::socket(AF_INET6, SOCK_STREAM, 0);
-  const Address loopback = address_of("::1", 0);
-  const bool has = socket >= 0 && ::bind(socket, loopback.get(), loopback.length) == 0;
-  if (socket >= 0) ::close(socket);
-  return has;
-}
-
 WireClient::WireClient(std::uint16_t port) : WireClient("127.0.0.1", port) {}
 
 WireClient::WireClient(const std::string& address, std::uint16_t port, const std::string& from) {

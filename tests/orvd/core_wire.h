@@ -35,9 +35,6 @@ struct Reply {
   std::string body;
 };
 
-// Whether this host has the IPv6 loopback address.
-bool host_has_ipv6();
-
 class WireClient {
  public:
   explicit WireClient(std::uint16_t port);

@@ -10,6 +10,7 @@
 
 #include "auth/identity_reader.h"
 #include "cfg/dn.h"
+#include "cfg/result_codes.h"
 #include "cfg/text.h"
 #include "slapi/codepage.h"
 #include "slapi/owners.h"
@@ -28,6 +29,7 @@ bool to_file_form(std::string_view password, std::string& form) {
   const int code = xlate_utf8_to_localcp(form.c_str(), &converted, &length);
   const MallocText text(converted);
   cfg::wipe(form);
+  if (code == result::no_memory) throw std::bad_alloc();
   if (code != 0) return false;
   form = text.get();
   cfg::wipe(text.get(), form.size());
@@ -109,7 +111,9 @@ struct Identities::Data {
 
   const IdentityRecord* find(std::string_view name) const {
     std::string normal;
-    if (cfg::normalize_dn(name, normal) != 0 || !may_be_bound(normal)) return nullptr;
+    const int code = cfg::normalize_dn(name, normal);
+    if (code == result::no_memory) throw std::bad_alloc();
+    if (code != 0 || !may_be_bound(normal)) return nullptr;
     return find_normal(normal);
   }
 
@@ -166,14 +170,10 @@ std::shared_ptr<const Identities> Identities::read(const char* config_file,
 }
 
 const Identity* Identities::authenticate(std::string_view name, std::string_view password,
-                                         Verify verify) const noexcept {
+                                         Verify verify) const {
   // RFC 4513, 5.1.2: a name without a password proves nothing, and takes no verification to see.
   if (password.empty()) return nullptr;
-  try {
-    return data_->authenticate(name, password, verify);
-  } catch (...) {
-    return nullptr;
-  }
+  return data_->authenticate(name, password, verify);
 }
 
 bool Identities::still_valid(const Identity& bound) const noexcept {

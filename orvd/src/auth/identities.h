@@ -41,8 +41,8 @@ unsigned role_bits(const std::vector<std::string>& roles) noexcept;
 class Identities {
  public:
   // Reads them with a session of its own. Null on failure, with the cause in `error`. Doubtful
-  // entries (a DN claimed twice, a member DN inside the configuration, second values) are described
-  // in `warnings`, without values of secrets.
+  // entries (a DN claimed twice, a member DN inside the configuration, second values, a sealed
+  // password that does not open) are described in `warnings`, without values of secrets.
   static std::shared_ptr<const Identities> read(const char* config_file, const char* key_stash_file,
                                                 std::string& error,
                                                 std::vector<std::string>& warnings) noexcept;
@@ -54,9 +54,10 @@ class Identities {
   // The identity that `name` (any spelling) and `password` prove; null when they prove none. So
   // that time does not tell which names exist, an unknown name takes the work of the costliest
   // password of all, and a wrong password takes it too where its own is cheap. Only passwords
-  // hashed with different numbers of iterations can be told apart.
+  // hashed with different numbers of iterations can be told apart. Throws std::bad_alloc: want of
+  // memory is no wrong password.
   const Identity* authenticate(std::string_view name, std::string_view password,
-                               Verify verify = cfg::verify_secret) const noexcept;
+                               Verify verify = cfg::verify_secret) const;
 
   // Whether what `bound` (of any snapshot) was granted still stands here: the same entry, bind DN,
   // flags, roles and stored password, and it may bind.

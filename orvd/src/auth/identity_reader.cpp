@@ -129,6 +129,7 @@ class RecordReader {
       record.identity.roles = role_bits(values(entry, kRole));
     }
     record.stored_password = first_value(entry, kind.password_type, record.identity.entry_dn);
+    doubt_sealed_password(record);
     const std::string bound = first_value(entry, kind.dn_type, record.identity.entry_dn);
     if (accept_bound_dn(kind, bound, record)) result_.records.push_back(std::move(record));
     return true;
@@ -172,6 +173,28 @@ class RecordReader {
     std::vector<std::string> all = values(entry, type);
     if (all.size() > 1) warn(entry_dn, std::string("only the first value of ") + type + " counts");
     return all.empty() ? std::string() : std::move(all.front());
+  }
+
+  // Whoever it belongs to would be told no more than that a password is wrong.
+  void doubt_sealed_password(const IdentityRecord& record) {
+    const std::string& entry_dn = record.identity.entry_dn;
+    const cfg::SecretPlace place{record.password_type, entry_dn};
+    std::string clear;
+    const cfg::OpenResult opened =
+        cfg::open_secret(result_.key.get(), record.stored_password, clear);
+    const bool belongs_here =
+        opened != cfg::OpenResult::opened ||
+        cfg::verify_secret(result_.key.get(), place, record.stored_password, clear);
+    cfg::wipe(clear);
+    if (opened == cfg::OpenResult::broken) {
+      warn(entry_dn, std::string(record.password_type) +
+                         (result_.key ? " does not open with the key of the stash file"
+                                      : " is sealed, and no key stash is named") +
+                         ", nobody can bind with it");
+    } else if (!belongs_here) {
+      warn(entry_dn, std::string(record.password_type) +
+                         " was sealed for another entry, nobody can bind with it");
+    }
   }
 
   bool is_group_enabled(_CFGMessage* entry) {

@@ -25,8 +25,8 @@ struct IdentityRecords {
 };
 
 // Reads all of them with one session. Records whose DN is missing, no DN, empty, or inside the
-// configuration itself are left out with a warning. Returns false with the cause in `error`. Throws
-// std::bad_alloc.
+// configuration itself are left out with a warning; so are sealed passwords that do not open, but
+// those records stay. Returns false with the cause in `error`. Throws std::bad_alloc.
 bool read_identity_records(const char* config_file, const char* key_stash_file,
                            IdentityRecords& result, std::string& error,
                            std::vector<std::string>& warnings);

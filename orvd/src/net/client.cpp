@@ -1,12 +1,10 @@
 #include "net/client.h"
 
-#include <netinet/in.h>
-#include <netinet/tcp.h>
-#include <sys/epoll.h>
 #include <sys/socket.h>
 
 #include <algorithm>
-#include <cerrno>
+#include <asio/buffer.hpp>
+#include <asio/error.hpp>
 #include <cstring>
 #include <exception>
 #include <new>
@@ -16,6 +14,8 @@
 
 namespace orv::server {
 namespace {
+
+using asio::ip::tcp;
 
 constexpr std::size_t kReadBytes = 4096;
 // Above this much unread output a client's requests wait.
@@ -33,56 +33,89 @@ std::string too_big(std::int64_t limit) {
   return "message too big: more than " + std::to_string(limit) + " bytes (orv-slapdMaxMessageSize)";
 }
 
+// Nothing can be read or written at the moment.
+bool later(const asio::error_code& error) {
+  return error == asio::error::would_block || error == asio::error::try_again ||
+         error == asio::error::interrupted;
+}
+
 }  // namespace
 
-Client::Client(Loop& loop, Services& services, std::uint64_t number, Descriptor socket,
-               ConnectionCounter::Ticket ticket)
+Client::Client(Loop& loop, Services& services, std::uint64_t number, Descriptor arrived,
+               tcp protocol, ConnectionCounter::Ticket ticket)
     : Session(services, loop.access(), number),
       loop_(loop),
-      socket_(std::move(socket)),
+      arrived_(std::move(arrived)),
+      protocol_(protocol),
+      socket_(loop.context()),
       ticket_(std::move(ticket)),
       in_(kReadBytes) {
   loop_.change_load(1);
 }
 
 void Client::start(const std::string& peer) {
-  const int on = 1;
-  ::setsockopt(socket_.number(), IPPROTO_TCP, TCP_NODELAY, &on, sizeof on);
-  ::setsockopt(socket_.number(), SOL_SOCKET, SO_KEEPALIVE, &on, sizeof on);
+  try {
+    begin(peer);
+  } catch (const std::exception& error) {
+    close(error.what());
+  }
+}
+
+void Client::begin(const std::string& peer) {
+  socket_.assign(protocol_, arrived_.number());
+  arrived_.release();
+  socket_.non_blocking(true);
+  asio::error_code ignored;
+  socket_.set_option(tcp::no_delay(true), ignored);
+  socket_.set_option(tcp::socket::keep_alive(true), ignored);
   loop_.add(self());
   if (std::string* const line = begin_access_line()) {
     line->append("ACCEPT from=").append(peer);
     end_access_line();
   }
-  watched_ = EPOLLIN;
-  if (!loop_.watch(*this, socket_.number(), watched_)) close("cannot be watched");
+  watch();
 }
 
 void Client::post(std::function<void()> work) {
   loop_.post(std::move(work));
 }
 
-void Client::ready(std::uint32_t events) {
-  if (state_ != State::closed && (events & EPOLLOUT) != 0) writable();
-  if (state_ == State::closed || continuing_ || (events & ~std::uint32_t{EPOLLOUT}) == 0) return;
-  if (may_read()) {
-    try {
-      return read();
-    } catch (const std::exception& error) {
-      return close(error.what());
-    }
-  }
-  // Not read from at the moment, but an error is reported all the same, again and again.
-  if ((events & (EPOLLERR | EPOLLHUP)) != 0) close("connection lost");
+// ---- waiting
+
+void Client::watch() noexcept {
+  if (!waiting_ && !continuing_ && may_read())
+    waiting_ = await(tcp::socket::wait_read, &Client::readable);
 }
 
-void Client::watch() {
-  if (state_ == State::closed) return;
-  const std::uint32_t wanted =
-      (may_read() ? std::uint32_t{EPOLLIN} : 0U) | (writing_ ? std::uint32_t{EPOLLOUT} : 0U);
-  if (wanted == watched_) return;
-  watched_ = wanted;
-  if (!loop_.change(*this, socket_.number(), wanted)) close("cannot be watched");
+bool Client::await(tcp::socket::wait_type what, void (Client::*then)()) noexcept {
+  try {
+    socket_.async_wait(what, [self = self(), then](const asio::error_code&) {
+      if (self->state_ == State::closed) return;
+      try {
+        (self.get()->*then)();
+      } catch (const std::exception& error) {
+        self->close(error.what());
+      }
+    });
+    return true;
+  } catch (const std::exception& error) {
+    close(error.what());
+    return false;
+  }
+}
+
+// Whether bytes have come that nobody had the time to read.
+bool Client::unread_in_system() noexcept {
+  asio::error_code failure;
+  return socket_.available(failure) > 0 && !failure;
+}
+
+// For a socket that is not read from at the moment, which would tell.
+bool Client::lost() noexcept {
+  int failure = 0;
+  socklen_t size = sizeof failure;
+  return ::getsockopt(socket_.native_handle(), SOL_SOCKET, SO_ERROR, &failure, &size) == 0 &&
+         failure != 0;
 }
 
 // ---- reading
@@ -92,13 +125,20 @@ bool Client::may_read() const noexcept {
   return state_ == State::open && !busy() && backlog() < kBacklogMark;
 }
 
+void Client::readable() {
+  waiting_ = false;
+  if (!continuing_ && may_read()) read();
+  watch();
+}
+
 void Client::read() {
   make_room();
-  const ssize_t length =
-      ::recv(socket_.number(), in_.data() + end_, in_.size() - end_, MSG_DONTWAIT);
-  if (length > 0) return received(static_cast<std::size_t>(length));
-  if (length == 0) return close("end of stream");
-  if (errno != EAGAIN && errno != EWOULDBLOCK && errno != EINTR) close("connection lost");
+  asio::error_code failure;
+  const std::size_t length =
+      socket_.receive(asio::buffer(in_.data() + end_, in_.size() - end_), 0, failure);
+  if (!failure) return received(length);
+  if (failure == asio::error::eof) return close("end of stream");
+  if (!later(failure)) close("connection lost");
 }
 
 // Keeps room for reading: the message at hand moves to the front, and only what has really arrived
@@ -173,6 +213,7 @@ bool Client::process_one() {
     case FrameState::complete:
       break;
   }
+  last_here_ = frame.length == bytes.size();
   handle(bytes.substr(0, frame.length));
   if (state_ != State::open) return false;
   consume(frame.length);
@@ -183,15 +224,15 @@ void Client::consume(std::size_t length) {
   // A simple bind leaves no password behind in the buffer.
   cfg::wipe(in_.data() + begin_, length);
   begin_ += length;
-  last_activity_ = loop_.now();
+  last_activity_ = Clock::now();
   message_begun_ = last_activity_;
 }
 
 void Client::resume() {
   if (state_ == State::closed) return;
-  last_activity_ = loop_.now();
+  last_activity_ = Clock::now();
   // The client is not to blame for the time in which it was not read from.
-  if ((watched_ & EPOLLIN) == 0) message_begun_ = last_activity_;
+  if (!waiting_) message_begun_ = last_activity_;
   process();
 }
 
@@ -219,16 +260,17 @@ bool gives_up(std::string_view bytes, std::int32_t message_id) {
 // Only looks: what is found here is read and handled in its turn, when the operation has ended.
 bool Client::lost_interest(PendingOperation& operation) noexcept {
   char bytes[512];
-  const ssize_t length = ::recv(socket_.number(), bytes, sizeof bytes, MSG_PEEK | MSG_DONTWAIT);
-  if (length == 0 || (length < 0 && errno != EAGAIN && errno != EINTR)) {
+  asio::error_code failure;
+  const std::size_t length =
+      socket_.receive(asio::buffer(bytes), tcp::socket::message_peek, failure);
+  if (failure && !later(failure)) {
     operation.answer().abandon();
     return true;
   }
   const std::int32_t id = operation.answer().message_id();
   try {
     // What came in one packet with the operation's own message was read along with it.
-    if (gives_up(unread(), id) ||
-        (length > 0 && gives_up({bytes, static_cast<std::size_t>(length)}, id))) {
+    if (gives_up(unread(), id) || (length > 0 && gives_up({bytes, length}, id))) {
       operation.answer().abandon();
     }
   } catch (const std::bad_alloc&) {
@@ -250,7 +292,7 @@ void Client::transmit(std::string& bytes) {
     out_ += bytes;
     bytes.clear();
   }
-  if (!processing_ || backlog() >= kWriteBatch) flush();
+  if (!processing_ || last_here_ || backlog() >= kWriteBatch) flush();
   output_is(backlog());
 }
 
@@ -260,19 +302,22 @@ void Client::lend_storage(std::string& bytes) noexcept {
 }
 
 void Client::flush() {
-  if (state_ == State::closed || writing_) return;
+  if (state_ != State::closed && !writing_) write();
+}
+
+void Client::write() {
   while (backlog() > 0) {
-    const ssize_t sent =
-        ::send(socket_.number(), out_.data() + out_sent_, backlog(), MSG_DONTWAIT | MSG_NOSIGNAL);
-    if (sent > 0) {
-      out_sent_ += static_cast<std::size_t>(sent);
+    asio::error_code failure;
+    const std::size_t sent =
+        socket_.send(asio::buffer(out_.data() + out_sent_, backlog()), 0, failure);
+    if (!failure) {
+      out_sent_ += sent;
       write_progress_ = Clock::now();
-    } else if (sent < 0 && errno == EINTR) {
+    } else if (failure == asio::error::interrupted) {
       continue;
-    } else if (sent < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) {
-      writing_ = true;
-      output_is(backlog());
-      return watch();
+    } else if (later(failure)) {
+      if (!writing_) writing_ = await(tcp::socket::wait_write, &Client::writable);
+      return output_is(state_ == State::closed ? 0 : backlog());
     } else {
       return close("connection lost");
     }
@@ -331,15 +376,16 @@ void Client::drop() {
 // The notice is written. Closing with unread input would make the system reset the connection and
 // throw the notice away, so the client is given time to close, unless the server is stopping.
 void Client::part() {
-  ::shutdown(socket_.number(), SHUT_WR);
+  asio::error_code ignored;
+  socket_.shutdown(tcp::socket::shutdown_send, ignored);
   if (services().stopping.load(std::memory_order_relaxed)) close("server is stopping");
 }
 
 void Client::close(std::string_view why) noexcept {
   if (state_ == State::closed) return;
   state_ = State::closed;
-  loop_.unwatch(socket_.number());
-  socket_.close();
+  asio::error_code ignored;
+  socket_.close(ignored);
   try {
     if (std::string* const line = begin_access_line()) {
       line->append("CLOSE reason=").append(why);
@@ -375,15 +421,23 @@ void Client::sweep(Clock::time_point now) {
   const auto past = [now](Clock::time_point since, std::int64_t seconds) {
     return now - since >= std::chrono::seconds(seconds);
   };
+  // A loop that was busy for long may not have read what came in time.
+  const auto late = [&](Clock::time_point since, std::int64_t seconds) {
+    return past(since, seconds) && !unread_in_system();
+  };
+  if (!waiting_ && lost()) return close("connection lost");
   if (state_ == State::parting) {
     if (now - parting_since_ >= kPartingTime) close("gone");
   } else if (backlog() > 0) {
-    if (past(write_progress_, limits.write_timeout)) close("does not read its answers");
+    if (past(write_progress_, limits.write_timeout)) write();  // it may have read just now
+    if (backlog() > 0 && past(write_progress_, limits.write_timeout))
+      close("does not read its answers");
   } else if (begin_ != end_ && may_read()) {
-    if (past(message_begun_, limits.message_timeout))
+    if (late(message_begun_, limits.message_timeout))
       disconnect(result::unavailable, "message not finished in time");
-  } else if (idle() && limits.idle_timeout > 0 && past(last_activity_, limits.idle_timeout)) {
-    disconnect(result::unavailable, "idle for too long");
+  } else if (idle() && limits.idle_timeout > 0) {
+    if (late(last_activity_, limits.idle_timeout))
+      disconnect(result::unavailable, "idle for too long");
   }
 }
 

@@ -1,5 +1,9 @@
 // A client's TCP connection: its socket, its buffers and its deadlines.
 //
+// Asio says when the socket can be read or written; reading and writing then are plain calls that
+// do not block. An idle connection has no read under way that would own a buffer, and what has not
+// been read yet can be looked at while an operation runs.
+//
 // Bytes are read when some are there and the session can take a message; answers are written at
 // once from the thread that made them, and by the event loop only when the client does not keep up.
 // A client that does not read its answers is not read from either, nor is one while its bind is
@@ -8,6 +12,7 @@
 // Threads: the loop's thread, except construction.
 #pragma once
 
+#include <asio/ip/tcp.hpp>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -24,15 +29,13 @@ namespace orv::server {
 
 class Client final : public Session {
  public:
-  Client(Loop& loop, Services& services, std::uint64_t number, Descriptor socket,
-         ConnectionCounter::Ticket ticket);
+  // `arrived` is a connected socket of `protocol`. Any thread.
+  Client(Loop& loop, Services& services, std::uint64_t number, Descriptor arrived,
+         asio::ip::tcp protocol, ConnectionCounter::Ticket ticket);
   ~Client() override { loop_.change_load(-1); }
 
   // Begins to serve. On the loop's thread.
   void start(const std::string& peer);
-
-  // The loop saw these epoll events on the socket.
-  void ready(std::uint32_t events);
 
   // Looks at the connection's deadlines.
   void sweep(Clock::time_point now);
@@ -57,8 +60,11 @@ class Client final : public Session {
     closed,
   };
 
+  void begin(const std::string& peer);
+
   // ---- reading
   bool may_read() const noexcept;
+  void readable();
   void read();
   void received(std::size_t length);
   void process();
@@ -71,17 +77,25 @@ class Client final : public Session {
   // ---- writing
   std::size_t backlog() const noexcept { return out_.size() - out_sent_; }
   void writable();
+  void write();
   void all_sent();
 
-  // Tells the loop what to wait for, when that has changed.
-  void watch();
+  // ---- waiting
+  // Waits for bytes, when some may be read.
+  void watch() noexcept;
+  // Calls `then` when the socket is ready. False, with the connection closed, without memory.
+  bool await(asio::ip::tcp::socket::wait_type what, void (Client::*then)()) noexcept;
+  bool unread_in_system() noexcept;
+  bool lost() noexcept;
 
   // ---- ending
   void part();
   void close(std::string_view why) noexcept;
 
   Loop& loop_;
-  Descriptor socket_;
+  Descriptor arrived_;  // until it begins
+  const asio::ip::tcp protocol_;
+  asio::ip::tcp::socket socket_;
   ConnectionCounter::Ticket ticket_;
   State state_ = State::open;
 
@@ -89,12 +103,13 @@ class Client final : public Session {
   std::size_t begin_ = 0;
   std::size_t end_ = 0;
   bool processing_ = false;
+  bool last_here_ = false;   // the message at hand is the last one that is here
   bool continuing_ = false;  // a continuation of process() is posted
 
   std::string out_;  // bytes from out_sent_ on are to be written
   std::size_t out_sent_ = 0;
   bool writing_ = false;  // the system takes no more at the moment
-  std::uint32_t watched_ = 0;
+  bool waiting_ = false;  // for bytes
 
   // When each began; meaningful while the condition lasts.
   Clock::time_point last_activity_ = Clock::now();   // nothing outstanding

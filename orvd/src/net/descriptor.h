@@ -1,4 +1,4 @@
-// The owner of a file descriptor.
+// The owner of a file descriptor, for one that is between two owners of another kind.
 #pragma once
 
 #include <unistd.h>
@@ -21,6 +21,8 @@ class Descriptor {
   // -1 when there is none.
   int number() const noexcept { return number_; }
   explicit operator bool() const noexcept { return number_ >= 0; }
+
+  int release() noexcept { return std::exchange(number_, -1); }
 
   void close() noexcept {
     if (number_ >= 0) ::close(std::exchange(number_, -1));

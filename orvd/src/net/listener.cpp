@@ -49,10 +49,14 @@ bool Listeners::open_one(const std::string& address, std::uint16_t port, bool re
                          std::string& error) {
   asio::error_code failure;
   const asio::ip::address parsed = asio::ip::make_address(address, failure);
+  if (failure) {
+    error = "cannot listen on '" + address + "': not an IP address, such as 127.0.0.1 or ::1";
+    return false;
+  }
   auto made = std::make_unique<Listener>(context_);
   tcp::acceptor& acceptor = made->acceptor;
   const tcp::endpoint endpoint(parsed, port);
-  if (!failure) acceptor.open(endpoint.protocol(), failure);
+  acceptor.open(endpoint.protocol(), failure);
   if (!failure) acceptor.set_option(tcp::acceptor::reuse_address(true), failure);
   if (!failure && parsed.is_v6()) acceptor.set_option(asio::ip::v6_only(true), failure);
   if (!failure) acceptor.bind(endpoint, failure);
@@ -122,8 +126,8 @@ void Listeners::accepted(tcp::socket socket) {
   Descriptor descriptor(socket.release(gone));
   if (gone) return;
   Loop& loop = next_loop();
-  const auto client = std::make_shared<Client>(loop, services_, next_number_++,
-                                               std::move(descriptor), std::move(ticket));
+  const auto client = std::make_shared<Client>(
+      loop, services_, next_number_++, std::move(descriptor), peer.protocol(), std::move(ticket));
   loop.post([client, text] { client->start(text); });
 }
 

@@ -1,23 +1,22 @@
-// An event loop: one thread, the connections that are pinned to it, and work that others post.
-//
-// A loop waits for its descriptors itself instead of through Asio's context: level-triggered, so
-// that reading on needs no call to the system, and between two messages of a brisk client it looks
-// for the next one a little longer before it sleeps.
+// An event loop: one thread with an Asio context of its own, the connections that are pinned to it,
+// and work that others post. Between two messages of a brisk client it looks for the next one a
+// little longer before it sleeps.
 //
 // Threads: everything here belongs to the loop's thread, except where a function says otherwise.
+// Sockets of the context are used on that thread only: the context does without locks for them.
 #pragma once
 
+#include <asio/executor_work_guard.hpp>
+#include <asio/io_context.hpp>
 #include <atomic>
 #include <cstdint>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <thread>
 #include <unordered_set>
 #include <vector>
 
 #include "logs.h"
-#include "net/descriptor.h"
 #include "ops/gate.h"
 #include "settings.h"
 
@@ -46,9 +45,8 @@ class Loop {
 
   AccessLane& access() noexcept { return access_; }
 
-  // The time at which the loop last woke. Where a deadline starts, look at the clock instead: what
-  // the loop is doing may have taken long.
-  Clock::time_point now() const noexcept { return now_; }
+  // For the sockets of the clients.
+  asio::io_context& context() noexcept { return context_; }
 
   // Keeps a client.
   void add(std::shared_ptr<Client> client);
@@ -60,43 +58,25 @@ class Loop {
     load_.fetch_add(static_cast<std::size_t>(by), std::memory_order_relaxed);
   }
 
-  // Calls the client's `ready` whenever one of these epoll events holds, errors always included.
-  // False when the system refuses.
-  bool watch(Client& client, int descriptor, std::uint32_t events) noexcept;
-  bool change(Client& client, int descriptor, std::uint32_t events) noexcept;
-  void unwatch(int descriptor) noexcept;
-
   // Ends every connection with a notice of disconnection. Any thread.
   void disconnect_all();
 
  private:
   void run();
-  bool turn();
-  int wait_time();
-  bool fall_asleep() noexcept;
-  bool run_posted();
-  void run_one(const std::function<void()>& work);
-  void sweep_if_due();
-  void wake() noexcept;
+  void turn();
+  void sleep();
+  bool handle_what_is_ready();
+  void sweep_if_due(Clock::time_point now);
 
-  Descriptor epoll_;
-  Descriptor wake_up_;
   Logs& logs_;
   std::shared_ptr<const Settings> settings_;
   AccessLane access_;
-  std::atomic<std::size_t> load_{0};  // before whatever holds clients
+  std::atomic<std::size_t> load_{0};
+  // After what clients use when they go, before what holds clients: its handlers do, too.
+  asio::io_context context_;
+  asio::executor_work_guard<asio::io_context::executor_type> lasting_;
   std::unordered_set<std::shared_ptr<Client>> clients_;
-
-  Clock::time_point now_ = Clock::now();
-  Clock::time_point next_sweep_ = now_;
-  Clock::time_point last_work_{};
-
-  std::mutex mutex_;
-  std::vector<std::function<void()>> posted_;  // under the mutex
-  std::vector<std::function<void()>> running_;
-  std::atomic<bool> work_posted_{false};  // written under the mutex
-  std::atomic<bool> asleep_{false};       // set under the mutex
-  std::atomic<bool> stopping_{false};
+  Clock::time_point next_sweep_ = Clock::now();
   std::thread thread_;
 };
 

@@ -17,6 +17,7 @@ constexpr std::string_view kObjectClass = "objectClass";
 constexpr std::string_view kTargetNotADn = "the target is not a DN";
 
 Refusal refuse(int code, std::string_view what, std::string_view name = "") {
+  if (code == result::no_memory) throw std::bad_alloc();  // that is no fault of the request
   std::string text(what);
   if (!name.empty()) text.append(": ").append(name);
   return {code, std::move(text)};
@@ -206,6 +207,43 @@ bool secret(const Schema& schema, std::string_view attribute) {
   return found && found->secret;
 }
 
+int hex_digit(char c) noexcept {
+  if (c >= '0' && c <= '9') return c - '0';
+  if (c >= 'a' && c <= 'f') return c - 'a' + 10;
+  return c >= 'A' && c <= 'F' ? c - 'A' + 10 : -1;
+}
+
+// The escapes of the decoder's text form undone.
+std::string unescaped(std::string_view text) {
+  std::string value;
+  value.reserve(text.size());
+  for (std::size_t i = 0; i < text.size(); ++i) {
+    const bool escape = text[i] == '\\' && i + 2 < text.size();
+    const int high = escape ? hex_digit(text[i + 1]) : -1;
+    const int low = escape ? hex_digit(text[i + 2]) : -1;
+    const bool whole = high >= 0 && low >= 0;
+    value += whole ? static_cast<char>(high * 16 + low) : text[i];
+    if (whole) i += 2;
+  }
+  return value;
+}
+
+// The file holds classes under one name, so one that is asked for by its number must be too. A
+// pattern stays: it is compared with that name.
+void append_evaluated(const Schema& schema, std::string_view item, const FilterItem& parts,
+                      std::string& out) {
+  std::string_view name;
+  if (parts.value.find('*') == std::string_view::npos &&
+      schema.canonical_attribute(parts.attribute) == kObjectClass)
+    name = schema.canonical_object_class(unescaped(parts.value));
+  if (name.empty()) {
+    out += item;
+  } else {
+    out += parts.before_value;
+    out += name;
+  }
+}
+
 void rewrite_item(const Schema& schema, std::string_view item, FilterUse use, std::string& out) {
   const FilterItem parts = split_item(item);
   const bool presence =
@@ -215,11 +253,12 @@ void rewrite_item(const Schema& schema, std::string_view item, FilterUse use, st
   } else if (use == FilterUse::show) {
     out += secret(schema, parts.attribute) ? parts.before_value : item;
     if (secret(schema, parts.attribute)) out += "***";
-  } else if (hidden_from_members(schema, parts.attribute)) {
+  } else if (use == FilterUse::evaluate_for_administrators &&
+             hidden_from_members(schema, parts.attribute)) {
     // No value assertion on a password is ever true or false.
     out += "orv-slapdAdminPW=-";
   } else {
-    out += item;
+    append_evaluated(schema, item, parts, out);
   }
 }
 

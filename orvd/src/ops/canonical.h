@@ -52,8 +52,10 @@ Refusal make_entry(const Schema& schema, const AddRequest& request, EntryPtr& ma
 // where there are none. 17, 20 and 21 as above; 2 an empty list, or an add without values.
 Refusal make_modifications(const Schema& schema, const ModifyRequest& request, ldapmod*& first);
 
-// What to do with an assertion on the value of an attribute.
+// What to do with an assertion on the value of an attribute. Evaluated ones ask for object classes
+// under their canonical names.
 enum class FilterUse {
+  evaluate,                     // by somebody who sees everything
   evaluate_for_administrators,  // hidden from everybody but the primary administrator: Undefined
   show,                         // values of secret attributes are replaced by asterisks
 };

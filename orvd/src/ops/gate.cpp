@@ -43,7 +43,7 @@ void Gate::leave() noexcept {
     if (queue_.empty()) {
       held_ = false;
       in_a_row_ = 0;
-      emptied_.notify_all();
+      if (closed_) emptied_.notify_all();
       return;
     }
     next.splice(next.begin(), queue_, next_in_turn());

@@ -60,9 +60,9 @@ Refusal PendingOperation::prepare_search(Services& services, SearchRequest& requ
   long_running_ = request.scope != 0;
   // Who may not see an attribute must not learn it by asking for its value.
   const bool sees_all = operation_.authority == authority::primary_administrator;
-  filter_ = malloc_text(sees_all ? request.filter
-                                 : rewrite_filter(services.schema, request.filter,
-                                                  FilterUse::evaluate_for_administrators));
+  filter_ = malloc_text(
+      rewrite_filter(services.schema, request.filter,
+                     sees_all ? FilterUse::evaluate : FilterUse::evaluate_for_administrators));
   names_ = canonical_names(services.schema, request.attributes);
   scope_ = request.scope;
   wants_worker_ = long_running_ && services.search_cost.may_be_long(request.filter.size());

@@ -79,9 +79,9 @@ std::int64_t stricter(std::int64_t a, std::int64_t b) {
 }
 
 // NAME dn="...".
-std::string describe(std::string_view name, std::string_view dn) {
+std::string describe(std::string_view name, std::string_view dn, std::string_view key = " dn=") {
   std::string text(name);
-  text += " dn=";
+  text += key;
   append_client_text(text, dn);
   return text;
 }
@@ -95,6 +95,26 @@ std::string describe_search(const Schema& schema, const SearchRequest& request) 
   append_client_text(text, rewrite_filter(schema, logged_part(request.filter), FilterUse::show));
   if (request.filter.size() > kLoggedBytes) text += "...";
   return text;
+}
+
+// What stands in the access log for a request that is answered on the spot.
+std::string describe(const Schema& schema, const Request& request) {
+  struct Describe {
+    const Schema& schema;
+    std::string operator()(const BindRequest&) const { return "BIND"; }
+    std::string operator()(const UnbindRequest&) const { return "UNBIND"; }
+    std::string operator()(const AbandonRequest&) const { return "ABANDON"; }
+    std::string operator()(const SearchRequest& r) const { return describe_search(schema, r); }
+    std::string operator()(const AddRequest& r) const { return describe("ADD", r.dn); }
+    std::string operator()(const DeleteRequest& r) const { return describe("DELETE", r.dn); }
+    std::string operator()(const ModifyRequest& r) const { return describe("MODIFY", r.dn); }
+    std::string operator()(const ModifyDnRequest& r) const { return describe("MODIFYDN", r.dn); }
+    std::string operator()(const CompareRequest& r) const { return describe("COMPARE", r.dn); }
+    std::string operator()(const ExtendedRequest& r) const {
+      return describe("EXTENDED", r.oid, " oid=");
+    }
+  };
+  return std::visit(Describe{schema}, request);
 }
 
 void wipe_credentials(BindRequest& request) noexcept {
@@ -166,16 +186,19 @@ void Session::take(Message& message) {
     refusal = {result::unavailable_critical_extension, "critical control not supported"};
   if (auto* bind = std::get_if<BindRequest>(&request))
     return receive_bind(id, *bind, std::move(refusal));
-  if (refusal)
-    return respond(id, answer_tag, refusal.code, refusal.text, operation_name(answer_tag));
+  if (refusal) return respond(id, answer_tag, refusal.code, refusal.text, described(request));
   if (auto* wanted = std::get_if<SearchRequest>(&request)) return search(id, *wanted);
   if (const auto* wanted = std::get_if<AddRequest>(&request)) return add(id, *wanted);
   if (const auto* wanted = std::get_if<DeleteRequest>(&request)) return remove(id, *wanted);
   if (const auto* wanted = std::get_if<ModifyRequest>(&request)) return modify(id, *wanted);
   if (std::holds_alternative<ExtendedRequest>(request))
     return respond(id, answer_tag, result::protocol_error, "extended operation not supported",
-                   operation_name(answer_tag));
-  respond(id, answer_tag, result::unwilling_to_perform, kNotOffered, operation_name(answer_tag));
+                   described(request));
+  respond(id, answer_tag, result::unwilling_to_perform, kNotOffered, described(request));
+}
+
+std::string Session::described(const Request& request) const {
+  return services_.logs.access_enabled() ? describe(services_.schema, request) : std::string();
 }
 
 bool Session::control_is_unknown(const Message& message) const {
@@ -194,7 +217,9 @@ bool Session::busy() const noexcept {
 
 Session::Target Session::find_target(std::string_view dn, std::string& normal) const {
   if (dn.empty()) return Target::root_dse;
-  if (cfg::normalize_dn(dn, normal) != 0) return Target::not_a_dn;
+  const int code = cfg::normalize_dn(dn, normal);
+  if (code == result::no_memory) throw std::bad_alloc();
+  if (code != 0) return Target::not_a_dn;
   if (normal.empty()) return Target::root_dse;
   if (cfg::normal_dn_is_at_or_below(normal, kSuffix)) return Target::configuration;
   return normal == kSubschemaNormalDn ? Target::subschema : Target::nothing;
@@ -206,9 +231,9 @@ void Session::search(std::int32_t id, SearchRequest& request) {
   std::string normal;
   const Target target = find_target(request.base, normal);
   if (target == Target::root_dse && request.scope == 0)
-    return search_published(id, request, services_.publications.root_dse(), "");
+    return search_published(id, request, services_.publications.root_dse());
   if (target == Target::subschema)
-    return search_published(id, request, services_.publications.subschema(), kSubschemaDn);
+    return search_published(id, request, services_.publications.subschema());
 
   const OperationPtr operation =
       make_operation(id, tag::search_done, stricter(settings().time_limit, request.time_limit),
@@ -224,7 +249,7 @@ void Session::search(std::int32_t id, SearchRequest& request) {
 }
 
 void Session::search_published(std::int32_t id, const SearchRequest& request,
-                               const std::shared_ptr<const entry>& published, std::string_view dn) {
+                               const std::shared_ptr<const entry>& published) {
   Answer answer(id, tag::search_done, {});
   const Clock::time_point started = Clock::now();
   int code = published ? result::success : result::no_memory;
@@ -234,9 +259,10 @@ void Session::search_published(std::int32_t id, const SearchRequest& request,
     code = answer.entry(*published, names.get(), request.types_only, nullptr);
   }
   answer.result(code, "", "");
-  transmit(answer.bytes());
+  transmit_answer(answer);
   if (services_.logs.access_enabled())
-    log_result(id, describe("SEARCH", dn), answer.code(), answer.entries(), started);
+    log_result(id, describe_search(services_.schema, request), answer.code(), answer.entries(),
+               started);
 }
 
 // ---- changes
@@ -423,10 +449,10 @@ void Session::complete(const OperationPtr& operation) {
   }
   const Answer& answer = operation->answer();
   if (answer.code() == result::operations_error && services_.note_failure) services_.note_failure();
-  log_result(answer.message_id(), operation->log_text,
-             answer.abandoned() ? kAbandoned : answer.code(), answer.entries(),
+  const int code = answer.abandoned() ? kAbandoned : answer.code();
+  deliver(*operation);  // what follows is done while the client reads
+  log_result(answer.message_id(), operation->log_text, code, answer.entries(),
              operation->started());
-  deliver(*operation);
   start_held_later();
   if (bind_ && !gone_) try_bind();
   settle_if_done();
@@ -440,7 +466,7 @@ void Session::deliver(PendingOperation& operation) {
   } const settle{output_, operation.charged()};
   if (gone_ || operation.answer().abandoned()) return;
   output_.queued(operation.charged());
-  transmit(operation.answer().bytes());
+  transmit_answer(operation.answer());
 }
 
 // ---- waiting for the client to read
@@ -506,16 +532,21 @@ void Session::pick_up_stranded() {
 }
 
 void Session::respond(std::int32_t id, int response_tag, int code, std::string_view text,
-                      std::string_view what, std::string_view response_name) {
+                      std::string_view what) {
   Answer answer(id, response_tag, {});
   ResultAnswer result{};
   result.code = code;
   result.text = text;
-  result.response_name = response_name;
   const Clock::time_point started = Clock::now();
   answer.result(result);
-  transmit(answer.bytes());
+  transmit_answer(answer);
   log_result(id, what, code, 0, started);
+}
+
+// A client that would wait for an answer that could not be made has its connection ended instead.
+void Session::transmit_answer(Answer& answer) {
+  if (!answer.answered()) throw std::bad_alloc();
+  transmit(answer.bytes());
 }
 
 // One that was given up does not count: its client does not wait for it any more.
@@ -592,7 +623,12 @@ void Session::try_bind() {
   if (!outstanding_.empty() || bind_->started) return;
   bind_->started = true;
   become(nullptr);
-  start_bind();
+  try {
+    start_bind();
+  } catch (...) {
+    bind_.reset();  // nothing is outstanding on a connection that ends for this
+    throw;
+  }
 }
 
 void Session::start_bind() {
@@ -684,7 +720,7 @@ void Session::finish_bind(int code, std::string_view text,
   identity_checked_ = bind->generation;
   Answer answer(bind->message_id, tag::bind_response, {});
   answer.result(code, "", text);
-  transmit(answer.bytes());
+  transmit_answer(answer);
 }
 
 void Session::become(std::shared_ptr<const Identity> identity) noexcept {

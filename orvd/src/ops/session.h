@@ -95,6 +95,8 @@ class Session : public OperationHome, public std::enable_shared_from_this<Sessio
   void take(Message& message);
   OperationPtr outstanding(std::int32_t message_id) const noexcept;
   bool control_is_unknown(const Message& message) const;
+  // For the access log; "" when that is off.
+  std::string described(const Request& request) const;
   void abandon(std::int32_t message_id);
 
   void search(std::int32_t id, SearchRequest& request);
@@ -102,7 +104,7 @@ class Session : public OperationHome, public std::enable_shared_from_this<Sessio
   void remove(std::int32_t id, const DeleteRequest& request);
   void modify(std::int32_t id, const ModifyRequest& request);
   void search_published(std::int32_t id, const SearchRequest& request,
-                        const std::shared_ptr<const entry>& published, std::string_view dn);
+                        const std::shared_ptr<const entry>& published);
 
   enum class Target { root_dse, subschema, configuration, nothing, not_a_dn };
   Target find_target(std::string_view dn, std::string& normal) const;
@@ -121,6 +123,7 @@ class Session : public OperationHome, public std::enable_shared_from_this<Sessio
   void take_step_or_end(const OperationPtr& operation) noexcept;
   void complete(const OperationPtr& operation);
   void deliver(PendingOperation& operation);
+  void transmit_answer(Answer& answer);
   bool give_up(const OperationPtr& operation) noexcept;
   void hold(const OperationPtr& operation);
   void start_held();
@@ -128,7 +131,7 @@ class Session : public OperationHome, public std::enable_shared_from_this<Sessio
   void pick_up_stranded();
   void end_for_want_of_memory() noexcept;
   void respond(std::int32_t id, int response_tag, int code, std::string_view text,
-               std::string_view what, std::string_view response_name = {});
+               std::string_view what);
   // `code` kAbandoned: there was no result.
   void log_result(std::int32_t id, std::string_view what, int code, std::int64_t entries,
                   Clock::time_point started) noexcept;

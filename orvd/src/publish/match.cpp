@@ -1,10 +1,12 @@
 #include "publish/match.h"
 
 #include <algorithm>
+#include <new>
 #include <optional>
 #include <string>
 #include <vector>
 
+#include "cfg/result_codes.h"
 #include "slapi/schema.h"
 
 namespace orv::server {
@@ -51,7 +53,9 @@ Truth equality(const entry& e, const std::string& type, std::string_view asserti
   const attr* attribute = attribute_of(e, type);
   if (attribute == nullptr) return Truth::no;
   const berval counted{value->size(), value->data()};
-  return value_find(attribute, &counted, attribute->syntax, 1) == 0 ? Truth::yes : Truth::no;
+  const int found = value_find(attribute, &counted, attribute->syntax, 1);
+  if (found == result::no_memory) throw std::bad_alloc();
+  return found == 0 ? Truth::yes : Truth::no;
 }
 
 // "type=value" and its relatives, without the parentheses.
@@ -144,12 +148,8 @@ class Evaluation {
 
 }  // namespace
 
-bool entry_matches(const entry& e, std::string_view filter) noexcept {
-  try {
-    return Evaluation(e).of(filter) == Truth::yes;
-  } catch (...) {
-    return false;
-  }
+bool entry_matches(const entry& e, std::string_view filter) {
+  return Evaluation(e).of(filter) == Truth::yes;
 }
 
 }  // namespace orv::server

@@ -14,7 +14,7 @@
 namespace orv::server {
 
 // `filter` is RFC 4515 text with its outer parentheses, as the decoder writes it. False also when
-// it cannot be read.
-bool entry_matches(const entry& e, std::string_view filter) noexcept;
+// it cannot be read. Throws std::bad_alloc.
+bool entry_matches(const entry& e, std::string_view filter);
 
 }  // namespace orv::server

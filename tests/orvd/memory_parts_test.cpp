@@ -1,0 +1,280 @@
+// Every allocation on the way of a request fails once: what was asked is refused with 90, or the
+// connection ends; nobody waits for an answer that never comes, nothing leaks, and the gate is open
+// again. A program of its own, because it replaces the allocation functions of the process.
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <functional>
+#include <new>
+#include <string>
+#include <vector>
+
+#include "../slapi/failing_allocation.h"
+#include "auth/identities.h"
+#include "core_bare_session.h"
+#include "ops/canonical.h"
+#include "protocol/decoder.h"
+#include "protocol/encoder.h"
+#include "publish/match.h"
+#include "server_entries.h"
+
+namespace orv::server {
+namespace {
+
+using orv::test::AllocationFault;
+using test::tlv;
+
+class WithSchema : public testing::Test {
+ protected:
+  static void SetUpTestSuite() {
+    ASSERT_EQ(cfg::register_attribute_types(builtin_schema().attribute_table()), 0);
+  }
+  const Schema& schema = builtin_schema();
+};
+
+// Calls `once` with its first allocation failing, then its second, until none is left to fail, and
+// `check` after each, with whether one failed. Nothing of what `once` made may stay.
+void fail_each(const std::function<void(bool hit)>& check, const std::function<void()>& once) {
+  constexpr long kMost = 100000;
+  once();  // what is made at the first use only
+  for (long n = 1; n < kMost; ++n) {
+    SCOPED_TRACE("allocation " + std::to_string(n));
+    AllocationFault fault(n);
+    once();
+    fault.disarm();
+    EXPECT_EQ(fault.balance(), 0);
+    check(fault.hit());
+    if (!fault.hit()) return;
+    if (testing::Test::HasFailure()) return;
+  }
+  FAIL() << "it never succeeds";
+}
+
+std::vector<std::string> requests() {
+  const std::string dn = tlv(0x04, "cn=a name that is not short,cn=configuration");
+  const std::string filter = tlv(
+      0xA0, tlv(0xA3, tlv(0x04, "description") + tlv(0x04, "a value that is longer than others")) +
+                tlv(0xA2, tlv(0x87, "objectClass")));
+  const std::string search =
+      tlv(0x63, dn + tlv(0x0A, "\x02") + tlv(0x0A, std::string(1, '\0')) + test::integer(0) +
+                    test::integer(0) + tlv(0x01, std::string(1, '\0')) + filter +
+                    tlv(0x30, tlv(0x04, "a requested attribute name")));
+  return {
+      test::bind(1, "cn=a name that is not short", "a password that is not short"),
+      test::sasl_bind(2, "A-MECHANISM-THAT-IS-NOT-SHORT"),
+      test::message(3, search, test::control("2.16.840.1.113730.3.4.2", true)),
+      test::add_entry(4, "cn=a name that is not short,cn=configuration", "description", "value"),
+      test::delete_entry(5, "cn=a name that is not short,cn=configuration"),
+      test::modify(6, "cn=a name that is not short,cn=configuration", "description", "value"),
+      test::compare(7, "cn=a name that is not short,cn=configuration"),
+      test::message(8, tlv(0x6C, dn + dn + tlv(0x01, "\xFF"))),
+      test::extended(9, "1.3.6.1.4.1.1466.20037.1.2.3.4.5")};
+}
+
+class MemoryOfAMessage : public WithSchema, public testing::WithParamInterface<std::string> {};
+
+TEST_P(MemoryOfAMessage, ThatCannotBeDecodedIsRefusedWith90) {
+  DecodeState state = DecodeState::fatal;
+  int code = 0;
+  fail_each(
+      [&](bool hit) {
+        EXPECT_EQ(state == DecodeState::decoded, !hit);
+        EXPECT_EQ(code, hit ? 90 : 0);
+      },
+      [&] {
+        Message message;
+        const Decoded decoded = decode(GetParam(), {}, message);
+        state = decoded.state;
+        code = decoded.code;
+      });
+}
+
+INSTANTIATE_TEST_SUITE_P(EachRequest, MemoryOfAMessage, testing::ValuesIn(requests()));
+
+using MemoryOfAnAnswer = WithSchema;
+
+TEST_F(MemoryOfAnAnswer, EntryThatCannotBeEncodedLeavesWhatIsThereAsItWas) {
+  const EntryPtr e = make_entry("cn=configuration");
+  add_values(e, "description", {std::string(400, 'x'), "y"});
+  AttributeSelection all;
+  ASSERT_TRUE(all.assign(nullptr));
+  bool encoded = false;
+  bool kept = false;
+  fail_each([&](bool hit) { EXPECT_TRUE(hit ? !encoded && kept : encoded); },
+            [&] {
+              std::string out = "before";
+              encoded = encode_entry(out, 1, *e, all, false, nullptr);
+              kept = out == "before";
+            });
+}
+
+TEST_F(MemoryOfAnAnswer, SelectionThatCannotBeMadeSaysSo) {
+  Names names{"description", "a requested attribute that is not known", "*"};
+  bool assigned = false;
+  fail_each([&](bool hit) { EXPECT_EQ(assigned, !hit); },
+            [&] {
+              AttributeSelection selection;
+              assigned = selection.assign(names.get());
+            });
+}
+
+// ---- what handlers are given
+
+class MemoryOfARequest : public WithSchema {
+ protected:
+  // `make` tells whether it made what it was to make. It throws std::bad_alloc when an allocation
+  // failed that it cannot do without.
+  static void expect_throws(const std::function<bool()>& make) {
+    bool threw = false;
+    bool made = false;
+    fail_each(
+        [&](bool hit) {
+          EXPECT_TRUE(made || threw);
+          EXPECT_TRUE(hit || !threw);
+        },
+        [&] {
+          threw = false;
+          made = false;
+          try {
+            made = make();
+          } catch (const std::bad_alloc&) {
+            threw = true;
+          }
+        });
+  }
+};
+
+TEST_F(MemoryOfARequest, EntryIsMadeOrMemoryIsSaidToBeShort) {
+  const AddRequest request{"cn=a name that is not short,cn=configuration",
+                           {{"cn", {"another value"}}, {"objectClass", {"2.5.6.0", "container"}}}};
+  expect_throws([&] {
+    EntryPtr made;
+    return make_entry(schema, request, made).code == 0;
+  });
+}
+
+TEST_F(MemoryOfARequest, ModificationsAreMadeOrMemoryIsSaidToBeShort) {
+  const ModifyRequest request{"cn=configuration",
+                              {{0, {"description", {"one", "two"}}}, {1, {"cn", {}}}}};
+  expect_throws([&] {
+    ldapmod* first = nullptr;
+    const bool good = make_modifications(schema, request, first).code == 0;
+    free_modifications(first);
+    return good;
+  });
+}
+
+TEST_F(MemoryOfARequest, FilterAndNamesAreMadeOrMemoryIsSaidToBeShort) {
+  expect_throws([&] {
+    rewrite_filter(schema, "(&(objectClass=2.5.6.0)(cn=a value that is not short at all))",
+                   FilterUse::evaluate_for_administrators);
+    return canonical_names(schema, {"cn", "a requested attribute that is not known"}) != nullptr;
+  });
+}
+
+TEST_F(MemoryOfARequest, FilterOnAnEntryOfTheServersOwnIsDecidedOrMemoryIsSaidToBeShort) {
+  const EntryPtr e = make_entry("cn=subschema");
+  add_values(e, "cn", {"subschema that is not short"});
+  expect_throws([&] { return entry_matches(*e, "(&(cn=*)(cn=subschema that is not short))"); });
+}
+
+// ---- who binds
+
+class MemoryOfABind : public MemoryOfARequest {
+ protected:
+  void SetUp() override {
+    std::string pattern = testing::TempDir() + "/orv-memory-XXXXXX";
+    ASSERT_NE(mkdtemp(pattern.data()), nullptr);
+    folder_ = pattern;
+    std::ofstream(config()) << "dn: cn=configuration\nobjectClass: orv-slapdTop\n"
+                               "cn: configuration\norv-slapdAdminDN: cn=a name that is not short\n"
+                               "orv-slapdAdminPW: a password that is not short\n";
+  }
+  void TearDown() override { std::filesystem::remove_all(folder_); }
+  std::string config() const { return folder_ + "/config.ldif"; }
+
+  std::string folder_;
+  std::string error_;
+  std::vector<std::string> warnings_;
+};
+
+TEST_F(MemoryOfABind, WantOfItIsNoWrongPassword) {
+  const auto identities = Identities::read(config().c_str(), "", error_, warnings_);
+  ASSERT_TRUE(identities) << error_;
+  const Identities::Verify compare = [](const cfg::Key*, cfg::SecretPlace, std::string_view stored,
+                                        std::string_view clear) noexcept {
+    return stored == clear;
+  };
+  expect_throws([&] {
+    return identities->authenticate("CN = A name that is not short", "a password that is not short",
+                                    compare) != nullptr;
+  });
+}
+
+// ---- the session
+
+class MemoryOfASession : public test::BareSessionTest,
+                         public testing::WithParamInterface<std::string> {
+ protected:
+  bool gate_is_open() {
+    class NoWaiter final : public GateWaiter {
+      void gate_decided(Verdict) noexcept override {}
+    };
+    const bool open = host.gate().enter(std::make_shared<NoWaiter>(), Clock::time_point::max()) ==
+                      Gate::Entry::inside;
+    if (open) host.gate().leave();
+    return open;
+  }
+  std::shared_ptr<test::BareSession> fresh_session(bool bound) {
+    session = std::make_shared<test::BareSession>(services, lane, settings);
+    if (bound) bind_as_root();
+    return session;
+  }
+};
+
+// A client is answered or its connection ends; its socket's side ends it when `handle` throws.
+TEST_P(MemoryOfASession, AnswersOrEnds) {
+  backend.on_search = [](pblock* parameters) { return test::finish_search(parameters, 0, 0); };
+  for (const bool bound : {false, true}) {
+    for (long n = 1;; ++n) {
+      SCOPED_TRACE("allocation " + std::to_string(n) + (bound ? ", bound" : ", anonymous"));
+      const auto tried = fresh_session(bound);
+      bool threw = false;
+      AllocationFault fault(n);
+      try {
+        tried->handle(GetParam());
+      } catch (const std::bad_alloc&) {
+        threw = true;
+      }
+      fault.disarm();
+      const bool hit = fault.hit();
+      const auto heard = [&] { return threw || tried->ended || !tried->sent.empty(); };
+      EXPECT_TRUE(tried->run_until(heard));
+      EXPECT_TRUE(hit || !threw);
+      tried->client_left();
+      EXPECT_TRUE(tried->run_until([&] { return tried->idle(); }));
+      EXPECT_TRUE(gate_is_open());
+      if (!hit || HasFailure()) break;
+    }
+  }
+}
+
+std::vector<std::string> messages() {
+  return {test::bind(2, test::kRoot, test::kSecret),
+          test::bind(2, "cn=somebody,cn=configuration", "a password that is not short"),
+          test::search(2, test::kTop, 2),
+          test::search(2, "cn=a name that is not short,cn=configuration"),
+          test::add_entry(2, "cn=x,cn=configuration", "cn", "x"),
+          test::modify(2, test::kTop, "description", "a value that is not short at all"),
+          test::delete_entry(2, "cn=a name that is not short,cn=configuration"),
+          test::compare(2, "cn=a name that is not short,cn=configuration"),
+          test::extended(2, "1.3.6.1.4.1.1466.20037"),
+          test::message(2, tlv(0x42, "wrong"))};
+}
+
+INSTANTIATE_TEST_SUITE_P(EachRequest, MemoryOfASession, testing::ValuesIn(messages()));
+
+}  // namespace
+}  // namespace orv::server
