@@ -32,7 +32,8 @@ add_compile_options("-fmacro-prefix-map=${CMAKE_SOURCE_DIR}/=")
 add_link_options(-Wl,-z,relro,-z,now)
 
 if(ORV_SANITIZE)
-  add_compile_options(-fsanitize=${ORV_SANITIZE} -fno-omit-frame-pointer
+  # Instrumented code is compiled for traces that can be read, in half the time.
+  add_compile_options(-O1 -g1 -fsanitize=${ORV_SANITIZE} -fno-omit-frame-pointer
                       -fno-sanitize-recover=all)
   add_link_options(-fsanitize=${ORV_SANITIZE})
 endif()
