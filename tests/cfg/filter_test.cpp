@@ -246,9 +246,9 @@ TEST_F(UnreadableFilterTest, IsAProtocolError) {
 TEST_F(UnreadableFilterTest, NestingIsLimited) {
   const CfgSession session = open(kEntry);
   const auto nested = [](int depth) {
-    std::string filter = "(cn=top)";
-    for (int i = 1; i < depth; ++i) filter = "(&" + filter + ")";
-    return filter;
+    std::string filter;
+    for (int i = 1; i < depth; ++i) filter += "(&";
+    return filter + "(cn=top)" + std::string(static_cast<std::size_t>(depth - 1), ')');
   };
   EXPECT_EQ(search_code(session, "cn=top+ou=unit,o=home", 0, nested(64).c_str()), 0);
   EXPECT_EQ(search_code(session, "cn=top+ou=unit,o=home", 0, nested(65).c_str()), 2);
