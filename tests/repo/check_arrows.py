@@ -2,6 +2,9 @@
 
     orvd, orvcfg  ->  slapi  ->  cfg        back-config  ->  slapi, cfg
     orvd  ->  back-config  through dlopen only
+
+Also that nothing of ours changes the process's locale: rules compare with strcasecmp, and under a
+Turkish locale "ConfigDB" and "CONFIGDB" would be two names.
 """
 
 import os
@@ -48,6 +51,8 @@ LINKS = {
     "bin/orvcfg": ([r"libslapi\.so", r"libcfg\.so"], ["libcfg.so"]),
 }
 
+FORBIDDEN_CALLS = {"setlocale", "uselocale"}
+
 INCLUDE = re.compile(r'^\s*#\s*include\s*([<"])([^>"]+)[>"]', re.MULTILINE)
 
 
@@ -91,6 +96,12 @@ def needed_libraries(binary):
     return re.findall(r"\(NEEDED\).*\[(.*)\]", text)
 
 
+def imported_functions(binary):
+    text = subprocess.run(["nm", "-D", "-P", "--undefined-only", binary], check=True,
+                          capture_output=True, text=True).stdout
+    return {line.split()[0].split("@")[0] for line in text.splitlines() if line}
+
+
 def link_findings(build):
     found = []
     for binary, (allowed, required) in LINKS.items():
@@ -98,6 +109,8 @@ def link_findings(build):
         if not os.path.exists(path):
             found.append(f"{binary}: was not built")
             continue
+        found += [f"{binary}: calls {name}"
+                  for name in sorted(imported_functions(path) & FORBIDDEN_CALLS)]
         needed = needed_libraries(path)
         for library in needed:
             if not any(re.fullmatch(pattern, library) for pattern in [RUNTIME, *allowed]):

@@ -69,6 +69,7 @@ class Arrows(Tree):
         found = check_arrows.link_findings(self.top)
         self.assertIn("lib/libback-config.so: does not link libslapi.so", found)
         self.assertIn("bin/orvd: was not built", found)
+        self.assertIn("lib/libback-config.so: calls setlocale", found)
 
     def test_each_binary_may_link_what_the_table_says_only(self):
         allowed = check_arrows.LINKS["lib/libback-config.so"][0]
