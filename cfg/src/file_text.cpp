@@ -100,10 +100,6 @@ void RecycledMemory::release() noexcept {
 
 namespace {
 
-FileIdentity identity_of(const struct stat& status) noexcept {
-  return {status.st_dev, status.st_ino, status.st_size, status.st_mtim};
-}
-
 std::string system_cause(const char* what, int error) {
   std::array<char, 128> buffer{};
   return std::string(what) + ": " + ::strerror_r(error, buffer.data(), buffer.size());
@@ -184,8 +180,19 @@ FileText::Outcome FileText::read_open(int file, std::string& cause) {
 }
 
 void FileText::assign(const char* text, std::size_t size) {
+  const std::string_view whole(text, size);
+  assign({&whole, 1});
+}
+
+void FileText::assign(std::span<const std::string_view> pieces) {
+  std::size_t size = 0;
+  for (const std::string_view piece : pieces) size += piece.size();
   memory_.reserve(size + kPadding, 0);
-  if (size > 0) std::memcpy(memory_.data(), text, size);
+  auto* to = static_cast<char*>(memory_.data());
+  for (const std::string_view piece : pieces) {
+    if (!piece.empty()) std::memcpy(to, piece.data(), piece.size());
+    to += piece.size();
+  }
   terminate(size);
 }
 

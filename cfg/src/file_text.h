@@ -1,11 +1,14 @@
 // The text of a file, read whole into private memory.
 #pragma once
 
+#include <sys/stat.h>
 #include <sys/types.h>
 
 #include <cstddef>
 #include <ctime>
+#include <span>
 #include <string>
+#include <string_view>
 
 namespace orv::cfg {
 
@@ -58,6 +61,10 @@ struct FileIdentity {
   }
 };
 
+inline FileIdentity identity_of(const struct stat& status) noexcept {
+  return {status.st_dev, status.st_ino, status.st_size, status.st_mtim};
+}
+
 class FileText {
  public:
   static constexpr std::size_t kMaxSize = std::size_t{1} << 30;
@@ -71,6 +78,8 @@ class FileText {
 
   // Takes a text that is in memory already.
   void assign(const char* text, std::size_t size);
+  // Takes pieces of text, none of them in this object, one after the other.
+  void assign(std::span<const std::string_view> pieces);
 
   [[nodiscard]] const char* begin() const noexcept {
     return static_cast<const char*>(memory_.data());
@@ -78,6 +87,7 @@ class FileText {
   [[nodiscard]] const char* end() const noexcept { return begin() + size_; }
   [[nodiscard]] std::size_t size() const noexcept { return size_; }
   [[nodiscard]] const FileIdentity& identity() const noexcept { return identity_; }
+  void set_identity(const FileIdentity& identity) noexcept { identity_ = identity; }
 
  private:
   enum class Outcome { read, changed, failed };

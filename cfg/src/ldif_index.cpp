@@ -126,27 +126,10 @@ constexpr const char* kSecretInDn = "a secret attribute in a DN";
 constexpr const char* kVersion = "only version 1 of LDIF is known";
 constexpr const char* kClassSpelling = "the object class must be written as ";
 
-constexpr std::string_view kDn = "dn";
-constexpr std::string_view kChangeType = "changetype";
-constexpr std::string_view kControl = "control";  // the first line of some change records
 constexpr std::string_view kObjectClass = "objectClass";
 
 bool is_name(std::string_view text, std::string_view name) noexcept {
   return text.size() == name.size() && equals_ignore_ascii_case(text, name);
-}
-
-bool is_oid(std::string_view type) noexcept {
-  if (type.empty() || !is_ascii_digit(type.front()) || !is_ascii_digit(type.back())) return false;
-  if (type.find('.') == std::string_view::npos) return false;
-  if (type.find("..") != std::string_view::npos) return false;
-  return std::all_of(type.begin(), type.end(),
-                     [](char c) { return is_ascii_digit(c) || c == '.'; });
-}
-
-bool is_descriptor(std::string_view type) noexcept {
-  if (type.empty() || !is_ascii_letter(type.front())) return false;
-  return std::all_of(type.begin(), type.end(),
-                     [](char c) { return is_ascii_letter(c) || is_ascii_digit(c) || c == '-'; });
 }
 
 // Where byte `offset` of the unfolded value stands in the text.
@@ -214,7 +197,8 @@ class LdifIndex::Builder {
   // whose values are names.
   [[nodiscard]] NameFilter special_names() const noexcept {
     NameFilter names = lookup_.secret_aliases();
-    for (const std::string_view name : {kDn, kChangeType, kControl, kObjectClass}) names.add(name);
+    for (const std::string_view name : {kDnName, kChangeTypeName, kControlName, kObjectClass})
+      names.add(name);
     if (object_class_ != nullptr) {
       for (const std::string& alias : object_class_->aliases) names.add(alias);
     }
@@ -353,16 +337,16 @@ class LdifIndex::Builder {
 
   bool check_line(const char* at, const AttributeLine& line, bool first) {
     if (!check_type(at, line)) return false;
-    if (is_name(line.type, kDn)) return refuse(line_start(at), kSecondDn);
-    if (is_name(line.type, kChangeType)) return refuse(line_start(at), kChangeRecord);
-    if (first && is_name(line.type, kControl)) return refuse(line_start(at), kChangeRecord);
+    if (is_name(line.type, kDnName)) return refuse(line_start(at), kSecondDn);
+    if (is_name(line.type, kChangeTypeName)) return refuse(line_start(at), kChangeRecord);
+    if (first && is_name(line.type, kControlName)) return refuse(line_start(at), kChangeRecord);
     if (line.kind != ValueKind::plain && !check_encoded(at, line)) return false;
     return !is_object_class(line.type) || check_class(at, line);
   }
 
   bool check_type(const char* at, const AttributeLine& line) {
     if (!line.has_colon) return refuse(line_start(at), kNoColon);
-    if (!is_descriptor(line.type) && !is_oid(line.type)) {
+    if (!is_attribute_name(line.type)) {
       const std::size_t option = line.type.find(';');
       if (option != std::string_view::npos) return refuse(line_start(at) + option, kOption);
       return refuse(line_start(at), kBadName);
@@ -434,7 +418,7 @@ class LdifIndex::Builder {
     if (*at == ' ') return refuse(at, kNothingToContinue);
     AttributeLine line;
     reader_.next(line);
-    if (!line.has_colon || !is_name(line.type, kDn)) return refuse(at, kNoDnLine);
+    if (!line.has_colon || !is_name(line.type, kDnName)) return refuse(at, kNoDnLine);
     if (line.kind == ValueKind::url) return refuse(at + line.type.size(), kUrl);
     std::string scratch;
     std::string_view dn;

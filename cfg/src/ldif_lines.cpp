@@ -1,5 +1,6 @@
 #include "ldif_lines.h"
 
+#include <algorithm>
 #include <cstring>
 #include <new>
 
@@ -7,6 +8,28 @@
 #include "cfg/text.h"
 
 namespace orv::cfg {
+
+namespace {
+
+bool is_oid(std::string_view type) noexcept {
+  if (type.empty() || !is_ascii_digit(type.front()) || !is_ascii_digit(type.back())) return false;
+  if (type.find('.') == std::string_view::npos) return false;
+  if (type.find("..") != std::string_view::npos) return false;
+  return std::all_of(type.begin(), type.end(),
+                     [](char c) { return is_ascii_digit(c) || c == '.'; });
+}
+
+bool is_descriptor(std::string_view type) noexcept {
+  if (type.empty() || !is_ascii_letter(type.front())) return false;
+  return std::all_of(type.begin(), type.end(),
+                     [](char c) { return is_ascii_letter(c) || is_ascii_digit(c) || c == '-'; });
+}
+
+}  // namespace
+
+bool is_attribute_name(std::string_view text) noexcept {
+  return is_descriptor(text) || is_oid(text);
+}
 
 void unfold(std::string_view text, std::string& unfolded) {
   unfolded.clear();

@@ -117,6 +117,15 @@ struct AttributeLine {
   bool plain_name = false;  // `type` holds nothing but letters, digits and hyphens
 };
 
+// The names of lines that are no attributes: the DN, and what begins a change record.
+inline constexpr std::string_view kDnName = "dn";
+inline constexpr std::string_view kChangeTypeName = "changetype";
+inline constexpr std::string_view kControlName = "control";
+
+// Whether a text is a name or numeric identifier of an attribute type (RFC 4512, 1.4), without
+// options.
+bool is_attribute_name(std::string_view text) noexcept;
+
 // Joins a folded text: drops each line end together with the blank that continues the line.
 void unfold(std::string_view text, std::string& unfolded);
 

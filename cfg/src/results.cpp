@@ -15,6 +15,7 @@ namespace orv {
 // NOLINTNEXTLINE(bugprone-reserved-identifier): the name is part of the interface
 struct _CFGBer {
   cfg::Session* session;
+  cfg::SnapshotPtr snapshot;
   std::uint32_t entry;
   std::uint32_t next;  // the attribute to give out
   bool chooses;        // only some of the attributes were asked for: those in `chosen`
@@ -55,6 +56,7 @@ bool Selection::has(const KnownType* known, std::string_view name) const noexcep
 Chain::Chain(Session& owner, char** attributes, bool wants_types_only)
     : _CFGMessage{Kind::chain},
       session(&owner),
+      snapshot(owner.snapshot),
       types_only(wants_types_only),
       selection(attributes) {
   next_chain = owner.chains;
@@ -147,7 +149,7 @@ class ValueList {
 char** collect_values(const Record& record, std::string_view name) {
   const Chain& chain = *record.chain;
   AttributeMap& map = chain.session->attributes;
-  map.show(chain.session->index, record.entry);
+  map.show(chain.snapshot->index, record.entry);
   const std::uint32_t attribute = map.find(name);
   if (attribute == AttributeMap::kNone) return nullptr;
   if (!chain.selection.has(map.known(attribute), name)) return nullptr;
@@ -160,7 +162,7 @@ char** collect_values(const Record& record, std::string_view name) {
 
 char* next_name(_CFGBer& cursor) {
   AttributeMap& map = cursor.session->attributes;
-  map.show(cursor.session->index, cursor.entry);
+  map.show(cursor.snapshot->index, cursor.entry);
   if (cursor.next == (cursor.chooses ? cursor.chosen.size() : map.size())) return nullptr;
   const std::uint32_t attribute = cursor.chooses ? cursor.chosen[cursor.next] : cursor.next;
   ++cursor.next;
@@ -172,10 +174,11 @@ char* first_attribute(const Record& record, std::unique_ptr<_CFGBer>& cursor) {
   Session& session = *record.chain->session;
   const Selection& selection = record.chain->selection;
   // NOLINTNEXTLINE(modernize-make-unique): clang 14 makes no aggregates that way
-  cursor.reset(new _CFGBer{&session, record.entry, 0, !selection.has_all(), {}});
+  cursor.reset(
+      new _CFGBer{&session, record.chain->snapshot, record.entry, 0, !selection.has_all(), {}});
   if (cursor->chooses) {
     AttributeMap& map = session.attributes;
-    map.show(session.index, record.entry);
+    map.show(cursor->snapshot->index, record.entry);
     for (std::uint32_t i = 0; i < map.size(); ++i) {
       if (selection.has(map.known(i), map.name(i))) cursor->chosen.push_back(i);
     }
@@ -230,7 +233,7 @@ char* cfg_get_dn(_CFG* session, _CFGMessage* entry) {
   }
   return cfg::guarded(session, [&] {
     std::string scratch;
-    return cfg::copy_text(record->chain->session->index.dn(record->entry, scratch));
+    return cfg::copy_text(record->chain->snapshot->index.dn(record->entry, scratch));
   });
 }
 

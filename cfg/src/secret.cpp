@@ -5,6 +5,7 @@
 #include <openssl/rand.h>
 
 #include <array>
+#include <atomic>
 #include <cstdint>
 #include <memory>
 #include <utility>
@@ -359,6 +360,34 @@ int hash_secret(std::string_view clear, std::string& stored) noexcept try {
   return result::success;
 } catch (...) {
   return result::no_memory;
+}
+
+// ---- Protecting ----
+
+namespace {
+
+std::atomic<SecretMethod> current_method{SecretMethod::sealed};
+
+}  // namespace
+
+void set_secret_method(SecretMethod method) noexcept {
+  current_method.store(method, std::memory_order_relaxed);
+}
+
+SecretMethod secret_method() noexcept {
+  return current_method.load(std::memory_order_relaxed);
+}
+
+int protect_secret(const Key* key, SecretPlace place, std::string_view clear,
+                   std::string& stored) noexcept {
+  if (key == nullptr || secret_method() == SecretMethod::hashed) return hash_secret(clear, stored);
+  return seal_secret(*key, place, clear, stored);
+}
+
+bool names_scheme(std::string_view value) noexcept {
+  std::string_view scheme;
+  std::string_view rest;
+  return split_scheme(value, scheme, rest);
 }
 
 }  // namespace orv::cfg

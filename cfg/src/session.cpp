@@ -65,13 +65,15 @@ int read_config_file(Session& session) {
     return fail_bind(session, "", {"no configuration file is named", 0, 0});
   }
   std::string cause;
-  if (!session.text.read(session.config_file.c_str(), cause)) {
+  const auto snapshot = std::make_shared<Snapshot>();
+  if (!snapshot->text.read(session.config_file.c_str(), cause)) {
     return fail_bind(session, session.config_file, {std::move(cause), 0, 0});
   }
   FileFault fault;
-  if (!session.index.build(session.text, fault)) {
+  if (!snapshot->index.build(snapshot->text, fault)) {
     return fail_bind(session, session.config_file, std::move(fault));
   }
+  session.snapshot = snapshot;
   return result::success;
 }
 
@@ -115,21 +117,20 @@ std::string describe_fault(const Session& session) {
 // ---- Search ----
 
 struct Search {
-  Session& session;
+  const LdifIndex& index;
   Chain& chain;
   const Filter* filter;  // null matches every entry
 
   int look_at(std::uint32_t entry) {
     if (interrupted()) return result::time_limit_exceeded;
     const Filter::Match match =
-        filter == nullptr ? Filter::Match::yes : filter->match(session.index, entry);
+        filter == nullptr ? Filter::Match::yes : filter->match(index, entry);
     if (match == Filter::Match::interrupted) return result::time_limit_exceeded;
     if (match == Filter::Match::yes) chain.append(entry);
     return result::success;
   }
 
   int children_of(std::uint32_t base) {
-    const LdifIndex& index = session.index;
     for (std::uint32_t entry = base + 1; entry < index.size(); ++entry) {
       if (index.parent(entry) != base) continue;
       const int rc = look_at(entry);
@@ -140,7 +141,6 @@ struct Search {
 
   // Parents come before their children: one walk tells who is below.
   int subtree_of(std::uint32_t base) {
-    const LdifIndex& index = session.index;
     int rc = look_at(base);
     std::vector<bool> below(base == 0 ? 0 : index.size() - base);
     if (!below.empty()) below[0] = true;
@@ -174,7 +174,7 @@ int find_base(const Session& session, const char* base, std::uint32_t& entry) {
   if (!normalize_local(base == nullptr ? "" : base, normal)) {
     return result::invalid_dn_syntax;
   }
-  entry = session.index.find(normal);
+  entry = session.snapshot->index.find(normal);
   return entry == LdifIndex::kNone ? result::no_such_object : result::success;
 }
 
@@ -190,7 +190,8 @@ int search(Session& session, const char* base, int scope, const char* filter_tex
   int rc = find_base(session, base, entry);
   if (rc != result::success) return rc;
   auto chain = std::make_unique<Chain>(session, attributes, types_only);
-  rc = Search{session, *chain, filter_text == nullptr ? nullptr : &filter}.run(entry, scope);
+  const Filter* const wanted = filter_text == nullptr ? nullptr : &filter;
+  rc = Search{session.snapshot->index, *chain, wanted}.run(entry, scope);
   if (rc == result::success) *result = chain.release();
   return rc;
 }
@@ -207,8 +208,16 @@ const char* reason(int code) noexcept {
       return "the request cannot be read";
     case result::time_limit_exceeded:
       return "interrupted";
+    case result::no_such_record:
+      return "no such entry, or no parent for it";
     case result::no_such_attribute:
       return "no such attribute";
+    case result::attribute_or_value_exists:
+      return "the value exists already";
+    case result::not_allowed_on_non_leaf:
+      return "the entry has children";
+    case result::already_exists:
+      return "the entry exists already";
     case result::no_such_object:
       return "no such entry";
     case result::invalid_dn_syntax:

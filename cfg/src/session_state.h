@@ -10,6 +10,7 @@
 #include "attribute_lookup.h"
 #include "attribute_map.h"
 #include "cfg/session.h"
+#include "file_calls.h"
 #include "file_text.h"
 #include "ldif_index.h"
 #include "secret_key.h"
@@ -28,6 +29,14 @@ namespace orv::cfg {
 
 struct Chain;
 
+// One version of the file: its text, and what stands where in it. A session goes on to another with
+// each change of its own; results keep the one that they are of.
+struct Snapshot {
+  FileText text;
+  LdifIndex index;
+};
+using SnapshotPtr = std::shared_ptr<const Snapshot>;
+
 // The session. Chains that its user never releases go with it.
 struct Session : _CFG {
   enum class State { unbound, bound, failed };
@@ -42,14 +51,14 @@ struct Session : _CFG {
 
   State state = State::unbound;
   int last_error = 0;
-  FileText text;
-  LdifIndex index;
+  SnapshotPtr snapshot;     // null until the session is bound
   AttributeMap attributes;  // of the entry whose record was looked at last
   SharedKey owned_key;
   FileFault fault;
   std::string fault_file;  // the file the fault is about
   std::string dump;
   Chain* chains = nullptr;
+  FileCalls* files = &system_file_calls();  // with which changes are written
 };
 
 // Which attributes a search asked for.
@@ -90,6 +99,7 @@ struct Chain : _CFGMessage {
   void unlink(Record& record) noexcept;
 
   Session* session;
+  const SnapshotPtr snapshot;
   Chain* previous_chain = nullptr;
   Chain* next_chain = nullptr;
   Record* first = nullptr;

@@ -3,12 +3,17 @@
 // The program's own allocation functions stand in front of the system's and count what is out.
 #include <gtest/gtest.h>
 
+#include <cerrno>
 #include <cstdlib>
+#include <iterator>
 #include <new>
 
+#include "cfg/diagnostics.h"
 #include "cfg/dn.h"
 #include "cfg/matching.h"
 #include "cfg_fixture.h"
+#include "file_calls.h"
+#include "session_state.h"
 
 #if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
 extern "C" void* __interceptor_malloc(std::size_t size);
@@ -179,6 +184,152 @@ TEST_F(AllocationTest, CanonicalValuesAnswerNinetyAndStayAsTheyWere) {
       return rc == 0 ? !form.empty() : rc == 90 && failed && form.empty();
     });
   }
+}
+
+// ---- Changes ----
+
+// Nothing is flushed: it is memory that is short here.
+class QuickFiles : public cfg::FileCalls {
+ public:
+  explicit QuickFiles(bool exchanges) : exchanges_(exchanges) {}
+  int flush(int /*file*/) override { return 0; }
+  int exchange(const char* a, const char* b) override {
+    return exchanges_ ? FileCalls::exchange(a, b) : (errno = EINVAL, -1);
+  }
+
+ private:
+  bool exchanges_;
+};
+
+class ChangeAllocationTest : public AllocationTest {
+ protected:
+  static constexpr const char* kBefore =
+      "dn: cn=a long name of the top so that it takes a block\ncn: top\n";
+
+  // Opens the file with `before`, lets each allocation of `change` fail, and looks at the file.
+  template <class Change>
+  void fail_each_of(Change change) {
+    for (const bool exchanges : {true, false}) {
+      QuickFiles files(exchanges);
+      fail_each([&] {
+        fail_at_end();
+        write_file(path_, before_);
+        const CfgSession session = unbound();
+        cfg_set_option(session.get(), kCfgOptSaveFile, save_.c_str());
+        if (cfg_bind_s(session.get(), nullptr, nullptr, 128) != 0) return false;
+        cfg::session_of(session.get())->files = &files;
+        fail_at_start();
+        const int rc = change(session.get());
+        fail_at_end();
+        const std::string now = read_all(path_);
+        return rc == 0 ? now == after_ : rc == 90 && failed && now == before_;
+      });
+    }
+  }
+
+  // Within a round only the change itself is short of memory.
+  void fail_at_end() {
+    if (fail_at >= 0) next_ = fail_at;
+    fail_at = -1;
+  }
+  void fail_at_start() const { fail_at = next_; }
+
+  static std::string read_all(const std::string& path) {
+    std::ifstream file(path, std::ios::binary);
+    return {std::istreambuf_iterator<char>(file), std::istreambuf_iterator<char>()};
+  }
+
+  const std::string save_ = path_ + ".save";
+  std::string before_ = kBefore;
+  std::string after_;
+  long next_ = 0;
+};
+
+TEST_F(ChangeAllocationTest, AnAddIsDoneOrAnsweredNinety) {
+  char cn[] = "2.5.4.3";
+  char description[] = "description";
+  char short_value[] = "a";
+  char other_value[] = "\xC3\xA4 value that has to be encoded and then folded, because it is long";
+  char* values[] = {short_value, other_value, nullptr};
+  ldapmod first{kModAdd, cn, {values}, nullptr};
+  ldapmod second{kModAdd, description, {values}, nullptr};
+  ldapmod* mods[] = {&first, &second, nullptr};
+  const char* const dn = "cn=\\61 new entry,cn=a long name of the top so that it takes a block";
+  write_file(path_, kBefore);
+  {
+    const CfgSession session = open(kBefore);
+    ASSERT_EQ(cfg_add_s(session.get(), dn, mods), 0);
+  }
+  after_ = read_all(path_);
+  fail_each_of([&](_CFG* session) { return cfg_add_s(session, dn, mods); });
+}
+
+TEST_F(ChangeAllocationTest, APasswordIsProtectedOrTheAddAnsweredNinety) {
+  char type[] = "orv-slapdAdminPW";
+  char value[] = "correct horse battery staple";
+  char* values[] = {value, nullptr};
+  ldapmod mod{kModAdd, type, {values}, nullptr};
+  ldapmod* mods[] = {&mod, nullptr};
+  const char* const dn = "cn=new,cn=a long name of the top so that it takes a block";
+  QuickFiles files(true);
+  fail_each([&] {
+    fail_at_end();
+    write_file(path_, kBefore);
+    const CfgSession session = unbound();
+    if (cfg_bind_s(session.get(), nullptr, nullptr, 128) != 0) return false;
+    cfg::session_of(session.get())->files = &files;
+    fail_at_start();
+    const int rc = cfg_add_s(session.get(), dn, mods);
+    fail_at_end();
+    const std::string now = read_all(path_);
+    if (now.find("horse") != std::string::npos) return false;
+    return rc == 0 ? now.find("{SSHA512}") != std::string::npos : rc == 90 && now == kBefore;
+  });
+}
+
+TEST_F(ChangeAllocationTest, ADeleteIsDoneOrAnsweredNinety) {
+  after_ = kBefore;
+  before_ = std::string(kBefore) +
+            "\ndn: cn=\xC3\xA4 new entry,cn=a long name of the top so that it takes a block\n"
+            "description: one\ndescr\n iption: two\n";
+  fail_each_of([](_CFG* session) {
+    return cfg_delete_s(
+        session, "cn=\xC3\x84 NEW entry, cn=a long name of the top so that it takes a block");
+  });
+}
+
+TEST_F(ChangeAllocationTest, AModifyIsDoneOrAnsweredNinety) {
+  before_ = std::string(kBefore) + "description: one\ndescr\n iption: two\nunknown: x\n";
+  after_ = std::string(kBefore) + "descr\n iption: two\ndescription: three\n";
+  char description[] = "description";
+  char unknown[] = "UNKNOWN";
+  char two[] = "two";
+  char three[] = "three";
+  char* values[] = {two, three, nullptr};
+  ldapmod first{kModReplace, description, {values}, nullptr};
+  ldapmod second{kModDelete, unknown, {nullptr}, nullptr};
+  ldapmod* mods[] = {&first, &second, nullptr};
+  fail_each_of([&](_CFG* session) {
+    return cfg_modify_s(session, "cn=a long name of the top so that it takes a block", mods);
+  });
+}
+
+TEST_F(ChangeAllocationTest, ARefusalIsAnsweredWithItsCodeOrNinety) {
+  write_file(path_, kBefore);
+  const CfgSession session = open(kBefore);
+  write_file(path_, std::string(kBefore) + "# edited by somebody, with another size\n");
+  char type[] = "cn";
+  char value[] = "a";
+  char* values[] = {value, nullptr};
+  ldapmod mod{kModAdd, type, {values}, nullptr};
+  ldapmod* mods[] = {&mod, nullptr};
+  cfg::set_diagnostics_sink([](const char* /*line*/) noexcept {});
+  fail_each([&] {
+    const int rc =
+        cfg_add_s(session.get(), "cn=a,cn=a long name of the top so that it takes a block", mods);
+    return rc == 51 || (rc == 90 && failed);
+  });
+  cfg::set_diagnostics_sink(nullptr);
 }
 
 TEST_F(AllocationTest, WithoutMemoryTheReservedHandleAnswersNinety) {

@@ -23,10 +23,9 @@ namespace orv::cfg_test {
 // A directory that goes with the object.
 class TemporaryDirectory {
  public:
-  TemporaryDirectory() {
-    char name[] = "/tmp/orv-cfg-XXXXXX";
-    if (::mkdtemp(name) == nullptr) std::abort();
-    path_ = name;
+  explicit TemporaryDirectory(const std::string& parent = "/tmp")
+      : path_(parent + "/orv-cfg-XXXXXX") {
+    if (::mkdtemp(path_.data()) == nullptr) std::abort();
   }
   ~TemporaryDirectory() { static_cast<void>(std::system(("rm -rf " + path_).c_str())); }
   TemporaryDirectory(const TemporaryDirectory&) = delete;
@@ -127,6 +126,8 @@ inline std::vector<FoundEntry> read_chain(_CFG* session, _CFGMessage* chain) {
 
 class CfgTest : public ::testing::Test {
  protected:
+  explicit CfgTest(const std::string& parent = "/tmp") : directory_(parent) {}
+
   void SetUp() override { ASSERT_EQ(cfg::register_attribute_types(test_types()), 0); }
 
   // A handle with the file's path set.
@@ -187,7 +188,7 @@ class CfgTest : public ::testing::Test {
     return rc;
   }
 
-  TemporaryDirectory directory_;
+  const TemporaryDirectory directory_;
   std::string path_ = directory_.file("config.ldif");
 };
 

@@ -1,8 +1,9 @@
-"""Puts deliberate faults into the backend, one by one, and sees whether the unit tests notice.
+"""Puts deliberate faults into the sources, one by one, and sees whether the tests notice.
 
 usage: mutate.py [--list FILE]... [--only TEXT] [--work DIR] [--keep]
 
-Works in a copy of the sources; the tree itself is not touched. A list has blocks like
+Works in a copy of the sources; the tree itself is not touched. The name of a list says which tests
+run: those of the backend, or of the configuration-file library. A list has blocks like
 
     == back-config/config_bind.cpp
     - what the source says
@@ -23,11 +24,21 @@ import tempfile
 import time
 
 ROOT = pathlib.Path(__file__).resolve().parents[2]
-NEEDED = ("back-config", "cfg/include", "slapi/include", "tests/unit", "tests/check_behaviours.py",
-          "cmake")
-TARGET = "backend_unit_tests"
+COMMON = ("cfg/include", "cmake")
+SUITES = {
+    "backend": {
+        "needed": ("back-config", "slapi/include", "tests/unit", "tests/check_behaviours.py"),
+        "folders": ("back-config", "tests/unit"),
+        "target": "backend_unit_tests",
+        "arguments": []},
+    "cfg": {
+        "needed": ("cfg/src", "cfg/CMakeLists.txt", "tests/cfg"),
+        "folders": ("cfg", "tests/cfg"),
+        "target": "cfg_test",
+        "arguments": ["--gtest_filter=Add*:Delete*:SaveFault*:Crash*:Concurrent*:ChangeModel*:Modify*"]},
+}
 
-# Only the backend and its unit tests; no warnings, since a fault may well leave something unused.
+# Only what the tests need; no warnings, since a fault may well leave something unused.
 PROJECT = """
 cmake_minimum_required(VERSION 3.25)
 project(orv LANGUAGES CXX)
@@ -36,11 +47,12 @@ include(OrvToolchain)
 include(OrvTargets)
 set_property(TARGET orv_warnings PROPERTY INTERFACE_COMPILE_OPTIONS -w)
 find_package(Threads REQUIRED)
+find_package(OpenSSL 3.0 REQUIRED)
+find_package(PkgConfig REQUIRED)
+pkg_check_modules(UTF8PROC REQUIRED IMPORTED_TARGET libutf8proc)
 enable_testing()
 find_package(GTest REQUIRED)
 include(GoogleTest)
-add_subdirectory(back-config)
-add_subdirectory(tests/unit)
 """
 
 
@@ -59,36 +71,39 @@ def faults_of(path):
             fault = None
 
 
-def prepare(work):
-    for name in NEEDED:
+def prepare(work, suite):
+    for name in (*COMMON, *suite["needed"]):
         source, target = ROOT / name, work / name
         target.parent.mkdir(parents=True, exist_ok=True)
         if source.is_dir():
             shutil.copytree(source, target)
         else:
             shutil.copy(source, target)
-    (work / "CMakeLists.txt").write_text(PROJECT, encoding="utf-8")
+    folders = "".join(f"add_subdirectory({folder})\n" for folder in suite["folders"])
+    (work / "CMakeLists.txt").write_text(PROJECT + folders, encoding="utf-8")
     subprocess.run(["cmake", "-S", work, "-B", work / "build", "-G", "Ninja",
                     "-DCMAKE_BUILD_TYPE=Debug", "-DCMAKE_CXX_FLAGS_DEBUG=-O0"],
                    check=True, stdout=subprocess.DEVNULL)
 
 
-def build(work):
-    done = subprocess.run(["ninja", "-C", work / "build", TARGET], capture_output=True, text=True)
+def build(work, suite):
+    done = subprocess.run(["ninja", "-C", work / "build", suite["target"]], capture_output=True,
+                          text=True)
     return done.returncode == 0, done.stdout
 
 
-def red(work):
+def red(work, suite):
     """Whether the tests fail: by a failure, a crash, or by never coming back."""
     try:
-        done = subprocess.run([work / "build/bin" / TARGET, "--gtest_brief=1",
-                               "--gtest_fail_fast"], capture_output=True, timeout=60)
+        done = subprocess.run([work / "build/bin" / suite["target"], "--gtest_brief=1",
+                               "--gtest_fail_fast", *suite["arguments"]],
+                              capture_output=True, timeout=180)
     except subprocess.TimeoutExpired:
         return True
     return done.returncode != 0
 
 
-def try_fault(work, fault):
+def try_fault(work, suite, fault):
     path = work / fault["file"]
     text = path.read_text(encoding="utf-8")
     old, new = "\n".join(fault["-"]), "\n".join(fault["+"])
@@ -96,23 +111,23 @@ def try_fault(work, fault):
         return f"stands {text.count(old)} times in the source"
     try:
         path.write_text(text.replace(old, new), encoding="utf-8")
-        built, _ = build(work)
+        built, _ = build(work, suite)
         if not built:
             return "does not compile"
-        return None if red(work) else "SURVIVED"
+        return None if red(work, suite) else "SURVIVED"
     finally:
         path.write_text(text, encoding="utf-8")
 
 
-def run(work, faults):
-    prepare(work)
-    built, output = build(work)
-    if not built or red(work):
+def run(work, suite, faults):
+    prepare(work, suite)
+    built, output = build(work, suite)
+    if not built or red(work, suite):
         print("the tests are not green without a fault\n" + output)
         return 1
     bad, begin = [], time.monotonic()
     for fault in faults:
-        verdict = try_fault(work, fault)
+        verdict = try_fault(work, suite, fault)
         if verdict:
             bad.append(fault)
             print(f"{fault['line']} {fault['file']}: {verdict}: {' / '.join(fault['-'])[:90]}",
@@ -134,15 +149,19 @@ def main():
     parser.add_argument("--keep", action="store_true", help="leave the copy behind")
     options = parser.parse_args()
     lists = options.list or sorted(pathlib.Path(__file__).parent.glob("*.faults"))
-    faults = [fault for path in lists for fault in faults_of(path)
-              if not options.only or options.only in fault["file"]]
     work = options.work or pathlib.Path(tempfile.mkdtemp(prefix="mutation-"))
     work.mkdir(parents=True, exist_ok=True)
+    bad = 0
     try:
-        return run(work, faults)
+        for path in lists:
+            faults = [fault for fault in faults_of(path)
+                      if not options.only or options.only in fault["file"]]
+            if faults or not options.only:
+                bad += run(work / path.stem, SUITES.get(path.stem, SUITES["backend"]), faults)
     finally:
         if not options.keep:
             shutil.rmtree(work)
+    return 1 if bad else 0
 
 
 if __name__ == "__main__":

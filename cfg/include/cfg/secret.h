@@ -63,6 +63,22 @@ void verify_nothing(std::string_view clear) noexcept;
 // Makes a salted SHA-512 value. 0 or 90.
 int hash_secret(std::string_view clear, std::string& stored) noexcept;
 
+// How a password that is given in clear is stored by a change (cfg_add_s): sealed under the key of
+// the session, or hashed. Without a key it is hashed in either case: no change leaves a clear text.
+enum class SecretMethod { sealed, hashed };
+
+// Sets the method of the process; `sealed` until then. Thread-safe.
+void set_secret_method(SecretMethod method) noexcept;
+SecretMethod secret_method() noexcept;
+
+// Protects a clear text with the method in force; `key` may be null. 0 or 90.
+int protect_secret(const Key* key, SecretPlace place, std::string_view clear,
+                   std::string& stored) noexcept;
+
+// Whether a value begins with "{" name "}", as protected ones do: no password to store may, since
+// nobody could tell it from a protected one.
+bool names_scheme(std::string_view value) noexcept;
+
 // Overwrites memory in a way that the compiler keeps.
 void wipe(void* memory, std::size_t length) noexcept;
 void wipe(std::string& text) noexcept;

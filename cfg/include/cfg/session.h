@@ -75,8 +75,8 @@ int cfg_bind_s(_CFG* session, const char* who, const char* credentials, int flag
 // null and for a handle that was never bound.
 int cfg_unbind(_CFG* session);
 
-// What went wrong in the last bind, in words: file, line, column and cause, never a value from the
-// file. Borrowed, valid until the next call on the handle, never null.
+// What went wrong in the last bind or change, in words: file, line, column and cause, never a value
+// from the file. Borrowed, valid until the next call on the handle, never null.
 const char* cfg_dump_exception(_CFG* session);
 
 // Searches below `base` (a DN in the file's code page, in any spelling).
@@ -137,20 +137,55 @@ int cfg_get_errno(_CFG* session);
 // (cfg/diagnostics.h). `text` may be null.
 void cfg_perror(_CFG* session, const char* text);
 
-// Changes. Declared for those who write against this interface; a program that calls them does not
-// link yet.
+// Changes.
 //
-// cfg_add_s adds the entry `dn` with the attributes of `mods` (code add; a list of records, strings
-// or counted values). 0; 68 exists; 9 parent missing; 21 a value with a null text or one that must
-// not be stored; 51 somebody else is changing the file; 90.
+// A change that returned 0 survives a power failure. At every instant the file is the old version
+// or the new one, whole; after any other answer it is the old one. Only the lines of the entry that
+// is meant change: every other byte of the file stays as it was. The version before the change
+// becomes the save file (option 1006), and permissions, access list, owner and group are kept.
+//
+// Writers exclude each other by an advisory lock on a file beside the configuration file (its name
+// with ".lock" added, which stays there). A file that somebody edited or replaced since this
+// session read it is left as it is, and the change answered with 51; the session then still shows
+// what it read. After a change of its own, searches of the session see the new text; results
+// obtained before still show the old one.
+//
+// Codes that all of them have, besides their own:
+//   1   the session is not bound
+//   11  the file would grow beyond 1 GiB
+//   34  `dn` is not a DN
+//   51  another writer holds the lock, or the file is not the one that was read
+//   53  the file, its directory or its media may not be written, or its owner cannot be kept
+//   80  an error of the file system: disk full, quota, input/output
+//   90  no memory
+// Why a change was refused with 11, 19, 21, 51, 53 or 80 is written to the diagnostics stream
+// (cfg/diagnostics.h), without values; `cfg_dump_exception` tells it too.
+
+// Adds the entry `dn`, whose spelling is kept, with the attributes of `mods`: a null-terminated
+// list of records with the code add, strings or counted values; the order of records and values is
+// the order in the file. The entry goes behind the last entry at or below its parent. Types that
+// are known are written under their canonical names. Passwords are protected here (cfg/secret.h).
+// 0; 68 the entry exists; 9 its parent does not; 2 no attributes, one without values, a record that
+// is no add; 17 an attribute type that is not well formed (options are refused) or has a meaning of
+// its own in the format; 19 a password that looks like a stored one; 20 a value given twice, by the
+// type's equality rule; 21 a value with a null text, with a NUL byte, or an empty password; 64 a
+// password attribute in the DN.
 int cfg_add_s(_CFG* session, const char* dn, ldapmod** mods);
 
-// cfg_modify_s applies the records in order to one copy of the entry and writes it: all or nothing.
-// 0 (also for a null or empty list, without writing); 9 entry missing; 16 value or attribute to
-// delete missing; 20 value to add exists; 2 add without values or an unknown code; 21, 51, 90.
-int cfg_modify_s(_CFG* session, const char* dn, ldapmod** mods);
-
-// cfg_delete_s removes a leaf. 0; 9 entry missing; 66 it has children; 51; 90.
+// Removes a leaf: its lines, comments between them, and one blank line that separated it. Comments
+// above the entry stay, and so does the blank line then. 0; 9 the entry is missing; 66 it has
+// children; 53 it is the only entry.
 int cfg_delete_s(_CFG* session, const char* dn);
+
+// Applies the records of a list in their order to one copy of the entry and writes that: all or
+// nothing. Lines of values that stay are not touched; a new value stands behind the last one of its
+// attribute, or at the end of the entry. Values are compared by the type's equality rule. A
+// password is given in clear and protected as in cfg_add_s; to delete one, its clear text will do,
+// or the text that is stored. A replace keeps values that are there byte for byte, protected ones
+// too. 0, also for a null or empty list and when nothing changes, without writing; 9 the entry is
+// missing; 16 a value or an attribute to delete is; 20 a value to add exists, or is given twice; 2
+// add without values, or an unknown code; 17, 19 and 21 as in cfg_add_s; 65 no attribute would be
+// left.
+int cfg_modify_s(_CFG* session, const char* dn, ldapmod** mods);
 
 }  // namespace orv

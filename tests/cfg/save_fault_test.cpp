@@ -1,0 +1,318 @@
+// Every file call of a save fails, with every error, once or for good: the change is refused, the
+// old file stands, and the next write works.
+#include <dirent.h>
+
+#include <algorithm>
+#include <set>
+
+#include "change_fixture.h"
+#include "faulty_files.h"
+
+namespace orv::cfg_test {
+namespace {
+
+using Lasting = FaultyFiles::Lasting;
+
+constexpr const char* kBefore = "# a\ndn: cn=top\ncn: top\n\n# b\n";
+constexpr const char* kAfter = "# a\ndn: cn=top\ncn: top\n\ndn: cn=a,cn=top\ncn: a\n\n# b\n";
+constexpr const char* kNext =
+    "# a\ndn: cn=top\ncn: top\n\ndn: cn=a,cn=top\ncn: a\n\ndn: cn=n,cn=top\ncn: n\n\n# b\n";
+constexpr const char* kNextAlone = "# a\ndn: cn=top\ncn: top\n\ndn: cn=n,cn=top\ncn: n\n\n# b\n";
+constexpr const char* kSavedBefore = "dn: cn=older\ncn: older\n";
+
+class SaveFaultTest : public ChangeTest {
+ protected:
+  SaveFaultTest() : ChangeTest(memory_directory()) {}
+
+  std::set<std::string> names() const {
+    std::set<std::string> found;
+    DIR* const directory = ::opendir(directory_.file("").c_str());
+    while (const dirent* const entry = ::readdir(directory)) found.insert(entry->d_name);
+    ::closedir(directory);
+    found.erase(".");
+    found.erase("..");
+    return found;
+  }
+
+  void set_up_files(bool leftovers) {
+    for (const std::string& name : names()) ::unlink(directory_.file(name).c_str());
+    write_file(path_, kBefore);
+    write_file(save_, kSavedBefore);
+    if (!leftovers) return;
+    write_file(path_ + ".new", "dn: cn=to");
+    write_file(save_ + ".new", "dn:");
+    write_file(path_ + ".swap", kSavedBefore);
+  }
+
+  // The calls of an add that nothing disturbs.
+  std::vector<FaultyFiles::Call> undisturbed(Abilities abilities, bool leftovers) {
+    set_up_files(leftovers);
+    FaultyFiles files(abilities);
+    const CfgSession session = reopen();
+    write_through(session, files);
+    EXPECT_EQ(add(session, "cn=a,cn=top", {{"cn", {"a"}}}), 0);
+    EXPECT_EQ(read_file(path_), kAfter);
+    EXPECT_EQ(read_file(save_), kBefore);
+    EXPECT_EQ(names(), kTidy);
+    return files.calls();
+  }
+
+  // Whether a change may succeed although this call fails: nothing depends on its answer.
+  static bool may_fail(const FaultyFiles::Call& call, std::size_t number, std::size_t commit) {
+    if (call.name == "close" || call.name == "pause" || number > commit) return true;
+    if (call.name == "status_of" && call.subject.find(".swap") == std::string::npos) return true;
+    // A lock file that cannot be shared with the owner, and a leftover that is none.
+    return call.name == "set_mode" || call.name == "set_owner";
+  }
+
+  // Whether a call that a signal interrupted is made again; a flush never is.
+  static bool is_repeated(const std::string& name) {
+    return name == "open" || name == "read" || name == "write" || name == "lock";
+  }
+
+  void check_refused(int rc, const CfgSession& session) {
+    EXPECT_TRUE(rc == 51 || rc == 53 || rc == 80 || rc == 90) << rc;
+    EXPECT_EQ(read_file(path_), kBefore);
+    EXPECT_EQ(search_code(session, "cn=a,cn=top", 0, nullptr), 32);
+    EXPECT_STRNE(cfg_dump_exception(session.get()), "");
+  }
+
+  void check_next_write(bool added) {
+    const CfgSession session = reopen();
+    FaultyFiles files;
+    write_through(session, files);
+    EXPECT_EQ(add(session, "cn=n,cn=top", {{"cn", {"n"}}}), 0) << told;
+    EXPECT_EQ(read_file(path_), added ? kNext : kNextAlone);
+    EXPECT_EQ(read_file(save_), added ? kAfter : kBefore);
+    EXPECT_EQ(names(), kTidy);
+  }
+
+  // One call fails in one way.
+  void try_fault(Abilities abilities, bool leftovers, std::size_t number, int error,
+                 Lasting lasting, bool must_refuse) {
+    set_up_files(leftovers);
+    FaultyFiles files(abilities);
+    files.fail_at(number, error, lasting);
+    const CfgSession session = reopen();
+    write_through(session, files);
+    const int rc = add(session, "cn=a,cn=top", {{"cn", {"a"}}});
+    EXPECT_TRUE(files.has_failed());
+    if (must_refuse) {
+      EXPECT_NE(rc, 0);
+    }
+    if (error == EINTR && lasting == Lasting::once && is_repeated(files.calls()[number].name)) {
+      EXPECT_EQ(rc, 0);
+    }
+    if (rc == 0) {
+      EXPECT_EQ(read_file(path_), kAfter);
+    } else if (lasting == Lasting::all && read_file(path_) != kBefore) {
+      // Nothing could be taken back any more; whole it is all the same.
+      EXPECT_EQ(read_file(path_), kAfter);
+    } else {
+      check_refused(rc, session);
+    }
+    check_next_write(read_file(path_) == kAfter);
+  }
+
+  void try_every_fault(Abilities abilities, bool leftovers) {
+    const auto calls = undisturbed(abilities, leftovers);
+    std::size_t commit = calls.size();  // the last flush: that of the names
+    while (calls[--commit].name != "flush") {
+    }
+    for (std::size_t number = 0; number < calls.size(); ++number) {
+      for (const int error : {EIO, ENOSPC, EDQUOT, EROFS, EACCES, EINTR}) {
+        for (const Lasting lasting : {Lasting::once, Lasting::kind, Lasting::all}) {
+          SCOPED_TRACE(::testing::Message()
+                       << "call " << number << " " << calls[number].name << " "
+                       << calls[number].subject << ", " << ::strerror(error)
+                       << (lasting == Lasting::once ? ", once" : ", from then on"));
+          const bool forgiven = may_fail(calls[number], number, commit) ||
+                                (error == EINTR && lasting == Lasting::once);
+          try_fault(abilities, leftovers, number, error, lasting, !forgiven);
+          if (HasFailure()) return;
+        }
+      }
+    }
+  }
+
+  static const std::set<std::string> kTidy;
+};
+
+const std::set<std::string> SaveFaultTest::kTidy = {"config.ldif", "config.ldif.lock",
+                                                    "config.ldif.save"};
+
+// ---- Failing calls ----
+
+TEST_F(SaveFaultTest, EveryCallFails) {
+  try_every_fault({}, false);
+}
+
+TEST_F(SaveFaultTest, EveryCallFailsWhereThereIsNoExchange) {
+  try_every_fault({false, true}, false);
+}
+
+TEST_F(SaveFaultTest, EveryCallFailsWhereThereAreNoHardLinks) {
+  try_every_fault({true, false}, false);
+}
+
+TEST_F(SaveFaultTest, EveryCallFailsWhereThereIsNeither) {
+  try_every_fault({false, false}, false);
+}
+
+TEST_F(SaveFaultTest, EveryCallFailsWhileLeftoversAreCleared) {
+  try_every_fault({}, true);
+}
+
+TEST_F(SaveFaultTest, EveryCallOfADeleteFails) {
+  const auto delete_with = [this](FaultyFiles& files) {
+    set_up_files(false);
+    write_file(path_, kAfter);
+    const CfgSession session = reopen();
+    write_through(session, files);
+    return remove(session, "cn=a,cn=top");
+  };
+  FaultyFiles undisturbed;
+  ASSERT_EQ(delete_with(undisturbed), 0);
+  ASSERT_EQ(read_file(path_), kBefore);
+  for (std::size_t number = 0; number < undisturbed.calls().size(); ++number) {
+    FaultyFiles files;
+    files.fail_at(number, EIO, Lasting::once);
+    SCOPED_TRACE(undisturbed.calls()[number].name);
+    EXPECT_EQ(read_file(path_), delete_with(files) == 0 ? kBefore : kAfter);
+    const CfgSession session = reopen();
+    FaultyFiles next;
+    write_through(session, next);
+    EXPECT_EQ(add(session, "cn=n,cn=top", {{"cn", {"n"}}}), 0);
+  }
+}
+
+TEST_F(SaveFaultTest, CodesTellWhatAnAdministratorCanDo) {
+  const auto code = [this](const char* name, int error) {
+    const auto calls = undisturbed({}, false);
+    std::size_t number = 0;
+    while (calls[number].name != name) ++number;
+    set_up_files(false);
+    FaultyFiles files;
+    files.fail_at(number, error, Lasting::kind);
+    const CfgSession session = reopen();
+    write_through(session, files);
+    return add(session, "cn=a,cn=top", {{"cn", {"a"}}});
+  };
+  EXPECT_EQ(code("write", ENOSPC), 80);
+  EXPECT_EQ(code("flush", EIO), 80);
+  EXPECT_EQ(code("open", EROFS), 53);
+  EXPECT_EQ(code("exchange", EACCES), 53);
+  EXPECT_EQ(code("rename", EPERM), 53);
+  EXPECT_EQ(code("write", ENOMEM), 90);
+  EXPECT_NE(told.find("No space left on device"), std::string::npos);
+}
+
+// ---- Short writes ----
+
+class ShortWrites : public cfg::FileCalls {
+ public:
+  explicit ShortWrites(std::size_t most) : most_(most) {}
+  ssize_t write(int file, const void* from, std::size_t size) override {
+    return most_ == 0 ? 0 : FileCalls::write(file, from, std::min(size, most_));
+  }
+
+ private:
+  std::size_t most_;
+};
+
+TEST_F(SaveFaultTest, ShortWritesAreContinued) {
+  for (const std::size_t most : {std::size_t{1}, std::size_t{7}}) {
+    set_up_files(false);
+    ShortWrites files(most);
+    const CfgSession session = reopen();
+    write_through(session, files);
+    EXPECT_EQ(add(session, "cn=a,cn=top", {{"cn", {"a"}}}), 0);
+    EXPECT_EQ(read_file(path_), kAfter);
+  }
+}
+
+TEST_F(SaveFaultTest, AWriteThatWritesNothingIsAFailure) {
+  set_up_files(false);
+  ShortWrites files(0);
+  const CfgSession session = reopen();
+  write_through(session, files);
+  EXPECT_EQ(add(session, "cn=a,cn=top", {{"cn", {"a"}}}), 80);
+  EXPECT_EQ(read_file(path_), kBefore);
+}
+
+// ---- Flushing ----
+
+// The order of flushes and names, and that no descriptor is flushed again after a failure.
+class FlushWatch : public cfg::FileCalls {
+ public:
+  explicit FlushWatch(int failures) : failures_(failures) {}
+  int flush(int file) override {
+    struct stat status {};
+    ::fstat(file, &status);
+    flushed.push_back(S_ISDIR(status.st_mode) ? "names" : "content");
+    return failures_-- > 0 ? (errno = EIO, -1) : FileCalls::flush(file);
+  }
+  int exchange(const char* a, const char* b) override {
+    flushed.emplace_back("exchange");
+    return FileCalls::exchange(a, b);
+  }
+  std::vector<std::string> flushed;
+
+ private:
+  int failures_;
+};
+
+TEST_F(SaveFaultTest, ContentIsFlushedBeforeTheExchangeAndNamesBehindIt) {
+  set_up_files(false);
+  FlushWatch files(0);
+  const CfgSession session = reopen();
+  write_through(session, files);
+  EXPECT_EQ(add(session, "cn=a,cn=top", {{"cn", {"a"}}}), 0);
+  EXPECT_EQ(files.flushed, (Values{"content", "exchange", "names"}));
+}
+
+TEST_F(SaveFaultTest, AFailedFlushIsNotTriedAgain) {
+  set_up_files(false);
+  FlushWatch files(1);
+  const CfgSession session = reopen();
+  write_through(session, files);
+  EXPECT_EQ(add(session, "cn=a,cn=top", {{"cn", {"a"}}}), 80);
+  EXPECT_EQ(files.flushed, Values{"content"});
+  EXPECT_EQ(read_file(path_), kBefore);
+  EXPECT_EQ(names(), kTidy);
+  EXPECT_EQ(add(session, "cn=a,cn=top", {{"cn", {"a"}}}), 0);
+  EXPECT_EQ(read_file(path_), kAfter);
+}
+
+TEST_F(SaveFaultTest, AFailedFlushOfTheNamesTakesTheChangeBack) {
+  set_up_files(false);
+  const auto calls = undisturbed({}, false);
+  std::size_t number = calls.size();
+  while (calls[--number].name != "flush") {
+  }
+  set_up_files(false);
+  FaultyFiles files;
+  files.fail_at(number, EIO, Lasting::once);
+  const CfgSession session = reopen();
+  write_through(session, files);
+  EXPECT_EQ(add(session, "cn=a,cn=top", {{"cn", {"a"}}}), 80);
+  EXPECT_EQ(read_file(path_), kBefore);
+  EXPECT_EQ(names(), kTidy);
+}
+
+TEST_F(SaveFaultTest, AFileSystemWhoseNamesNeedNoFlushIsGoodEnough) {
+  set_up_files(false);
+  const auto calls = undisturbed({}, false);
+  std::size_t number = calls.size();
+  while (calls[--number].name != "flush") {
+  }
+  set_up_files(false);
+  FaultyFiles files;
+  files.fail_at(number, EINVAL, Lasting::once);
+  const CfgSession session = reopen();
+  write_through(session, files);
+  EXPECT_EQ(add(session, "cn=a,cn=top", {{"cn", {"a"}}}), 0);
+}
+
+}  // namespace
+}  // namespace orv::cfg_test
