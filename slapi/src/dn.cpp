@@ -18,6 +18,17 @@ bool is_suffix(const Backend* backend, std::string_view dn) noexcept {
   return false;
 }
 
+// Stands for a parent without memory: no DN, so that nothing is found there.
+constexpr std::string_view kNowhere = "=";
+// NOLINTNEXTLINE(cert-err58-cpp) filled when the library is loaded, and throws nothing
+slapi::Reserve g_nowhere(kNowhere.size() + 1);
+
+char* nowhere() noexcept {
+  auto* const text = static_cast<char*>(g_nowhere.take());
+  if (text != nullptr) kNowhere.copy(text, kNowhere.size());
+  return text;
+}
+
 }  // namespace
 
 // There is one normal form, and it is upper case: `fold` selects nothing.
@@ -55,7 +66,10 @@ void free_ldap_escDN(ldap_escDN* dn) {
 char* dn_parent_norm(const Backend* backend, const char* normalized_dn) {
   if (normalized_dn == nullptr || is_suffix(backend, normalized_dn)) return nullptr;
   const std::string_view parent = cfg::parent_of_normal_dn(normalized_dn);
-  return parent.empty() ? nullptr : slapi::copy_bytes(parent);
+  if (parent.empty()) return nullptr;
+  g_nowhere.fill();
+  char* const text = slapi::copy_bytes(parent);
+  return text == nullptr ? nowhere() : text;
 }
 
 int are_nested_dn(const char* a, const char* b) {

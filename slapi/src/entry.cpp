@@ -5,7 +5,9 @@
 #include <new>
 #include <string>
 #include <string_view>
+#include <unordered_map>
 #include <unordered_set>
+#include <vector>
 
 #include "cfg/owners.h"
 #include "cfg/result_codes.h"
@@ -228,6 +230,83 @@ int create_attribute(entry& e, attr** end, const char* type, ValueList values) n
   return append_attribute(e, end, std::move(created));
 }
 
+// ---- Deleting values -------------------------------------------------------------------------
+
+// Which values of an attribute are to go, by position.
+using Doomed = std::vector<bool>;
+
+// The values of a modification, in whichever form it holds them.
+std::vector<std::string_view> values_of(const ldapmod& modification) {
+  std::vector<std::string_view> values;
+  if ((modification.mod_op & kModBvalues) != 0) {
+    berval** const counted = modification.mod_vals.modv_bvals;
+    for (berval** value = counted; counted != nullptr && *value != nullptr; ++value)
+      values.push_back(bytes_of(**value));
+  } else {
+    char** const strings = modification.mod_vals.modv_strvals;
+    for (char** value = strings; strings != nullptr && *value != nullptr; ++value)
+      values.emplace_back(*value);
+  }
+  return values;
+}
+
+// Passwords are not compared before the caller's rights are: the code would tell a right guess from
+// a wrong one.
+int doom_earliest(std::size_t wanted, Doomed& doomed) {
+  if (wanted > doomed.size()) return result::no_such_attribute;
+  std::fill_n(doomed.begin(), wanted, true);
+  return result::success;
+}
+
+// Marks one equal value for each wanted one. Linear in the number of values.
+int doom_equal(const entry& e, const attr& present, const std::vector<std::string_view>& wanted,
+               Doomed& doomed) {
+  const cfg::MatchingRule rule = rule_of(present, present.syntax);
+  std::unordered_multimap<std::string, std::size_t> held;
+  held.reserve(doomed.size());
+  for (std::size_t i = 0; i < doomed.size(); ++i)
+    held.emplace(slapi::equality_key(rule, bytes_of(*present.values[i])), i);
+  for (const std::string_view value : wanted) {
+    slapi::MallocPtr<char> text;
+    std::size_t length = 0;
+    std::string copy(value);  // with the NUL that counted values have behind them
+    const berval counted{copy.size(), copy.data()};
+    if (const int rc = text_for_entry(e, counted, text, length); rc != result::success) return rc;
+    const auto found = held.find(slapi::equality_key(rule, {text.get(), length}));
+    if (found == held.end()) return result::no_such_attribute;
+    doomed[found->second] = true;
+    held.erase(found);
+  }
+  return result::success;
+}
+
+// Takes the marked values out; everything that can fail comes first.
+int remove_values(entry& e, attr& present, const Doomed& doomed) noexcept {
+  const auto kept_count = static_cast<std::size_t>(std::count(doomed.begin(), doomed.end(), false));
+  if (kept_count == 0) return attr_delete(&e, present.type, nullptr);
+  slapi::MallocPtr<berval*> kept(
+      static_cast<berval**>(std::calloc(kept_count + 1, sizeof(berval*))));
+  if (kept == nullptr) return result::no_memory;
+  for (std::size_t i = 0, next = 0; i < doomed.size(); ++i)
+    if (!doomed[i]) kept.get()[next++] = present.values[i];
+  const bool object_class = is_object_class(present.type);
+  slapi::MallocPtr<ShortValue> list;
+  if (object_class) {
+    list = make_short_list(kept.get(), nullptr);
+    if (list == nullptr) return result::no_memory;
+  }
+  for (std::size_t i = 0; i < doomed.size(); ++i) {
+    if (!doomed[i]) continue;
+    std::free(present.values[i]->bv_val);
+    std::free(present.values[i]);
+  }
+  std::free(present.values);
+  present.values = kept.release();
+  present.count = static_cast<int>(kept_count);
+  if (object_class) set_object_classes(e, &present, std::move(list));
+  return result::success;
+}
+
 // ---- Records of the configuration file -------------------------------------------------------
 
 // The normal form of a DN in the file's code page, in that code page; null when it has none.
@@ -344,6 +423,23 @@ int attr_delete(entry* e, const char* type, void* /*old*/) {
   if (is_object_class(type)) set_object_classes(*e, nullptr, nullptr);
   free_attribute(doomed);
   return result::success;
+}
+
+int delete_values_from_entry(entry* e, ldapmod* modification) {
+  if (e == nullptr || modification == nullptr || modification->mod_type == nullptr)
+    return result::other;
+  attr* const present = attr_find(e, modification->mod_type, 0, 0);
+  if (present == nullptr) return result::no_such_attribute;
+  try {
+    const std::vector<std::string_view> wanted = values_of(*modification);
+    if (wanted.empty()) return attr_delete(e, modification->mod_type, nullptr);
+    Doomed doomed(count_values(present->values));
+    const int rc = slapi::is_secret_type(present->type) ? doom_earliest(wanted.size(), doomed)
+                                                        : doom_equal(*e, *present, wanted, doomed);
+    return rc == result::success ? remove_values(*e, *present, doomed) : rc;
+  } catch (const std::bad_alloc&) {
+    return result::no_memory;
+  }
 }
 
 int value_find(const attr* a, const berval* value, int syntax, int /*normalise*/) {

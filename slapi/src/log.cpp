@@ -43,6 +43,38 @@ constexpr std::array kMessages{
             "The pass-through entry '%s' covers the reserved suffix '%s', which is never passed "
             "through."},
     Message{8, 179, 1, "The value '%s' of orv-slapdPtaURL is not an LDAP URL."},
+    Message{9, 1, 1, "The entry '%s' does not fit the schema: it has no object class."},
+    Message{9, 2, 2, "The entry '%s' does not fit the schema: there is no object class '%s'."},
+    Message{9, 3, 2, "The entry '%s' does not fit the schema: there is no attribute type '%s'."},
+    Message{9, 4, 2, "The entry '%s' does not fit the schema: '%s' has more than one value."},
+    Message{9, 5, 3, "The entry '%s' does not fit the schema: a value of '%s' %s."},
+    Message{9, 6, 2,
+            "The entry '%s' does not fit the schema: its object classes do not allow '%s'."},
+    Message{9, 7, 1, "The entry '%s' does not fit the schema: it has no structural object class."},
+    Message{9, 8, 3,
+            "The entry '%s' does not fit the schema: '%s' and '%s' are structural object classes "
+            "of which neither derives from the other."},
+    Message{9, 9, 2, "The entry '%s' does not fit the schema: its object classes demand '%s'."},
+    Message{9, 10, 2,
+            "The entry '%s' does not fit the schema: '%s' is a password and cannot be part of a "
+            "name."},
+    Message{9, 11, 2,
+            "The entry '%s' does not fit the schema: its name has a value of '%s' that the entry "
+            "lacks."},
+    Message{10, 1, 1, "A new password from '%s' was refused: it is empty."},
+    Message{10, 2, 2, "A new password from '%s' was refused: it has fewer than %s characters."},
+    Message{10, 3, 2, "A new password from '%s' was refused: it has fewer than %s letters."},
+    Message{10, 4, 2,
+            "A new password from '%s' was refused: fewer than %s of its characters are no "
+            "letters."},
+    Message{10, 5, 2,
+            "A new password from '%s' was refused: one character occurs more than %s times."},
+    Message{10, 6, 2,
+            "A new password from '%s' was refused: fewer than %s different characters are new."},
+    Message{10, 7, 1, "A new password from '%s' was refused: it is the old one."},
+    Message{10, 8, 1,
+            "The password policy in the configuration file is not put in force: %s. The one "
+            "before stays."},
 };
 
 const Message* find_message(int set, int number) noexcept {

@@ -1,6 +1,7 @@
 // Blocks of the malloc family, for everything that crosses the interface.
 #pragma once
 
+#include <atomic>
 #include <cstdlib>
 #include <cstring>
 #include <memory>
@@ -22,5 +23,29 @@ inline char* copy_bytes(std::string_view bytes) noexcept {
   copy[bytes.size()] = '\0';
   return copy;
 }
+
+// A zeroed block put aside while there is memory, for the one answer that must not fail: where null
+// would be read as "nothing to do". Whoever gets the block releases it with free; the next call of
+// `fill` puts another one aside. Thread-safe.
+class Reserve {
+ public:
+  explicit Reserve(std::size_t size) noexcept : size_(size) { fill(); }
+  ~Reserve() { std::free(block_.load()); }
+  Reserve(const Reserve&) = delete;
+  Reserve& operator=(const Reserve&) = delete;
+
+  void fill() noexcept {
+    if (block_.load(std::memory_order_relaxed) != nullptr) return;
+    void* const made = std::calloc(1, size_);
+    void* none = nullptr;
+    if (!block_.compare_exchange_strong(none, made)) std::free(made);
+  }
+  // Null only when it was taken and could not be filled again.
+  void* take() noexcept { return block_.exchange(nullptr); }
+
+ private:
+  std::size_t size_;
+  std::atomic<void*> block_{nullptr};
+};
 
 }  // namespace orv::slapi

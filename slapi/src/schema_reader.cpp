@@ -16,6 +16,7 @@
 #include "equality.h"
 #include "schema_index.h"
 #include "slapi/schema.h"
+#include "type_names.h"
 
 namespace orv {
 namespace {
@@ -156,34 +157,12 @@ std::vector<std::string> texts(char* const* list) {
   return copies;
 }
 
-// keystring of RFC 4512, 1.4.
-bool is_descriptor(std::string_view name) noexcept {
-  const auto letter = [](char c) { return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z'); };
-  const auto key_char = [&](char c) { return letter(c) || (c >= '0' && c <= '9') || c == '-'; };
-  return !name.empty() && letter(name.front()) && std::all_of(name.begin(), name.end(), key_char);
-}
-
-// numericoid: at least two numbers without leading zeros.
-bool is_numeric_oid(std::string_view oid) noexcept {
-  std::size_t numbers = 0;
-  while (!oid.empty()) {
-    const std::size_t digits = std::min(oid.find_first_not_of("0123456789"), oid.size());
-    if (digits == 0 || (digits > 1 && oid.front() == '0')) return false;
-    ++numbers;
-    oid.remove_prefix(digits);
-    if (oid.empty()) break;
-    if (oid.front() != '.' || oid.size() == 1) return false;
-    oid.remove_prefix(1);
-  }
-  return numbers >= 2;
-}
-
 std::vector<std::string> checked_names(char* const* list, std::string_view oid, std::size_t line) {
   std::vector<std::string> names = texts(list);
-  if (!is_numeric_oid(oid)) refuse(line, "not a numeric OID: " + quoted(oid));
+  if (!slapi::is_numeric_oid(oid)) refuse(line, "not a numeric OID: " + quoted(oid));
   if (names.empty()) refuse(line, "no NAME");
   for (const std::string& name : names)
-    if (!is_descriptor(name)) refuse(line, "not a name: " + quoted(name));
+    if (!slapi::is_descriptor(name)) refuse(line, "not a name: " + quoted(name));
   return names;
 }
 
@@ -250,6 +229,7 @@ class SchemaReader {
     attribute.ordering = text_or_empty(parsed->at_ordering_oid);
     attribute.substrings = text_or_empty(parsed->at_substr_oid);
     attribute.syntax = text_or_empty(parsed->at_syntax_oid);
+    attribute.max_characters = static_cast<std::size_t>(std::max(parsed->at_syntax_len, 0));
     attribute.single_valued = parsed->at_single_value != 0;
     attribute.no_user_modification = parsed->at_no_user_mod != 0;
     attribute.operational = parsed->at_usage != LDAP_SCHEMA_USER_APPLICATIONS;
@@ -271,7 +251,10 @@ class SchemaReader {
     if (attribute.equality.empty()) attribute.equality = superior->equality;
     if (attribute.ordering.empty()) attribute.ordering = superior->ordering;
     if (attribute.substrings.empty()) attribute.substrings = superior->substrings;
-    if (attribute.syntax.empty()) attribute.syntax = superior->syntax;
+    if (attribute.syntax.empty()) {
+      attribute.syntax = superior->syntax;
+      attribute.max_characters = superior->max_characters;
+    }
     attribute.secret = attribute.secret || superior->secret;
   }
 

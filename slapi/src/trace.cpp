@@ -12,8 +12,7 @@ std::atomic<std::uint32_t> trcEvents{0};
 namespace {
 
 // How plug-ins write "name: value" records: the name first, then the value, both texts.
-constexpr const char* kNamedValueFormats[] = {trace::name_and_value,
-                                              " Attribute %s: has value %s \n"};
+constexpr const char* kNamedValueFormats[] = {trace::name_and_value, trace::attribute_and_value};
 constexpr char kMask[] = "********";
 
 bool trace_has(std::uint32_t bits) noexcept {
@@ -37,7 +36,7 @@ void add_named_value(slapi::Record& record, const char* format, const char* name
   if (std::strcmp(format, kNamedValueFormats[0]) == 0)
     record.add(trace::name_and_value, name, value);
   else
-    record.add(" Attribute %s: has value %s \n", name, value);
+    record.add(trace::attribute_and_value, name, value);
 }
 
 void add_text(slapi::Record& record, const char* format, std::va_list arguments) noexcept {

@@ -39,6 +39,8 @@ void print_all() {
   PrintMessage(0, 8, 167, "O=A", "O=B");
   PrintMessage(0, 8, 174, "CN=P", "CN=SCHEMA");
   PrintMessage(0, 8, 179, "http://x");
+  for (int number = 1; number <= 11; ++number) PrintMessage(0, 9, number, "CN=E", "A", "B");
+  for (int number = 1; number <= 8; ++number) PrintMessage(0, 10, number, "CN=A", "7");
 }
 
 const std::vector<std::string> kBuiltInTexts{
@@ -48,7 +50,31 @@ const std::vector<std::string> kBuiltInTexts{
     "server only.",
     "0/8/174 The pass-through entry 'CN=P' covers the reserved suffix 'CN=SCHEMA', which is never "
     "passed through.",
-    "0/8/179 The value 'http://x' of orv-slapdPtaURL is not an LDAP URL."};
+    "0/8/179 The value 'http://x' of orv-slapdPtaURL is not an LDAP URL.",
+    "0/9/1 The entry 'CN=E' does not fit the schema: it has no object class.",
+    "0/9/2 The entry 'CN=E' does not fit the schema: there is no object class 'A'.",
+    "0/9/3 The entry 'CN=E' does not fit the schema: there is no attribute type 'A'.",
+    "0/9/4 The entry 'CN=E' does not fit the schema: 'A' has more than one value.",
+    "0/9/5 The entry 'CN=E' does not fit the schema: a value of 'A' B.",
+    "0/9/6 The entry 'CN=E' does not fit the schema: its object classes do not allow 'A'.",
+    "0/9/7 The entry 'CN=E' does not fit the schema: it has no structural object class.",
+    "0/9/8 The entry 'CN=E' does not fit the schema: 'A' and 'B' are structural object classes of "
+    "which neither derives from the other.",
+    "0/9/9 The entry 'CN=E' does not fit the schema: its object classes demand 'A'.",
+    "0/9/10 The entry 'CN=E' does not fit the schema: 'A' is a password and cannot be part of a "
+    "name.",
+    "0/9/11 The entry 'CN=E' does not fit the schema: its name has a value of 'A' that the entry "
+    "lacks.",
+    "0/10/1 A new password from 'CN=A' was refused: it is empty.",
+    "0/10/2 A new password from 'CN=A' was refused: it has fewer than 7 characters.",
+    "0/10/3 A new password from 'CN=A' was refused: it has fewer than 7 letters.",
+    "0/10/4 A new password from 'CN=A' was refused: fewer than 7 of its characters are no "
+    "letters.",
+    "0/10/5 A new password from 'CN=A' was refused: one character occurs more than 7 times.",
+    "0/10/6 A new password from 'CN=A' was refused: fewer than 7 different characters are new.",
+    "0/10/7 A new password from 'CN=A' was refused: it is the old one.",
+    "0/10/8 The password policy in the configuration file is not put in force: CN=A. The one "
+    "before stays."};
 
 TEST_F(Messages, HaveBuiltInTextsWithoutACatalogue) {
   EXPECT_FALSE(open_message_catalogue("/nonexistent/orvd.cat"));
@@ -65,6 +91,7 @@ TEST_F(Messages, OfTheInstalledCatalogueAreTheBuiltInOnes) {
 TEST_F(Messages, AreTakenFromTheCatalogueWithArgumentsInItsOrder) {
   ASSERT_TRUE(open_message_catalogue(ORV_TEST_DATA "/translated.cat"));
   print_all();
+  g_messages.resize(5);
   EXPECT_THAT(g_messages,
               testing::ElementsAre("0/8/145 Der Name ist vergeben (100%).", kBuiltInTexts[1],
                                    "0/8/167 O=B liegt unter oder auf O=A.", kBuiltInTexts[3],

@@ -9,14 +9,18 @@
 #include <thread>
 
 #include "configuration_file.h"
+#include "entries.h"
 #include "failing_allocation.h"
+#include "messages.h"
 #include "slapi/codepage.h"
 #include "slapi/control.h"
 #include "slapi/log.h"
 #include "slapi/owners.h"
 #include "slapi/schema.h"
+#include "slapi/services.h"
 #include "slapi/strings.h"
 #include "slapi/trace.h"
+#include "slapi/value_syntax.h"
 #include "values.h"
 
 namespace orv {
@@ -51,6 +55,13 @@ void fail_each_allocation(
       return;
     }
   }
+}
+
+// Releases a list of records as backends do.
+void free_list(ldapmod** list) {
+  if (list == nullptr) return;
+  free_ldmll(list[0]);
+  std::free(list);
 }
 
 class OutOfMemory : public testing::Test {
@@ -161,6 +172,214 @@ TEST_F(OutOfMemory, EntryOfAFileIsNullAndLeavesNothing) {
             "kept inside a string object||; ");
 }
 
+// ---- The schema check ------------------------------------------------------------------------
+
+TEST_F(OutOfMemory, SchemaCheckSays90AndNothingElse) {
+  test::MessageRecorder messages;
+  const EntryPtr e = test::make_entry(
+      "cn=a member with a name too long for a short string,CN=ADMINGROUP,CN=CONFIGURATION",
+      {{"objectClass", {"top", "orv-slapdConfigEntry", "orv-slapdAdminGroupMember"}},
+       {"cn", {"A Member with a name too long for a short string"}},
+       {"orv-slapdAdminDN", {"cn=a member with a name too long for a short string"}},
+       {"orv-slapdAdminPW", {"a secret that is too long for a short string"}},
+       {"orv-slapdKrbAdminDN", {"orv-kn=a-member-with-a-long-name@EXAMPLE.COM"}},
+       {"orv-slapdDigestAdminUser", {"caf\xC3\xA9 with a name too long for a short string"}},
+       {"orv-slapdAdminRole", {"NoAdmin"}}});
+  int rc = 0;
+  fail_each_allocation(
+      [&] {
+        rc = ldcf_api_schema_check(e.get(), 0, 0);
+        return rc == 0;
+      },
+      [&] { EXPECT_EQ(rc, 90); });
+  EXPECT_THAT(messages.take(), testing::IsEmpty());
+}
+
+TEST_F(OutOfMemory, SchemaCheckOfAnEntryInAnotherCodePageSays90) {
+  set_local_code_page("ISO-8859-1");
+  ASSERT_EQ(initIconvHandle(), 0);
+  const EntryPtr e = test::make_entry("cn=caf\xE9,CN=CONFIGURATION",
+                                      {{"objectClass", {"top", "container"}}, {"cn", {"caf\xE9"}}});
+  e->local_code_page = true;
+  ASSERT_EQ(ldcf_api_schema_check(e.get(), 0, 0), 0);
+  int rc = 0;
+  fail_each_allocation(
+      [&] {
+        rc = ldcf_api_schema_check(e.get(), 0, 0);
+        return rc == 0;
+      },
+      [&] { EXPECT_EQ(rc, 90); });
+  set_local_code_page("UTF-8");
+  ASSERT_EQ(initIconvHandle(), 0);
+}
+
+TEST_F(OutOfMemory, CheckOfAValueSays90) {
+  for (const char* type :
+       {"orv-slapdAdminDN", "orv-slapdKrbAdminDN", "orv-slapdPtaSubtree", "createTimestamp"}) {
+    const char* problem = nullptr;
+    int rc = 0;
+    const std::string value = std::string_view(type) == "createTimestamp"
+                                  ? "20260101000000.123456789Z"
+                                  : "orv-kn=caf\xC3\xA9-with-a-long-name@EXAMPLE.COM";
+    fail_each_allocation(
+        [&] {
+          rc = check_value(*builtin_schema().attribute(type), value, &problem);
+          return rc == 0;
+        },
+        [&] { EXPECT_EQ(rc, 90); });
+    EXPECT_EQ(problem, nullptr);
+  }
+}
+
+// ---- Modification records --------------------------------------------------------------------
+
+// Never a null list: the change would be reported as done.
+TEST_F(OutOfMemory, ListOfAttributesIsOneRecordThatNoChangeAccepts) {
+  const EntryPtr e = test::make_entry(
+      nullptr, {{"objectClass", {"top", "container"}}, {"cn", {"box"}}, {"description", {""}}});
+  long refused = 0;
+  for (long n = 1, hit = 1; hit != 0; ++n) {
+    ASSERT_LT(n, 1000);
+    AllocationFault fault(n);
+    ldapmod** const list = EntryToLDAPMod(e->attributes);
+    fault.disarm();
+    hit = fault.hit() ? 1 : 0;
+    ASSERT_NE(list, nullptr) << n;
+    if (list[0]->mod_type == nullptr) {
+      ++refused;
+      EXPECT_EQ(list[1], nullptr);
+    } else {
+      EXPECT_STREQ(list[2]->mod_type, "description");
+    }
+    free_ldmll(list[0]);
+    std::free(list);
+  }
+  EXPECT_GT(refused, 10);
+}
+
+TEST_F(OutOfMemory, ListOfAttributesLeavesNothingBehind) {
+  const EntryPtr e = test::make_entry(nullptr, {{"cn", {"box", "crate"}}, {"description", {"x"}}});
+  for (long n = 1, hit = 1; hit != 0; ++n) {
+    ASSERT_LT(n, 1000);
+    AllocationFault fault(n);
+    free_list(EntryToLDAPMod(e->attributes));
+    fault.disarm();
+    hit = fault.hit() ? 1 : 0;
+    // The reserve that an earlier call took is made again, or was taken by this one.
+    EXPECT_LE(std::abs(fault.balance()), 1) << n;
+  }
+  AllocationFault none(0);
+  for (int i = 0; i < 10; ++i) free_list(EntryToLDAPMod(e->attributes));
+  none.disarm();
+  EXPECT_LE(none.balance(), 1);
+}
+
+// Every allocation fails for a while, as it does when memory is short.
+TEST_F(OutOfMemory, ListOfAttributesIsRefusedEachTimeFromTheReserve) {
+  const EntryPtr e = test::make_entry(nullptr, {{"cn", {"box"}}});
+  AllocationFault fault(1);
+  ldapmod** const list = EntryToLDAPMod(e->attributes);
+  fault.disarm();
+  ASSERT_NE(list, nullptr);
+  EXPECT_EQ(list[0]->mod_type, nullptr);
+  free_list(list);
+}
+
+TEST_F(OutOfMemory, DeletedValuesStay) {
+  const EntryPtr e = test::make_entry(
+      nullptr, {{"objectClass", {"top", "container", "referral"}},
+                {"cn", {"a value too long to be kept inside a string object", "box"}}});
+  char* wanted[] = {strdup("A value too long to be kept inside a string object"), nullptr};
+  char type[] = "cn";
+  ldapmod record{kModDelete, type, {.modv_strvals = wanted}, nullptr};
+  const std::string before = to_text(*e);
+  int rc = 0;
+  const auto attempt = [&] {
+    rc = delete_values_from_entry(e.get(), &record);
+    return rc == 0;
+  };
+  const auto unchanged = [&] {
+    EXPECT_EQ(rc, 90);
+    EXPECT_EQ(to_text(*e), before);
+    EXPECT_EQ(texts_of(e->object_class_list), texts_of(e->object_classes));
+  };
+  fail_each_allocation(attempt, unchanged);
+  EXPECT_EQ(texts_of(attr_find(e.get(), "cn", 0, 0)), std::vector<std::string>{"box"});
+  std::free(wanted[0]);
+}
+
+TEST_F(OutOfMemory, DeletedObjectClassesStay) {
+  const EntryPtr e = test::make_entry(nullptr, {{"objectClass", {"top", "container", "referral"}}});
+  char* wanted[] = {strdup("REFERRAL"), nullptr};
+  char type[] = "objectClass";
+  ldapmod record{kModDelete, type, {.modv_strvals = wanted}, nullptr};
+  int rc = 0;
+  fail_each_allocation(
+      [&] {
+        rc = delete_values_from_entry(e.get(), &record);
+        return rc == 0;
+      },
+      [&] {
+        EXPECT_EQ(rc, 90);
+        EXPECT_EQ(e->object_classes->count, 3);
+        EXPECT_EQ(texts_of(e->object_class_list), texts_of(e->object_classes));
+      });
+  EXPECT_EQ(texts_of(e->object_class_list), (std::vector<std::string>{"top", "container"}));
+  std::free(wanted[0]);
+}
+
+// ---- Passwords, URLs -------------------------------------------------------------------------
+
+TEST_F(OutOfMemory, PasswordIsNeverAccepted) {
+  test::MessageRecorder messages;
+  char password[] = "correct-h0use-of-a-man";
+  char old[] = "another of its kind";
+  int rc = 0;
+  _Admin_pwdPolicy policy = getGlobalAdminPWDPolicyLocal();
+  policy.passwordMaxRepeatedChars = 0;
+  const _Admin_pwdPolicy strict = getGlobalAdminPWDPolicyLocal();
+  ASSERT_EQ(set_admin_password_policy(policy), 0);
+  fail_each_allocation(
+      [&] {
+        rc = verify_admin_password(password, old, nullptr);
+        return rc == 0;
+      },
+      [&] { EXPECT_EQ(rc, 90); });
+  EXPECT_THAT(messages.take(), testing::IsEmpty());
+  ASSERT_EQ(set_admin_password_policy(strict), 0);
+}
+
+TEST_F(OutOfMemory, PolicyBeforeStaysInForce) {
+  test::MessageRecorder messages;
+  test::ConfigurationFile file(
+      "dn: CN=CONFIGURATION\nobjectClass: top\ncn: Configuration\n\n"
+      "dn: CN=PWDPOLICY ADMIN,CN=CONFIGURATION\nobjectClass: orv-slapdAdminPolicy\n"
+      "cn: PwdPolicy Admin\npwdMinLength: 20\n");
+  const _Admin_pwdPolicy strict = getGlobalAdminPWDPolicyLocal();
+  for (long n = 1, hit = 1; hit != 0; ++n) {
+    ASSERT_LT(n, 10000);
+    AllocationFault fault(n);
+    const int rc = load_admin_password_policy(file.session());
+    fault.disarm();
+    hit = fault.hit() ? 1 : 0;
+    ASSERT_EQ(rc, hit != 0 && rc != 0 ? 90 : 0) << n;
+    EXPECT_EQ(getGlobalAdminPWDPolicyLocal().pwdMinLength, rc == 0 ? 20 : 12) << n;
+    ASSERT_EQ(set_admin_password_policy(strict), 0);
+  }
+}
+
+TEST_F(OutOfMemory, UrlIsNotParsed) {
+  LDAPURLDesc* url = nullptr;
+  fail_each_allocation(
+      [&] {
+        const bool parsed = ldap_url_parse("ldaps://host:636/o=x?cn?sub?(cn=*)", &url) == 0;
+        EXPECT_EQ(parsed, url != nullptr);
+        return parsed;
+      },
+      [&] { EXPECT_EQ(url, nullptr); });
+  ldap_free_urldesc(url);
+}
+
 TEST_F(OutOfMemory, ParameterBlockIsNull) {
   PblockPtr block;
   fail_each_allocation([&] {
@@ -201,12 +420,23 @@ TEST_F(OutOfMemory, LightFormIsNull) {
   EXPECT_EQ(dn->error, 0);
 }
 
-TEST_F(OutOfMemory, ParentIsNull) {
-  MallocText text;
-  fail_each_allocation([&] {
-    text.reset(dn_parent_norm(nullptr, "CN=A,CN=B"));
-    return text != nullptr;
-  });
+// Null would say that the entry needs no parent.
+TEST_F(OutOfMemory, ParentIsNoDn) {
+  for (int i = 0; i < 3; ++i) {
+    const MallocText warm(dn_parent_norm(nullptr, "CN=A,CN=B"));
+    EXPECT_STREQ(warm.get(), "CN=B");
+    AllocationFault fault(1);
+    const MallocText text(dn_parent_norm(nullptr, "CN=A,CN=B"));
+    fault.disarm();
+    EXPECT_TRUE(fault.hit());
+    EXPECT_STREQ(text.get(), "=");
+    EXPECT_NE(slapi_dn_compare_v3(text.get(), text.get()), 0) << "is a DN";
+  }
+}
+
+TEST_F(OutOfMemory, NoParentIsStillNull) {
+  AllocationFault fault(1);
+  EXPECT_EQ(dn_parent_norm(nullptr, "CN=A"), nullptr);
 }
 
 TEST_F(OutOfMemory, CopyIsNull) {
@@ -383,6 +613,31 @@ TEST(NoAllocation, IsMadeByAMessage) {
   set_message_sink([](int, int, int, const char*) noexcept {});
   AllocationFault fault(1);
   PrintMessage(0, 8, 167, "O=A", "O=B");
+  fault.disarm();
+  EXPECT_EQ(fault.allocations(), 0);
+}
+
+TEST(NoAllocation, IsMadeByAMapping) {
+  current_schema();
+  AllocationFault fault(1);
+  EXPECT_EQ(verifyAttributeMapping("uid = mail, cn = 2.5.4.3", nullptr, nullptr), 0);
+  fault.disarm();
+  EXPECT_EQ(fault.allocations(), 0);
+}
+
+TEST(NoAllocation, IsMadeByThePolicy) {
+  AllocationFault fault(1);
+  EXPECT_TRUE(pwdIsAdminPolicyOn());
+  EXPECT_EQ(validate_new_settings(getGlobalAdminPWDPolicyLocal(), true), 0);
+  fault.disarm();
+  EXPECT_EQ(fault.allocations(), 0);
+}
+
+TEST(NoAllocation, IsMadeByAReferral) {
+  const EntryPtr e = entry_with("objectClass", {"top", "referral"});
+  current_schema();
+  AllocationFault fault(1);
+  EXPECT_EQ(checkReferral(e.get()), 53);
   fault.disarm();
   EXPECT_EQ(fault.allocations(), 0);
 }

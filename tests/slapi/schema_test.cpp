@@ -75,6 +75,8 @@ TEST(Schema, ReadsWhatATypeSays) {
   EXPECT_EQ(first.ordering, "caseExactOrderingMatch");
   EXPECT_EQ(first.substrings, "caseExactSubstringsMatch");
   EXPECT_EQ(first.syntax, "1.3.6.1.4.1.1466.115.121.1.15");
+  EXPECT_EQ(first.max_characters, 64U);
+  EXPECT_EQ(schema->attribute("hidden")->max_characters, 0U);
   EXPECT_TRUE(first.single_valued);
   EXPECT_FALSE(first.operational);
   EXPECT_FALSE(first.no_user_modification);
@@ -89,6 +91,7 @@ TEST(Schema, InheritsRulesAndSyntaxFromASuperior) {
   EXPECT_EQ(second.ordering, "caseExactOrderingMatch");
   EXPECT_EQ(second.substrings, "caseExactSubstringsMatch");
   EXPECT_EQ(second.syntax, "1.3.6.1.4.1.1466.115.121.1.15");
+  EXPECT_EQ(second.max_characters, 64U);
   EXPECT_FALSE(second.single_valued);
   EXPECT_TRUE(second.operational);
   EXPECT_TRUE(second.no_user_modification);

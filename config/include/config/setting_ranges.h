@@ -18,6 +18,9 @@ namespace setting_bounds {
 inline constexpr std::int64_t seconds = 86400;
 inline constexpr std::int64_t count = 1000000;
 inline constexpr std::int64_t bytes = 1 << 30;
+// Of the password policy: what validate_new_settings (slapi/services.h) accepts.
+inline constexpr std::int64_t policy_number = 1000000;
+inline constexpr std::int64_t policy_length = 256;
 inline constexpr std::int64_t any = std::numeric_limits<std::int32_t>::max();
 }  // namespace setting_bounds
 
@@ -40,14 +43,16 @@ inline constexpr SettingRange kSettingRanges[] = {
     {"orv-slapdOperationWait", 1, setting_bounds::seconds},
     {"orv-slapdWriteTimeOut", 1, setting_bounds::seconds},
     {"orv-slapdMessageTimeOut", 1, setting_bounds::seconds},
-    {"pwdMinLength", 0, setting_bounds::any},
-    {"passwordMinAlphaChars", 0, setting_bounds::any},
-    {"passwordMinOtherChars", 0, setting_bounds::any},
-    {"passwordMaxRepeatedChars", 0, setting_bounds::any},
-    {"passwordMinDiffChars", 0, setting_bounds::any},
-    {"pwdMaxFailure", 0, setting_bounds::any},
-    {"pwdFailureCountInterval", 0, setting_bounds::any},
-    {"pwdLockoutDuration", 0, setting_bounds::any},
+    {"orv-slapdMaxPersistentSearches", 0, setting_bounds::count},
+    {"orv-slapdMaxPersistentSearchesPerConnection", 1, setting_bounds::count},
+    {"pwdMinLength", 0, setting_bounds::policy_length},
+    {"passwordMinAlphaChars", 0, setting_bounds::policy_length},
+    {"passwordMinOtherChars", 0, setting_bounds::policy_length},
+    {"passwordMaxRepeatedChars", 0, setting_bounds::policy_length},
+    {"passwordMinDiffChars", 0, setting_bounds::policy_length},
+    {"pwdMaxFailure", 0, setting_bounds::policy_number},
+    {"pwdFailureCountInterval", 0, setting_bounds::policy_number},
+    {"pwdLockoutDuration", 0, setting_bounds::policy_number},
 };
 
 // Values of orv-slapdLogLevel, in any letter case.

@@ -22,7 +22,8 @@ ldap_escDN* dn_normalize_light_esc(const char* dn);
 void free_ldap_escDN(ldap_escDN* dn);  // null is a no-op
 
 // The parent of a normalised DN: a malloced text, or null when the DN is a suffix of the backend or
-// has no parent, or without memory. A null backend has no suffixes.
+// has no parent. A null backend has no suffixes. Without memory the text is "=", which is no DN:
+// who finds no parent takes the entry for one that needs none.
 char* dn_parent_norm(const Backend* backend, const char* normalized_dn);
 
 // 1 when one of two normalised DNs equals the other or lies below it, else 0. The empty DN is above

@@ -75,29 +75,43 @@ entry* CFGMessage2Entry(_CFG* session, _CFGMessage* record);
 // Frees a null-terminated array of texts and each text; null is a no-op.
 void charray_free(char** array);
 
-// ---- Changes of entries. Declared for those who write against this interface; a program that
-// calls them does not link yet.
+// ---- Changes of entries
 
 // Applies a delete modification: without values the whole attribute goes, else each value by the
-// equality rule. 0; 16 attribute or value missing; 90. For a secret type the earliest value goes,
-// whatever the modification says, so that nothing can be learned from the code.
+// equality rule, all of them or none; a value that is named twice must be there twice. 0; 16
+// attribute or value missing; 21 the entry is in the local code page and that lacks a character of
+// a value; 90; 80 a null argument. For a secret type each value of the modification takes the
+// earliest value of the entry, whatever it says, so that nothing can be learned from the code.
 int delete_values_from_entry(entry* e, ldapmod* modification);
 
 // The list form of attributes that the configuration-file library writes: a malloced
 // null-terminated array of add records with deep copies of type and values (strings, read up to
-// their NUL), linked through `mod_next` in array order. Null only for an empty list.
+// their NUL), linked through `mod_next` in array order. Released with `free_ldmll` on the first
+// record, then free on the array.
+// Without memory, and for a list that is shorter than the entry whose schema check came last on
+// this thread (both have the same type texts), the array holds one record without a type, which no
+// change accepts: a backend would otherwise report nothing, or half an entry, as written. Null only
+// for an empty list, and when memory fails again while the last such answer is still held.
 ldapmod** EntryToLDAPMod(attr* attributes);
 
 // Frees a linked list of records; null is a no-op. And an array of them: each record, and the array
-// itself when `free_array` is not 0.
+// itself when `free_array` is not 0. Values go by the arm that the flag kModBvalues names.
 void free_ldmll(ldapmod* first);
 void ldap_mods_free(ldapmod** array, int free_array);
 
-// Checks an entry against the schema. The two flags are reserved and 0. 0; 17 unknown type; 65
-// class rules; 21 syntax; 19 too many values; 64 the RDN's value is not in the entry.
+// Checks an entry against the schema in force. The two flags are reserved and 0. 0, or the first of
+//   65  no object class, or one that is unknown
+//   17  an attribute type that is unknown or carries options
+//   19  a second value of a single-valued type, or a value longer than its type allows
+//   21  a value that is not of its type's syntax, or an attribute without values
+//   65  an attribute that the classes do not allow; none or two structural classes; an attribute
+//       that the classes demand and the entry lacks
+//   64  a password in the RDN, or a value of the RDN that the entry lacks
+//   34  a DN that is none; 90 no memory; 80 a null entry
+// What is wrong goes to the server log as a message of set 9, without values.
 int ldcf_api_schema_check(entry* e, int reserved1, int reserved2);
 
-// 0 for an entry without object class "referral", else 53.
+// 0 for an entry without object class "referral" (under any of its names), else 53.
 int checkReferral(entry* e);
 
 }  // namespace orv

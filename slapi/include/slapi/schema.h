@@ -33,7 +33,8 @@ struct SchemaAttribute {
   std::string equality;            // rule name, may be inherited
   std::string ordering;
   std::string substrings;
-  std::string syntax;  // numeric OID
+  std::string syntax;              // numeric OID
+  std::size_t max_characters = 0;  // the syntax's bound ("{64}"), 0 without one
   bool single_valued = false;
   bool no_user_modification = false;
   bool operational = false;

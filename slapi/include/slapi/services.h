@@ -1,8 +1,7 @@
-// Services of the server that guard identities, passwords, addresses and back ends. Declared for
-// those who write against this interface; a program that calls them does not link yet.
+// Services of the server that guard identities, passwords, addresses and back ends.
 //
 // None of them enters a backend, waits for the server's admission of operations, or blocks: they
-// are called from inside handlers.
+// are called from inside handlers. None throws; all are thread-safe.
 #pragma once
 
 #include <cstddef>
@@ -11,33 +10,84 @@
 
 namespace orv {
 
-// Non-zero when `dn` is the master server identity of `suffix`, or of the whole server when suffix
-// is null.
-int checkMasterSrvDn(const char* suffix, const char* dn);
+// ---- The password policy of administrators: the entry CN=PWDPOLICY ADMIN,CN=CONFIGURATION.
+//
+// The policy in force is a copy in memory. Whoever reads the configuration file for the server
+// renews it with `load_admin_password_policy`: at the start, when the server is told to read its
+// settings again, and after a change of the tree. Until the first good reading the strict policy of
+// the default configuration is in force, afterwards the last good one: neither a damaged entry nor
+// one that was taken out opens anything.
 
-// The administrator password policy, handed around by value.
+// Handed around by value.
 struct _Admin_pwdPolicy {  // NOLINT(bugprone-reserved-identifier) the name is part of the interface
   char enabled;
   char pwdLockout;
-  int pwdLockoutDuration;  // seconds
+  int pwdLockoutDuration;  // seconds; 0: until the password is set anew
   int pwdMaxFailure;
-  int pwdFailureCountInterval;  // seconds
-  int pwdMinLength;
+  int pwdFailureCountInterval;  // seconds; 0: until the next success
+  int pwdMinLength;             // characters
   int passwordMinAlphaChars;
   int passwordMinOtherChars;
-  int passwordMaxRepeatedChars;
-  int passwordMinDiffChars;
+  int passwordMaxRepeatedChars;  // occurrences of one character; 0: no limit
+  int passwordMinDiffChars;      // different characters that the old password does not have
   int reserved[2];
 };
 
+// Whether new passwords of administrators must comply, and, apart from that, whether failed binds
+// lock an administrator out.
 bool pwdIsAdminPolicyOn();
 bool pwdIsAdminPasswordLockoutOn();
 _Admin_pwdPolicy getGlobalAdminPWDPolicyLocal();
-// 0 acceptable, 19 the limits are out of range or contradict one another.
+
+// 0 acceptable; 19 the limits are out of range (0 to 1,000,000, lengths to 256) or contradict one
+// another: more letters and others than characters, more new characters than characters, a lockout
+// without a number of failures. `check_all` is passed as true; false looks at the ranges only.
 int validate_new_settings(_Admin_pwdPolicy policy, bool check_all);
-// 0 the new password complies, 19 it does not (the reason goes to the error log). `old_password`
-// may be null, a clear text or a stored hash.
+
+// Puts a policy in force. 0; 19, with the policy before still in force.
+int set_admin_password_policy(const _Admin_pwdPolicy& policy) noexcept;
+
+// Reads the policy entry with a bound session and puts it in force; settings that it lacks have the
+// strict policy's values. 0; 32 no such entry; 19 limits that `validate_new_settings` refuses; 21 a
+// value that is no number or boolean; 90; else the session's code. After anything but 0 the policy
+// before is still in force, and message 8 of set 10 tells why.
+int load_admin_password_policy(_CFG* session) noexcept;
+
+// Whether a password that is to be set complies with the policy in force, on or off. `new_password`
+// is the clear text. `old_password` may be null, a clear text or a stored hash; of a hash only
+// whether the new password is the same can be told. 0; 19 it does not comply (the reason goes to
+// the server log as a message of set 10, never the password); 90; 80 a null password.
 int verify_admin_password(char* new_password, char* old_password, Operation* operation);
+
+// ---- Pass-through authentication
+
+// Whether an attribute mapping is well formed: 0; 21, also for null. The grammar, with blanks
+// allowed around "=" and ",":
+//   mapping = pair *( "," pair )        ; at most 16 pairs, 1024 bytes
+//   pair    = local "=" remote          ; attribute types: names or numeric OIDs of RFC 4512, 1.4
+// The local types are those of this server's schema, none twice; passwords are not mapped.
+// The other two arguments are reserved and null.
+int verifyAttributeMapping(const char* mapping, void* reserved1, void* reserved2);
+
+// LDAP URLs (RFC 4516), as the LDAP client library reads them: also "ldaps" and "ldapi", a URL in
+// angle brackets, without a host ("") or with a port of 0 where none is given for a local socket.
+// Whoever connects checks host and port.
+struct LDAPURLDesc {
+  char* scheme;
+  char* host;
+  int port;
+  char* dn;
+};
+// 0, with a description for `ldap_free_urldesc`; else, with null: not a URL, or no memory.
+int ldap_url_parse(const char* url, LDAPURLDesc** description);
+void ldap_free_urldesc(LDAPURLDesc* description);  // null is a no-op
+
+// ---- Declared for those who write against this interface; a program that calls what follows does
+// not link yet.
+
+// Non-zero when `dn` is the master server identity of `suffix`, or of the whole server when suffix
+// is null.
+int checkMasterSrvDn(const char* suffix, const char* dn);
 
 // The server's record of an administrator's failures; lives as long as the process.
 struct AdminPasswordRecord {
@@ -57,9 +107,6 @@ int convertPWEncryptionMethod(const char* name, int* method);
 // Whether a literal address is one of the host's.
 bool isValidIPAddressOnSystem(const char* address);
 
-// Whether an attribute mapping of pass-through authentication is well formed: 0 or 21.
-int verifyAttributeMapping(const char* mapping, void* reserved1, void* reserved2);
-
 // The backend that serves a DN, or null.
 Backend* select_backend_opt(const char* dn);
 
@@ -68,15 +115,5 @@ Backend* select_backend_opt(const char* dn);
 using PluginFunction = int (*)(Backend* backend, int method, char** text);
 // The functions registered under `number`, null-terminated, owned by the server. 0 or non-zero.
 int getAllPluginFuncs(Backend* backend, int number, PluginFunction** list);
-
-// LDAP URLs (RFC 4516).
-struct LDAPURLDesc {
-  char* scheme;
-  char* host;
-  int port;
-  char* dn;
-};
-int ldap_url_parse(const char* url, LDAPURLDesc** description);  // 0, else not a URL
-void ldap_free_urldesc(LDAPURLDesc* description);
 
 }  // namespace orv

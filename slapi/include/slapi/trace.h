@@ -36,9 +36,10 @@ inline constexpr std::uint32_t info = 0xC8010000;   // general flow
 inline constexpr std::uint32_t close = 0xC8030000;  // the close handler's invalid-backend messages
 
 // For a value that may be a secret: the attribute's name, then the value. The writer knows records
-// by this text and masks the value where it has to; with any other text the value would stand
+// by these texts and masks the value where it has to; with any other text the value would stand
 // there.
 inline constexpr const char* name_and_value = "%s: %s\n";
+inline constexpr const char* attribute_and_value = " Attribute %s: has value %s \n";
 }  // namespace trace
 
 // Sinks behind the class below: one call for each record that the mask lets through.
