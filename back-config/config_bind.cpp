@@ -107,7 +107,7 @@ void config_end(ConfigBackendPrivate* state) {
   if (pthread_mutex_unlock(&state->configMutex) != 0) trace.debug(trace::info, kNotUnlocked);
 }
 
-void OperationSession::release_without_taking() {
+void OperationSession::close() {
   cfg_unbind(connection_->config_session);
   connection_->config_session = nullptr;
   config_end(state_);

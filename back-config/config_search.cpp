@@ -9,6 +9,7 @@
 #include <memory>
 
 #include "auto_lock.h"
+#include "callers.h"
 #include "cfg/owners.h"
 #include "cfg/result_codes.h"
 #include "config_add.h"
@@ -144,21 +145,6 @@ int has_search_authority(const Connection* /*connection*/, const Operation* oper
 // ======== What each caller sees
 
 namespace {
-
-bool is_primary_administrator(const Operation& operation) {
-  return (operation.authority & authority::primary_administrator) ==
-         authority::primary_administrator;
-}
-
-// The normal form of a copy of `dn` (which may be null). 0; 90 no copy could be made; the code of
-// `replace_DN`.
-int normalized_copy(const char* dn, MallocText& copy) {
-  char* text = slapi_ch_strdup(dn);
-  if (text == nullptr) return result::no_memory;
-  const int rc = replace_DN(&text, 1);
-  copy.reset(text);
-  return rc;
-}
 
 // Takes an attribute out of the entry, if it is there. 0 or 16.
 int hide(entry& e, const char* attribute) {
@@ -361,18 +347,10 @@ bool client_is_gone(const Connection& connection) {
   return connection.state == 0 && connection.aux != nullptr && connection.aux->client_gone != 0;
 }
 
-int to_local_code_page(const char* text, MallocText& local) {
-  char* converted = nullptr;
-  std::size_t length = 0;
-  const int rc = cfg_xlate_utf8_to_localcp(text, &converted, &length);
-  local.reset(converted);
-  return rc;
-}
-
 int convert_arguments(SearchRequest& request) {
-  const int rc = to_local_code_page(request.target_dn, request.local_base);
+  const int rc = convert(cfg_xlate_utf8_to_localcp, request.target_dn, request.local_base);
   if (rc != 0) return rc;
-  return to_local_code_page(request.filter, request.local_filter);
+  return convert(cfg_xlate_utf8_to_localcp, request.filter, request.local_filter);
 }
 
 }  // namespace

@@ -37,11 +37,14 @@ class OperationSession {
   // The handle in the connection's slot; null before `open`.
   [[nodiscard]] _CFG* handle() const noexcept { return connection_->config_session; }
 
-  // Unbinds what is in the slot, empties it and unlocks, also when `open` failed or was never
-  // called. A caller that holds no lock so releases the lock of whoever does: the server therefore
-  // admits one operation at a time. In return a handle or a lock that a failed operation left
-  // behind is cleaned away by the next search, even one that is refused.
-  void release_without_taking();
+  // Unbinds the handle, empties the slot and unlocks. After an `open` that gave 0.
+  void close();
+
+  // The same, also when `open` failed or was never called. A caller that holds no lock so releases
+  // the lock of whoever does: the server therefore admits one operation at a time. In return a
+  // handle or a lock that a failed operation left behind is cleaned away by the next search, even
+  // one that is refused.
+  void release_without_taking() { close(); }
 
  private:
   Connection* connection_;

@@ -9,6 +9,7 @@
 #include "config_names.h"
 #include "function_ids.h"
 #include "slapi/codepage.h"
+#include "slapi/dn.h"
 #include "slapi/owners.h"
 #include "slapi/strings.h"
 #include "slapi/trace.h"
@@ -41,6 +42,22 @@ int cfg_xlate_localcp_to_utf8(const char* text, char** result, std::size_t* leng
 int cfg_xlate_utf8_to_localcp(const char* text, char** result, std::size_t* length) {
   ldtr_function_local trace(function_id::utf8_to_local);
   return trace.exit(xlate_utf8_to_localcp(text, result, length));
+}
+
+int convert(CodePageDirection& direction, const char* text, MallocText& owner) {
+  char* converted = nullptr;
+  std::size_t length = 0;
+  const int rc = direction(text, &converted, &length);
+  owner.reset(converted);
+  return rc;
+}
+
+int normalized_copy(const char* dn, MallocText& copy) {
+  char* text = slapi_ch_strdup(dn);
+  if (text == nullptr) return result::no_memory;
+  const int rc = replace_DN(&text, 1);
+  copy.reset(text);
+  return rc;
 }
 
 // ---- One attribute of one entry

@@ -7,6 +7,7 @@
 #include <cstddef>
 
 #include "slapi/entry.h"
+#include "slapi/owners.h"
 
 namespace orv {
 
@@ -15,6 +16,15 @@ namespace orv {
 // null.
 int cfg_xlate_localcp_to_utf8(const char* text, char** result, std::size_t* length);
 int cfg_xlate_utf8_to_localcp(const char* text, char** result, std::size_t* length);
+
+// The same with an owner for the result: `direction` is one of the two above. Its code; `owner` is
+// null when nothing was made.
+using CodePageDirection = int(const char* text, char** result, std::size_t* length);
+int convert(CodePageDirection& direction, const char* text, MallocText& owner);
+
+// The normal form of a copy of `dn`, both in UTF-8. 0; 90 no copy could be made (also of null); the
+// code of `replace_DN`, with `copy` as `dn` was.
+int normalized_copy(const char* dn, MallocText& copy);
 
 // Searches at `dn` (local code page) for "(objectclass=*)", asking for one attribute. 0 with the
 // result in `*chain`, for `cfg_msgfree`; 32 no such entry; 90 no memory; 80 any other failure.

@@ -26,12 +26,36 @@ inline constexpr std::uint32_t config_end = make(File::frame, 5);
 inline constexpr std::uint32_t config_back_bind = make(File::frame, 6);
 inline constexpr std::uint32_t config_back_unbind = make(File::frame, 7);
 inline constexpr std::uint32_t config_back_delete = make(File::frame, 8);
+inline constexpr std::uint32_t check_delete_authority = make(File::frame, 9);
+inline constexpr std::uint32_t get_num_current_psearches = make(File::frame, 10);
 
 inline constexpr std::uint32_t config_back_add = make(File::add, 1);
 inline constexpr std::uint32_t get_admin_dn = make(File::add, 2);
 inline constexpr std::uint32_t get_admin_kerberos_id = make(File::add, 3);
 inline constexpr std::uint32_t get_admin_digest_user_name = make(File::add, 4);
 inline constexpr std::uint32_t get_admin_group_member_dn = make(File::add, 5);
+inline constexpr std::uint32_t does_admin_group_member_dn_exist = make(File::add, 6);
+inline constexpr std::uint32_t does_replication_supplier_dn_exist = make(File::add, 7);
+inline constexpr std::uint32_t does_kerberos_id_exist = make(File::add, 8);
+inline constexpr std::uint32_t does_digest_user_name_exist = make(File::add, 9);
+inline constexpr std::uint32_t does_proxy_split_name_exist = make(File::add, 10);
+inline constexpr std::uint32_t check_if_admin_group_entry = make(File::add, 11);
+inline constexpr std::uint32_t check_if_repl_supplier_entry = make(File::add, 12);
+inline constexpr std::uint32_t check_if_kerberos_entry = make(File::add, 13);
+inline constexpr std::uint32_t check_if_digest_entry = make(File::add, 14);
+inline constexpr std::uint32_t check_if_proxy_split_container = make(File::add, 15);
+inline constexpr std::uint32_t check_admin_policy_entry = make(File::add, 16);
+inline constexpr std::uint32_t process_roles_if_admin_group_entry = make(File::add, 17);
+inline constexpr std::uint32_t check_if_passthru_subtree_entry = make(File::add, 18);
+inline constexpr std::uint32_t verify_passthrough_server_entry = make(File::add, 19);
+inline constexpr std::uint32_t does_conflicting_pta_subtree_exist = make(File::add, 20);
+inline constexpr std::uint32_t check_all_pta_entries = make(File::add, 21);
+inline constexpr std::uint32_t check_add_authority = make(File::add, 22);
+inline constexpr std::uint32_t check_if_exists = make(File::add, 23);
+inline constexpr std::uint32_t check_for_parent = make(File::add, 24);
+inline constexpr std::uint32_t check_for_rep = make(File::add, 25);
+inline constexpr std::uint32_t xlate_attrs = make(File::add, 26);
+inline constexpr std::uint32_t cleanup_attrs = make(File::add, 27);
 
 inline constexpr std::uint32_t config_back_modify = make(File::modify, 1);
 

@@ -2,8 +2,8 @@
 //
 // Handlers are called from the server's worker threads, one call for each client operation. Each
 // reads its arguments from the parameter block, sends its own result to the client, and returns the
-// LDAP code of the operation. Search and unbind take `configMutex` for as long as they work with a
-// session, and only then; the other handlers take no lock.
+// LDAP code of the operation. Search, add, delete and unbind take `configMutex` for as long as they
+// work with a session, and only then; the other handlers take no lock.
 #pragma once
 
 #include "slapi/pblock.h"
@@ -45,9 +45,19 @@ int config_back_unbind(pblock* pb);
 // every path but that of a client who is gone, even when it was never taken.
 int config_back_search(pblock* pb);
 
-// Not offered: these answer 53 (unwilling to perform).
+// Adds the entry in `pb` to the configuration file (see config_add.h for the rules). Rewrites the
+// entry: the roles of a member of the administrative group are settled in it. Always answers when
+// connection and operation are known. When the session cannot be opened the slot and `configMutex`
+// stay as `init_cfg_ld` left them: the server has to bring the backend back to rest.
 int config_back_add(pblock* pb);
-int config_back_modify(pblock* pb);
+
+// Removes an entry from the configuration file (see config_delete.h for who may). While persistent
+// searches run, the entry as it was is stored as parameter -157 in the operation's block, also when
+// the delete then fails; it is the server's to release. When the session cannot be opened
+// **nothing is sent**, and slot and lock stay as in `config_back_add`.
 int config_back_delete(pblock* pb);
+
+// Not offered: answers 53 (unwilling to perform).
+int config_back_modify(pblock* pb);
 
 }  // namespace orv

@@ -5,6 +5,8 @@
 #include "backend_test.h"
 #include "config_add.h"
 #include "config_xlate.h"
+#include "slapi/owners.h"
+#include "slapi/psearch.h"
 
 namespace orv {
 namespace {
@@ -30,8 +32,10 @@ class FailingAllocations : public BackendTest {
     return 0;
   }
 
+  bool session_was_kept();
+
   // What may stay where a record is given up: the library's values and the cursor.
-  void expect_only_given_up_values_left(std::vector<std::string> besides) {
+  void expect_only_given_up_values_left(const std::vector<std::string>& besides) {
     std::vector<std::string> left = platform.leaks();
     const auto kept = [](const std::string& word) {
       return word == "cfg_value" || word == "cfg_values" || word == "cursor";
@@ -88,10 +92,128 @@ TEST_F(FailingAllocations, RefusedSearchAllocatesNothing) {
 }
 
 TEST_F(FailingAllocations, OtherHandlersAllocateNothing) {
-  for (const Handler handler : {config_back_bind, config_back_unbind, config_back_add,
-                                config_back_delete, config_back_modify, config_back_close}) {
+  for (const Handler handler :
+       {config_back_bind, config_back_unbind, config_back_modify, config_back_close}) {
     EXPECT_EQ(each([&] { platform.run([&] { return handler(&pb); }); }, [] {}), 0);
   }
+}
+
+// A session that could not be opened for lack of memory keeps the lock, and its handle in the slot.
+// Puts both back; true when that was so.
+bool FailingAllocations::session_was_kept() {
+  if (!locked()) {
+    EXPECT_EQ(connection.config_session, nullptr);
+    return false;
+  }
+  EXPECT_EQ(platform.count("cfg_unbind"), 0);
+  EXPECT_EQ(platform.count("cfg_bind_s"), 1);
+  EXPECT_NE(connection.config_session, nullptr);
+  close_session();
+  platform.set_held(&state.configMutex, false);
+  return true;
+}
+
+TEST_F(FailingAllocations, AddOfAMemberAnswersOnceAndComesToRest) {
+  as(0x0C);
+  platform.admin_policy = true;
+  platform.file["CN=CONFIGURATION"] = {{{"CN=CONFIGURATION", {{"orv-slapdAdminDN", {"cn=x"}}}}}};
+  platform.file["CN=ADMINGROUP,CN=CONFIGURATION"] = {
+      {{"CN=ADMINGROUP,CN=CONFIGURATION", {{"orv-slapdAdminDN", {"cn=y"}}}}}};
+  int rc = -1;
+  int successes = 0;
+  EntryPtr e;
+  const auto add = [&] {
+    e.reset(scripted::make_entry(
+        {"cn=one,cn=admingroup,cn=configuration",
+         {{"objectClass", {"top", "orv-slapdConfigEntry", "orv-slapdAdminGroupMember"}},
+          {"orv-slapdAdminDN", {"cn=one"}},
+          {"orv-slapdAdminPW", {"new"}}}}));
+    pb.put(parameter::add_entry, e.get());
+    rc = platform.run([&] { return config_back_add(&pb); });
+  };
+  const int failed = each(add, [&] {
+    EXPECT_EQ(platform.count("send_ldap_result"), 1);
+    const bool kept = session_was_kept();
+    EXPECT_TRUE(kept ? rc == 1 : rc == 0 || rc == 1 || rc == 80 || rc == 90) << rc;
+    if (rc == 0) ++successes;
+    e.reset();
+    EXPECT_THAT(platform.leaks(), IsEmpty());
+    EXPECT_THAT(platform.violations(), IsEmpty());
+  });
+  EXPECT_EQ(rc, 0);
+  EXPECT_GT(failed, 60);
+  // What passes for a success: the four options of the session; a parent that passes for none; nine
+  // values before the last one, handed on as null; four attributes, each for the end of the entry;
+  // the list of modifications for an empty one.
+  EXPECT_EQ(successes, 4 + 1 + 9 + 4 + 1);
+  EXPECT_EQ(platform.count("cfg_add_s"), 1);
+  e.reset();
+}
+
+TEST_F(FailingAllocations, AddOfAPassThroughEntryAnswersOnceAndComesToRest) {
+  as(0x0C);
+  const char* container = "CN=PASSTHROUGH AUTHENTICATION,CN=CONFIGURATION";
+  platform.file[container] = {{{"cn=other,cn=passthrough authentication,cn=configuration",
+                                {{"orv-slapdPtaSubtree", {"o=b", "o=c"}}}}}};
+  int rc = -1;
+  const EntryPtr e(
+      scripted::make_entry({"cn=one,cn=passthrough authentication,cn=configuration",
+                            {{"objectClass", {"top", "orv-slapdConfigEntry", "orv-slapdPta"}},
+                             {"orv-slapdPtaURL", {"ldap://a"}},
+                             {"orv-slapdPtaSubtree", {"ou=x,o=b", "o=d"}}}}));
+  pb.put(parameter::add_entry, e.get());
+  const std::vector<std::string> before = platform.leaks();
+  const auto add = [&] { rc = platform.run([&] { return config_back_add(&pb); }); };
+  const int failed = each(add, [&] {
+    EXPECT_EQ(platform.count("send_ldap_result"), 1);
+    const bool kept = session_was_kept();
+    // 21 for a URL that there was no memory to parse; 53 and 19 are what the entry deserves.
+    EXPECT_TRUE(kept ? rc == 1 : rc == 1 || rc == 19 || rc == 21 || rc == 80 || rc == 90 || rc == 0)
+        << rc;
+    if (rc == 0) {
+      EXPECT_EQ(platform.count("dn_parent_norm"), 2);
+      EXPECT_EQ(platform.count("ldap_url_parse"), 0);
+    }
+    EXPECT_EQ(platform.leaks(), before);
+    EXPECT_THAT(platform.violations(), IsEmpty());
+  });
+  EXPECT_EQ(rc, 19);
+  EXPECT_GT(failed, 20);
+  EXPECT_EQ(platform.count("cfg_add_s"), 0);
+}
+
+TEST_F(FailingAllocations, DeleteAnswersOnceAndComesToRest) {
+  as(0x0C);
+  operation.parameters = &pb;
+  PSearchMonitor monitor;
+  monitor.begin(1);
+  platform.global_parameters.put(parameter::persistent_search_switch, 1);
+  platform.global_parameters.put(parameter::persistent_search_monitor, &monitor);
+  platform.file["CN=X"] = {{{"CN=X", {{"objectClass", {"top", "x"}}}}}};
+  pb.put(parameter::target_dn, static_cast<const void*>("CN=X"));
+  int rc = -1;
+  const auto release_notice = [&] {
+    const auto kept = pb.values.find(parameter::entry_before_delete);
+    if (kept == pb.values.end()) return false;
+    entry_free(static_cast<entry*>(const_cast<void*>(kept->second.pointer)));
+    pb.values.erase(kept);
+    return true;
+  };
+  int lost_notices = 0;
+  const auto remove = [&] { rc = platform.run([&] { return config_back_delete(&pb); }); };
+  const int failed = each(remove, [&] {
+    const bool kept = session_was_kept();
+    EXPECT_EQ(platform.count("send_ldap_result"), kept ? 0 : 1);
+    const bool noticed = release_notice();
+    if (rc == 0 && !noticed) ++lost_notices;
+    EXPECT_TRUE(rc == 0 || rc == 1 || rc == 16 || rc == 80 || rc == 90) << rc;
+    EXPECT_THAT(platform.leaks(), IsEmpty());
+    EXPECT_THAT(platform.violations(), IsEmpty());
+  });
+  EXPECT_EQ(rc, 0);
+  EXPECT_TRUE(release_notice());
+  EXPECT_GT(failed, 10);
+  EXPECT_EQ(lost_notices, 3);
 }
 
 TEST_F(FailingAllocations, RegistrationAllocatesNothing) {
@@ -147,6 +269,74 @@ TEST_F(FailingAllocations, IdentityLookupsGiveNull) {
     EXPECT_GT(failed, 9);
     std::free(found);
   }
+  close_session();
+}
+
+TEST_F(FailingAllocations, UniquenessChecksGiveACodeAndLeakNothing) {
+  open_session();
+  const std::vector<scripted::ScriptedAttribute> attributes = {{"cn", {"a", "b"}},
+                                                               {"orv-slapdAdminDN", {"cn=x"}},
+                                                               {"orv-slapdMasterDN", {"cn=x"}},
+                                                               {"orv-slapdKrbAdminDN", {"cn=x"}},
+                                                               {"orv-slapdDigestAdminUser", {"x"}},
+                                                               {"orv-slapdProxySplitName", {"x"}}};
+  for (const char* dn :
+       {"CN=CONFIGURATION", "CN=KERBEROS,CN=CONFIGURATION", "CN=DIGEST,CN=CONFIGURATION",
+        "CN=ADMINGROUP,CN=CONFIGURATION",
+        "CN=PROXYDB,CN=PROXY BACKENDS,CN=ORV DIRECTORY,CN=SCHEMAS,CN=CONFIGURATION"}) {
+    platform.file[dn] = {{{dn, attributes}, {dn, attributes}}};
+  }
+  for (const auto& check :
+       {doesAdminGroupMemberDNExist, doesReplicationSupplierDNExist, doesKerberosIDExist,
+        doesDigestUserNameExist, doesProxySplitNameExist}) {
+    int rc = -1;
+    const int failed = each(
+        [&] { rc = platform.run([&] { return check(connection.config_session, "cn=free"); }); },
+        [&] {
+          // Only an identity of the administrator that cannot be read may be passed over.
+          const bool passed_over =
+              platform.count("cfg_search_s") == 2 &&
+              (check == doesKerberosIDExist || check == doesDigestUserNameExist);
+          EXPECT_TRUE(rc == 1 || rc == 80 || rc == 90 || (rc == 0 && passed_over)) << rc;
+          EXPECT_THAT(platform.leaks(), ElementsAre("session"));
+        });
+    EXPECT_EQ(rc, 0);
+    EXPECT_GT(failed, 20);
+  }
+  close_session();
+}
+
+TEST_F(FailingAllocations, RulesOfAnAddedMemberGiveACodeAndLeakNothing) {
+  open_session();
+  as(0x0C);
+  platform.file["CN=CONFIGURATION"] = {{{"CN=CONFIGURATION", {{"orv-slapdAdminDN", {"cn=x"}}}}}};
+  platform.file["CN=ADMINGROUP,CN=CONFIGURATION"] = {
+      {{"CN=ADMINGROUP,CN=CONFIGURATION", {{"orv-slapdAdminDN", {"cn=x"}}}}}};
+  const EntryPtr e(scripted::make_entry(
+      {"CN=ONE,CN=ADMINGROUP,CN=CONFIGURATION",
+       {{"objectClass", {"top", "orv-slapdConfigEntry", "orv-slapdAdminGroupMember"}},
+        {"orv-slapdAdminDN", {"cn=one"}},
+        {"orv-slapdKrbAdminDN", {"orv-kn=one"}},
+        {"orv-slapdDigestAdminUser", {"one"}},
+        {"orv-slapdAdminPW", {"new"}}}}));
+  const std::string as_given = scripted::text_of(*e);
+  const std::vector<std::string> before = platform.leaks();
+  int rc = -1;
+  const auto rules = [&] {
+    rc = platform.run([&] {
+      const int group = checkIfAdminGroupEntry(e->normalized_dn, e.get(), &connection, &operation);
+      if (group != 0) return group;
+      return checkAdminPolicyEntry(e->normalized_dn, e.get(), &connection, &operation);
+    });
+  };
+  const int failed = each(rules, [&] {
+    const bool passed_over = platform.count("cfg_search_s") == 8;
+    EXPECT_TRUE(rc == 1 || rc == 80 || rc == 90 || (rc == 0 && passed_over)) << rc;
+    EXPECT_EQ(platform.leaks(), before);
+    EXPECT_EQ(scripted::text_of(*e), as_given);
+  });
+  EXPECT_EQ(rc, 0);
+  EXPECT_GT(failed, 20);
   close_session();
 }
 

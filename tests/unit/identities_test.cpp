@@ -157,6 +157,7 @@ TEST_F(Identities, OthersTakeTheFirstOfSeveralValues) {
   EXPECT_EQ(kerberos_id(), "CN=A");
   EXPECT_EQ(digest_user(), "a");
   EXPECT_EQ(member_dn(), "CN=C");
+  EXPECT_THAT(platform.debug_lines(), Not(Contains(error("Error: more then one admin DN "))));
 }
 
 TEST_F(Identities, AbsentAttributeGivesNullWithCodeZero) {

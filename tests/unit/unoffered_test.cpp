@@ -14,8 +14,7 @@ TEST_P(Unoffered, IsAnsweredWith53AndAnEmptyTextAndTouchesNoLock) {
   EXPECT_EQ(platform.count("pthread_mutex_unlock"), 0);
 }
 
-INSTANTIATE_TEST_SUITE_P(AddDeleteModify, Unoffered,
-                         testing::Values(config_back_add, config_back_delete, config_back_modify));
+INSTANTIATE_TEST_SUITE_P(Modify, Unoffered, testing::Values(config_back_modify));
 
 }  // namespace
 }  // namespace orv

@@ -118,7 +118,8 @@ int cfg_search_s(_CFG* session, const char* base, int scope, const char* filter,
   const Call call("cfg_search_s", session, base, scope, filter, attributes, types_only);
   *chain = nullptr;
   if (const auto failure = call.failure_or_no_memory()) return done(*failure);
-  const auto answer = platform().file.find(base);
+  auto answer = platform().file.find(std::string(base) + "?" + filter);
+  if (answer == platform().file.end()) answer = platform().file.find(base);
   if (answer == platform().file.end()) return done(32);
   if (answer->second.code == 0 || !answer->second.entries.empty()) {
     *chain = make_chain(answer->second);
@@ -233,6 +234,32 @@ void cfg_msg_unlink(_CFG* session, _CFGMessage* record) {
   platform().change_owner(record, Owned::loose_record);
 }
 
+namespace {
+
+// "code type=value,value|code type=..."
+std::string text_of(ldapmod** mods) {
+  std::string text;
+  for (ldapmod** mod = mods; *mod != nullptr; ++mod) {
+    text += (mod == mods ? "" : "|") + std::to_string((*mod)->mod_op) + " " + (*mod)->mod_type;
+    for (char** value = (*mod)->mod_vals.modv_strvals; *value != nullptr; ++value) {
+      text += (value == (*mod)->mod_vals.modv_strvals ? "=" : ",") + std::string(*value);
+    }
+  }
+  return text;
+}
+
+}  // namespace
+
+int cfg_add_s(_CFG* session, const char* dn, ldapmod** mods) {
+  const Call call("cfg_add_s", session, dn, text_of(mods).c_str());
+  return done(call.failure_or_no_memory().value_or(0));
+}
+
+int cfg_delete_s(_CFG* session, const char* dn) {
+  const Call call("cfg_delete_s", session, dn);
+  return done(call.failure_or_no_memory().value_or(0));
+}
+
 int cfg_get_errno(_CFG* session) {
   const Call call("cfg_get_errno", session);
   return call.failure().value_or(platform().error);
@@ -243,3 +270,11 @@ void cfg_perror(_CFG* session, const char* text) {
 }
 
 }  // namespace orv
+
+namespace orv::scripted {
+
+const std::vector<ScriptedAttribute>& attributes_of(const _CFGMessage* record) {
+  return record->script->attributes;
+}
+
+}  // namespace orv::scripted

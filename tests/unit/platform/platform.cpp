@@ -38,8 +38,14 @@ const char* word(Owned kind) {
       return "session";
     case Owned::part:
       return "part";
+    case Owned::value:
+      return "value";
     case Owned::escaped_dn:
       return "escaped_dn";
+    case Owned::url:
+      return "url";
+    case Owned::mods:
+      return "mods";
   }
   return "?";
 }
@@ -52,6 +58,7 @@ bool freeable(Owned kind) {
     case Owned::cfg_values:
     case Owned::cfg_value:
     case Owned::loose_record:
+    case Owned::value:
       return true;
     default:
       return false;

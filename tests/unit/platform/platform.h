@@ -30,6 +30,23 @@
 #include "slapi/entry.h"
 #include "slapi/pblock.h"
 
+namespace orv {
+
+// The parameter block of the scripted platform.
+struct pblock {
+  struct Value {
+    const void* pointer = nullptr;
+    int number = 0;
+    bool is_number = false;
+  };
+  std::map<int, Value> values;
+
+  void put(int parameter, const void* pointer) { values[parameter] = {pointer, 0, false}; }
+  void put(int parameter, int number) { values[parameter] = {nullptr, number, true}; }
+};
+
+}  // namespace orv
+
 namespace orv::scripted {
 
 // ---- The script of the configuration file
@@ -80,7 +97,10 @@ enum class Owned {
   cursor,      // cfg_ber_free
   session,     // cfg_unbind
   part,        // of an entry: entry_free, attr_delete
+  value,       // of an entry's attribute, record or text: the same, or free
   escaped_dn,  // free_ldap_escDN
+  url,         // ldap_free_urldesc
+  mods,        // free_ldmll
 };
 
 class Platform {
@@ -102,9 +122,10 @@ class Platform {
 
   // ---- Script
 
-  std::map<std::string, Answer> file;  // by base DN; others answer 32
-  std::string link_target;             // what readlink finds
-  int link_errno = 0;                  // or why it fails
+  // By base DN, or by "base?filter", which comes first; others answer 32.
+  std::map<std::string, Answer> file;
+  std::string link_target;  // what readlink finds
+  int link_errno = 0;       // or why it fails
   std::map<std::string, std::string> environment;
   bool server_debug = false;          // read_ldap_debug()
   pthread_t thread = 0;               // pthread_self()
@@ -113,6 +134,8 @@ class Platform {
   bool keeps_letter_case = false;     // replace_DN does not fold
   bool failed_text_is_left = false;   // a conversion that fails by the script gives a text as well
   bool real_mutexes = false;          // mutexes are taken, and not only modelled
+  bool admin_policy = false;          // pwdIsAdminPolicyOn()
+  pblock global_parameters;           // the server's own block
 
   // The n-th call of a function (from 1; 0 for each) gives `result`: the code it returns, or null
   // with that error number for functions that return a pointer.
@@ -287,25 +310,12 @@ class Call {
 // Fills the connection's send operations.
 void connect(Connection& connection);
 
-// Builds an entry as the server would hand it over (kind memory parts belong to it).
+// Builds an entry as the server would hand it over, for `entry_free`: its DN as the script spells
+// it, and normalised.
 entry* make_entry(const ScriptedEntry& script);
 std::string text_of(const entry& e);
 
+// The script of a record's attributes.
+const std::vector<ScriptedAttribute>& attributes_of(const _CFGMessage* record);
+
 }  // namespace orv::scripted
-
-namespace orv {
-
-// The parameter block of the scripted platform.
-struct pblock {
-  struct Value {
-    const void* pointer = nullptr;
-    int number = 0;
-    bool is_number = false;
-  };
-  std::map<int, Value> values;
-
-  void put(int parameter, const void* pointer) { values[parameter] = {pointer, 0, false}; }
-  void put(int parameter, int number) { values[parameter] = {nullptr, number, true}; }
-};
-
-}  // namespace orv

@@ -10,6 +10,8 @@
 #include "slapi/dn.h"
 #include "slapi/globals.h"
 #include "slapi/log.h"
+#include "slapi/psearch.h"
+#include "slapi/services.h"
 #include "slapi/strings.h"
 #include "slapi/trace.h"
 
@@ -95,12 +97,42 @@ void PrintDebug(std::uint32_t category, const char* format, ...) {
   va_end(arguments);
 }
 
+// The arguments that come with a message are texts; their number goes with the message's.
+void PrintMessage(int severity, int set, int number, ...) {
+  const Unobserved unobserved;
+  const int count = number == 179 ? 1 : number == 174 || number == 167 ? 2 : 0;
+  std::string text =
+      scripted::show(severity) + ", " + scripted::show(set) + ", " + scripted::show(number);
+  std::va_list arguments;
+  va_start(arguments, number);
+  for (int i = 0; i < count; ++i) text += ", " + scripted::show(va_arg(arguments, const char*));
+  va_end(arguments);
+  platform().begin_call("PrintMessage", "PrintMessage(" + text + ")");
+}
+
 // ---- Texts
 
 char* slapi_ch_strdup(const char* text) {
   const Call call("slapi_ch_strdup", text);
   if (text == nullptr || call.failure_or_no_memory()) return nullptr;
   return platform().give_text(Owned::text, text);
+}
+
+int kel_strcasecmp(const char* a, const char* b) {
+  const Call call("kel_strcasecmp", a, b);
+  if (call.failure()) return *call.failure();
+  if (a == nullptr || b == nullptr) return a == b ? 0 : 1;
+  return strcasecmp(a, b);
+}
+
+bool is_string_alphanum(const char* text) {
+  const Call call("is_string_alphanum", text);
+  if (call.failure()) return *call.failure() != 0;
+  if (text == nullptr || *text == '\0') return false;
+  for (const char* c = text; *c != '\0'; ++c) {
+    if (std::isalnum(static_cast<unsigned char>(*c)) == 0) return false;
+  }
+  return true;
 }
 
 std::size_t kel_strlcpy(char* target, const char* source, std::size_t size) {
@@ -211,6 +243,22 @@ int slapi_dn_compare_v3(const char* a, const char* b) {
   return cleaned(a, true) == cleaned(b, true) ? 0 : 1;
 }
 
+// The parent of a scripted DN begins after its first comma.
+char* dn_parent_norm(const Backend* backend, const char* normalized_dn) {
+  const Call call("dn_parent_norm", backend, normalized_dn);
+  const char* comma = std::strchr(normalized_dn, ',');
+  if (comma == nullptr || call.failure_or_no_memory()) return nullptr;
+  return platform().give_text(Owned::text, comma + 1);
+}
+
+int are_nested_dn(const char* a, const char* b) {
+  const Call call("are_nested_dn", a, b);
+  if (call.failure()) return *call.failure();
+  const bool first_is_longer = std::strlen(a) > std::strlen(b);
+  const std::string longer = "," + std::string(first_is_longer ? a : b);
+  return longer.ends_with("," + std::string(first_is_longer ? b : a)) ? 1 : 0;
+}
+
 // ---- Entries
 
 namespace {
@@ -232,11 +280,11 @@ void dispose_attribute(attr* a) {
 }
 
 berval* copy_of(const berval& value) {
-  auto* copy = static_cast<berval*>(platform().give(Owned::part, sizeof(berval)));
+  auto* copy = static_cast<berval*>(platform().give(Owned::value, sizeof(berval)));
   const std::string bytes =
       value.bv_val == nullptr ? std::string() : std::string(value.bv_val, value.bv_len);
   copy->bv_len = bytes.size();
-  copy->bv_val = platform().give_text(Owned::part, bytes);
+  copy->bv_val = platform().give_text(Owned::value, bytes);
   return copy;
 }
 
@@ -249,6 +297,36 @@ attr* make_attribute(const char* type, berval** values) {
   a->values = static_cast<berval**>(platform().give(Owned::part, (count + 1) * sizeof(berval*)));
   for (std::size_t i = 0; i < count; ++i) a->values[i] = copy_of(*values[i]);
   return a;
+}
+
+// The reference to the object class attribute, and its values in short.
+void refresh_object_classes(entry* e) {
+  e->object_classes = *place_of(e, "objectClass");
+  platform().dispose(e->object_class_list);
+  e->object_class_list = nullptr;
+  if (e->object_classes == nullptr) return;
+  const auto count = static_cast<std::size_t>(e->object_classes->count);
+  e->object_class_list =
+      static_cast<ShortValue*>(platform().give(Owned::part, (count + 1) * sizeof(ShortValue)));
+  for (std::size_t i = 0; i < count; ++i) {
+    const berval& value = *e->object_classes->values[i];
+    e->object_class_list[i] = {value.bv_val, value.bv_len};
+  }
+}
+
+void fill(entry* e, const std::vector<scripted::ScriptedAttribute>& attributes) {
+  for (const scripted::ScriptedAttribute& a : attributes) {
+    std::vector<berval> values;
+    for (const std::string& text : a.values) {
+      values.push_back({text.size(), const_cast<char*>(text.c_str())});
+    }
+    std::vector<berval*> pointers;
+    pointers.reserve(values.size() + 1);
+    for (berval& value : values) pointers.push_back(&value);
+    pointers.push_back(nullptr);
+    *place_of(e, a.type.c_str()) = make_attribute(a.type.c_str(), pointers.data());
+  }
+  refresh_object_classes(e);
 }
 
 std::string show_values(berval** values) {
@@ -274,6 +352,7 @@ void entry_free(entry* e) {
   platform().dispose(e->dn);
   platform().dispose(e->normalized_dn);
   platform().dispose(e->requested_dn);
+  platform().dispose(e->object_class_list);
   platform().dispose(e);
 }
 
@@ -290,6 +369,7 @@ int attr_merge(entry* e, const char* type, berval** values, int syntax_normalise
   attr** place = place_of(e, type);
   if (*place != nullptr) return 20;  // scripted records name each attribute once
   *place = make_attribute(type, values);
+  refresh_object_classes(e);
   return 0;
 }
 
@@ -301,6 +381,7 @@ int attr_delete(entry* e, const char* type, void* old) {
   if (found == nullptr) return 1;
   *place = found->next;
   dispose_attribute(found);
+  refresh_object_classes(e);
   return 0;
 }
 
@@ -317,13 +398,135 @@ int value_find(const attr* a, const berval* value, int syntax, int normalise) {
   return 1;
 }
 
+int value_find_short_list(const ShortValue* list, const char* bytes, std::size_t length) {
+  const Call call("value_find_short_list", std::string(bytes, length).c_str(), length);
+  if (call.failure()) return *call.failure();
+  for (const ShortValue* v = list; v != nullptr && v->bytes != nullptr; ++v) {
+    if (v->length == length && strncasecmp(v->bytes, bytes, length) == 0) return 0;
+  }
+  return 1;
+}
+
 entry* CFGMessage2Entry(_CFG* session, _CFGMessage* record) {
   const Call call("CFGMessage2Entry", session, record);
   if (call.failure_or_no_memory()) return nullptr;
   entry* e = static_cast<entry*>(platform().give(Owned::part, sizeof(entry)));
   e->dn = platform().give_text(Owned::part, "as the file spells it");
   e->local_code_page = true;
+  fill(e, scripted::attributes_of(record));
   return e;
+}
+
+void charray_free(char** array) {
+  const Call call("charray_free", array == nullptr ? nullptr : "array");
+  if (array == nullptr) return;
+  for (char** value = array; *value != nullptr; ++value) {
+    platform().take_back(*value, Owned::cfg_value, "charray_free");
+  }
+  platform().take_back(array, Owned::cfg_values, "charray_free");
+}
+
+int ldcf_api_schema_check(entry* e, int reserved1, int reserved2) {
+  const Call call("ldcf_api_schema_check", e, reserved1, reserved2);
+  return call.failure().value_or(0);
+}
+
+int checkReferral(entry* e) {
+  const Call call("checkReferral", e);
+  return call.failure().value_or(0);
+}
+
+// ---- Lists of modifications
+
+namespace {
+
+// A record that adds the texts of an attribute; null texts are shown.
+ldapmod* make_modification(const attr& a) {
+  auto* mod = static_cast<ldapmod*>(platform().give(Owned::mods, sizeof(ldapmod)));
+  mod->mod_type = platform().give_text(Owned::part, a.type);
+  std::size_t count = 0;
+  while (a.values != nullptr && a.values[count] != nullptr) ++count;
+  auto** texts = static_cast<char**>(platform().give(Owned::part, (count + 1) * sizeof(char*)));
+  for (std::size_t i = 0; i < count; ++i) {
+    const char* text = a.values[i]->bv_val;
+    texts[i] = platform().give_text(Owned::part, text == nullptr ? "<null>" : text);
+  }
+  mod->mod_vals.modv_strvals = texts;
+  return mod;
+}
+
+}  // namespace
+
+ldapmod** EntryToLDAPMod(attr* attributes) {
+  const Call call("EntryToLDAPMod");
+  if (attributes == nullptr || call.failure_or_no_memory()) return nullptr;
+  std::size_t count = 0;
+  for (const attr* a = attributes; a != nullptr; a = a->next) ++count;
+  auto** list =
+      static_cast<ldapmod**>(platform().give(Owned::text, (count + 1) * sizeof(ldapmod*)));
+  platform().name(list, "modifications");
+  ldapmod** place = list;
+  for (const attr* a = attributes; a != nullptr; a = a->next, ++place) {
+    *place = make_modification(*a);
+    if (place != list) place[-1]->mod_next = *place;
+  }
+  platform().name(list[0], "first modification");
+  return list;
+}
+
+void free_ldmll(ldapmod* first) {
+  const Call call("free_ldmll", first);
+  while (first != nullptr) {
+    ldapmod* next = first->mod_next;
+    for (char** text = first->mod_vals.modv_strvals; *text != nullptr; ++text) {
+      platform().dispose(*text);
+    }
+    platform().dispose(first->mod_vals.modv_strvals);
+    platform().dispose(first->mod_type);
+    platform().take_back(first, Owned::mods, "free_ldmll");
+    first = next;
+  }
+}
+
+// ---- Pass-through authentication
+
+int verifyAttributeMapping(const char* mapping, void* reserved1, void* reserved2) {
+  const Call call("verifyAttributeMapping", mapping, reserved1, reserved2);
+  return call.failure().value_or(0);
+}
+
+int ldap_url_parse(const char* url, LDAPURLDesc** description) {
+  const Call call("ldap_url_parse", url);
+  *description = nullptr;
+  if (const auto failure = call.failure_or_no_memory()) return *failure;
+  *description = static_cast<LDAPURLDesc*>(platform().give(Owned::url, sizeof(LDAPURLDesc)));
+  platform().name(*description, "description");
+  return 0;
+}
+
+void ldap_free_urldesc(LDAPURLDesc* description) {
+  const Call call("ldap_free_urldesc", description);
+  platform().take_back(description, Owned::url, "ldap_free_urldesc");
+}
+
+// ---- Persistent searches
+
+bool PSearchMonitor::begin(int most) noexcept {
+  if (current_ >= most) return false;
+  ++current_;
+  return true;
+}
+
+// ---- Passwords
+
+bool pwdIsAdminPolicyOn() {
+  const Call call("pwdIsAdminPolicyOn");
+  return platform().admin_policy;
+}
+
+int verify_admin_password(char* new_password, char* old_password, Operation* operation) {
+  const Call call("verify_admin_password", new_password, old_password, operation);
+  return call.failure().value_or(0);
 }
 
 // ---- Controls
@@ -350,7 +553,7 @@ int slapi_pblock_get(pblock* pb, int number, void* value) {
   const auto found = pb->values.find(number);
   const bool required = number == 50 || number == 60 || (number >= 130 && number <= 132);
   if (required && found == pb->values.end()) return -1;
-  const pblock::Value unset{nullptr, 0, number == 110 || number == 117};
+  const pblock::Value unset{nullptr, 0, number == 110 || number == 117 || number == -141};
   const pblock::Value& stored = found == pb->values.end() ? unset : found->second;
   if (stored.is_number) {
     std::memcpy(value, &stored.number, sizeof stored.number);
@@ -379,6 +582,18 @@ int slapi_pblock_set(pblock* pb, int number, std::nullptr_t value) {
   if (call.failure()) return *call.failure();
   pb->put(number, static_cast<const void*>(nullptr));
   return 0;
+}
+
+int slapi_pblock_set(pblock* pb, int number, void* value) {
+  const Call call("slapi_pblock_set", pb, number, value);
+  if (call.failure()) return *call.failure();
+  pb->put(number, static_cast<const void*>(value));
+  return 0;
+}
+
+pblock* getGlobalPBlock() {
+  const Call call("getGlobalPBlock");
+  return &platform().global_parameters;
 }
 
 // ---- Answers to the client
@@ -417,6 +632,14 @@ void connect(Connection& connection) {
   connection.send_search_entry = send_search_entry;
   connection.send_search_result = send_search_result;
   connection.send_result = nullptr;  // only through send_ldap_result
+}
+
+entry* make_entry(const ScriptedEntry& script) {
+  auto* e = static_cast<entry*>(platform().give(Owned::part, sizeof(entry)));
+  e->dn = platform().give_text(Owned::part, script.dn);
+  e->normalized_dn = platform().give_text(Owned::part, cleaned(script.dn.c_str(), true));
+  fill(e, script.attributes);
+  return e;
 }
 
 std::string text_of(const entry& e) {

@@ -1,0 +1,28 @@
+// What an operation tells about its caller.
+#pragma once
+
+#include "slapi/connection.h"
+
+namespace orv {
+
+constexpr bool has_all(unsigned flags, unsigned wanted) {
+  return (flags & wanted) == wanted;
+}
+
+inline bool is_primary_administrator(const Operation& operation) {
+  return has_all(operation.authority, authority::primary_administrator);
+}
+
+// Suppliers, and callers who are kept out: exactly that value, not every set of flags that has it.
+inline bool has_no_configuration_access(const Operation& operation) {
+  constexpr unsigned kAnySupplier = authority::supplier_of_server | authority::supplier_of_suffix;
+  return (operation.authority & kAnySupplier) != 0 ||
+         operation.authority == authority::no_configuration_access;
+}
+
+// A member of the administrative group: what it may do is told by its role bits.
+inline bool is_admin_group_member(const Operation& operation) {
+  return has_all(operation.authority, authority::admin_group_member);
+}
+
+}  // namespace orv
