@@ -309,8 +309,10 @@ Logs::~Logs() {
 std::vector<std::string> Logs::open(const Settings& settings) {
   std::vector<std::string> problems;
   try {
-    Candidate error = examine(settings.error_log, settings.error_log_level, guarded_files_);
-    Candidate access = examine(settings.access_log, settings.access_log_level, guarded_files_);
+    std::vector<std::string> guarded = guarded_files_;
+    guarded.push_back(settings.audit_log);
+    Candidate error = examine(settings.error_log, settings.error_log_level, guarded);
+    Candidate access = examine(settings.access_log, settings.access_log_level, guarded);
     const std::lock_guard lock(writer_->mutex);
     // Who is refused keeps what it had, which the other one may not take either.
     if (error.accepted()) refuse_if_same(access, error.file.status, "error log");
@@ -332,6 +334,15 @@ std::vector<std::string> Logs::open(const Settings& settings) {
     problems.emplace_back(e.what());
   }
   return problems;
+}
+
+bool Logs::writes_to(const std::string& path) const {
+  struct stat status {};
+  if (stat(path.c_str(), &status) != 0) return false;
+  const std::lock_guard lock(writer_->mutex);
+  for (const Log* const log : {&writer_->error, &writer_->access})
+    if (log->file.st_ino != 0 && same_file(log->file, status)) return true;
+  return false;
 }
 
 // ---- writing

@@ -42,6 +42,9 @@ class Logs {
   // name, keeps the file it had; the reasons are returned, one line each.
   std::vector<std::string> open(const Settings& settings);
 
+  // Whether the error log or the access log is open on the file at `path`.
+  bool writes_to(const std::string& path) const;
+
   // Writes one line to the error log.
   void write(LogLevel level, std::string_view line) noexcept;
   void error(std::string_view line) noexcept { write(LogLevel::error, line); }

@@ -11,17 +11,22 @@
 #include <cstring>
 #include <ctime>
 #include <memory>
+#include <mutex>
 #include <string>
 #include <thread>
 #include <utility>
 #include <vector>
 
+#include "audit/log.h"
 #include "auth/identities.h"
 #include "broken_file.h"
 #include "cfg/attribute_table.h"
 #include "cfg/diagnostics.h"
 #include "cfg/object_class_table.h"
+#include "cfg/result_codes.h"
+#include "file_report.h"
 #include "logs.h"
+#include "ops/persistent_search.h"
 #include "options.h"
 #include "plugin/loader.h"
 #include "publish/root_dse.h"
@@ -41,6 +46,8 @@ namespace {
 
 constexpr const char* kSuffix = "CN=CONFIGURATION";
 constexpr const char* kEntryPoint = "config_backend_init";
+constexpr int kServerWithoutControls = 3;
+constexpr int kEveryOperation = -1;
 
 // ---- where the libraries write to
 
@@ -90,6 +97,7 @@ class StoredIdentities final : public Authenticator {
     const std::shared_ptr<const Identities> identities = store_.current();
     if (!identities) return nullptr;
     const Identity* const found = identities->authenticate(name, password);
+    if (!found && identities->claimed_twice(name)) tell_of_claim(name);
     if (!found) return nullptr;
     return {identities, found};  // the snapshot lives as long as somebody is bound by it
   }
@@ -101,10 +109,48 @@ class StoredIdentities final : public Authenticator {
     return identities && identities->still_valid(bound);
   }
 
+  bool may_define(std::string_view entry_dn) const noexcept override {
+    const std::shared_ptr<const Identities> identities = store_.latest();
+    return !identities || identities->defined_by(entry_dn);
+  }
+
+  // Reads what has changed; what is found is told.
+  void refresh() noexcept { store_.current(); }
+
  private:
+  // Once for each reading of the file: strangers must not fill the log.
+  void tell_of_claim(std::string_view name) {
+    const std::uint64_t generation = store_.generation();
+    if (told_.exchange(generation) == generation) return;
+    std::string line = "nobody can bind as ";
+    append_quoted(line, name);
+    logs_.error(line + ": more than one entry defines that identity");
+  }
+
   IdentityStore store_;
   Logs& logs_;
+  std::atomic<std::uint64_t> told_{0};
 };
+
+// ---- the password policy
+
+// One at a time, so that what was read before a change never comes after what was read behind it.
+void renew_policy(const Options& options, Logs& logs) noexcept {
+  static std::mutex renewing;
+  try {
+    const std::lock_guard lock(renewing);
+    std::string error;
+    const int code = renew_password_policy(options.config_file, options.key_stash_file, error);
+    if (code == result::success) return;
+    if (code == result::no_such_object)
+      error = "the configuration file has no policy entry";
+    else if (error.empty())
+      error = "result " + std::to_string(code);
+    logs.warning("the password policy stays as it was: " + error);
+  } catch (...) {
+    logs.error("the password policy stays as it was: out of memory");
+  }
+}
 
 // ---- the process
 
@@ -134,8 +180,12 @@ void prepare_process() {
 // Files that nothing may be written to but what belongs there.
 std::vector<std::string> own_files(const Options& options) {
   const std::string& config = options.config_file;
-  return {config, config + ".save", options.key_stash_file,
-          config.substr(0, config.rfind('/') + 1) + "admin.pw"};
+  std::vector<std::string> files = {config, options.key_stash_file,
+                                    config.substr(0, config.rfind('/') + 1) + "admin.pw"};
+  // What a change of the configuration file leaves beside it, and uses on the way.
+  for (const char* const ending : {".save", ".lock", ".new", ".swap", ".rescued"})
+    files.push_back(config + ending);
+  return files;
 }
 
 bool may_be_traced_to(const Options& options) {
@@ -217,6 +267,13 @@ bool start_backend(const Options& options, BackendPlace& place) {
   return true;
 }
 
+// The controls that the server itself understands; the backend has announced its own.
+void announce_controls() {
+  if (g_srvType.load(std::memory_order_relaxed) == kServerWithoutControls) return;
+  slapi_register_supported_control(kPersistentSearchOid, kEveryOperation);
+  slapi_register_supported_control(kEntryChangeOid, kEveryOperation);
+}
+
 // ---- the life of the server
 
 Publications publications() {
@@ -236,7 +293,17 @@ void report(Logs& logs, const std::vector<std::string>& problems) {
   for (const std::string& problem : problems) logs.error(problem);
 }
 
-int serve(const Options& options, const Settings& settings, Logs& logs,
+// Before the other logs, which then keep off its file.
+void open_audit_log(const Options& options, const Settings& settings, Logs& logs, AuditLog& audit) {
+  std::vector<std::string> guarded = own_files(options);
+  guarded.push_back(options.trace_file);
+  const std::string reason = logs.writes_to(settings.audit_log)
+                                 ? "another log is there"
+                                 : audit.open(settings.audit_log, guarded);
+  if (!reason.empty()) logs.error("cannot record changes in " + settings.audit_log + ": " + reason);
+}
+
+int serve(const Options& options, const Settings& settings, Logs& logs, AuditLog& audit,
           StoredIdentities& identities, BackendPlace& place) {
   BrokenFileReporter broken_file(options.config_file, options.key_stash_file, logs);
   Server server({builtin_schema(), place.backend, identities, publications(), logs,
@@ -249,12 +316,19 @@ int serve(const Options& options, const Settings& settings, Logs& logs,
                      logs.error("settings not taken over: " + error);
                      return false;
                    }
+                   renew_policy(options, logs);
+                   open_audit_log(options, wanted, logs, audit);
                    report(logs, logs.open(wanted));
                    configfile_read.fetch_add(1, std::memory_order_relaxed);
                    logs.info("settings taken over");
                    return true;
                  },
-                 [&broken_file] { broken_file.note_failure(); }});
+                 [&broken_file] { broken_file.note_failure(); }, &audit,
+                 [&](const Consequences& consequences) {
+                   if (consequences.identities) identities.refresh();
+                   if (consequences.policy) renew_policy(options, logs);
+                 },
+                 options.guards});
   std::string error;
   const auto& addresses = options.addresses.empty() ? settings.addresses : options.addresses;
   const auto port = options.port.value_or(static_cast<std::uint16_t>(settings.port));
@@ -294,12 +368,19 @@ int run(const Options& options) {
     if (!identities.reload(error)) {
       std::fprintf(stderr, "orvd: %s\n", error.c_str());
     } else if (start_backend(options, place)) {
+      renew_policy(options, logs);
+      for (const std::string& doubt :
+           doubts_about_file(options.config_file, options.key_stash_file))
+        logs.warning(doubt);
       if (options.check) {
         std::printf("%s: good\n", options.config_file.c_str());
         status = 0;
       } else {
+        AuditLog audit([&logs](std::string_view line) { logs.error(line); });
+        open_audit_log(options, settings, logs, audit);
         report(logs, logs.open(settings));
-        status = serve(options, settings, logs, identities, place);
+        announce_controls();
+        status = serve(options, settings, logs, audit, identities, place);
       }
     }
   }

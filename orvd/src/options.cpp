@@ -63,6 +63,8 @@ Parsed parse_options(int argc, char** argv, Options& options, int& status) {
   app.add_option("--trace-mask", mask, "What to trace")->type_name("HEX")->check(check_mask);
   app.add_option("--trace-file", options.trace_file, "Where to trace to")->type_name("FILE");
   app.add_flag("--debug", options.debug, "Write debug output");
+  app.add_flag("!--without-guards", options.guards,
+               "Leave out the server's own guards, to test the backend's rules");
   app.add_flag("--check", options.check, "Read the configuration, report, and exit");
   try {
     app.parse(argc, argv);

@@ -20,6 +20,7 @@ struct Options {
   std::optional<std::uint32_t> trace_mask;
   std::string trace_file;  // "": standard error
   bool debug = false;
+  bool guards = true;  // the server's own, in front of the backend
   bool check = false;  // read everything, report, do not serve
 };
 

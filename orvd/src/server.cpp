@@ -60,6 +60,12 @@ Server::Server(ServerParts parts)
       verifiers_(kVerifierThreads),
       listeners_(control_, services_, counter_, loops_) {
   services_.note_failure = parts_.note_failure;
+  services_.audit = parts_.audit;
+  services_.guards = parts_.guards;
+  services_.take_over = [this](const Consequences& consequences) {
+    if (parts_.take_over) parts_.take_over(consequences);
+    if (consequences.settings) reload_soon();
+  };
   for (unsigned i = 0; i < std::max(1U, parts_.loops); ++i)
     loops_.push_back(std::make_unique<Loop>(parts_.logs, settings_));
 }
@@ -154,6 +160,14 @@ void Server::wind_up() {
   stop_workers();
   for (const auto& loop : loops_) loop->stop();
   parts_.logs.info("stopped");
+}
+
+void Server::reload_soon() noexcept {
+  try {
+    asio::post(control_, [this] { reload(); });
+  } catch (...) {
+    parts_.logs.error("settings not taken over: out of memory");
+  }
 }
 
 void Server::reload() {

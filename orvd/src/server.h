@@ -36,6 +36,11 @@ struct ServerParts {
   std::function<bool(Settings&)> reload;
   // Told when an operation failed because the backend could not open its session. May be empty.
   std::function<void()> note_failure{};
+  AuditLog* audit = nullptr;  // null: changes are not recorded
+  // Takes over identities and password policy after a change. Inside the gate; must not throw. May
+  // be empty.
+  std::function<void(const Consequences&)> take_over{};
+  bool guards = true;  // the server's own, in front of the backend
 };
 
 class Server {
@@ -64,6 +69,8 @@ class Server {
 
   // Reads the settings again and takes them over. On the control thread.
   void reload();
+  // The same, later. Any thread.
+  void reload_soon() noexcept;
 
   BackendHost& backend() noexcept { return backend_; }
   std::int64_t connections() const { return counter_.count(); }

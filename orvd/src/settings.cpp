@@ -8,6 +8,7 @@
 #include "cfg/session.h"
 #include "cfg/text.h"
 #include "config/setting_ranges.h"
+#include "slapi/services.h"
 
 namespace orv::server {
 namespace {
@@ -37,11 +38,17 @@ constexpr SettingRow kRows[] = {
     row("orv-slapdOperationWait", &Settings::operation_wait),
     row("orv-slapdWriteTimeOut", &Settings::write_timeout),
     row("orv-slapdMessageTimeOut", &Settings::message_timeout),
+    row("orv-slapdMaxPersistentSearches", &Settings::max_persistent_searches),
+    row("orv-slapdMaxPersistentSearchesPerConnection",
+        &Settings::max_persistent_searches_per_connection),
 };
 
 constexpr const char* kConfiguration = "CN=CONFIGURATION";
 constexpr const char* kErrorLogEntry = "CN=DEFAULT,CN=LOG MANAGEMENT,CN=CONFIGURATION";
 constexpr const char* kAccessLogEntry = "CN=ACCESS,CN=LOG MANAGEMENT,CN=CONFIGURATION";
+constexpr const char* kAuditLogEntry = "CN=AUDIT,CN=LOG MANAGEMENT,CN=CONFIGURATION";
+// Where changes are recorded when no file is named. No other log may be there.
+constexpr const char* kDefaultAuditLog = "/var/ldap/V6.0/audit.log";
 
 CfgSession open_session(const std::string& config_file, const std::string& key_stash_file,
                         std::string& error) {
@@ -111,6 +118,15 @@ bool read_log(_CFG* session, const char* dn, std::string& path, std::string& lev
   return false;
 }
 
+// Changes are recorded unless the entry says otherwise.
+bool read_audit_log(_CFG* session, std::string& path, std::string& error) {
+  std::string level = "info";
+  if (!read_log(session, kAuditLogEntry, path, level, error)) return false;
+  if (path.empty()) path = kDefaultAuditLog;
+  if (level == "off") path.clear();
+  return true;
+}
+
 bool read_integers(const FileEntry& top, Settings& settings, std::string& error) {
   for (const SettingRow& row : setting_rows()) {
     const std::optional<std::string> value = top.first(std::string(row.name).c_str());
@@ -144,6 +160,12 @@ bool can_open(const std::string& config_file, const std::string& key_stash_file,
   return open_session(config_file, key_stash_file, cause) != nullptr;
 }
 
+int renew_password_policy(const std::string& config_file, const std::string& key_stash_file,
+                          std::string& error) {
+  const CfgSession session = open_session(config_file, key_stash_file, error);
+  return session ? load_admin_password_policy(session.get()) : result::operations_error;
+}
+
 bool read_settings(const std::string& config_file, const std::string& key_stash_file,
                    Settings& settings, std::string& error) {
   const CfgSession session = open_session(config_file, key_stash_file, error);
@@ -157,7 +179,8 @@ bool read_settings(const std::string& config_file, const std::string& key_stash_
   read.addresses = top.values("orv-slapdIpAddress");
   if (read_integers(top, read, error) &&
       read_log(session.get(), kErrorLogEntry, read.error_log, read.error_log_level, error) &&
-      read_log(session.get(), kAccessLogEntry, read.access_log, read.access_log_level, error)) {
+      read_log(session.get(), kAccessLogEntry, read.access_log, read.access_log_level, error) &&
+      read_audit_log(session.get(), read.audit_log, error)) {
     settings = std::move(read);
     return true;
   }

@@ -22,19 +22,22 @@ struct Settings {
   std::int64_t max_connections_per_address = 1024;
   std::int64_t max_pending_operations = 64;  // outstanding on one connection
   std::int64_t max_filter_depth = 32;
-  std::int64_t max_controls = 32;           // in one message
-  std::int64_t max_attributes = 1024;       // in one message
-  std::int64_t max_values = 10000;          // in one message
-  std::int64_t max_result_size = 67108864;  // bytes of one answer
-  std::int64_t operation_wait = 30;         // seconds until an operation that waits gets 51
-  std::int64_t write_timeout = 30;          // seconds without progress of a slow reader
-  std::int64_t message_timeout = 30;        // seconds to finish a message once begun
-  std::vector<std::string> addresses;       // empty: every address
+  std::int64_t max_controls = 32;             // in one message
+  std::int64_t max_attributes = 1024;         // in one message
+  std::int64_t max_values = 10000;            // in one message
+  std::int64_t max_result_size = 67108864;    // bytes of one answer
+  std::int64_t operation_wait = 30;           // seconds until an operation that waits gets 51
+  std::int64_t write_timeout = 30;            // seconds without progress of a slow reader
+  std::int64_t message_timeout = 30;          // seconds to finish a message once begun
+  std::int64_t max_persistent_searches = 64;  // in all, 0: there are none
+  std::int64_t max_persistent_searches_per_connection = 8;
+  std::vector<std::string> addresses;  // empty: every address
 
   std::string error_log;  // path; empty: standard error
   std::string error_log_level = "info";
   std::string access_log;  // path; empty: standard error
   std::string access_log_level = "off";
+  std::string audit_log;  // path; empty: no changes are recorded
 };
 
 // One integer setting: attribute, bounds and the member that holds it. The member's initial value
@@ -67,5 +70,11 @@ bool can_open(const std::string& config_file, const std::string& key_stash_file,
 // The settings that a reload cannot change while the server runs and in which the two differ, by
 // attribute name.
 std::vector<std::string_view> restart_needed(const Settings& running, const Settings& wanted);
+
+// Puts the password policy of the configuration file in force. 0; 32 the file has no policy entry;
+// 19 or 21 it cannot be taken over (told as a message); else the code of the session, with the
+// cause in `error`. After anything but 0 the policy stays as it was.
+int renew_password_policy(const std::string& config_file, const std::string& key_stash_file,
+                          std::string& error);
 
 }  // namespace orv::server

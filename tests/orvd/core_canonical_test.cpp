@@ -4,6 +4,7 @@
 #include <gtest/gtest.h>
 
 #include "cfg/attribute_table.h"
+#include "slapi/codepage.h"
 
 namespace orv::server {
 namespace {
@@ -64,6 +65,65 @@ TEST_F(Canonical, EntryIsRefusedForWhatTheBackendMustNotSee) {
   EXPECT_EQ(add_code({dn, {{"cn", {"\xC3("}}}}), 21);
   EXPECT_EQ(add_code({dn, {{"cn", {"x"}}, {"2.5.4.3", {"y"}}}}), 20);
   EXPECT_EQ(add_code({dn, {{"cn", {"x", "x"}}}}), 20);
+}
+
+TEST_F(Canonical, EqualValuesAreFoundByTheEqualityOfTheirType) {
+  const std::string dn = "cn=x,cn=configuration";
+  const auto code = [&](const char* type, std::vector<std::string> values) {
+    return add_code({dn, {{type, std::move(values)}}});
+  };
+  EXPECT_EQ(code("description", {"x", "X"}), 20);
+  EXPECT_EQ(code("description", {"a b", "a  b"}), 20);
+  EXPECT_EQ(code("description", {"\xC3\xA9", "e\xCC\x81"}), 20);
+  EXPECT_EQ(code("description", {"x", "y"}), 0);
+  EXPECT_EQ(code("objectClass", {"top", "2.5.6.0"}), 20);
+  EXPECT_EQ(code("orv-slapdPtaSubtree", {"o=x", "O = X"}), 20);
+  EXPECT_EQ(code("orv-slapdDigestAdminUser", {"x", "X"}), 0);
+  EXPECT_EQ(code("orv-slapdAdminPW", {"x", "X"}), 0);
+  EXPECT_EQ(code("orv-slapdAdminPW", {"x", "x"}), 20);
+  // What is no value of the type is not for this check to refuse.
+  EXPECT_EQ(code("orv-slapdPtaSubtree", {"no dn", "o=x"}), 0);
+}
+
+TEST_F(Canonical, ValueOfTheRdnIsLookedForByTheEqualityOfItsType) {
+  EntryPtr made;
+  ASSERT_EQ(make_entry(schema, {"cn=O  Brien\\20,cn=x", {{"cn", {"o brien"}}}}, made).code, 0);
+  EXPECT_EQ(values_of(attr_find(made.get(), "cn", 0, 0)), std::vector<std::string>{"o brien"});
+  ASSERT_EQ(make_entry(schema,
+                       {"orv-slapdDigestAdminUser=X", {{"orv-slapdDigestAdminUser", {"x"}}}}, made)
+                .code,
+            0);
+  EXPECT_EQ(values_of(attr_find(made.get(), "orv-slapdDigestAdminUser", 0, 0)),
+            (std::vector<std::string>{"x", "X"}));
+}
+
+TEST_F(Canonical, PasswordInTheRdnIsRefused) {
+  const std::vector<Attribute> classes{{"objectClass", {"container"}}};
+  EXPECT_EQ(add_code({"orv-slapdAdminPW=x,cn=configuration", classes}), 64);
+  EXPECT_EQ(add_code({"cn=x+orv-slapdMasterPW=y,cn=configuration", classes}), 64);
+}
+
+TEST_F(Canonical, AttributesOfTheServerAreRefused) {
+  EXPECT_EQ(add_code({"cn=x", {{"createTimestamp", {"20260101000000Z"}}}}), 19);
+  EXPECT_EQ(modify_code({"cn=x", {{2, {"createTimestamp", {"20260101000000Z"}}}}}), 19);
+}
+
+TEST_F(Canonical, TextOutsideTheCodePageOfTheFileIsRefusedWithItsPlace) {
+  set_local_code_page("ISO-8859-1");
+  ASSERT_EQ(initIconvHandle(), 0);
+  EntryPtr made;
+  const Refusal refusal = make_entry(
+      schema, {"cn=x", {{"description", {"caf\xC3\xA9", "caf\xC3\xA9 \xE2\x82\xAC"}}}}, made);
+  EXPECT_EQ(refusal.code, 21);
+  EXPECT_NE(refusal.text.find("character 6 "), std::string::npos) << refusal.text;
+  EXPECT_NE(refusal.text.find("description"), std::string::npos) << refusal.text;
+  EXPECT_EQ(add_code({"cn=x", {{"description", {"caf\xC3\xA9"}}}}), 0);
+  EXPECT_EQ(add_code({"cn=\xE2\x82\xAC", {{"description", {"x"}}}}), 21);
+  EXPECT_EQ(check_target_code_page("CN=CAF\xC3\x89").code, 34);
+  EXPECT_EQ(check_target_code_page("CN=CAFE").code, 0);
+  set_local_code_page("UTF-8");
+  ASSERT_EQ(initIconvHandle(), 0);
+  EXPECT_EQ(check_target_code_page("CN=CAF\xC3\x89").code, 0);
 }
 
 TEST_F(Canonical, ModificationsKeepTheClientsOrderAndHaveCountedValues) {

@@ -75,10 +75,12 @@ class LoopbackServer : public testing::Test {
                                 },
                                 [] { return make_subschema(builtin_schema(), 0); }},
                                logs,
-                               {kManageDsaIt},
+                               controls,
                                settings,
                                loops,
-                               reload});
+                               reload,
+                               {},
+                               audit});
     std::string error;
     ASSERT_TRUE(server->listen(addresses, 0, error)) << error;
     if (reload) server->handle_signals();
@@ -117,8 +119,10 @@ class LoopbackServer : public testing::Test {
   FakeBackend backend;
   ScriptedAuthenticator authenticator;
   Settings settings;
+  std::vector<std::string> controls{kManageDsaIt};  // that the server supports
   Logs logs;
   std::function<bool(Settings&)> reload;
+  AuditLog* audit = nullptr;
   std::vector<std::string> addresses{"127.0.0.1"};
   unsigned loops = 1;
   std::optional<Server> server;

@@ -181,4 +181,19 @@ bool Identities::still_valid(const Identity& bound) const noexcept {
   return record != nullptr && same_grant(record->identity, bound);
 }
 
+bool Identities::claimed_twice(std::string_view name) const {
+  std::string normal;
+  const int code = cfg::normalize_dn(name, normal);
+  if (code == result::no_memory) throw std::bad_alloc();
+  const auto place = code == 0 ? data_->by_dn.find(normal) : data_->by_dn.end();
+  return place != data_->by_dn.end() && place->second == nullptr;
+}
+
+bool Identities::defined_by(std::string_view entry_dn) const noexcept {
+  const auto& records = data_->records;
+  return std::any_of(records.begin(), records.end(), [&](const IdentityRecord& record) {
+    return record.identity.entry_dn == entry_dn;
+  });
+}
+
 }  // namespace orv::server

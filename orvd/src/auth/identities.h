@@ -63,6 +63,12 @@ class Identities {
   // flags, roles and stored password, and it may bind.
   bool still_valid(const Identity& bound) const noexcept;
 
+  // Whether more than one entry claims the DN that is spelled so. Throws std::bad_alloc.
+  bool claimed_twice(std::string_view name) const;
+
+  // Whether somebody is defined by the entry of this normal form, and be it one who cannot bind.
+  bool defined_by(std::string_view entry_dn) const noexcept;
+
   ~Identities();
 
  private:

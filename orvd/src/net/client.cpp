@@ -69,6 +69,7 @@ void Client::begin(const std::string& peer) {
   socket_.set_option(tcp::no_delay(true), ignored);
   socket_.set_option(tcp::socket::keep_alive(true), ignored);
   loop_.add(self());
+  set_peer(peer);
   if (std::string* const line = begin_access_line()) {
     line->append("ACCEPT from=").append(peer);
     end_access_line();
@@ -435,7 +436,7 @@ void Client::sweep(Clock::time_point now) {
   } else if (begin_ != end_ && may_read()) {
     if (late(message_begun_, limits.message_timeout))
       disconnect(result::unavailable, "message not finished in time");
-  } else if (idle() && limits.idle_timeout > 0) {
+  } else if (idle() && !listens() && limits.idle_timeout > 0) {
     if (late(last_activity_, limits.idle_timeout))
       disconnect(result::unavailable, "idle for too long");
   }

@@ -1,6 +1,7 @@
 #include "ops/answer.h"
 
 #include <new>
+#include <vector>
 
 #include "cfg/result_codes.h"
 
@@ -14,16 +15,28 @@ bool Answer::select(char** attributes) noexcept {
   return true;
 }
 
+bool Answer::append(const orv::entry& e, bool types_only, LDAPControl** controls) noexcept {
+  if (!attached_) return encode_entry(bytes_, message_id_, e, selection_, types_only, controls);
+  try {
+    std::vector<LDAPControl*> all{attached_};
+    for (; controls && *controls; ++controls) all.push_back(*controls);
+    all.push_back(nullptr);
+    return encode_entry(bytes_, message_id_, e, selection_, types_only, all.data());
+  } catch (const std::bad_alloc&) {
+    return false;
+  }
+}
+
 int Answer::entry(const orv::entry& e, char** attributes, bool types_only,
                   LDAPControl** controls) noexcept {
   if (abandoned() || answered_) return result::other;
   if (limits_.entries > 0 && entries_ >= limits_.entries) return result::size_limit_exceeded;
   if (limits_.deadline != Clock::time_point::max() && Clock::now() >= limits_.deadline)
     return result::time_limit_exceeded;
+  if (hide_entries_) return result::success;
   if (!select(attributes)) return result::no_memory;
   const std::size_t before = bytes_.size();
-  if (!encode_entry(bytes_, message_id_, e, selection_, types_only, controls))
-    return result::no_memory;
+  if (!append(e, types_only, controls)) return result::no_memory;
   if (bytes_.size() > limits_.bytes) {
     bytes_.resize(before);
     return result::admin_limit_exceeded;
@@ -50,6 +63,10 @@ void Answer::result(const ResultAnswer& answer) noexcept {
     complete.text = "server is stopping";
   }
   code_ = complete.code;
+  if (open_ && complete.code == result::success) {
+    answered_ = true;
+    return;
+  }
   // Unanswered when it cannot be encoded: the server then tries again with less.
   answered_ = encode_result(bytes_, complete);
 }

@@ -40,6 +40,15 @@ class Answer {
   // A result with what only some responses carry.
   void result(const ResultAnswer& answer) noexcept;
 
+  // The answer is part of a persistent search: a successful result is not sent, since more is to
+  // come. Without `entries` no entry is sent either.
+  void keep_open(bool entries) noexcept {
+    open_ = true;
+    hide_entries_ = !entries;
+  }
+  // This control goes with each entry. It must live as long as the answer.
+  void attach(LDAPControl* control) noexcept { attached_ = control; }
+
   // Nobody wants the answer any more: nothing is sent from now on. Any thread.
   void abandon() noexcept { abandoned_.store(true, std::memory_order_relaxed); }
   bool abandoned() const noexcept { return abandoned_.load(std::memory_order_relaxed); }
@@ -61,6 +70,7 @@ class Answer {
 
  private:
   bool select(char** attributes) noexcept;
+  bool append(const orv::entry& e, bool types_only, LDAPControl** controls) noexcept;
 
   const std::int32_t message_id_;
   const int response_tag_;
@@ -70,6 +80,9 @@ class Answer {
   int code_ = 0;
   bool answered_ = false;
   bool cut_off_ = false;
+  bool open_ = false;
+  bool hide_entries_ = false;
+  LDAPControl* attached_ = nullptr;
   bool selected_ = false;  // selection_ stands for selected_list_
   char** selected_list_ = nullptr;
   AttributeSelection selection_;

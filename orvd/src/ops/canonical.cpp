@@ -7,8 +7,11 @@
 #include <utility>
 
 #include "cfg/dn.h"
+#include "cfg/matching.h"
 #include "cfg/result_codes.h"
+#include "cfg/secret.h"
 #include "cfg/text.h"
+#include "slapi/codepage.h"
 
 namespace orv::server {
 namespace {
@@ -30,6 +33,8 @@ Refusal canonical_type(const Schema& schema, const std::string& name, std::strin
     return refuse(result::undefined_attribute_type, "attribute options are not supported", name);
   type = schema.canonical_attribute(name);
   if (type.empty()) return refuse(result::undefined_attribute_type, "unknown attribute type", name);
+  if (schema.attribute(type)->no_user_modification)
+    return refuse(result::constraint_violation, "the server alone sets this attribute", type);
   return {};
 }
 
@@ -49,6 +54,72 @@ std::string canonical_value(const Schema& schema, std::string_view type, const s
   return name.empty() ? value : std::string(name);
 }
 
+// A form in which equal values of a type are equal bytes. Passwords are compared as they were sent,
+// and so is what no rule of the type can read.
+std::string equality_key(const Schema& schema, std::string_view type, const std::string& value) {
+  const SchemaAttribute* const known = schema.attribute(type);
+  if (known->secret) return value;
+  auto rule = cfg::MatchingRule::case_ignore;
+  cfg::find_matching_rule(known->equality, rule);
+  std::string key;
+  const int code = cfg::canonical_value(rule, value, key);
+  if (code == result::no_memory) throw std::bad_alloc();
+  return code == result::success ? "=" + key : value;
+}
+
+bool has_equal_values(const Schema& schema, std::string_view type,
+                      const std::vector<std::string>& values) {
+  if (values.size() < 2) return false;
+  std::vector<std::string> keys;
+  keys.reserve(values.size());
+  for (const std::string& value : values) keys.push_back(equality_key(schema, type, value));
+  std::sort(keys.begin(), keys.end());
+  const bool found = std::adjacent_find(keys.begin(), keys.end()) != keys.end();
+  if (schema.attribute(type)->secret)
+    for (std::string& key : keys) cfg::wipe(key);
+  return found;
+}
+
+// ---- the file's code page
+
+bool fits_code_page(const char* text) {
+  char* converted = nullptr;
+  std::size_t length = 0;
+  const int code = xlate_utf8_to_localcp(text, &converted, &length);
+  if (converted) cfg::wipe(converted, length);
+  std::free(converted);
+  if (code == result::no_memory) throw std::bad_alloc();
+  return code == result::success;
+}
+
+bool continues_character(char c) noexcept {
+  return (static_cast<unsigned char>(c) & 0xC0) == 0x80;
+}
+
+// The number, from 1, of the first character that the code page lacks.
+std::size_t first_misfit(const std::string& text) {
+  std::size_t number = 0;
+  for (std::size_t at = 0; at < text.size();) {
+    std::size_t next = at + 1;
+    while (next < text.size() && continues_character(text[next])) ++next;
+    ++number;
+    std::string character = text.substr(at, next - at);
+    const bool fits = fits_code_page(character.c_str());
+    cfg::wipe(character);
+    if (!fits) break;
+    at = next;
+  }
+  return number;
+}
+
+Refusal check_code_page(std::string_view type, const std::string& value) {
+  if (local_code_page_is_utf8() || fits_code_page(value.c_str())) return {};
+  return refuse(result::invalid_attribute_syntax,
+                "character " + std::to_string(first_misfit(value)) +
+                    " of a value is not in the code page of the configuration file",
+                type);
+}
+
 struct CanonicalAttribute {
   std::string_view type;  // lives in the schema
   std::vector<std::string> values;
@@ -60,11 +131,10 @@ Refusal canonical_attribute(const Schema& schema, const Attribute& given,
   made.values.reserve(given.values.size());
   for (const std::string& value : given.values) {
     if (Refusal refusal = check_value(made.type, value)) return refusal;
+    if (Refusal refusal = check_code_page(made.type, value)) return refusal;
     made.values.push_back(canonical_value(schema, made.type, value));
   }
-  std::vector<std::string_view> sorted(made.values.begin(), made.values.end());
-  std::sort(sorted.begin(), sorted.end());
-  if (std::adjacent_find(sorted.begin(), sorted.end()) != sorted.end())
+  if (has_equal_values(schema, made.type, made.values))
     return refuse(result::attribute_or_value_exists, "the same value twice", made.type);
   return {};
 }
@@ -124,10 +194,13 @@ Refusal canonical_attributes(const Schema& schema, const AddRequest& request,
   return {};
 }
 
-bool holds_rdn_value(const CanonicalAttribute& attribute, const std::string& value) {
-  return std::any_of(
-      attribute.values.begin(), attribute.values.end(),
-      [&](const std::string& held) { return cfg::equals_ignore_ascii_case(held, value); });
+bool holds_rdn_value(const Schema& schema, const CanonicalAttribute& attribute,
+                     const std::string& value) {
+  const std::string wanted = equality_key(schema, attribute.type, value);
+  return std::any_of(attribute.values.begin(), attribute.values.end(),
+                     [&](const std::string& held) {
+                       return equality_key(schema, attribute.type, held) == wanted;
+                     });
 }
 
 // RFC 4511, 4.7: values of the RDN that the list lacks are added.
@@ -139,10 +212,15 @@ Refusal complete_rdn(const Schema& schema, const std::string& dn,
   for (const cfg::Ava& ava : parsed.front()) {
     std::string_view type;
     if (Refusal refusal = canonical_type(schema, ava.type, type)) return refusal;
+    // Everybody who may search sees DNs.
+    if (schema.attribute(type)->secret)
+      return refuse(result::naming_violation, "a password cannot be part of a name", type);
+    if (Refusal refusal = check_value(type, ava.value)) return refusal;
+    if (Refusal refusal = check_code_page(type, ava.value)) return refusal;
     auto found = std::find_if(attributes.begin(), attributes.end(),
                               [&](const CanonicalAttribute& a) { return a.type == type; });
     if (found == attributes.end()) found = attributes.insert(found, {type, {}});
-    if (!holds_rdn_value(*found, ava.value)) found->values.push_back(ava.value);
+    if (!holds_rdn_value(schema, *found, ava.value)) found->values.push_back(ava.value);
   }
   return {};
 }
@@ -301,6 +379,13 @@ Refusal make_entry(const Schema& schema, const AddRequest& request, EntryPtr& ma
   if (const int code = cfg::canonicalize_dn_types(request.dn, dn))
     return refuse(code, kTargetNotADn);
   std::vector<CanonicalAttribute> attributes;
+  struct Wiped {
+    ~Wiped() {
+      for (CanonicalAttribute& attribute : attributes)
+        for (std::string& value : attribute.values) cfg::wipe(value);
+    }
+    std::vector<CanonicalAttribute>& attributes;
+  } const wiped{attributes};
   if (Refusal refusal = canonical_attributes(schema, request, attributes)) return refusal;
   if (Refusal refusal = complete_rdn(schema, request.dn, attributes)) return refusal;
   made = build_entry(dn, normal, attributes);
@@ -325,6 +410,14 @@ Refusal make_modifications(const Schema& schema, const ModifyRequest& request, l
   }
   first = list.release();
   return {};
+}
+
+Refusal check_target_code_page(std::string_view normal_dn) {
+  const bool ascii = std::all_of(normal_dn.begin(), normal_dn.end(),
+                                 [](char c) { return static_cast<unsigned char>(c) < 0x80; });
+  if (ascii || local_code_page_is_utf8()) return {};
+  return refuse(result::invalid_dn_syntax,
+                "the configuration file is not in UTF-8, and the target is not ASCII");
 }
 
 std::string rewrite_filter(const Schema& schema, std::string_view filter, FilterUse use) {

@@ -45,12 +45,19 @@ TextArray canonical_names(const Schema& schema, const std::vector<std::string>& 
 
 // The entry of an add request: canonical types, each once, object classes first, the values of the
 // RDN completed. 34 no DN; 17 unknown type or an attribute option; 2 an attribute without values or
-// an empty list; 20 a type or a value twice; 21 a value that must not reach the backend.
+// an empty list; 19 an attribute that only the server sets; 20 a type twice, or a value by the
+// type's own equality; 21 a value that must not reach the backend, or that the code page of the
+// file cannot hold; 64 a password in the RDN.
 Refusal make_entry(const Schema& schema, const AddRequest& request, EntryPtr& made);
 
 // The modification records of a modify request, in the client's order: counted values, a null array
-// where there are none. 17, 20 and 21 as above; 2 an empty list, or an add without values.
+// where there are none. 17, 19, 20 and 21 as above; 2 an empty list, or an add without values.
 Refusal make_modifications(const Schema& schema, const ModifyRequest& request, ldapmod*& first);
+
+// Whether the target of a delete or a modify can be named to the backend: 34 for a DN outside ASCII
+// when the file is not in UTF-8. The backend looks at such a name in one code page and changes the
+// entry of the name in the other.
+Refusal check_target_code_page(std::string_view normal_dn);
 
 // What to do with an assertion on the value of an attribute. Evaluated ones ask for object classes
 // under their canonical names.

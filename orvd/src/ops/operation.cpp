@@ -6,6 +6,7 @@
 #include <utility>
 
 #include "cfg/result_codes.h"
+#include "ops/guards.h"
 
 namespace orv::server {
 namespace {
@@ -51,6 +52,7 @@ bool PendingOperation::begin(Services& services, int handler, std::string_view n
   parameters_ = make_parameters(services.backend.backend(), home_->connection(), operation_);
   if (!parameters_) throw std::bad_alloc();
   dn_ = malloc_text(normal_dn);
+  if (handler != parameter::search_function) changed_dn_ = normal_dn;
   return set(parameter::target_dn, dn_.get());
 }
 
@@ -77,18 +79,26 @@ Refusal PendingOperation::prepare_add(Services& services, const AddRequest& requ
                                       std::string_view normal_dn) {
   begin(services, parameter::add_function, normal_dn);
   if (Refusal refusal = make_entry(services.schema, request, entry_)) return refusal;
+  if (services.guards)
+    if (Refusal refusal =
+            guarded(GuardedChange::add, normal_dn, operation_.authority, entry_.get()))
+      return refusal;
+  consequences_ = consequences_of_add(normal_dn, *entry_);
   set(parameter::add_entry, entry_.get());
   return {};
 }
 
 Refusal PendingOperation::prepare_delete(Services& services, std::string_view normal_dn) {
   begin(services, parameter::delete_function, normal_dn);
-  return {};
+  if (Refusal refusal = check_target_code_page(normal_dn)) return refusal;
+  if (!services.guards) return {};
+  return guarded(GuardedChange::remove, normal_dn, operation_.authority, nullptr);
 }
 
 Refusal PendingOperation::prepare_modify(Services& services, const ModifyRequest& request,
                                          std::string_view normal_dn) {
   begin(services, parameter::modify_function, normal_dn);
+  if (Refusal refusal = check_target_code_page(normal_dn)) return refusal;
   ldapmod* first = nullptr;
   if (Refusal refusal = make_modifications(services.schema, request, first)) return refusal;
   // From here the block holds the list: the handler clears the parameter when it released it.
@@ -108,8 +118,52 @@ bool PendingOperation::take_budget(const Services& services) noexcept {
   return room != 0;
 }
 
+// Who lost rights while the operation waited has them no more.
+bool PendingOperation::rights_hold(const Services& services) noexcept {
+  if (!identity_ || services.authenticator.generation() == identity_generation ||
+      services.authenticator.still_valid(*identity_))
+    return true;
+  answer_.result(result::insufficient_access, "", "the bound identity has changed or is gone");
+  return false;
+}
+
+// Inside the gate: the next operation must find the identities as this one left them.
+void PendingOperation::take_over(Services& services, int code) noexcept {
+  if (code != result::success || !services.take_over) return;
+  const Consequences consequences =
+      handler_ == parameter::add_function
+          ? consequences_
+          : consequences_of_change(changed_dn_, services.authenticator);
+  if (consequences.any()) services.take_over(consequences);
+}
+
+int PendingOperation::outcome() const noexcept {
+  if (returned_) return *returned_;
+  return answer_.answered() ? answer_.code() : kNotPerformed;
+}
+
+namespace {
+
+ChangeType change_type(int handler) noexcept {
+  if (handler == parameter::add_function) return ChangeType::add;
+  return handler == parameter::delete_function ? ChangeType::remove : ChangeType::modify;
+}
+
+}  // namespace
+
+// Who is to be told of what the handler did. Inside the gate.
+PersistentSearches::Audience PendingOperation::changed(Services& services, int code) noexcept {
+  if (code != result::success) return {};
+  entry* before = nullptr;
+  slapi_pblock_get(parameters_.get(), parameter::entry_before_delete, &before);
+  slapi_pblock_set(parameters_.get(), parameter::entry_before_delete, nullptr);
+  return services.persistent_searches.audience(change_type(handler_), changed_dn_,
+                                               EntryPtr(before));
+}
+
 void PendingOperation::run(Services& services, bool on_home_thread) noexcept {
-  if (!answer_.abandoned() && take_budget(services)) {
+  PersistentSearches::Audience audience;
+  if (!answer_.abandoned() && rights_hold(services) && take_budget(services)) {
     on_home_thread_ = on_home_thread;
     next_look_ = Clock::now() + kLookInterval;
     const bool search = handler_ == parameter::search_function;
@@ -117,12 +171,20 @@ void PendingOperation::run(Services& services, bool on_home_thread) noexcept {
     if (search) scope.emplace(&PendingOperation::interrupted, this);
     const int code = services.backend.call_keeping_gate(handler_, parameters_.get(),
                                                         home_->connection(), !search);
+    returned_ = code;
     if (!answer_.answered()) answer_.result(code != 0 ? code : result::other, "", "");
     if (search) learn_cost(services, code);
+    if (!search) take_over(services, code);
+    if (!search) audience = changed(services, code);
+    // A search that could not join would miss changes.
+    if (persistent && !notice_of && answer_.code() == result::success &&
+        !services.persistent_searches.join(persistent))
+      persistent->fail(result::no_memory);
     charged_ = answer_.bytes().size();
     home_->output().answered(charged_);
   }
   services.backend.leave_gate();
+  services.persistent_searches.announce(std::move(audience));
 }
 
 void PendingOperation::learn_cost(Services& services, int code) noexcept {

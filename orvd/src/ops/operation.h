@@ -8,12 +8,16 @@
 
 #include <atomic>
 #include <memory>
+#include <optional>
 #include <string>
 
+#include "audit/record.h"
 #include "cfg/interrupt.h"
 #include "ops/answer.h"
 #include "ops/canonical.h"
+#include "ops/consequences.h"
 #include "ops/gate.h"
+#include "ops/persistent_search.h"
 #include "ops/services.h"
 
 namespace orv::server {
@@ -73,7 +77,23 @@ class PendingOperation final : public GateWaiter,
   bool long_running() const noexcept { return long_running_; }
   Clock::time_point started() const noexcept { return started_; }
 
+  // The result for the audit log: what the handler returned, also when nobody waited for it.
+  int outcome() const noexcept;
+  std::string_view bound_dn() const noexcept { return operation_.bound_dn; }
+
+  // Which reading of the identities the bound one was good by.
+  std::uint64_t identity_generation = 0;
+
   std::string log_text;  // what the access log says of the request; empty when it is off
+
+  std::string audit_text;            // what the audit log says of the request,
+  std::string_view audit_operation;  // and its kind; empty: nothing, or it has said it
+
+  // The persistent search that this operation is a part of: a notice of the change `notice_of`, or
+  // the first part when that is null.
+  PersistentSearchPtr persistent;
+  ChangePtr notice_of;
+  std::optional<EntryChangeControl> change_control;
 
   // Bytes of the answer that were added to the connection's output share.
   std::size_t charged() const noexcept { return charged_; }
@@ -91,7 +111,10 @@ class PendingOperation final : public GateWaiter,
   static bool interrupted(void* self) noexcept;
   bool must_stop() noexcept;
   bool take_budget(const Services& services) noexcept;
+  bool rights_hold(const Services& services) noexcept;
+  void take_over(Services& services, int code) noexcept;
   void learn_cost(Services& services, int code) noexcept;
+  PersistentSearches::Audience changed(Services& services, int code) noexcept;
 
   const std::shared_ptr<OperationHome> home_;
   const std::shared_ptr<const Identity> identity_;  // null: anonymous
@@ -103,6 +126,9 @@ class PendingOperation final : public GateWaiter,
   bool long_running_ = false;
   bool wants_worker_ = true;
   std::size_t charged_ = 0;
+  std::optional<int> returned_;  // by the handler
+  std::string changed_dn_;       // of a change: handlers may rewrite their own copy
+  Consequences consequences_;    // of an add, while it is as the client wrote it
 
   // Arguments of the handler, released with the operation.
   PblockPtr parameters_;

@@ -14,12 +14,16 @@
 #include "auth/identities.h"
 #include "logs.h"
 #include "ops/backend_host.h"
+#include "ops/consequences.h"
 #include "ops/output_meter.h"
+#include "ops/persistent_search.h"
 #include "ops/search_cost.h"
 #include "slapi/owners.h"
 #include "slapi/schema.h"
 
 namespace orv::server {
+
+class AuditLog;
 
 // Proves who a client is.
 class Authenticator {
@@ -36,6 +40,10 @@ class Authenticator {
   // Whether what an identity proved when it bound still holds by the identities read last: it is
   // there, with the same flags, roles, entry and password. Must not read files.
   virtual bool still_valid(const Identity&) const noexcept { return true; }
+
+  // Whether an entry (a normal form) defines somebody, by the identities read last; true when in
+  // doubt. Must not read files.
+  virtual bool may_define(std::string_view) const noexcept { return true; }
 };
 
 // Entries of the server's own outside every backend; null without memory.
@@ -61,6 +69,12 @@ struct Services {
   std::function<void()> note_failure{};
   OutputMeter output{};
   SearchCost search_cost{};
+  // Told of what a change that was made means for the server, inside the gate. May be empty; must
+  // not throw.
+  std::function<void(const Consequences&)> take_over{};
+  bool guards = true;  // the server's own, in front of the backend
+  PersistentSearches persistent_searches{};
+  AuditLog* audit = nullptr;  // null: changes are not recorded
 };
 
 }  // namespace orv::server

@@ -117,6 +117,17 @@ std::string describe(const Schema& schema, const Request& request) {
   return std::visit(Describe{schema}, request);
 }
 
+// Why a change of somebody with access did not reach the backend, which tells of its own refusals.
+void tell(Logs& logs, std::string_view what, std::string_view dn, const Refusal& refusal) {
+  if (!refusal) return;
+  std::string line = describe(what, dn);
+  line += " refused with ";
+  append_number(line, refusal.code);
+  line += ": ";
+  append_client_text(line, refusal.text);
+  logs.warning(line);
+}
+
 void wipe_credentials(BindRequest& request) noexcept {
   cfg::wipe(request.password);
   if (request.credentials) cfg::wipe(*request.credentials);
@@ -162,6 +173,7 @@ void Session::handle(std::string_view frame) {
   const Decoded decoded = decode(frame, decoder_limits(settings()), message);
   if (decoded.state == DecodeState::fatal) return disconnect(decoded.code, decoded.text);
   if (decoded.state == DecodeState::decoded) return take(message);
+  audit_refused(message, decoded.code);
   // Also a bind that is refused for its form leaves the connection anonymous.
   if (decoded.response_tag == tag::bind_response) {
     BindRequest none;
@@ -176,18 +188,21 @@ void Session::take(Message& message) {
   Request& request = message.request;
   if (std::holds_alternative<UnbindRequest>(request)) return drop();
   // RFC 4511, 4.1.1.1: answers could not be told apart.
-  if (outstanding(id)) return disconnect(result::protocol_error, "message ID is in use");
+  if (outstanding(id) || persistent_search(id))
+    return disconnect(result::protocol_error, "message ID is in use");
   if (const auto* given_up = std::get_if<AbandonRequest>(&request))
     return abandon(given_up->message_id);
   if (!identity_holds()) return;
   const int answer_tag = response_tag(request);
-  Refusal refusal;
-  if (control_is_unknown(message))
-    refusal = {result::unavailable_critical_extension, "critical control not supported"};
+  PersistentWish wish;
+  Refusal refusal = read_controls(message, wish);
   if (auto* bind = std::get_if<BindRequest>(&request))
     return receive_bind(id, *bind, std::move(refusal));
-  if (refusal) return respond(id, answer_tag, refusal.code, refusal.text, described(request));
-  if (auto* wanted = std::get_if<SearchRequest>(&request)) return search(id, *wanted);
+  if (refusal) {
+    audit_refused(message, refusal.code);
+    return respond(id, answer_tag, refusal.code, refusal.text, described(request));
+  }
+  if (auto* wanted = std::get_if<SearchRequest>(&request)) return search(id, *wanted, wish);
   if (const auto* wanted = std::get_if<AddRequest>(&request)) return add(id, *wanted);
   if (const auto* wanted = std::get_if<DeleteRequest>(&request)) return remove(id, *wanted);
   if (const auto* wanted = std::get_if<ModifyRequest>(&request)) return modify(id, *wanted);
@@ -199,13 +214,6 @@ void Session::take(Message& message) {
 
 std::string Session::described(const Request& request) const {
   return services_.logs.access_enabled() ? describe(services_.schema, request) : std::string();
-}
-
-bool Session::control_is_unknown(const Message& message) const {
-  const auto& known = services_.supported_controls;
-  return std::any_of(message.controls.begin(), message.controls.end(), [&](const Control& control) {
-    return control.critical && std::find(known.begin(), known.end(), control.oid) == known.end();
-  });
 }
 
 bool Session::busy() const noexcept {
@@ -227,9 +235,12 @@ Session::Target Session::find_target(std::string_view dn, std::string& normal) c
 
 // ---- search
 
-void Session::search(std::int32_t id, SearchRequest& request) {
+void Session::search(std::int32_t id, SearchRequest& request, const PersistentWish& wish) {
   std::string normal;
   const Target target = find_target(request.base, normal);
+  if (wish.critical && (target == Target::root_dse || target == Target::subschema))
+    return respond(id, tag::search_done, result::unavailable_critical_extension,
+                   "persistent searches are for the configuration", described(request));
   if (target == Target::root_dse && request.scope == 0)
     return search_published(id, request, services_.publications.root_dse());
   if (target == Target::subschema)
@@ -245,7 +256,12 @@ void Session::search(std::int32_t id, SearchRequest& request) {
   if (target != Target::configuration) return submit(operation, {result::no_such_object, ""});
   if (!may_search(connection_.authority))
     return submit(operation, {result::insufficient_access, ""});
-  submit(operation, operation->prepare_search(services_, request, normal));
+  if (!wish.wanted) return submit(operation, operation->prepare_search(services_, request, normal));
+  if (services_.logs.access_enabled()) operation->log_text += " persistent";
+  if (Refusal refusal = begin_persistent(*operation, wish.control, request, normal))
+    return submit(operation, refusal);
+  SearchRequest first_part = wish.control.changes_only ? probe(request) : request;
+  submit(operation, operation->prepare_search(services_, first_part, normal));
 }
 
 void Session::search_published(std::int32_t id, const SearchRequest& request,
@@ -280,7 +296,11 @@ void Session::add(std::int32_t id, const AddRequest& request) {
   Refusal refusal = refuse_change(find_target(request.dn, normal));
   const OperationPtr operation = make_operation(id, tag::add_response, 0, 0);
   if (services_.logs.access_enabled()) operation->log_text = describe("ADD", request.dn);
-  if (!refusal) refusal = operation->prepare_add(services_, request, normal);
+  prepare_audit(*operation, request);
+  if (!refusal) {
+    refusal = operation->prepare_add(services_, request, normal);
+    tell(services_.logs, "ADD", request.dn, refusal);
+  }
   submit(operation, refusal);
 }
 
@@ -289,7 +309,11 @@ void Session::remove(std::int32_t id, const DeleteRequest& request) {
   Refusal refusal = refuse_change(find_target(request.dn, normal));
   const OperationPtr operation = make_operation(id, tag::delete_response, 0, 0);
   if (services_.logs.access_enabled()) operation->log_text = describe("DELETE", request.dn);
-  if (!refusal) refusal = operation->prepare_delete(services_, normal);
+  prepare_audit(*operation, request);
+  if (!refusal) {
+    refusal = operation->prepare_delete(services_, normal);
+    tell(services_.logs, "DELETE", request.dn, refusal);
+  }
   submit(operation, refusal);
 }
 
@@ -298,7 +322,11 @@ void Session::modify(std::int32_t id, const ModifyRequest& request) {
   Refusal refusal = refuse_change(find_target(request.dn, normal));
   const OperationPtr operation = make_operation(id, tag::modify_response, 0, 0);
   if (services_.logs.access_enabled()) operation->log_text = describe("MODIFY", request.dn);
-  if (!refusal) refusal = operation->prepare_modify(services_, request, normal);
+  prepare_audit(*operation, request);
+  if (!refusal) {
+    refusal = operation->prepare_modify(services_, request, normal);
+    tell(services_.logs, "MODIFY", request.dn, refusal);
+  }
   submit(operation, refusal);
 }
 
@@ -312,6 +340,7 @@ Session::OperationPtr Session::make_operation(std::int32_t id, int response_tag,
   if (time_limit > 0) limits.deadline = Clock::now() + std::chrono::seconds(time_limit);
   auto operation =
       std::make_shared<PendingOperation>(shared_from_this(), identity_, id, response_tag, limits);
+  operation->identity_generation = identity_checked_;
   lend_storage(operation->answer().bytes());
   return operation;
 }
@@ -326,7 +355,10 @@ void Session::submit(const OperationPtr& operation, const Refusal& refusal) {
 void Session::start(const OperationPtr& operation) {
   if (output_.full()) return hold(operation);
   Gate& gate = services_.backend.gate();
-  const auto deadline = Clock::now() + std::chrono::seconds(settings().operation_wait);
+  // A notice waits as long as it takes: its client would hear of nothing more without it.
+  const auto deadline = operation->notice_of
+                            ? Clock::time_point::max()
+                            : Clock::now() + std::chrono::seconds(settings().operation_wait);
   Gate::Entry entry = Gate::Entry::closed;
   try {
     entry = operation->wants_worker() ? gate.enter_elsewhere(operation, deadline)
@@ -377,6 +409,7 @@ void Session::work(const OperationPtr& operation) noexcept {
     return hand_back(operation, Step::hold);
   }
   operation->run(services_, false);
+  audit(*operation, true);
   hand_back(operation, Step::finish);
 }
 
@@ -447,12 +480,23 @@ void Session::complete(const OperationPtr& operation) {
     operation->held = false;
     --held_;
   }
+  audit(*operation, false);
+  if (operation->notice_of) {
+    notice_done(operation);
+    return go_on();
+  }
   const Answer& answer = operation->answer();
   if (answer.code() == result::operations_error && services_.note_failure) services_.note_failure();
   const int code = answer.abandoned() ? kAbandoned : answer.code();
   deliver(*operation);  // what follows is done while the client reads
   log_result(answer.message_id(), operation->log_text, code, answer.entries(),
              operation->started());
+  if (operation->persistent) first_part_done(*operation);
+  go_on();
+}
+
+// Something is no longer outstanding.
+void Session::go_on() {
   start_held_later();
   if (bind_ && !gone_) try_bind();
   settle_if_done();
@@ -513,6 +557,7 @@ void Session::start_held_later() noexcept {
 void Session::output_is(std::size_t unwritten) noexcept {
   output_.unwritten(unwritten);
   start_held_later();
+  next_notice_later();
 }
 
 // ---- now and then
@@ -520,6 +565,7 @@ void Session::output_is(std::size_t unwritten) noexcept {
 void Session::tick() {
   pick_up_stranded();
   if (!gone_) identity_holds();
+  if (!gone_ && listens()) look_after_persistent_searches();
 }
 
 void Session::pick_up_stranded() {
@@ -559,6 +605,8 @@ Session::OperationPtr Session::outstanding(std::int32_t message_id) const noexce
 }
 
 void Session::abandon(std::int32_t message_id) {
+  if (const PersistentSearchPtr search = persistent_search(message_id))
+    return end_persistent(search, kAbandoned, "");
   const OperationPtr operation = outstanding(message_id);
   if (operation && give_up(operation)) complete(operation);
 }
@@ -575,6 +623,7 @@ void Session::client_left() noexcept {
   gone_ = true;
   connection_.state.store(0, std::memory_order_relaxed);
   aux_.client_gone.store(1, std::memory_order_relaxed);
+  end_persistent_searches();
   for (std::size_t i = 0; i < outstanding_.size();) {
     const OperationPtr operation = outstanding_[i];
     // With the client gone, completing is forgetting: nothing in it can throw.
@@ -616,6 +665,8 @@ void Session::receive_bind(std::int32_t id, BindRequest& request, Refusal refusa
   wipe_credentials(request);
   bind->refusal = std::move(refusal);
   bind_ = std::move(bind);
+  // They would stay outstanding for ever, and the bind would wait as long (RFC 4511, 4.2.1).
+  end_persistent_searches();
   try_bind();
 }
 

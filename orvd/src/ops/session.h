@@ -10,6 +10,7 @@
 #pragma once
 
 #include <atomic>
+#include <deque>
 #include <memory>
 #include <string>
 #include <string_view>
@@ -23,13 +24,16 @@
 
 namespace orv::server {
 
-class Session : public OperationHome, public std::enable_shared_from_this<Session> {
+class Session : public OperationHome,
+                public ChangeListener,
+                public std::enable_shared_from_this<Session> {
  public:
   Session(Services& services, AccessLane& access, std::uint64_t number);
 
   Connection& connection() noexcept override { return connection_; }
   void decided(std::shared_ptr<PendingOperation> operation, Verdict verdict) noexcept override;
   OutputShare& output() noexcept override { return output_; }
+  void has_news(PersistentSearchPtr search) noexcept override;
 
  protected:
   // ---- what the subclass provides
@@ -60,6 +64,10 @@ class Session : public OperationHome, public std::enable_shared_from_this<Sessio
   void client_left() noexcept;
   bool client_is_gone() const noexcept { return gone_; }
   bool idle() const noexcept { return outstanding_.empty() && !bind_; }
+  // The client waits for changes, however long nothing happens.
+  bool listens() const noexcept { return !persistent_.empty(); }
+  // Who the client is, for the audit log.
+  void set_peer(std::string_view peer) { peer_ = peer; }
   // The subclass has so many bytes to write now. To be called whenever that changes.
   void output_is(std::size_t unwritten) noexcept;
   // To be called a few times a second, also when the client is gone.
@@ -94,12 +102,19 @@ class Session : public OperationHome, public std::enable_shared_from_this<Sessio
 
   void take(Message& message);
   OperationPtr outstanding(std::int32_t message_id) const noexcept;
-  bool control_is_unknown(const Message& message) const;
   // For the access log; "" when that is off.
   std::string described(const Request& request) const;
   void abandon(std::int32_t message_id);
 
-  void search(std::int32_t id, SearchRequest& request);
+  // A persistent search that a message asks for.
+  struct PersistentWish {
+    bool wanted = false;
+    bool critical = false;
+    PersistentSearchControl control;
+  };
+  Refusal read_controls(const Message& message, PersistentWish& wish) const;
+
+  void search(std::int32_t id, SearchRequest& request, const PersistentWish& wish);
   void add(std::int32_t id, const AddRequest& request);
   void remove(std::int32_t id, const DeleteRequest& request);
   void modify(std::int32_t id, const ModifyRequest& request);
@@ -122,6 +137,7 @@ class Session : public OperationHome, public std::enable_shared_from_this<Sessio
   void take_step(const OperationPtr& operation);
   void take_step_or_end(const OperationPtr& operation) noexcept;
   void complete(const OperationPtr& operation);
+  void go_on();
   void deliver(PendingOperation& operation);
   void transmit_answer(Answer& answer);
   bool give_up(const OperationPtr& operation) noexcept;
@@ -135,6 +151,31 @@ class Session : public OperationHome, public std::enable_shared_from_this<Sessio
   // `code` kAbandoned: there was no result.
   void log_result(std::int32_t id, std::string_view what, int code, std::int64_t entries,
                   Clock::time_point started) noexcept;
+
+  // ---- persistent searches, in session_notices.cpp
+  Refusal begin_persistent(PendingOperation& operation, const PersistentSearchControl& control,
+                           const SearchRequest& request, std::string_view normal_base);
+  static SearchRequest probe(const SearchRequest& request);
+  void first_part_done(PendingOperation& operation);
+  void hear(const PersistentSearchPtr& search);
+  void next_notice();
+  void next_notice_later() noexcept;
+  void search_for_notice(const PersistentSearchPtr& search, const ChangePtr& change);
+  void tell_deletion(PersistentSearch& search, const Change& change);
+  void notice_done(const OperationPtr& operation);
+  PersistentSearchPtr persistent_search(std::int32_t message_id) const noexcept;
+  // `code` kAbandoned: without a result.
+  void end_persistent(PersistentSearchPtr search, int code, std::string_view text);
+  void end_persistent_searches();
+  void look_after_persistent_searches();
+
+  // ---- the audit log, in session_audit.cpp
+  bool is_audited() const noexcept;
+  AuditDetail audit_detail() const noexcept;
+  template <typename ChangeRequest>
+  void prepare_audit(PendingOperation& operation, const ChangeRequest& request);
+  void audit(PendingOperation& operation, bool wait) noexcept;
+  void audit_refused(const Message& message, int code) noexcept;
 
   void receive_bind(std::int32_t id, BindRequest& request, Refusal refusal);
   void try_bind();
@@ -156,7 +197,12 @@ class Session : public OperationHome, public std::enable_shared_from_this<Sessio
   std::shared_ptr<const Identity> identity_;  // null: anonymous
   std::uint64_t identity_checked_ = 0;        // the generation by which it was good
   OutputShare output_;
+  std::string peer_;
   std::vector<OperationPtr> outstanding_;
+  std::vector<PersistentSearchPtr> persistent_;  // whose first part is over
+  std::deque<PersistentSearchPtr> news_;         // one for each change that is to be told
+  OperationPtr notice_;                          // that is being looked up
+  bool notice_posted_ = false;
   BindPtr bind_;
   bool gone_ = false;
   bool starting_held_ = false;

@@ -1,0 +1,34 @@
+// The server's own guards: changes that it refuses in front of the backend, beyond the backend's
+// rules. The table is documented in docs/guards.md.
+//
+// A guard only ever forbids more. All functions are thread-safe and do not throw but for want of
+// memory.
+#pragma once
+
+#include <span>
+#include <string_view>
+
+#include "ops/canonical.h"
+#include "slapi/entry.h"
+
+namespace orv::server {
+
+enum class GuardedChange { add, remove };
+
+struct Guard {
+  GuardedChange change;
+  std::string_view dn;  // normal form
+  bool primary_may;     // the primary administrator is let through
+  int code;
+  std::string_view text;  // for the client
+};
+
+// The guards of single entries, in the order of the documentation.
+std::span<const Guard> entry_guards() noexcept;
+
+// The refusal of a change of an entry by somebody with these authority flags; none when no guard
+// stands in the way. `added` is the entry to add, null for a delete.
+Refusal guarded(GuardedChange change, std::string_view normal_dn, unsigned authority,
+                const entry* added);
+
+}  // namespace orv::server

@@ -1,0 +1,487 @@
+// Persistent searches: their controls, their bounds, and what becomes of them when something fails.
+#include "ops/persistent_search.h"
+
+#include <gtest/gtest.h>
+
+#include <string>
+#include <vector>
+
+#include "cfg/attribute_table.h"
+#include "core_fake_backend.h"
+#include "core_server_fixture.h"
+#include "core_wire.h"
+#include "slapi/schema.h"
+
+namespace orv::server {
+namespace {
+
+using test::LoopbackServer;
+using test::Reply;
+using test::WireClient;
+
+constexpr const char* kMember = "cn=x,cn=admingroup,cn=configuration";
+constexpr const char* kNormalMember = "CN=X,CN=ADMINGROUP,CN=CONFIGURATION";
+constexpr int kEntryTag = 0x64;
+constexpr int kDoneTag = 0x65;
+
+std::string control_value(int types, bool changes_only, bool notifications) {
+  return test::tlv(0x30, test::integer(types) + test::tlv(0x01, std::string(1, changes_only)) +
+                             test::tlv(0x01, std::string(1, notifications)));
+}
+
+// ---- the control
+
+TEST(PersistentSearchControl, IsReadWhole) {
+  struct PersistentSearchControl control {};
+  ASSERT_TRUE(read_persistent_search(control_value(5, true, false), control));
+  EXPECT_EQ(control.change_types, 5U);
+  EXPECT_TRUE(control.changes_only);
+  EXPECT_FALSE(control.return_notifications);
+}
+
+TEST(PersistentSearchControl, IsRefusedWhenMalformed) {
+  struct PersistentSearchControl control {};
+  const std::string good = control_value(1, true, true);
+  for (std::size_t length = 0; length < good.size(); ++length)
+    EXPECT_FALSE(read_persistent_search(std::string_view(good).substr(0, length), control));
+  EXPECT_FALSE(read_persistent_search(good + '\0', control));
+  EXPECT_FALSE(read_persistent_search(control_value(0, true, true), control));
+  EXPECT_FALSE(read_persistent_search(control_value(16, true, true), control));
+  EXPECT_FALSE(read_persistent_search(
+      test::tlv(0x30, test::integer(1) + test::tlv(0x01, "") + test::tlv(0x01, "")), control));
+}
+
+TEST(EntryChangeControl, TellsTheTypeOfTheChange) {
+  EntryChangeControl control(ChangeType::remove);
+  EXPECT_EQ(std::string(control.get()->oid), "2.16.840.1.113730.3.4.7");
+  EXPECT_EQ(std::string(control.get()->value.bv_val, control.get()->value.bv_len),
+            std::string("\x30\x03\x0A\x01\x02"));
+}
+
+// ---- one search
+
+class Counting final : public ChangeListener {
+ public:
+  void has_news(PersistentSearchPtr) noexcept override { ++news; }
+  int news = 0;
+};
+
+class OneSearch : public testing::Test {
+ protected:
+  PersistentSearchPtr make(int types = 15, int scope = 2) {
+    SearchRequest request;
+    request.scope = scope;
+    return std::make_shared<PersistentSearch>(
+        home, 1, PersistentSearchControl{static_cast<unsigned>(types), true, true}, request,
+        "CN=ADMINGROUP,CN=CONFIGURATION", "(objectClass=*)");
+  }
+  static ChangePtr change(std::size_t bytes = 10) {
+    return std::make_shared<const Change>(Change{ChangeType::add, kNormalMember, nullptr, bytes});
+  }
+  std::shared_ptr<Counting> home = std::make_shared<Counting>();
+};
+
+TEST_F(OneSearch, CoversWhatItAskedFor) {
+  EXPECT_TRUE(make()->covers(ChangeType::add, kNormalMember));
+  EXPECT_TRUE(make()->covers(ChangeType::add, "CN=ADMINGROUP,CN=CONFIGURATION"));
+  EXPECT_FALSE(make()->covers(ChangeType::add, "CN=CONFIGURATION"));
+  EXPECT_FALSE(make(2)->covers(ChangeType::add, kNormalMember));
+  EXPECT_TRUE(make(2)->covers(ChangeType::remove, kNormalMember));
+  EXPECT_TRUE(make(15, 1)->covers(ChangeType::add, kNormalMember));
+  EXPECT_FALSE(make(15, 1)->covers(ChangeType::add, "CN=ADMINGROUP,CN=CONFIGURATION"));
+  EXPECT_FALSE(make(15, 1)->covers(ChangeType::add, std::string("CN=Y,") + kNormalMember));
+  EXPECT_TRUE(make(15, 0)->covers(ChangeType::add, "CN=ADMINGROUP,CN=CONFIGURATION"));
+  EXPECT_FALSE(make(15, 0)->covers(ChangeType::add, kNormalMember));
+}
+
+TEST_F(OneSearch, FailsWhenItFallsTooFarBehind) {
+  const PersistentSearchPtr search = make();
+  for (std::size_t i = 0; i < PersistentSearch::kMostWaiting; ++i) search->tell(change());
+  EXPECT_EQ(search->failure(), 0);
+  search->tell(change());
+  EXPECT_EQ(search->failure(), 11);
+  const int told = home->news;
+  search->tell(change());
+  EXPECT_EQ(home->news, told);
+}
+
+TEST_F(OneSearch, FailsWhenTooMuchWaits) {
+  const PersistentSearchPtr search = make();
+  search->tell(change(2 * PersistentSearch::kMostBytes));  // alone, however large
+  EXPECT_EQ(search->failure(), 0);
+  search->tell(change());
+  EXPECT_EQ(search->failure(), 11);
+}
+
+TEST_F(OneSearch, KeepsUpWhenItsChangesAreTaken) {
+  const PersistentSearchPtr search = make();
+  for (std::size_t i = 0; i < 2 * PersistentSearch::kMostWaiting; ++i) {
+    search->tell(change(PersistentSearch::kMostBytes));
+    ASSERT_TRUE(search->take());
+  }
+  EXPECT_EQ(search->failure(), 0);
+  EXPECT_FALSE(search->take());
+}
+
+TEST_F(OneSearch, HearsNothingAfterItsEnd) {
+  const PersistentSearchPtr search = make();
+  search->tell(change());
+  search->end();
+  search->tell(change());
+  EXPECT_FALSE(search->take());
+}
+
+TEST_F(OneSearch, CountsUntilItIsGone) {
+  PersistentSearches all;
+  {
+    const PersistentSearchPtr forgotten = make();
+    ASSERT_TRUE(all.count(*forgotten, 1));
+    EXPECT_FALSE(all.count(*make(), 1));
+  }
+  const PersistentSearchPtr next = make();
+  ASSERT_TRUE(all.count(*next, 1));
+  ASSERT_TRUE(all.join(next));
+  all.leave(*next);
+  all.leave(*next);
+  EXPECT_TRUE(all.count(*make(), 1));
+}
+
+TEST_F(OneSearch, TheBackendIsToldWhileThereMayBeSome) {
+  const auto switched = [] {
+    int on = -1;
+    slapi_pblock_get(getGlobalPBlock(), parameter::persistent_search_switch, &on);
+    return on;
+  };
+  const auto monitor = [] {
+    PSearchMonitor* found = nullptr;
+    slapi_pblock_get(getGlobalPBlock(), parameter::persistent_search_monitor, &found);
+    return found;
+  };
+  {
+    PersistentSearches all;
+    EXPECT_EQ(switched(), 1);
+    EXPECT_TRUE(monitor());
+  }
+  EXPECT_EQ(switched(), 0);
+  EXPECT_FALSE(monitor());
+}
+
+// ---- what a deleted entry shows
+
+class DeletedEntry : public testing::Test {
+ protected:
+  static void SetUpTestSuite() {
+    ASSERT_EQ(cfg::register_attribute_types(builtin_schema().attribute_table()), 0);
+  }
+  static EntryPtr make(const char* normal_dn) {
+    EntryPtr made = test::make_test_entry(normal_dn);
+    for (const char* type : {"orv-slapdAdminPW", "orv-slapdMasterPW", "orv-slapdAdminDN",
+                             "orv-slapdAdminGroupEnabled"}) {
+      std::string text = "cn=x";
+      berval value{text.size(), text.data()};
+      berval* values[] = {&value, nullptr};
+      attr_merge(made.get(), type, values, 1, 1, nullptr);
+    }
+    return made;
+  }
+  static bool shows(const char* normal_dn, const Identity* identity, const char* type) {
+    const EntryPtr deleted = make(normal_dn);
+    const EntryPtr visible = visible_part(builtin_schema(), *deleted, identity);
+    return attr_find(visible.get(), type, 0, 0) != nullptr;
+  }
+  const Identity root{"CN=ROOT", 0x0C, 0, "CN=CONFIGURATION"};
+  const Identity member{"CN=M", 0x14, 0x3E, "CN=M,CN=ADMINGROUP,CN=CONFIGURATION"};
+};
+
+TEST_F(DeletedEntry, ShowsItsSecretsToThePrimaryAdministratorAndItsOwner) {
+  EXPECT_TRUE(shows(kNormalMember, &root, "orv-slapdAdminPW"));
+  EXPECT_TRUE(shows("CN=M,CN=ADMINGROUP,CN=CONFIGURATION", &member, "orv-slapdAdminPW"));
+}
+
+TEST_F(DeletedEntry, HidesItsSecretsFromEverybodyElse) {
+  for (const char* type : {"orv-slapdAdminPW", "orv-slapdMasterPW"}) {
+    EXPECT_FALSE(shows(kNormalMember, &member, type));
+    EXPECT_FALSE(shows(kNormalMember, nullptr, type));
+  }
+  EXPECT_TRUE(shows(kNormalMember, &member, "orv-slapdAdminDN"));
+}
+
+TEST_F(DeletedEntry, HidesTheAdministratorOfTheTopEntry) {
+  EXPECT_FALSE(shows("CN=CONFIGURATION", &member, "orv-slapdAdminDN"));
+  EXPECT_FALSE(shows("CN=CONFIGURATION", &member, "orv-slapdAdminGroupEnabled"));
+  EXPECT_TRUE(shows("CN=CONFIGURATION", &root, "orv-slapdAdminDN"));
+}
+
+// ---- over the wire
+
+class PersistentWire : public LoopbackServer {
+ protected:
+  PersistentWire() {
+    controls = {kPersistentSearchOid, kEntryChangeOid};
+    // Each search finds the entry it names, of the size that the test wants.
+    backend.on_search = [this](pblock* parameters) {
+      const std::string dn = test::target_of(parameters);
+      if (search_code != 0) return test::finish_search(parameters, search_code, 0);
+      const EntryPtr found = test::make_test_entry(dn, value_bytes);
+      const int code = test::send_test_entry(parameters, *found);
+      return test::finish_search(parameters, code, 1);
+    };
+    backend.on_change = [](pblock* parameters) {
+      send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 0, nullptr,
+                       "");
+      return 0;
+    };
+  }
+
+  static std::string persistent_search(int id, bool changes_only = true,
+                                       std::string_view base = test::kTop) {
+    const std::string control =
+        test::tlv(0x30, test::tlv(0x04, kPersistentSearchOid) + test::tlv(0x01, "\xFF") +
+                            test::tlv(0x04, control_value(15, changes_only, true)));
+    const std::string request =
+        test::tlv(0x63, test::tlv(0x04, base) + test::tlv(0x0A, "\x02") +
+                            test::tlv(0x0A, std::string(1, '\0')) + test::integer(0) +
+                            test::integer(0) + test::tlv(0x01, std::string(1, '\0')) +
+                            test::tlv(0x87, "objectClass") + test::tlv(0x30, ""));
+    return test::message(id, request, control);
+  }
+  // Whether the server has taken everything that was sent so far.
+  static bool taken(WireClient& client, int id) {
+    client.send(test::extended(id, "1.2.3"));
+    const auto reply = client.receive();
+    return reply && reply->id == id;
+  }
+  int add(WireClient& client, int id, const std::string& dn = kMember) {
+    return code_of(client, test::add_entry(id, dn, "cn", "x"));
+  }
+  int remove(WireClient& client, int id, const std::string& dn = kMember) {
+    return code_of(client, test::delete_entry(id, dn));
+  }
+
+  std::atomic<int> search_code{0};
+  std::atomic<std::size_t> value_bytes{8};
+};
+
+TEST_F(PersistentWire, TellsChangesOfAllKindsUnderItsMessageId) {
+  loops = 2;
+  start();
+  WireClient listener(port());
+  WireClient changer(port());
+  bind_as_root(listener);
+  bind_as_root(changer);
+  listener.send(persistent_search(7));
+  ASSERT_TRUE(taken(listener, 8));
+  ASSERT_EQ(add(changer, 2), 0);
+  ASSERT_EQ(code_of(changer, test::modify(3, kMember, "description", "y")), 0);
+  for (int i = 0; i < 2; ++i) {
+    const auto notice = listener.receive();
+    ASSERT_TRUE(notice);
+    EXPECT_EQ(notice->id, 7);
+    EXPECT_EQ(notice->tag, kEntryTag);
+  }
+  listener.send(test::abandon(9, 7));
+  ASSERT_TRUE(taken(listener, 10));
+  ASSERT_EQ(add(changer, 4), 0);
+  EXPECT_TRUE(taken(listener, 11)) << "a notice came after the search was abandoned";
+}
+
+TEST_F(PersistentWire, SendsNoResultBeforeItEnds) {
+  start();
+  WireClient listener(port());
+  bind_as_root(listener);
+  listener.send(persistent_search(7, false));
+  const auto first = listener.receive();
+  ASSERT_TRUE(first);
+  EXPECT_EQ(first->tag, kEntryTag);
+  EXPECT_TRUE(taken(listener, 8));
+}
+
+TEST_F(PersistentWire, AFailedFirstPartIsItsResult) {
+  start();
+  search_code = 32;
+  WireClient listener(port());
+  bind_as_root(listener);
+  EXPECT_EQ(code_of(listener, persistent_search(7)), 32);
+  EXPECT_EQ(code_of(listener, persistent_search(7)), 32) << "its message id is free again";
+}
+
+TEST_F(PersistentWire, AMessageIdOfARunningSearchIsInUse) {
+  start();
+  WireClient listener(port());
+  bind_as_root(listener);
+  listener.send(persistent_search(7));
+  ASSERT_TRUE(taken(listener, 8));
+  listener.send(test::search(7, test::kTop));
+  const auto notice = listener.receive();
+  ASSERT_TRUE(notice);
+  EXPECT_EQ(notice->id, 0);
+}
+
+TEST_F(PersistentWire, EndsWithTheCodeOfASearchThatFails) {
+  start();
+  WireClient listener(port());
+  WireClient changer(port());
+  bind_as_root(listener);
+  bind_as_root(changer);
+  listener.send(persistent_search(7));
+  ASSERT_TRUE(taken(listener, 8));
+  search_code = 1;
+  ASSERT_EQ(add(changer, 2), 0);
+  const auto end = listener.receive();
+  ASSERT_TRUE(end);
+  EXPECT_EQ(end->id, 7);
+  EXPECT_EQ(end->tag, kDoneTag);
+  EXPECT_EQ(end->code, 1);
+}
+
+TEST_F(PersistentWire, AnEntryThatIsGoneAgainIsNotTold) {
+  start();
+  WireClient listener(port());
+  WireClient changer(port());
+  bind_as_root(listener);
+  bind_as_root(changer);
+  listener.send(persistent_search(7));
+  ASSERT_TRUE(taken(listener, 8));
+  search_code = 32;
+  ASSERT_EQ(add(changer, 2), 0);
+  while (backend.calls(parameter::search_function) < 2) std::this_thread::yield();
+  search_code = 0;
+  ASSERT_EQ(add(changer, 3), 0);
+  const auto notice = listener.receive();
+  ASSERT_TRUE(notice);
+  EXPECT_EQ(notice->tag, kEntryTag);
+}
+
+TEST_F(PersistentWire, ARefusedChangeIsNotTold) {
+  start();
+  WireClient listener(port());
+  WireClient changer(port());
+  bind_as_root(listener);
+  bind_as_root(changer);
+  listener.send(persistent_search(7));
+  ASSERT_TRUE(taken(listener, 8));
+  backend.on_change = [](pblock* parameters) {
+    send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 68, nullptr,
+                     "");
+    return 68;
+  };
+  ASSERT_EQ(add(changer, 2), 68);
+  EXPECT_TRUE(taken(listener, 9));
+  EXPECT_EQ(backend.calls(parameter::search_function), 1);
+}
+
+TEST_F(PersistentWire, ADeletedEntryIsToldWithoutASearch) {
+  start();
+  WireClient listener(port());
+  WireClient changer(port());
+  bind_as_root(listener);
+  bind_as_root(changer);
+  listener.send(persistent_search(7));
+  ASSERT_TRUE(taken(listener, 8));
+  backend.on_change = [](pblock* parameters) {
+    EntryPtr before = test::make_test_entry(test::target_of(parameters));
+    std::string text = "container";
+    berval value{text.size(), text.data()};
+    berval* values[] = {&value, nullptr};
+    attr_merge(before.get(), "objectClass", values, 1, 1, nullptr);
+    slapi_pblock_set(parameters, parameter::entry_before_delete,
+                     static_cast<void*>(before.release()));
+    send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 0, nullptr,
+                     "");
+    return 0;
+  };
+  ASSERT_EQ(remove(changer, 2), 0);
+  const auto notice = listener.receive();
+  ASSERT_TRUE(notice);
+  EXPECT_EQ(notice->tag, kEntryTag);
+  EXPECT_EQ(backend.calls(parameter::search_function), 1) << "that of the first part";
+}
+
+TEST_F(PersistentWire, WhoIsNobodyAnyMoreHearsNothingMore) {
+  start();
+  WireClient listener(port());
+  bind_as_root(listener);
+  listener.send(persistent_search(7));
+  ASSERT_TRUE(taken(listener, 8));
+  authenticator.change(false);
+  const auto notice = listener.receive();
+  ASSERT_TRUE(notice);
+  EXPECT_EQ(notice->id, 0);
+}
+
+TEST_F(PersistentWire, ABindEndsItAndIsAnswered) {
+  start();
+  WireClient listener(port());
+  bind_as_root(listener);
+  listener.send(persistent_search(7));
+  ASSERT_TRUE(taken(listener, 8));
+  EXPECT_EQ(code_of(listener, test::bind(9, test::kRoot, test::kSecret)), 0);
+  listener.send(test::search(7, test::kTop));
+  EXPECT_EQ(listener.receive_result().back().code, 0) << "its message id is free again";
+}
+
+TEST_F(PersistentWire, TheBoundsHold) {
+  settings.max_persistent_searches = 2;
+  settings.max_persistent_searches_per_connection = 1;
+  start();
+  WireClient one(port());
+  WireClient two(port());
+  WireClient three(port());
+  for (WireClient* const client : {&one, &two, &three}) bind_as_root(*client);
+  one.send(persistent_search(7));
+  two.send(persistent_search(7));
+  ASSERT_TRUE(taken(one, 8));
+  ASSERT_TRUE(taken(two, 8));
+  EXPECT_EQ(code_of(one, persistent_search(9)), 11);
+  EXPECT_EQ(code_of(three, persistent_search(9)), 51);
+  one.send(test::abandon(10, 7));
+  ASSERT_TRUE(taken(one, 11));
+  three.send(persistent_search(10));
+  EXPECT_TRUE(taken(three, 11));
+}
+
+TEST_F(PersistentWire, NoneAreAllowedWhenTheyAreSwitchedOff) {
+  settings.max_persistent_searches = 0;
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  EXPECT_EQ(code_of(client, persistent_search(7)), 53);
+}
+
+// The listener reads nothing until the end: what waits for it is bounded, and it is told so. The
+// notices are large enough to fill what the system buffers for it.
+TEST_F(PersistentWire, WhoDoesNotReadIsEndedWithAResult) {
+  settings.write_timeout = 3600;
+  loops = 2;
+  start();
+  value_bytes = 300000;
+  WireClient listener(port());
+  WireClient changer(port());
+  bind_as_root(listener);
+  bind_as_root(changer);
+  listener.send(persistent_search(7));
+  ASSERT_TRUE(taken(listener, 8));
+  const int most = static_cast<int>(PersistentSearch::kMostWaiting) + 200;
+  for (int i = 0; i < most; ++i) ASSERT_EQ(add(changer, i + 2), 0);
+  const std::vector<Reply> replies = listener.receive_result();
+  ASSERT_FALSE(replies.empty());
+  EXPECT_EQ(replies.back().tag, kDoneTag);
+  EXPECT_EQ(replies.back().code, 11);
+  EXPECT_LT(replies.size(), 200U);
+}
+
+TEST_F(PersistentWire, TheServerStopsWhileSomebodyListens) {
+  start();
+  WireClient listener(port());
+  bind_as_root(listener);
+  listener.send(persistent_search(7));
+  ASSERT_TRUE(taken(listener, 8));
+  stop();
+  EXPECT_EQ(status, 0);
+  const auto notice = listener.receive();
+  ASSERT_TRUE(notice);
+  EXPECT_EQ(notice->id, 0);
+}
+
+}  // namespace
+}  // namespace orv::server
