@@ -887,6 +887,7 @@ int compare_with_chain(const ldtr_function_local& trace, _CFG* session, _CFGMess
   while (record_dn != nullptr) {
     const int rc = compare_with_record(trace, session, record, record_dn.get(), dn, subtrees);
     if (rc != 0) return rc;
+    record_dn.reset();
     record = cfg_next_entry(session, record);
     record_dn.reset(record == nullptr ? nullptr : cfg_get_dn(session, record));
   }
