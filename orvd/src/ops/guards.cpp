@@ -1,8 +1,12 @@
 #include "ops/guards.h"
 
+#include <strings.h>
+
+#include <algorithm>
 #include <string>
 
 #include "cfg/result_codes.h"
+#include "config/setting_ranges.h"
 #include "slapi/connection.h"
 
 namespace orv::server {
@@ -36,6 +40,18 @@ bool is_second_supplier_of_server(std::string_view normal_dn, const entry& added
                                kSupplierOfServer.size()) == 0;
 }
 
+// With such a level in its file the server would not start again.
+bool has_unknown_log_level(const entry& added) noexcept {
+  const attr* const levels = attr_find(&added, "orv-slapdLogLevel", 0, 0);
+  if (levels == nullptr || levels->values == nullptr) return false;
+  return std::any_of(levels->values, levels->values + levels->count, [](const berval* level) {
+    return std::none_of(std::begin(kLogLevels), std::end(kLogLevels), [level](auto known) {
+      return known.size() == level->bv_len &&
+             strncasecmp(known.data(), level->bv_val, known.size()) == 0;
+    });
+  });
+}
+
 }  // namespace
 
 std::span<const Guard> entry_guards() noexcept {
@@ -52,6 +68,9 @@ Refusal guarded(GuardedChange change, std::string_view normal_dn, unsigned autho
   if (added && is_second_supplier_of_server(normal_dn, *added))
     return {result::unwilling_to_perform,
             "the supplier of the whole server is " + std::string(kMasterServer)};
+  if (added && has_unknown_log_level(*added))
+    return {result::invalid_attribute_syntax,
+            "orv-slapdLogLevel is none of error, warning, info, debug, off"};
   return {};
 }
 
