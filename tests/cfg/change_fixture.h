@@ -4,6 +4,7 @@
 #include <fstream>
 #include <iterator>
 #include <memory>
+#include <mutex>
 #include <string>
 #include <utility>
 #include <vector>
@@ -106,14 +107,19 @@ class ChangeTest : public CfgTest {
  protected:
   using CfgTest::CfgTest;
 
-  // Reasons of refusals go to `told`, for the length of a test.
+  // Reasons of refusals go to `told`, for the length of a test; from any thread, to be read when
+  // the threads have ended.
   void SetUp() override {
     CfgTest::SetUp();
     told.clear();
-    cfg::set_diagnostics_sink([](const char* line) noexcept { (told += line) += '\n'; });
+    cfg::set_diagnostics_sink([](const char* line) noexcept {
+      const std::lock_guard lock(told_mutex);
+      (told += line) += '\n';
+    });
   }
   void TearDown() override { cfg::set_diagnostics_sink(nullptr); }
   inline static std::string told;
+  inline static std::mutex told_mutex;
 
   // A handle with the paths of file and save file set.
   CfgSession unbound_with_save() {
