@@ -1,12 +1,10 @@
 // Who may bind, and what is granted: read from real files, proven with real passwords.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
-#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <atomic>
-#include <chrono>
 #include <filesystem>
 #include <fstream>
 #include <thread>
@@ -521,45 +519,6 @@ TEST_F(Store, KeepsTheLastGoodOneWhileTheFileIsDamaged) {
   EXPECT_TRUE(binds(store, "one"));
   replace(top_with("two"));
   EXPECT_TRUE(binds(store, "two"));
-}
-
-// The process may open nothing more while this lives.
-class NoMoreFiles {
- public:
-  NoMoreFiles() {
-    getrlimit(RLIMIT_NOFILE, &before_);
-    rlimit none = before_;
-    none.rlim_cur = 0;
-    setrlimit(RLIMIT_NOFILE, &none);
-  }
-  ~NoMoreFiles() { setrlimit(RLIMIT_NOFILE, &before_); }
-  NoMoreFiles(const NoMoreFiles&) = delete;
-  NoMoreFiles& operator=(const NoMoreFiles&) = delete;
-
- private:
-  rlimit before_{};
-};
-
-TEST_F(Store, ReadsAGoodFileThatCouldNotBeReadOnceMoreAndTellsOnce) {
-  write(top_with("one"));
-  int told = 0;
-  IdentityStore store(config(), "", [&](const std::string&, const auto&) { ++told; });
-  ASSERT_TRUE(store.reload(error_, warnings_)) << error_;
-  replace(top_with("two"));
-  {
-    const NoMoreFiles hindrance;
-    EXPECT_TRUE(binds(store, "one"));
-    EXPECT_TRUE(binds(store, "one"));
-  }
-  EXPECT_TRUE(binds(store, "one")) << "the pause is not over";
-  store.read_again_after(std::chrono::milliseconds(0));
-  {
-    const NoMoreFiles hindrance;
-    ASSERT_FALSE(store.reload(error_, warnings_));
-    EXPECT_TRUE(binds(store, "one"));
-  }
-  EXPECT_TRUE(binds(store, "two"));
-  EXPECT_EQ(told, 1);
 }
 
 TEST_F(Store, ReadsAgainWhenTheKeyStashChanges) {
