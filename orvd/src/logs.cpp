@@ -21,6 +21,8 @@
 #include <spdlog/pattern_formatter.h>
 #include <spdlog/sinks/base_sink.h>
 
+#include "descriptor.h"
+
 namespace orv::server {
 namespace {
 
@@ -54,23 +56,6 @@ LogLevel level_of(std::string_view name) {
 }
 
 // ---- files
-
-class Descriptor {
- public:
-  explicit Descriptor(int number = -1) noexcept : number_(number) {}
-  Descriptor(Descriptor&& other) noexcept : number_(std::exchange(other.number_, -1)) {}
-  Descriptor& operator=(Descriptor&& other) noexcept {
-    std::swap(number_, other.number_);
-    return *this;
-  }
-  ~Descriptor() {
-    if (number_ >= 0) ::close(number_);
-  }
-  int get() const noexcept { return number_; }
-
- private:
-  int number_;
-};
 
 bool same_file(const struct stat& a, const struct stat& b) noexcept {
   return a.st_dev == b.st_dev && a.st_ino == b.st_ino;
@@ -112,7 +97,7 @@ std::string refuse(const LogFile& file, const std::vector<std::string>& guarded)
 // meant before may be something else by now.
 std::string open_guarded(const std::string& path, const std::vector<std::string>& guarded,
                          LogFile& file) {
-  if (!open_log_file(path, file) || fstat(file.descriptor.get(), &file.status) != 0)
+  if (!open_log_file(path, file) || fstat(file.descriptor.number(), &file.status) != 0)
     return std::strerror(errno);
   std::string reason = refuse(file, guarded);
   if (!reason.empty() && file.made) ::unlink(path.c_str());
@@ -140,7 +125,7 @@ void write_all(int fd, const char* text, std::size_t length) noexcept {
 class Sink final : public spdlog::sinks::base_sink<spdlog::details::null_mutex> {
  public:
   Sink() : number_(STDERR_FILENO) {}
-  explicit Sink(Descriptor file) : file_(std::move(file)), number_(file_.get()) {}
+  explicit Sink(Descriptor file) : file_(std::move(file)), number_(file_.number()) {}
 
  protected:
   void sink_it_(const spdlog::details::log_msg& message) override {
@@ -278,7 +263,7 @@ void refuse_if_same(Candidate& wanted, const struct stat& other, const char* oth
 
 std::shared_ptr<spdlog::logger> make_logger(Candidate& wanted, bool access) {
   std::shared_ptr<Sink> sink;
-  if (wanted.file.descriptor.get() >= 0)
+  if (wanted.file.descriptor.number() >= 0)
     sink = std::make_shared<Sink>(std::move(wanted.file.descriptor));
   else
     sink = std::make_shared<Sink>();

@@ -18,6 +18,8 @@
 #include <string>
 #include <string_view>
 
+#include "descriptor.h"
+
 #if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
 // The reports of the sanitizers end the process before anybody could carry them over.
 extern "C" void __sanitizer_set_report_fd(void* descriptor);
@@ -29,25 +31,6 @@ namespace {
 
 constexpr std::size_t kKept = 1 << 20;
 constexpr int kPipeBytes = 1 << 20;
-
-class Descriptor {
- public:
-  explicit Descriptor(int number = -1) noexcept : number_(number) {}
-  ~Descriptor() {
-    if (number_ >= 0) ::close(number_);
-  }
-  Descriptor(const Descriptor&) = delete;
-  Descriptor& operator=(const Descriptor&) = delete;
-  void reset(int number) noexcept {
-    if (number_ >= 0) ::close(number_);
-    number_ = number;
-  }
-  int get() const noexcept { return number_; }
-  bool valid() const noexcept { return number_ >= 0; }
-
- private:
-  int number_;
-};
 
 // What came out of the pipe and has not been taken yet.
 class Backlog {
@@ -136,19 +119,19 @@ struct StandardError::State {
 
   bool open() noexcept {
     int ends[2];
-    original.reset(::fcntl(STDERR_FILENO, F_DUPFD_CLOEXEC, STDERR_FILENO + 1));
-    wake.reset(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
-    if (!original.valid() || !wake.valid()) return false;
+    original = Descriptor(::fcntl(STDERR_FILENO, F_DUPFD_CLOEXEC, STDERR_FILENO + 1));
+    wake = Descriptor(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
+    if (!original || !wake) return false;
     if (::pipe2(ends, O_CLOEXEC | O_NONBLOCK) != 0) return false;
-    outlet.reset(ends[0]);
+    outlet = Descriptor(ends[0]);
     const Descriptor inlet(ends[1]);
-    ::fcntl(inlet.get(), F_SETPIPE_SZ, kPipeBytes);  // a larger one loses less; any will do
-    return ::dup2(inlet.get(), STDERR_FILENO) == STDERR_FILENO;
+    ::fcntl(inlet.number(), F_SETPIPE_SZ, kPipeBytes);  // a larger one loses less; any will do
+    return ::dup2(inlet.number(), STDERR_FILENO) == STDERR_FILENO;
   }
 
   void end() noexcept {
     const std::uint64_t one = 1;
-    [[maybe_unused]] const ssize_t written = ::write(wake.get(), &one, sizeof one);
+    [[maybe_unused]] const ssize_t written = ::write(wake.number(), &one, sizeof one);
   }
 
   void carry() noexcept {
@@ -178,9 +161,9 @@ struct StandardError::State {
  private:
   // Until there is something to read, room for what is kept, or the end.
   void wait(const Backlog& backlog) noexcept {
-    pollfd polled[] = {{outlet.get(), POLLIN, 0},
-                       {ending_ ? -1 : wake.get(), POLLIN, 0},
-                       {backlog.empty() ? -1 : original.get(), POLLOUT, 0}};
+    pollfd polled[] = {{outlet.number(), POLLIN, 0},
+                       {ending_ ? -1 : wake.number(), POLLIN, 0},
+                       {backlog.empty() ? -1 : original.number(), POLLOUT, 0}};
     if (::poll(polled, 3, -1) < 0) return;
     if ((polled[1].revents & POLLIN) != 0) ending_ = true;
     writable_ = polled[2].revents != 0;
@@ -188,8 +171,8 @@ struct StandardError::State {
 
   bool is_nearly_full() const noexcept {
     int waiting = 0;
-    const int size = ::fcntl(outlet.get(), F_GETPIPE_SZ);
-    return size > 0 && ::ioctl(outlet.get(), FIONREAD, &waiting) == 0 && waiting >= size / 8 * 7;
+    const int size = ::fcntl(outlet.number(), F_GETPIPE_SZ);
+    return size > 0 && ::ioctl(outlet.number(), FIONREAD, &waiting) == 0 && waiting >= size / 8 * 7;
   }
 
   // Whether the pipe is empty now; false when it never seems to get there.
@@ -199,7 +182,7 @@ struct StandardError::State {
     carrying.store(true, std::memory_order_release);
     if (is_nearly_full()) backlog.overflow();
     for (int i = 0; i < kAtOnce; ++i) {
-      const ssize_t length = ::read(outlet.get(), chunk, sizeof chunk);
+      const ssize_t length = ::read(outlet.number(), chunk, sizeof chunk);
       if (length <= 0) return true;
       if (!gone_) backlog.take({chunk, static_cast<std::size_t>(length)});
     }
@@ -212,7 +195,7 @@ struct StandardError::State {
     if (!writable_ || backlog.empty()) return;
     writable_ = false;
     const std::string_view next = backlog.next();
-    const ssize_t written = ::write(original.get(), next.data(), next.size());
+    const ssize_t written = ::write(original.number(), next.data(), next.size());
     if (written >= 0) return backlog.taken(static_cast<std::size_t>(written));
     if (errno == EAGAIN || errno == EINTR) return;
     gone_ = true;  // nobody will ever read it
@@ -254,13 +237,13 @@ StandardError::StandardError() noexcept {
     state_ = state;
     thread_ = std::thread([state] { state->carry(); });
     watched.carrying.store(&state->carrying, std::memory_order_release);
-    watched.outlet.store(state->outlet.get(), std::memory_order_release);
+    watched.outlet.store(state->outlet.number(), std::memory_order_release);
 #ifdef ORV_REPORTS_OF_SANITIZERS
-    __sanitizer_set_report_fd(reinterpret_cast<void*>(std::intptr_t{state->original.get()}));
+    __sanitizer_set_report_fd(reinterpret_cast<void*>(std::intptr_t{state->original.number()}));
 #endif
     std::signal(SIGABRT, wait_for_last_words);
   } catch (...) {
-    if (state_) ::dup2(state_->original.get(), STDERR_FILENO);
+    if (state_) ::dup2(state_->original.number(), STDERR_FILENO);
     state_.reset();
   }
 }
@@ -278,7 +261,7 @@ StandardError::~StandardError() {
     return;
   }
   thread_.join();
-  ::dup2(state_->original.get(), STDERR_FILENO);
+  ::dup2(state_->original.number(), STDERR_FILENO);
 #ifdef ORV_REPORTS_OF_SANITIZERS
   __sanitizer_set_report_fd(reinterpret_cast<void*>(std::intptr_t{STDERR_FILENO}));
 #endif

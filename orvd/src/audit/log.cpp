@@ -12,7 +12,7 @@
 #include <mutex>
 #include <utility>
 
-#include "net/descriptor.h"
+#include "descriptor.h"
 
 namespace orv::server {
 namespace {

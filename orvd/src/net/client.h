@@ -20,7 +20,7 @@
 #include <string_view>
 #include <vector>
 
-#include "net/descriptor.h"
+#include "descriptor.h"
 #include "net/limits.h"
 #include "net/loop.h"
 #include "ops/session.h"

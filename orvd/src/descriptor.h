@@ -1,4 +1,4 @@
-// The owner of a file descriptor, for one that is between two owners of another kind.
+// The owner of a file descriptor.
 #pragma once
 
 #include <unistd.h>
