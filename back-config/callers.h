@@ -13,11 +13,19 @@ inline bool is_primary_administrator(const Operation& operation) {
   return has_all(operation.authority, authority::primary_administrator);
 }
 
-// Suppliers, and callers who are kept out: exactly that value, not every set of flags that has it.
-inline bool has_no_configuration_access(const Operation& operation) {
+// A master server, of the server as a whole or of a suffix.
+inline bool is_supplier(const Operation& operation) {
   constexpr unsigned kAnySupplier = authority::supplier_of_server | authority::supplier_of_suffix;
-  return (operation.authority & kAnySupplier) != 0 ||
-         operation.authority == authority::no_configuration_access;
+  return (operation.authority & kAnySupplier) != 0;
+}
+
+// Callers who are kept out: exactly that value, not every set of flags that has it.
+inline bool is_kept_out(const Operation& operation) {
+  return operation.authority == authority::no_configuration_access;
+}
+
+inline bool has_no_configuration_access(const Operation& operation) {
+  return is_supplier(operation) || is_kept_out(operation);
 }
 
 // A member of the administrative group: what it may do is told by its role bits.

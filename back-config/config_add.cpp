@@ -17,6 +17,7 @@
 #include "config_xlate.h"
 #include "function_ids.h"
 #include "handlers.h"
+#include "rules.h"
 #include "slapi/dn.h"
 #include "slapi/globals.h"
 #include "slapi/log.h"
@@ -36,15 +37,6 @@ constexpr const char* kProblems = "Problems retrieving values for %s ! \n";
 constexpr const char* kWalkFailed = "cfg_first_attribute error ! \n";
 constexpr const char* kSecondAdminDn = "Error: more then one admin DN ";
 constexpr const char* kFailed = "Retrieving %s FAILED rc = %d\n";
-
-// A value list of the library, released value by value.
-struct EachValueDeleter {
-  void operator()(char** values) const noexcept {
-    for (char** value = values; *value != nullptr; ++value) std::free(*value);
-    std::free(values);
-  }
-};
-using ValueList = std::unique_ptr<char*, EachValueDeleter>;
 
 // Makes an identity of the first value of its attribute, which is in the file's code page.
 using Take = int (*)(const char* value, MallocText& identity);
@@ -158,17 +150,6 @@ int walk(const ldtr_function_local& trace, _CFG* session, _CFGMessage* record,
   return rc;
 }
 
-int search(_CFG* session, const char* base, int scope, const char* filter, CfgResult& chain) {
-  _CFGMessage* found = nullptr;
-  const int rc = cfg_search_s(session, base, scope, filter, nullptr, 0, &found);
-  chain.reset(found);
-  return rc;
-}
-
-int search_entry(_CFG* session, const char* dn, CfgResult& chain) {
-  return search(session, dn, kScopeBase, config_names::any_entry, chain);
-}
-
 // ---- The three identities of the primary administrator
 
 int read_identity(const ldtr_function_local& trace, _CFG* session, const char* dn,
@@ -244,8 +225,6 @@ char* getAdminGroupMemberDn(Connection* connection, const char* target_dn) {
 
 namespace {
 
-constexpr const char* kText = "%s";
-constexpr const char* kNullPointer = "Invalid NULL pointer passed through.\n";
 constexpr const char* kNullSplitName =
     "doesProxySplitNameExist::Invalid NULL pointer passed through.\n";
 constexpr const char* kDnOfAdministrator =
@@ -274,11 +253,6 @@ constexpr const char* kSplitNameTaken =
     "split Name.";
 
 constexpr int kEveryEntry = INT_MAX;
-
-int refuse_null(const ldtr_function_local& trace, const char* text = kNullPointer) {
-  trace.debug(trace::error, kText, text);
-  return result::other;
-}
 
 // ---- When two identities are the same: for DNs in the normal form and for names, byte for byte;
 // for Kerberos identities, by what follows the first "=", in any letter case
@@ -442,19 +416,8 @@ namespace {
 
 constexpr const char* kNullSplitContainer =
     "CheckIfProxySplitContainer::Invalid NULL pointer passed through.\n";
-constexpr const char* kBadKerberosMember = "Bad value for Kerberos Admin Group Member DN\n";
-constexpr const char* kBadKerberosRoot = "Bad value for Kerberos Root Administrator DN\n";
 
-constexpr int kMessageSet = 8;
 constexpr int kMessageSplitNameTaken = 146;
-
-bool contains(const char* dn, const char* part) {
-  return std::strstr(dn, part) != nullptr;
-}
-
-bool is(const char* dn, const char* constant) {
-  return std::strcmp(dn, constant) == 0;
-}
 
 // Object class tests follow the attribute's own equality rule.
 bool has_class(const entry& e, const char* name) {
@@ -483,30 +446,10 @@ int check_log_entry(const char* dn, const Operation& operation) {
   return (operation.roles & opens) != 0 ? result::success : result::insufficient_access;
 }
 
-bool begins_with(const char* value, const char* prefix) {
-  return value != nullptr && strncasecmp(value, prefix, std::strlen(prefix)) == 0;
-}
-
-int check_kerberos_identity(const ldtr_function_local& trace, _CFG* session, const attr& identity,
-                            const char* bad_form) {
-  const char* const value = first_value(identity);
-  if (begins_with(value, config_names::kerberos_prefix) ||
-      begins_with(value, config_names::short_kerberos_prefix)) {
-    return doesKerberosIDExist(session, value);
-  }
-  trace.debug(trace::error, kText, bad_form);
-  return result::other;
-}
-
 int check_digest_user(_CFG* session, const entry& e) {
   const attr* const user = find(e, config_names::digest_admin_user);
   if (user == nullptr) return result::success;
   return doesDigestUserNameExist(session, first_value(*user));
-}
-
-int check_bind_dn_of_member(_CFG* session, const char* dn) {
-  const int rc = doesAdminGroupMemberDNExist(session, dn);
-  return rc != 0 ? rc : doesReplicationSupplierDNExist(session, dn);
 }
 
 int check_member(const ldtr_function_local& trace, _CFG* session, const entry& e) {
@@ -519,7 +462,7 @@ int check_member(const ldtr_function_local& trace, _CFG* session, const entry& e
   int rc = check_bind_dn_of_member(session, first_value(*dn));
   if (rc != 0) return rc;
   if (const attr* const kerberos = find(e, config_names::kerberos_admin_dn)) {
-    rc = check_kerberos_identity(trace, session, *kerberos, kBadKerberosMember);
+    rc = check_kerberos_identity(trace, session, first_value(*kerberos), kBadKerberosMember);
     if (rc != 0) return rc;
   }
   return check_digest_user(session, e);
@@ -574,8 +517,8 @@ int checkIfKerberosEntry(const char* normalized_dn, entry* e, Connection* connec
   }
   const attr* const identity = find(*e, config_names::kerberos_admin_dn);
   if (identity == nullptr) return trace.exit(result::object_class_violation);
-  return trace.exit(
-      check_kerberos_identity(trace, connection->config_session, *identity, kBadKerberosRoot));
+  return trace.exit(check_kerberos_identity(trace, connection->config_session,
+                                            first_value(*identity), kBadKerberosRoot));
 }
 
 int checkIfDigestEntry(const char* normalized_dn, entry* e, Connection* connection,
@@ -654,26 +597,6 @@ constexpr const char* kInvalidRole =
 constexpr const char* kDefaultRole =
     "Admin group member %s is being added with orv-slapdAdminRole: %s\n";
 
-// Counted values of our own, released with their texts.
-struct CountedValuesDeleter {
-  void operator()(berval** values) const noexcept {
-    for (berval** value = values; *value != nullptr; ++value) {
-      std::free((*value)->bv_val);
-      std::free(*value);
-    }
-    std::free(values);
-  }
-};
-using CountedValues = std::unique_ptr<berval*, CountedValuesDeleter>;
-
-// The role that a value names, in any letter case; null for none.
-const char* role_named(const char* value) {
-  const auto* const found =
-      std::find_if(std::begin(kAdminRoles), std::end(kAdminRoles),
-                   [&](const char* role) { return kel_strcasecmp(value, role) == 0; });
-  return found == std::end(kAdminRoles) ? nullptr : *found;
-}
-
 // Makes "NoAdmin" the only value. It is written over the first, which is a role and so has room.
 void leave_only_no_admin(attr& roles) {
   std::size_t count = 0;
@@ -709,18 +632,6 @@ std::size_t count_default_roles(const ldtr_function_local& trace, const char* dn
     trace.debug(trace::info, kDefaultRole, dn, DEFAULT_ADMIN_ROLES[count]);
   }
   return count;
-}
-
-berval* new_value(const char* text) {
-  auto* const value = static_cast<berval*>(std::calloc(1, sizeof(berval)));
-  if (value == nullptr) return nullptr;
-  value->bv_val = slapi_ch_strdup(text);
-  if (value->bv_val == nullptr) {
-    std::free(value);
-    return nullptr;
-  }
-  value->bv_len = std::strlen(text);
-  return value;
 }
 
 int add_default_roles(const ldtr_function_local& trace, const char* dn, entry& e) {
@@ -887,7 +798,6 @@ int compare_with_chain(const ldtr_function_local& trace, _CFG* session, _CFGMess
   while (record_dn != nullptr) {
     const int rc = compare_with_record(trace, session, record, record_dn.get(), dn, subtrees);
     if (rc != 0) return rc;
-    record_dn.reset();
     record = cfg_next_entry(session, record);
     record_dn.reset(record == nullptr ? nullptr : cfg_get_dn(session, record));
   }

@@ -20,6 +20,10 @@ inline constexpr const char* proxy_backend_dn =
     "CN=PROXYDB,CN=PROXY BACKENDS,CN=ORV DIRECTORY,CN=SCHEMAS,CN=CONFIGURATION";
 inline constexpr const char* directory_backend_dn =
     "CN=DIRECTORY,CN=RDBM BACKENDS,CN=ORV DIRECTORY,CN=SCHEMAS,CN=CONFIGURATION";
+inline constexpr const char* backends_dn = "CN=ORV DIRECTORY,CN=SCHEMAS,CN=CONFIGURATION";
+inline constexpr const char* password_policy_dn = "CN=PWDPOLICY ADMIN,CN=CONFIGURATION";
+// Not in the configuration: where the directory backend is found.
+inline constexpr const char* localhost_dn = "CN=LOCALHOST";
 
 inline constexpr const char* admin_dn = "orv-slapdAdminDN";
 inline constexpr const char* admin_password = "orv-slapdAdminPW";
@@ -33,12 +37,17 @@ inline constexpr const char* proxy_split_name = "orv-slapdProxySplitName";
 inline constexpr const char* passthrough_url = "orv-slapdPtaURL";
 inline constexpr const char* passthrough_subtree = "orv-slapdPtaSubtree";
 inline constexpr const char* passthrough_mapping = "orv-slapdPtaAttrMapping";
+inline constexpr const char* suffix = "orv-slapdSuffix";
+inline constexpr const char* ip_address = "orv-slapdIpAddress";
+inline constexpr const char* log_file = "orv-slapdLog";
+inline constexpr const char* password_encryption = "orv-slapdPwEncryption";
 
 // What a Kerberos identity of an administrator begins with, in any letter case.
 inline constexpr const char* kerberos_prefix = "orv-kerberosName=";
 inline constexpr const char* short_kerberos_prefix = "orv-kn=";
 
 inline constexpr const char* top_class = "top";
+inline constexpr const char* top_entry_class = "orv-slapdTop";
 inline constexpr const char* container_class = "container";
 inline constexpr const char* config_entry_class = "orv-slapdConfigEntry";
 inline constexpr const char* admin_group_member_class = "orv-slapdAdminGroupMember";
@@ -55,6 +64,7 @@ inline constexpr const char* any_entry_in_parentheses = "(objectclass=*)";
 inline constexpr const char* replication_entries = "objectclass=orv-slapdReplication";
 inline constexpr const char* supplier_entries = "objectclass=orv-slapdSupplier";
 inline constexpr const char* passthrough_entries = "objectclass=orv-slapdPta";
+inline constexpr const char* audit_log_entries = "(objectclass=orv-auditConfig)";
 
 }  // namespace orv::config_names
 

@@ -8,6 +8,7 @@
 #include "cfg/result_codes.h"
 #include "config_names.h"
 #include "function_ids.h"
+#include "name_list.h"
 #include "slapi/codepage.h"
 #include "slapi/dn.h"
 #include "slapi/owners.h"
@@ -61,30 +62,6 @@ int normalized_copy(const char* dn, MallocText& copy) {
 }
 
 // ---- One attribute of one entry
-
-namespace {
-
-// A null-terminated list with one name, in the form that a search takes.
-class NameList {
- public:
-  explicit NameList(const char* name) : list_(static_cast<char**>(std::calloc(2, sizeof(char*)))) {
-    if (list_ != nullptr) list_[0] = slapi_ch_strdup(name);
-  }
-  ~NameList() {
-    if (list_ != nullptr) std::free(list_[0]);
-    std::free(list_);
-  }
-  NameList(const NameList&) = delete;
-  NameList& operator=(const NameList&) = delete;
-
-  [[nodiscard]] bool complete() const noexcept { return list_ != nullptr && list_[0] != nullptr; }
-  [[nodiscard]] char** get() const noexcept { return list_; }
-
- private:
-  char** list_;
-};
-
-}  // namespace
 
 int cfg_read_cfg_entry(_CFG* session, const char* dn, const char* attribute, int scope,
                        _CFGMessage** chain) {

@@ -58,6 +58,25 @@ inline constexpr std::uint32_t xlate_attrs = make(File::add, 26);
 inline constexpr std::uint32_t cleanup_attrs = make(File::add, 27);
 
 inline constexpr std::uint32_t config_back_modify = make(File::modify, 1);
+inline constexpr std::uint32_t check_ip_addrs = make(File::modify, 2);
+inline constexpr std::uint32_t gen_check_ip_addrs_err = make(File::modify, 3);
+inline constexpr std::uint32_t addmodifyop = make(File::modify, 4);
+inline constexpr std::uint32_t mod_entry = make(File::modify, 5);
+inline constexpr std::uint32_t mod_schema_check = make(File::modify, 6);
+inline constexpr std::uint32_t check_if_admin_group_can_modify = make(File::modify, 7);
+inline constexpr std::uint32_t check_root_admin_modify = make(File::modify, 8);
+inline constexpr std::uint32_t check_kerberos_modify = make(File::modify, 9);
+inline constexpr std::uint32_t check_digest_modify = make(File::modify, 10);
+inline constexpr std::uint32_t check_repl_supplier_modify = make(File::modify, 11);
+inline constexpr std::uint32_t check_proxy_name_modify = make(File::modify, 12);
+inline constexpr std::uint32_t does_mod_attribute_exists = make(File::modify, 13);
+inline constexpr std::uint32_t get_mod_attribute = make(File::modify, 14);
+inline constexpr std::uint32_t resolve_path = make(File::modify, 15);
+inline constexpr std::uint32_t get_audit_log_filename = make(File::modify, 16);
+inline constexpr std::uint32_t check_audit_log = make(File::modify, 17);
+inline constexpr std::uint32_t check_admin_policy_entry_modify = make(File::modify, 18);
+inline constexpr std::uint32_t check_admin_policy_modify = make(File::modify, 19);
+inline constexpr std::uint32_t check_pw_encryption_modify = make(File::modify, 20);
 
 inline constexpr std::uint32_t config_back_search = make(File::search, 1);
 inline constexpr std::uint32_t has_search_authority = make(File::search, 2);

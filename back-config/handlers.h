@@ -2,8 +2,8 @@
 //
 // Handlers are called from the server's worker threads, one call for each client operation. Each
 // reads its arguments from the parameter block, sends its own result to the client, and returns the
-// LDAP code of the operation. Search, add, delete and unbind take `configMutex` for as long as they
-// work with a session, and only then; the other handlers take no lock.
+// LDAP code of the operation. Search, add, delete, modify and unbind take `configMutex` for as long
+// as they work with a session, and only then; the other handlers take no lock.
 #pragma once
 
 #include "slapi/pblock.h"
@@ -57,7 +57,12 @@ int config_back_add(pblock* pb);
 // **nothing is sent**, and slot and lock stay as in `config_back_add`.
 int config_back_delete(pblock* pb);
 
-// Not offered: answers 53 (unwilling to perform).
+// Changes an entry of the configuration file (see config_modify.h for the rules). Takes the list of
+// modifications over: it may be rewritten, is released here and its parameter set to null, unless
+// it could not be read. Always answers when connection and operation are known, with a text where a
+// rule has one. When the session cannot be opened, slot and lock stay as in `config_back_add`. What
+// was made of the list for the file **is not released after a refusal or a failure** that comes
+// later than authority: the server bounds what one caller can so take.
 int config_back_modify(pblock* pb);
 
 }  // namespace orv

@@ -4,9 +4,15 @@
 #include <openssl/evp.h>
 #include <openssl/rand.h>
 
+#ifdef ORV_HAS_CRYPT
+#include <crypt.h>
+#endif
+
 #include <array>
 #include <atomic>
+#include <cerrno>
 #include <cstdint>
+#include <cstdlib>
 #include <memory>
 #include <utility>
 
@@ -210,8 +216,10 @@ struct SaltedScheme {
   std::string_view name;
   const EVP_MD* (*type)();
 };
-constexpr SaltedScheme kSaltedSchemes[] = {
-    {"SSHA512", &EVP_sha512}, {"SSHA256", &EVP_sha256}, {"SSHA", &EVP_sha1}};
+constexpr SaltedScheme kSaltedSchemes[] = {{"SSHA512", &EVP_sha512},
+                                           {"SSHA384", &EVP_sha384},
+                                           {"SSHA256", &EVP_sha256},
+                                           {"SSHA", &EVP_sha1}};
 
 bool verify_salted(const EVP_MD* type, std::string_view encoded, std::string_view clear) {
   std::string stored;
@@ -269,6 +277,69 @@ bool verify_pbkdf2(const EVP_MD* type, std::string_view rest, std::string_view c
   return CRYPTO_memcmp(made.data(), hash.data(), hash.size()) == 0;
 }
 
+// ---- crypt(3) ----
+
+constexpr std::string_view kCryptScheme = "CRYPT";
+
+#ifdef ORV_HAS_CRYPT
+
+struct CryptDeleter {
+  void operator()(crypt_data* data) const noexcept {
+    wipe(data, sizeof *data);
+    std::free(data);
+  }
+};
+
+// The text that crypt(3) makes of a password by a setting (a method with its salt, or a text made
+// before). 0; 90; 53 the platform does not know the setting; 19 a password it cannot take.
+int run_crypt(const std::string& clear, const std::string& setting, std::string& made) {
+  if (clear.size() >= CRYPT_MAX_PASSPHRASE_SIZE || clear.find('\0') != std::string::npos)
+    return result::constraint_violation;
+  const std::unique_ptr<crypt_data, CryptDeleter> data(
+      static_cast<crypt_data*>(std::calloc(1, sizeof(crypt_data))));
+  if (data == nullptr) return result::no_memory;
+  errno = 0;
+  const char* const text = crypt_r(clear.c_str(), setting.c_str(), data.get());
+  // What begins with "*" stands for a failure.
+  if (text == nullptr || *text == '*')
+    return errno == ENOMEM ? result::no_memory : result::unwilling_to_perform;
+  made = text;
+  return result::success;
+}
+
+int make_crypt(std::string_view clear, std::string& stored) {
+  char setting[CRYPT_GENSALT_OUTPUT_SIZE] = "";
+  // The platform's best method, its usual cost, random bytes of its own.
+  if (crypt_gensalt_rn(nullptr, 0, nullptr, 0, setting, sizeof setting) == nullptr)
+    return errno == ENOMEM ? result::no_memory : result::unwilling_to_perform;
+  std::string password(clear);
+  const WipeAtEnd wiped(password);
+  std::string made;
+  const int rc = run_crypt(password, setting, made);
+  if (rc == result::success) stored = "{CRYPT}" + made;
+  return rc;
+}
+
+bool verify_crypt(std::string_view stored, std::string_view clear) {
+  std::string password(clear);
+  const WipeAtEnd wiped(password);
+  std::string made;
+  return run_crypt(password, std::string(stored), made) == result::success &&
+         made.size() == stored.size() &&
+         CRYPTO_memcmp(made.data(), stored.data(), made.size()) == 0;
+}
+
+#else
+
+int make_crypt(std::string_view, std::string&) {
+  return result::unwilling_to_perform;
+}
+bool verify_crypt(std::string_view, std::string_view) {
+  return false;
+}
+
+#endif
+
 bool verify_scheme(const Key* key, SecretPlace place, std::string_view scheme,
                    std::string_view rest, std::string_view clear) {
   if (equals_ignore_ascii_case(scheme, kSealedScheme)) {
@@ -284,7 +355,56 @@ bool verify_scheme(const Key* key, SecretPlace place, std::string_view scheme,
       return verify_pbkdf2(known.type(), rest, clear);
     }
   }
-  return false;
+  return equals_ignore_ascii_case(scheme, kCryptScheme) && verify_crypt(rest, clear);
+}
+
+// ---- Making ----
+
+constexpr std::size_t kSaltLength = 16;
+
+bool make_salt(std::string& salt) {
+  salt.assign(kSaltLength, '\0');
+  return RAND_bytes(bytes_of(salt), static_cast<int>(salt.size())) == 1;
+}
+
+int make_salted(const SaltedScheme& scheme, std::string_view clear, std::string& stored) {
+  std::string salt;
+  std::string encoded;
+  Digest made;
+  if (!make_salt(salt) || !digest(scheme.type(), clear, salt, made)) return result::no_memory;
+  const std::string bytes(made.bytes.begin(), made.bytes.begin() + made.length);
+  if (base64_encode(bytes + salt, encoded) != result::success) return result::no_memory;
+  stored = "{" + std::string(scheme.name) + "}" + encoded;
+  return result::success;
+}
+
+bool encode_unpadded(std::string_view bytes, std::string& text) {
+  if (base64_encode(bytes, text) != result::success) return false;
+  while (text.ends_with('=')) text.pop_back();
+  return true;
+}
+
+int make_pbkdf2(const SaltedScheme& scheme, int iterations, std::string_view clear,
+                std::string& stored) {
+  if (clear.size() > INT32_MAX) return result::constraint_violation;
+  std::string salt;
+  std::string salt_text;
+  std::string hash_text;
+  std::array<unsigned char, EVP_MAX_MD_SIZE> made{};
+  const EVP_MD* const type = scheme.type();
+  const int length = EVP_MD_get_size(type);
+  if (!make_salt(salt) || PKCS5_PBKDF2_HMAC(clear.data(), static_cast<int>(clear.size()),
+                                            bytes_of(salt), static_cast<int>(salt.size()),
+                                            iterations, type, length, made.data()) != 1) {
+    return result::no_memory;
+  }
+  const std::string hash(made.begin(), made.begin() + length);
+  if (!encode_unpadded(salt, salt_text) || !encode_unpadded(hash, hash_text)) {
+    return result::no_memory;
+  }
+  stored = "{" + std::string(scheme.name) + "}" + std::to_string(iterations) + "$" + salt_text +
+           "$" + hash_text;
+  return result::success;
 }
 
 }  // namespace
@@ -344,22 +464,42 @@ void verify_nothing(std::string_view clear) noexcept try {
 } catch (...) {
 }
 
-int hash_secret(std::string_view clear, std::string& stored) noexcept try {
-  std::string salt(16, '\0');
-  Digest made;
-  if (RAND_bytes(bytes_of(salt), static_cast<int>(salt.size())) != 1 ||
-      !digest(EVP_sha512(), clear, salt, made)) {
-    return result::no_memory;
+int make_secret(SecretMethod method, std::string_view clear, std::string& stored) noexcept try {
+  switch (method) {
+    case SecretMethod::ssha256:
+      return make_salted({"SSHA256", &EVP_sha256}, clear, stored);
+    case SecretMethod::ssha384:
+      return make_salted({"SSHA384", &EVP_sha384}, clear, stored);
+    case SecretMethod::ssha512:
+      return make_salted({"SSHA512", &EVP_sha512}, clear, stored);
+    case SecretMethod::pbkdf2_sha256:
+      return make_pbkdf2({"PBKDF2-SHA256", &EVP_sha256}, 600'000, clear, stored);
+    case SecretMethod::pbkdf2_sha512:
+      return make_pbkdf2({"PBKDF2-SHA512", &EVP_sha512}, 210'000, clear, stored);
+    case SecretMethod::crypt:
+      return make_crypt(clear, stored);
+    case SecretMethod::clear:
+      stored = clear;
+      return result::success;
+    case SecretMethod::sealed:
+      break;
   }
-  std::string bytes(made.bytes.begin(), made.bytes.begin() + made.length);
-  std::string encoded;
-  if (base64_encode(bytes + salt, encoded) != result::success) return result::no_memory;
-  std::string text = "{SSHA512}";
-  text += encoded;
-  stored = std::move(text);
-  return result::success;
+  return result::unwilling_to_perform;
 } catch (...) {
   return result::no_memory;
+}
+
+int hash_secret(std::string_view clear, std::string& stored) noexcept {
+  return make_secret(SecretMethod::ssha512, clear, stored);
+}
+
+bool can_make_secret(SecretMethod method) noexcept {
+#ifdef ORV_HAS_CRYPT
+  static_cast<void>(method);
+  return true;
+#else
+  return method != SecretMethod::crypt;
+#endif
 }
 
 // ---- Protecting ----
@@ -380,8 +520,9 @@ SecretMethod secret_method() noexcept {
 
 int protect_secret(const Key* key, SecretPlace place, std::string_view clear,
                    std::string& stored) noexcept {
-  if (key == nullptr || secret_method() == SecretMethod::hashed) return hash_secret(clear, stored);
-  return seal_secret(*key, place, clear, stored);
+  const SecretMethod method = secret_method();
+  if (method != SecretMethod::sealed) return make_secret(method, clear, stored);
+  return key == nullptr ? hash_secret(clear, stored) : seal_secret(*key, place, clear, stored);
 }
 
 bool names_scheme(std::string_view value) noexcept {

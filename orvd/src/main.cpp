@@ -24,6 +24,7 @@
 #include "cfg/diagnostics.h"
 #include "cfg/object_class_table.h"
 #include "cfg/result_codes.h"
+#include "directory_backend.h"
 #include "file_report.h"
 #include "logs.h"
 #include "ops/persistent_search.h"
@@ -33,6 +34,8 @@
 #include "publish/subschema.h"
 #include "server.h"
 #include "settings.h"
+#include "slapi/administrators.h"
+#include "slapi/backends.h"
 #include "slapi/codepage.h"
 #include "slapi/control.h"
 #include "slapi/globals.h"
@@ -96,7 +99,9 @@ class StoredIdentities final : public Authenticator {
                                                std::string_view password) override {
     const std::shared_ptr<const Identities> identities = store_.current();
     if (!identities) return nullptr;
-    const Identity* const found = identities->authenticate(name, password);
+    const Identity* found = identities->authenticate(name, password);
+    if (!settle_administrator_bind(name, found != nullptr, std::chrono::steady_clock::now()))
+      found = nullptr;
     if (!found && identities->claimed_twice(name)) tell_of_claim(name);
     if (!found) return nullptr;
     return {identities, found};  // the snapshot lives as long as somebody is bound by it
@@ -132,24 +137,45 @@ class StoredIdentities final : public Authenticator {
   std::atomic<std::uint64_t> told_{0};
 };
 
-// ---- the password policy
+// ---- what the rules know
+
+// Reads one of the things that the rules go by, which stays as it was when that fails.
+struct Renewal {
+  const char* what;
+  int (*renew)(const std::string& config_file, const std::string& key_stash_file,
+               std::string& error);
+};
+constexpr Renewal kPolicy{"the password policy", renew_password_policy};
+constexpr Renewal kMethods{"the method of storing passwords", renew_password_methods};
+constexpr Renewal kAdministrators{"the administrators", renew_administrators};
 
 // One at a time, so that what was read before a change never comes after what was read behind it.
-void renew_policy(const Options& options, Logs& logs) noexcept {
+void renew(const Renewal& renewal, const Options& options, Logs& logs) noexcept {
   static std::mutex renewing;
   try {
     const std::lock_guard lock(renewing);
     std::string error;
-    const int code = renew_password_policy(options.config_file, options.key_stash_file, error);
+    const int code = renewal.renew(options.config_file, options.key_stash_file, error);
     if (code == result::success) return;
-    if (code == result::no_such_object)
-      error = "the configuration file has no policy entry";
-    else if (error.empty())
-      error = "result " + std::to_string(code);
-    logs.warning("the password policy stays as it was: " + error);
+    if (error.empty()) error = "result " + std::to_string(code);
+    if (code == result::no_such_object) error = "the configuration file has no entry for it";
+    logs.warning(std::string(renewal.what) + " stays as it was: " + error);
   } catch (...) {
-    logs.error("the password policy stays as it was: out of memory");
+    logs.error(renewal.what);
+    logs.error("could not be read: out of memory");
   }
+}
+
+void renew_all(const Options& options, Logs& logs) noexcept {
+  for (const Renewal& renewal : {kAdministrators, kPolicy, kMethods}) renew(renewal, options, logs);
+}
+
+void take_over(const Consequences& consequences, StoredIdentities& identities,
+               const Options& options, Logs& logs) noexcept {
+  if (consequences.identities) identities.refresh();
+  if (consequences.identities) renew(kAdministrators, options, logs);
+  if (consequences.policy) renew(kPolicy, options, logs);
+  if (consequences.methods) renew(kMethods, options, logs);
 }
 
 // ---- the process
@@ -264,6 +290,10 @@ bool start_backend(const Options& options, BackendPlace& place) {
     std::fprintf(stderr, "orvd: the backend does not start: result %d\n", code);
     return false;
   }
+  if (register_backend(&backend) != result::success) {
+    std::fprintf(stderr, "orvd: the backend cannot be registered\n");
+    return false;
+  }
   return true;
 }
 
@@ -280,6 +310,7 @@ Publications publications() {
   ServerFacts facts;
   facts.naming_contexts = {"cn=configuration"};
   facts.supported_features = {"1.3.6.1.4.1.4203.1.5.1"};  // all operational attributes, RFC 3673
+  facts.restart_settings = restart_settings();
   facts.vendor_name = "orv";
   facts.vendor_version = ORV_VERSION;
   // The schema does not change while the server runs, and making the entry costs more than a
@@ -316,7 +347,7 @@ int serve(const Options& options, const Settings& settings, Logs& logs, AuditLog
                      logs.error("settings not taken over: " + error);
                      return false;
                    }
-                   renew_policy(options, logs);
+                   renew_all(options, logs);
                    open_audit_log(options, wanted, logs, audit);
                    report(logs, logs.open(wanted));
                    configfile_read.fetch_add(1, std::memory_order_relaxed);
@@ -325,8 +356,7 @@ int serve(const Options& options, const Settings& settings, Logs& logs, AuditLog
                  },
                  [&broken_file] { broken_file.note_failure(); }, &audit,
                  [&](const Consequences& consequences) {
-                   if (consequences.identities) identities.refresh();
-                   if (consequences.policy) renew_policy(options, logs);
+                   take_over(consequences, identities, options, logs);
                  },
                  options.guards});
   std::string error;
@@ -368,7 +398,8 @@ int run(const Options& options) {
     if (!identities.reload(error)) {
       std::fprintf(stderr, "orvd: %s\n", error.c_str());
     } else if (start_backend(options, place)) {
-      renew_policy(options, logs);
+      const DirectoryBackend directory;
+      renew_all(options, logs);
       for (const std::string& doubt :
            doubts_about_file(options.config_file, options.key_stash_file))
         logs.warning(doubt);

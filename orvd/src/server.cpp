@@ -62,10 +62,8 @@ Server::Server(ServerParts parts)
   services_.note_failure = parts_.note_failure;
   services_.audit = parts_.audit;
   services_.guards = parts_.guards;
-  services_.take_over = [this](const Consequences& consequences) {
-    if (parts_.take_over) parts_.take_over(consequences);
-    if (consequences.settings) reload_soon();
-  };
+  services_.take_over = parts_.take_over;
+  services_.renew_settings = [this] { renew_settings(); };
   for (unsigned i = 0; i < std::max(1U, parts_.loops); ++i)
     loops_.push_back(std::make_unique<Loop>(parts_.logs, settings_));
 }
@@ -162,15 +160,8 @@ void Server::wind_up() {
   parts_.logs.info("stopped");
 }
 
-void Server::reload_soon() noexcept {
-  try {
-    asio::post(control_, [this] { reload(); });
-  } catch (...) {
-    parts_.logs.error("settings not taken over: out of memory");
-  }
-}
-
 void Server::reload() {
+  const std::lock_guard lock(reloading_);
   Settings wanted;
   if (!parts_.reload || !parts_.reload(wanted)) return;
   for (const std::string_view name : restart_needed(*settings_, wanted))
@@ -179,8 +170,18 @@ void Server::reload() {
   wanted.port = settings_->port;
   wanted.addresses = settings_->addresses;
   settings_ = std::make_shared<const Settings>(std::move(wanted));
-  listeners_.renew(settings_);
   for (const auto& loop : loops_) loop->renew(settings_);
+  asio::post(control_, [this, settings = settings_] { listeners_.renew(settings); });
+}
+
+// After a change over LDAP, which stays whatever becomes of this.
+void Server::renew_settings() noexcept {
+  try {
+    reload();
+  } catch (const std::exception& error) {
+    parts_.logs.error("settings not taken over:");
+    parts_.logs.error(error.what());
+  }
 }
 
 }  // namespace orv::server

@@ -11,6 +11,7 @@
 #include <asio/steady_timer.hpp>
 #include <functional>
 #include <memory>
+#include <mutex>
 #include <string>
 #include <vector>
 
@@ -67,15 +68,16 @@ class Server {
   // Ends serve(). Any thread.
   void stop();
 
-  // Reads the settings again and takes them over. On the control thread.
+  // Reads the settings again and takes them over. When it returns they are in force for what is
+  // posted to the loops from then on. Any thread but those of the loops; one at a time, others
+  // wait.
   void reload();
-  // The same, later. Any thread.
-  void reload_soon() noexcept;
 
   BackendHost& backend() noexcept { return backend_; }
   std::int64_t connections() const { return counter_.count(); }
 
  private:
+  void renew_settings() noexcept;
   void control();
   void watch_gate();
   void wind_up();
@@ -89,7 +91,8 @@ class Server {
   BackendHost backend_;
   Services services_;
   ConnectionCounter counter_;
-  std::shared_ptr<const Settings> settings_;
+  std::mutex reloading_;
+  std::shared_ptr<const Settings> settings_;  // guarded by `reloading_` once the server serves
   std::vector<std::unique_ptr<Loop>> loops_;
   // After the loops: work that was never done goes with the pools and holds connections.
   asio::thread_pool changes_;

@@ -8,6 +8,8 @@
 #include "cfg/session.h"
 #include "cfg/text.h"
 #include "config/setting_ranges.h"
+#include "slapi/administrators.h"
+#include "slapi/password_method.h"
 #include "slapi/services.h"
 
 namespace orv::server {
@@ -43,6 +45,7 @@ constexpr SettingRow kRows[] = {
         &Settings::max_persistent_searches_per_connection),
 };
 
+constexpr const char* kAddresses = "orv-slapdIpAddress";
 constexpr const char* kConfiguration = "CN=CONFIGURATION";
 constexpr const char* kErrorLogEntry = "CN=DEFAULT,CN=LOG MANAGEMENT,CN=CONFIGURATION";
 constexpr const char* kAccessLogEntry = "CN=ACCESS,CN=LOG MANAGEMENT,CN=CONFIGURATION";
@@ -166,6 +169,18 @@ int renew_password_policy(const std::string& config_file, const std::string& key
   return session ? load_admin_password_policy(session.get()) : result::operations_error;
 }
 
+int renew_administrators(const std::string& config_file, const std::string& key_stash_file,
+                         std::string& error) {
+  const CfgSession session = open_session(config_file, key_stash_file, error);
+  return session ? load_administrators(session.get()) : result::operations_error;
+}
+
+int renew_password_methods(const std::string& config_file, const std::string& key_stash_file,
+                           std::string& error) {
+  const CfgSession session = open_session(config_file, key_stash_file, error);
+  return session ? load_password_methods(session.get()) : result::operations_error;
+}
+
 bool read_settings(const std::string& config_file, const std::string& key_stash_file,
                    Settings& settings, std::string& error) {
   const CfgSession session = open_session(config_file, key_stash_file, error);
@@ -176,7 +191,7 @@ bool read_settings(const std::string& config_file, const std::string& key_stash_
     return false;
   }
   Settings read;
-  read.addresses = top.values("orv-slapdIpAddress");
+  read.addresses = top.values(kAddresses);
   if (read_integers(top, read, error) &&
       read_log(session.get(), kErrorLogEntry, read.error_log, read.error_log_level, error) &&
       read_log(session.get(), kAccessLogEntry, read.access_log, read.access_log_level, error) &&
@@ -188,11 +203,19 @@ bool read_settings(const std::string& config_file, const std::string& key_stash_
   return false;
 }
 
+std::vector<std::string> restart_settings() {
+  std::vector<std::string> names;
+  for (const SettingRow& row : setting_rows())
+    if (row.needs_restart) names.emplace_back(row.name);
+  names.emplace_back(kAddresses);
+  return names;
+}
+
 std::vector<std::string_view> restart_needed(const Settings& running, const Settings& wanted) {
   std::vector<std::string_view> names;
   for (const SettingRow& row : setting_rows())
     if (row.needs_restart && running.*row.member != wanted.*row.member) names.push_back(row.name);
-  if (running.addresses != wanted.addresses) names.push_back("orv-slapdIpAddress");
+  if (running.addresses != wanted.addresses) names.push_back(kAddresses);
   return names;
 }
 

@@ -67,6 +67,9 @@ bool read_settings(const std::string& config_file, const std::string& key_stash_
 bool can_open(const std::string& config_file, const std::string& key_stash_file,
               std::string& cause);
 
+// The settings that are read when the server starts and not again, by attribute name.
+std::vector<std::string> restart_settings();
+
 // The settings that a reload cannot change while the server runs and in which the two differ, by
 // attribute name.
 std::vector<std::string_view> restart_needed(const Settings& running, const Settings& wanted);
@@ -76,5 +79,12 @@ std::vector<std::string_view> restart_needed(const Settings& running, const Sett
 // cause in `error`. After anything but 0 the policy stays as it was.
 int renew_password_policy(const std::string& config_file, const std::string& key_stash_file,
                           std::string& error);
+
+// The same for what the library of the rules knows: who administers and supplies, with their
+// failures (slapi/administrators.h), and how passwords are stored (slapi/password_method.h).
+int renew_administrators(const std::string& config_file, const std::string& key_stash_file,
+                         std::string& error);
+int renew_password_methods(const std::string& config_file, const std::string& key_stash_file,
+                           std::string& error);
 
 }  // namespace orv::server

@@ -75,6 +75,10 @@ constexpr std::array kMessages{
     Message{10, 8, 1,
             "The password policy in the configuration file is not put in force: %s. The one "
             "before stays."},
+    Message{10, 9, 1,
+            "The password method in the configuration file is not put in force: %s. The one "
+            "before stays."},
+    Message{10, 10, 2, "'%s' is locked out after %s failed binds."},
 };
 
 const Message* find_message(int set, int number) noexcept {

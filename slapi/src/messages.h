@@ -31,5 +31,9 @@ inline constexpr int too_few_new = 6;
 inline constexpr int password_is_old = 7;
 // The policy that stands in the file is not put in force. The argument is the reason.
 inline constexpr int policy_refused = 8;
+// The password method that stands in the file is not put in force. The argument is the reason.
+inline constexpr int method_refused = 9;
+// An identity is locked out. The second argument is the number of failed binds.
+inline constexpr int locked_out = 10;
 
 }  // namespace orv::message

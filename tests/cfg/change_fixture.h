@@ -4,7 +4,6 @@
 #include <fstream>
 #include <iterator>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <utility>
 #include <vector>
@@ -107,19 +106,14 @@ class ChangeTest : public CfgTest {
  protected:
   using CfgTest::CfgTest;
 
-  // Reasons of refusals go to `told`, for the length of a test; from any thread, to be read when
-  // the threads have ended.
+  // Reasons of refusals go to `told`, for the length of a test.
   void SetUp() override {
     CfgTest::SetUp();
     told.clear();
-    cfg::set_diagnostics_sink([](const char* line) noexcept {
-      const std::lock_guard lock(told_mutex);
-      (told += line) += '\n';
-    });
+    cfg::set_diagnostics_sink([](const char* line) noexcept { (told += line) += '\n'; });
   }
   void TearDown() override { cfg::set_diagnostics_sink(nullptr); }
   inline static std::string told;
-  inline static std::mutex told_mutex;
 
   // A handle with the paths of file and save file set.
   CfgSession unbound_with_save() {

@@ -209,6 +209,27 @@ TEST_F(SecretTest, Pbkdf2ValuesVerify) {
                              "secret"));
 }
 
+TEST_F(SecretTest, TextsOfCryptVerify) {
+  if (!can_make_secret(SecretMethod::crypt)) GTEST_SKIP() << "the platform has none";
+  std::string stored;
+  ASSERT_EQ(make_secret(SecretMethod::crypt, "secret", stored), 0);
+  const SecretPlace place{"orv-slapdAdminPW", "CN=A"};
+  EXPECT_TRUE(verify_secret(nullptr, place, stored, "secret"));
+  EXPECT_TRUE(verify_secret(nullptr, place, "{crypt}" + stored.substr(7), "secret"));
+  EXPECT_FALSE(verify_secret(nullptr, place, stored, "secret "));
+  EXPECT_FALSE(verify_secret(nullptr, place, stored, std::string("secret\0", 7)));
+  for (const char* broken : {"{CRYPT}", "{CRYPT}*0", "{CRYPT}x", "{CRYPT}$none$x"})
+    EXPECT_FALSE(verify_secret(nullptr, place, broken, "secret")) << broken;
+  EXPECT_EQ(make_secret(SecretMethod::crypt, std::string(511, 'x'), stored), 0);
+  EXPECT_EQ(make_secret(SecretMethod::crypt, std::string(512, 'x'), stored), 19);
+}
+
+TEST_F(SecretTest, ASealedValueIsNotMadeWithoutAKey) {
+  std::string stored = "kept";
+  EXPECT_EQ(make_secret(SecretMethod::sealed, "secret", stored), 53);
+  EXPECT_EQ(stored, "kept");
+}
+
 TEST_F(SecretTest, MalformedValuesNeverMatch) {
   const std::string hash(22, 'A');
   for (const std::string& stored :

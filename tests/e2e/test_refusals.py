@@ -39,14 +39,6 @@ OPERATIONS = {
 }
 
 
-def test_modify_is_refused_with_53_and_changes_nothing(shared, admin):
-    before = shared.config.read()
-    with pytest.raises(ldap.UNWILLING_TO_PERFORM):
-        OPERATIONS["modify"](admin)
-    assert shared.config.read() == before
-    assert clients.BASE in clients.search(admin, scope=ldap.SCOPE_BASE)
-
-
 @pytest.mark.parametrize("operation", OPERATIONS)
 def test_change_by_the_anonymous_is_refused_with_50(shared, stranger, operation):
     before = shared.config.read()

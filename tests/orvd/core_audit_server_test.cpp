@@ -102,5 +102,45 @@ TEST_F(AuditedServer, RecordsNothingThatChangesNothing) {
   EXPECT_EQ(records().find("dn:"), std::string::npos);
 }
 
+// A modify of one attribute: a delete of "old", then an add of "new".
+std::string delete_and_add(int id) {
+  using test::tlv;
+  const auto change = [](std::string_view code, std::string_view value) {
+    return tlv(0x30,
+               tlv(0x0A, code) + tlv(0x30, tlv(0x04, "description") + tlv(0x31, tlv(0x04, value))));
+  };
+  const std::string list = change("\x01", "old") + change(std::string_view("\0", 1), "new");
+  return test::message(id, tlv(0x66, tlv(0x04, test::kTop) + tlv(0x30, list)));
+}
+
+TEST_F(AuditedServer, RecordsModificationsAsTheClientSentThem) {
+  backend.on_change = [](pblock*) { return 0; };
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  client.send(delete_and_add(2));
+  ASSERT_FALSE(client.receive_result().empty());
+  EXPECT_NE(records().find("delete: description\ndescription: old\n-\n"
+                           "add: description\ndescription: new\n-\n"),
+            std::string::npos);
+}
+
+TEST_F(AuditedServer, ChangeThatEndsTheLogIsStillRecordedInIt) {
+  backend.on_change = [](pblock* parameters) {
+    send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 0, nullptr,
+                     "");
+    return 0;
+  };
+  reload = [this](Settings&) {
+    log.open("", {});
+    return false;
+  };
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  ASSERT_EQ(code_of(client, delete_and_add(2)), 0);
+  EXPECT_NE(records().find("# operation: modify\n# result: 0\n"), std::string::npos);
+}
+
 }  // namespace
 }  // namespace orv::server

@@ -20,9 +20,9 @@ class Canonical : public testing::Test {
     EntryPtr made;
     return make_entry(schema, request, made).code;
   }
-  int modify_code(const ModifyRequest& request) {
+  int modify_code(const ModifyRequest& request, ListForm form = ListForm::folded) {
     ldapmod* first = nullptr;
-    const int code = make_modifications(schema, request, first).code;
+    const int code = make_modifications(schema, request, form, first).code;
     free_modifications(first);
     return code;
   }
@@ -130,7 +130,7 @@ TEST_F(Canonical, ModificationsKeepTheClientsOrderAndHaveCountedValues) {
   ldapmod* first = nullptr;
   const ModifyRequest request{"cn=configuration",
                               {{2, {"ORV-SLAPDPORT", {"389"}}}, {1, {"description", {}}}}};
-  ASSERT_EQ(make_modifications(schema, request, first).code, 0);
+  ASSERT_EQ(make_modifications(schema, request, ListForm::folded, first).code, 0);
   EXPECT_EQ(first->mod_op, kModReplace | kModBvalues);
   EXPECT_STREQ(first->mod_type, "orv-slapdPort");
   EXPECT_STREQ(first->mod_vals.modv_bvals[0]->bv_val, "389");
@@ -141,6 +141,38 @@ TEST_F(Canonical, ModificationsKeepTheClientsOrderAndHaveCountedValues) {
   EXPECT_EQ(first->mod_next->mod_vals.modv_bvals, nullptr);  // no values: no array
   EXPECT_EQ(first->mod_next->mod_next, nullptr);
   free_modifications(first);
+}
+
+TEST_F(Canonical, ModificationsAreHandedOverFoldedOrAsTheyCame) {
+  const ModifyRequest request{"cn=configuration",
+                              {{1, {"description", {"a"}}}, {0, {"2.5.4.13", {"b"}}}}};
+  ldapmod* first = nullptr;
+  ASSERT_EQ(make_modifications(schema, request, ListForm::folded, first).code, 0);
+  EXPECT_EQ(first->operation(), kModAdd);
+  EXPECT_STREQ(first->mod_vals.modv_bvals[0]->bv_val, "b");
+  ASSERT_NE(first->mod_next, nullptr);
+  EXPECT_EQ(first->mod_next->operation(), kModDelete);
+  free_modifications(first);
+  first = nullptr;
+  ASSERT_EQ(make_modifications(schema, request, ListForm::as_sent, first).code, 0);
+  EXPECT_EQ(first->operation(), kModDelete);
+  EXPECT_STREQ(first->mod_type, "description");
+  ASSERT_NE(first->mod_next, nullptr);
+  EXPECT_EQ(first->mod_next->operation(), kModAdd);
+  EXPECT_STREQ(first->mod_next->mod_type, "description");
+  free_modifications(first);
+}
+
+TEST_F(Canonical, ListsThatCannotBeFoldedAreRefusedUnlessTheyGoAsTheyCame) {
+  const ModifyRequest late{"cn=x", {{0, {"description", {"a"}}}, {2, {"description", {"b"}}}}};
+  EXPECT_EQ(modify_code(late), 53);
+  EXPECT_EQ(modify_code(late, ListForm::as_sent), 0);
+}
+
+TEST_F(Canonical, ModificationsOfClassesAndNamesAreRefused) {
+  EXPECT_EQ(modify_code({"cn=x", {{2, {"2.5.4.0", {"top"}}}}}), 69);
+  EXPECT_EQ(modify_code({"cn=x,cn=configuration", {{1, {"cn", {"X"}}}}}), 67);
+  EXPECT_EQ(modify_code({"2.5.4.3=x,cn=configuration", {{2, {"commonName", {"y"}}}}}), 67);
 }
 
 TEST_F(Canonical, ModificationsAreRefusedForWhatTheBackendMustNotSee) {

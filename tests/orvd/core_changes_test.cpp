@@ -103,6 +103,13 @@ TEST(Consequences, OfDeletingEntriesThatDefineSomebody) {
   EXPECT_FALSE(consequences_of_change("CN=X,CN=CONFIGURATION", identities).any());
 }
 
+TEST(Consequences, OfEntriesThatSayHowPasswordsAreStored) {
+  const OneIdentity identities;
+  EXPECT_TRUE(consequences_of_change("CN=CONFIGURATION", identities).methods);
+  EXPECT_TRUE(consequences_of_change("CN=ADMINGROUP,CN=CONFIGURATION", identities).methods);
+  EXPECT_FALSE(consequences_of_change("CN=X,CN=ADMINGROUP,CN=CONFIGURATION", identities).methods);
+}
+
 TEST(Consequences, OfEntriesThatHoldSettings) {
   const OneIdentity identities;
   EXPECT_TRUE(consequences_of_change(kPolicy, identities).policy);

@@ -4,7 +4,6 @@
 #include <gtest/gtest.h>
 
 #include <string>
-#include <thread>
 #include <vector>
 
 #include "cfg/attribute_table.h"
@@ -419,37 +418,6 @@ TEST_F(PersistentWire, ABindEndsItAndIsAnswered) {
   EXPECT_EQ(code_of(listener, test::bind(9, test::kRoot, test::kSecret)), 0);
   listener.send(test::search(7, test::kTop));
   EXPECT_EQ(listener.receive_result().back().code, 0) << "its message id is free again";
-}
-
-// A bind that is answered at once, when the end of the last search leaves nothing outstanding.
-TEST_F(PersistentWire, ABindEndsItAlsoWhileANoticeWaitsForItsTurn) {
-  test::Event first_goes_on;
-  test::Event second_goes_on;
-  std::atomic<int> changes{0};
-  backend.on_change = [&](pblock* parameters) {
-    (changes.fetch_add(1) == 0 ? first_goes_on : second_goes_on).wait();
-    send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 0, nullptr,
-                     "");
-    return 0;
-  };
-  start();
-  WireClient listener(port());
-  WireClient one(port());
-  WireClient two(port());
-  for (WireClient* const client : {&listener, &one, &two}) bind_as_root(*client);
-  listener.send(persistent_search(7));
-  ASSERT_TRUE(taken(listener, 8));
-
-  one.send(test::add_entry(2, kMember, "cn", "x"));
-  while (changes.load() == 0) std::this_thread::yield();
-  two.send(test::add_entry(2, kMember, "cn", "x"));
-  ASSERT_TRUE(wait_for_waiters(1)) << "the second add waits";
-  first_goes_on.happen();
-  while (changes.load() == 1) std::this_thread::yield();
-  ASSERT_TRUE(wait_for_waiters(1)) << "the notice waits behind the second add";
-  EXPECT_EQ(code_of(listener, test::bind(9, "", "")), 0);
-  second_goes_on.happen();
-  EXPECT_TRUE(taken(listener, 10));
 }
 
 TEST_F(PersistentWire, TheBoundsHold) {

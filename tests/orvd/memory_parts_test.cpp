@@ -3,7 +3,6 @@
 // again. A program of its own, because it replaces the allocation functions of the process.
 #include <gtest/gtest.h>
 
-#include <chrono>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
@@ -158,10 +157,12 @@ TEST_F(MemoryOfARequest, EntryIsMadeOrMemoryIsSaidToBeShort) {
 
 TEST_F(MemoryOfARequest, ModificationsAreMadeOrMemoryIsSaidToBeShort) {
   const ModifyRequest request{"cn=configuration",
-                              {{0, {"description", {"one", "two"}}}, {1, {"cn", {}}}}};
+                              {{0, {"description", {"one", "two"}}},
+                               {1, {"description", {"a third one"}}},
+                               {1, {"orv-slapdPort", {}}}}};
   expect_throws([&] {
     ldapmod* first = nullptr;
-    const bool good = make_modifications(schema, request, first).code == 0;
+    const bool good = make_modifications(schema, request, ListForm::folded, first).code == 0;
     free_modifications(first);
     return good;
   });
@@ -212,34 +213,6 @@ TEST_F(MemoryOfABind, WantOfItIsNoWrongPassword) {
     return identities->authenticate("CN = A name that is not short", "a password that is not short",
                                     compare) != nullptr;
   });
-}
-
-// The file is good, so nothing about it will change when there is memory again.
-TEST_F(MemoryOfABind, WantOfItWhileTheFileIsReadIsMadeGoodAfterAPauseAndToldOnce) {
-  int told = 0;
-  IdentityStore store(config(), "", [&](const std::string&, const auto&) { ++told; });
-  ASSERT_TRUE(store.reload(error_, warnings_)) << error_;
-  const auto generation = store.generation();
-  std::filesystem::last_write_time(config(), std::filesystem::file_time_type::clock::now());
-  store.read_again_after(std::chrono::hours(1));
-  {
-    const AllocationFault fault(1);
-    store.current();
-  }
-  store.current();
-  EXPECT_EQ(store.generation(), generation);
-  EXPECT_EQ(told, 1);
-
-  store.read_again_after(std::chrono::hours(0));
-  bool read = true;
-  {
-    const AllocationFault fault(1);
-    read = store.reload(error_, warnings_);
-  }
-  EXPECT_FALSE(read);
-  store.current();
-  EXPECT_GT(store.generation(), generation);
-  EXPECT_EQ(told, 1);
 }
 
 // ---- the session

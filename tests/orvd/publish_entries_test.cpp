@@ -46,6 +46,7 @@ ServerFacts facts() {
   f.naming_contexts = {"cn=configuration"};
   f.supported_extensions = {"1.3.6.1.4.1.4203.1.11.3"};
   f.supported_features = {"1.3.6.1.4.1.4203.1.5.1"};
+  f.restart_settings = {"orv-slapdPort"};
   f.vendor_name = "orv";
   f.vendor_version = "0.1.0";
   return f;
@@ -66,6 +67,7 @@ TEST(RootDse, TellsWhatTheServerIs) {
   EXPECT_THAT(values_of(e, "supportedExtension"), ElementsAre("1.3.6.1.4.1.4203.1.11.3"));
   EXPECT_THAT(values_of(e, "supportedFeatures"), ElementsAre("1.3.6.1.4.1.4203.1.5.1"));
   EXPECT_THAT(values_of(e, "supportedLDAPVersion"), ElementsAre("3"));
+  EXPECT_THAT(values_of(e, "orv-restartSettings"), ElementsAre("orv-slapdPort"));
   EXPECT_THAT(values_of(e, "vendorName"), ElementsAre("orv"));
   EXPECT_THAT(values_of(e, "vendorVersion"), ElementsAre("0.1.0"));
 }

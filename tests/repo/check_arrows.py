@@ -25,7 +25,7 @@ sys/xattr.h syslog.h termios.h time.h unistd.h wchar.h linux/fs.h emmintrin.h
 
 # folder: folders whose public headers it may include, and third-party headers (by prefix).
 INCLUDES = {
-    "cfg": (["cfg"], ["openssl/", "ldap.h", "lber.h", "utf8proc.h", "unicode/"]),
+    "cfg": (["cfg"], ["crypt.h", "openssl/", "ldap.h", "lber.h", "utf8proc.h", "unicode/"]),
     "slapi": (["slapi", "cfg", "schema"],
               ["openssl/", "ldap.h", "ldap_schema.h", "lber.h", "spdlog/"]),
     "back-config": (["slapi", "cfg"], []),
@@ -40,10 +40,11 @@ INCLUDES = {
 RUNTIME = r"lib(stdc\+\+|m|c|gcc_s|pthread|dl|asan|ubsan|tsan|lsan|gcov)\.so.*|ld-linux.*"
 LDAP = r"lib(ldap|lber)(-2\.\d+)?\.so.*"
 OPENSSL = r"lib(ssl|crypto)\.so.*"
+CRYPT = r"libcrypt\.so.*"
 
 # binary: what it may link besides the run-time libraries of the compiler, and what it must link.
 LINKS = {
-    "lib/libcfg.so": ([LDAP, OPENSSL, r"libutf8proc\.so.*", r"libicu.*"], []),
+    "lib/libcfg.so": ([CRYPT, LDAP, OPENSSL, r"libutf8proc\.so.*", r"libicu.*"], []),
     "lib/libslapi.so": ([r"libcfg\.so", LDAP, OPENSSL, r"lib(spdlog|fmt)\.so.*"], ["libcfg.so"]),
     "lib/libback-config.so": ([r"libslapi\.so", r"libcfg\.so"], ["libslapi.so"]),
     "bin/orvd": ([r"libslapi\.so", r"libcfg\.so", LDAP, OPENSSL, r"lib(spdlog|fmt)\.so.*",

@@ -12,8 +12,8 @@ import schema_files
 
 DOCUMENT = "docs/configuration.md"
 ROW = re.compile(r"^\| `([A-Za-z-]+)` \|([^|\n]*)\|([^|\n]*)\|([^|\n]*)\|([^|\n]*)\|$", re.MULTILINE)
-# Not a setting: the type stands only inside the values of another.
-NOT_SETTINGS = {"orv-kerberosName"}
+# Not settings: a type that stands only inside the values of another, and one of the root DSE.
+NOT_SETTINGS = {"orv-kerberosName", "orv-restartSettings"}
 PLACEHOLDER = re.compile(r"@(DIR|ADMINPW)@")
 
 

@@ -4,7 +4,7 @@ import argparse
 import os
 import sys
 
-SKIPPED_FOLDERS = {".git", "build", "var", "__pycache__", ".cache", ".pytest_cache", "corpus"}
+SKIPPED = {".git", "build", "var", "__pycache__", ".cache", ".pytest_cache", "corpus"}
 
 
 def arguments(description):
@@ -27,8 +27,10 @@ def files(top, suffixes=None):
     """Paths of files below `top`, relative to it, sorted; what is made by builds is left out."""
     found = []
     for folder, folders, names in os.walk(top):
-        folders[:] = [f for f in folders if f not in SKIPPED_FOLDERS]
+        folders[:] = [f for f in folders if f not in SKIPPED]
         for name in names:
+            if name in SKIPPED:  # .git is a file where a work tree is linked
+                continue
             if suffixes is None or name.endswith(suffixes):
                 found.append(os.path.relpath(os.path.join(folder, name), top))
     return sorted(found)

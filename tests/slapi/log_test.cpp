@@ -40,7 +40,7 @@ void print_all() {
   PrintMessage(0, 8, 174, "CN=P", "CN=SCHEMA");
   PrintMessage(0, 8, 179, "http://x");
   for (int number = 1; number <= 11; ++number) PrintMessage(0, 9, number, "CN=E", "A", "B");
-  for (int number = 1; number <= 8; ++number) PrintMessage(0, 10, number, "CN=A", "7");
+  for (int number = 1; number <= 10; ++number) PrintMessage(0, 10, number, "CN=A", "7");
 }
 
 const std::vector<std::string> kBuiltInTexts{
@@ -74,7 +74,10 @@ const std::vector<std::string> kBuiltInTexts{
     "0/10/6 A new password from 'CN=A' was refused: fewer than 7 different characters are new.",
     "0/10/7 A new password from 'CN=A' was refused: it is the old one.",
     "0/10/8 The password policy in the configuration file is not put in force: CN=A. The one "
-    "before stays."};
+    "before stays.",
+    "0/10/9 The password method in the configuration file is not put in force: CN=A. The one "
+    "before stays.",
+    "0/10/10 'CN=A' is locked out after 7 failed binds."};
 
 TEST_F(Messages, HaveBuiltInTextsWithoutACatalogue) {
   EXPECT_FALSE(open_message_catalogue("/nonexistent/orvd.cat"));

@@ -8,19 +8,24 @@
 #include <string>
 #include <thread>
 
+#include "cfg/secret.h"
 #include "configuration_file.h"
 #include "entries.h"
 #include "failing_allocation.h"
 #include "messages.h"
+#include "slapi/administrators.h"
+#include "slapi/backends.h"
 #include "slapi/codepage.h"
 #include "slapi/control.h"
 #include "slapi/log.h"
 #include "slapi/owners.h"
+#include "slapi/password_method.h"
 #include "slapi/schema.h"
 #include "slapi/services.h"
 #include "slapi/strings.h"
 #include "slapi/trace.h"
 #include "slapi/value_syntax.h"
+#include "temporary_directory.h"
 #include "values.h"
 
 namespace orv {
@@ -72,6 +77,7 @@ class OutOfMemory : public testing::Test {
     char* dn = strdup("cn=\xC3\xA9");
     ASSERT_EQ(replace_DN(&dn, 1), 0);
     std::free(dn);
+    ASSERT_EQ(select_backend_opt("CN=LOCALHOST"), nullptr);
   }
 };
 
@@ -368,6 +374,148 @@ TEST_F(OutOfMemory, PolicyBeforeStaysInForce) {
   }
 }
 
+TEST_F(OutOfMemory, PasswordMethodBeforeStaysInForce) {
+  test::MessageRecorder messages;
+  test::ConfigurationFile hashed(
+      "dn: CN=CONFIGURATION\nobjectClass: top\ncn: Configuration\n"
+      "orv-slapdPwEncryption: SSHA512\n\n"
+      "dn: CN=ADMINGROUP,CN=CONFIGURATION\nobjectClass: top\ncn: AdminGroup\n"
+      "orv-slapdPwEncryptionAllowed: SSHA512\norv-slapdPwEncryptionAllowed: AES256\n");
+  test::ConfigurationFile sealed("dn: CN=CONFIGURATION\nobjectClass: top\ncn: Configuration\n");
+  for (long n = 1, hit = 1; hit != 0; ++n) {
+    ASSERT_LT(n, 10000);
+    ASSERT_EQ(load_password_methods(sealed.session()), 0);
+    AllocationFault fault(n);
+    const int rc = load_password_methods(hashed.session());
+    fault.disarm();
+    hit = fault.hit() ? 1 : 0;
+    ASSERT_EQ(rc, hit != 0 && rc != 0 ? 90 : 0) << n;
+    EXPECT_EQ(password_method_in_force(),
+              rc == 0 ? password_method::ssha512 : password_method::aes256)
+        << n;
+  }
+  ASSERT_EQ(load_password_methods(sealed.session()), 0);
+}
+
+TEST_F(OutOfMemory, PasswordMethodIsNotStaged) {
+  for (long n = 1, hit = 1; hit != 0; ++n) {
+    ASSERT_LT(n, 1000);
+    AllocationFault fault(n);
+    char* text = nullptr;
+    const int rc = stage_password_method(password_method::ssha512, &text);
+    fault.disarm();
+    hit = fault.hit() ? 1 : 0;
+    EXPECT_EQ(text, nullptr);
+    ASSERT_EQ(rc, hit != 0 && rc != 0 ? 90 : 0) << n;
+  }
+  char* text = nullptr;
+  AllocationFault fault(1);
+  EXPECT_EQ(stage_password_method(16, &text), 53);
+  fault.disarm();
+  EXPECT_TRUE(fault.hit());
+  EXPECT_EQ(text, nullptr);
+}
+
+TEST_F(OutOfMemory, SealedPasswordIsNotOpened) {
+  const test::TemporaryDirectory directory;
+  std::string why;
+  cfg::KeyPtr key;
+  ASSERT_EQ(cfg::create_key_stash(directory.file("key").c_str(), why), 0);
+  ASSERT_EQ(cfg::load_key_stash(directory.file("key").c_str(), key, why), 0);
+  std::string sealed;
+  const std::string secret = "a secret too long to be kept inside a string object";
+  ASSERT_EQ(cfg::seal_secret(*key, {"orv-slapdAdminPW", "CN=CONFIGURATION"}, secret, sealed), 0);
+  for (long n = 1, hit = 1; hit != 0; ++n) {
+    ASSERT_LT(n, 1000);
+    char* clear = nullptr;
+    AllocationFault fault(n);
+    const int rc = unformat_password(sealed.c_str(), &clear, key.get(), 0);
+    fault.disarm();
+    hit = fault.hit() ? 1 : 0;
+    ASSERT_EQ(rc, clear == nullptr ? -1 : 1) << n;
+    if (clear != nullptr) {
+      EXPECT_EQ(clear, secret);
+    } else {
+      EXPECT_NE(hit, 0);
+    }
+    std::free(clear);
+  }
+}
+
+constexpr const char* kIdentities =
+    "dn: CN=CONFIGURATION\nobjectClass: top\ncn: Configuration\norv-slapdAdminDN: cn=root\n"
+    "orv-slapdAdminPW: a password too long to be kept inside a string object\n\n"
+    "dn: CN=MASTER SERVER,CN=CONFIGURATION\nobjectClass: orv-slapdReplication\n"
+    "cn: Master Server\norv-slapdMasterDN: cn=master\n\n"
+    "dn: cn=s,CN=CONFIGURATION\nobjectClass: orv-slapdSupplier\ncn: s\n"
+    "orv-slapdMasterDN: cn=sup\norv-slapdMasterSuffix: o=a\n";
+
+TEST_F(OutOfMemory, AdministratorsBeforeStayAsTheyWere) {
+  test::ConfigurationFile nobody("dn: CN=CONFIGURATION\nobjectClass: top\ncn: Configuration\n");
+  test::ConfigurationFile file(kIdentities);
+  // An algorithm whose first look-up fails for want of memory is never found again.
+  ASSERT_EQ(load_administrators(file.session()), 0);
+  for (long n = 1, hit = 1; hit != 0; ++n) {
+    ASSERT_LT(n, 10000);
+    ASSERT_EQ(load_administrators(nobody.session()), 0);
+    AllocationFault fault(n);
+    const int rc = load_administrators(file.session());
+    fault.disarm();
+    hit = fault.hit() ? 1 : 0;
+    ASSERT_EQ(rc, hit != 0 && rc != 0 ? 90 : 0) << n;
+    const bool there = rc == 0;
+    EXPECT_EQ(findAdminPWDPAttrib("cn=root") != nullptr, there) << n;
+    EXPECT_EQ(checkMasterSrvDn(nullptr, "CN=MASTER") != 0, there) << n;
+    EXPECT_EQ(checkMasterSrvDn("O=A", "CN=SUP") != 0, there) << n;
+  }
+  ASSERT_EQ(load_administrators(nobody.session()), 0);
+}
+
+TEST_F(OutOfMemory, NobodyIsASupplierNorBinds) {
+  test::ConfigurationFile nobody("dn: CN=CONFIGURATION\nobjectClass: top\ncn: Configuration\n");
+  test::ConfigurationFile file(kIdentities);
+  ASSERT_EQ(load_administrators(file.session()), 0);
+  const char* const who = "CN=MASTER";
+  const char* const where = "cn = a suffix too long to be kept inside a string object, o = b";
+  fail_each_allocation([&] { return checkMasterSrvDn(nullptr, "cn = master") != 0; });
+  fail_each_allocation([&] { return findAdminPWDPAttrib("cn = root") != nullptr; });
+  fail_each_allocation([&] { return settle_administrator_bind("cn = root", true, {}); });
+  for (long n = 1; n < 100; ++n) {
+    AllocationFault fault(n);
+    EXPECT_EQ(checkMasterSrvDn(where, who), 0);
+  }
+  ASSERT_EQ(load_administrators(nobody.session()), 0);
+}
+
+TEST_F(OutOfMemory, BackendIsNotRegisteredByHalves) {
+  static constexpr const char* kSuffixes[] = {"CN=LOCALHOST", nullptr};
+  static Backend backend;
+  backend.suffixes = kSuffixes;
+  const PluginFunction function = [](Backend*, int, char**) { return 0; };
+  PluginFunction* list = nullptr;
+  int rc = 0;
+  fail_each_allocation(
+      [&] {
+        rc = register_backend(&backend);
+        return rc == 0;
+      },
+      [&] {
+        EXPECT_EQ(rc, 90);
+        EXPECT_EQ(select_backend_opt("CN=LOCALHOST"), nullptr);
+      });
+  fail_each_allocation(
+      [&] {
+        rc = register_plugin_function(&backend, -159, function);
+        return rc == 0;
+      },
+      [&] {
+        EXPECT_EQ(rc, 90);
+        EXPECT_EQ(getAllPluginFuncs(&backend, -159, &list), 80);
+      });
+  fail_each_allocation([&] { return select_backend_opt("cn = localhost") == &backend; });
+  unregister_backend(&backend);
+}
+
 TEST_F(OutOfMemory, UrlIsNotParsed) {
   LDAPURLDesc* url = nullptr;
   fail_each_allocation(
@@ -630,6 +778,15 @@ TEST(NoAllocation, IsMadeByThePolicy) {
   EXPECT_TRUE(pwdIsAdminPolicyOn());
   EXPECT_EQ(validate_new_settings(getGlobalAdminPWDPolicyLocal(), true), 0);
   fault.disarm();
+  EXPECT_EQ(fault.allocations(), 0);
+}
+
+TEST(NoAllocation, IsMadeByAMethodName) {
+  int method = password_method::none_converted;
+  AllocationFault fault(1);
+  EXPECT_EQ(convertPWEncryptionMethod("ssha512", &method), 0);
+  fault.disarm();
+  EXPECT_EQ(method, password_method::ssha512);
   EXPECT_EQ(fault.allocations(), 0);
 }
 

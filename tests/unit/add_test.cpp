@@ -832,16 +832,7 @@ TEST_F(Add, EarlierValueThatCannotBeTranslatedIsPassedOnAsItIs) {
                           "\"0 objectClass=<null>|0 cn=x\")"));
 }
 
-TEST_F(Add, EarlierValueThatWasTranslatedInPartIsPassedOnAsItIs) {
-  platform.failed_text_is_left = true;
-  platform.fail("xlate_utf8_to_localcp", 1, 21);
-  EXPECT_EQ(add(), 0);
-  EXPECT_THAT(platform.calls({"cfg_add_s"}),
-              ElementsAre(testing::Not(testing::HasSubstr("<null>"))));
-}
-
 TEST_F(Add, DnThatCannotBeTranslatedEndsWithItsCode) {
-  platform.failed_text_is_left = true;  // what it left is not used
   platform.fail("xlate_utf8_to_localcp", 3, 21);
   EXPECT_EQ(add(), 21);
   EXPECT_EQ(platform.count("EntryToLDAPMod"), 0);

@@ -92,8 +92,7 @@ TEST_F(FailingAllocations, RefusedSearchAllocatesNothing) {
 }
 
 TEST_F(FailingAllocations, OtherHandlersAllocateNothing) {
-  for (const Handler handler :
-       {config_back_bind, config_back_unbind, config_back_modify, config_back_close}) {
+  for (const Handler handler : {config_back_bind, config_back_unbind, config_back_close}) {
     EXPECT_EQ(each([&] { platform.run([&] { return handler(&pb); }); }, [] {}), 0);
   }
 }
@@ -214,6 +213,84 @@ TEST_F(FailingAllocations, DeleteAnswersOnceAndComesToRest) {
   EXPECT_TRUE(release_notice());
   EXPECT_GT(failed, 10);
   EXPECT_EQ(lost_notices, 3);
+}
+
+// What a modify that came to nothing may leave: the copy of its list.
+void expect_at_most_a_copy(Platform& platform, int rc) {
+  const std::vector<std::string> left = platform.leaks();
+  if (rc == 0) {
+    EXPECT_THAT(left, IsEmpty());
+  }
+  for (const std::string& word : left) EXPECT_TRUE(word == "memory" || word == "text") << word;
+  EXPECT_THAT(platform.violations(), IsEmpty());
+  platform.release_leaks();
+}
+
+TEST_F(FailingAllocations, ModifyOfAPasswordAnswersOnceAndComesToRest) {
+  as(0x14, "CN=ONE");
+  platform.admin_policy = true;
+  const char* member = "CN=ONE,CN=ADMINGROUP,CN=CONFIGURATION";
+  const char* audit = "CN=AUDIT,CN=LOG MANAGEMENT,CN=CONFIGURATION";
+  platform.file[member] = {{{member,
+                             {{"objectClass", {"top", "orv-slapdAdminGroupMember"}},
+                              {"orv-slapdAdminPW", {"{sealed}old"}},
+                              {"orv-slapdAdminDN", {"cn=one"}}}}}};
+  platform.file[audit] = {{{audit, {{"orv-slapdLog", {"/log/audit"}}}}}};
+  pb.put(parameter::target_dn, static_cast<const void*>(member));
+  int rc = -1;
+  int successes = 0;
+  const auto modify = [&] {
+    pb.put(
+        parameter::modifications,
+        scripted::make_modifications({{kModReplace | kModBvalues, "orv-slapdAdminPW", {{"new"}}}}));
+    rc = platform.run([&] { return config_back_modify(&pb); });
+  };
+  const int failed = each(modify, [&] {
+    EXPECT_EQ(platform.count("send_ldap_result"), 1);
+    EXPECT_EQ(pb.values.at(parameter::modifications).pointer, nullptr);
+    const bool kept = session_was_kept();
+    EXPECT_TRUE(kept ? rc == 1 : rc == 0 || rc == 1 || rc == 16 || rc == 32 || rc == 80 || rc == 90)
+        << rc;
+    if (rc == 0) {
+      ++successes;
+      EXPECT_EQ(platform.count("cfg_modify_s"), 1);
+      EXPECT_EQ(platform.count("verify_admin_password"), 1);
+    }
+    expect_at_most_a_copy(platform, rc);
+  });
+  EXPECT_EQ(rc, 0);
+  EXPECT_GT(failed, 30);
+  // The four options of the session; the name of the audit log's file, read in four steps, without
+  // which its default is protected; an old password that is not opened, and compared as it is
+  // stored.
+  EXPECT_EQ(successes, 4 + 4 + 1);
+}
+
+TEST_F(FailingAllocations, ModifyOfTheLastRoleAnswersOnceAndComesToRest) {
+  as(0x0C);
+  const char* member = "CN=ONE,CN=ADMINGROUP,CN=CONFIGURATION";
+  platform.file[member] = {{{member, {{"orv-slapdAdminRole", {"SchemaAdmin", "AuditAdmin"}}}}}};
+  pb.put(parameter::target_dn, static_cast<const void*>(member));
+  int rc = -1;
+  const auto modify = [&] {
+    pb.put(
+        parameter::modifications,
+        scripted::make_modifications(
+            {{kModDelete | kModBvalues, "orv-slapdAdminRole", {{"SchemaAdmin", "AuditAdmin"}}}}));
+    rc = platform.run([&] { return config_back_modify(&pb); });
+  };
+  const int failed = each(modify, [&] {
+    EXPECT_EQ(platform.count("send_ldap_result"), 1);
+    EXPECT_EQ(pb.values.at(parameter::modifications).pointer, nullptr);
+    session_was_kept();
+    if (rc == 0) {
+      EXPECT_THAT(platform.calls({"cfg_modify_s"}),
+                  ElementsAre(testing::HasSubstr("\"2 orv-slapdAdminRole=NoAdmin\"")));
+    }
+    expect_at_most_a_copy(platform, rc);
+  });
+  EXPECT_EQ(rc, 0);
+  EXPECT_GT(failed, 30);
 }
 
 TEST_F(FailingAllocations, RegistrationAllocatesNothing) {

@@ -533,16 +533,6 @@ TEST_F(PassThrough, ValueOfAnotherEntryThatCannotBeConvertedGives1) {
   expect_only_the_session_left();
 }
 
-TEST_F(PassThrough, DnOfAnotherEntryIsReleasedBeforeTheNextEntryIsTaken) {
-  make_with_subtrees({"o=a"});
-  file({{kOther, {{"orv-slapdPtaSubtree", {"o=b"}}}}});
-  EXPECT_EQ(verify(), 0);
-  EXPECT_THAT(
-      platform.calls({"cfg_get_dn", "cfg_memfree", "cfg_next_entry"}),
-      ElementsAre("cfg_get_dn(session, record 1)", "cfg_memfree(\"" + std::string(kOther) + "\")",
-                  "cfg_next_entry(session, record 1)"));
-}
-
 TEST_F(PassThrough, ValuesAreReleasedOneByOneAndNotByTheLibrary) {
   make_with_subtrees({"o=a"});
   file({{kOther, {{"orv-slapdPtaSubtree", {"o=b", "o=c"}}}}});

@@ -2,10 +2,11 @@
 //
 // Forms of a stored value:
 //   {AES256}base64   sealed: AES-256-GCM under the key of the stash file; can be opened again
-//   {SSHA512}base64  salted SHA-512; also {SSHA256}, {SSHA}: can only be verified
+//   {SSHA512}base64  salted SHA-512; also {SSHA384}, {SSHA256}, {SSHA}: can only be verified
 //   {PBKDF2-SHA256}iterations$salt$hash (base64 without padding), also -SHA512: can only be
-//   verified anything else    the clear text, unless it begins with "{" name "}" of an unknown
-//   scheme, which
+//                    verified
+//   {CRYPT}text      as crypt(3) makes it, where the platform has it: can only be verified
+//   anything else    the clear text, unless it begins with "{" name "}" of an unknown scheme, which
 //                    never matches
 //
 // A sealed value is bound to the attribute and the entry it stands in (their names are part of what
@@ -63,15 +64,33 @@ void verify_nothing(std::string_view clear) noexcept;
 // Makes a salted SHA-512 value. 0 or 90.
 int hash_secret(std::string_view clear, std::string& stored) noexcept;
 
-// How a password that is given in clear is stored by a change (cfg_add_s): sealed under the key of
-// the session, or hashed. Without a key it is hashed in either case: no change leaves a clear text.
-enum class SecretMethod { sealed, hashed };
+// How a password that is given in clear is stored by a change (cfg_add_s, cfg_modify_s): sealed
+// under the key of the session, hashed, or as it is. Without a key, `sealed` means ssha512.
+enum class SecretMethod {
+  sealed,
+  ssha256,
+  ssha384,
+  ssha512,
+  pbkdf2_sha256,  // 600,000 iterations: a quarter of a second of one core
+  pbkdf2_sha512,  // 210,000 iterations
+  crypt,          // the platform's own choice among its methods
+  clear,
+  hashed = ssha512,
+};
+
+// Whether this host can store passwords that way; all but crypt are always possible.
+bool can_make_secret(SecretMethod method) noexcept;
+
+// Makes the stored form that needs no key, with a salt of its own. 0; 90; 19 a password that the
+// method cannot take (crypt: longer than 511 bytes); 53 `sealed`, or this host cannot.
+int make_secret(SecretMethod method, std::string_view clear, std::string& stored) noexcept;
 
 // Sets the method of the process; `sealed` until then. Thread-safe.
 void set_secret_method(SecretMethod method) noexcept;
 SecretMethod secret_method() noexcept;
 
-// Protects a clear text with the method in force; `key` may be null. 0 or 90.
+// Protects a clear text with the method in force; `key` may be null. 0; 90; 19 and 53 as in
+// make_secret.
 int protect_secret(const Key* key, SecretPlace place, std::string_view clear,
                    std::string& stored) noexcept;
 

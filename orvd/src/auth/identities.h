@@ -15,7 +15,6 @@
 #pragma once
 
 #include <array>
-#include <chrono>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -95,12 +94,8 @@ class IdentityStore {
   // Reads anew whatever the file's times say. False (with the cause) when the last good one stays.
   bool reload(std::string& error, std::vector<std::string>& warnings) noexcept;
 
-  // Never null after the first successful reload. Looks at a file that could not be read again when
-  // it has changed, and after a pause (1 s).
+  // Never null after the first successful reload.
   std::shared_ptr<const Identities> current() noexcept;
-
-  // How long that pause is.
-  void read_again_after(std::chrono::milliseconds pause) noexcept;
 
   // The same without looking at the files, and how often they were read with success. Never block.
   std::shared_ptr<const Identities> latest() const noexcept;

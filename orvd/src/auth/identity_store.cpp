@@ -1,5 +1,4 @@
 #include <atomic>
-#include <chrono>
 #include <cstdint>
 #include <utility>
 
@@ -17,13 +16,9 @@ struct IdentityStore::State {
   std::mutex pointer_mutex;  // for moments: guards the pointer only
   std::shared_ptr<const Identities> identities;
 
-  std::mutex mutex;          // lets one thread read the files, and guards what follows
-  ConfigurationState tried;  // of the last attempt, good or not
-  // A file that could not be read is not read for every bind; but what kept it from being read may
-  // have been want of memory or of descriptors, and its state does not tell when that is over.
-  bool failed = false;
-  std::chrono::milliseconds pause{1000};
-  std::chrono::steady_clock::time_point again_at;
+  std::mutex mutex;  // lets one thread read the files, and guards what follows
+  ConfigurationState
+      tried;  // of the last attempt, good or not: a broken file is not read for every bind
 
   ConfigurationState now() const noexcept { return {config_file, key_stash_file}; }
 
@@ -32,9 +27,7 @@ struct IdentityStore::State {
             std::vector<std::string>& warnings) noexcept {
     auto fresh = Identities::read(config_file.c_str(), key_stash_file.c_str(), error, warnings);
     tried = state;
-    failed = fresh == nullptr;
-    again_at = std::chrono::steady_clock::now() + pause;
-    if (failed) return false;
+    if (!fresh) return false;
     {
       const std::lock_guard lock(pointer_mutex);
       identities = std::move(fresh);
@@ -70,21 +63,10 @@ std::shared_ptr<const Identities> IdentityStore::current() noexcept {
   {
     const std::lock_guard lock(state_->mutex);
     const ConfigurationState now = state_->now();
-    const bool changed = !(now == state_->tried);
-    const bool again = state_->failed && std::chrono::steady_clock::now() >= state_->again_at;
-    if (changed || again) state_->read(now, error, warnings);
-    if (!changed && state_->failed) {  // told already
-      error.clear();
-      warnings.clear();
-    }
+    if (!(now == state_->tried)) state_->read(now, error, warnings);
   }
   if (state_->report && (!error.empty() || !warnings.empty())) state_->report(error, warnings);
   return state_->latest();
-}
-
-void IdentityStore::read_again_after(std::chrono::milliseconds pause) noexcept {
-  const std::lock_guard lock(state_->mutex);
-  state_->pause = pause;
 }
 
 std::shared_ptr<const Identities> IdentityStore::latest() const noexcept {

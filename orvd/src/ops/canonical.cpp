@@ -7,10 +7,11 @@
 #include <utility>
 
 #include "cfg/dn.h"
-#include "cfg/matching.h"
 #include "cfg/result_codes.h"
 #include "cfg/secret.h"
 #include "cfg/text.h"
+#include "ops/equality.h"
+#include "ops/modification_list.h"
 #include "slapi/codepage.h"
 
 namespace orv::server {
@@ -52,19 +53,6 @@ std::string canonical_value(const Schema& schema, std::string_view type, const s
   if (type != kObjectClass) return value;
   const std::string_view name = schema.canonical_object_class(value);
   return name.empty() ? value : std::string(name);
-}
-
-// A form in which equal values of a type are equal bytes. Passwords are compared as they were sent,
-// and so is what no rule of the type can read.
-std::string equality_key(const Schema& schema, std::string_view type, const std::string& value) {
-  const SchemaAttribute* const known = schema.attribute(type);
-  if (known->secret) return value;
-  auto rule = cfg::MatchingRule::case_ignore;
-  cfg::find_matching_rule(known->equality, rule);
-  std::string key;
-  const int code = cfg::canonical_value(rule, value, key);
-  if (code == result::no_memory) throw std::bad_alloc();
-  return code == result::success ? "=" + key : value;
 }
 
 bool has_equal_values(const Schema& schema, std::string_view type,
@@ -123,6 +111,16 @@ Refusal check_code_page(std::string_view type, const std::string& value) {
 struct CanonicalAttribute {
   std::string_view type;  // lives in the schema
   std::vector<std::string> values;
+};
+
+// Wipes the values when it goes: there may be passwords among them.
+template <typename List>
+struct Wiped {
+  ~Wiped() {
+    for (auto& item : list)
+      for (std::string& value : item.values) cfg::wipe(value);
+  }
+  List& list;
 };
 
 Refusal canonical_attribute(const Schema& schema, const Attribute& given,
@@ -246,12 +244,40 @@ struct ModificationsDeleter {
 };
 using Modifications = std::unique_ptr<ldapmod, ModificationsDeleter>;
 
-ldapmod* malloc_modification(int operation, const CanonicalAttribute& attribute) {
+ldapmod* malloc_modification(const TypeChange& change) {
   Modifications made(static_cast<ldapmod*>(checked(std::calloc(1, sizeof(ldapmod)))));
-  made->mod_op = operation | kModBvalues;
-  made->mod_type = malloc_text(attribute.type).release();
-  made->mod_vals.modv_bvals = malloc_values(attribute.values).release();
+  made->mod_op = change.operation | kModBvalues;
+  made->mod_type = malloc_text(change.type).release();
+  made->mod_vals.modv_bvals = malloc_values(change.values).release();
   return made.release();
+}
+
+ldapmod* malloc_modifications(const TypeChanges& changes) {
+  Modifications list;
+  ldapmod* last = nullptr;
+  for (const TypeChange& change : changes) {
+    ldapmod* const made = malloc_modification(change);
+    if (last)
+      last->mod_next = made;
+    else
+      list.reset(made);
+    last = made;
+  }
+  return list.release();
+}
+
+Refusal canonical_changes(const Schema& schema, const ModifyRequest& request,
+                          TypeChanges& changes) {
+  if (request.modifications.empty()) return refuse(result::protocol_error, "no modifications");
+  changes.reserve(request.modifications.size());  // what moves leaves passwords behind
+  for (const Modification& given : request.modifications) {
+    CanonicalAttribute attribute;
+    if (Refusal refusal = canonical_attribute(schema, given.attribute, attribute)) return refusal;
+    if (given.operation == kModAdd && attribute.values.empty())
+      return refuse(result::protocol_error, "add without values", attribute.type);
+    changes.push_back({given.operation, attribute.type, std::move(attribute.values)});
+  }
+  return {};
 }
 
 // ---- filters
@@ -379,36 +405,28 @@ Refusal make_entry(const Schema& schema, const AddRequest& request, EntryPtr& ma
   if (const int code = cfg::canonicalize_dn_types(request.dn, dn))
     return refuse(code, kTargetNotADn);
   std::vector<CanonicalAttribute> attributes;
-  struct Wiped {
-    ~Wiped() {
-      for (CanonicalAttribute& attribute : attributes)
-        for (std::string& value : attribute.values) cfg::wipe(value);
-    }
-    std::vector<CanonicalAttribute>& attributes;
-  } const wiped{attributes};
+  const Wiped<std::vector<CanonicalAttribute>> wiped{attributes};
   if (Refusal refusal = canonical_attributes(schema, request, attributes)) return refusal;
   if (Refusal refusal = complete_rdn(schema, request.dn, attributes)) return refusal;
   made = build_entry(dn, normal, attributes);
   return {};
 }
 
-Refusal make_modifications(const Schema& schema, const ModifyRequest& request, ldapmod*& first) {
-  if (request.modifications.empty()) return refuse(result::protocol_error, "no modifications");
-  Modifications list;
-  ldapmod* last = nullptr;
-  for (const Modification& given : request.modifications) {
-    CanonicalAttribute attribute;
-    if (Refusal refusal = canonical_attribute(schema, given.attribute, attribute)) return refusal;
-    if (given.operation == kModAdd && attribute.values.empty())
-      return refuse(result::protocol_error, "add without values", attribute.type);
-    ldapmod* const made = malloc_modification(given.operation, attribute);
-    if (last)
-      last->mod_next = made;
-    else
-      list.reset(made);
-    last = made;
+Refusal make_modifications(const Schema& schema, const ModifyRequest& request, ListForm form,
+                           ldapmod*& first) {
+  TypeChanges given;
+  const Wiped<TypeChanges> wiped_given{given};
+  if (Refusal refusal = canonical_changes(schema, request, given)) return refusal;
+  if (form == ListForm::as_sent) {
+    first = malloc_modifications(given);
+    return {};
   }
-  first = list.release();
+  if (Refusal refusal = check_class_changes(schema, given)) return refusal;
+  TypeChanges folded;
+  const Wiped<TypeChanges> wiped_folded{folded};
+  if (Refusal refusal = fold_changes(schema, given, folded)) return refusal;
+  if (Refusal refusal = check_name_stays(schema, request.dn, folded)) return refusal;
+  first = malloc_modifications(folded);
   return {};
 }
 

@@ -14,18 +14,12 @@
 #include <vector>
 
 #include "cfg/ldapmod.h"
+#include "ops/refusal.h"
 #include "protocol/message.h"
 #include "slapi/owners.h"
 #include "slapi/schema.h"
 
 namespace orv::server {
-
-// 0, or the code with which a request is refused and a reason for the client.
-struct Refusal {
-  int code = 0;
-  std::string text;
-  explicit operator bool() const noexcept { return code != 0; }
-};
 
 // A null-terminated array of malloced texts.
 struct TextArrayDeleter {
@@ -50,9 +44,16 @@ TextArray canonical_names(const Schema& schema, const std::vector<std::string>& 
 // file cannot hold; 64 a password in the RDN.
 Refusal make_entry(const Schema& schema, const AddRequest& request, EntryPtr& made);
 
-// The modification records of a modify request, in the client's order: counted values, a null array
-// where there are none. 17, 19, 20 and 21 as above; 2 an empty list, or an add without values.
-Refusal make_modifications(const Schema& schema, const ModifyRequest& request, ldapmod*& first);
+// Whether a list of modifications is brought to the form in which its order cannot matter
+// (ops/modification_list.h), with the checks that need it. Lists of callers who may only send one
+// kind of list are not: there the number of modifications is itself a rule of the backend.
+enum class ListForm { folded, as_sent };
+
+// The modification records of a modify request, in the order of the client or that of the folded
+// list: counted values, a null array where there are none. 17, 19, 20 and 21 as above; 2 an empty
+// list, or an add without values. Folded ones also 16, 20, 53, 67 and 69.
+Refusal make_modifications(const Schema& schema, const ModifyRequest& request, ListForm form,
+                           ldapmod*& first);
 
 // Whether the target of a delete or a modify can be named to the backend: 34 for a DN outside ASCII
 // when the file is not in UTF-8. The backend looks at such a name in one code page and changes the

@@ -7,6 +7,7 @@ namespace orv::server {
 namespace {
 
 constexpr std::string_view kTop = "CN=CONFIGURATION";
+constexpr std::string_view kGroup = "CN=ADMINGROUP,CN=CONFIGURATION";
 constexpr std::string_view kLogs = "CN=LOG MANAGEMENT,CN=CONFIGURATION";
 constexpr std::string_view kPolicy = "CN=PWDPOLICY ADMIN,CN=CONFIGURATION";
 constexpr std::string_view kClassesOfIdentities[] = {"orv-slapdTop", "orv-slapdAdminGroupMember",
@@ -15,6 +16,7 @@ constexpr std::string_view kClassesOfIdentities[] = {"orv-slapdTop", "orv-slapdA
 Consequences of_place(std::string_view normal_dn) noexcept {
   Consequences found;
   found.policy = normal_dn == kPolicy;
+  found.methods = normal_dn == kTop || normal_dn == kGroup;
   found.settings = normal_dn == kTop || cfg::normal_dn_is_at_or_below(normal_dn, kLogs);
   return found;
 }

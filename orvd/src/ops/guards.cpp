@@ -1,12 +1,12 @@
 #include "ops/guards.h"
 
-#include <strings.h>
-
 #include <algorithm>
 #include <string>
 
 #include "cfg/result_codes.h"
+#include "cfg/text.h"
 #include "config/setting_ranges.h"
+#include "settings.h"
 #include "slapi/connection.h"
 
 namespace orv::server {
@@ -14,8 +14,8 @@ namespace {
 
 constexpr std::string_view kPolicy = "CN=PWDPOLICY ADMIN,CN=CONFIGURATION";
 constexpr std::string_view kPassThrough = "CN=PASSTHROUGH AUTHENTICATION,CN=CONFIGURATION";
-constexpr std::string_view kMasterServer = "CN=MASTER SERVER,CN=CONFIGURATION";
-constexpr std::string_view kSupplierOfServer = "orv-slapdReplication";
+constexpr std::string_view kObjectClass = "objectClass";
+constexpr std::string_view kLogLevel = "orv-slapdLogLevel";
 
 constexpr Guard kGuards[] = {
     // With a policy of their own making, members could set any password they like.
@@ -32,24 +32,54 @@ bool is_primary(unsigned flags) noexcept {
   return flags == authority::primary_administrator;
 }
 
-// The rules of uniqueness know the first entry of that class only, which must be the one that the
-// supplier binds by.
-bool is_second_supplier_of_server(std::string_view normal_dn, const entry& added) noexcept {
-  return normal_dn != kMasterServer &&
-         value_find_short_list(added.object_class_list, kSupplierOfServer.data(),
-                               kSupplierOfServer.size()) == 0;
+// Classes that stand at one entry only.
+struct Placed {
+  std::string_view name;
+  std::string_view dn;
+  std::string_view text;  // for the client
+};
+constexpr Placed kPlaced[] = {
+    // The rules of uniqueness know the first entry of that class only, which must be the one that
+    // the supplier binds by.
+    {"orv-slapdReplication", "CN=MASTER SERVER,CN=CONFIGURATION",
+     "the supplier of the whole server is CN=MASTER SERVER,CN=CONFIGURATION"},
+    // Members may change almost any entry but this one, and must not grant themselves anything.
+    {"orv-slapdAdminGroupSettings", "CN=ADMINGROUP,CN=CONFIGURATION",
+     "these settings stand at CN=ADMINGROUP,CN=CONFIGURATION and nowhere else"},
+};
+
+Refusal refuse_class(std::string_view normal_dn, std::string_view name) {
+  for (const Placed& placed : kPlaced)
+    if (normal_dn != placed.dn && cfg::equals_ignore_ascii_case(placed.name, name))
+      return {result::unwilling_to_perform, std::string(placed.text)};
+  return {};
 }
 
-// With such a level in its file the server would not start again.
-bool has_unknown_log_level(const entry& added) noexcept {
-  const attr* const levels = attr_find(&added, "orv-slapdLogLevel", 0, 0);
-  if (levels == nullptr || levels->values == nullptr) return false;
-  return std::any_of(levels->values, levels->values + levels->count, [](const berval* level) {
-    return std::none_of(std::begin(kLogLevels), std::end(kLogLevels), [level](auto known) {
-      return known.size() == level->bv_len &&
-             strncasecmp(known.data(), level->bv_val, known.size()) == 0;
-    });
+bool is_level(std::string_view value) noexcept {
+  return std::any_of(std::begin(kLogLevels), std::end(kLogLevels), [&](std::string_view level) {
+    return cfg::equals_ignore_ascii_case(level, value);
   });
+}
+
+Refusal refuse_value(std::string_view normal_dn, std::string_view type, std::string_view value) {
+  if (type == kObjectClass) return refuse_class(normal_dn, value);
+  if (type == kLogLevel && !is_level(value))
+    return {result::constraint_violation, std::string(type) + " is no level of a log"};
+  for (const SettingRow& row : setting_rows()) {
+    Settings scratch;
+    std::string error;
+    if (row.name == type && !apply_setting(row, value, scratch, error))
+      return {result::constraint_violation, error};
+  }
+  return {};
+}
+
+Refusal refuse_values(std::string_view normal_dn, std::string_view type,
+                      const berval* const* values) {
+  for (; values && *values; ++values)
+    if (Refusal refusal = refuse_value(normal_dn, type, {(*values)->bv_val, (*values)->bv_len}))
+      return refusal;
+  return {};
 }
 
 }  // namespace
@@ -65,12 +95,17 @@ Refusal guarded(GuardedChange change, std::string_view normal_dn, unsigned autho
     if (guard.primary_may && is_primary(authority)) continue;
     return {guard.code, std::string(guard.text)};
   }
-  if (added && is_second_supplier_of_server(normal_dn, *added))
-    return {result::unwilling_to_perform,
-            "the supplier of the whole server is " + std::string(kMasterServer)};
-  if (added && has_unknown_log_level(*added))
-    return {result::invalid_attribute_syntax,
-            "orv-slapdLogLevel is none of error, warning, info, debug, off"};
+  for (const attr* a = added ? added->attributes : nullptr; a; a = a->next)
+    if (Refusal refusal = refuse_values(normal_dn, a->type, a->values)) return refusal;
+  return {};
+}
+
+Refusal guarded_modification(std::string_view normal_dn, const ldapmod* first) {
+  for (; first; first = first->mod_next) {
+    if (first->operation() == kModDelete) continue;
+    if (Refusal refusal = refuse_values(normal_dn, first->mod_type, first->mod_vals.modv_bvals))
+      return refusal;
+  }
   return {};
 }
 

@@ -26,9 +26,15 @@ struct Guard {
 // The guards of single entries, in the order of the documentation.
 std::span<const Guard> entry_guards() noexcept;
 
-// The refusal of a change of an entry by somebody with these authority flags; none when no guard
-// stands in the way. `added` is the entry to add, null for a delete.
+// The refusal of adding or deleting an entry by somebody with these authority flags; none when no
+// guard stands in the way. `added` is the entry to add, null for a delete. 50 or 53 by the table;
+// 53 an object class out of its place; 19 a value with which the server would not start, nor take
+// over any settings while it runs: an integer setting out of its bounds, or a level that no log
+// has.
 Refusal guarded(GuardedChange change, std::string_view normal_dn, unsigned authority,
                 const entry* added);
+
+// The same for what a modification puts in.
+Refusal guarded_modification(std::string_view normal_dn, const ldapmod* first);
 
 }  // namespace orv::server

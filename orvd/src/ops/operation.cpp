@@ -5,8 +5,10 @@
 #include <optional>
 #include <utility>
 
+#include "cfg/dn.h"
 #include "cfg/result_codes.h"
 #include "ops/guards.h"
+#include "slapi/administrators.h"
 
 namespace orv::server {
 namespace {
@@ -14,6 +16,18 @@ namespace {
 // How often a running search looks at the client.
 constexpr std::chrono::milliseconds kLookInterval{10};
 constexpr std::string_view kWholeTree = "CN=CONFIGURATION";
+constexpr std::string_view kGroup = "CN=ADMINGROUP,CN=CONFIGURATION";
+
+// Suppliers may do nothing but add suffixes, and members nothing in the group but change their own
+// password, with a request that holds nothing else: to fold such a list could make one of several
+// modifications one of a single one.
+ListForm list_form(unsigned flags, std::string_view normal_dn) noexcept {
+  constexpr unsigned kSupplier = authority::supplier_of_server | authority::supplier_of_suffix;
+  if ((flags & kSupplier) != 0) return ListForm::as_sent;
+  const bool member = (flags & authority::group_member) != 0;
+  return member && cfg::normal_dn_is_at_or_below(normal_dn, kGroup) ? ListForm::as_sent
+                                                                    : ListForm::folded;
+}
 
 }  // namespace
 
@@ -100,10 +114,15 @@ Refusal PendingOperation::prepare_modify(Services& services, const ModifyRequest
   begin(services, parameter::modify_function, normal_dn);
   if (Refusal refusal = check_target_code_page(normal_dn)) return refusal;
   ldapmod* first = nullptr;
-  if (Refusal refusal = make_modifications(services.schema, request, first)) return refusal;
+  const ListForm form = list_form(operation_.authority, normal_dn);
+  if (Refusal refusal = make_modifications(services.schema, request, form, first)) return refusal;
   // From here the block holds the list: the handler clears the parameter when it released it.
-  if (!set(parameter::modifications, first)) free_modifications(first);
-  return {};
+  if (!set(parameter::modifications, first)) {
+    free_modifications(first);
+    return {result::other, ""};
+  }
+  if (!services.guards || form == ListForm::as_sent) return {};
+  return guarded_modification(normal_dn, first);
 }
 
 // What all connections may keep bounds each answer. Without room there is no search; a change is
@@ -129,12 +148,17 @@ bool PendingOperation::rights_hold(const Services& services) noexcept {
 
 // Inside the gate: the next operation must find the identities as this one left them.
 void PendingOperation::take_over(Services& services, int code) noexcept {
-  if (code != result::success || !services.take_over) return;
+  if (code != result::success) return;
   const Consequences consequences =
       handler_ == parameter::add_function
           ? consequences_
           : consequences_of_change(changed_dn_, services.authenticator);
-  if (consequences.any()) services.take_over(consequences);
+  settings_changed_ = consequences.settings;
+  if (services.take_over && consequences.any()) services.take_over(consequences);
+}
+
+void PendingOperation::renew_settings(Services& services) noexcept {
+  if (settings_changed_ && services.renew_settings) services.renew_settings();
 }
 
 int PendingOperation::outcome() const noexcept {
@@ -174,6 +198,7 @@ void PendingOperation::run(Services& services, bool on_home_thread) noexcept {
     returned_ = code;
     if (!answer_.answered()) answer_.result(code != 0 ? code : result::other, "", "");
     if (search) learn_cost(services, code);
+    if (!search) settle_password_changes(code == result::success);
     if (!search) take_over(services, code);
     if (!search) audience = changed(services, code);
     // A search that could not join would miss changes.

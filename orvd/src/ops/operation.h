@@ -68,12 +68,20 @@ class PendingOperation final : public GateWaiter,
   // open or passed on afterwards. `on_home_thread`: the connection's thread runs it.
   void run(Services& services, bool on_home_thread) noexcept;
 
+  // Makes the server's settings those of the file, after a change that touched them. Outside the
+  // gate, on a worker, and before the result leaves: whoever has heard of the change can count on
+  // it.
+  void renew_settings(Services& services) noexcept;
+
   void gate_decided(Verdict verdict) noexcept override;
 
   Answer& answer() noexcept { return answer_; }
   const Answer& answer() const noexcept { return answer_; }
   // Changes flush to disk and some searches take long, so they run on a worker thread.
   bool wants_worker() const noexcept { return wants_worker_; }
+  bool is_change() const noexcept {
+    return handler_ != 0 && handler_ != parameter::search_function;
+  }
   bool long_running() const noexcept { return long_running_; }
   Clock::time_point started() const noexcept { return started_; }
 
@@ -126,9 +134,10 @@ class PendingOperation final : public GateWaiter,
   bool long_running_ = false;
   bool wants_worker_ = true;
   std::size_t charged_ = 0;
-  std::optional<int> returned_;  // by the handler
-  std::string changed_dn_;       // of a change: handlers may rewrite their own copy
-  Consequences consequences_;    // of an add, while it is as the client wrote it
+  std::optional<int> returned_;    // by the handler
+  std::string changed_dn_;         // of a change: handlers may rewrite their own copy
+  Consequences consequences_;      // of an add, while it is as the client wrote it
+  bool settings_changed_ = false;  // by a change that was made
 
   // Arguments of the handler, released with the operation.
   PblockPtr parameters_;

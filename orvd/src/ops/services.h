@@ -72,6 +72,9 @@ struct Services {
   // Told of what a change that was made means for the server, inside the gate. May be empty; must
   // not throw.
   std::function<void(const Consequences&)> take_over{};
+  // Takes the settings of the file over, outside the gate and on a worker. May be empty; must not
+  // throw.
+  std::function<void()> renew_settings{};
   bool guards = true;  // the server's own, in front of the backend
   PersistentSearches persistent_searches{};
   AuditLog* audit = nullptr;  // null: changes are not recorded

@@ -5,7 +5,6 @@
 #include <new>
 #include <utility>
 
-#include "audit/record.h"
 #include "cfg/dn.h"
 #include "cfg/result_codes.h"
 #include "cfg/secret.h"
@@ -87,14 +86,8 @@ std::string describe(std::string_view name, std::string_view dn, std::string_vie
   return text;
 }
 
-// The same for a name that may hold a password: people write one into an RDN.
-std::string describe_dn(const Schema& schema, std::string_view name, std::string_view dn) {
-  std::string masked;
-  return describe(name, mask_dn(schema, dn, masked) ? masked : dn);
-}
-
 std::string describe_search(const Schema& schema, const SearchRequest& request) {
-  std::string text = describe_dn(schema, "SEARCH", request.base);
+  std::string text = describe("SEARCH", request.base);
   text += " scope=";
   append_number(text, request.scope);
   text += " filter=";
@@ -112,19 +105,11 @@ std::string describe(const Schema& schema, const Request& request) {
     std::string operator()(const UnbindRequest&) const { return "UNBIND"; }
     std::string operator()(const AbandonRequest&) const { return "ABANDON"; }
     std::string operator()(const SearchRequest& r) const { return describe_search(schema, r); }
-    std::string operator()(const AddRequest& r) const { return describe_dn(schema, "ADD", r.dn); }
-    std::string operator()(const DeleteRequest& r) const {
-      return describe_dn(schema, "DELETE", r.dn);
-    }
-    std::string operator()(const ModifyRequest& r) const {
-      return describe_dn(schema, "MODIFY", r.dn);
-    }
-    std::string operator()(const ModifyDnRequest& r) const {
-      return describe_dn(schema, "MODIFYDN", r.dn);
-    }
-    std::string operator()(const CompareRequest& r) const {
-      return describe_dn(schema, "COMPARE", r.dn);
-    }
+    std::string operator()(const AddRequest& r) const { return describe("ADD", r.dn); }
+    std::string operator()(const DeleteRequest& r) const { return describe("DELETE", r.dn); }
+    std::string operator()(const ModifyRequest& r) const { return describe("MODIFY", r.dn); }
+    std::string operator()(const ModifyDnRequest& r) const { return describe("MODIFYDN", r.dn); }
+    std::string operator()(const CompareRequest& r) const { return describe("COMPARE", r.dn); }
     std::string operator()(const ExtendedRequest& r) const {
       return describe("EXTENDED", r.oid, " oid=");
     }
@@ -133,15 +118,14 @@ std::string describe(const Schema& schema, const Request& request) {
 }
 
 // Why a change of somebody with access did not reach the backend, which tells of its own refusals.
-void tell(const Services& services, std::string_view what, std::string_view dn,
-          const Refusal& refusal) {
+void tell(Logs& logs, std::string_view what, std::string_view dn, const Refusal& refusal) {
   if (!refusal) return;
-  std::string line = describe_dn(services.schema, what, dn);
+  std::string line = describe(what, dn);
   line += " refused with ";
   append_number(line, refusal.code);
   line += ": ";
   append_client_text(line, refusal.text);
-  services.logs.warning(line);
+  logs.warning(line);
 }
 
 void wipe_credentials(BindRequest& request) noexcept {
@@ -311,12 +295,11 @@ void Session::add(std::int32_t id, const AddRequest& request) {
   std::string normal;
   Refusal refusal = refuse_change(find_target(request.dn, normal));
   const OperationPtr operation = make_operation(id, tag::add_response, 0, 0);
-  if (services_.logs.access_enabled())
-    operation->log_text = describe_dn(services_.schema, "ADD", request.dn);
+  if (services_.logs.access_enabled()) operation->log_text = describe("ADD", request.dn);
   prepare_audit(*operation, request);
   if (!refusal) {
     refusal = operation->prepare_add(services_, request, normal);
-    tell(services_, "ADD", request.dn, refusal);
+    tell(services_.logs, "ADD", request.dn, refusal);
   }
   submit(operation, refusal);
 }
@@ -325,12 +308,11 @@ void Session::remove(std::int32_t id, const DeleteRequest& request) {
   std::string normal;
   Refusal refusal = refuse_change(find_target(request.dn, normal));
   const OperationPtr operation = make_operation(id, tag::delete_response, 0, 0);
-  if (services_.logs.access_enabled())
-    operation->log_text = describe_dn(services_.schema, "DELETE", request.dn);
+  if (services_.logs.access_enabled()) operation->log_text = describe("DELETE", request.dn);
   prepare_audit(*operation, request);
   if (!refusal) {
     refusal = operation->prepare_delete(services_, normal);
-    tell(services_, "DELETE", request.dn, refusal);
+    tell(services_.logs, "DELETE", request.dn, refusal);
   }
   submit(operation, refusal);
 }
@@ -339,12 +321,11 @@ void Session::modify(std::int32_t id, const ModifyRequest& request) {
   std::string normal;
   Refusal refusal = refuse_change(find_target(request.dn, normal));
   const OperationPtr operation = make_operation(id, tag::modify_response, 0, 0);
-  if (services_.logs.access_enabled())
-    operation->log_text = describe_dn(services_.schema, "MODIFY", request.dn);
+  if (services_.logs.access_enabled()) operation->log_text = describe("MODIFY", request.dn);
   prepare_audit(*operation, request);
   if (!refusal) {
     refusal = operation->prepare_modify(services_, request, normal);
-    tell(services_, "MODIFY", request.dn, refusal);
+    tell(services_.logs, "MODIFY", request.dn, refusal);
   }
   submit(operation, refusal);
 }
@@ -428,7 +409,9 @@ void Session::work(const OperationPtr& operation) noexcept {
     return hand_back(operation, Step::hold);
   }
   operation->run(services_, false);
+  // Before the settings, which may name another audit log, or none.
   audit(*operation, true);
+  operation->renew_settings(services_);
   hand_back(operation, Step::finish);
 }
 
@@ -583,7 +566,8 @@ void Session::output_is(std::size_t unwritten) noexcept {
 
 void Session::tick() {
   pick_up_stranded();
-  if (!gone_) identity_holds();
+  // Whoever changed a password of their own, or their own roles, hears of it first.
+  if (!gone_ && !awaits_change()) identity_holds();
   if (!gone_ && listens()) look_after_persistent_searches();
 }
 
@@ -683,10 +667,9 @@ void Session::receive_bind(std::int32_t id, BindRequest& request, Refusal refusa
   take_over(request, bind->request);
   wipe_credentials(request);
   bind->refusal = std::move(refusal);
-  // They would stay outstanding for ever, and the bind would wait as long (RFC 4511, 4.2.1). It is
-  // not there yet: the end of the last of them would start it, and with luck finish it, in here.
-  end_persistent_searches();
   bind_ = std::move(bind);
+  // They would stay outstanding for ever, and the bind would wait as long (RFC 4511, 4.2.1).
+  end_persistent_searches();
   try_bind();
 }
 
@@ -784,8 +767,7 @@ void Session::finish_bind(int code, std::string_view text,
   wipe_credentials(bind->request);
   std::string what;
   if (services_.logs.access_enabled())
-    what = describe_dn(services_.schema, "BIND", bind->request.name) +
-           (bind->request.simple ? " simple" : " sasl");
+    what = describe("BIND", bind->request.name) + (bind->request.simple ? " simple" : " sasl");
   log_result(bind->message_id, what, gone_ ? kAbandoned : code, 0, bind->received);
   if (gone_) return settle_if_done();
   become(std::move(identity));
@@ -799,6 +781,12 @@ void Session::become(std::shared_ptr<const Identity> identity) noexcept {
   identity_ = std::move(identity);
   connection_.authority = identity_ ? identity_->authority : authority::no_configuration_access;
   connection_.roles = identity_ ? identity_->roles : 0;
+}
+
+bool Session::awaits_change() const noexcept {
+  return std::any_of(outstanding_.begin(), outstanding_.end(), [](const OperationPtr& operation) {
+    return operation->is_change() && !operation->held;
+  });
 }
 
 // Ends the connection when the identities were read anew and the bound one is not what it was.

@@ -187,6 +187,7 @@ class Session : public OperationHome,
   void finish_bind(int code, std::string_view text, std::shared_ptr<const Identity> identity);
   void become(std::shared_ptr<const Identity> identity) noexcept;
   bool identity_holds();
+  bool awaits_change() const noexcept;
   void settle_if_done();
 
   Services& services_;

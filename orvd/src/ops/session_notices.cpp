@@ -223,8 +223,6 @@ PersistentSearchPtr Session::persistent_search(std::int32_t message_id) const no
   return nullptr;
 }
 
-// By value: what is handed over may be an element of the list that it is taken out of.
-// NOLINTNEXTLINE(performance-unnecessary-value-param)
 void Session::end_persistent(PersistentSearchPtr search, int code, std::string_view text) {
   services_.persistent_searches.leave(*search);
   std::erase(persistent_, search);

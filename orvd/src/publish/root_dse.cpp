@@ -16,6 +16,7 @@ EntryPtr make_root_dse(const ServerFacts& facts) noexcept {
         .add("supportedFeatures", facts.supported_features)
         .add("supportedLDAPVersion", "3")
         .add("supportedSASLMechanisms", facts.sasl_mechanisms)
+        .add("orv-restartSettings", facts.restart_settings)
         .add("vendorName", facts.vendor_name)
         .add("vendorVersion", facts.vendor_version)
         .take();

@@ -22,6 +22,7 @@ struct ServerFacts {
   std::vector<std::string> sasl_mechanisms;       // empty: the attribute is absent
   std::string vendor_name;
   std::string vendor_version;
+  std::vector<std::string> restart_settings{};  // that take effect when the server starts
 };
 
 // Makes the entry; the supported controls are those registered so far. Null without memory.

@@ -82,38 +82,58 @@ struct LDAPURLDesc {
 int ldap_url_parse(const char* url, LDAPURLDesc** description);
 void ldap_free_urldesc(LDAPURLDesc* description);  // null is a no-op
 
-// ---- Declared for those who write against this interface; a program that calls what follows does
-// not link yet.
+// ---- Identities: what they are read from, and by whom, see slapi/administrators.h
 
 // Non-zero when `dn` is the master server identity of `suffix`, or of the whole server when suffix
-// is null.
+// is null. The whole server's is named by CN=MASTER SERVER,CN=CONFIGURATION; a suffix's by an entry
+// of class orv-slapdSupplier that has the suffix, itself and not one above or below it, in
+// orv-slapdMasterSuffix. Both arguments may be spelled in any way; what is no DN, and the empty DN,
+// is nobody's. 0 without memory.
 int checkMasterSrvDn(const char* suffix, const char* dn);
 
-// The server's record of an administrator's failures; lives as long as the process.
+// The server's record of an administrator's or supplier's failures; lives as long as the process.
 struct AdminPasswordRecord {
-  int changed;  // set to 1 after an accepted change of the password
+  // Set to 1 by a rule that accepted a new password. Read and cleared by the server between two
+  // calls of handlers (`settle_password_changes`).
+  int changed;
 };
-// Null for a null DN or one without a record.
+// The record of the identity with that name, spelled in any way, in the code page of the
+// configuration file. Null for a null DN, for nobody's name, and without memory.
 AdminPasswordRecord* findAdminPWDPAttrib(const char* dn);
 
-// Opens a sealed value with the key of a session handle: 1 and a malloced clear text; 0 for a clear
-// or hashed value; -1 when it is broken or the key is missing (`*clear` null).
+// ---- Stored passwords: methods and their names, see slapi/password_method.h
+
+// Opens a sealed value with the key of a session handle (`_CFG::key`): 1 and a malloced clear text,
+// which its owner wipes; 0 for a clear or hashed value; -1 when it is broken, the key is another
+// one or missing, a null argument, or no memory (`*clear` null).
 int unformat_password(const char* stored, char** clear, const void* key, int reserved);
 
-// Finds a password method by name: 0, with `*method` untouched for an unknown name; 1 when the
-// configuration forbids it. No method has the number 16.
+// Finds a password method by name, ignoring ASCII letter case: 0 with its number in `*method`; 0
+// with `*method` untouched for an unknown name and for null; 1, untouched too, for a name that the
+// configuration forbids. No method has the number 16.
 int convertPWEncryptionMethod(const char* name, int* method);
 
-// Whether a literal address is one of the host's.
+// ---- Addresses
+
+// Whether a literal address is one of the host's, on whatever interface, up or down. Read are the
+// forms of inet_pton(3), at most 64 bytes: no names, no blanks, no brackets. An IPv4-mapped IPv6
+// address is the IPv4 address. A link-local address carries a zone, the name or number of its
+// interface ("fe80::1%eth0"); no other address may. Wildcards (0.0.0.0, ::) and null are false, and
+// so is everything while the system does not tell its addresses.
 bool isValidIPAddressOnSystem(const char* address);
 
-// The backend that serves a DN, or null.
+// ---- Backends, as the server registered them (slapi/backends.h)
+
+// The backend whose suffix is the DN or the nearest above it; null when there is none, for null and
+// for what is no DN, and without memory.
 Backend* select_backend_opt(const char* dn);
 
 // A function that a backend offers to others under a number; -159 checks and stages a new password
 // method: `text` receives a malloced reason for a refusal.
 using PluginFunction = int (*)(Backend* backend, int method, char** text);
-// The functions registered under `number`, null-terminated, owned by the server. 0 or non-zero.
+// The functions that a backend offers under `number`, in the order of registration: a
+// null-terminated list of at least one, owned by the server for as long as the backend is
+// registered. 0; 80 with a null list for an unknown backend and for none.
 int getAllPluginFuncs(Backend* backend, int number, PluginFunction** list);
 
 }  // namespace orv

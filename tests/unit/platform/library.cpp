@@ -236,13 +236,15 @@ void cfg_msg_unlink(_CFG* session, _CFGMessage* record) {
 
 namespace {
 
-// "code type=value,value|code type=..."
+// "code type=value,value|code type=..."; a record without values ends with its type.
 std::string text_of(ldapmod** mods) {
+  if (mods == nullptr) return "<null>";
   std::string text;
   for (ldapmod** mod = mods; *mod != nullptr; ++mod) {
     text += (mod == mods ? "" : "|") + std::to_string((*mod)->mod_op) + " " + (*mod)->mod_type;
-    for (char** value = (*mod)->mod_vals.modv_strvals; *value != nullptr; ++value) {
-      text += (value == (*mod)->mod_vals.modv_strvals ? "=" : ",") + std::string(*value);
+    char** const values = (*mod)->mod_vals.modv_strvals;
+    for (char** value = values; value != nullptr && *value != nullptr; ++value) {
+      text += (value == values ? "=" : ",") + std::string(*value);
     }
   }
   return text;
@@ -257,6 +259,11 @@ int cfg_add_s(_CFG* session, const char* dn, ldapmod** mods) {
 
 int cfg_delete_s(_CFG* session, const char* dn) {
   const Call call("cfg_delete_s", session, dn);
+  return done(call.failure_or_no_memory().value_or(0));
+}
+
+int cfg_modify_s(_CFG* session, const char* dn, ldapmod** mods) {
+  const Call call("cfg_modify_s", session, dn, text_of(mods).c_str());
   return done(call.failure_or_no_memory().value_or(0));
 }
 

@@ -29,6 +29,7 @@
 #include "slapi/control.h"
 #include "slapi/entry.h"
 #include "slapi/pblock.h"
+#include "slapi/services.h"
 
 namespace orv {
 
@@ -64,6 +65,13 @@ struct ScriptedEntry {
 struct Answer {
   std::vector<ScriptedEntry> entries;
   int code = 0;
+};
+
+// One modification of a server's list; without values there is no array of them.
+struct ScriptedModification {
+  int code;  // with kModBvalues for counted values
+  std::string type;
+  std::optional<std::vector<std::string>> values;
 };
 
 // ---- What was seen
@@ -135,7 +143,17 @@ class Platform {
   bool failed_text_is_left = false;   // a conversion that fails by the script gives a text as well
   bool real_mutexes = false;          // mutexes are taken, and not only modelled
   bool admin_policy = false;          // pwdIsAdminPolicyOn()
-  pblock global_parameters;           // the server's own block
+  std::set<std::string> addresses;    // of the host
+  _Admin_pwdPolicy policy{};          // getGlobalAdminPWDPolicyLocal()
+  _Admin_pwdPolicy validated{};       // what validate_new_settings was last asked about
+  AdminPasswordRecord* administrator_record = nullptr;  // findAdminPWDPAttrib()
+  Backend* localhost_backend = nullptr;                 // select_backend_opt()
+  PluginFunction* plugin_functions = nullptr;           // getAllPluginFuncs()
+  std::map<std::string, int> supplied;  // checkMasterSrvDn() by suffix; others answer 0
+  std::map<std::string, std::string>
+      real_paths;                          // what realpath makes of a path; others are missing
+  std::map<std::string, int> path_errors;  // or why it fails
+  pblock global_parameters;                // the server's own block
 
   // The n-th call of a function (from 1; 0 for each) gives `result`: the code it returns, or null
   // with that error number for functions that return a pointer.
@@ -314,6 +332,11 @@ void connect(Connection& connection);
 // it, and normalised.
 entry* make_entry(const ScriptedEntry& script);
 std::string text_of(const entry& e);
+
+// Builds a server's list of modifications, for `free_ldmll`.
+ldapmod* make_modifications(const std::vector<ScriptedModification>& script);
+// "0x80 type=value,value|0x81 type", in the order of the list; values are counted ones.
+std::string text_of(const ldapmod* first);
 
 // The script of a record's attributes.
 const std::vector<ScriptedAttribute>& attributes_of(const _CFGMessage* record);

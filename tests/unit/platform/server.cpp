@@ -125,6 +125,12 @@ int kel_strcasecmp(const char* a, const char* b) {
   return strcasecmp(a, b);
 }
 
+const char* kel_strcasestr(const char* text, const char* needle) {
+  const Call call("kel_strcasestr", text, needle);
+  if (text == nullptr || needle == nullptr) return nullptr;
+  return strcasestr(text, needle);
+}
+
 bool is_string_alphanum(const char* text) {
   const Call call("is_string_alphanum", text);
   if (call.failure()) return *call.failure() != 0;
@@ -148,6 +154,35 @@ std::size_t kel_strlcat(char* target, const char* source, std::size_t size) {
   std::snprintf(target + before, size - before, "%s", source);
   if (call.failure()) return static_cast<std::size_t>(*call.failure());
   return before + std::strlen(source);
+}
+
+int kel_asprintf(char** result, const char* format, ...) {
+  const Call call("kel_asprintf", format);
+  *result = nullptr;
+  if (call.failure_or_no_memory()) return -1;
+  std::va_list arguments;
+  va_start(arguments, format);
+  const std::string text = formatted(format, arguments);
+  va_end(arguments);
+  *result = platform().give_text(Owned::text, text);
+  platform().name(*result, "text");
+  return static_cast<int>(text.size());
+}
+
+void* safe_realloc(void* memory, std::size_t size) {
+  const Call call("safe_realloc", size);
+  if (call.failure_or_no_memory()) return nullptr;
+  platform().freed(memory);
+  void* resized = __real_realloc(memory, size);
+  platform().note(resized, Owned::memory);
+  return resized;
+}
+
+// ---- Addresses
+
+bool isValidIPAddressOnSystem(const char* address) {
+  const Call call("isValidIPAddressOnSystem", address);
+  return platform().addresses.contains(address);
 }
 
 // ---- Code page: Latin-1, of which only the letter a-umlaut counts
@@ -299,6 +334,31 @@ attr* make_attribute(const char* type, berval** values) {
   return a;
 }
 
+void append_values(attr& a, berval** values) {
+  std::size_t count = 0;
+  while (values[count] != nullptr) ++count;
+  const auto before = static_cast<std::size_t>(a.count);
+  auto** all =
+      static_cast<berval**>(platform().give(Owned::part, (before + count + 1) * sizeof(berval*)));
+  for (std::size_t i = 0; i < before; ++i) all[i] = a.values[i];
+  for (std::size_t i = 0; i < count; ++i) all[before + i] = copy_of(*values[i]);
+  platform().dispose(a.values);
+  a.values = all;
+  a.count = static_cast<int>(before + count);
+}
+
+// False when the attribute has no such value.
+bool take_value(attr& a, const berval& value) {
+  berval** place = a.values;
+  while (*place != nullptr && std::strcmp((*place)->bv_val, value.bv_val) != 0) ++place;
+  if (*place == nullptr) return false;
+  platform().dispose((*place)->bv_val);
+  platform().dispose(*place);
+  for (; *place != nullptr; ++place) place[0] = place[1];
+  --a.count;
+  return true;
+}
+
 // The reference to the object class attribute, and its values in short.
 void refresh_object_classes(entry* e) {
   e->object_classes = *place_of(e, "objectClass");
@@ -367,8 +427,11 @@ int attr_merge(entry* e, const char* type, berval** values, int syntax_normalise
                   check_duplicates, old);
   if (const auto failure = call.failure_or_no_memory()) return *failure;
   attr** place = place_of(e, type);
-  if (*place != nullptr) return 20;  // scripted records name each attribute once
-  *place = make_attribute(type, values);
+  if (*place == nullptr) {
+    *place = make_attribute(type, values);
+  } else {
+    append_values(**place, values);
+  }
   refresh_object_classes(e);
   return 0;
 }
@@ -381,6 +444,25 @@ int attr_delete(entry* e, const char* type, void* old) {
   if (found == nullptr) return 1;
   *place = found->next;
   dispose_attribute(found);
+  refresh_object_classes(e);
+  return 0;
+}
+
+// Value by value: what was taken before one that is missing stays away.
+int delete_values_from_entry(entry* e, ldapmod* modification) {
+  berval** values = modification->mod_vals.modv_bvals;
+  const Call call("delete_values_from_entry", modification->mod_type, show_values(values).c_str());
+  if (const auto failure = call.failure_or_no_memory()) return *failure;
+  attr** place = place_of(e, modification->mod_type);
+  attr* found = *place;
+  if (found == nullptr) return 16;
+  for (berval** value = values; value != nullptr && *value != nullptr; ++value) {
+    if (!take_value(*found, **value)) return 16;
+  }
+  if (values == nullptr || values[0] == nullptr || found->count == 0) {
+    *place = found->next;
+    dispose_attribute(found);
+  }
   refresh_object_classes(e);
   return 0;
 }
@@ -474,18 +556,46 @@ ldapmod** EntryToLDAPMod(attr* attributes) {
   return list;
 }
 
+namespace {
+
+// Values go by the arm that the flag names.
+void dispose_modification(ldapmod* mod, Owned kind, const char* function) {
+  if ((mod->mod_op & kModBvalues) != 0) {
+    berval** const values = mod->mod_vals.modv_bvals;
+    for (berval** value = values; value != nullptr && *value != nullptr; ++value) {
+      platform().dispose((*value)->bv_val);
+      platform().dispose(*value);
+    }
+    platform().dispose(values);
+  } else {
+    char** const texts = mod->mod_vals.modv_strvals;
+    for (char** text = texts; text != nullptr && *text != nullptr; ++text) {
+      platform().dispose(*text);
+    }
+    platform().dispose(texts);
+  }
+  platform().dispose(mod->mod_type);
+  platform().take_back(mod, kind, function);
+}
+
+}  // namespace
+
 void free_ldmll(ldapmod* first) {
   const Call call("free_ldmll", first);
   while (first != nullptr) {
     ldapmod* next = first->mod_next;
-    for (char** text = first->mod_vals.modv_strvals; *text != nullptr; ++text) {
-      platform().dispose(*text);
-    }
-    platform().dispose(first->mod_vals.modv_strvals);
-    platform().dispose(first->mod_type);
-    platform().take_back(first, Owned::mods, "free_ldmll");
+    dispose_modification(first, Owned::mods, "free_ldmll");
     first = next;
   }
+}
+
+void ldap_mods_free(ldapmod** array, int free_array) {
+  const Call call("ldap_mods_free", array == nullptr ? nullptr : "list", free_array);
+  if (array == nullptr) return;
+  for (ldapmod** mod = array; *mod != nullptr; ++mod) {
+    dispose_modification(*mod, Owned::memory, "ldap_mods_free");
+  }
+  if (free_array != 0) platform().take_back(array, Owned::memory, "ldap_mods_free");
 }
 
 // ---- Pass-through authentication
@@ -522,6 +632,65 @@ bool PSearchMonitor::begin(int most) noexcept {
 bool pwdIsAdminPolicyOn() {
   const Call call("pwdIsAdminPolicyOn");
   return platform().admin_policy;
+}
+
+bool pwdIsAdminPasswordLockoutOn() {
+  const Call call("pwdIsAdminPasswordLockoutOn");
+  return call.failure().value_or(0) != 0;
+}
+
+_Admin_pwdPolicy getGlobalAdminPWDPolicyLocal() {
+  const Call call("getGlobalAdminPWDPolicyLocal");
+  return platform().policy;
+}
+
+int validate_new_settings(_Admin_pwdPolicy policy, bool check_all) {
+  const Call call("validate_new_settings", static_cast<int>(check_all));
+  platform().validated = policy;
+  return call.failure().value_or(0);
+}
+
+AdminPasswordRecord* findAdminPWDPAttrib(const char* dn) {
+  const Call call("findAdminPWDPAttrib", dn);
+  return platform().administrator_record;
+}
+
+int unformat_password(const char* stored, char** clear, const void* key, int reserved) {
+  const Call call("unformat_password", stored, key, reserved);
+  *clear = nullptr;
+  if (call.failure()) return *call.failure();
+  const std::string text = stored;
+  if (!text.starts_with("{sealed}")) return 0;
+  if (call.failure_or_no_memory()) return -1;
+  *clear = platform().give_text(Owned::text, text.substr(std::strlen("{sealed}")));
+  return 1;
+}
+
+int convertPWEncryptionMethod(const char* name, int* method) {
+  const Call call("convertPWEncryptionMethod", name, *method);
+  if (call.failure()) return *call.failure();
+  if (name != nullptr && std::string(name) == "known") *method = 3;
+  return 0;
+}
+
+Backend* select_backend_opt(const char* dn) {
+  const Call call("select_backend_opt", dn);
+  return platform().localhost_backend;
+}
+
+int getAllPluginFuncs(Backend* backend, int number, PluginFunction** list) {
+  const Call call("getAllPluginFuncs", backend, number);
+  if (call.failure()) return *call.failure();
+  *list = platform().plugin_functions;
+  return 0;
+}
+
+// A supplier of the suffixes that the script names; null for the server as a whole.
+int checkMasterSrvDn(const char* suffix, const char* dn) {
+  const Call call("checkMasterSrvDn", suffix, dn);
+  if (call.failure()) return *call.failure();
+  const auto found = platform().supplied.find(suffix == nullptr ? "" : suffix);
+  return found == platform().supplied.end() ? 0 : found->second;
 }
 
 int verify_admin_password(char* new_password, char* old_password, Operation* operation) {
@@ -640,6 +809,60 @@ entry* make_entry(const ScriptedEntry& script) {
   e->normalized_dn = platform().give_text(Owned::part, cleaned(script.dn.c_str(), true));
   fill(e, script.attributes);
   return e;
+}
+
+namespace {
+
+berval** make_values(const std::vector<std::string>& texts) {
+  auto** const values =
+      static_cast<berval**>(platform().give(Owned::value, (texts.size() + 1) * sizeof(berval*)));
+  for (std::size_t i = 0; i < texts.size(); ++i) {
+    values[i] = static_cast<berval*>(platform().give(Owned::value, sizeof(berval)));
+    values[i]->bv_len = texts[i].size();
+    values[i]->bv_val = platform().give_text(Owned::value, texts[i]);
+  }
+  return values;
+}
+
+char** make_strings(const std::vector<std::string>& texts) {
+  auto** const strings =
+      static_cast<char**>(platform().give(Owned::value, (texts.size() + 1) * sizeof(char*)));
+  for (std::size_t i = 0; i < texts.size(); ++i) {
+    strings[i] = platform().give_text(Owned::value, texts[i]);
+  }
+  return strings;
+}
+
+}  // namespace
+
+ldapmod* make_modifications(const std::vector<ScriptedModification>& script) {
+  ldapmod* first = nullptr;
+  ldapmod** place = &first;
+  for (const ScriptedModification& scripted : script) {
+    auto* const mod = static_cast<ldapmod*>(platform().give(Owned::mods, sizeof(ldapmod)));
+    mod->mod_op = scripted.code;
+    mod->mod_type = platform().give_text(Owned::part, scripted.type);
+    if (scripted.values && (scripted.code & kModBvalues) != 0) {
+      mod->mod_vals.modv_bvals = make_values(*scripted.values);
+    } else if (scripted.values) {
+      mod->mod_vals.modv_strvals = make_strings(*scripted.values);
+    }
+    *place = mod;
+    place = &mod->mod_next;
+  }
+  if (first != nullptr) platform().name(first, "modifications");
+  return first;
+}
+
+std::string text_of(const ldapmod* first) {
+  std::string text;
+  for (const ldapmod* m = first; m != nullptr; m = m->mod_next) {
+    char code[16];
+    std::snprintf(code, sizeof code, "0x%02x ", static_cast<unsigned>(m->mod_op));
+    text += (m == first ? "" : "|") + std::string(code) + m->mod_type;
+    if (m->mod_vals.modv_bvals != nullptr) text += "=" + show_values(m->mod_vals.modv_bvals);
+  }
+  return text;
 }
 
 std::string text_of(const entry& e) {

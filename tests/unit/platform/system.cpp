@@ -158,4 +158,20 @@ ssize_t __wrap_readlink(const char* path, char* buffer, std::size_t size) {
   return static_cast<ssize_t>(length);
 }
 
+char* __real_realpath(const char* path, char* resolved);
+char* __wrap_realpath(const char* path, char* resolved) {
+  if (!observed()) return __real_realpath(path, resolved);
+  const Call call("realpath", path);
+  const Platform& platform = *Platform::current();
+  const auto reason = platform.path_errors.find(path);
+  const auto found = platform.real_paths.find(path);
+  if (reason != platform.path_errors.end() || found == platform.real_paths.end()) {
+    std::strcpy(resolved, "/as/far/as/it/went");  // which it may leave there
+    errno = reason != platform.path_errors.end() ? reason->second : ENOENT;
+    return nullptr;
+  }
+  std::strcpy(resolved, found->second.c_str());
+  return resolved;
+}
+
 }  // extern "C"

@@ -1,0 +1,248 @@
+// Modify requests on their way through the server: which list the backend gets, and what a change
+// that was made means for the server before its result leaves.
+#include <algorithm>
+#include <mutex>
+#include <sstream>
+
+#include "cfg/ldapmod.h"
+#include "core_server_fixture.h"
+#include "ops/guards.h"
+
+namespace orv::server::test {
+namespace {
+
+constexpr const char* kMemberEntry = "cn=member,cn=admingroup,cn=configuration";
+
+struct Change {
+  int operation;
+  std::string type;
+  std::vector<std::string> values;
+};
+
+std::string modify_with(int id, std::string_view dn, const std::vector<Change>& changes) {
+  std::string list;
+  for (const Change& change : changes) {
+    std::string values;
+    for (const std::string& value : change.values) values += tlv(0x04, value);
+    const std::string code(1, static_cast<char>(change.operation));
+    list += tlv(0x30, tlv(0x0A, code) + tlv(0x30, tlv(0x04, change.type) + tlv(0x31, values)));
+  }
+  return message(id, tlv(0x66, tlv(0x04, dn) + tlv(0x30, list)));
+}
+
+std::string text_of(pblock* parameters) {
+  ldapmod* first = nullptr;
+  slapi_pblock_get(parameters, parameter::modifications, &first);
+  std::ostringstream text;
+  for (; first; first = first->mod_next) {
+    constexpr const char* kNames[] = {"add", "delete", "replace"};
+    text << kNames[first->operation()] << ' ' << first->mod_type;
+    for (berval** value = first->mod_vals.modv_bvals; value && *value; ++value)
+      text << ' ' << (*value)->bv_val;
+    text << "; ";
+  }
+  return text.str();
+}
+
+class ModifyServer : public LoopbackServer {
+ protected:
+  ModifyServer() {
+    settings.audit_log.clear();
+    backend.on_change = [this](pblock* parameters) {
+      {
+        const std::lock_guard lock(mutex);
+        handed_over = text_of(parameters);
+      }
+      if (in_handler) in_handler();
+      send_ldap_result(connection_of(parameters), operation_of(parameters), code, nullptr, "");
+      return code;
+    };
+  }
+  ~ModifyServer() override { stop(); }
+
+  std::string last_list() {
+    const std::lock_guard lock(mutex);
+    return handed_over;
+  }
+
+  int code = 0;  // of the handler
+  std::function<void()> in_handler;
+
+ private:
+  std::mutex mutex;
+  std::string handed_over;
+};
+
+// ---- lists
+
+TEST_F(ModifyServer, HandsOverAFoldedList) {
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  EXPECT_EQ(code_of(client, modify_with(2, kTop,
+                                        {{1, "description", {"a"}},
+                                         {2, "orv-slapdport", {"1"}},
+                                         {0, "2.5.4.13", {"b"}},
+                                         {2, "orv-slapdPort", {"2"}}})),
+            0);
+  EXPECT_EQ(last_list(), "add description b; delete description a; replace orv-slapdPort 2; ");
+}
+
+TEST_F(ModifyServer, RefusesAListThatCannotBeFoldedWithoutTheBackend) {
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  client.send(modify_with(2, kTop, {{0, "description", {"a"}}, {2, "description", {"b"}}}));
+  const std::vector<Reply> replies = client.receive_result();
+  ASSERT_FALSE(replies.empty());
+  EXPECT_EQ(replies.back().code, 53);
+  EXPECT_NE(replies.back().body.find("description"), std::string::npos);
+  stop();
+  EXPECT_EQ(backend.calls(parameter::modify_function), 0);
+}
+
+TEST_F(ModifyServer, HandsOverTheListOfAMemberInTheGroupAsItCame) {
+  start();
+  WireClient member(port());
+  bind_as(member, kMember);
+  const std::vector<Change> two{{1, "orv-slapdAdminPW", {"old"}}, {0, "orv-slapdAdminPW", {"new"}}};
+  EXPECT_EQ(code_of(member, modify_with(2, kMemberEntry, two)), 0);
+  EXPECT_EQ(last_list(), "delete orv-slapdAdminPW old; add orv-slapdAdminPW new; ");
+  EXPECT_EQ(code_of(member, modify_with(3, kTop, two)), 0);
+  EXPECT_EQ(last_list(), "add orv-slapdAdminPW new; delete orv-slapdAdminPW old; ");
+}
+
+TEST_F(ModifyServer, FoldsTheListOfThePrimaryAdministratorInTheGroup) {
+  start();
+  WireClient root(port());
+  bind_as_root(root);
+  EXPECT_EQ(code_of(root, modify_with(2, kMemberEntry,
+                                      {{1, "orv-slapdAdminRole", {"AuditAdmin"}},
+                                       {0, "orv-slapdAdminRole", {"NoAdmin"}}})),
+            0);
+  EXPECT_EQ(last_list(), "add orv-slapdAdminRole NoAdmin; delete orv-slapdAdminRole AuditAdmin; ");
+}
+
+TEST_F(ModifyServer, RefusesStructuralClassesAndNames) {
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  const char* const entry = "cn=x,cn=configuration";
+  EXPECT_EQ(code_of(client, modify_with(2, entry, {{0, "objectClass", {"orv-slapdSupplier"}}})),
+            69);
+  EXPECT_EQ(code_of(client, modify_with(3, entry, {{1, "cn", {"X"}}})), 67);
+  stop();
+  EXPECT_EQ(backend.calls(parameter::modify_function), 0);
+}
+
+TEST_F(ModifyServer, RefusesSettingsThatTheServerCouldNotStartWith) {
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  EXPECT_EQ(code_of(client, modify_with(2, kTop, {{2, "orv-slapdMaxConnections", {"0"}}})), 19);
+  EXPECT_EQ(code_of(client, modify_with(3, kTop, {{0, "orv-slapdPort", {"65536"}}})), 19);
+  EXPECT_EQ(code_of(client, modify_with(4, "cn=default,cn=log management,cn=configuration",
+                                        {{2, "orv-slapdLogLevel", {"loud"}}})),
+            19);
+  EXPECT_EQ(code_of(client, modify_with(5, kTop, {{1, "orv-slapdPort", {"65536"}}})), 0);
+  EXPECT_EQ(code_of(client, modify_with(6, "cn=default,cn=log management,cn=configuration",
+                                        {{2, "orv-slapdLogLevel", {"WARNING"}}})),
+            0);
+  stop();
+  EXPECT_EQ(backend.calls(parameter::modify_function), 2);
+}
+
+TEST_F(ModifyServer, RefusesSettingsOfTheGroupOutOfTheirPlace) {
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  const std::vector<Change> changes{{0, "objectClass", {"ORV-slapdAdminGroupSettings"}}};
+  EXPECT_EQ(code_of(client, modify_with(2, kTop, changes)), 53);
+  EXPECT_EQ(code_of(client, modify_with(3, "cn=digest,cn=configuration", changes)), 53);
+  EXPECT_EQ(code_of(client, modify_with(4, "cn=admingroup,cn=configuration", changes)), 0);
+  stop();
+  EXPECT_EQ(backend.calls(parameter::modify_function), 1);
+}
+
+int code_of_adding(const Attribute& attribute) {
+  EntryPtr added;
+  EXPECT_EQ(make_entry(builtin_schema(), {"cn=x,cn=configuration", {attribute}}, added).code, 0);
+  return guarded(GuardedChange::add, "CN=X,CN=CONFIGURATION", 0x0C, added.get()).code;
+}
+
+TEST(ValueGuards, LookAtAddedEntriesToo) {
+  EXPECT_EQ(code_of_adding({"orv-slapdLogLevel", {"loud"}}), 19);
+  EXPECT_EQ(code_of_adding({"orv-slapdLogLevel", {"Debug"}}), 0);
+  EXPECT_EQ(code_of_adding({"orv-slapdSizeLimit", {"-1"}}), 19);
+  EXPECT_EQ(code_of_adding({"objectClass", {"orv-slapdAdminGroupSettings"}}), 53);
+}
+
+// ---- settings
+
+TEST_F(ModifyServer, SettingsAreInForceWhenTheResultArrives) {
+  std::atomic<int> reloads{0};
+  reload = [&](Settings& wanted) {
+    ++reloads;
+    wanted = settings;
+    wanted.max_attributes = 1;
+    return true;
+  };
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  const std::vector<Change> two{{2, "description", {"a"}}, {2, "orv-slapdPort", {"1"}}};
+  EXPECT_EQ(code_of(client, modify_with(2, kTop, two)), 0);
+  EXPECT_EQ(reloads, 1);
+  EXPECT_EQ(code_of(client, modify_with(3, kTop, two)), 11);
+}
+
+TEST_F(ModifyServer, SettingsAreNotReadAfterAChangeThatWasRefusedOrConcernsNone) {
+  std::atomic<int> reloads{0};
+  reload = [&](Settings&) {
+    ++reloads;
+    return false;
+  };
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  code = 65;
+  EXPECT_EQ(code_of(client, modify(2, kTop, "description", "a")), 65);
+  code = 0;
+  EXPECT_EQ(code_of(client, modify(3, "cn=digest,cn=configuration", "description", "a")), 0);
+  EXPECT_EQ(reloads, 0);
+  EXPECT_EQ(
+      code_of(client, modify(4, "cn=audit,cn=log management,cn=configuration", "description", "a")),
+      0);
+  EXPECT_EQ(reloads, 1);
+}
+
+// ---- whoever changes what they are themselves
+
+TEST_F(ModifyServer, ResultOfAChangeOfOnesOwnIdentityComesBeforeTheEndOfTheConnection) {
+  std::optional<WireClient> witness;
+  std::atomic<bool> witness_ended{false};
+  // The result waits for this, and the connections were looked through meanwhile.
+  reload = [&](Settings&) {
+    const std::optional<Reply> reply = witness->receive();
+    witness_ended = reply && reply->tag == kNotice;
+    return false;
+  };
+  in_handler = [this] { authenticator.change(false); };
+  start();
+  witness.emplace(port());
+  bind_as(*witness, kMember);
+  WireClient client(port());
+  bind_as(client, kMember);
+  client.send(modify(2, kTop, "description", "a"));
+  const std::optional<Reply> result = client.receive();
+  ASSERT_TRUE(result);
+  EXPECT_NE(result->tag, kNotice);
+  EXPECT_EQ(result->code, 0);
+  EXPECT_TRUE(witness_ended);
+  const std::optional<Reply> notice = client.receive();
+  ASSERT_TRUE(notice);
+  EXPECT_EQ(notice->tag, kNotice);
+}
+
+}  // namespace
+}  // namespace orv::server::test
