@@ -428,6 +428,12 @@ const attr* find(const entry& e, const char* type) {
   return attr_find(&e, type, 0, 0);
 }
 
+std::size_t count_values(const attr& a) {
+  std::size_t count = 0;
+  while (a.values != nullptr && a.values[count] != nullptr) ++count;
+  return count;
+}
+
 // The only value that the rules look at; null when there is none.
 const char* first_value(const attr& a) {
   if (a.values == nullptr || a.values[0] == nullptr) return nullptr;
@@ -581,7 +587,7 @@ int checkAdminPolicyEntry(const char* normalized_dn, entry* e, Connection* conne
   }
   const char* const password = new_password(normalized_dn, *e);
   if (password == nullptr) return trace.exit(result::success);
-  const MallocText copy(strdup(password));
+  const ClearText copy(strdup(password));
   if (copy == nullptr) return trace.exit(result::no_memory);
   return trace.exit(verify_admin_password(copy.get(), nullptr, operation));
 }
@@ -599,9 +605,7 @@ constexpr const char* kDefaultRole =
 
 // Makes "NoAdmin" the only value. It is written over the first, which is a role and so has room.
 void leave_only_no_admin(attr& roles) {
-  std::size_t count = 0;
-  while (roles.values[count] != nullptr) ++count;
-  for (; count > 1; --count) {
+  for (std::size_t count = count_values(roles); count > 1; --count) {
     std::free(roles.values[count - 1]->bv_val);
     std::free(roles.values[count - 1]);
     roles.values[count - 1] = nullptr;
@@ -699,12 +703,6 @@ int normal_form(const char* local_dn, MallocText& dn) {
 
 // ---- The subtrees of an entry
 
-std::size_t count_values(const attr& a) {
-  std::size_t count = 0;
-  while (a.values != nullptr && a.values[count] != nullptr) ++count;
-  return count;
-}
-
 int normalize_subtrees(const attr& a, ValueList& subtrees) {
   const std::size_t count = count_values(a);
   subtrees.reset(static_cast<char**>(std::calloc(count + 1, sizeof(char*))));
@@ -798,6 +796,7 @@ int compare_with_chain(const ldtr_function_local& trace, _CFG* session, _CFGMess
   while (record_dn != nullptr) {
     const int rc = compare_with_record(trace, session, record, record_dn.get(), dn, subtrees);
     if (rc != 0) return rc;
+    record_dn.reset();
     record = cfg_next_entry(session, record);
     record_dn.reset(record == nullptr ? nullptr : cfg_get_dn(session, record));
   }
@@ -1055,14 +1054,6 @@ bool translate_values(const attr& source, attr& copy, int& rc) {
   return true;
 }
 
-void release_values(berval** values) {
-  for (berval** value = values; value != nullptr && *value != nullptr; ++value) {
-    std::free((*value)->bv_val);
-    std::free(*value);
-  }
-  std::free(values);
-}
-
 }  // namespace
 
 int xlate_attrs(attr* source, attr** result) {
@@ -1092,7 +1083,7 @@ int cleanup_attrs(attr** list) {
   while (*list != nullptr) {
     attr* const first = *list;
     *list = first->next;
-    release_values(first->values);
+    CountedValues(first->values).reset();
     std::free(first);  // its type is the source's
   }
   return trace.exit(result::success);

@@ -501,12 +501,11 @@ void release_values(berval** values) {
   if (values != nullptr) CountedValuesDeleter()(values);
 }
 
-// Makes the first delete of the whole list, whatever it deletes, store "NoAdmin" instead. The new
-// value is made before the old ones go, so that without memory the list is as it was.
+// Makes the first delete of the whole list, whatever it deletes, store "NoAdmin" instead; there is
+// one. The new value is made before the old ones go, so that without memory the list is as it was.
 int store_no_admin(ldapmod* modifications) {
   ldapmod* m = modifications;
-  while (m != nullptr && m->operation() != kModDelete) m = m->mod_next;
-  if (m == nullptr) return result::success;
+  while (m->operation() != kModDelete) m = m->mod_next;
   CountedValues values(static_cast<berval**>(std::calloc(2, sizeof(berval*))));
   if (values == nullptr) return result::no_memory;
   values.get()[0] = new_value(kNoAdminRole);
@@ -818,6 +817,7 @@ int resolve_audit_log_file(const ldtr_function_local& trace, _CFG* session, Mall
     return result::no_memory;
   }
   resolved.reset(resolve_path(file.get()));
+  file.reset();
   if (resolved != nullptr) return result::success;
   trace.debug(trace::error, kBadAuditFile);
   return result::other;
@@ -971,15 +971,6 @@ int find_holder(_CFG* session, const char* dn, const PasswordHolder& holder, Cfg
   }
   return result::no_such_object;
 }
-
-// A clear text of our own: nothing of it is left where it was.
-struct WipeDeleter {
-  void operator()(char* text) const noexcept {
-    explicit_bzero(text, std::strlen(text));
-    std::free(text);
-  }
-};
-using ClearText = std::unique_ptr<char, WipeDeleter>;
 
 // The password that the entry has. `text` is null where it has none, and otherwise borrowed from
 // one of the other two.
@@ -1181,7 +1172,6 @@ int answer(pblock* pb, ModifyRequest& request, int rc) {
 // ---- Steps 3 and 8: the schema
 
 int check_schema(ModifyRequest& request) {
-  request.text.reset();
   char* text = nullptr;
   const int rc = mod_schema_check(request.connection, request.dn, &request.modifications, &text);
   request.text.reset(text);

@@ -88,7 +88,8 @@ ldapmod* getModAttribute(const char* type, ldapmod* modifications);
 // free; null for a null or unresolvable path, and without memory.
 char* resolve_path(const char* path);
 
-// The audit log's file as the configuration file names it, for free; null when it does not.
+// The audit log's file as the configuration file names it, for free; null when it does not, or when
+// that cannot be told.
 char* get_audit_log_filename(_CFG* session);
 
 // No other log setting than that of the audit log itself names its file: 0; 53 one does; 80 a null

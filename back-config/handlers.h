@@ -61,8 +61,9 @@ int config_back_delete(pblock* pb);
 // modifications over: it may be rewritten, is released here and its parameter set to null, unless
 // it could not be read. Always answers when connection and operation are known, with a text where a
 // rule has one. When the session cannot be opened, slot and lock stay as in `config_back_add`. What
-// was made of the list for the file **is not released after a refusal or a failure** that comes
-// later than authority: the server bounds what one caller can so take.
+// was made of the list for the file **is not released after a refusal or a failure**; it is made as
+// soon as schema and authority flags let pass, before roles are asked: the server bounds what one
+// caller can so take.
 int config_back_modify(pblock* pb);
 
 }  // namespace orv

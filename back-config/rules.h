@@ -98,12 +98,24 @@ inline const char* role_named(const char* value) {
   return found == std::end(kAdminRoles) ? nullptr : *found;
 }
 
+// ---- Clear texts of our own: nothing of them is left where they were
+
+struct WipeDeleter {
+  void operator()(char* text) const noexcept {
+    if (text == nullptr) return;
+    explicit_bzero(text, std::strlen(text));
+    std::free(text);
+  }
+};
+using ClearText = std::unique_ptr<char, WipeDeleter>;
+
 // ---- Counted values of our own, released with their texts
 
+// Passwords may be among them.
 struct CountedValuesDeleter {
   void operator()(berval** values) const noexcept {
     for (berval** value = values; *value != nullptr; ++value) {
-      std::free((*value)->bv_val);
+      WipeDeleter()((*value)->bv_val);
       std::free(*value);
     }
     std::free(values);

@@ -1,43 +1,23 @@
 // Add: authority, the checks of the file, the translation of the entry, and the way of the
 // operation.
-#include "backend_test.h"
+#include "added_entry.h"
 #include "config_add.h"
 #include "function_ids.h"
 
 namespace orv {
 namespace {
 
-constexpr unsigned kPrimary = 0x0C;
-constexpr unsigned kMember = 0x14;
-constexpr const char* kConfiguration = "CN=CONFIGURATION";
 constexpr const char* kEntry = "cn=x, cn=Configuration";
-constexpr const char* kDefaultLog = "CN=DEFAULT,CN=LOG MANAGEMENT,CN=CONFIGURATION";
-constexpr const char* kAudit = "CN=AUDIT,CN=LOG MANAGEMENT,CN=CONFIGURATION";
-constexpr const char* kAdminAudit = "CN=ADMIN AUDIT,CN=LOG MANAGEMENT,CN=CONFIGURATION";
-constexpr const char* kMaster = "CN=MASTER SERVER,CN=CONFIGURATION";
-constexpr const char* kReplication = "CN=REPLICATION,CN=CONFIGURATION";
-
-using Attributes = std::vector<scripted::ScriptedAttribute>;
-
-class AddTest : public BackendTest {
+class AddTest : public AddedEntryTest {
  protected:
   AddTest() { as(kPrimary); }
-  void TearDown() override {
-    entry_free(e);
-    BackendTest::TearDown();
-  }
 
   void make(const std::string& dn, const Attributes& attributes) {
-    entry_free(e);
-    e = scripted::make_entry({dn, attributes});
-    platform.name(e, "entry");
-    pb.put(parameter::add_entry, e);
-    platform.forget();
+    AddedEntryTest::make(dn, attributes);
+    pb.put(parameter::add_entry, e.get());
   }
 
   void exists(const std::string& dn) { platform.file[dn] = {{{dn, {}}}}; }
-
-  entry* e = nullptr;
 };
 
 // ---- Who may add
@@ -45,18 +25,17 @@ class AddTest : public BackendTest {
 class AddAuthority : public AddTest {
  protected:
   int authority() {
-    return platform.run([&] { return check_add_authority(nullptr, &operation, e); });
+    return traced(function_id::check_add_authority,
+                  [&] { return check_add_authority(nullptr, &operation, e.get()); });
   }
 
   // Which of all sets of role bits let a member add an entry.
-  void expect_roles(const char* dn, const std::vector<std::string>& classes,
-                    const std::function<bool(unsigned)>& allowed) {
+  template <typename Allowed>
+  void expect_roles(const char* dn, const std::vector<std::string>& classes, Allowed allowed) {
+    SCOPED_TRACE(dn);
     make(dn, {{"objectClass", classes}});
-    as(kMember);
-    for (unsigned roles = 0; roles < 0x80; ++roles) {
-      operation.roles = roles;
-      EXPECT_EQ(authority(), allowed(roles) ? 0 : 50) << dn << " with " << roles;
-    }
+    orv::expect_roles(
+        operation, [&] { return authority(); }, allowed);
   }
 };
 
@@ -86,6 +65,17 @@ TEST_F(AddAuthority, OthersThanMembersNeedNoRole) {
   }
 }
 
+TEST_F(AddAuthority, MembersNeedARoleWhateverElseTheyAre) {
+  make(kEntry, {});
+  for (const unsigned flags : {0x14U, 0x1CU, 0x34U, 0x3CU}) {
+    as(flags);
+    operation.roles = 0x1E;
+    EXPECT_EQ(authority(), 50) << flags;
+    operation.roles = 0x20;
+    EXPECT_EQ(authority(), 0) << flags;
+  }
+}
+
 TEST_F(AddAuthority, SupplierIsLookedForUpToTheFirstMatch) {
   make(kEntry, {{"objectClass", {"top", "ORV-slapdsupplier", "x"}}});
   EXPECT_EQ(authority(), 0);
@@ -101,11 +91,18 @@ TEST_F(AddAuthority, OrdinaryEntryNeedsTheServerConfigurationRole) {
 
 TEST_F(AddAuthority, EntryWithoutObjectClassesIsOrdinary) {
   make(kEntry, {});
-  as(kMember);
+  as(kGroupMember);
   operation.roles = 0x20;
   EXPECT_EQ(authority(), 0);
   operation.roles = 0x1E;
   EXPECT_EQ(authority(), 50);
+}
+
+TEST_F(AddAuthority, EntryWhoseObjectClassesHaveNoValuesIsOrdinary) {
+  for (const bool null_list : {false, true}) {
+    platform.empty_lists_are_null = null_list;
+    expect_roles(kEntry, {}, [](unsigned roles) { return (roles & 0x20) != 0; });
+  }
 }
 
 TEST_F(AddAuthority, AuditLogsNeedTheAuditRole) {
@@ -141,7 +138,7 @@ TEST_F(AddAuthority, SupplierUnderAProtectedDnHasToPassBothRules) {
 
 TEST_F(AddAuthority, OtherSpellingsOfAProtectedDnAreTheSameEntry) {
   make("cn = Audit, cn=Log Management , cn=Configuration", {});
-  as(kMember);
+  as(kGroupMember);
   operation.roles = 0x20;
   EXPECT_EQ(authority(), 50);
   operation.roles = 0x02;
@@ -152,7 +149,7 @@ TEST_F(AddAuthority, NormalisedDnIsComparedWithoutRegardToLetterCase) {
   platform.keeps_letter_case = true;
   make(kAudit, {});
   for (char* c = e->normalized_dn; *c != '\0'; ++c) *c = static_cast<char>(std::tolower(*c));
-  as(kMember);
+  as(kGroupMember);
   operation.roles = 0x20;
   EXPECT_EQ(authority(), 50);
   operation.roles = 0x02;
@@ -177,10 +174,14 @@ class FileChecks : public AddTest {
     AddTest::TearDown();
   }
   int existence(const char* dn = "CN=X") {
-    return platform.run([&] { return checkIfExists(dn, &connection); });
+    return traced(function_id::check_if_exists, [&] { return checkIfExists(dn, &connection); });
   }
   int parent_of(const char* dn = "CN=X,CN=P") {
-    return platform.run([&] { return checkForParent(dn, &connection, &backend); });
+    return traced(function_id::check_for_parent,
+                  [&] { return checkForParent(dn, &connection, &backend); });
+  }
+  int replication_context() {
+    return traced(function_id::check_for_rep, [&] { return checkForRep(e.get()); });
   }
 };
 
@@ -250,13 +251,13 @@ TEST_F(FileChecks, OtherCodesOfTheSearchForTheParentComeBack) {
 
 TEST_F(FileChecks, ReplicationContextGives92) {
   make(kEntry, {{"objectClass", {"top", "orv-replicationContext"}}});
-  EXPECT_EQ(platform.run([&] { return checkForRep(e); }), 92);
+  EXPECT_EQ(replication_context(), 92);
   EXPECT_THAT(platform.calls(),
               ElementsAre("value_find_short_list(\"orv-replicationContext\", 22)"));
   make(kEntry, {{"objectClass", {"top", "orv-replicationContextX"}}});
-  EXPECT_EQ(platform.run([&] { return checkForRep(e); }), 0);
+  EXPECT_EQ(replication_context(), 0);
   make(kEntry, {});
-  EXPECT_EQ(platform.run([&] { return checkForRep(e); }), 0);
+  EXPECT_EQ(replication_context(), 0);
 }
 
 TEST_F(FileChecks, OnlyTheAnswer0MeansAReplicationContext) {
@@ -264,7 +265,7 @@ TEST_F(FileChecks, OnlyTheAnswer0MeansAReplicationContext) {
   for (const int answer : {1, -1, 80}) {
     platform.forget();
     platform.fail("value_find_short_list", 1, answer);
-    EXPECT_EQ(platform.run([&] { return checkForRep(e); }), 0);
+    EXPECT_EQ(replication_context(), 0);
   }
 }
 
@@ -274,7 +275,7 @@ TEST_F(FileChecks, LeaveExitRecords) {
   exists("CN=X");
   existence();
   parent_of();
-  platform.run([&] { return checkForRep(e); });
+  replication_context();
   EXPECT_THAT(platform.records(),
               ElementsAre("entry 01021700 ", "exit 01021700 68", "entry 01021800 ",
                           "exit 01021800 32", "entry 01021900 ", "exit 01021900 92"));
@@ -285,13 +286,12 @@ TEST_F(FileChecks, LeaveExitRecords) {
 class Translation : public AddTest {
  protected:
   int translate() {
-    return platform.run([&] { return xlate_attrs(e->attributes, &list); });
+    return traced(function_id::xlate_attrs, [&] { return xlate_attrs(e->attributes, &list); });
   }
   void clean() {
     EXPECT_EQ(platform.run([&] { return cleanup_attrs(&list); }), 0);
     EXPECT_EQ(list, nullptr);
-    entry_free(e);
-    e = nullptr;
+    e.reset();
     EXPECT_THAT(platform.leaks(), IsEmpty());
   }
   [[nodiscard]] std::string text() const {
@@ -424,7 +424,7 @@ TEST_F(Translation, LeavesExitRecords) {
   make(kEntry, {{"cn", {"a"}}});
   platform.fail("xlate_utf8_to_localcp", 1, 90);
   translate();
-  EXPECT_EQ(platform.records().back(), "exit 01021a00 90");
+  EXPECT_EQ(last_record(), "exit 01021a00 90");
   EXPECT_THAT(platform.records(), Contains("exit 01021b00 0"));
 }
 
@@ -438,7 +438,7 @@ class Add : public AddTest {
   }
 
   int add() {
-    return platform.run([&] { return config_back_add(&pb); });
+    return traced(function_id::config_back_add, [&] { return config_back_add(&pb); });
   }
 
   // The backend's own functions that were entered, and the platform's that are named, in order.
@@ -472,11 +472,6 @@ class Add : public AddTest {
     return steps;
   }
 
-  void expect_answered(int code, const std::string& text = "") {
-    EXPECT_THAT(platform.calls({"send_ldap_result"}),
-                ElementsAre("send_ldap_result(connection, operation, " + std::to_string(code) +
-                            ", null, \"" + text + "\")"));
-  }
   void expect_at_rest() {
     EXPECT_FALSE(locked());
     EXPECT_EQ(connection.config_session, nullptr);
@@ -599,7 +594,7 @@ TEST_F(AddMember, OtherCodesOfTheRolesAreAnsweredUnchangedWithoutText) {
   EXPECT_EQ(platform.count("ldcf_api_schema_check"), 1);
   expect_no_lock_touched();
   platform.forget();
-  as(kMember);
+  as(kGroupMember);
   EXPECT_EQ(add(), 50);
   expect_answered(50);
 }
@@ -779,7 +774,7 @@ TEST_F(Add, PasswordIsNotLookedAtWhileThePolicyIsOff) {
 
 TEST_F(Add, MemberWithoutSchemaRoleMayNotAddTheMasterServer) {
   make("cn=Master Server,cn=Configuration", {{"objectClass", {"top"}}});
-  as(kMember);
+  as(kGroupMember);
   operation.roles = 0x24;
   EXPECT_EQ(add(), 50);
   operation.roles = 0x34;
@@ -832,7 +827,16 @@ TEST_F(Add, EarlierValueThatCannotBeTranslatedIsPassedOnAsItIs) {
                           "\"0 objectClass=<null>|0 cn=x\")"));
 }
 
+TEST_F(Add, EarlierValueThatWasTranslatedInPartIsPassedOnAsItIs) {
+  platform.failed_text_is_left = true;
+  platform.fail("xlate_utf8_to_localcp", 1, 21);
+  EXPECT_EQ(add(), 0);
+  EXPECT_THAT(platform.calls({"cfg_add_s"}),
+              ElementsAre(testing::Not(testing::HasSubstr("<null>"))));
+}
+
 TEST_F(Add, DnThatCannotBeTranslatedEndsWithItsCode) {
+  platform.failed_text_is_left = true;  // what it left is not used
   platform.fail("xlate_utf8_to_localcp", 3, 21);
   EXPECT_EQ(add(), 21);
   EXPECT_EQ(platform.count("EntryToLDAPMod"), 0);
@@ -887,7 +891,7 @@ TEST_F(Add, ExitRecordsCarryTheCodeOfEveryEnd) {
   trcEvents = kTraceExit;
   const auto last = [&] {
     add();
-    return platform.records().back();
+    return last_record();
   };
   EXPECT_EQ(last(), "exit 01020100 0");
   as(0x24);

@@ -1,39 +1,22 @@
 // What an entry must be to be added: group, suppliers, Kerberos, Digest-MD5, proxy splits,
 // passwords.
-#include "backend_test.h"
+#include "added_entry.h"
 #include "config_add.h"
-#include "slapi/owners.h"
+#include "function_ids.h"
 
 namespace orv {
 namespace {
 
-constexpr const char* kConfiguration = "CN=CONFIGURATION";
-constexpr const char* kGroup = "CN=ADMINGROUP,CN=CONFIGURATION";
-constexpr const char* kMember = "CN=ONE,CN=ADMINGROUP,CN=CONFIGURATION";
-constexpr const char* kKerberos = "CN=KERBEROS,CN=CONFIGURATION";
-constexpr const char* kDigest = "CN=DIGEST,CN=CONFIGURATION";
-constexpr const char* kAudit = "CN=AUDIT,CN=LOG MANAGEMENT,CN=CONFIGURATION";
-constexpr const char* kAdminAudit = "CN=ADMIN AUDIT,CN=LOG MANAGEMENT,CN=CONFIGURATION";
-constexpr const char* kDefaultLog = "CN=DEFAULT,CN=LOG MANAGEMENT,CN=CONFIGURATION";
-constexpr const char* kProxies =
-    "CN=PROXYDB,CN=PROXY BACKENDS,CN=ORV DIRECTORY,CN=SCHEMAS,CN=CONFIGURATION";
 constexpr const char* kElsewhere = "CN=X,CN=CONFIGURATION";
-constexpr const char* kReplication = "CN=CONFIGURATION?objectclass=orv-slapdReplication";
-constexpr const char* kSuppliers = "CN=CONFIGURATION?objectclass=orv-slapdSupplier";
 
-constexpr unsigned kPrimary = 0x0C;
-constexpr unsigned kGroupMember = 0x14;
-
-class AddRules : public BackendTest {
+class AddRules : public AddedEntryTest {
  protected:
-  using Attributes = std::vector<scripted::ScriptedAttribute>;
-
   AddRules() {
     open_session();
     as(kPrimary);
     found(kConfiguration, {{"orv-slapdAdminDN", {"cn=root"}}});
-    found(kReplication, {{"orv-slapdMasterDN", {"cn=master"}}});
-    found(kSuppliers, {{"orv-slapdMasterDN", {"cn=supplier"}}});
+    found(kReplicationSearch, {{"orv-slapdMasterDN", {"cn=master"}}});
+    found(kSupplierSearch, {{"orv-slapdMasterDN", {"cn=supplier"}}});
     found(kGroup, {{"orv-slapdAdminDN", {"cn=taken"}},
                    {"orv-slapdKrbAdminDN", {"orv-kn=taken@REALM"}},
                    {"orv-slapdDigestAdminUser", {"taken"}}});
@@ -44,7 +27,7 @@ class AddRules : public BackendTest {
     EXPECT_THAT(platform.leaks(), ElementsAre("session"));
     EXPECT_EQ(platform.count("pthread_mutex_lock"), 0);
     close_session();
-    BackendTest::TearDown();
+    AddedEntryTest::TearDown();
   }
 
   void found(const std::string& base, Attributes attributes) {
@@ -52,8 +35,8 @@ class AddRules : public BackendTest {
   }
 
   // The entry to add, and the DN under which the rules are told of it.
-  void adding(const char* normalized_dn, Attributes attributes) {
-    e.reset(scripted::make_entry({normalized_dn, std::move(attributes)}));
+  void adding(const char* normalized_dn, const Attributes& attributes) {
+    make(normalized_dn, attributes);
     dn = normalized_dn;
   }
   // A member with everything that it must have, and `more`.
@@ -66,30 +49,41 @@ class AddRules : public BackendTest {
 
   // Runs a rule; none changes the entry.
   template <typename Rule>
-  int run(Rule rule) {
+  int run(std::uint32_t identifier, Rule rule) {
     platform.forget();
     const std::string before = e == nullptr ? "" : scripted::text_of(*e);
-    const int rc = platform.run(rule);
+    const int rc = traced(identifier, rule);
     EXPECT_EQ(e == nullptr ? "" : scripted::text_of(*e), before);
     return rc;
   }
   int group() {
-    return run([&] { return checkIfAdminGroupEntry(dn, e.get(), &connection, &operation); });
+    return run(function_id::check_if_admin_group_entry,
+               [&] { return checkIfAdminGroupEntry(dn, e.get(), &connection, &operation); });
   }
   int supplier() {
-    return run([&] { return checkIfReplSupplierEntry(dn, e.get(), &connection); });
+    return run(function_id::check_if_repl_supplier_entry,
+               [&] { return checkIfReplSupplierEntry(dn, e.get(), &connection); });
   }
   int kerberos() {
-    return run([&] { return checkIfKerberosEntry(dn, e.get(), &connection, &operation); });
+    return run(function_id::check_if_kerberos_entry,
+               [&] { return checkIfKerberosEntry(dn, e.get(), &connection, &operation); });
   }
   int digest() {
-    return run([&] { return checkIfDigestEntry(dn, e.get(), &connection, &operation); });
+    return run(function_id::check_if_digest_entry,
+               [&] { return checkIfDigestEntry(dn, e.get(), &connection, &operation); });
   }
   int proxy() {
-    return run([&] { return checkIfProxySplitContainer(e.get(), &connection); });
+    return run(function_id::check_if_proxy_split_container,
+               [&] { return checkIfProxySplitContainer(e.get(), &connection); });
   }
   int policy() {
-    return run([&] { return checkAdminPolicyEntry(dn, e.get(), &connection, &operation); });
+    return run(function_id::check_admin_policy_entry,
+               [&] { return checkAdminPolicyEntry(dn, e.get(), &connection, &operation); });
+  }
+  // With what the platform has been told since the last call.
+  int policy_of_the_script() {
+    return traced(function_id::check_admin_policy_entry,
+                  [&] { return checkAdminPolicyEntry(dn, e.get(), &connection, &operation); });
   }
 
   [[nodiscard]] int searches() const { return platform.count("cfg_search_s"); }
@@ -97,7 +91,6 @@ class AddRules : public BackendTest {
     return platform.calls({"value_find", "attr_find"});
   }
 
-  EntryPtr e;
   const char* dn = nullptr;
 };
 
@@ -111,35 +104,33 @@ TEST_F(AddRules, EachNullArgumentGives80AndTheText) {
   adding(kElsewhere, {});
   Connection* const c = &connection;
   Operation* const o = &operation;
-  const std::vector<std::function<int()>> attempts = {
-      [&] { return checkIfAdminGroupEntry(nullptr, e.get(), c, o); },
-      [&] { return checkIfAdminGroupEntry(dn, nullptr, c, o); },
-      [&] { return checkIfAdminGroupEntry(dn, e.get(), nullptr, o); },
-      [&] { return checkIfAdminGroupEntry(dn, e.get(), c, nullptr); },
-      [&] { return checkIfReplSupplierEntry(nullptr, e.get(), c); },
-      [&] { return checkIfReplSupplierEntry(dn, nullptr, c); },
-      [&] { return checkIfReplSupplierEntry(dn, e.get(), nullptr); },
-      [&] { return checkIfKerberosEntry(nullptr, e.get(), c, o); },
-      [&] { return checkIfKerberosEntry(dn, nullptr, c, o); },
-      [&] { return checkIfKerberosEntry(dn, e.get(), nullptr, o); },
-      [&] { return checkIfKerberosEntry(dn, e.get(), c, nullptr); },
-      [&] { return checkIfDigestEntry(nullptr, e.get(), c, o); },
-      [&] { return checkIfDigestEntry(dn, nullptr, c, o); },
-      [&] { return checkIfDigestEntry(dn, e.get(), nullptr, o); },
-      [&] { return checkIfDigestEntry(dn, e.get(), c, nullptr); },
-      [&] { return checkAdminPolicyEntry(nullptr, e.get(), c, o); },
-      [&] { return checkAdminPolicyEntry(dn, nullptr, c, o); },
-      [&] { return checkAdminPolicyEntry(dn, e.get(), nullptr, o); },
-      [&] { return checkAdminPolicyEntry(dn, e.get(), c, nullptr); }};
-  for (std::size_t i = 0; i < attempts.size(); ++i) {
-    EXPECT_EQ(run(attempts[i]), 80) << i;
-    EXPECT_THAT(platform.debug_lines(), ElementsAre(null_line())) << i;
-    EXPECT_THAT(platform.calls(), IsEmpty()) << i;
+  const auto refused = [&](std::uint32_t identifier, auto rule) {
+    EXPECT_EQ(run(identifier, rule), 80) << identifier;
+    EXPECT_THAT(platform.debug_lines(), ElementsAre(null_line())) << identifier;
+    EXPECT_THAT(platform.calls(), IsEmpty()) << identifier;
+  };
+  using Rule = int (*)(const char*, entry*, Connection*, Operation*);
+  for (const auto& [identifier, rule] :
+       {std::pair<std::uint32_t, Rule>{function_id::check_if_admin_group_entry,
+                                       checkIfAdminGroupEntry},
+        {function_id::check_if_kerberos_entry, checkIfKerberosEntry},
+        {function_id::check_if_digest_entry, checkIfDigestEntry},
+        {function_id::check_admin_policy_entry, checkAdminPolicyEntry}}) {
+    refused(identifier, [&, rule = rule] { return rule(nullptr, e.get(), c, o); });
+    refused(identifier, [&, rule = rule] { return rule(dn, nullptr, c, o); });
+    refused(identifier, [&, rule = rule] { return rule(dn, e.get(), nullptr, o); });
+    refused(identifier, [&, rule = rule] { return rule(dn, e.get(), c, nullptr); });
   }
+  constexpr std::uint32_t kSupplier = function_id::check_if_repl_supplier_entry;
+  refused(kSupplier, [&] { return checkIfReplSupplierEntry(nullptr, e.get(), c); });
+  refused(kSupplier, [&] { return checkIfReplSupplierEntry(dn, nullptr, c); });
+  refused(kSupplier, [&] { return checkIfReplSupplierEntry(dn, e.get(), nullptr); });
 }
 
 TEST_F(AddRules, NullEntryForTheProxyRuleHasATextOfItsOwn) {
-  EXPECT_EQ(run([&] { return checkIfProxySplitContainer(nullptr, &connection); }), 80);
+  EXPECT_EQ(run(function_id::check_if_proxy_split_container,
+                [&] { return checkIfProxySplitContainer(nullptr, &connection); }),
+            80);
   EXPECT_THAT(
       platform.debug_lines(),
       ElementsAre(error("CheckIfProxySplitContainer::Invalid NULL pointer passed through.\n")));
@@ -147,7 +138,9 @@ TEST_F(AddRules, NullEntryForTheProxyRuleHasATextOfItsOwn) {
 
 TEST_F(AddRules, ProxyRuleTakesNoConnectionWhereItNeedsNone) {
   adding(kElsewhere, {});
-  EXPECT_EQ(run([&] { return checkIfProxySplitContainer(e.get(), nullptr); }), 0);
+  EXPECT_EQ(run(function_id::check_if_proxy_split_container,
+                [&] { return checkIfProxySplitContainer(e.get(), nullptr); }),
+            0);
 }
 
 // ---- The administrative group: whom it concerns
@@ -166,7 +159,9 @@ TEST_F(AddRules, GroupRuleLetsOtherEntriesPassUnseen) {
 TEST_F(AddRules, LowerCaseDnsNeverMatch) {
   as(kGroupMember);
   for (const char* lower :
-       {"cn=one,cn=admingroup,cn=configuration", "cn=audit,cn=log management,cn=configuration"}) {
+       {"cn=one,cn=admingroup,cn=configuration", "cn=audit,cn=log management,cn=configuration",
+        "cn=admin audit,cn=log management,cn=configuration",
+        "cn=default,cn=log management,cn=configuration"}) {
     adding(lower, {});
     EXPECT_EQ(group(), 0) << lower;
   }
@@ -174,6 +169,11 @@ TEST_F(AddRules, LowerCaseDnsNeverMatch) {
   EXPECT_EQ(kerberos(), 0);
   adding("cn=digest,cn=configuration", {});
   EXPECT_EQ(digest(), 0);
+  adding("cn=one,cn=admingroup,cn=configuration",
+         {{"cn", {"one"}}, {"orv-slapdAdminPW", {"admin"}}, {"orv-slapdMasterPW", {"master"}}});
+  EXPECT_EQ(policy(), 0);
+  EXPECT_THAT(platform.calls({"verify_admin_password"}),
+              ElementsAre("verify_admin_password(\"master\", null, operation)"));
 }
 
 TEST_F(AddRules, LogEntriesAskMembersForTheirRights) {
@@ -332,7 +332,7 @@ TEST_F(AddRules, MembersRulesComeInTheirOrder) {
 
 TEST_F(AddRules, FailureOfOneOfTheMembersRulesEndsThem) {
   adding_member({{"orv-slapdDigestAdminUser", {"one"}}, {"orv-slapdKrbAdminDN", {"orv-kn=one"}}});
-  platform.file[kReplication].code = 3;
+  platform.file[kReplicationSearch].code = 3;
   EXPECT_EQ(group(), 3);
   EXPECT_EQ(platform.calls({"attr_find"}).size(), 1U);
   platform.file.erase(kConfiguration);
@@ -563,6 +563,9 @@ TEST_F(AddRules, SplitNameThatIsTakenIsAlsoToldInTheServerLog) {
   EXPECT_THAT(platform.calls({"is_string_alphanum", "cfg_search_s", "PrintMessage"}),
               ElementsAre("is_string_alphanum(\"taken\")", testing::HasSubstr("CN=PROXYDB"),
                           "PrintMessage(0, 8, 146)"));
+  debug_off();  // on which the server log does not depend
+  EXPECT_EQ(proxy(), 68);
+  EXPECT_EQ(platform.count("PrintMessage"), 1);
 }
 
 TEST_F(AddRules, OtherFailuresOfTheSplitNameAreNotLogged) {
@@ -589,7 +592,7 @@ TEST_F(AddRules, PasswordOfASupplierIsVerifiedUnlessItsFirstAttributeHasBothClas
   const Attributes password = {{"orv-slapdMasterPW", {"new"}}};
   const auto verified = [&](Attributes attributes) {
     attributes.push_back(password[0]);
-    adding(kElsewhere, std::move(attributes));
+    adding(kElsewhere, attributes);
     EXPECT_EQ(policy(), 0);
     return platform.count("verify_admin_password") == 1;
   };
@@ -641,10 +644,15 @@ TEST_F(AddRules, CodeOfThePolicyIsReturnedUnchanged) {
     adding(kMember, {{"orv-slapdAdminPW", {"new"}}});
     platform.forget();
     platform.fail("verify_admin_password", 1, code);
-    EXPECT_EQ(
-        platform.run([&] { return checkAdminPolicyEntry(dn, e.get(), &connection, &operation); }),
-        code);
+    EXPECT_EQ(policy_of_the_script(), code);
   }
+}
+
+TEST_F(AddRules, PolicyMayWriteOverWhatItGets) {
+  platform.password_is_overwritten = true;
+  adding(kMember, {{"orv-slapdAdminPW", {"new"}}});
+  EXPECT_EQ(policy(), 0);
+  EXPECT_STREQ(e->attributes->values[0]->bv_val, "new");
 }
 
 TEST_F(AddRules, PolicyGetsACopyThatIsReleased) {
@@ -655,8 +663,7 @@ TEST_F(AddRules, PolicyGetsACopyThatIsReleased) {
     EXPECT_EQ(platform.count("free"), 0);
     EXPECT_EQ(platform.allocations(), 1);
   });
-  EXPECT_EQ(
-      platform.run([&] { return checkAdminPolicyEntry(dn, e.get(), &connection, &operation); }), 0);
+  EXPECT_EQ(policy_of_the_script(), 0);
   EXPECT_EQ(platform.count("free"), 1);
 }
 
@@ -664,9 +671,7 @@ TEST_F(AddRules, PasswordThatCannotBeCopiedGives90) {
   adding(kMember, {{"orv-slapdAdminPW", {"new"}}});
   platform.forget();
   platform.fail_allocation(1);
-  EXPECT_EQ(
-      platform.run([&] { return checkAdminPolicyEntry(dn, e.get(), &connection, &operation); }),
-      90);
+  EXPECT_EQ(policy_of_the_script(), 90);
   EXPECT_EQ(platform.count("verify_admin_password"), 0);
 }
 
@@ -681,74 +686,24 @@ TEST_F(AddRules, NothingIsTracedWhenNotDebugging) {
 
 TEST_F(AddRules, ExitRecordsCarryTheCodes) {
   trcEvents = 0x00020000;
-  const auto last = [&] { return platform.records().back(); };
   adding(kGroup, {});
   group();
-  EXPECT_EQ(last(), "exit 01020b00 65");
+  EXPECT_EQ(last_record(), "exit 01020b00 65");
   adding(kElsewhere, {{"objectClass", {"top"}}, {"orv-slapdMasterDN", {"cn=taken"}}});
   supplier();
-  EXPECT_EQ(last(), "exit 01020c00 68");
+  EXPECT_EQ(last_record(), "exit 01020c00 68");
   adding(kKerberos, {});
   kerberos();
-  EXPECT_EQ(last(), "exit 01020d00 65");
+  EXPECT_EQ(last_record(), "exit 01020d00 65");
   adding(kDigest, {});
   digest();
-  EXPECT_EQ(last(), "exit 01020e00 65");
+  EXPECT_EQ(last_record(), "exit 01020e00 65");
   adding(kElsewhere, {{"orv-slapdProxySplitName", {"-"}}});
   proxy();
-  EXPECT_EQ(last(), "exit 01020f00 21");
-  run([&] { return checkAdminPolicyEntry(nullptr, e.get(), &connection, &operation); });
-  EXPECT_EQ(last(), "exit 01021000 80");
-}
-
-TEST_F(AddRules, ExitRecordsCarryTheCodesOfEachEnd) {
-  trcEvents = 0x00020000;
-  const auto last = [&] { return platform.records().back(); };
-  adding_member({{"orv-slapdKrbAdminDN", {"x"}}});
-  group();
-  EXPECT_EQ(last(), "exit 01020b00 80");
-  adding(kGroup, {{"objectClass", {"top"}}});
-  group();
-  EXPECT_EQ(last(), "exit 01020b00 65");
-  adding(kKerberos, {{"objectClass", {"orv-slapdKerberos"}}});
-  kerberos();
-  EXPECT_EQ(last(), "exit 01020d00 65");
-  adding(kKerberos, {{"objectClass", {"orv-slapdKerberos"}}, {"orv-slapdKrbAdminDN", {"x"}}});
-  kerberos();
-  EXPECT_EQ(last(), "exit 01020d00 80");
-  adding(kDigest, {{"objectClass", {"orv-slapdDigest"}}, {"orv-slapdDigestAdminUser", {"taken"}}});
-  digest();
-  EXPECT_EQ(last(), "exit 01020e00 68");
-  adding(kElsewhere, {{"orv-slapdProxySplitName", {"taken"}}});
-  proxy();
-  EXPECT_EQ(last(), "exit 01020f00 68");
-  as(kGroupMember);
-  adding(kAudit, {});
-  group();
-  EXPECT_EQ(last(), "exit 01020b00 50");
-  adding(kMember, {});
-  group();
-  EXPECT_EQ(last(), "exit 01020b00 50");
-  adding(kKerberos, {});
-  kerberos();
-  EXPECT_EQ(last(), "exit 01020d00 50");
-  adding(kDigest, {});
-  digest();
-  EXPECT_EQ(last(), "exit 01020e00 50");
-}
-
-TEST_F(AddRules, ExitRecordOfThePolicyCarriesItsCode) {
-  trcEvents = 0x00020000;
-  adding(kMember, {{"orv-slapdAdminPW", {"new"}}});
-  for (const int allocation : {0, 1}) {
-    platform.forget();
-    platform.fail_allocation(allocation);
-    platform.fail("verify_admin_password", 1, 19);
-    const int rc =
-        platform.run([&] { return checkAdminPolicyEntry(dn, e.get(), &connection, &operation); });
-    EXPECT_EQ(platform.records().back(), "exit 01021000 " + std::to_string(rc));
-    EXPECT_EQ(rc, allocation == 0 ? 19 : 90);
-  }
+  EXPECT_EQ(last_record(), "exit 01020f00 21");
+  dn = nullptr;
+  policy();
+  EXPECT_EQ(last_record(), "exit 01021000 80");
 }
 
 }  // namespace

@@ -1,4 +1,5 @@
 // The audit log's file is nobody else's: paths, the file's name in the settings, the guard.
+#include <algorithm>
 #include <cerrno>
 
 #include "backend_test.h"
@@ -100,6 +101,34 @@ TEST_F(ResolvedPath, OfAMissingFileEndsWithItsBuffer) {
   EXPECT_EQ(resolved(path.c_str()), path.substr(0, 4095));
 }
 
+TEST_F(ResolvedPath, BeginsWithABufferOfZerosForTheSystem) {
+  platform.real_paths["/x"] = "/y";
+  const Freed result(platform.run([&] { return resolve_path("/x"); }));
+  ASSERT_NE(result.text, nullptr);
+  EXPECT_THAT(platform.sizes, ElementsAre(4096U));
+  EXPECT_EQ(std::count(result.text, result.text + 4096, '\0'), 4096 - 2);
+}
+
+TEST_F(ResolvedPath, ReleasesItsBufferBeforeItSaysThatThereIsNone) {
+  platform.path_errors["/x"] = EACCES;
+  platform.name_allocation(1, "buffer");
+  EXPECT_EQ(resolved("/x"), "NULL");
+  EXPECT_THAT(platform.story({"free"}),
+              ElementsAre(testing::HasSubstr("realpath failed"), "free(buffer)",
+                          testing::HasSubstr("resolved file=[NULL]")));
+}
+
+TEST_F(ResolvedPath, IsTheSameWithoutTheTrace) {
+  debug_off();
+  platform.real_paths["/x"] = "/y";
+  platform.path_errors["/z"] = EACCES;
+  EXPECT_EQ(resolved("/x"), "/y");
+  EXPECT_EQ(resolved("/missing"), "/missing");
+  EXPECT_EQ(resolved("/z"), "NULL");
+  EXPECT_EQ(resolved(nullptr), "NULL");
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
+}
+
 TEST_F(ResolvedPath, LeavesAnExitRecord) {
   trcEvents = kTraceExit;
   resolved("/x");
@@ -114,10 +143,14 @@ class AuditLogFile : public AuditLogTest {
       "get_audit_log_filename: base search dn=[CN=AUDIT,CN=LOG MANAGEMENT,CN=CONFIGURATION] "
       "filter=[(objectclass=orv-auditConfig)] for attribute=[orv-slapdLog]\n");
 
-  // The name that the settings give; "NULL" for none.
-  std::string file_name() {
+  // The name that the settings give; "NULL" for none. Its exit record carries `rc`.
+  std::string file_name(int rc = 0) {
+    const std::uint32_t before = trcEvents;
+    trcEvents = before | (kTraceExit & ~kTraceEntry);
     const Freed result(
         platform.run([&] { return get_audit_log_filename(connection.config_session); }));
+    trcEvents = before;
+    EXPECT_EQ(last_record(), "exit 01031000 " + std::to_string(rc));
     return result.text == nullptr ? "NULL" : result.text;
   }
 
@@ -158,7 +191,7 @@ TEST_F(AuditLogFile, IsNoneWithoutASession) {
 }
 
 TEST_F(AuditLogFile, OfAMissingEntryIsNoneAndTold) {
-  EXPECT_EQ(file_name(), "NULL");
+  EXPECT_EQ(file_name(32), "NULL");
   EXPECT_THAT(platform.story({"cfg_perror", "cfg_msgfree"}),
               ElementsAre("debug: " + search_line.text,
                           "debug: Error - get_audit_log_filename: missing entry for "
@@ -170,7 +203,7 @@ TEST_F(AuditLogFile, OfAMissingEntryIsNoneAndTold) {
 
 TEST_F(AuditLogFile, OfASearchThatFailedIsNoneAlsoWhenItFoundSomething) {
   platform.file[kAudit] = {{{kAudit, {{"orv-slapdLog", {"/log/audit"}}}}}, 3};
-  EXPECT_EQ(file_name(), "NULL");
+  EXPECT_EQ(file_name(3), "NULL");
   EXPECT_EQ(platform.debug_lines().back(), not_read(3));
   EXPECT_EQ(platform.count("cfg_first_entry"), 0);
 }
@@ -186,7 +219,7 @@ TEST_F(AuditLogFile, OfAnEntryOfAnotherClassIsNoneWithoutAnError) {
 TEST_F(AuditLogFile, OfAnAttributeThatCannotBeReachedIsNoneAndTold) {
   audit_entry({{"orv-slapdLog", {"/log/audit"}}});
   platform.fail("cfg_get_errno", 1, 7);  // the name is there nevertheless, and released
-  EXPECT_EQ(file_name(), "NULL");
+  EXPECT_EQ(file_name(7), "NULL");
   EXPECT_THAT(
       platform.debug_lines(),
       ElementsAre(search_line,
@@ -198,7 +231,7 @@ TEST_F(AuditLogFile, OfAnAttributeThatCannotBeReachedIsNoneAndTold) {
 TEST_F(AuditLogFile, OfValuesThatCannotBeReadIsNoneAndToldAfterEverythingIsReleased) {
   audit_entry({{"orv-slapdLog", {"/log/audit"}}});
   platform.fail("cfg_get_errno", 2, 8);
-  EXPECT_EQ(file_name(), "NULL");
+  EXPECT_EQ(file_name(8), "NULL");
   EXPECT_THAT(platform.debug_lines(),
               ElementsAre(search_line,
                           error("Error - get_audit_log_filename: failed to retrieve values for "
@@ -230,17 +263,48 @@ TEST_F(AuditLogFile, OfNoAttributeNoArrayAndNoValueIsNoneWithoutAnError) {
 TEST_F(AuditLogFile, ThatCannotBeCopiedIsNoneAndTold) {
   audit_entry({{"orv-slapdLog", {"/log/audit"}}});
   platform.fail("slapi_ch_strdup", 1, 0);
-  EXPECT_EQ(file_name(), "NULL");
+  EXPECT_EQ(file_name(90), "NULL");
   ASSERT_EQ(platform.debug_lines().size(), 3U);
   expect_allocation_line(platform.debug_lines()[1], "get_audit_log_filename");
   EXPECT_EQ(platform.debug_lines()[2], not_read(90));
   EXPECT_EQ(platform.count("cfg_perror"), 1);
 }
 
+TEST_F(AuditLogFile, GivesUpWhatItReadInTheReverseOrderOfItsReading) {
+  audit_entry({{"orv-slapdLog", {"/log/audit", "/log/second"}}});
+  const auto left_at = [&](const char* function, const std::vector<std::string>& words) {
+    platform.at(function, 1, [&, words] {
+      std::vector<std::string> left = platform.leaks();
+      left.erase(std::remove(left.begin(), left.end(), "session"), left.end());
+      EXPECT_THAT(left, testing::UnorderedElementsAreArray(words));
+    });
+  };
+  left_at("cfg_memfree", {"text", "cfg_text", "cursor", "chain", "record"});  // no values
+  left_at("cfg_ber_free", {"text", "cursor", "chain", "record"});
+  left_at("cfg_msgfree", {"text", "chain", "record"});
+  EXPECT_EQ(file_name(), "/log/audit");
+  EXPECT_EQ(platform.count("cfg_msgfree"), 1);
+}
+
+TEST_F(AuditLogFile, IsReadAndReportedTheSameWayWithoutTheTrace) {
+  debug_off();
+  EXPECT_EQ(file_name(32), "NULL");
+  audit_entry({{"orv-slapdLog", {"/log/audit"}}});
+  EXPECT_EQ(file_name(), "/log/audit");
+  EXPECT_EQ(platform.count("cfg_perror"), 1);
+  for (const int nth : {1, 2}) {
+    platform.forget();
+    platform.fail("cfg_get_errno", nth, 7);
+    EXPECT_EQ(file_name(7), "NULL");
+    EXPECT_EQ(platform.count("cfg_perror"), 1);
+  }
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
+}
+
 TEST_F(AuditLogFile, LeavesAnExitRecord) {
   trcEvents = kTraceExit;
-  file_name();
-  EXPECT_THAT(platform.records(), ElementsAre("entry 01031000 ", "exit 01031000 32"));
+  file_name(32);
+  EXPECT_EQ(platform.records().front(), "entry 01031000 ");
 }
 
 // ---- checkAuditLog
@@ -256,7 +320,8 @@ class AuditLogGuard : public AuditLogTest {
 
   int check(const char* dn, const std::vector<scripted::ScriptedModification>& list) {
     ldapmod* const mods = scripted::make_modifications(list);
-    const int rc = platform.run([&] { return checkAuditLog(connection.config_session, dn, mods); });
+    const int rc =
+        traced(0x01031100, [&] { return checkAuditLog(connection.config_session, dn, mods); });
     free_ldmll(mods);
     return rc;
   }
@@ -292,6 +357,25 @@ TEST_F(AuditLogGuard, SeesThroughLinksAndRelativePartsOnBothSides) {
   EXPECT_EQ(log_to("/link"), 53);
 }
 
+TEST_F(AuditLogGuard, SeesThroughTwoDotsInTheNameOfAFileThatExists) {
+  platform.real_paths["/log/old/../audit"] = "/log/audit";
+  EXPECT_EQ(log_to("/log/old/../audit"), 53);
+}
+
+TEST_F(AuditLogGuard, SaysTheResolvedNameAndTheTypeAsItWasSpelled) {
+  platform.real_paths["/link"] = "/log/Audit";
+  platform.real_paths["/second/link"] = "/log/audit";
+  audit_entry({{"orv-slapdLog", {"/link"}}});
+  EXPECT_EQ(check(kOtherLog, {{kReplace, "ORV-slapdLog", {{"/second/link"}}}}), 53);
+  const auto lines = platform.debug_lines();
+  ASSERT_GT(lines.size(), 2U);
+  EXPECT_THAT(std::vector<DebugLine>(lines.end() - 2, lines.end()),
+              ElementsAre(detail("checkAuditLog: audit log filename=[/log/Audit] "
+                                 "value=[/log/audit] for attr=ORV-slapdLog\n"),
+                          error("Error - checkAuditLog: audit log filename /log/Audit cannot be "
+                                "used as a value for ORV-slapdLog\n")));
+}
+
 TEST_F(AuditLogGuard, ComparesFilesThatDoNotExistByTheirLiteralNames) {
   platform.real_paths.clear();
   EXPECT_EQ(log_to("/log/audit"), 53);
@@ -317,6 +401,20 @@ TEST_F(AuditLogGuard, ProtectsTheDefaultFileWhereTheSettingsNameNone) {
   EXPECT_EQ(log_to(kDefaultFile), 53);
 }
 
+TEST_F(AuditLogGuard, ProtectsTheDefaultFileWhereTheSettingsCannotBeRead) {
+  const std::pair<const char*, int> failures[] = {
+      {"cfg_search_s", 1},   {"cfg_first_entry", 1}, {"cfg_first_attribute", 1},
+      {"cfg_get_errno", 1},  {"cfg_get_errno", 2},   {"cfg_get_values", 1},
+      {"slapi_ch_strdup", 1}};
+  for (const auto& [function, nth] : failures) {
+    for (const auto& [path, expected] : {std::pair{kDefaultFile, 53}, std::pair{"/log/audit", 0}}) {
+      platform.forget();
+      platform.fail(function, nth, 7);
+      EXPECT_EQ(log_to(path), expected) << function << nth << path;
+    }
+  }
+}
+
 TEST_F(AuditLogGuard, LooksAtAddsAndReplacesOnly) {
   for (const int code :
        {kAdd, kReplace, static_cast<int>(kModAdd), static_cast<int>(kModReplace)}) {
@@ -337,9 +435,9 @@ TEST_F(AuditLogGuard, LooksAtTheLogAttributeInAnyLetterCaseAndAtNoOther) {
 TEST_F(AuditLogGuard, PassesOverAModificationWithoutAType) {
   ldapmod nameless{};
   nameless.mod_op = kModAdd;
-  EXPECT_EQ(
-      platform.run([&] { return checkAuditLog(connection.config_session, kOtherLog, &nameless); }),
-      0);
+  EXPECT_EQ(traced(0x01031100,
+                   [&] { return checkAuditLog(connection.config_session, kOtherLog, &nameless); }),
+            0);
 }
 
 TEST_F(AuditLogGuard, LooksAtTheFirstValueOnly) {
@@ -395,7 +493,7 @@ TEST_F(AuditLogGuard, MissingArgumentsGive80WithALineOfTheirOwn) {
 
 TEST_F(AuditLogGuard, WithoutASessionProtectsTheDefaultFile) {
   ldapmod* const mods = scripted::make_modifications({{kAdd, "orv-slapdLog", {{kDefaultFile}}}});
-  EXPECT_EQ(platform.run([&] { return checkAuditLog(nullptr, kOtherLog, mods); }), 53);
+  EXPECT_EQ(traced(0x01031100, [&] { return checkAuditLog(nullptr, kOtherLog, mods); }), 53);
   free_ldmll(mods);
 }
 
@@ -423,10 +521,71 @@ TEST_F(AuditLogGuard, ReleasesTheNameOfTheFileBeforeItLooksAtTheValues) {
       ElementsAre("realpath(\"/log/audit\")", "free(file name)", "realpath(\"/log/other\")"));
 }
 
+TEST_F(AuditLogGuard, ReleasesTheNameOfTheFileBeforeItSaysThatItDoesNotResolve) {
+  platform.path_errors["/log/audit"] = EACCES;
+  platform.at("slapi_ch_strdup", 1,
+              [&] { platform.name_allocation(platform.allocations() + 1, "file name"); });
+  EXPECT_EQ(log_to("/log/other"), 80);
+  const auto story = platform.story({"free"});
+  ASSERT_GT(story.size(), 2U);
+  EXPECT_EQ(story[story.size() - 2], "free(file name)");
+  EXPECT_EQ(story.back(), "debug: Error - checkAuditLog: invalid audit log filename\n");
+}
+
+TEST_F(AuditLogGuard, ReleasesEachResolvedValueBeforeTheNextOne) {
+  exists("/log/other");
+  std::size_t left = 0;
+  const auto note = [&] { left = platform.leaks().size(); };
+  const auto same = [&] { EXPECT_EQ(platform.leaks().size(), left); };
+  platform.at("realpath", 2, note);
+  platform.at("realpath", 3, same);
+  platform.at("realpath", 4, same);
+  EXPECT_EQ(check(kOtherLog, {{kAdd, "orv-slapdLog", {{"/log/audit"}}},
+                              {kAdd, "orv-slapdLog", {{"/log/other"}}},
+                              {kAdd, "orv-slapdLog", {{"/log/audit"}}}}),
+            53);
+  EXPECT_EQ(platform.count("realpath"), 4);
+}
+
+TEST_F(AuditLogGuard, DecidesTheSameWithoutTheTrace) {
+  debug_off();
+  exists("/log/other");
+  EXPECT_EQ(log_to("/log/audit"), 53);
+  EXPECT_EQ(log_to("/log/other"), 0);
+  EXPECT_EQ(check(kAudit, {{kReplace, "orv-slapdLog", {{"/log/audit"}}}}), 0);
+  EXPECT_EQ(check(nullptr, {{kAdd, "cn", {{"x"}}}}), 80);
+  EXPECT_EQ(check(kOtherLog, {}), 80);
+  platform.path_errors["/log/audit"] = EACCES;
+  EXPECT_EQ(log_to("/log/other"), 80);
+  platform.file.erase(kAudit);
+  platform.forget();
+  platform.fail("slapi_ch_strdup", 1, 0);
+  EXPECT_EQ(log_to("/log/other"), 90);
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
+}
+
+TEST_F(AuditLogGuard, EachFailingAllocationIsAnsweredAndLeaksNothing) {
+  for (const bool from_then_on : {false, true}) {
+    int nth = 0;
+    int rc = 0;
+    do {
+      platform.forget();
+      ++nth;
+      from_then_on ? platform.fail_allocations_from(nth) : platform.fail_allocation(nth);
+      rc = log_to("/log/audit");
+      EXPECT_TRUE(rc == 53 || rc == 0 || rc == 80 || rc == 90) << nth;
+      EXPECT_THAT(platform.leaks(), ElementsAre("session")) << nth;
+    } while (platform.allocations() >= nth && nth < 50);
+    EXPECT_EQ(rc, 53);
+    EXPECT_EQ(nth, 7);  // search, name, values, copy, two buffers; then none
+  }
+}
+
 TEST_F(AuditLogGuard, LeavesAnExitRecord) {
   trcEvents = kTraceExit;
   log_to("/log/audit");
-  EXPECT_EQ(platform.records().back(), "exit 01031100 53");
+  EXPECT_EQ(platform.records().front(), "entry 01031100 ");
+  EXPECT_EQ(last_record(), "exit 01031100 53");
 }
 
 }  // namespace

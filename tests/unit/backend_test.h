@@ -4,6 +4,8 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <cstdint>
+#include <cstdio>
 #include <memory>
 #include <string>
 #include <vector>
@@ -65,6 +67,20 @@ class BackendTest : public testing::Test {
     operation.bound_dn = bound_dn;
   }
 
+  // Runs a function that returns a code, and looks at its exit record: that identifier, that code.
+  template <typename Function>
+  int traced(std::uint32_t function, Function call) {
+    const std::uint32_t before = trcEvents;
+    trcEvents = before | (kTraceExit & ~kTraceEntry);
+    const int rc = platform.run(call);
+    trcEvents = before;
+    const std::vector<std::string> records = platform.records();
+    char expected[32];
+    std::snprintf(expected, sizeof expected, "exit %08x %d", function, rc);
+    EXPECT_EQ(records.empty() ? "" : records.back(), expected);
+    return rc;
+  }
+
   // A session that an earlier call has opened.
   _CFG* open_session() {
     connection.config_session = cfg_init(nullptr, 0);
@@ -77,6 +93,16 @@ class BackendTest : public testing::Test {
   }
 
   [[nodiscard]] bool locked() const { return platform.held(&state.configMutex); }
+
+  // The client was told exactly this.
+  void expect_answered(int code, const std::string& text = "") const {
+    EXPECT_THAT(platform.calls({"send_ldap_result"}),
+                ElementsAre("send_ldap_result(connection, operation, " + std::to_string(code) +
+                            ", null, \"" + text + "\")"));
+  }
+
+  // The newest entry or exit record.
+  [[nodiscard]] std::string last_record() const { return platform.records().back(); }
 
   Platform platform;
   ConfigBackendPrivate state{

@@ -2,21 +2,15 @@
 // operation.
 #include "config_delete.h"
 
-#include "backend_test.h"
+#include "added_entry.h"
 #include "config_session.h"
+#include "function_ids.h"
 #include "slapi/psearch.h"
 
 namespace orv {
 namespace {
 
-constexpr unsigned kPrimary = 0x0C;
-constexpr unsigned kMember = 0x14;
 constexpr const char* kEntry = "CN=X,CN=CONFIGURATION";
-constexpr const char* kDefaultLog = "CN=DEFAULT,CN=LOG MANAGEMENT,CN=CONFIGURATION";
-constexpr const char* kAudit = "CN=AUDIT,CN=LOG MANAGEMENT,CN=CONFIGURATION";
-constexpr const char* kAdminAudit = "CN=ADMIN AUDIT,CN=LOG MANAGEMENT,CN=CONFIGURATION";
-constexpr const char* kMaster = "CN=MASTER SERVER,CN=CONFIGURATION";
-constexpr const char* kReplication = "CN=REPLICATION,CN=CONFIGURATION";
 constexpr const char* kOwnBackend =
     "CN=CONFIGDB,CN=CONFIG BACKENDS,CN=ORV DIRECTORY,CN=SCHEMAS,CN=CONFIGURATION";
 
@@ -45,17 +39,16 @@ class DeleteAuthority : public DeleteTest {
   }
 
   int authority_over(const char* dn) {
-    return platform.run(
-        [&] { return check_delete_authority(&connection, &operation, nullptr, dn); });
+    return traced(function_id::check_delete_authority,
+                  [&] { return check_delete_authority(&connection, &operation, nullptr, dn); });
   }
 
   // Which of all sets of role bits let a member delete an entry.
-  void expect_roles(const char* dn, const std::function<bool(unsigned)>& allowed) {
-    for (unsigned roles = 0; roles < 0x80; ++roles) {
-      as(kMember);
-      operation.roles = roles;
-      EXPECT_EQ(authority_over(dn), allowed(roles) ? 0 : 50) << dn << " with " << roles;
-    }
+  template <typename Allowed>
+  void expect_roles(const char* dn, Allowed allowed) {
+    SCOPED_TRACE(dn);
+    orv::expect_roles(
+        operation, [&] { return authority_over(dn); }, allowed);
   }
 };
 
@@ -91,7 +84,7 @@ TEST_F(DeleteAuthority, ReadsTheObjectClassesAndReleasesChainThenValues) {
 }
 
 TEST_F(DeleteAuthority, MissingEntryIsToldToEveryCallerBeforeItsRoles) {
-  for (const unsigned flags : {kPrimary, kMember, 0U}) {
+  for (const unsigned flags : {kPrimary, kGroupMember, 0U}) {
     as(flags);
     EXPECT_EQ(authority_over(kEntry), 32) << flags;
   }
@@ -102,6 +95,17 @@ TEST_F(DeleteAuthority, CodeOfTheReaderIsReturned) {
   EXPECT_EQ(authority_over(kEntry), 80);
   platform.fail("slapi_ch_strdup", 2, 0);
   EXPECT_EQ(authority_over(kEntry), 90);
+}
+
+TEST_F(DeleteAuthority, ResultThatCameWithAFailureIsReleased) {
+  entry_of_file(kEntry);
+  for (const auto& [code, answer] : {std::pair{32, 32}, {3, 80}}) {
+    platform.forget();
+    platform.file[kEntry].code = code;
+    EXPECT_EQ(authority_over(kEntry), answer);
+    EXPECT_THAT(platform.calls({"cfg_first_entry", "cfg_get_values", "cfg_msgfree"}),
+                ElementsAre("cfg_msgfree(chain)"));
+  }
 }
 
 TEST_F(DeleteAuthority, FoundWithoutARecordGives32AndItsLine) {
@@ -143,6 +147,17 @@ TEST_F(DeleteAuthority, OthersThanMembersNeedNoRole) {
   }
 }
 
+TEST_F(DeleteAuthority, MembersNeedARoleWhateverElseTheyAre) {
+  entry_of_file(kEntry);
+  for (const unsigned flags : {0x14U, 0x1CU, 0x34U, 0x3CU}) {
+    as(flags);
+    operation.roles = 0x1E;
+    EXPECT_EQ(authority_over(kEntry), 50) << flags;
+    operation.roles = 0x20;
+    EXPECT_EQ(authority_over(kEntry), 0) << flags;
+  }
+}
+
 TEST_F(DeleteAuthority, OrdinaryEntryNeedsTheServerConfigurationRole) {
   entry_of_file(kEntry);
   expect_roles(kEntry, [](unsigned roles) { return (roles & 0x20) != 0; });
@@ -174,6 +189,8 @@ TEST_F(DeleteAuthority, SupplierNeedsThreeRolesTogetherUnderAnyDnAndInAnyLetterC
   for (const char* name : {"orv-slapdSupplier", "ORV-SLAPDSUPPLIER", "orv-slapdsupplier"}) {
     entry_of_file(kEntry, {"top", "orv-slapdConfigEntry", name});
     expect_roles(kEntry, [](unsigned roles) { return (roles & 0x34) == 0x34; });
+    entry_of_file(kEntry, {name, "top"});
+    expect_roles(kEntry, [](unsigned roles) { return (roles & 0x34) == 0x34; });
   }
   entry_of_file(kEntry, {"orv-slapdSupplierX"});
   expect_roles(kEntry, [](unsigned roles) { return (roles & 0x20) != 0; });
@@ -200,7 +217,7 @@ TEST_F(DeleteAuthority, EntriesBelowANamedOneAreOrdinary) {
 TEST_F(DeleteAuthority, MemberWithServerConfigurationOnlyMayDeleteReplicationButNotTheMaster) {
   entry_of_file(kReplication);
   entry_of_file(kMaster);
-  as(kMember);
+  as(kGroupMember);
   operation.roles = 0x20;
   EXPECT_EQ(authority_over(kReplication), 0);
   EXPECT_EQ(authority_over(kMaster), 50);
@@ -219,7 +236,8 @@ class Monitor : public DeleteTest {
  protected:
   Monitor() { platform.name(&monitor, "monitor"); }
   int ask() {
-    return platform.run([&] { return monitor.get_num_current_psearches(); });
+    return traced(function_id::get_num_current_psearches,
+                  [&] { return monitor.get_num_current_psearches(); });
   }
   PSearchMonitor monitor;
 };
@@ -233,6 +251,13 @@ TEST_F(Monitor, CountsUnderItsMutex) {
   EXPECT_THAT(platform.calls(),
               ElementsAre("pthread_mutex_lock(monitor)", "pthread_mutex_unlock(monitor)"));
   EXPECT_THAT(platform.debug_lines(), IsEmpty());
+}
+
+TEST_F(Monitor, CountIsThatBetweenLockingAndUnlocking) {
+  platform.at("pthread_mutex_lock", 1, [&] { monitor.begin(9); });
+  platform.at("pthread_mutex_unlock", 1, [&] { monitor.begin(9); });
+  EXPECT_EQ(ask(), 1);
+  EXPECT_EQ(ask(), 2);
 }
 
 TEST_F(Monitor, WithoutItsMutexIsSilentWithALine) {
@@ -275,7 +300,7 @@ class Delete : public DeleteTest {
   }
 
   int remove() {
-    return platform.run([&] { return config_back_delete(&pb); });
+    return traced(function_id::config_back_delete, [&] { return config_back_delete(&pb); });
   }
 
   // Persistent searches run.
@@ -289,12 +314,6 @@ class Delete : public DeleteTest {
     const auto found = pb.values.find(parameter::entry_before_delete);
     return found == pb.values.end() ? nullptr
                                     : static_cast<entry*>(const_cast<void*>(found->second.pointer));
-  }
-
-  void expect_answered(int code) {
-    EXPECT_THAT(platform.calls({"send_ldap_result"}),
-                ElementsAre("send_ldap_result(connection, operation, " + std::to_string(code) +
-                            ", null, \"\")"));
   }
 
   void expect_at_rest() {
@@ -419,7 +438,7 @@ TEST_F(Delete, OwnBackendIsAnsweredWith53InAnyLetterCase) {
 
 TEST_F(Delete, AuthorityOverTheOwnBackendComesBeforeItsRule) {
   target(kOwnBackend);
-  as(kMember);
+  as(kGroupMember);
   EXPECT_EQ(remove(), 50);
   platform.file.clear();
   EXPECT_EQ(remove(), 32);
@@ -435,7 +454,7 @@ TEST_F(Delete, AdministratorsAreForThePrimaryAdministratorOnly) {
                          "CN=ADMINGROUP,CN=CONFIGURATION,O=X", "CN=KERBEROS,CN=CONFIGURATION",
                          "CN=DIGEST,CN=CONFIGURATION"}) {
     target(dn);
-    for (const unsigned flags : {kMember, 0x04U, 0x08U, 0x10U, 0U}) {
+    for (const unsigned flags : {kGroupMember, 0x04U, 0x08U, 0x10U, 0U}) {
       platform.forget();
       as(flags);
       operation.roles = 0x3E;
@@ -453,7 +472,7 @@ TEST_F(Delete, AdministratorsAreForThePrimaryAdministratorOnly) {
 }
 
 TEST_F(Delete, KerberosAndDigestAreRecognisedAsWholeDnsAndByteForByte) {
-  as(kMember);
+  as(kGroupMember);
   operation.roles = 0x20;
   for (const char* dn :
        {"cn=kerberos,cn=configuration", "CN=KERBEROS,CN=CONFIGURATION,O=X",
@@ -466,6 +485,7 @@ TEST_F(Delete, KerberosAndDigestAreRecognisedAsWholeDnsAndByteForByte) {
 
 TEST_F(Delete, DnThatCannotBeConvertedEndsWithThatCodeAndSkipsTheRest) {
   somebody_listens();
+  platform.failed_text_is_left = true;  // what it left is not used
   platform.fail("xlate_utf8_to_localcp", 1, 21);
   EXPECT_EQ(remove(), 21);
   expect_answered(21);
@@ -525,6 +545,18 @@ TEST_F(Delete, EntryIsReadAndKeptBeforeItGoesWhileSomebodyListens) {
   ASSERT_NE(kept(), nullptr);
   EXPECT_STREQ(kept()->requested_dn, kEntry);
   entry_free(kept());
+}
+
+TEST_F(Delete, EntryIsKeptInTheOperationsOwnBlock) {
+  pblock own;
+  platform.name(&own, "own");
+  operation.parameters = &own;
+  somebody_listens();
+  EXPECT_EQ(remove(), 0);
+  EXPECT_EQ(kept(), nullptr);
+  EXPECT_THAT(platform.calls({"slapi_pblock_set"}), ElementsAre("slapi_pblock_set(own, -157, ?)"));
+  entry_free(static_cast<entry*>(
+      const_cast<void*>(own.values.at(parameter::entry_before_delete).pointer)));
 }
 
 TEST_F(Delete, EntryIsFetchedUnderTheConvertedDn) {
@@ -598,16 +630,16 @@ TEST_F(Delete, TracesTheBlockOnEntryAndTheResultOnExit) {
   platform.forget();
   as(0x24);
   remove();
-  EXPECT_EQ(platform.records().back(), "exit 01010800 50");
+  EXPECT_EQ(last_record(), "exit 01010800 50");
 }
 
 TEST_F(Delete, ExitRecordsCarryTheCodesOfAnsweredAndUnansweredDeletes) {
   trcEvents = kTraceExit;
   remove();
-  EXPECT_EQ(platform.records().back(), "exit 01010800 0");
+  EXPECT_EQ(last_record(), "exit 01010800 0");
   platform.fail("pthread_mutex_lock", 2, 22);
   remove();
-  EXPECT_EQ(platform.records().back(), "exit 01010800 80");
+  EXPECT_EQ(last_record(), "exit 01010800 80");
 }
 
 }  // namespace

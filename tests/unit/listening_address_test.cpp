@@ -1,4 +1,7 @@
 // Addresses on which the server listens: the host must have them.
+#include <sys/mman.h>
+#include <unistd.h>
+
 #include "backend_test.h"
 #include "config_modify.h"
 #include "slapi/owners.h"
@@ -25,7 +28,7 @@ class ListeningAddress : public BackendTest {
     make({{"objectClass", {"top", "orv-slapdTop"}}, {"orv-slapdIpAddress", addresses}});
   }
   int check() {
-    return platform.run([&] { return checkIPaddrs(e.get(), &text); });
+    return traced(0x01030200, [&] { return checkIPaddrs(e.get(), &text); });
   }
   char* message(int kind, const berval& value) {
     return platform.run([&] { return gen_checkIPaddrs_err(kind, &value); });
@@ -162,10 +165,34 @@ TEST_F(ListeningAddress, OnlyTwoKindsHaveATextAndTheOthersTakeNoMemory) {
   }
 }
 
+// Text at the end of memory: whoever reads on, crashes.
+class LastBytes {
+ public:
+  explicit LastBytes(const std::string& text)
+      : size_(static_cast<std::size_t>(sysconf(_SC_PAGESIZE))),
+        pages_(static_cast<char*>(
+            mmap(nullptr, 2 * size_, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0))),
+        begin_(pages_ + size_ - text.size()) {
+    mprotect(pages_ + size_, size_, PROT_NONE);
+    text.copy(begin_, text.size());
+  }
+  ~LastBytes() { munmap(pages_, 2 * size_); }
+  LastBytes(const LastBytes&) = delete;
+  LastBytes& operator=(const LastBytes&) = delete;
+
+  [[nodiscard]] char* begin() const { return begin_; }
+
+ private:
+  std::size_t size_;
+  char* pages_;
+  char* begin_;
+};
+
 TEST_F(ListeningAddress, ValueIsReadUpToItsLengthOnly) {
-  char bytes[] = {'1', '0', '.', '1', 'x', 'x'};
-  text = message(19, {4, bytes});
+  const LastBytes bytes("10.1");
+  text = message(19, {4, bytes.begin()});
   EXPECT_STREQ(text, "IP address 10.1 is not defined for this system.");
+  EXPECT_THAT(platform.sizes, ElementsAre(4U + 2));  // the copy
   expect_only_the_copy_left();
 }
 
@@ -175,6 +202,14 @@ TEST_F(ListeningAddress, LinesNeedTheDebugBit) {
   platform.fail("kel_asprintf", 1, -1);
   EXPECT_EQ(check(), 19);
   EXPECT_THAT(platform.debug_lines(), IsEmpty());
+}
+
+TEST_F(ListeningAddress, ClientIsToldTheAddressWithOrWithoutTheDebugBit) {
+  debug_off();
+  top_entry({"10.0.0.1"});
+  EXPECT_EQ(check(), 19);
+  EXPECT_STREQ(text, "IP address 10.0.0.1 is not defined for this system.");
+  expect_only_the_copy_left();
 }
 
 TEST_F(ListeningAddress, ExitRecordsCarryTheCodes) {

@@ -23,7 +23,7 @@ class ListForTheFile : public BackendTest {
   }
 
   int add(int operation, const char* type, const char* value) {
-    return platform.run([&] { return addmodifyop(&list, operation, type, value); });
+    return traced(0x01030400, [&] { return addmodifyop(&list, operation, type, value); });
   }
   // "code type=value,value" for each record; "=" only where there is an array.
   [[nodiscard]] std::vector<std::string> records() const {
@@ -49,6 +49,7 @@ TEST_F(ListForTheFile, CollectsValuesOfOneTypeAndCodeInAnyLetterCase) {
   EXPECT_EQ(add(0, "CN", "b"), 0);
   EXPECT_EQ(add(0, "Cn", "c"), 0);
   EXPECT_THAT(records(), ElementsAre("0 cn=a,b,c"));
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
 }
 
 TEST_F(ListForTheFile, KeepsCodesApartExactly) {
@@ -100,11 +101,15 @@ TEST_F(ListForTheFile, ValuesAreInTheLocalCodePageAndTypesAsTheyCame) {
 }
 
 TEST_F(ListForTheFile, GrowsByExactlyOneSlot) {
+  constexpr std::size_t kOneSlot = 2 * sizeof(void*);  // and the terminator
   for (const char* type : {"a", "b", "c"}) add(0, type, nullptr);
+  EXPECT_THAT(platform.sizes,
+              ElementsAre(kOneSlot, sizeof(ldapmod), sizeof(ldapmod), sizeof(ldapmod)));
   EXPECT_THAT(platform.calls({"safe_realloc"}),
               ElementsAre("safe_realloc(24)", "safe_realloc(32)"));
   platform.forget();
   for (const char* value : {"1", "2", "3"}) add(0, "a", value);
+  EXPECT_THAT(platform.sizes, ElementsAre(kOneSlot));
   EXPECT_THAT(platform.calls({"safe_realloc"}),
               ElementsAre("safe_realloc(24)", "safe_realloc(32)"));
   EXPECT_EQ(list[3], nullptr);
@@ -174,6 +179,13 @@ TEST_F(ListForTheFile, RecordThatCannotBeMadeLeavesTheListTerminated) {
   EXPECT_THAT(records(), ElementsAre("0 cn"));
 }
 
+TEST_F(ListForTheFile, RecordWithoutATypeIsPassedOver) {
+  platform.fail_allocation(3);
+  EXPECT_EQ(add(0, "cn", "a"), 90);
+  EXPECT_EQ(add(0, "cn", "a"), 0);
+  EXPECT_THAT(records(), ElementsAre("0 <null>", "0 cn=a"));
+}
+
 TEST_F(ListForTheFile, TextsNeedTheDebugBit) {
   debug_off();
   platform.fail_allocation(1);
@@ -204,7 +216,7 @@ class ChangedEntry : public BackendTest {
   int apply(const Script& script) {
     free_ldmll(modifications);
     modifications = scripted::make_modifications(script);
-    return platform.run([&] { return mod_entry(e.get(), &modifications); });
+    return traced(0x01030500, [&] { return mod_entry(e.get(), &modifications); });
   }
   [[nodiscard]] std::string text() const { return scripted::text_of(*e); }
 
@@ -224,6 +236,7 @@ TEST_F(ChangedEntry, TakesEachModificationInItsOrder) {
                           "delete_values_from_entry(\"cn\", \"a\")", "attr_delete(\"sn\", null)",
                           "attr_merge(\"sn\", \"d,e\", 1, 1, null)",
                           "attr_merge(\"sn\", \"f\", 1, 1, null)"));
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
 }
 
 TEST_F(ChangedEntry, EmptyListChangesNothing) {
@@ -312,6 +325,7 @@ TEST_F(ChangedEntry, UnknownCodeGives80AndTheOthersGoOn) {
   EXPECT_EQ(apply({{kDelete, "cn", {{"z"}}}, {3, "cn", std::nullopt}}), 80);
   EXPECT_EQ(apply({{kAdd, "cn", {{"c"}}}, {3, "cn", std::nullopt}}), 80);
   EXPECT_EQ(text(), "cn=x|cn=a,b,c");
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
 }
 
 TEST_F(ChangedEntry, LeavesAnExitRecord) {
@@ -347,7 +361,8 @@ class ChangeCheck : public BackendTest {
     free_ldmll(modifications);
     modifications = scripted::make_modifications(script);
     text = not_text;
-    return platform.run([&] { return mod_schema_check(&connection, dn, &modifications, &text); });
+    return traced(0x01030600,
+                  [&] { return mod_schema_check(&connection, dn, &modifications, &text); });
   }
   // The checks that were made, in their order.
   [[nodiscard]] std::vector<std::string> checks() const {
@@ -400,6 +415,7 @@ TEST_F(ChangeCheck, MissingEntryGives32WhateverTheSearchSaid) {
     EXPECT_EQ(check({}), 32);
     EXPECT_EQ(platform.count("cfg_first_entry"), 0);
     EXPECT_EQ(platform.count("cfg_msgfree"), code == 0 ? 1 : 0);
+    EXPECT_THAT(platform.debug_lines(), IsEmpty());
   }
 }
 
@@ -410,7 +426,19 @@ TEST_F(ChangeCheck, ResultThatCannotBeCountedHoldsNoEntry) {
 }
 
 TEST_F(ChangeCheck, EntryThatCannotBeTakenGives80AndIsReported) {
-  platform.fail("cfg_first_entry", 1, 5);
+  for (const std::uint32_t debug : {kTraceDebug, 0U}) {
+    trcEvents = debug;
+    platform.forget();
+    platform.fail("cfg_first_entry", 1, 5);
+    EXPECT_EQ(check({}), 80);
+    EXPECT_THAT(platform.calls({"cfg_perror", "CFGMessage2Entry", "cfg_msgfree"}),
+                ElementsAre("cfg_perror(session, \"cfg_first_entry\")", "cfg_msgfree(chain)"));
+    EXPECT_THAT(platform.debug_lines(), IsEmpty());
+  }
+}
+
+TEST_F(ChangeCheck, ErrorNumberOfTheSessionCountsAlsoBesideAnEntry) {
+  platform.fail("cfg_get_errno", 1, 5);
   EXPECT_EQ(check({}), 80);
   EXPECT_THAT(platform.calls({"cfg_perror", "CFGMessage2Entry", "cfg_msgfree"}),
               ElementsAre("cfg_perror(session, \"cfg_first_entry\")", "cfg_msgfree(chain)"));
@@ -452,6 +480,7 @@ TEST_F(ChangeCheck, FirstRefusalEndsTheChecks) {
 
   platform.forget();
   EXPECT_EQ(check({{kAdd, "objectClass", {{"orv-replicationContext"}}}}), 92);
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
   EXPECT_THAT(checks(), ElementsAre("attr_merge", "ldcf_api_schema_check", "checkReferral",
                                     "value_find_short_list"));
   EXPECT_EQ(text, nullptr);
@@ -466,6 +495,27 @@ TEST_F(ChangeCheck, AddressThatTheHostLacksGives19AndItsText) {
   connection.config_session = nullptr;
   modifications = nullptr;
   open_session();
+}
+
+TEST_F(ChangeCheck, AddressWhoseTextCannotBeMadeGives19WithoutOne) {
+  platform.fail("kel_asprintf", 1, -1);
+  EXPECT_EQ(check({{kAdd, "orv-slapdIpAddress", {{"10.0.0.1"}}}}), 19);
+  EXPECT_EQ(text, nullptr);
+}
+
+TEST_F(ChangeCheck, AddressesOfOtherEntriesAreNotLookedAt) {
+  set({{"objectClass", {"top"}}, {"orv-slapdIpAddress", {"10.0.0.1"}}});
+  EXPECT_EQ(check({{kAdd, "orv-slapdIpAddress", {{"10.0.0.2"}}}}), 0);
+  EXPECT_EQ(platform.count("isValidIPAddressOnSystem"), 0);
+}
+
+TEST_F(ChangeCheck, ClassesAreLookedAtAsTheyWouldBe) {
+  platform.addresses = {};
+  EXPECT_EQ(check({{kReplace, "objectClass", {{"top"}}}}), 0);
+  set({{"objectClass", {"top"}}, {"orv-slapdIpAddress", {"::1"}}});
+  platform.fail("kel_asprintf", 1, -1);
+  EXPECT_EQ(check({{kReplace, "objectClass", {{"orv-slapdTop"}}}}), 19);
+  EXPECT_EQ(check({{kReplace, "objectClass", {{"top", "orv-replicationContext"}}}}), 92);
 }
 
 TEST_F(ChangeCheck, AddressesAreLookedAtAsTheyWouldBe) {
@@ -510,15 +560,18 @@ TEST_F(ChangeCheck, EachFailingAllocationIsAnsweredAndLeaksNothing) {
   for (;; ++nth) {
     SCOPED_TRACE(nth);
     ASSERT_LT(nth, 100);
-    platform.forget();
-    platform.fail_allocation(nth);
-    const int rc = check({{kReplace, "cn", {{"x"}}}, {kAdd, "sn", {{"y"}}}});
+    for (const bool once : {false, true}) {
+      platform.forget();
+      once ? platform.fail_allocation(nth) : platform.fail_allocations_from(nth);
+      const int rc = check({{kReplace, "cn", {{"x"}}}, {kAdd, "sn", {{"y"}}}});
+      if (platform.allocations() < nth) break;
+      EXPECT_TRUE(rc == 90 || rc == 32) << rc;
+      EXPECT_EQ(text, nullptr);
+      free_ldmll(modifications);
+      modifications = nullptr;
+      EXPECT_THAT(platform.leaks(), ElementsAre("session"));
+    }
     if (platform.allocations() < nth) break;
-    EXPECT_TRUE(rc == 90 || rc == 32) << rc;
-    EXPECT_EQ(text, nullptr);
-    free_ldmll(modifications);
-    modifications = nullptr;
-    EXPECT_THAT(platform.leaks(), ElementsAre("session"));
   }
   EXPECT_GE(nth, 4);
 }

@@ -1,5 +1,8 @@
 // Modify: the way of the operation, who may change what, the copy that is written, the rules in
 // their order.
+#include <algorithm>
+#include <cctype>
+#include <cstring>
 #include <functional>
 
 #include "backend_test.h"
@@ -54,8 +57,9 @@ class Modify : public BackendTest {
   }
 
   int modify(const Modifications& list = kAnything) {
+    last_list_ = list;
     pb.put(parameter::modifications, scripted::make_modifications(list));
-    return platform.run([&] { return config_back_modify(&pb); });
+    return traced(0x01030100, [&] { return config_back_modify(&pb); });
   }
 
   [[nodiscard]] bool list_is_gone() const {
@@ -64,9 +68,7 @@ class Modify : public BackendTest {
 
   // Answered once, with the list released and everything at rest.
   void expect_answered(int code, const std::string& text = "") {
-    EXPECT_THAT(platform.calls({"send_ldap_result"}),
-                ElementsAre("send_ldap_result(connection, operation, " + std::to_string(code) +
-                            ", null, \"" + text + "\")"));
+    BackendTest::expect_answered(code, text);
     EXPECT_TRUE(list_is_gone());
     EXPECT_FALSE(locked());
     EXPECT_EQ(connection.config_session, nullptr);
@@ -97,18 +99,33 @@ class Modify : public BackendTest {
     return texts;
   }
 
-  // The copy of the list stays on every way but that of success.
+  // The copy of the list stays on every way but that of success: its array, its records with their
+  // types and arrays of values, and the values; and nothing else does.
   void expect_copy_left() {
-    EXPECT_EQ(platform.count("ldap_mods_free"), 0);
-    EXPECT_THAT(platform.leaks(), Not(IsEmpty()));
-    for (const std::string& word : platform.leaks()) {
-      EXPECT_TRUE(word == "memory" || word == "text") << word;
+    std::map<std::pair<int, std::string>, bool> records;
+    std::size_t values = 0;
+    for (const scripted::ScriptedModification& m : last_list_) {
+      std::string type = m.type;
+      for (char& c : type) c = static_cast<char>(std::tolower(c));
+      const std::size_t count = m.values ? m.values->size() : 0;
+      values += count;
+      records[{m.code & 0x7F, type}] |= count != 0;
     }
+    std::size_t memory = 1;
+    for (const auto& [record, has_values] : records) memory += has_values ? 3U : 2U;
+    expect_left(memory, values);
+  }
+  void expect_left(std::size_t memory, std::size_t texts) {
+    std::vector<std::string> expected(memory, "memory");
+    expected.insert(expected.end(), texts, "text");
+    EXPECT_EQ(platform.count("ldap_mods_free"), 0);
+    EXPECT_THAT(platform.leaks(), testing::UnorderedElementsAreArray(expected));
     platform.release_leaks();
   }
 
  private:
   std::string target_dn_;
+  Modifications last_list_;
 };
 
 // ---- The way of the operation
@@ -150,8 +167,9 @@ TEST_F(Modify, ParameterThatCannotBeReadGives1WithoutASession) {
     platform.fail("slapi_pblock_get", nth, -1);
     ldapmod* const mods = scripted::make_modifications(kAnything);
     pb.put(parameter::modifications, mods);
-    EXPECT_EQ(platform.run([&] { return config_back_modify(&pb); }), 1);
+    EXPECT_EQ(traced(0x01030100, [&] { return config_back_modify(&pb); }), 1);
     EXPECT_EQ(platform.count("slapi_pblock_get"), nth);
+    EXPECT_EQ(platform.count("slapi_pblock_set"), 0);
     EXPECT_EQ(platform.count("pthread_mutex_lock"), 0);
     EXPECT_EQ(platform.count("cfg_unbind"), 0);
     EXPECT_EQ(platform.count("send_ldap_result"), nth > 3 ? 1 : 0) << nth;
@@ -159,6 +177,12 @@ TEST_F(Modify, ParameterThatCannotBeReadGives1WithoutASession) {
     EXPECT_FALSE(list_is_gone());
     free_ldmll(mods);
   }
+}
+
+TEST_F(Modify, UnreadableParameterIsAnsweredWith1AndAnEmptyText) {
+  pb.values.erase(parameter::target_dn);
+  EXPECT_EQ(traced(0x01030100, [&] { return config_back_modify(&pb); }), 1);
+  BackendTest::expect_answered(1);
 }
 
 TEST_F(Modify, FailedBindGives1AnsweredAndKeepsHandleAndLock) {
@@ -184,9 +208,79 @@ TEST_F(Modify, NoHandleGives90AnsweredAndKeepsTheLock) {
 TEST_F(Modify, LockThatCannotBeTakenGives80Answered) {
   platform.fail("pthread_mutex_lock", 1, 22);
   EXPECT_EQ(modify(), 80);
-  EXPECT_EQ(platform.count("send_ldap_result"), 1);
+  BackendTest::expect_answered(80);
   EXPECT_EQ(platform.count("pthread_mutex_unlock"), 0);
+  EXPECT_EQ(platform.count("cfg_unbind"), 0);
+  EXPECT_EQ(platform.count("cfg_search_s"), 0);
   EXPECT_TRUE(list_is_gone());
+}
+
+TEST_F(Modify, SessionThatAnEarlierOperationLeftIsUsedAndUnbound) {
+  open_session();
+  EXPECT_EQ(modify(), 0);
+  EXPECT_EQ(platform.count("cfg_init"), 0);
+  expect_answered(0);
+}
+
+TEST_F(Modify, AnswersOfClosingAndSendingAreNotLookedAt) {
+  platform.fail("cfg_unbind", 1, 7);
+  platform.fail("pthread_mutex_unlock", 1, 1);
+  platform.fail("send_ldap_result", 1, 80);
+  EXPECT_EQ(modify(), 0);
+  EXPECT_EQ(connection.config_session, nullptr);
+  EXPECT_TRUE(list_is_gone());
+  platform.set_held(&state.configMutex, false);
+}
+
+TEST_F(Modify, ParameterIsClearedAfterTheListWasReleasedAndAfterTheAnswer) {
+  platform.fail("cfg_modify_s", 1, 53);
+  EXPECT_EQ(modify(), 53);
+  EXPECT_THAT(platform.calls(
+                  {"pthread_mutex_unlock", "send_ldap_result", "free_ldmll", "slapi_pblock_set"}),
+              ElementsAre("pthread_mutex_unlock(configMutex)",
+                          "send_ldap_result(connection, operation, 53, null, \"\")",
+                          "free_ldmll(modifications)", "slapi_pblock_set(90, null)"));
+  expect_copy_left();
+}
+
+TEST_F(Modify, TellsNobodyElseOfASuccess) {
+  debug_off();
+  EXPECT_EQ(modify(), 0);
+  const std::set<std::string> known = {"slapi_pblock_get",
+                                       "slapi_pblock_set",
+                                       "pthread_mutex_lock",
+                                       "pthread_mutex_unlock",
+                                       "cfg_init",
+                                       "cfg_set_option",
+                                       "cfg_bind_s",
+                                       "cfg_search_s",
+                                       "cfg_count_entries",
+                                       "cfg_first_entry",
+                                       "CFGMessage2Entry",
+                                       "attr_delete",
+                                       "attr_merge",
+                                       "ldcf_api_schema_check",
+                                       "checkReferral",
+                                       "value_find",
+                                       "value_find_short_list",
+                                       "kel_strcasecmp",
+                                       "entry_free",
+                                       "cfg_msgfree",
+                                       "safe_realloc",
+                                       "slapi_ch_strdup",
+                                       "realpath",
+                                       "cfg_perror",
+                                       "pwdIsAdminPolicyOn",
+                                       "xlate_utf8_to_localcp",
+                                       "cfg_modify_s",
+                                       "ldap_mods_free",
+                                       "cfg_unbind",
+                                       "send_ldap_result",
+                                       "free_ldmll",
+                                       "kel_strlcpy"};
+  for (const std::string& call : platform.calls()) {
+    EXPECT_TRUE(known.contains(call.substr(0, call.find('(')))) << call;
+  }
 }
 
 // ---- The schema
@@ -242,6 +336,101 @@ TEST_F(LastRole, NothingIsForgivenElsewhereOrToALaterModification) {
   }
 }
 
+TEST_F(LastRole, IsForgivenInTheGroupsContainerAndWhereverItsNameIsPartOfTheDn) {
+  for (const char* dn :
+       {"CN=ADMINGROUP,CN=CONFIGURATION", "CN=A,CN=ONE,CN=ADMINGROUP,CN=CONFIGURATION",
+        "CN=ONE,CN=ADMINGROUP,CN=CONFIGURATION,O=X"}) {
+    platform.forget();
+    target(dn, {"top"}, {{kRole, {"SchemaAdmin"}}});
+    platform.fail("ldcf_api_schema_check", 1, 65);
+    EXPECT_EQ(modify(roles_), 0) << dn;
+    EXPECT_EQ(platform.count("ldcf_api_schema_check"), 2) << dn;
+  }
+}
+
+TEST_F(LastRole, IsForgivenToEveryCallerButRefusedByAuthorityWhereThatRefuses) {
+  as(0x04);  // whom no authority rule concerns
+  platform.fail("ldcf_api_schema_check", 1, 65);
+  EXPECT_EQ(modify(roles_), 0);
+  EXPECT_EQ(platform.count("ldcf_api_schema_check"), 2);
+  for (const unsigned flags : {kMember, 0x24U, kServerSupplier}) {
+    platform.forget();
+    as(flags);
+    platform.fail("ldcf_api_schema_check", 1, 65);
+    EXPECT_EQ(modify(roles_), 50) << flags;
+    expect_answered(50);
+    EXPECT_EQ(platform.count("ldcf_api_schema_check"), 1) << flags;
+    if (flags == kMember) expect_copy_left();
+  }
+}
+
+TEST_F(LastRole, ForgivenessSkipsNoWalkOverASuppliersSuffixes) {
+  as(kServerSupplier);
+  platform.fail("ldcf_api_schema_check", 1, 65);
+  EXPECT_EQ(modify(roles_), 50);
+  EXPECT_THAT(platform.calls({"checkMasterSrvDn"}), ElementsAre("checkMasterSrvDn(null, \"\")"));
+}
+
+TEST_F(LastRole, RefusalOfTheRolesEndsBeforeTheSecondCheck) {
+  trcEvents = kTraceExit;
+  EXPECT_EQ(modify({{kAdd, kRole, {{"Wizard"}}}}), 80);
+  EXPECT_THAT(steps(), ElementsAre("schema 0", "addmodifyop 0", "root 80"));
+  expect_answered(80);
+  expect_copy_left();
+}
+
+TEST_F(LastRole, SecondCheckComesBetweenTheRolesAndTheRules) {
+  trcEvents = kTraceExit;
+  EXPECT_EQ(modify(roles_), 0);
+  EXPECT_THAT(steps(), ElementsAre("schema 0", "addmodifyop 0", "root 0", "schema 0",
+                                   "addmodifyop 0", "supplier 0", "kerberos 0", "audit log 0",
+                                   "digest 0", "proxy name 0", "encryption 0"));
+  EXPECT_EQ(written(), "2 orv-slapdAdminRole=AuditAdmin");
+}
+
+TEST_F(LastRole, CodesOfTheSecondCheckAreAnsweredUnchangedWithItsText) {
+  for (const int code : {1, 21, 65}) {
+    platform.forget();
+    platform.fail("ldcf_api_schema_check", 2, code);
+    EXPECT_EQ(modify(roles_), code);
+    expect_answered(code);
+    EXPECT_EQ(written(), "");
+    expect_copy_left();
+  }
+  platform.forget();
+  target(kOne, {"orv-slapdTop"}, {{kRole, {"SchemaAdmin"}}, {"orv-slapdIpAddress", {"192.0.2.1"}}});
+  platform.addresses = {"192.0.2.1"};
+  platform.at("isValidIPAddressOnSystem", 2, [&] { platform.addresses.clear(); });
+  EXPECT_EQ(modify(roles_), 19);
+  expect_answered(19, "IP address 192.0.2.1 is not defined for this system.");
+  expect_left(5, 1);  // the copy, and that of the address
+}
+
+TEST_F(LastRole, SecondCopyIsMadeLikeTheFirstAndOnlyItIsWritten) {
+  target(kOne, {"top"}, {{kRole, {"SchemaAdmin"}}, {"description", {"x"}}});
+  EXPECT_EQ(modify({{kReplace, kRole, {{"AuditAdmin", "SchemaAdmin"}}},
+                    {kDelete, "description", std::nullopt},
+                    {kReplace, "seeAlso", {{}}},
+                    {kReplace, "sn", {{"K\xC3\xA4se"}}}}),
+            0);
+  EXPECT_EQ(written(), "2 orv-slapdAdminRole=AuditAdmin,SchemaAdmin|1 description|2 sn=K\xE4se");
+  EXPECT_EQ(platform.count("ldap_mods_free"), 2);
+}
+
+TEST_F(LastRole, ListOfNothingToWriteIsCopiedTwice) {
+  EXPECT_EQ(modify({{kReplace, kRole, {{}}}}), 0);
+  EXPECT_EQ(written(), "<null>");
+  EXPECT_EQ(platform.count("ldcf_api_schema_check"), 2);
+}
+
+TEST_F(LastRole, WithoutAListThereIsNoFirstModification) {
+  pb.put(parameter::modifications, static_cast<const void*>(nullptr));
+  EXPECT_EQ(traced(0x01030100, [&] { return config_back_modify(&pb); }), 80);
+  platform.forget();
+  platform.fail("ldcf_api_schema_check", 1, 65);
+  EXPECT_EQ(traced(0x01030100, [&] { return config_back_modify(&pb); }), 65);
+}
+
 TEST_F(LastRole, ForgivenessAndSecondCheckKnowTheTypeInAnyLetterCase) {
   platform.fail("ldcf_api_schema_check", 1, 65);
   EXPECT_EQ(modify({{kReplace, "ORV-SLAPDADMINROLE", {{"AuditAdmin"}}}}), 0);
@@ -281,6 +470,42 @@ TEST_F(Modify, CallerWithoutAccessIsAnsweredWith50WhateverTheSchemaSays) {
   EXPECT_EQ(modify(), 50);
   expect_answered(50);
   EXPECT_EQ(platform.count("ldcf_api_schema_check"), 1);
+}
+
+TEST_F(Modify, OnlyExactly36IsKeptOut) {
+  trcEvents = kTraceExit;
+  operation.roles = 0x20;
+  for (const unsigned flags : {0x2CU, 0x34U, 0x64U, 0x124U, 0x04U, 0x20U}) {
+    platform.forget();
+    as(flags);
+    EXPECT_EQ(modify(), 0) << flags;
+  }
+  target(kDirectory);
+  platform.supplied = {{"", 1}};
+  for (const unsigned flags : {0x25U, 0x26U, 0x27U}) {
+    platform.forget();
+    as(flags);
+    EXPECT_EQ(modify({{kAdd, kSuffix, {{"O=A"}}}}), 0) << flags;
+  }
+  as(0x24);
+  EXPECT_EQ(modify(), 50);
+}
+
+TEST_F(Modify, CallerWithoutAccessIsNoSupplierAndNothingIsCopied) {
+  trcEvents = kTraceExit;
+  as(0x24);
+  EXPECT_EQ(modify(), 50);
+  EXPECT_THAT(steps(), ElementsAre("schema 0"));
+  EXPECT_EQ(platform.count("checkMasterSrvDn"), 0);
+}
+
+TEST_F(Modify, RefusalOfThePrimaryAdministratorsRuleEndsBeforeTheOthers) {
+  trcEvents = kTraceExit;
+  target(kTop);
+  EXPECT_EQ(modify({{kReplace, "orv-slapdKrbAdminDN", {{"cn=x"}}}}), 80);
+  EXPECT_THAT(steps(), ElementsAre("schema 0", "addmodifyop 0", "root 80"));
+  expect_answered(80);
+  expect_copy_left();
 }
 
 TEST_F(Modify, OthersThanAdministratorsMeetOnlyTheRules) {
@@ -393,6 +618,82 @@ TEST_F(ModifyBySupplier, RefusalOfTheSchemaSkipsTheWalkButNotTheFirstQuestion) {
   EXPECT_EQ(modify(add_a_), 21);
 }
 
+TEST_F(ModifyBySupplier, RefusalOfTheSchemaNotesTheFirstAnswerNevertheless) {
+  platform.supplied[""] = 4;
+  platform.fail("ldcf_api_schema_check", 1, 65);
+  EXPECT_EQ(modify(add_a_), 65);
+  EXPECT_EQ(operation.master_server_result, 4);
+}
+
+TEST_F(ModifyBySupplier, WalkEndsAtTheFirstOtherAttribute) {
+  EXPECT_EQ(modify({{kAdd, "description", {{"x"}}}, {kAdd, kSuffix, {{"O=A"}}}}), 50);
+  expect_answered(50);
+  EXPECT_THAT(platform.calls({"checkMasterSrvDn"}),
+              ElementsAre("checkMasterSrvDn(null, \"CN=S\")"));
+}
+
+TEST_F(ModifyBySupplier, WalkAsksForEveryModification) {
+  EXPECT_EQ(modify({{kAdd, kSuffix, {{"O=A"}}}, {kAdd, kSuffix, {{"O=X"}}}}), 50);
+  expect_answered(50);
+  EXPECT_EQ(platform.count("checkMasterSrvDn"), 3);
+  platform.forget();
+  EXPECT_EQ(modify({{kAdd, kSuffix, {{"O=A"}}}, {kAdd, kSuffix, {{"O=B"}}}}), 0);
+  EXPECT_EQ(platform.count("checkMasterSrvDn"), 3);
+  EXPECT_EQ(written(), "0 orv-slapdSuffix=O=A,O=B");
+}
+
+TEST_F(ModifyBySupplier, WalkLooksAtNoCodesAndNeedsNoValues) {
+  // The codes are looked at after the walk; each answer of the walk is noted all the same.
+  target(kDirectory, {"top"}, {{kSuffix, {"O=A"}}});
+  EXPECT_EQ(modify({{kReplace, kSuffix, {{"O=A"}}}}), 50);
+  EXPECT_EQ(operation.master_server_result, 5);
+  platform.forget();
+  EXPECT_EQ(modify({{kAdd, kSuffix, std::nullopt}}), 0);
+  EXPECT_EQ(platform.count("checkMasterSrvDn"), 1);
+  EXPECT_EQ(operation.master_server_result, 0);
+}
+
+TEST_F(ModifyBySupplier, EveryModificationMustAddToTheSuffixes) {
+  target(kDirectory, {"top"}, {{kSuffix, {"O=B"}}});
+  for (const int server : {0, 1}) {
+    platform.supplied[""] = server;
+    for (const int code : {kDelete, kReplace}) {
+      platform.forget();
+      EXPECT_EQ(modify({{kAdd, kSuffix, {{"O=A"}}}, {code, kSuffix, {{"O=B"}}}}), 50);
+      expect_answered(50);
+    }
+    platform.forget();
+    EXPECT_EQ(modify({{kAdd, kSuffix, {{"O=A"}}}}), 0);
+  }
+}
+
+TEST_F(ModifyBySupplier, EntryIsKnownByItsWholeDn) {
+  for (const std::string& dn :
+       {std::string("CN=X,") + kDirectory, kDirectory + std::string(",O=X")}) {
+    platform.forget();
+    target(dn);
+    EXPECT_EQ(modify(add_a_), 50) << dn;
+  }
+}
+
+TEST_F(ModifyBySupplier, WhoIsAlsoAnAdministratorMeetsThoseRulesToo) {
+  trcEvents = kTraceExit;
+  as(0x0D, "CN=S");
+  EXPECT_EQ(modify({{kReplace, "description", {{"x"}}}}), 50);
+  platform.forget();
+  platform.supplied[""] = 1;
+  EXPECT_EQ(modify(add_a_), 0);
+  EXPECT_THAT(steps(), Contains("root 0"));
+  platform.forget();
+  as(0x15, "CN=S");
+  EXPECT_EQ(modify(add_a_), 50);  // a member without roles
+  expect_copy_left();
+  platform.forget();
+  operation.roles = 0x20;
+  EXPECT_EQ(modify(add_a_), 0);
+  EXPECT_THAT(steps(), Contains("member 0"));
+}
+
 TEST_F(ModifyBySupplier, MeetsTheRulesButNoRoles) {
   trcEvents = kTraceExit;
   EXPECT_EQ(modify(add_a_), 0);
@@ -429,7 +730,7 @@ TEST_F(Modify, ValueThatCannotBeTranslatedEndsTheCopyWithItsCode) {
   EXPECT_EQ(modify({{kReplace, "description", {{"a", "b"}}}, {kReplace, "cn", {{"c"}}}}), 21);
   expect_answered(21);
   EXPECT_EQ(platform.count("xlate_utf8_to_localcp"), 1);
-  expect_copy_left();
+  expect_left(4, 0);  // array, record, type and the empty array of values
 }
 
 // ---- Members of the administrative group
@@ -478,6 +779,49 @@ TEST_F(ModifyByMember, ReplicationNeedsAReplicationOrTheServerConfigurationRole)
 TEST_F(ModifyByMember, BackendsNeedTheSchemaOrTheServerConfigurationRole) {
   target(kBackends);
   expect_roles([](unsigned roles) { return (roles & 0x30) != 0; });
+}
+
+TEST_F(ModifyByMember, NamedEntriesAreKnownInAnyLetterCase) {
+  // Each asks for other bits than an ordinary entry would.
+  target("cn=default,cn=log management,cn=configuration");
+  expect_roles([](unsigned roles) { return (roles & 0x22) != 0; });
+  target("cn=audit,cn=log management,cn=configuration");
+  expect_roles([](unsigned roles) { return (roles & 0x02) != 0; });
+  target("cn=orv directory,cn=schemas,cn=configuration");
+  expect_roles([](unsigned roles) { return (roles & 0x30) != 0; });
+  target("cn=master server,cn=configuration");
+  expect_roles([](unsigned roles) { return (roles & 0x34) == 0x34; });
+}
+
+TEST_F(ModifyByMember, NamedEntriesAreKnownByTheirWholeDns) {
+  for (const char* dn : {kDefaultLog, kAdminAudit, kReplication, kBackends, kMaster}) {
+    target(std::string("CN=Y,") + dn);
+    expect_roles([](unsigned roles) { return (roles & 0x20) != 0; });
+    target(dn + std::string(",O=Y"));
+    expect_roles([](unsigned roles) { return (roles & 0x20) != 0; });
+  }
+}
+
+TEST_F(ModifyByMember, TopEntryAndItsOtherEntriesAreOrdinary) {
+  for (const char* dn : {kTop, kDirectory, "CN=KERBEROS,CN=CONFIGURATION"}) {
+    target(dn);
+    expect_roles([](unsigned roles) { return (roles & 0x20) != 0; });
+  }
+}
+
+TEST_F(ModifyByMember, GroupIsFoundAnywhereInTheDn) {
+  target("CN=ONE,CN=AdminGroup,CN=CONFIGURATION,O=X");
+  expect_roles([](unsigned) { return true; });
+}
+
+TEST_F(ModifyByMember, PassThroughIsFoundAnywhereInTheDn) {
+  for (const char* dn :
+       {"CN=PASSTHROUGH AUTHENTICATION,CN=CONFIGURATION,cn=admingroup,cn=configuration",
+        "CN=P,CN=PASSTHROUGH AUTHENTICATION,CN=CONFIGURATION,cn=admingroup,"
+        "cn=configuration"}) {
+    target(dn);
+    expect_roles([](unsigned roles) { return (roles & 0x20) != 0; });
+  }
 }
 
 TEST_F(ModifyByMember, PassThroughNeedsTheServerConfigurationRoleInAnyLetterCase) {
@@ -539,6 +883,63 @@ TEST_F(ModifyByMember, WithoutRolesIsRefusedBeforeTheEntryIsRead) {
   expect_answered(50);
   EXPECT_EQ(platform.count("cfg_search_s"), 1);  // that of the schema check
   expect_copy_left();
+}
+
+TEST_F(ModifyByMember, OtherBitsAreNoRoles) {
+  operation.roles = 0x41;
+  platform.file[std::string(kEntry) + "?(objectclass=*)"] = {};
+  EXPECT_EQ(modify(), 50);  // and not 32: the entry is not read
+  EXPECT_EQ(platform.count("cfg_search_s"), 1);
+  expect_copy_left();
+}
+
+TEST_F(ModifyByMember, EntryIsReadBeforeTheRolesAreHeldAgainstIt) {
+  operation.roles = 0x02;  // not enough for this entry
+  platform.file[std::string(kEntry) + "?(objectclass=*)"] = {};
+  EXPECT_EQ(modify(), 32);
+  expect_copy_left();
+}
+
+TEST_F(ModifyByMember, RolesThatAreMissingEndBeforeTheGroupsOwnRule) {
+  trcEvents = kTraceExit;
+  target(kAudit);
+  operation.roles = 0x20;
+  EXPECT_EQ(modify(), 50);
+  EXPECT_THAT(steps(), ElementsAre("schema 0", "addmodifyop 0"));
+  expect_copy_left();
+  platform.forget();
+  operation.roles = 0x02;
+  connection.roles = 0x20;  // which only the group's own rule asks
+  EXPECT_EQ(modify(), 50);
+  EXPECT_THAT(steps(), ElementsAre("schema 0", "addmodifyop 0", "member 50"));
+  expect_copy_left();
+}
+
+TEST_F(ModifyByMember, MissingEntryIsAnsweredTheSameWayWithoutTheTrace) {
+  debug_off();
+  operation.roles = 0x20;
+  platform.file[std::string(kEntry) + "?(objectclass=*)"] = {};
+  EXPECT_EQ(modify(), 32);
+  expect_answered(32);
+  expect_copy_left();
+}
+
+TEST_F(ModifyByMember, ObjectClassesAreReleasedAlsoAfterARefusal) {
+  operation.roles = 0x02;
+  EXPECT_EQ(modify(), 50);
+  EXPECT_EQ(platform.count("cfg_value_free"), 1);
+  EXPECT_THAT(
+      platform.calls({"cfg_get_values", "cfg_value_free"}),
+      ElementsAre("cfg_get_values(session, record 1, \"OBJECTCLASS\")", "cfg_value_free()"));
+  expect_copy_left();
+}
+
+TEST_F(ModifyByMember, SupplierMayStandAnywhereAmongTheClasses) {
+  for (const std::vector<std::string>& classes :
+       {std::vector<std::string>{"orv-slapdSupplier", "top"}, {"top", "orv-slapdSupplier"}}) {
+    target(kEntry, classes);
+    expect_roles([](unsigned roles) { return (roles & 0x34) == 0x34; });
+  }
 }
 
 TEST_F(ModifyByMember, WithoutRolesMayChangeItsOwnPassword) {
@@ -702,8 +1103,106 @@ INSTANTIATE_TEST_SUITE_P(
                             21,
                             {"schema 0", "addmodifyop 0", "supplier 0", "kerberos 0", "audit log 0",
                              "digest 0", "password 0", "proxy name 0", "encryption 21"},
-                            "orv-slapdPwEncryption value is not one of the supported values."}),
+                            "orv-slapdPwEncryption value is not one of the supported values."},
+                    Refusal{"EncryptionThatIsNotAllowed",
+                            kTop,
+                            {{kReplace, "orv-slapdPwEncryption", {{"known"}}}},
+                            [](Platform& p) { p.fail("convertPWEncryptionMethod", 1, 1); },
+                            53,
+                            {"schema 0", "addmodifyop 0", "supplier 0", "kerberos 0", "audit log 0",
+                             "digest 0", "password 0", "proxy name 0", "encryption 53"},
+                            "requested orv-slapdPwEncryption value is not allowed by current "
+                            "configuration."}),
     [](const auto& instance) { return std::string(instance.param.name); });
+
+TEST_F(Modify, RulesGetTheServersListAndNotTheCopy) {
+  // The third rule and the last one see the client's bytes, the file its own.
+  target(kTop);
+  EXPECT_EQ(modify({{kReplace, "orv-slapdLog", {{"/K\xC3\xA4se"}}},
+                    {kReplace, "orv-slapdPwEncryption", {{"K\xC3\xA4se"}}}}),
+            21);
+  EXPECT_THAT(platform.calls({"realpath"}), Contains("realpath(\"/K\xC3\xA4se\")"));
+  EXPECT_THAT(platform.calls({"convertPWEncryptionMethod"}),
+              ElementsAre("convertPWEncryptionMethod(\"K\xC3\xA4se\", 16)"));
+  expect_copy_left();
+}
+
+TEST_F(Modify, AuditLogMayBeGivenTheFileThatItHas) {
+  platform.file[std::string(kAudit) + "?(objectclass=orv-auditConfig)"] = {
+      {{kAudit, {{"orv-slapdLog", {"/log/audit"}}}}}};
+  target(kAudit);
+  EXPECT_EQ(modify({{kReplace, "orv-slapdLog", {{"/log/audit"}}}}), 0);
+  EXPECT_EQ(written(), "2 orv-slapdLog=/log/audit");
+  platform.forget();
+  target(kDefaultLog);
+  EXPECT_EQ(modify({{kReplace, "orv-slapdLog", {{"/log/audit"}}}}), 53);
+  expect_copy_left();
+}
+
+TEST_F(Modify, RulesAskTheOperationAndTheConnectionEachForItsOwn) {
+  // The connection's flags count for the master server, the operation's for the Kerberos entry.
+  as(0x04);
+  connection.authority = kMember;
+  target(kMaster);
+  EXPECT_EQ(modify(), 50);
+  expect_copy_left();
+  target("CN=KERBEROS,CN=CONFIGURATION");
+  connection.authority = kPrimary;
+  EXPECT_EQ(modify({{kDelete, "orv-slapdKrbAdminDN", std::nullopt}}), 16);
+  target("CN=KERBEROS,CN=CONFIGURATION", {"top"}, {{"orv-slapdKrbAdminDN", {"orv-kn=a"}}});
+  EXPECT_EQ(modify({{kDelete, "orv-slapdKrbAdminDN", std::nullopt}}), 50);
+  platform.release_leaks();
+  as(kPrimary);
+  connection.authority = 0x24;
+  EXPECT_EQ(modify({{kDelete, "orv-slapdKrbAdminDN", std::nullopt}}), 0);
+}
+
+TEST_F(Modify, PasswordsAreVerifiedForTheOperationOnlyWhileThePolicyIsOn) {
+  target(kTop, {"top"}, {{"orv-slapdAdminPW", {"old"}}, {"orv-slapdAdminDN", {"cn=root"}}});
+  const Modifications list = {{kReplace, "orv-slapdAdminPW", {{"new"}}}};
+  EXPECT_EQ(modify(list), 0);
+  EXPECT_EQ(platform.count("verify_admin_password"), 0);
+  platform.admin_policy = true;
+  EXPECT_EQ(modify(list), 0);
+  EXPECT_THAT(platform.calls({"verify_admin_password"}),
+              ElementsAre("verify_admin_password(\"new\", \"old\", operation)"));
+}
+
+TEST_F(Modify, WhatAPolicyDoesToItsCopyOfAPasswordIsNotWritten) {
+  platform.admin_policy = true;
+  platform.password_is_overwritten = true;
+  target(kTop, {"top"}, {{"orv-slapdAdminPW", {"old"}}, {"orv-slapdAdminDN", {"cn=root"}}});
+  EXPECT_EQ(modify({{kReplace, "orv-slapdAdminPW", {{"new"}}}}), 0);
+  EXPECT_EQ(written(), "2 orv-slapdAdminPW=new");
+}
+
+TEST_F(Modify, AnswerAndTextOfTheDirectoryBackendAreSentAndNothingIsWritten) {
+  Backend localhost;
+  PluginFunction functions[] = {[](Backend*, int, char** text) {
+                                  *text = strdup("not now");
+                                  return 53;
+                                },
+                                nullptr};
+  platform.localhost_backend = &localhost;
+  platform.plugin_functions = functions;
+  target(kTop);
+  EXPECT_EQ(modify({{kReplace, "orv-slapdPwEncryption", {{"known"}}}}), 53);
+  expect_answered(53, "not now");
+  EXPECT_EQ(written(), "");
+  expect_copy_left();
+}
+
+TEST_F(Modify, MethodIsHandedOnAfterAllOtherRulesAndBeforeTheWrite) {
+  target(kTop);
+  EXPECT_EQ(modify({{kReplace, "orv-slapdPwEncryption", {{"known"}}},
+                    {kReplace, "orv-slapdProxySplitName", {{"a"}}}}),
+            0);
+  EXPECT_THAT(
+      platform.calls(
+          {"realpath", "is_string_alphanum", "convertPWEncryptionMethod", "cfg_modify_s"}),
+      ElementsAre("realpath(\"/var/ldap/V6.0/audit.log\")", "is_string_alphanum(\"a\")",
+                  "convertPWEncryptionMethod(\"known\", 16)", testing::StartsWith("cfg_mod")));
+}
 
 TEST_F(Modify, PolicyIsAskedForTwiceBeforeTheDnIsLookedAt) {
   EXPECT_EQ(modify(), 0);
@@ -727,8 +1226,13 @@ TEST_F(Modify, PolicyThatIsPutOnBetweenTheTwoQuestionsConcernsThePassword) {
 
 TEST_F(Modify, OtherEntriesThanThePolicysAreNotTakenForIt) {
   platform.admin_policy = true;
-  EXPECT_EQ(modify(), 0);
-  EXPECT_EQ(platform.count("validate_new_settings"), 0);
+  for (const std::string& dn :
+       {std::string(kEntry), std::string("CN=X,") + kPolicy, kPolicy + std::string(",O=X")}) {
+    platform.forget();
+    target(dn);
+    EXPECT_EQ(modify(), 0);
+    EXPECT_EQ(platform.count("validate_new_settings"), 0) << dn;
+  }
 }
 
 TEST_F(Modify, TextOfTheAddressCheckIsSentAlsoAlongWith50) {
@@ -768,6 +1272,15 @@ TEST_F(Modify, TheFileIsAskedForTheDnInItsOwnCodePage) {
 }
 
 TEST_F(Modify, DnThatCannotBeTranslatedEndsWithItsCode) {
+  platform.fail("xlate_utf8_to_localcp", 2, 21);
+  EXPECT_EQ(modify(), 21);
+  expect_answered(21);
+  EXPECT_EQ(written(), "");
+  expect_copy_left();
+}
+
+TEST_F(Modify, DnThatCameWithAFailureIsNotWrittenTo) {
+  platform.failed_text_is_left = true;
   platform.fail("xlate_utf8_to_localcp", 2, 21);
   EXPECT_EQ(modify(), 21);
   expect_answered(21);
@@ -817,7 +1330,7 @@ TEST_F(Modify, TranslatedDnGoesAfterTheListAndBeforeTheSession) {
 
 TEST_F(Modify, WithoutAListIsRefusedByTheRules) {
   pb.put(parameter::modifications, static_cast<const void*>(nullptr));
-  EXPECT_EQ(platform.run([&] { return config_back_modify(&pb); }), 80);
+  EXPECT_EQ(traced(0x01030100, [&] { return config_back_modify(&pb); }), 80);
   EXPECT_EQ(platform.count("free_ldmll"), 0);
   EXPECT_EQ(platform.count("send_ldap_result"), 1);
 }
@@ -831,17 +1344,305 @@ TEST_F(Modify, TracesTheBlockOnEntryAndTheResultOnExit) {
   EXPECT_THAT(platform.records(), ElementsAre(expected, "exit 01030100 1"));
 }
 
+// ---- Without memory
+
+// A modify that comes to the function that its name tells.
+struct Path {
+  const char* name;
+  unsigned flags;
+  const char* dn;
+  std::vector<scripted::ScriptedAttribute> attributes;
+  Modifications list;
+  int code;
+  int fewest;                      // allocations that it makes at least
+  std::string written = {};        // after a success
+  std::vector<int> refusals = {};  // what it may answer besides 0, 1, 32, 80, 90 and its own code
+};
+
+void PrintTo(const Path& path, std::ostream* out) {
+  *out << path.name;
+}
+
+class ModifyWithoutMemory : public Modify, public testing::WithParamInterface<Path> {
+ protected:
+  ModifyWithoutMemory() {
+    platform.admin_policy = true;
+    platform.supplied = {{"O=A", 1}};
+    platform.localhost_backend = &localhost_;
+    for (const char* dn :
+         {kTop, kGroup, "CN=KERBEROS,CN=CONFIGURATION", "CN=DIGEST,CN=CONFIGURATION",
+          "CN=PROXYDB,CN=PROXY BACKENDS,CN=ORV DIRECTORY,CN=SCHEMAS,CN=CONFIGURATION",
+          "CN=PASSTHROUGH AUTHENTICATION,CN=CONFIGURATION"}) {
+      platform.file[dn] = {{{dn,
+                             {{"orv-slapdAdminDN", {"cn=root"}},
+                              {"orv-slapdMasterDN", {"cn=m"}},
+                              {"orv-slapdKrbAdminDN", {"orv-kn=root"}},
+                              {"orv-slapdDigestAdminUser", {"root"}},
+                              {"orv-slapdProxySplitName", {"taken"}},
+                              {"orv-slapdPtaSubtree", {"o=b"}}}}}};
+    }
+    platform.file[kAudit] = {{{kAudit, {{"orv-slapdLog", {"/log/audit"}}}}}};
+    platform.real_paths = {{"/log/audit", "/log/audit"}, {"/log/other", "/log/other"}};
+  }
+
+  // The session that a failed opening leaves, with its lock, goes back.
+  bool session_was_kept() {
+    if (!locked()) return false;
+    EXPECT_NE(connection.config_session, nullptr);
+    EXPECT_EQ(platform.count("cfg_unbind"), 0);
+    EXPECT_EQ(platform.count("cfg_search_s"), 0);
+    close_session();
+    platform.set_held(&state.configMutex, false);
+    return true;
+  }
+
+  void expect_in_order(const Path& path, int rc) {
+    EXPECT_EQ(platform.count("send_ldap_result"), 1);
+    EXPECT_TRUE(list_is_gone());
+    EXPECT_EQ(platform.count("free_ldmll"), 1);
+    if (session_was_kept()) {
+      EXPECT_EQ(rc, 1);
+    } else {
+      EXPECT_EQ(connection.config_session, nullptr);
+      EXPECT_EQ(platform.count("cfg_unbind"), 1);
+    }
+    const bool allowed = rc == 0 || rc == 1 || rc == 32 || rc == 80 || rc == 90 ||
+                         rc == path.code ||
+                         std::count(path.refusals.begin(), path.refusals.end(), rc) != 0;
+    EXPECT_TRUE(allowed) << rc;
+    if (rc == 0) {
+      EXPECT_EQ(written(), path.written);
+      EXPECT_THAT(platform.leaks(), IsEmpty());
+    } else if (platform.count("cfg_modify_s") != 0) {
+      EXPECT_EQ(written(), path.written);  // the library itself had no memory
+      EXPECT_EQ(rc, 90);
+    }
+    // After a refusal the copy may be left, and that of an address.
+    for (const std::string& word : platform.leaks()) {
+      EXPECT_TRUE(word == "memory" || word == "text") << word;
+    }
+    EXPECT_THAT(platform.violations(), IsEmpty());
+    platform.release_leaks();
+  }
+
+ private:
+  Backend localhost_;
+};
+
+TEST_P(ModifyWithoutMemory, IsAnsweredOnceAndComesToRestWhicheverAllocationFails) {
+  const Path& path = GetParam();
+  as(path.flags, "CN=ONE");
+  operation.roles = 0x20;
+  connection.authority = path.flags;
+  connection.roles = 0x20;
+  target(path.dn, {"top", "orv-slapdTop", "orv-slapdPta"}, path.attributes);
+  for (const bool from_then_on : {false, true}) {
+    int nth = 0;
+    int rc = 0;
+    do {
+      platform.forget();
+      ++nth;
+      SCOPED_TRACE((from_then_on ? "from allocation " : "allocation ") + std::to_string(nth));
+      from_then_on ? platform.fail_allocations_from(nth) : platform.fail_allocation(nth);
+      rc = modify(path.list);
+      if (platform.allocations() >= nth) {
+        expect_in_order(path, rc);
+      } else {
+        EXPECT_EQ(rc, path.code);
+        EXPECT_EQ(written(), rc == 0 ? path.written : "");
+        if (rc == 0) {
+          EXPECT_THAT(platform.leaks(), IsEmpty());
+        }
+        platform.release_leaks();
+        break;
+      }
+    } while (nth < 300 && !HasFailure());
+    EXPECT_GT(nth, path.fewest);
+    EXPECT_LT(nth, 300);
+  }
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Paths, ModifyWithoutMemory,
+    testing::Values(Path{"BindDnOfASupplier",
+                         0x04,
+                         kEntry,
+                         {},
+                         {{kReplace, "orv-slapdMasterDN", {{"cn=new"}}}},
+                         0,
+                         20,
+                         "2 orv-slapdMasterDN=cn=new"},
+                    Path{"KerberosEntry",
+                         kPrimary,
+                         "CN=KERBEROS,CN=CONFIGURATION",
+                         {},
+                         {{kReplace, "orv-slapdKrbAdminDN", {{"orv-kn=new"}}}},
+                         0,
+                         20,
+                         "2 orv-slapdKrbAdminDN=orv-kn=new"},
+                    Path{"DigestEntry",
+                         kPrimary,
+                         "CN=DIGEST,CN=CONFIGURATION",
+                         {},
+                         {{kReplace, "orv-slapdDigestAdminUser", {{"new"}}}},
+                         0,
+                         20,
+                         "2 orv-slapdDigestAdminUser=new"},
+                    Path{"OtherLog",
+                         0x04,
+                         kDefaultLog,
+                         {},
+                         {{kReplace, "orv-slapdLog", {{"/log/other"}}}},
+                         0,
+                         15,
+                         "2 orv-slapdLog=/log/other"},
+                    Path{"AuditLogsFile",
+                         0x04,
+                         kDefaultLog,
+                         {},
+                         {{kReplace, "orv-slapdLog", {{"/log/audit"}}}},
+                         53,
+                         15,
+                         "2 orv-slapdLog=/log/audit"},
+                    Path{"PolicyEntry",
+                         0x04,
+                         kPolicy,
+                         {},
+                         {{kReplace, "pwdMinLength", {{"9"}}}},
+                         0,
+                         15,
+                         "2 pwdMinLength=9"},
+                    Path{"PasswordOfTheAdministrator",
+                         kPrimary,
+                         kTop,
+                         {{"orv-slapdAdminPW", {"{sealed}old"}}, {"orv-slapdAdminDN", {"cn=root"}}},
+                         {{kReplace, "orv-slapdAdminPW", {{"new"}}}},
+                         0,
+                         20,
+                         "2 orv-slapdAdminPW=new"},
+                    Path{"PasswordOfASupplier",
+                         0x04,
+                         kEntry,
+                         {{"orv-slapdMasterPW", {"old"}}, {"orv-slapdMasterDN", {"cn=s"}}},
+                         {{kReplace, "orv-slapdMasterPW", {{"new"}}}},
+                         0,
+                         20,
+                         "2 orv-slapdMasterPW=new"},
+                    Path{"SplitName",
+                         0x04,
+                         kEntry,
+                         {},
+                         {{kReplace, "orv-slapdProxySplitName", {{"new"}}}},
+                         0,
+                         20,
+                         "2 orv-slapdProxySplitName=new"},
+                    Path{"SplitNameThatIsTaken",
+                         0x04,
+                         kEntry,
+                         {},
+                         {{kReplace, "orv-slapdProxySplitName", {{"taken"}}}},
+                         68,
+                         20},
+                    Path{"UnknownMethod",
+                         0x04,
+                         kTop,
+                         {},
+                         {{kReplace, "orv-slapdPwEncryption", {{"rot13"}}}},
+                         21,
+                         15},
+                    Path{"KnownMethod",
+                         0x04,
+                         kTop,
+                         {},
+                         {{kReplace, "orv-slapdPwEncryption", {{"known"}}}},
+                         0,
+                         15,
+                         "2 orv-slapdPwEncryption=known"},
+                    Path{"IdentitiesOfAMember",
+                         kPrimary,
+                         kOne,
+                         {{kRole, {"SchemaAdmin"}}},
+                         {{kReplace, kRole, {{"AuditAdmin"}}},
+                          {kReplace, "orv-slapdAdminDN", {{"cn=new"}}},
+                          {kReplace, "orv-slapdKrbAdminDN", {{"orv-kn=new"}}},
+                          {kReplace, "orv-slapdDigestAdminUser", {{"new"}}}},
+                         0,
+                         60,
+                         "2 orv-slapdAdminRole=AuditAdmin|2 orv-slapdAdminDN=cn=new|2 "
+                         "orv-slapdKrbAdminDN=orv-kn=new|2 orv-slapdDigestAdminUser=new",
+                         {16}},
+                    Path{"LastRole",
+                         kPrimary,
+                         kOne,
+                         {{kRole, {"SchemaAdmin", "AuditAdmin"}}},
+                         {{kDelete, kRole, {{"SchemaAdmin", "AuditAdmin"}}}},
+                         0,
+                         30,
+                         "2 orv-slapdAdminRole=NoAdmin",
+                         {16}},
+                    Path{"OwnPassword",
+                         kMember,
+                         kOne,
+                         {{"orv-slapdAdminPW", {"old"}}, {"orv-slapdAdminDN", {"cn=one"}}},
+                         {{kReplace, "orv-slapdAdminPW", {{"new"}}}},
+                         0,
+                         30,
+                         "2 orv-slapdAdminPW=new",
+                         {16}},
+                    Path{"OrdinaryEntryByAMember",
+                         kMember,
+                         kEntry,
+                         {},
+                         kAnything,
+                         0,
+                         15,
+                         "2 description=text",
+                         {16}},
+                    Path{"SuffixByASupplier",
+                         kSuffixSupplier,
+                         kDirectory,
+                         {},
+                         {{kAdd, kSuffix, {{"O=A"}}}},
+                         0,
+                         10,
+                         "0 orv-slapdSuffix=O=A"},
+                    Path{"PassThroughEntry",
+                         0x04,
+                         kPassThrough,
+                         {{"orv-slapdPtaURL", {"ldap://a"}}, {"orv-slapdPtaSubtree", {"o=x"}}},
+                         {{kReplace, "orv-slapdPtaSubtree", {{"o=d"}}}},
+                         0,
+                         15,
+                         "2 orv-slapdPtaSubtree=o=d",
+                         {21}},
+                    Path{"AddressThatTheHostLacks",
+                         0x04,
+                         kTop,
+                         {},
+                         {{kReplace, "orv-slapdIpAddress", {{"192.0.2.1"}}}},
+                         19,
+                         5},
+                    Path{"SeveralValues",
+                         0x04,
+                         kEntry,
+                         {},
+                         {{kReplace, "description", {{"a", "b", "c"}}}, {kReplace, "cn", {{"d"}}}},
+                         0,
+                         20,
+                         "2 description=a,b,c|2 cn=d"}),
+    [](const auto& instance) { return std::string(instance.param.name); });
+
 TEST_F(Modify, ExitRecordsCarryTheCodeOfEveryEnd) {
   trcEvents = kTraceExit;
   modify();
-  EXPECT_EQ(platform.records().back(), "exit 01030100 0");
+  EXPECT_EQ(last_record(), "exit 01030100 0");
   as(0x24);
   modify();
-  EXPECT_EQ(platform.records().back(), "exit 01030100 50");
+  EXPECT_EQ(last_record(), "exit 01030100 50");
   platform.forget();
   platform.fail("pthread_mutex_lock", 1, 22);
   modify();
-  EXPECT_EQ(platform.records().back(), "exit 01030100 80");
+  EXPECT_EQ(last_record(), "exit 01030100 80");
 }
 
 }  // namespace

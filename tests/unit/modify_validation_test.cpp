@@ -68,32 +68,45 @@ class ModifyRule : public BackendTest {
     return platform.calls({"cfg_search_s"});
   }
 
+  // Of the rules only the primary administrator's may rewrite the list.
+  template <typename Function>
+  int untouched(std::uint32_t function, Function rule) {
+    const std::string before = list();
+    const int rc = traced(function, rule);
+    EXPECT_EQ(list(), before);
+    return rc;
+  }
+
   int member(const char* dn, const Script& script, const char* bound_dn = "CN=ME") {
     make(script);
-    return platform.run(
-        [&] { return checkIfAdminGroupCanModify(&connection, dn, bound_dn, modifications); });
+    return untouched(0x01030700, [&] {
+      return checkIfAdminGroupCanModify(&connection, dn, bound_dn, modifications);
+    });
   }
   int root(const char* dn, const Script& script) {
     make(script);
-    return platform.run([&] { return checkRootAdminModify(session, dn, modifications); });
+    return traced(0x01030800, [&] { return checkRootAdminModify(session, dn, modifications); });
   }
   int kerberos(const char* dn, const Script& script) {
     make(script);
-    return platform.run(
-        [&] { return checkKerberosModify(&operation, session, dn, modifications); });
+    return untouched(0x01030900,
+                     [&] { return checkKerberosModify(&operation, session, dn, modifications); });
   }
   int digest(const char* dn, const Script& script) {
     make(script);
-    return platform.run([&] { return checkDigestModify(&operation, session, dn, modifications); });
+    return untouched(0x01030a00,
+                     [&] { return checkDigestModify(&operation, session, dn, modifications); });
   }
   int supplier(const char* dn, const Script& script) {
     make(script);
-    return platform.run(
-        [&] { return checkReplSupplierModify(&connection, session, dn, modifications); });
+    return untouched(0x01030b00, [&] {
+      return checkReplSupplierModify(&connection, session, dn, modifications);
+    });
   }
   int proxy(const Script& script) {
     make(script);
-    return platform.run([&] { return checkProxyNameModify(session, kOther, modifications); });
+    return untouched(0x01030c00,
+                     [&] { return checkProxyNameModify(session, kOther, modifications); });
   }
 
   _CFG* session;
@@ -145,51 +158,103 @@ TEST_F(ModificationsByType, LeaveExitRecords) {
 
 // ======== Null arguments
 
+struct TracedCall {
+  std::uint32_t function;
+  std::function<int()> call;
+};
+
 TEST_F(ModifyRule, NullArgumentGives80WithItsText) {
   ldapmod* const m = make({{kAdd, "cn", {{"a"}}}});
-  const std::function<int()> calls[] = {
-      [&] { return checkIfAdminGroupCanModify(nullptr, kOther, "", m); },
-      [&] { return checkIfAdminGroupCanModify(&connection, nullptr, "", m); },
-      [&] { return checkIfAdminGroupCanModify(&connection, kOther, nullptr, m); },
-      [&] { return checkIfAdminGroupCanModify(&connection, kOther, "", nullptr); },
-      [&] { return checkRootAdminModify(nullptr, kOther, m); },
-      [&] { return checkRootAdminModify(session, nullptr, m); },
-      [&] { return checkRootAdminModify(session, kOther, nullptr); },
-      [&] { return checkKerberosModify(nullptr, session, kOther, m); },
-      [&] { return checkKerberosModify(&operation, nullptr, kOther, m); },
-      [&] { return checkKerberosModify(&operation, session, nullptr, m); },
-      [&] { return checkKerberosModify(&operation, session, kOther, nullptr); },
-      [&] { return checkDigestModify(nullptr, session, kOther, m); },
-      [&] { return checkDigestModify(&operation, nullptr, kOther, m); },
-      [&] { return checkDigestModify(&operation, session, nullptr, m); },
-      [&] { return checkDigestModify(&operation, session, kOther, nullptr); },
-      [&] { return checkReplSupplierModify(nullptr, session, kOther, m); },
-      [&] { return checkReplSupplierModify(&connection, nullptr, kOther, m); },
-      [&] { return checkReplSupplierModify(&connection, session, nullptr, m); },
-      [&] { return checkReplSupplierModify(&connection, session, kOther, nullptr); },
+  const TracedCall calls[] = {
+      {0x01030700, [&] { return checkIfAdminGroupCanModify(nullptr, kOther, "", m); }},
+      {0x01030700, [&] { return checkIfAdminGroupCanModify(&connection, nullptr, "", m); }},
+      {0x01030700, [&] { return checkIfAdminGroupCanModify(&connection, kOther, nullptr, m); }},
+      {0x01030700, [&] { return checkIfAdminGroupCanModify(&connection, kOther, "", nullptr); }},
+      {0x01030800, [&] { return checkRootAdminModify(nullptr, kOther, m); }},
+      {0x01030800, [&] { return checkRootAdminModify(session, nullptr, m); }},
+      {0x01030800, [&] { return checkRootAdminModify(session, kOther, nullptr); }},
+      {0x01030900, [&] { return checkKerberosModify(nullptr, session, kOther, m); }},
+      {0x01030900, [&] { return checkKerberosModify(&operation, nullptr, kOther, m); }},
+      {0x01030900, [&] { return checkKerberosModify(&operation, session, nullptr, m); }},
+      {0x01030900, [&] { return checkKerberosModify(&operation, session, kOther, nullptr); }},
+      {0x01030a00, [&] { return checkDigestModify(nullptr, session, kOther, m); }},
+      {0x01030a00, [&] { return checkDigestModify(&operation, nullptr, kOther, m); }},
+      {0x01030a00, [&] { return checkDigestModify(&operation, session, nullptr, m); }},
+      {0x01030a00, [&] { return checkDigestModify(&operation, session, kOther, nullptr); }},
+      {0x01030b00, [&] { return checkReplSupplierModify(nullptr, session, kOther, m); }},
+      {0x01030b00, [&] { return checkReplSupplierModify(&connection, nullptr, kOther, m); }},
+      {0x01030b00, [&] { return checkReplSupplierModify(&connection, session, nullptr, m); }},
+      {0x01030b00, [&] { return checkReplSupplierModify(&connection, session, kOther, nullptr); }},
   };
-  for (const auto& call : calls) {
+  for (const auto& [function, call] : calls) {
     platform.forget();
-    EXPECT_EQ(platform.run([&] { return call(); }), 80);
+    EXPECT_EQ(traced(function, call), 80);
     EXPECT_THAT(platform.debug_lines(),
                 ElementsAre(error("Invalid NULL pointer passed through.\n")));
     EXPECT_THAT(platform.calls(), IsEmpty());
+    debug_off();
+    EXPECT_EQ(traced(function, call), 80);
+    debug_on();
   }
 }
 
 TEST_F(ModifyRule, NullArgumentOfTheSplitNameHasATextOfItsOwn) {
   ldapmod* const m = make({{kAdd, "orv-slapdProxySplitName", {{"a"}}}});
-  const std::function<int()> calls[] = {
-      [&] { return checkProxyNameModify(nullptr, kOther, m); },
-      [&] { return checkProxyNameModify(session, nullptr, m); },
-      [&] { return checkProxyNameModify(session, kOther, nullptr); },
+  const TracedCall calls[] = {
+      {0x01030c00, [&] { return checkProxyNameModify(nullptr, kOther, m); }},
+      {0x01030c00, [&] { return checkProxyNameModify(session, nullptr, m); }},
+      {0x01030c00, [&] { return checkProxyNameModify(session, kOther, nullptr); }},
   };
-  for (const auto& call : calls) {
+  for (const auto& [function, call] : calls) {
     platform.forget();
-    EXPECT_EQ(platform.run([&] { return call(); }), 80);
+    EXPECT_EQ(traced(function, call), 80);
     EXPECT_THAT(platform.debug_lines(),
                 ElementsAre(error("checkProxynameModify::Invalid NULL pointer passed through.\n")));
     EXPECT_THAT(platform.calls(), IsEmpty());
+    debug_off();
+    EXPECT_EQ(traced(function, call), 80);
+    debug_on();
+  }
+}
+
+// ======== Without memory
+
+TEST_F(ModifyRule, EachFailingAllocationRefusesAnIdentityAndLeaksNothing) {
+  file(kMember, {{"orv-slapdAdminDN", {"cn=me"}}, {"orv-slapdAdminRole", {"AuditAdmin"}}});
+  const std::function<int()> rules[] = {
+      [&] {
+        return member(kMember, {{kReplace, "orv-slapdAdminPW", {{"x"}}}});
+      },
+      [&] {
+        return root(kMember, {{kReplace, "orv-slapdAdminDN", {{"cn=new"}}}});
+      },
+      [&] {
+        return supplier(kOther, {{kReplace, "orv-slapdMasterDN", {{"cn=new"}}}});
+      },
+      [&] {
+        return proxy({{kReplace, "orv-slapdProxySplitName", {{"split2"}}}});
+      },
+  };
+  for (const auto& rule : rules) {
+    for (int nth = 1;; ++nth) {
+      SCOPED_TRACE(nth);
+      ASSERT_LT(nth, 200);
+      platform.forget();
+      platform.fail_allocation(nth);
+      const int rc = rule();
+      if (platform.allocations() < nth) {
+        EXPECT_GT(nth, 4);
+        EXPECT_EQ(rc, 0);
+        break;
+      }
+      EXPECT_NE(rc, 0);
+      platform.forget();
+      platform.fail_allocations_from(nth);
+      EXPECT_NE(rule(), 0);
+      free_ldmll(modifications);
+      modifications = nullptr;
+      EXPECT_THAT(platform.leaks(), ElementsAre("session"));
+    }
   }
 }
 
@@ -200,6 +265,7 @@ using MemberModify = ModifyRule;
 TEST_F(MemberModify, ContainerOfTheGroupIsNotForMembers) {
   EXPECT_EQ(member(kGroup, {{kReplace, "orv-slapdAdminPW", {{"x"}}}}), 50);
   EXPECT_THAT(searches(), IsEmpty());
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
 }
 
 TEST_F(MemberModify, AuditLogAsksForTheAuditBitOfTheConnection) {
@@ -211,6 +277,7 @@ TEST_F(MemberModify, AuditLogAsksForTheAuditBitOfTheConnection) {
   operation.roles = 0;
   connection.roles = 0x02;
   EXPECT_EQ(member(kAuditLog, {{kReplace, "orv-slapdLog", {{"/x"}}}}), 0);
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
 }
 
 TEST_F(MemberModify, TopEntryIsOpenButForThreeAttributes) {
@@ -222,6 +289,7 @@ TEST_F(MemberModify, TopEntryIsOpenButForThreeAttributes) {
   }
   EXPECT_EQ(member(kConfiguration, {{kReplace, "orv-slapdIpAddress", {{"::1"}}}}), 0);
   EXPECT_THAT(searches(), IsEmpty());
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
 }
 
 TEST_F(MemberModify, TopEntrysAttributesAreLookedForInTheirOrder) {
@@ -247,6 +315,7 @@ TEST_F(MemberModify, PasswordOfAnotherMemberMayNotBeChanged) {
   for (const char* caller : {"CN=YOU", "cn=me", "CN=M", "CN=ME,O=X", ""}) {
     EXPECT_EQ(member(kMember, {{kReplace, "orv-slapdAdminPW", {{"x"}}}}, caller), 50) << caller;
   }
+  EXPECT_THAT(errors(), IsEmpty());
 }
 
 TEST_F(MemberModify, OwnEntryTakesExactlyOneModificationOfThePassword) {
@@ -257,6 +326,7 @@ TEST_F(MemberModify, OwnEntryTakesExactlyOneModificationOfThePassword) {
   EXPECT_EQ(member(kMember, {{kReplace, "orv-slapdAdminRole", {{"AuditAdmin"}}}}), 50);
   EXPECT_EQ(member(kMember, {{kReplace, "orv-slapdAdminPWX", {{"x"}}}}), 50);
   EXPECT_THAT(searches(), IsEmpty());
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
 }
 
 TEST_F(MemberModify, MemberWhoseBindDnCannotBeToldGives80) {
@@ -269,6 +339,7 @@ TEST_F(MemberModify, PasswordPolicyIsNotForMembersAndTheRestIs) {
   EXPECT_EQ(member(kPolicy, {{kReplace, "pwdMinLength", {{"1"}}}}), 50);
   EXPECT_EQ(member(kOther, {{kReplace, "orv-slapdAdminPW", {{"x"}}}}), 0);
   EXPECT_EQ(member("CN=X,CN=PWDPOLICY ADMIN,CN=CONFIGURATION", {{kReplace, "cn", {{"x"}}}}), 0);
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
 }
 
 TEST_F(MemberModify, NamesAreComparedByteForByteAndWhole) {
@@ -277,6 +348,11 @@ TEST_F(MemberModify, NamesAreComparedByteForByteAndWhole) {
                          "CN=A,CN=AUDIT,CN=LOG MANAGEMENT,CN=CONFIGURATION",
                          "cn=pwdpolicy admin,cn=configuration"}) {
     EXPECT_EQ(member(dn, password), 0) << dn;
+  }
+  // The group's may stand anywhere in the name.
+  for (const char* dn :
+       {"CN=ME,CN=ADMINGROUP,CN=CONFIGURATION,O=X", "XCN=ADMINGROUP,CN=CONFIGURATION"}) {
+    EXPECT_EQ(member(dn, {{kReplace, "cn", {{"x"}}}}), 50) << dn;
   }
 }
 
@@ -299,6 +375,13 @@ TEST_F(RootModify, OtherEntriesAreNoConcern) {
               0);
   }
   EXPECT_THAT(searches(), IsEmpty());
+}
+
+TEST_F(RootModify, GroupsNameMayStandAnywhereInThatOfTheEntry) {
+  for (const char* dn :
+       {"CN=ME,CN=ADMINGROUP,CN=CONFIGURATION,O=X", "XCN=ADMINGROUP,CN=CONFIGURATION"}) {
+    EXPECT_EQ(root(dn, {{kReplace, "orv-slapdKrbAdminDN", {{"x"}}}}), 80) << dn;
+  }
 }
 
 TEST_F(RootModify, BindDnIsHeldAgainstAdministratorsAndThenSuppliers) {
@@ -370,6 +453,40 @@ TEST_F(RootModify, DigestUserMustBeFreeByteForByte) {
             0);
 }
 
+TEST_F(RootModify, PrefixOfAKerberosIdentityEndsWithItsEqualsSign) {
+  for (const char* bad : {"orv-kerberosNames=a", "orv-knx=a", "orv-kerberosName", "orv-k=a"}) {
+    EXPECT_EQ(root(kMember, {{kAdd, "orv-slapdKrbAdminDN", {{bad}}}}), 80) << bad;
+    EXPECT_EQ(kerberos(kKerberos, {{kAdd, "orv-slapdKrbAdminDN", {{bad}}}}), 80) << bad;
+  }
+  EXPECT_THAT(searches(), IsEmpty());
+}
+
+TEST_F(RootModify, AdministratorsBindDnEndsTheChecksBeforeSuppliers) {
+  EXPECT_EQ(root(kMember, {{kAdd, "orv-slapdAdminDN", {{"cn=one"}}}}), 68);
+  for (const std::string& search : searches()) {
+    EXPECT_THAT(search, Not(testing::HasSubstr("objectclass=orv-slapd")));
+  }
+}
+
+TEST_F(RootModify, AcceptedIdentityIsFollowedByTheOthers) {
+  EXPECT_EQ(root(kMember, {{kReplace, "orv-slapdAdminDN", {{"cn=new"}}},
+                           {kReplace, "orv-slapdKrbAdminDN", {{"orv-kn=new@R"}}},
+                           {kReplace, "orv-slapdDigestAdminUser", {{"one"}}}}),
+            68);
+  EXPECT_EQ(root(kMember, {{kReplace, "orv-slapdAdminDN", {{"cn=new"}}},
+                           {kReplace, "orv-slapdKrbAdminDN", {{"orv-kn=new@R"}}},
+                           {kReplace, "orv-slapdDigestAdminUser", {{"new"}}}}),
+            0);
+}
+
+TEST_F(RootModify, OtherAnswersAboutAnIdentityAreTheResult) {
+  platform.file[kGroup].code = 4;
+  for (const char* type : {"orv-slapdAdminDN", "orv-slapdDigestAdminUser"}) {
+    EXPECT_EQ(root(kMember, {{kReplace, type, {{"cn=new"}}}}), 4) << type;
+  }
+  EXPECT_EQ(root(kMember, {{kReplace, "orv-slapdKrbAdminDN", {{"orv-kn=new@R"}}}}), 4);
+}
+
 TEST_F(RootModify, KerberosComesBeforeDigestWhateverTheirOrder) {
   EXPECT_EQ(root(kMember, {{kAdd, "orv-slapdDigestAdminUser", {{"one"}}},
                            {kAdd, "orv-slapdKrbAdminDN", {{"x"}}}}),
@@ -396,6 +513,22 @@ TEST_F(RolesModify, RolesAreReadWithTheWholeSubtreeAndParentheses) {
                           "cfg_get_values(session, record 1, \"orv-slapdAdminRole\")",
                           "cfg_msgfree(chain)"));
   EXPECT_EQ(list(), "0x80 orv-slapdadminrole=passwordadmin");
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
+}
+
+TEST_F(RolesModify, WhatWasMadeToReadTheRolesGoesInItsOrder) {
+  platform.name_allocation(1, "names");
+  platform.name_allocation(2, "name");
+  EXPECT_EQ(root(kMember, {{kReplace, kType, {{"PasswordAdmin"}}}}), 0);
+  EXPECT_THAT(platform.calls({"cfg_msgfree", "free", "cfg_value_free"}),
+              ElementsAre("cfg_msgfree(chain)", "free(name)", "free(names)", "cfg_value_free()"));
+}
+
+TEST_F(RolesModify, FirstEntryThatIsFoundIsTheOneWhoseRolesCount) {
+  platform.file[kGroup] = {{{kGroup, {{"cn", {"group"}}}}, {kMember, {{kType, {"AuditAdmin"}}}}},
+                           0};
+  EXPECT_EQ(root(kGroup, {{kDelete, kType, {{"AuditAdmin"}}}}), 16);
+  EXPECT_EQ(root(kConfiguration, {{kAdd, kType, {{"AuditAdmin"}}}}), 16);
 }
 
 TEST_F(RolesModify, MissingEntryGives32WithItsLine) {
@@ -476,8 +609,17 @@ TEST_F(RolesModify, ValuesOfLaterModificationsAreCheckedByPositionOnTheFirst) {
   EXPECT_EQ(root(kMember, {{kDelete, kType, std::nullopt}, {kAdd, kType, {{"Witch"}}}}), 80);
 }
 
+TEST_F(RolesModify, ModificationsOfOtherTypesBetweenThemHideNothing) {
+  EXPECT_EQ(root(kMember, {{kAdd, kType, {{"PasswordAdmin"}}},
+                           {kAdd, "cn", {{"x"}}},
+                           {kAdd, kType, {{"AuditAdmin", "Wizard"}}}}),
+            80);
+  EXPECT_THAT(errors(), ElementsAre(error("Error: Invalid attribute value Wizard\n")));
+}
+
 TEST_F(RolesModify, LastDeletedValueMustBeThere) {
   EXPECT_EQ(root(kMember, {{kDelete, kType, {{"AuditAdmin", "PasswordAdmin"}}}}), 16);
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
   EXPECT_EQ(root(kMember, {{kDelete, kType, {{"PasswordAdmin", "auditADMIN"}}}}), 0);
   // Added and replaced ones need not be there.
   EXPECT_EQ(root(kMember, {{kReplace, kType, {{"PasswordAdmin"}}}}), 0);
@@ -494,6 +636,7 @@ TEST_F(RolesModify, DeletingAllRolesByValueStoresNoAdmin) {
   EXPECT_EQ(list(), "0x82 orv-slapdAdminRole=NoAdmin");
   EXPECT_EQ(modifications->mod_vals.modv_bvals[0]->bv_len, 7U);
   EXPECT_EQ(modifications->mod_vals.modv_bvals[1], nullptr);
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
 }
 
 TEST_F(RolesModify, NumbersOfValuesDecideNotWhichTheyAre) {
@@ -562,6 +705,7 @@ TEST_F(RolesModify, NoMemoryForNoAdminGives90AndLeavesTheListAsItWas) {
     EXPECT_NE(rc, 0);
     EXPECT_EQ(list(), "0x81 orv-slapdAdminRole=AuditAdmin");
     if (rc == 90) ++refused;
+    EXPECT_EQ(platform.debug_lines().empty(), nth > 3);  // the name and the search are told
   }
   EXPECT_EQ(refused, 5);  // two for the name, three for the value
 }
@@ -573,6 +717,28 @@ TEST_F(RolesModify, RolesComeAfterTheBindDnAndBeforeKerberos) {
   EXPECT_EQ(root(kMember,
                  {{kAdd, kType, {{"AuditAdmin"}}}, {kAdd, "orv-slapdDigestAdminUser", {{"one"}}}}),
             68);
+}
+
+TEST_F(RolesModify, RolesAreCheckedBehindAnAcceptedBindDn) {
+  EXPECT_EQ(
+      root(kMember, {{kReplace, "orv-slapdAdminDN", {{"cn=new"}}}, {kAdd, kType, {{"Wizard"}}}}),
+      80);
+  EXPECT_EQ(errors().back(), error("Error: Invalid attribute value Wizard\n"));
+}
+
+TEST_F(RolesModify, CodesDoNotDependOnTheDebugBit) {
+  debug_off();
+  EXPECT_EQ(root(kMember, {{kAdd, kType, {{"Wizard"}}}}), 80);
+  EXPECT_EQ(root(kMember, {{kAdd, "orv-slapdKrbAdminDN", {{"x"}}}}), 80);
+  platform.fail_allocation(platform.allocations() + 1);
+  EXPECT_EQ(root(kMember, {{kAdd, kType, {{"AuditAdmin"}}}}), 90);
+  platform.file[kMember].code = 9;
+  EXPECT_EQ(root(kMember, {{kAdd, kType, {{"AuditAdmin"}}}}), 80);
+  platform.file[kMember] = {};
+  EXPECT_EQ(root(kMember, {{kAdd, kType, {{"AuditAdmin"}}}}), 32);
+  platform.file.erase(kMember);
+  EXPECT_EQ(root(kMember, {{kAdd, kType, {{"AuditAdmin"}}}}), 32);
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
 }
 
 TEST_F(RolesModify, LeavesExitRecords) {
@@ -610,6 +776,25 @@ TEST_F(RootIdentityModify, OnlyThePrimaryAdministratorByTheOperationsFlags) {
     }
   }
   EXPECT_THAT(searches(), IsEmpty());
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
+}
+
+TEST_F(RootIdentityModify, AuthorityComesBeforeTheValue) {
+  as(0x14);
+  EXPECT_EQ(kerberos(kKerberos, {{kReplace, "orv-slapdKrbAdminDN", {{"x"}}}}), 50);
+  EXPECT_EQ(digest(kDigest, {{kReplace, "orv-slapdDigestAdminUser", std::nullopt}}), 50);
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
+}
+
+TEST_F(RootIdentityModify, OtherAnswersAboutAnIdentityAreTheResult) {
+  platform.file[kGroup].code = 4;
+  EXPECT_EQ(kerberos(kKerberos, {{kReplace, "orv-slapdKrbAdminDN", {{"orv-kn=new@R"}}}}), 4);
+  EXPECT_EQ(digest(kDigest, {{kReplace, "orv-slapdDigestAdminUser", {{"new"}}}}), 4);
+}
+
+TEST_F(RootIdentityModify, BadFormIsRefusedWithoutTheDebugBitToo) {
+  debug_off();
+  EXPECT_EQ(kerberos(kKerberos, {{kReplace, "orv-slapdKrbAdminDN", {{"x"}}}}), 80);
 }
 
 TEST_F(RootIdentityModify, KerberosIdentityNeedsItsFormAndMustBeFree) {
@@ -666,7 +851,11 @@ TEST_F(SupplierModify, MembersNeedAReplicationBitOfTheConnectionForTheMasterServ
     connection.roles = roles;
     EXPECT_EQ(supplier(kMasterServer, script), 50);
     EXPECT_EQ(supplier(kOther, script), 0);
-    EXPECT_EQ(supplier("cn=master server,cn=configuration", script), 0);
+    for (const char* dn :
+         {"cn=master server,cn=configuration", "CN=X,CN=MASTER SERVER,CN=CONFIGURATION",
+          "CN=MASTER SERVER,CN=CONFIGURATION,O=X"}) {
+      EXPECT_EQ(supplier(dn, script), 0);
+    }
   }
   for (const unsigned roles : {0x04U, 0x08U}) {
     connection.roles = roles;
@@ -677,6 +866,7 @@ TEST_F(SupplierModify, MembersNeedAReplicationBitOfTheConnectionForTheMasterServ
     connection.authority = flags;
     EXPECT_EQ(supplier(kMasterServer, script), 0);
   }
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
 }
 
 TEST_F(SupplierModify, BindDnOfEveryEntryMustBeNoAdministrators) {
@@ -687,6 +877,26 @@ TEST_F(SupplierModify, BindDnOfEveryEntryMustBeNoAdministrators) {
       EXPECT_EQ(supplier(dn, {{code, "orv-slapdMasterDN", {{"cn=supplier", "cn=one"}}}}), 0);
     }
   }
+}
+
+TEST_F(SupplierModify, OtherAnswersAboutTheBindDnAreTheResult) {
+  const Script script = {{kReplace, "orv-slapdMasterDN", {{"cn=new"}}}};
+  platform.file[kGroup].code = 4;
+  EXPECT_EQ(supplier(kOther, script), 4);
+  file(kConfiguration, {{"cn", {"configuration"}}});  // the administrator's cannot be told
+  EXPECT_EQ(supplier(kOther, script), 80);
+}
+
+TEST_F(SupplierModify, RefusalOfTheMasterServerComesBeforeTheValue) {
+  connection.authority = 0x14;
+  EXPECT_EQ(supplier(kMasterServer, {{kReplace, "orv-slapdMasterDN", std::nullopt}}), 50);
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
+}
+
+TEST_F(SupplierModify, MissingValueIsRefusedWithoutTheDebugBitToo) {
+  debug_off();
+  EXPECT_EQ(supplier(kOther, {{kReplace, "orv-slapdMasterDN", std::nullopt}}), 80);
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
 }
 
 TEST_F(SupplierModify, MissingValueGives80WithItsLine) {
@@ -733,10 +943,17 @@ TEST_F(SplitNameModify, NameMustBeAlphanumericBeforeItIsLookedFor) {
     }
   }
   EXPECT_THAT(searches(), IsEmpty());
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
 }
 
 TEST_F(SplitNameModify, TakenNameGives68AndIsLogged) {
   EXPECT_EQ(proxy({{kReplace, "orv-slapdProxySplitName", {{"split1", "-"}}}}), 68);
+  EXPECT_THAT(platform.calls({"PrintMessage"}), ElementsAre("PrintMessage(0, 8, 145)"));
+}
+
+TEST_F(SplitNameModify, TakenNameIsLoggedWithoutTheDebugBitToo) {
+  debug_off();
+  EXPECT_EQ(proxy({{kAdd, "orv-slapdProxySplitName", {{"split1"}}}}), 68);
   EXPECT_THAT(platform.calls({"PrintMessage"}), ElementsAre("PrintMessage(0, 8, 145)"));
 }
 

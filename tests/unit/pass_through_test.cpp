@@ -1,15 +1,13 @@
 // Pass-through authentication: who may add an entry, where, and when its settings are sound.
 #include <cstring>
 
-#include "backend_test.h"
+#include "added_entry.h"
 #include "config_add.h"
+#include "function_ids.h"
 
 namespace orv {
 namespace {
 
-constexpr unsigned kPrimary = 0x0C;
-constexpr unsigned kMember = 0x14;
-constexpr const char* kContainer = "CN=PASSTHROUGH AUTHENTICATION,CN=CONFIGURATION";
 constexpr const char* kEntry = "CN=NEW,CN=PASSTHROUGH AUTHENTICATION,CN=CONFIGURATION";
 constexpr const char* kOther = "cn=other, cn=passthrough authentication, cn=configuration";
 constexpr const char* kOtherNormal = "CN=OTHER,CN=PASSTHROUGH AUTHENTICATION,CN=CONFIGURATION";
@@ -17,23 +15,14 @@ constexpr const char* kSearch =
     "cfg_search_s(session, \"CN=PASSTHROUGH AUTHENTICATION,CN=CONFIGURATION\", 1, "
     "\"objectclass=orv-slapdPta\", null, 0)";
 
-using Attributes = std::vector<scripted::ScriptedAttribute>;
-
-class PassThrough : public BackendTest {
+class PassThrough : public AddedEntryTest {
  protected:
   PassThrough() { open_session(); }
   void TearDown() override {
-    entry_free(e);
     close_session();
-    BackendTest::TearDown();
+    AddedEntryTest::TearDown();
   }
 
-  void make(const std::string& dn, const Attributes& attributes) {
-    entry_free(e);
-    e = scripted::make_entry({dn, attributes});
-    platform.name(e, "entry");
-    platform.forget();
-  }
   void make_with(const std::string& type, const std::vector<std::string>& values) {
     make(kEntry, {{type, values}});
   }
@@ -45,21 +34,22 @@ class PassThrough : public BackendTest {
   void file(const std::vector<ScriptedEntry>& entries) { platform.file[kContainer] = {entries}; }
 
   int verify(const char* dn = kEntry) {
-    return platform.run([&] { return verifyPassthroughServerEntry(dn, e, &connection); });
+    return traced(function_id::verify_passthrough_server_entry,
+                  [&] { return verifyPassthroughServerEntry(dn, e.get(), &connection); });
   }
-  int check() {
-    return platform.run(
-        [&] { return checkIfPassthruSubtreeEntry(e, &connection, &backend, &operation); });
+  int check() { return check(e.get(), &connection, &backend, &operation); }
+  int check(entry* an_entry, Connection* a_connection, Backend* a_backend,
+            Operation* an_operation) {
+    return traced(function_id::check_if_passthru_subtree_entry, [&] {
+      return checkIfPassthruSubtreeEntry(an_entry, a_connection, a_backend, an_operation);
+    });
   }
 
   void expect_only_the_session_left() {
     EXPECT_THAT(platform.violations(), IsEmpty());
-    entry_free(e);
-    e = nullptr;
+    e.reset();
     EXPECT_THAT(platform.leaks(), ElementsAre("session"));
   }
-
-  entry* e = nullptr;
 };
 
 // ---- Who may add, and where
@@ -75,27 +65,22 @@ class AddPassThrough : public PassThrough {
 TEST_F(AddPassThrough, NullEntryConnectionOrBackendGives80AndItsLine) {
   const auto refused = [&](entry* an_entry, Connection* a_connection, Backend* a_backend) {
     platform.forget();
-    EXPECT_EQ(platform.run([&] {
-      return checkIfPassthruSubtreeEntry(an_entry, a_connection, a_backend, &operation);
-    }),
-              80);
+    EXPECT_EQ(check(an_entry, a_connection, a_backend, &operation), 80);
     EXPECT_THAT(platform.debug_lines(),
                 ElementsAre(error("Invalid NULL pointer passed through.\n")));
   };
   refused(nullptr, &connection, &backend);
-  refused(e, nullptr, &backend);
-  refused(e, &connection, nullptr);
+  refused(e.get(), nullptr, &backend);
+  refused(e.get(), &connection, nullptr);
 }
 
 TEST_F(AddPassThrough, OperationIsNotTestedForNull) {
   make("CN=X,CN=CONFIGURATION", {});
-  EXPECT_EQ(
-      platform.run([&] { return checkIfPassthruSubtreeEntry(e, &connection, &backend, nullptr); }),
-      0);
+  EXPECT_EQ(check(e.get(), &connection, &backend, nullptr), 0);
 }
 
 TEST_F(AddPassThrough, OtherEntriesAreNoConcern) {
-  as(kMember);
+  as(kGroupMember);
   for (const char* dn : {"CN=X,CN=CONFIGURATION", "CN=PASSTHROUGH AUTHENTICATION,CN=X"}) {
     make(dn, {});
     EXPECT_EQ(check(), 0);
@@ -116,10 +101,10 @@ TEST_F(AddPassThrough, PrimaryAdministratorOrServerConfigurationRoleIsNeeded) {
   };
   EXPECT_EQ(given(kPrimary, 0), 0);
   EXPECT_EQ(given(0x1C, 0), 0);
-  EXPECT_EQ(given(kMember, 0x20), 0);
-  EXPECT_EQ(given(kMember, 0x3E), 0);
+  EXPECT_EQ(given(kGroupMember, 0x20), 0);
+  EXPECT_EQ(given(kGroupMember, 0x3E), 0);
   for (const unsigned roles : {0U, 0x02U, 0x04U, 0x08U, 0x10U, 0x1EU, 0x40U}) {
-    EXPECT_EQ(given(kMember, roles), 50) << roles;
+    EXPECT_EQ(given(kGroupMember, roles), 50) << roles;
   }
   EXPECT_EQ(given(0x04, 0), 50);
   EXPECT_EQ(given(0x08, 0), 50);
@@ -128,7 +113,7 @@ TEST_F(AddPassThrough, PrimaryAdministratorOrServerConfigurationRoleIsNeeded) {
 }
 
 TEST_F(AddPassThrough, AuthorityComesBeforeThePlace) {
-  as(kMember);
+  as(kGroupMember);
   make(kContainer, {});
   EXPECT_EQ(check(), 50);
   EXPECT_EQ(platform.count("dn_parent_norm"), 0);
@@ -207,7 +192,7 @@ TEST_F(AddPassThrough, SettingsAreVerifiedLast) {
 
 TEST_F(AddPassThrough, ExitRecordsCarryTheCodes) {
   trcEvents = kTraceExit;
-  as(kMember);
+  as(kGroupMember);
   check();
   EXPECT_THAT(platform.records(), ElementsAre("entry 01021200 ", "exit 01021200 50"));
 }
@@ -515,6 +500,18 @@ TEST_F(PassThrough, ValuesThatCannotBeReadGive1WithTheEntrysDn) {
                                 std::string(kOtherNormal) + "!\n")));
 }
 
+TEST_F(PassThrough, ValuesThatCameWithAnErrorGive1AndAreReleased) {
+  make_with_subtrees({"o=a"});
+  file({{kOther, {{"orv-slapdPtaSubtree", {"o=b"}}}}});
+  platform.fail("cfg_get_errno", 1, 53);
+  EXPECT_EQ(verify(), 1);
+  EXPECT_THAT(platform.debug_lines(),
+              ElementsAre(error("Problems retrieving values for orv-slapdPtaSubtree in entry " +
+                                std::string(kOtherNormal) + "!\n")));
+  EXPECT_EQ(platform.count("xlate_localcp_to_utf8"), 2);  // the entry's own, and the DN
+  expect_only_the_session_left();
+}
+
 TEST_F(PassThrough, NoValuesWithoutAnErrorAreNoConflict) {
   make_with_subtrees({"o=a"});
   file({{kOther, {{"orv-slapdPtaSubtree", {"o=a"}}}}});
@@ -531,6 +528,16 @@ TEST_F(PassThrough, ValueOfAnotherEntryThatCannotBeConvertedGives1) {
   platform.fail("replace_DN", 3, 34);
   EXPECT_EQ(verify(), 1);
   expect_only_the_session_left();
+}
+
+TEST_F(PassThrough, DnOfAnotherEntryIsReleasedBeforeTheNextEntryIsTaken) {
+  make_with_subtrees({"o=a"});
+  file({{kOther, {{"orv-slapdPtaSubtree", {"o=b"}}}}});
+  EXPECT_EQ(verify(), 0);
+  EXPECT_THAT(
+      platform.calls({"cfg_get_dn", "cfg_memfree", "cfg_next_entry"}),
+      ElementsAre("cfg_get_dn(session, record 1)", "cfg_memfree(\"" + std::string(kOther) + "\")",
+                  "cfg_next_entry(session, record 1)"));
 }
 
 TEST_F(PassThrough, ValuesAreReleasedOneByOneAndNotByTheLibrary) {
@@ -584,12 +591,36 @@ TEST_F(PassThrough, MappingIsNotVerifiedAfterAnEarlierRefusal) {
   EXPECT_EQ(platform.count("verifyAttributeMapping"), 0);
 }
 
+TEST_F(PassThrough, ServerLogDoesNotDependOnTheTrace) {
+  debug_off();
+  const auto logged = [&](const std::string& type, const std::vector<std::string>& values) {
+    make_with(type, values);
+    platform.fail("ldap_url_parse", 1, 3);
+    EXPECT_NE(verify(), 0);
+    EXPECT_THAT(platform.debug_lines(), IsEmpty());
+    return platform.calls({"PrintMessage"});
+  };
+  file({{kOther, {{"orv-slapdPtaSubtree", {"o=b"}}}}});
+  EXPECT_THAT(logged("orv-slapdPtaURL", {"nonsense"}),
+              ElementsAre("PrintMessage(0, 8, 179, \"nonsense\")"));
+  EXPECT_THAT(
+      logged("orv-slapdPtaSubtree", {"cn=schema"}),
+      ElementsAre("PrintMessage(0, 8, 174, \"" + std::string(kEntry) + "\", \"CN=SCHEMA\")"));
+  EXPECT_THAT(logged("orv-slapdPtaSubtree", {"o=a", "o=a"}),
+              ElementsAre("PrintMessage(0, 8, 167, \"O=A\", \"O=A\")"));
+  EXPECT_THAT(logged("orv-slapdPtaSubtree", {"o=b"}),
+              ElementsAre("PrintMessage(0, 8, 167, \"O=B\", \"O=B\")"));
+}
+
 TEST_F(PassThrough, ExitRecordsCarryTheCodes) {
   trcEvents = kTraceExit;
   make_with_subtrees({"o=a"});
   verify();
-  EXPECT_THAT(platform.records().back(), "exit 01021300 32");
+  EXPECT_THAT(last_record(), "exit 01021300 32");
   EXPECT_THAT(platform.records(), Contains("exit 01021400 32"));
+  file({{kOther, {{"orv-slapdPtaSubtree", {"o=a"}}}}});
+  verify();
+  EXPECT_THAT(platform.records(), Contains("exit 01021400 19"));
 }
 
 // ---- The review of all entries, once in a process: each of these runs in a process of its own
@@ -706,6 +737,17 @@ TEST_F(Review, NothingToReviewIsTracedAfterTheResultIsReleased) {
   });
 }
 
+TEST_F(Review, LeavesItsRecordsWithoutACode) {
+  in_a_fresh_process([&] {
+    g_safe_mode = 1;
+    trcEvents = kTraceExit;
+    make(kEntry, {});
+    EXPECT_EQ(verify(), 0);
+    EXPECT_THAT(platform.records(), ElementsAre("entry 01021300 ", "entry 01021500 ",
+                                                "exit 01021500 0", "exit 01021300 0"));
+  });
+}
+
 TEST_F(Review, HasNothingToReviewInAResultThatCannotBeCounted) {
   in_a_fresh_process([&] {
     g_safe_mode = 1;
@@ -730,6 +772,25 @@ TEST_F(Review, EndsWhereADnOrAnEntryCannotBeMade) {
       EXPECT_EQ(platform.count("cfg_next_entry"), 0) << failing;
       EXPECT_EQ(platform.count("ldap_url_parse"), 0) << failing;
       EXPECT_EQ(platform.count("cfg_msgfree"), 1) << failing;
+      expect_only_the_session_left();
+    });
+  }
+}
+
+TEST_F(Review, FailingAllocationOnlyEndsTheReviewOrAnEntrysPartOfIt) {
+  constexpr int kEnough = 45;  // one more than a review of these entries makes, at least
+  for (int nth = 1; nth <= kEnough; ++nth) {
+    in_a_fresh_process([&] {
+      g_safe_mode = 1;
+      file({{"cn=one," + std::string(kContainer), {{"orv-slapdPtaSubtree", {"o=a"}}}},
+            {"cn=two," + std::string(kContainer), {{"orv-slapdPtaSubtree", {"o=b"}}}}});
+      make(kEntry, {});
+      platform.fail_allocation(nth);
+      EXPECT_EQ(verify(), 0) << nth;
+      if (nth == kEnough) {
+        EXPECT_LT(platform.allocations(), nth);
+      }
+      EXPECT_EQ(platform.count("PrintMessage"), 0) << nth;
       expect_only_the_session_left();
     });
   }

@@ -29,7 +29,7 @@ class PolicyChange : public BackendTest {
 
   int change(const Modifications& list) {
     ldapmod* const mods = scripted::make_modifications(list);
-    const int rc = platform.run([&] { return checkAdminPolicyEntryModify(mods); });
+    const int rc = traced(0x01031200, [&] { return checkAdminPolicyEntryModify(mods); });
     free_ldmll(mods);
     return rc;
   }
@@ -114,7 +114,8 @@ TEST_F(PolicyChange, OnlyTheFirstValueIsUsedAndALaterModificationWins) {
 
 TEST_F(PolicyChange, NumbersAreReadAsFarAsTheyGo) {
   const std::pair<const char*, int> cases[] = {
-      {"12abc", 12}, {"", 0}, {"abc", 0}, {"-3", -3}, {" 7", 7}, {"2147483647", 2147483647}};
+      {"12abc", 12}, {"", 0},     {"abc", 0},  {"-3", -3},
+      {" 7", 7},     {"012", 12}, {"0x10", 0}, {"2147483647", 2147483647}};
   for (const auto& [text, number] : cases) {
     change({{kReplace, "pwdMinLength", {{text}}}});
     EXPECT_EQ(validated()[5], number) << text;
@@ -153,6 +154,41 @@ TEST_F(PolicyChange, WithoutModificationsTheCurrentPolicyIsValidated) {
   EXPECT_EQ(platform.count("validate_new_settings"), 1);
 }
 
+TEST_F(PolicyChange, SettingsAreKnownByTheirWholeNames) {
+  for (const char* type : {"pwdLockoutDurations", "pwdMaxFailur", "pwdLock", "xpwdMinLength", ""}) {
+    EXPECT_EQ(change({{kReplace, type, {{"77"}}}}), 0);
+    EXPECT_THAT(validated(), ElementsAre(1, 1, 2, 3, 4, 5, 6, 7, 8, 9, 10, 11)) << type;
+  }
+  EXPECT_EQ(platform.debug_lines().size(), 5U);
+}
+
+TEST_F(PolicyChange, EveryModificationCountsAlsoBehindOneThatIsIgnored) {
+  EXPECT_EQ(change({{kAdd, "pwdLockout", {{"false"}}},
+                    {kDelete, "cn", std::nullopt},
+                    {kAdd, "pwdLockoutDuration", {{"20"}}},
+                    {kReplace, "pwdMaxFailure", {{"30"}}},
+                    {kDelete, "passwordMinDiffChars", {{"90"}}}}),
+            0);
+  EXPECT_THAT(validated(), ElementsAre(1, 0, 20, 30, 4, 5, 6, 7, 8, 90, 10, 11));
+  EXPECT_EQ(platform.count("validate_new_settings"), 1);
+}
+
+TEST_F(PolicyChange, AnswerOfTheServerIsReturnedWhateverItIsAlsoWithoutTheTrace) {
+  debug_off();
+  for (const int code : {-1, 1, 19, 80}) {
+    platform.forget();
+    platform.fail("validate_new_settings", 1, code);
+    EXPECT_EQ(change({{kReplace, "pwdMinLength", {{"12"}}}, {kReplace, "cn", {{"x"}}}}), code);
+    EXPECT_EQ(validated()[5], 12);
+  }
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
+}
+
+TEST_F(PolicyChange, TakesNoMemory) {
+  EXPECT_EQ(change({{kReplace, "pwdMinLength", {{"12"}}}, {kReplace, "pwdLockout", {{"x"}}}}), 0);
+  EXPECT_EQ(platform.allocations(), 0);
+}
+
 TEST_F(PolicyChange, LeavesAnExitRecord) {
   trcEvents = kTraceExit;
   platform.fail("validate_new_settings", 1, 19);
@@ -189,8 +225,9 @@ class NewPassword : public BackendTest {
 
   int check(const char* dn, const Modifications& list) {
     ldapmod* const mods = scripted::make_modifications(list);
-    const int rc = platform.run(
-        [&] { return checkAdminPolicyModify(&operation, connection.config_session, dn, mods); });
+    const int rc = traced(0x01031300, [&] {
+      return checkAdminPolicyModify(&operation, connection.config_session, dn, mods);
+    });
     free_ldmll(mods);
     return rc;
   }
@@ -262,7 +299,7 @@ TEST_F(NewPassword, NullArgumentsGive1ButTheOperationMayBeNull) {
   _CFG* const session = connection.config_session;
   const auto check_with = [&](Operation* o, _CFG* s, const char* dn, ldapmod* m) {
     platform.forget();
-    return platform.run([&] { return checkAdminPolicyModify(o, s, dn, m); });
+    return traced(0x01031300, [&] { return checkAdminPolicyModify(o, s, dn, m); });
   };
   EXPECT_EQ(check_with(&operation, nullptr, kTop, mods), 1);
   EXPECT_THAT(platform.debug_lines(), ElementsAre(kNullLine));
@@ -470,7 +507,7 @@ TEST_F(NewPassword, RefusalOfThePolicyIsReturnedAndNothingIsMarked) {
 TEST_F(NewPassword, LockoutIsAskedForWithoutUseAndARecordMayBeMissing) {
   for (const int answer : {0, 1}) {
     platform.forget();
-    record.changed = 0;
+    record.changed = answer + 4;
     platform.fail("pwdIsAdminPasswordLockoutOn", 1, answer);
     EXPECT_EQ(replace(kTop), 0);
     EXPECT_EQ(record.changed, 1) << answer;
@@ -479,11 +516,117 @@ TEST_F(NewPassword, LockoutIsAskedForWithoutUseAndARecordMayBeMissing) {
   EXPECT_EQ(replace(kTop), 0);
 }
 
+TEST_F(NewPassword, AtTheTopEntryInLowerCaseIsASuppliersWhereThatIsOne) {
+  platform.file["cn=configuration"] = {};
+  platform.file["cn=configuration?objectclass=orv-slapdSupplier"] = {
+      {{"cn=configuration", {{kMasterPassword, {"masters"}}, {"orv-slapdMasterDN", {"cn=s"}}}}}};
+  EXPECT_EQ(replace("cn=configuration"), 0);
+  EXPECT_THAT(platform.calls({"verify_admin_password", "findAdminPWDPAttrib"}),
+              ElementsAre("verify_admin_password(\"new\", \"masters\", operation)",
+                          "findAdminPWDPAttrib(\"cn=s\")"));
+}
+
+TEST_F(NewPassword, OfTheGroupsContainerIsAnAdministrators) {
+  entry("CN=ADMINGROUP,CN=CONFIGURATION",
+        {{kAdminPassword, {"groups"}}, {"orv-slapdAdminDN", {"cn=g"}}});
+  EXPECT_EQ(replace("CN=ADMINGROUP,CN=CONFIGURATION"), 0);
+  EXPECT_THAT(platform.calls({"verify_admin_password"}),
+              ElementsAre("verify_admin_password(\"new\", \"groups\", operation)"));
+}
+
+TEST_F(NewPassword, FirstValuesCountOfWhatIsStored) {
+  entry(kTop, {{kAdminPassword, {"first", "second"}}, {"orv-slapdAdminDN", {"cn=a", "cn=b"}}});
+  EXPECT_EQ(replace(kTop), 0);
+  EXPECT_THAT(platform.calls({"unformat_password", "verify_admin_password", "findAdminPWDPAttrib"}),
+              ElementsAre("unformat_password(\"first\", null, 0)",
+                          "verify_admin_password(\"new\", \"first\", operation)",
+                          "findAdminPWDPAttrib(\"cn=a\")"));
+}
+
+TEST_F(NewPassword, FirstEntryCountsOfWhatIsFound) {
+  platform.file[kTop] = {
+      {{kTop, {{kAdminPassword, {"one"}}, {"orv-slapdAdminDN", {"cn=1"}}}},
+       {kGroupMember, {{kAdminPassword, {"two"}}, {"orv-slapdAdminDN", {"cn=2"}}}}}};
+  EXPECT_EQ(replace(kTop), 0);
+  EXPECT_THAT(platform.calls({"findAdminPWDPAttrib"}),
+              ElementsAre("findAdminPWDPAttrib(\"cn=1\")"));
+}
+
+TEST_F(NewPassword, AnswerOfThePolicyIsReturnedWhateverItIs) {
+  for (const int code : {-1, 1, 16, 19, 90}) {
+    platform.forget();
+    platform.fail("verify_admin_password", 1, code);
+    EXPECT_EQ(check(kTop, {{kAdd, kAdminPassword, {{"new"}}}}), code);
+    EXPECT_EQ(record.changed, 0);
+  }
+}
+
+TEST_F(NewPassword, ErrorsOfTheDnAreReturnedWithTheirLineAndReleaseEverything) {
+  for (const int number : {1, 16, 80}) {
+    platform.forget();
+    platform.fail("cfg_get_values", 2, number);
+    EXPECT_EQ(check(kTop, {{kAdd, kAdminPassword, {{"new"}}}}), number);
+    EXPECT_EQ(platform.debug_lines().back(), error("Error - no dn value\n"));
+    EXPECT_EQ(platform.count("verify_admin_password"), 0);
+    EXPECT_THAT(platform.leaks(), ElementsAre("session"));
+  }
+}
+
+TEST_F(NewPassword, ErrorNumberCountsAlsoWhereThereAreValues) {
+  for (const int nth : {1, 2}) {  // of the password, of the DN
+    platform.forget();
+    platform.fail("cfg_get_errno", nth, 7);
+    EXPECT_EQ(check(kTop, {{kAdd, kAdminPassword, {{"new"}}}}), 7);
+    EXPECT_EQ(platform.count("verify_admin_password"), 0);
+  }
+  platform.forget();
+  platform.fail("cfg_get_errno", 1, 16);  // forgiven, and the values are not looked at
+  EXPECT_EQ(check(kTop, {{kAdd, kAdminPassword, {{"new"}}}}), 0);
+  EXPECT_THAT(platform.calls({"unformat_password", "verify_admin_password"}),
+              ElementsAre("verify_admin_password(\"new\", null, operation)"));
+}
+
+TEST_F(NewPassword, IsDecidedTheSameWayWithoutTheTrace) {
+  debug_off();
+  EXPECT_EQ(replace(kTop), 0);
+  EXPECT_EQ(record.changed, 1);
+  EXPECT_EQ(platform.count("pwdIsAdminPasswordLockoutOn"), 1);
+  EXPECT_EQ(check(kTop, {}), 1);
+  supplier({{"orv-slapdMasterDN", {"cn=s"}}});
+  EXPECT_EQ(replace(kSupplierEntry, kMasterPassword), 16);
+  EXPECT_EQ(check(kSupplierEntry, {{kAdd, kMasterPassword, {{"new"}}}}), 0);
+  supplier({{kMasterPassword, {"old"}}});
+  EXPECT_EQ(replace(kSupplierEntry, kMasterPassword), 16);
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
+}
+
+TEST_F(NewPassword, EachFailingAllocationIsAnsweredAndLeaksNothing) {
+  supplier({{kMasterPassword, {"{sealed}old"}}, {"orv-slapdMasterDN", {"cn=s"}}});
+  for (const bool from_then_on : {false, true}) {
+    int nth = 0;
+    int rc = 0;
+    do {
+      platform.forget();
+      record.changed = 0;
+      ++nth;
+      from_then_on ? platform.fail_allocations_from(nth) : platform.fail_allocation(nth);
+      rc = replace(kSupplierEntry, kMasterPassword);
+      EXPECT_TRUE(rc == 90 || rc == 0) << nth;
+      EXPECT_EQ(record.changed, rc == 0 ? 1 : 0);
+      EXPECT_EQ(platform.count("verify_admin_password"), rc == 0 ? 1 : 0);
+      EXPECT_THAT(platform.leaks(), ElementsAre("session")) << nth;
+    } while (platform.allocations() >= nth && nth < 50);
+    EXPECT_EQ(rc, 0);
+    EXPECT_EQ(nth, 8);  // two searches, values, clear text, values, DN, password; then none
+  }
+}
+
 TEST_F(NewPassword, LeavesAnExitRecord) {
   trcEvents = kTraceExit;
   platform.fail("verify_admin_password", 1, 19);
   replace(kTop);
-  EXPECT_EQ(platform.records().back(), "exit 01031300 19");
+  EXPECT_EQ(platform.records().front(), "entry 01031300 ");
+  EXPECT_EQ(last_record(), "exit 01031300 19");
 }
 
 // ---- How passwords are stored
@@ -525,7 +668,7 @@ class PasswordMethod : public BackendTest {
   std::string check(const Modifications& list, const char* dn = kTop) {
     ldapmod* const mods = scripted::make_modifications(list);
     char* text = nullptr;
-    const int rc = platform.run([&] {
+    const int rc = traced(0x01031400, [&] {
       return checkPwEncryptionModify(&operation, connection.config_session, dn, mods, &text);
     });
     free_ldmll(mods);
@@ -563,6 +706,15 @@ TEST_F(PasswordMethod, ThatIsNotAllowedGives53AndItsText) {
   EXPECT_EQ(platform.count("select_backend_opt"), 0);
 }
 
+TEST_F(PasswordMethod, ThatIsNotAllowedIsToldByAnyAnswerBut0) {
+  for (const int answer : {-1, 2, 16, 90}) {
+    platform.forget();
+    platform.fail("convertPWEncryptionMethod", 1, answer);
+    EXPECT_EQ(replace("known"),
+              "53 requested orv-slapdPwEncryption value is not allowed by current configuration.");
+  }
+}
+
 TEST_F(PasswordMethod, ThatIsUnknownGives21AndItsText) {
   EXPECT_EQ(replace("rot13"), "21 orv-slapdPwEncryption value is not one of the supported values.");
   EXPECT_THAT(g_staged, IsEmpty());
@@ -590,7 +742,7 @@ TEST_F(PasswordMethod, NullArgumentsGive80) {
   char* text = nullptr;
   const auto check_with = [&](Operation* o, _CFG* s, const char* dn, ldapmod* m, char** t) {
     platform.forget();
-    const int rc = platform.run([&] { return checkPwEncryptionModify(o, s, dn, m, t); });
+    const int rc = traced(0x01031400, [&] { return checkPwEncryptionModify(o, s, dn, m, t); });
     EXPECT_THAT(platform.debug_lines(), ElementsAre(kNullLine));
     return rc;
   };
@@ -606,9 +758,11 @@ TEST_F(PasswordMethod, NullArgumentsGive80) {
 }
 
 TEST_F(PasswordMethod, EverythingPassesInSafeMode) {
-  g_safe_mode = 1;
-  EXPECT_EQ(replace("rot13"), "0");
-  EXPECT_EQ(replace("known"), "0");
+  for (const int mode : {1, 2, -1}) {
+    g_safe_mode = mode;
+    EXPECT_EQ(replace("rot13"), "0");
+    EXPECT_EQ(replace("known"), "0");
+  }
   expect_not_converted();
 }
 
@@ -656,10 +810,47 @@ TEST_F(PasswordMethod, PassesWhereNobodyTakesIt) {
   EXPECT_THAT(g_staged, IsEmpty());
 }
 
+TEST_F(PasswordMethod, AnswersOfTheDirectoryBackendAreReturnedWhateverTheyAre) {
+  for (const int code : {-1, 1, 21, 90}) {
+    g_answer = code;
+    EXPECT_EQ(replace("known"), std::to_string(code) + " the backend's reason");
+  }
+}
+
+TEST_F(PasswordMethod, IsDecidedTheSameWayWithoutTheTrace) {
+  debug_off();
+  EXPECT_EQ(replace("rot13"), "21 orv-slapdPwEncryption value is not one of the supported values.");
+  EXPECT_EQ(replace("known"), "0");
+  EXPECT_EQ(g_staged.size(), 1U);
+  EXPECT_EQ(check({}), "80");
+  platform.forget();
+  platform.fail("convertPWEncryptionMethod", 1, 1);
+  EXPECT_EQ(replace("known"),
+            "53 requested orv-slapdPwEncryption value is not allowed by current configuration.");
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
+}
+
+TEST_F(PasswordMethod, RefusalsAndAcceptedMethodsLeaveNoLineInTheTrace) {
+  replace("known");
+  replace("rot13");
+  platform.fail("convertPWEncryptionMethod", 3, 1);
+  replace("known");
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
+}
+
+TEST_F(PasswordMethod, OnlyTheTextOfARefusalNeedsMemory) {
+  EXPECT_EQ(replace("known"), "0");
+  EXPECT_EQ(platform.allocations(), 0);
+  platform.fail_allocations_from(1);
+  EXPECT_EQ(replace("rot13"), "21");
+  EXPECT_EQ(platform.allocations(), 1);
+}
+
 TEST_F(PasswordMethod, LeavesAnExitRecord) {
   trcEvents = kTraceExit;
   replace("rot13");
-  EXPECT_EQ(platform.records().back(), "exit 01031400 21");
+  EXPECT_EQ(platform.records().front(), "entry 01031400 ");
+  EXPECT_EQ(last_record(), "exit 01031400 21");
 }
 
 }  // namespace

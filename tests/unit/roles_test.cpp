@@ -1,33 +1,26 @@
 // The roles of a member that is added.
-#include "backend_test.h"
+#include "added_entry.h"
 #include "config_add.h"
-#include "slapi/owners.h"
+#include "function_ids.h"
 
 namespace orv {
 namespace {
 
-constexpr const char* kGroup = "CN=ADMINGROUP,CN=CONFIGURATION";
-constexpr const char* kMember = "CN=ONE,CN=ADMINGROUP,CN=CONFIGURATION";
-
-class Roles : public BackendTest {
+class Roles : public AddedEntryTest {
  protected:
   using Values = std::vector<std::string>;
 
-  Roles() { as(0x0C); }
-  void TearDown() override {
-    e.reset();
-    BackendTest::TearDown();
-  }
+  Roles() { as(kPrimary); }
 
-  void adding(const char* normalized_dn, std::vector<scripted::ScriptedAttribute> attributes = {}) {
-    e.reset(scripted::make_entry({normalized_dn, std::move(attributes)}));
+  void adding(const char* normalized_dn, const Attributes& attributes = {}) {
+    make(normalized_dn, attributes);
     dn = normalized_dn;
-    platform.forget();
   }
   void adding_with(const Values& roles) { adding(kMember, {{"orv-slapdAdminRole", roles}}); }
 
   int process() {
-    return platform.run([&] { return processRolesIfAdminGroupEntry(dn, e.get(), &operation); });
+    return traced(function_id::process_roles_if_admin_group_entry,
+                  [&] { return processRolesIfAdminGroupEntry(dn, e.get(), &operation); });
   }
   // The attribute as it stands after processing; "none" without one.
   [[nodiscard]] std::string roles() const {
@@ -44,7 +37,6 @@ class Roles : public BackendTest {
     return "none";
   }
 
-  EntryPtr e;
   const char* dn = nullptr;
 };
 
@@ -61,10 +53,12 @@ TEST_F(Roles, EachNullArgumentGives80AndTheText) {
   adding(kMember);
   for (int i = 0; i < 3; ++i) {
     platform.forget();
-    EXPECT_EQ(platform.run([&] {
-      return processRolesIfAdminGroupEntry(i == 0 ? nullptr : dn, i == 1 ? nullptr : e.get(),
-                                           i == 2 ? nullptr : &operation);
-    }),
+    EXPECT_EQ(traced(function_id::process_roles_if_admin_group_entry,
+                     [&] {
+                       return processRolesIfAdminGroupEntry(i == 0 ? nullptr : dn,
+                                                            i == 1 ? nullptr : e.get(),
+                                                            i == 2 ? nullptr : &operation);
+                     }),
               80);
     EXPECT_THAT(
         platform.debug_lines(),

@@ -1,20 +1,20 @@
 // Whether an identity is already taken.
-#include "backend_test.h"
+#include "added_entry.h"
 #include "config_add.h"
+#include "function_ids.h"
 
 namespace orv {
 namespace {
 
-constexpr const char* kConfiguration = "CN=CONFIGURATION";
-constexpr const char* kGroup = "CN=ADMINGROUP,CN=CONFIGURATION";
-constexpr const char* kKerberos = "CN=KERBEROS,CN=CONFIGURATION";
-constexpr const char* kDigest = "CN=DIGEST,CN=CONFIGURATION";
-constexpr const char* kProxies =
-    "CN=PROXYDB,CN=PROXY BACKENDS,CN=ORV DIRECTORY,CN=SCHEMAS,CN=CONFIGURATION";
-constexpr const char* kReplication = "CN=CONFIGURATION?objectclass=orv-slapdReplication";
-constexpr const char* kSuppliers = "CN=CONFIGURATION?objectclass=orv-slapdSupplier";
-
 using Check = int (*)(_CFG* session, const char* candidate);
+
+std::uint32_t identifier_of(Check check) {
+  return check == doesAdminGroupMemberDNExist      ? function_id::does_admin_group_member_dn_exist
+         : check == doesReplicationSupplierDNExist ? function_id::does_replication_supplier_dn_exist
+         : check == doesKerberosIDExist            ? function_id::does_kerberos_id_exist
+         : check == doesDigestUserNameExist        ? function_id::does_digest_user_name_exist
+                                                   : function_id::does_proxy_split_name_exist;
+}
 
 class Uniqueness : public BackendTest {
  protected:
@@ -29,8 +29,6 @@ class Uniqueness : public BackendTest {
     BackendTest::TearDown();
   }
 
-  using Attributes = std::vector<scripted::ScriptedAttribute>;
-
   void administrator(Attributes attributes) {
     platform.file[kConfiguration] = {{{kConfiguration, std::move(attributes)}}};
   }
@@ -42,7 +40,7 @@ class Uniqueness : public BackendTest {
   }
 
   int run(Check check, const char* candidate) {
-    return platform.run([&] { return check(session, candidate); });
+    return traced(identifier_of(check), [&] { return check(session, candidate); });
   }
   int member_dn(const char* candidate) { return run(doesAdminGroupMemberDNExist, candidate); }
   int supplier_dn(const char* candidate) { return run(doesReplicationSupplierDNExist, candidate); }
@@ -108,8 +106,8 @@ TEST_F(Uniqueness, NormalFormsAreComparedByteForByte) {
   found(kGroup, {{{"orv-slapdAdminDN", {"cn=one"}}}});
   EXPECT_EQ(member_dn("CN=ROOT"), 0);
   EXPECT_EQ(member_dn("CN=ONE"), 0);
-  found(kReplication, {{{"orv-slapdMasterDN", {"cn=one"}}}});
-  found(kSuppliers, {{{"orv-slapdMasterDN", {"cn=one"}}}});
+  found(kReplicationSearch, {{{"orv-slapdMasterDN", {"cn=one"}}}});
+  found(kSupplierSearch, {{{"orv-slapdMasterDN", {"cn=one"}}}});
   EXPECT_EQ(supplier_dn("CN=ONE"), 0);
   EXPECT_EQ(supplier_dn("cn=one"), 68);
 }
@@ -202,6 +200,20 @@ TEST_F(Uniqueness, ValuesAreTracedAsDetailAndPasswordsToo) {
   EXPECT_THAT(platform.debug_lines(), ElementsAre(detail("orv-slapdAdminPW: secret\n")));
 }
 
+TEST_F(Uniqueness, ValuesAreTracedUnderTheirNamesByAllButTheSuppliersCheck) {
+  found(kGroup, {{{"orv-slapdAdminDN", {"cn=one"}},
+                  {"orv-slapdKrbAdminDN", {"orv-kn=one"}},
+                  {"orv-slapdDigestAdminUser", {"one"}}}});
+  for (const Check check :
+       {doesAdminGroupMemberDNExist, doesKerberosIDExist, doesDigestUserNameExist}) {
+    platform.forget();
+    EXPECT_EQ(run(check, "x"), 0);
+    EXPECT_THAT(platform.debug_lines(), Contains(detail("orv-slapdAdminDN: cn=one\n")));
+    EXPECT_THAT(platform.debug_lines(), Contains(detail("orv-slapdKrbAdminDN: orv-kn=one\n")));
+    EXPECT_THAT(platform.debug_lines(), Contains(detail("orv-slapdDigestAdminUser: one\n")));
+  }
+}
+
 TEST_F(Uniqueness, StepsAndReleasesComeInTheirOrder) {
   found(kGroup, {{{"orv-slapdAdminDN", {"cn=one"}}}});
   EXPECT_EQ(member_dn("cn=two"), 0);
@@ -221,11 +233,27 @@ TEST_F(Uniqueness, StepsAndReleasesComeInTheirOrder) {
                           "cfg_memfree(\"CN=ADMINGROUP,CN=CONFIGURATION\")", "cfg_msgfree(chain)"));
 }
 
+TEST_F(Uniqueness, DnsAreReleasedWithWhatTheyWereComparedIn) {
+  found(kGroup, {{{"orv-slapdAdminDN", {"cn=one"}}}});
+  int made = 0;
+  const char* const names[] = {"administrator's DN", "copy", "member's DN"};
+  platform.at("replace_DN", 0,
+              [&] { platform.name_allocation(platform.allocations() + 1, names[made++]); });
+  EXPECT_EQ(member_dn("cn=two"), 0);
+  const std::vector<std::string> calls =
+      platform.calls({"free", "cfg_ber_free", "cfg_memfree", "cfg_msgfree"});
+  ASSERT_GT(calls.size(), 6U);
+  EXPECT_THAT(std::vector<std::string>(calls.end() - 6, calls.end()),
+              ElementsAre("free(member's DN)", "cfg_ber_free(cursor)",
+                          "cfg_memfree(\"CN=ADMINGROUP,CN=CONFIGURATION\")", "cfg_msgfree(chain)",
+                          "free(copy)", "free(administrator's DN)"));
+}
+
 TEST_F(Uniqueness, StoredValuesAreConvertedFromTheLocalCodePage) {
   found(kGroup, {{{"orv-slapdAdminDN", {"CN=K\xE4SE"}},
                   {"orv-slapdKrbAdminDN", {"orv-kn=K\xE4se"}},
                   {"orv-slapdDigestAdminUser", {"K\xE4se"}}}});
-  found(kReplication, {{{"orv-slapdMasterDN", {"CN=K\xE4SE"}}}});
+  found(kReplicationSearch, {{{"orv-slapdMasterDN", {"CN=K\xE4SE"}}}});
   found(kProxies, {{{"orv-slapdProxySplitName", {"K\xE4se"}}}});
   EXPECT_EQ(member_dn("CN=K\xC3\xA4SE"), 68);
   EXPECT_EQ(supplier_dn("CN=K\xC3\xA4SE"), 68);
@@ -238,8 +266,8 @@ TEST_F(Uniqueness, AttributeNamesMatchInAnyLetterCase) {
   found(kGroup, {{{"ORV-SLAPDADMINDN", {"cn=one"}},
                   {"orv-slapdkrbadmindn", {"orv-kn=one"}},
                   {"Orv-SlapdDigestAdminUser", {"one"}}}});
-  found(kReplication, {{{"orv-slapdMASTERDN", {"cn=one"}}}});
-  found(kSuppliers, {{{"orv-slapdMASTERDN", {"cn=two"}}}});
+  found(kReplicationSearch, {{{"orv-slapdMASTERDN", {"cn=one"}}}});
+  found(kSupplierSearch, {{{"orv-slapdMASTERDN", {"cn=two"}}}});
   found(kProxies, {{{"ORV-slapdProxySplitName", {"one"}}}});
   EXPECT_EQ(member_dn("cn=one"), 68);
   EXPECT_EQ(kerberos_id("orv-kn=one"), 68);
@@ -252,8 +280,8 @@ TEST_F(Uniqueness, AttributeNamesMatchInAnyLetterCase) {
 TEST_F(Uniqueness, OtherAttributesAreNotCompared) {
   const Attributes other = {{"cn", {"cn=one"}}, {"orv-slapdMasterDn2", {"cn=one"}}};
   found(kGroup, {other});
-  found(kReplication, {other});
-  found(kSuppliers, {other});
+  found(kReplicationSearch, {other});
+  found(kSupplierSearch, {other});
   found(kProxies, {other});
   EXPECT_EQ(member_dn("cn=one"), 0);
   EXPECT_EQ(supplier_dn("cn=one"), 0);
@@ -278,8 +306,8 @@ TEST_F(Uniqueness, OnlyTheFirstOfSeveralValuesIsComparedAndTheSecondTraced) {
 TEST_F(Uniqueness, SecondValuesOfTheOthersAreTreatedAlike) {
   found(kGroup, {{{"orv-slapdKrbAdminDN", {"orv-kn=one", "orv-kn=two"}},
                   {"orv-slapdDigestAdminUser", {"one", "two"}}}});
-  found(kReplication, {{{"orv-slapdMasterDN", {"cn=one", "cn=two"}}}});
-  found(kSuppliers, {{{"orv-slapdMasterDN", {"cn=one", "cn=two"}}}});
+  found(kReplicationSearch, {{{"orv-slapdMasterDN", {"cn=one", "cn=two"}}}});
+  found(kSupplierSearch, {{{"orv-slapdMasterDN", {"cn=one", "cn=two"}}}});
   found(kProxies, {{{"orv-slapdProxySplitName", {"one", "two"}}}});
   const std::vector<std::pair<Check, const char*>> cases = {
       {doesReplicationSupplierDNExist, "cn=two"},
@@ -308,8 +336,8 @@ TEST_F(Uniqueness, ValuesThatAreNullWithoutAnErrorHoldNothing) {
 // ---- Suppliers
 
 TEST_F(Uniqueness, SupplierDnsAreLookedForInTwoSearchesWithoutTheAdministrator) {
-  found(kReplication, {});
-  found(kSuppliers, {});
+  found(kReplicationSearch, {});
+  found(kSupplierSearch, {});
   EXPECT_EQ(supplier_dn("cn=root"), 0);
   EXPECT_THAT(searches(), ElementsAre("cfg_search_s(session, \"CN=CONFIGURATION\", 2, "
                                       "\"objectclass=orv-slapdReplication\", null, 0)",
@@ -319,8 +347,8 @@ TEST_F(Uniqueness, SupplierDnsAreLookedForInTwoSearchesWithoutTheAdministrator) 
 }
 
 TEST_F(Uniqueness, ReplicationEntrysDnIsTakenAndSuppliersAreNotSearched) {
-  found(kReplication, {{{"orv-slapdMasterDN", {"cn=one"}}}});
-  found(kSuppliers, {{{"orv-slapdMasterDN", {"cn=one"}}}});
+  found(kReplicationSearch, {{{"orv-slapdMasterDN", {"cn=one"}}}});
+  found(kSupplierSearch, {{{"orv-slapdMasterDN", {"cn=one"}}}});
   EXPECT_EQ(supplier_dn("CN = one"), 68);
   EXPECT_THAT(platform.debug_lines(),
               ElementsAre(detail(" Attribute orv-slapdMasterDN: has value cn=one \n"),
@@ -330,14 +358,16 @@ TEST_F(Uniqueness, ReplicationEntrysDnIsTakenAndSuppliersAreNotSearched) {
 }
 
 TEST_F(Uniqueness, SecondReplicationEntryIsNeverExamined) {
-  found(kReplication, {{{"orv-slapdMasterDN", {"cn=one"}}}, {{"orv-slapdMasterDN", {"cn=two"}}}});
+  found(kReplicationSearch,
+        {{{"orv-slapdMasterDN", {"cn=one"}}}, {{"orv-slapdMasterDN", {"cn=two"}}}});
   EXPECT_EQ(supplier_dn("cn=two"), 0);
   EXPECT_EQ(platform.count("cfg_next_entry"), 0);
 }
 
 TEST_F(Uniqueness, EverySuppliersDnIsTakenWithATextOfItsOwn) {
-  found(kReplication, {});
-  found(kSuppliers, {{{"orv-slapdMasterDN", {"cn=one"}}}, {{"orv-slapdMasterDN", {"cn=two"}}}});
+  found(kReplicationSearch, {});
+  found(kSupplierSearch,
+        {{{"orv-slapdMasterDN", {"cn=one"}}}, {{"orv-slapdMasterDN", {"cn=two"}}}});
   EXPECT_EQ(supplier_dn("cn=two"), 68);
   EXPECT_THAT(
       platform.debug_lines(),
@@ -348,23 +378,23 @@ TEST_F(Uniqueness, EverySuppliersDnIsTakenWithATextOfItsOwn) {
 }
 
 TEST_F(Uniqueness, SuppliersAreSearchedAfterAMissingReplicationEntryButNotAfterAFailure) {
-  found(kReplication, {}, 32);
-  found(kSuppliers, {{{"orv-slapdMasterDN", {"cn=one"}}}});
+  found(kReplicationSearch, {}, 32);
+  found(kSupplierSearch, {{{"orv-slapdMasterDN", {"cn=one"}}}});
   EXPECT_EQ(supplier_dn("cn=one"), 68);
   platform.forget();
-  found(kReplication, {}, 80);
+  found(kReplicationSearch, {}, 80);
   EXPECT_EQ(supplier_dn("cn=one"), 80);
   EXPECT_EQ(searches().size(), 1U);
   platform.forget();
-  found(kReplication, {{{"orv-slapdMasterDN", {"cn=two"}}}});
+  found(kReplicationSearch, {{{"orv-slapdMasterDN", {"cn=two"}}}});
   platform.fail("cfg_get_values", 1, 1);
   EXPECT_EQ(supplier_dn("cn=one"), 1);
   EXPECT_EQ(searches().size(), 1U);
 }
 
 TEST_F(Uniqueness, FirstSearchsResultIsReleasedBeforeTheSecondSearch) {
-  found(kReplication, {{}});
-  found(kSuppliers, {});
+  found(kReplicationSearch, {{}});
+  found(kSupplierSearch, {});
   EXPECT_EQ(supplier_dn("cn=one"), 0);
   EXPECT_THAT(platform.calls({"cfg_search_s", "cfg_msgfree"}),
               ElementsAre(testing::HasSubstr("Replication"), "cfg_msgfree(chain)",
@@ -497,8 +527,8 @@ struct Case {
 };
 constexpr Case kCases[] = {
     {doesAdminGroupMemberDNExist, kGroup, "orv-slapdAdminDN"},
-    {doesReplicationSupplierDNExist, kReplication, "orv-slapdMasterDN"},
-    {doesReplicationSupplierDNExist, kSuppliers, "orv-slapdMasterDN"},
+    {doesReplicationSupplierDNExist, kReplicationSearch, "orv-slapdMasterDN"},
+    {doesReplicationSupplierDNExist, kSupplierSearch, "orv-slapdMasterDN"},
     {doesKerberosIDExist, kGroup, "orv-slapdKrbAdminDN"},
     {doesDigestUserNameExist, kGroup, "orv-slapdDigestAdminUser"},
     {doesProxySplitNameExist, kProxies, "orv-slapdProxySplitName"},
@@ -510,8 +540,8 @@ class EachUniqueness : public Uniqueness, public testing::WithParamInterface<Cas
   // Two holders, whose DNs cannot be mistaken for the candidate.
   EachUniqueness() {
     administrator({{"orv-slapdAdminDN", {"cn=root"}}});
-    found(kReplication, {});
-    found(kSuppliers, {});
+    found(kReplicationSearch, {});
+    found(kSupplierSearch, {});
     found(GetParam().base, {});
     run("x");
     for (const char* function : {"cfg_search_s", "cfg_get_dn", "cfg_first_attribute",
@@ -519,7 +549,7 @@ class EachUniqueness : public Uniqueness, public testing::WithParamInterface<Cas
       before[function] = platform.count(function);
     }
     // The suppliers are searched after the replication entry.
-    if (std::string(GetParam().base) == kReplication)
+    if (std::string(GetParam().base) == kReplicationSearch)
       before["cfg_search_s"] = 0;
     else
       --before["cfg_search_s"];
@@ -556,6 +586,16 @@ TEST_P(EachUniqueness, EntryWhoseDnCannotBeReadGives90) {
   fail("cfg_get_dn", 1, 0);
   EXPECT_EQ(run("two"), 90);
   EXPECT_EQ(platform.count("cfg_first_attribute"), before["cfg_first_attribute"]);
+}
+
+// Where one entry is examined there is no second.
+TEST_P(EachUniqueness, SecondEntryThatCannotBeTakenOrReadGives90) {
+  const int code = std::string(GetParam().base) == kReplicationSearch ? 0 : 90;
+  fail("cfg_get_dn", 2, 0);
+  EXPECT_EQ(run("two"), code);
+  platform.forget();
+  platform.fail("cfg_next_entry", 1, 1);
+  EXPECT_EQ(run("two"), code);
 }
 
 TEST_P(EachUniqueness, EntryThatCannotBeTakenGives90) {
@@ -637,14 +677,14 @@ TEST_F(Uniqueness, StoredDnThatCannotBeNormalisedIsTheCode) {
   platform.fail("replace_DN", 3, 34);
   EXPECT_EQ(member_dn("cn=two"), 34);
   platform.forget();
-  found(kReplication, {{{"orv-slapdMasterDN", {"cn=one"}}}});
+  found(kReplicationSearch, {{{"orv-slapdMasterDN", {"cn=one"}}}});
   platform.fail("replace_DN", 2, 34);
   EXPECT_EQ(supplier_dn("cn=two"), 34);
 }
 
 TEST_F(Uniqueness, ExitRecordsCarryTheCode) {
-  found(kReplication, {});
-  found(kSuppliers, {});
+  found(kReplicationSearch, {});
+  found(kSupplierSearch, {});
   found(kProxies, {{{"orv-slapdProxySplitName", {"one"}}}});
   trcEvents = 0x00020000;
   member_dn("cn=root");
@@ -659,30 +699,6 @@ TEST_F(Uniqueness, ExitRecordsCarryTheCode) {
   EXPECT_THAT(
       own, ElementsAre("exit 01020200 0", "exit 01020600 68", "exit 01020700 0", "exit 01020800 80",
                        "exit 01020400 32", "exit 01020900 0", "exit 01020a00 68"));
-}
-
-TEST_F(Uniqueness, ExitRecordsCarryTheCodeWhereACheckEndsEarly) {
-  trcEvents = 0x00020000;
-  const auto last = [&] { return platform.records().back(); };
-  platform.fail("replace_DN", 2, 34);
-  member_dn("cn=x");
-  EXPECT_EQ(last(), "exit 01020600 34");
-  platform.forget();
-  platform.fail("replace_DN", 1, 34);
-  supplier_dn("cn=x");
-  EXPECT_EQ(last(), "exit 01020700 34");
-  const std::vector<std::pair<Check, std::string>> nulls = {
-      {doesAdminGroupMemberDNExist, "exit 01020600 80"},
-      {doesReplicationSupplierDNExist, "exit 01020700 80"},
-      {doesDigestUserNameExist, "exit 01020900 80"},
-      {doesProxySplitNameExist, "exit 01020a00 80"}};
-  for (const auto& [check, record] : nulls) {
-    run(check, nullptr);
-    EXPECT_EQ(last(), record);
-  }
-  administrator({});
-  member_dn("cn=x");
-  EXPECT_EQ(last(), "exit 01020600 80");
 }
 
 }  // namespace

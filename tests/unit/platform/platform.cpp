@@ -132,14 +132,18 @@ void Platform::forget() {
   actions_.clear();
   sent.clear();
   allocation_names_.clear();
+  sizes.clear();
   failing_allocation_ = 0;
+  fails_from_then_on_ = false;
   allocations_ = 0;
   unlocks_of_free_ = 0;
   error = 0;
 }
 
 bool Platform::allocation_fails() {
-  return ++allocations_ == failing_allocation_;
+  ++allocations_;
+  const bool later = fails_from_then_on_ && allocations_ > failing_allocation_;
+  return allocations_ == failing_allocation_ || later;
 }
 
 std::optional<int> Platform::begin_call(const std::string& function, const std::string& text) {

@@ -143,9 +143,10 @@ class Platform {
   bool failed_text_is_left = false;   // a conversion that fails by the script gives a text as well
   bool real_mutexes = false;          // mutexes are taken, and not only modelled
   bool admin_policy = false;          // pwdIsAdminPolicyOn()
-  std::set<std::string> addresses;    // of the host
-  _Admin_pwdPolicy policy{};          // getGlobalAdminPWDPolicyLocal()
-  _Admin_pwdPolicy validated{};       // what validate_new_settings was last asked about
+  bool password_is_overwritten = false;  // verify_admin_password leaves nothing of a new one
+  std::set<std::string> addresses;       // of the host
+  _Admin_pwdPolicy policy{};             // getGlobalAdminPWDPolicyLocal()
+  _Admin_pwdPolicy validated{};          // what validate_new_settings was last asked about
   AdminPasswordRecord* administrator_record = nullptr;  // findAdminPWDPAttrib()
   Backend* localhost_backend = nullptr;                 // select_backend_opt()
   PluginFunction* plugin_functions = nullptr;           // getAllPluginFuncs()
@@ -162,7 +163,14 @@ class Platform {
   void at(const std::string& function, int nth, std::function<void()> action);
   // The n-th allocation fails: by the code under test itself or, on its behalf, by the platform.
   void fail_allocation(int nth) { failing_allocation_ = nth; }
+  // The same, and every later one.
+  void fail_allocations_from(int nth) {
+    failing_allocation_ = nth;
+    fails_from_then_on_ = true;
+  }
   [[nodiscard]] int allocations() const { return allocations_; }
+  // What malloc and calloc were asked for by the code under test, in bytes and in order.
+  std::vector<std::size_t> sizes;
   // What the n-th allocation gives is known by that name; its release with free is then a call.
   void name_allocation(int nth, const std::string& name) { allocation_names_[nth] = name; }
   // Forgets calls and script of failures, and starts counting again. What is owned and locked
@@ -265,6 +273,7 @@ class Platform {
   std::map<const pthread_mutex_t*, bool> mutexes_;
   std::vector<std::string> violations_;
   int failing_allocation_ = 0;
+  bool fails_from_then_on_ = false;
   int allocations_ = 0;
   int unlocks_of_free_ = 0;
   int mutexes_alive_ = 0;

@@ -695,6 +695,7 @@ int checkMasterSrvDn(const char* suffix, const char* dn) {
 
 int verify_admin_password(char* new_password, char* old_password, Operation* operation) {
   const Call call("verify_admin_password", new_password, old_password, operation);
+  if (platform().password_is_overwritten) std::memset(new_password, 0, std::strlen(new_password));
   return call.failure().value_or(0);
 }
 

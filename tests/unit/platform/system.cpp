@@ -33,6 +33,12 @@ void* allocate(Allocate allocate_real) {
   return block;
 }
 
+void note_size(std::size_t size) {
+  if (!observed()) return;
+  const Unobserved unobserved;
+  Platform::current()->sizes.push_back(size);
+}
+
 }  // namespace
 
 extern "C" {
@@ -40,12 +46,14 @@ extern "C" {
 // ---- Memory
 
 void* __wrap_malloc(std::size_t size) {
+  note_size(size);
   void* block = allocate([&] { return __real_malloc(size); });
   if (block != nullptr && observed()) std::memset(block, 0xA5, size);  // whoever wants zeros asks
   return block;
 }
 
 void* __wrap_calloc(std::size_t count, std::size_t size) {
+  note_size(count * size);
   return allocate([&] { return __real_calloc(count, size); });
 }
 
