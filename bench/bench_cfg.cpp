@@ -26,6 +26,7 @@
 #include "cfg/object_class_table.h"
 #include "cfg/owners.h"
 #include "cfg/session.h"
+#include "sizes.h"
 
 namespace {
 
@@ -269,16 +270,6 @@ void append_json(std::string& json, std::size_t entries, std::size_t bytes,
   }
 }
 
-std::vector<std::size_t> read_sizes(const std::string& list) {
-  std::vector<std::size_t> sizes;
-  for (std::size_t at = 0; at < list.size();) {
-    const std::size_t comma = std::min(list.find(',', at), list.size());
-    sizes.push_back(std::max<std::size_t>(3, std::stoul(list.substr(at, comma - at))));
-    at = comma + 1;
-  }
-  return sizes;
-}
-
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -289,7 +280,7 @@ int main(int argc, char** argv) {
     const std::string option = argv[i];
     if (option == "--json") json_path = argv[i + 1];
     if (option == "--seconds") seconds = std::stod(argv[i + 1]);
-    if (option == "--entries") sizes = read_sizes(argv[i + 1]);
+    if (option == "--entries") sizes = orv::bench::read_sizes(argv[i + 1], 3);
   }
   register_types();
   char path[] = "/tmp/bench-cfg-XXXXXX";

@@ -4,9 +4,10 @@
 //
 //   bench_cfg_save [--json FILE] [--seconds N] [--entries N[,N...]] [--dir DIR]
 //
-// A change is what a server does for one: open a session, add or delete one entry, close it. Works
-// in DIR (default /var/tmp): a memory file system has no floor to speak of. Adds, deletes and floor
-// take turns, so that the disk's moods meet all alike; figures are medians.
+// A change is what a server does for one: open a session, add, modify or delete one entry, close
+// it. Works in DIR (default /var/tmp): a memory file system has no floor to speak of. Adds,
+// modifies, deletes and floor take turns, so that the disk's moods meet all alike; figures are
+// medians.
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -23,6 +24,7 @@
 #include "cfg/attribute_table.h"
 #include "cfg/owners.h"
 #include "cfg/session.h"
+#include "sizes.h"
 
 namespace {
 
@@ -104,6 +106,18 @@ void add_once(const std::string& path) {
   if (rc != 0) fail("an add failed with " + std::to_string(rc));
 }
 
+// Another value of one attribute each time.
+void modify_once(const std::string& path) {
+  static int times = 0;
+  char description[] = "description";
+  std::string text = "An entry that was changed " + std::to_string(++times) + " times";
+  char* texts[] = {text.data(), nullptr};
+  orv::ldapmod mod{orv::kModReplace, description, {texts}, nullptr};
+  orv::ldapmod* mods[] = {&mod, nullptr};
+  const int rc = orv::cfg_modify_s(open_session(path).get(), kDn, mods);
+  if (rc != 0) fail("a modify failed with " + std::to_string(rc));
+}
+
 void delete_once(const std::string& path) {
   const int rc = orv::cfg_delete_s(open_session(path).get(), kDn);
   if (rc != 0) fail("a delete failed with " + std::to_string(rc));
@@ -127,6 +141,7 @@ double median(std::vector<double> values) {
 struct Figures {
   std::vector<double> floor;
   std::vector<double> add;
+  std::vector<double> modify;
   std::vector<double> remove;
 };
 
@@ -141,6 +156,8 @@ Figures measure(const std::string& directory, const std::string& text, double se
   while (figures.floor.size() < 10 || Clock::now() < end) {
     figures.floor.push_back(milliseconds([&] { floor_once(directory, text); }));
     figures.add.push_back(milliseconds([&] { add_once(path); }));
+    figures.floor.push_back(milliseconds([&] { floor_once(directory, text); }));
+    figures.modify.push_back(milliseconds([&] { modify_once(path); }));
     figures.floor.push_back(milliseconds([&] { floor_once(directory, text); }));
     figures.remove.push_back(milliseconds([&] { delete_once(path); }));
   }
@@ -159,16 +176,6 @@ void report(std::string& json, const char* name, std::size_t entries, std::size_
   json += line;
 }
 
-std::vector<std::size_t> read_sizes(const std::string& list) {
-  std::vector<std::size_t> sizes;
-  for (std::size_t at = 0; at < list.size();) {
-    const std::size_t comma = std::min(list.find(',', at), list.size());
-    sizes.push_back(std::max<std::size_t>(1, std::stoul(list.substr(at, comma - at))));
-    at = comma + 1;
-  }
-  return sizes;
-}
-
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -180,7 +187,7 @@ int main(int argc, char** argv) {
     const std::string option = argv[i];
     if (option == "--json") json_path = argv[i + 1];
     if (option == "--seconds") seconds = std::stod(argv[i + 1]);
-    if (option == "--entries") sizes = read_sizes(argv[i + 1]);
+    if (option == "--entries") sizes = orv::bench::read_sizes(argv[i + 1], 1);
     if (option == "--dir") parent = argv[i + 1];
   }
   std::string json;
@@ -193,6 +200,7 @@ int main(int argc, char** argv) {
     std::printf("\n%zu entries, %zu bytes, %zu rounds\n", entries, text.size(), figures.add.size());
     report(json, "floor", entries, text.size(), floor, floor);
     report(json, "add", entries, text.size(), median(figures.add), floor);
+    report(json, "modify", entries, text.size(), median(figures.modify), floor);
     report(json, "delete", entries, text.size(), median(figures.remove), floor);
     std::fflush(stdout);
     for (const char* name : {"config.ldif", "config.ldif.save", "config.ldif.lock", "floor.ldif"}) {

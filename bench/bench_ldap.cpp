@@ -1,8 +1,10 @@
 // Measures a running server over LDAP, beside the floor of the same minute: a bare round trip of
 // messages of the same sizes between two threads over the loopback interface.
 //
-//   bench_ldap --port N --bind-dn DN --password-file F --pid P --json FILE [--entry DN] [--rounds
-//   N]
+//   bench_ldap --port N --bind-dn DN --password-file F --pid P --json FILE [--part reads] [--entry
+//   DN] [--rounds N]
+//   bench_ldap ... --part changes     base searches while eight clients modify
+//   bench_ldap ... --part members     adds and deletes of members of the administrative group
 //
 // The client is as cheap as it can be made: requests are bytes prepared beforehand, answers are
 // only framed. One connection is driven by blocking calls, several by one thread that looks for
@@ -18,6 +20,7 @@
 #include <CLI/CLI.hpp>
 #include <algorithm>
 #include <array>
+#include <atomic>
 #include <chrono>
 #include <cstdint>
 #include <cstdio>
@@ -137,6 +140,26 @@ std::string search_request(const std::string& base, int scope, const std::string
       2, element(0x63, element(0x04, base) + small_number(0x0A, scope) + small_number(0x0A, 0) +
                            small_number(0x02, 0) + small_number(0x02, 0) + small_number(0x01, 0) +
                            filter + element(0x30, "")));
+}
+
+std::string attribute(const std::string& type, const std::vector<std::string>& values) {
+  std::string set;
+  for (const std::string& value : values) set += element(0x04, value);
+  return element(0x30, element(0x04, type) + element(0x31, set));
+}
+
+std::string replace_request(const std::string& dn, const std::string& type,
+                            const std::string& value) {
+  const std::string change = element(0x30, small_number(0x0A, 2) + attribute(type, {value}));
+  return message(3, element(0x66, element(0x04, dn) + element(0x30, change)));
+}
+
+std::string add_request(const std::string& dn, const std::string& attributes) {
+  return message(4, element(0x68, element(0x04, dn) + element(0x30, attributes)));
+}
+
+std::string delete_request(const std::string& dn) {
+  return message(5, element(0x4A, dn));
 }
 
 // Frames the answers of one search after the other on one connection.
@@ -269,14 +292,17 @@ void receive_exactly(const Socket& socket, std::vector<char>& buffer, std::size_
   for (std::size_t got = 0; got < wanted;) got += socket.receive(buffer.data(), buffer.size());
 }
 
-void measure_floor(Figures& figures, std::size_t request, std::size_t answer, int count) {
+// For at most `seconds`.
+void measure_floor(Figures& figures, std::size_t request, std::size_t answer, int count,
+                   double seconds) {
   auto [near, far] = connected_pair();
   std::thread peer([&far = far, request, answer] { echo(far, request, answer); });
   std::vector<char> buffer(1 << 16);
   const std::string ask(request, 'x');
   const auto begin = Clock::now();
+  const auto end = begin + std::chrono::duration<double>(seconds);
   auto last = begin;
-  for (int i = 0; i < count; ++i) {
+  for (int i = 0; i < count && last < end; ++i) {
     near.send(ask);
     receive_exactly(near, buffer, answer);
     const auto now = Clock::now();
@@ -329,10 +355,13 @@ class LdapClient {
   AnswerReader reader_;
 };
 
-void measure_one(Figures& figures, LdapClient& client, const std::string& request, int count) {
+// For at most `seconds`, but three times at least.
+void measure_one(Figures& figures, LdapClient& client, const std::string& request, int count,
+                 double seconds) {
   const auto begin = Clock::now();
+  const auto end = begin + std::chrono::duration<double>(seconds);
   auto last = begin;
-  for (int i = 0; i < count; ++i) {
+  for (int i = 0; i < count && (i < 3 || last < end); ++i) {
     client.ask(request);
     const auto now = Clock::now();
     figures.microseconds.push_back(micros(now - last));
@@ -352,8 +381,11 @@ class Crowd {
     for (std::size_t i = 0; i < clients_.size(); ++i) watch(i);
   }
 
-  void measure(Figures& figures, const std::string& request, int count) {
+  // For at most `seconds`, but eight searches on each connection at least.
+  void measure(Figures& figures, const std::string& request, int count, double seconds) {
     const auto begin = Clock::now();
+    const auto end = begin + std::chrono::duration<double>(seconds);
+    const int least = count - 8 * static_cast<int>(clients_.size());
     int unsent = count;
     int unanswered = count;
     for (std::size_t i = 0; i < clients_.size() && unsent > 0; ++i, --unsent) ask(i, request);
@@ -365,6 +397,10 @@ class Crowd {
         if (!clients_[i].progress()) continue;
         figures.microseconds.push_back(micros(Clock::now() - started_[i]));
         --unanswered;
+        if (unsent > 0 && unsent < least && Clock::now() > end) {
+          unanswered -= unsent;
+          unsent = 0;
+        }
         if (unsent > 0) {
           --unsent;
           ask(i, request);
@@ -390,6 +426,85 @@ class Crowd {
   std::vector<LdapClient> clients_;
   std::vector<Clock::time_point> started_;
 };
+
+// ---- Changes ------------------------------------------------------------------------------------
+
+// Keeps one modify outstanding on each of several connections, in a thread of its own that sleeps
+// while there is nothing to do.
+class Modifiers {
+ public:
+  Modifiers(const Target& target, int size) : epoll_(::epoll_create1(0)) {
+    for (int i = 0; i < size; ++i) clients_.emplace_back(target);
+    for (std::size_t i = 0; i < clients_.size(); ++i) {
+      epoll_event event{};
+      event.events = EPOLLIN;
+      event.data.u64 = i;
+      ::epoll_ctl(epoll_.fd(), EPOLL_CTL_ADD, clients_[i].fd(), &event);
+    }
+    thread_ = std::thread([this] { run(); });
+  }
+  Modifiers(const Modifiers&) = delete;
+  Modifiers& operator=(const Modifiers&) = delete;
+
+  // Ends the load and tells how the modifies went.
+  Figures stop() {
+    stopping_ = true;
+    thread_.join();
+    if (failed_) throw std::runtime_error("a modify failed");
+    return std::move(figures_);
+  }
+
+ private:
+  void run() try {
+    const auto begin = Clock::now();
+    std::vector<Clock::time_point> started(clients_.size());
+    const auto ask = [&](std::size_t i) {
+      started[i] = Clock::now();
+      clients_[i].begin(replace_request("cn=log management,cn=configuration", "description",
+                                        "changed " + std::to_string(++count_) + " times"));
+    };
+    for (std::size_t i = 0; i < clients_.size(); ++i) ask(i);
+    std::array<epoll_event, 64> events{};
+    for (std::size_t outstanding = clients_.size(); outstanding > 0;) {
+      const int ready = ::epoll_wait(epoll_.fd(), events.data(), events.size(), -1);
+      for (int e = 0; e < ready; ++e) {
+        const std::size_t i = events[static_cast<std::size_t>(e)].data.u64;
+        if (!clients_[i].progress()) continue;
+        figures_.microseconds.push_back(micros(Clock::now() - started[i]));
+        if (stopping_) {
+          --outstanding;
+        } else {
+          ask(i);
+        }
+      }
+    }
+    figures_.seconds = std::chrono::duration<double>(Clock::now() - begin).count();
+  } catch (const std::exception&) {
+    failed_ = true;
+  }
+
+  Socket epoll_;
+  std::vector<LdapClient> clients_;
+  Figures figures_;
+  std::atomic<bool> stopping_{false};
+  std::atomic<bool> failed_{false};
+  int count_ = 0;
+  std::thread thread_;
+};
+
+std::string member_dn(int number) {
+  return "cn=bench-" + std::to_string(number) + ",cn=admingroup,cn=configuration";
+}
+
+std::string new_member(int number) {
+  const std::string name = "bench-" + std::to_string(number);
+  const std::vector<std::string> classes = {"top", "orv-slapdConfigEntry",
+                                            "orv-slapdAdminGroupMember"};
+  return add_request(member_dn(number), attribute("objectClass", classes) +
+                                            attribute("cn", {name}) +
+                                            attribute("orv-slapdAdminDN", {"cn=" + name}) +
+                                            attribute("orv-slapdAdminRole", {"AuditAdmin"}));
+}
 
 // ---- Memory -------------------------------------------------------------------------------------
 
@@ -441,6 +556,7 @@ struct Options {
   Target target;
   std::string password_file;
   std::string json;
+  std::string part = "reads";
   std::string entry = "cn=configuration";  // the one that the filter search looks for
   int pid = 0;
   int rounds = 5;
@@ -450,7 +566,7 @@ struct Options {
 // How often a request fits into `seconds`, tried with a few.
 int repetitions(LdapClient& client, const std::string& request, double seconds) {
   Figures trial;
-  measure_one(trial, client, request, 3);
+  measure_one(trial, client, request, 3, seconds);
   return static_cast<int>(std::clamp(seconds / (trial.seconds / 3), 3.0, 50000.0));
 }
 
@@ -464,9 +580,9 @@ void measure_base_search(const Options& options, LdapClient& client, Report& rep
   const int count = repetitions(client, request, options.seconds);
   for (int round = 0; round < options.rounds; ++round) {
     Figures round_floor, round_one, round_eight;
-    measure_floor(round_floor, request.size(), answer, 20000);
-    measure_one(round_one, client, request, count);
-    crowd.measure(round_eight, request, 4 * count);
+    measure_floor(round_floor, request.size(), answer, 20000, 2 * options.seconds);
+    measure_one(round_one, client, request, count, 2 * options.seconds);
+    crowd.measure(round_eight, request, 4 * count, 4 * options.seconds);
     latency.push_back(round_one.percentile(0.5) / round_floor.percentile(0.5));
     throughput.push_back(round_eight.rate() / round_floor.rate());
     for (auto [all, part] :
@@ -490,11 +606,11 @@ void measure_walk(const Options& options, LdapClient& client, Report& report,
   const std::string request = search_request("cn=configuration", 2, filter);
   Figures one, eight;
   const int count = repetitions(client, request, options.seconds);
-  measure_one(one, client, request, count);
+  measure_one(one, client, request, count, 2 * options.seconds);
   report.put(name + "_entries", static_cast<double>(client.answers().entries()));
   report.put(name + "_bytes", static_cast<double>(client.answers().bytes()));
   Crowd crowd(options.target, 8);
-  crowd.measure(eight, request, std::max(8, count));
+  crowd.measure(eight, request, std::max(8, count), 2 * options.seconds);
   report.put(name + "_1", one);
   report.put(name + "_8", eight);
 }
@@ -510,6 +626,46 @@ void measure_memory(const Options& options, LdapClient& client, Report& report) 
                          search_request("cn=configuration", 2, equality("cn", options.entry))));
 }
 
+// Base searches on a quiet server, and while eight clients modify.
+void measure_changes(const Options& options, Report& report) {
+  LdapClient client(options.target);
+  const std::string request = search_request("cn=configuration", 0, presence("objectClass"));
+  Figures quiet, busy;
+  measure_one(quiet, client, request, repetitions(client, request, options.seconds),
+              2 * options.seconds);
+  Modifiers modifiers(options.target, 8);
+  const auto end = Clock::now() + std::chrono::duration<double>(options.rounds * options.seconds);
+  while (Clock::now() < end) measure_one(busy, client, request, 1, options.seconds);
+  Figures modifies = modifiers.stop();
+  report.put("quiet", quiet);
+  report.put("busy", busy);
+  report.put("modify_8", modifies);
+}
+
+void measure_members(const Options& options, Report& report) {
+  LdapClient client(options.target);
+  Figures adds, deletes;
+  const auto end = Clock::now() + std::chrono::duration<double>(options.rounds * options.seconds);
+  for (int number = 0; number < 5 || Clock::now() < end; ++number) {
+    measure_one(adds, client, new_member(number), 1, options.seconds);
+    measure_one(deletes, client, delete_request(member_dn(number)), 1, options.seconds);
+  }
+  report.put("add", adds);
+  report.put("delete", deletes);
+}
+
+void measure_reads(const Options& options, Report& report) {
+  LdapClient client(options.target);
+  measure_memory(options, client, report);
+  measure_base_search(options, client, report);
+  measure_walk(options, client, report, "subtree", presence("objectClass"));
+  measure_walk(options, client, report, "equality", equality("cn", options.entry));
+  measure_walk(options, client, report, "substring", substring("cn", options.entry));
+  report.put("subtree_peak_growth_bytes",
+             peak_growth(options.pid, client,
+                         search_request("cn=configuration", 2, presence("objectClass"))));
+}
+
 std::string first_line(const std::string& path) {
   std::ifstream in(path);
   std::string line;
@@ -521,17 +677,9 @@ std::string first_line(const std::string& path) {
 void run(Options& options) {
   options.target.password = first_line(options.password_file);
   Report report;
-  {
-    LdapClient client(options.target);
-    measure_memory(options, client, report);
-    measure_base_search(options, client, report);
-    measure_walk(options, client, report, "subtree", presence("objectClass"));
-    measure_walk(options, client, report, "equality", equality("cn", options.entry));
-    measure_walk(options, client, report, "substring", substring("cn", options.entry));
-    report.put("subtree_peak_growth_bytes",
-               peak_growth(options.pid, client,
-                           search_request("cn=configuration", 2, presence("objectClass"))));
-  }
+  if (options.part == "reads") measure_reads(options, report);
+  if (options.part == "changes") measure_changes(options, report);
+  if (options.part == "members") measure_members(options, report);
   report.write(options.json);
 }
 
@@ -545,6 +693,8 @@ int main(int argc, char** argv) {
   app.add_option("--bind-dn", options.target.bind_dn, "who binds")->required();
   app.add_option("--password-file", options.password_file, "file with the password")->required();
   app.add_option("--json", options.json, "where the figures go")->required();
+  app.add_option("--part", options.part, "what is measured")
+      ->check(CLI::IsMember({"reads", "changes", "members"}));
   app.add_option("--entry", options.entry, "common name that the filter searches ask for");
   app.add_option("--pid", options.pid, "process whose memory is watched");
   app.add_option("--rounds", options.rounds, "rounds of floor and base search");

@@ -1,5 +1,6 @@
 #include "change.h"
 
+#include <cstring>
 #include <memory>
 #include <new>
 #include <utility>
@@ -17,6 +18,14 @@ namespace orv::cfg {
 
 // ---- Writing a changed text ----
 
+namespace {
+
+bool is_same(const FileText& a, const FileText& b) noexcept {
+  return a.size() == b.size() && std::memcmp(a.begin(), b.begin(), a.size()) == 0;
+}
+
+}  // namespace
+
 Outcome commit(Session& session, const std::vector<Edit>& edits) {
   const Snapshot& before = *session.snapshot;
   if (edited_size(before.text, edits) > FileText::kMaxSize) {
@@ -24,15 +33,14 @@ Outcome commit(Session& session, const std::vector<Edit>& edits) {
   }
   const auto after = std::make_shared<Snapshot>();
   apply_edits(before.text, edits, after->text);
+  if (is_same(before.text, after->text)) return {};
+  // Whatever the reason, a file that no session could read again must not be put in place.
   FileFault fault;
-  if (!after->index.build(after->text, fault)) {
-    // Whatever the reason, a file that no session could read again must not be written.
-    return {result::other, "the changed file would not be well formed: " + fault.cause};
-  }
   const SaveJob job{session.config_file.c_str(), session.save_file.c_str(), before.text,
-                    after->text};
+                    after->text, [&] { return after->index.build(after->text, fault); }};
   Outcome outcome;
   outcome.code = save(*session.files, job, outcome.reason);
+  if (!fault.cause.empty()) outcome.reason += ": " + fault.cause;
   if (outcome.refused()) return outcome;
   session.snapshot = after;
   session.attributes = AttributeMap();
@@ -144,6 +152,8 @@ void report(Session& session, Outcome& outcome) noexcept try {
 } catch (const std::bad_alloc&) {
 }
 
+thread_local unsigned long changes_made = 0;
+
 }  // namespace
 
 int run_change(_CFG* handle, Change change, const char* dn, ldapmod** mods) noexcept {
@@ -156,6 +166,7 @@ int run_change(_CFG* handle, Change change, const char* dn, ldapmod** mods) noex
   try {
     Outcome outcome = change(*session, or_empty(dn), mods);
     session->last_error = outcome.code;
+    if (!outcome.refused()) ++changes_made;
     report(*session, outcome);
   } catch (const std::bad_alloc&) {
     session->last_error = result::no_memory;
@@ -166,3 +177,11 @@ int run_change(_CFG* handle, Change change, const char* dn, ldapmod** mods) noex
 }
 
 }  // namespace orv::cfg
+
+namespace orv {
+
+unsigned long cfg_changes_made() {
+  return cfg::changes_made;
+}
+
+}  // namespace orv

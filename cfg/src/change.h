@@ -22,7 +22,8 @@ struct Outcome {
   [[nodiscard]] bool refused() const noexcept { return code != result::success; }
 };
 
-// Makes the edited text the content of the file, and the session's. Throws std::bad_alloc.
+// Makes the edited text the content of the file, and the session's; does nothing when it is the
+// same. Throws std::bad_alloc.
 Outcome commit(Session& session, const std::vector<Edit>& edits);
 
 // The text of a C string that may be null.

@@ -49,6 +49,10 @@ int FileCalls::flush(int file) {
   return ::fsync(file);
 }
 
+void FileCalls::start_flush(int file) {
+  ::sync_file_range(file, 0, 0, SYNC_FILE_RANGE_WRITE);
+}
+
 int FileCalls::close(int file) {
   return ::close(file);
 }

@@ -1,6 +1,7 @@
 // Modifying entries: the lines whose values change, and no others.
 #include <iterator>
 #include <list>
+#include <new>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -15,6 +16,7 @@
 #include "characters.h"
 #include "dn_text.h"
 #include "local_text.h"
+#include "secret_key.h"
 
 namespace orv::cfg {
 
@@ -221,7 +223,10 @@ class EntryEditor {
   // Takes the values that are there out of `exact`, and all others out of the attribute.
   static void keep_only(Attribute& attribute, std::unordered_set<std::string_view>& exact) {
     for (auto at = attribute.by_key.begin(); at != attribute.by_key.end();) {
-      if (exact.erase(at->second->value) > 0) {
+      const Item& item = *at->second;
+      // A password that stands there in clear is protected by the method that is in force now.
+      const bool may_stay = !item.type.is_secret() || names_scheme(item.value);
+      if (may_stay && exact.erase(item.value) > 0) {
         ++at;
       } else {
         at->second->gone = true;
@@ -243,9 +248,12 @@ class EntryEditor {
     return found;
   }
 
-  [[nodiscard]] bool is_password(const Item& item, std::string_view value) const noexcept {
+  [[nodiscard]] bool is_password(const Item& item, std::string_view value) const {
+    if (item.value == value) return true;
     const SecretPlace place{item.type.name, normal_dn_};
-    return item.value == value || verify_secret(session_.owned_key.get(), place, item.value, value);
+    const Match match = match_secret(session_.owned_key.get(), place, item.value, value);
+    if (match == Match::no_memory) throw std::bad_alloc();
+    return match == Match::yes;
   }
 
   const Session& session_;

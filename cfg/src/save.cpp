@@ -1,7 +1,9 @@
 #include "save.h"
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
+#include <charconv>
 #include <cstring>
 #include <memory>
 #include <new>
@@ -156,6 +158,9 @@ class Saver {
     swap_ = config_ + ".swap";
     lock_ = config_ + ".lock";
     rescued_ = config_ + ".rescued";
+    // Where a number comes behind it, no memory may be needed any more.
+    first_rescued_ = rescued_.size();
+    rescued_.reserve(first_rescued_ + kRescueDigits);
     return kNone;
   }
 
@@ -218,12 +223,31 @@ class Saver {
     const Failure failure = is_version_of_ours(known);
     if (failure.happened()) return failure;
     if (known) return remove_leftover(swap_) ? kNone : failed(swap_, "cannot be removed");
-    if (files_.rename(swap_.c_str(), rescued_.c_str()) != 0) {
-      return failed(swap_, "an edit that a stopped change left there cannot be kept");
-    }
+    if (!rescue()) return failed(swap_, "an edit that a stopped change left there cannot be kept");
     const std::string line = rescued_ + ": holds what a change that was stopped had found in place";
     write_diagnostics_line(line.c_str());
     return kNone;
+  }
+
+  // Keeps the ".swap" file under the first name that is free; false with errno.
+  bool rescue() noexcept {
+    constexpr int kMost = 9999;
+    for (int number = 1; number <= kMost; ++number) {
+      name_rescued(number);
+      struct stat status {};
+      if (files_.status_of(rescued_.c_str(), status) == 0) continue;
+      return errno == ENOENT && files_.rename(swap_.c_str(), rescued_.c_str()) == 0;
+    }
+    errno = EEXIST;
+    return false;
+  }
+
+  void name_rescued(int number) noexcept {
+    rescued_.resize(first_rescued_);
+    if (number == 1) return;
+    std::array<char, kRescueDigits> ending{'-'};
+    const auto end = std::to_chars(ending.data() + 1, ending.data() + ending.size(), number).ptr;
+    rescued_.append(ending.data(), end);
   }
 
   bool remove_leftover(const std::string& path) {
@@ -305,31 +329,50 @@ class Saver {
     return check_is_before(config_, old_file_.get());
   }
 
+  [[nodiscard]] Failure changed_by_others() const noexcept {
+    return {result::busy, config_.c_str(), "was changed by somebody else", 0};
+  }
+
   // Whether an open file holds what was read; 51 when it does not.
   Failure check_is_before(const std::string& name, int file) {
-    const Failure changed{result::busy, config_.c_str(), "was changed by somebody else", 0};
     const char* expected = job_.before.begin();
     std::size_t left = job_.before.size();
     while (true) {
       const ssize_t got = read_block(file, first_block_);
       if (got < 0) return failed(name, "cannot be read");
       const auto size = static_cast<std::size_t>(got);
-      if (size > left || std::memcmp(first_block_.data(), expected, size) != 0) return changed;
+      if (size > left || std::memcmp(first_block_.data(), expected, size) != 0) {
+        return changed_by_others();
+      }
       expected += size;
       left -= size;
-      if (size < first_block_.size()) return left == 0 ? kNone : changed;
+      if (size < first_block_.size()) return left == 0 ? kNone : changed_by_others();
     }
   }
 
   // A name under which the old version stays to be had: the same file where the file system can do
   // that, else a copy.
   Failure keep_old_as(const std::string& path) {
-    if (files_.link(config_.c_str(), path.c_str()) == 0) return kNone;
+    if (files_.link(config_.c_str(), path.c_str()) == 0) return check_linked(path);
     if (!cannot_link(errno)) return failed(path, "cannot be linked");
     OpenFile copy(files_);
     struct stat status {};
-    const Failure failure = write_version(path, job_.before, copy, status);
+    Failure failure = write_unflushed(path, job_.before, copy);
+    if (!failure.happened()) failure = flush_version(path, copy, status);
     if (failure.happened() && copy.get() >= 0) files_.remove(path.c_str());
+    return failure;
+  }
+
+  // A link is made by name, and somebody may have put another file there.
+  Failure check_linked(const std::string& path) {
+    struct stat status {};
+    Failure failure = changed_by_others();
+    if (files_.status_of(path.c_str(), status) != 0) {
+      failure = failed(path, "cannot be examined");
+    } else if (is_same_inode(status, old_status_)) {
+      return kNone;
+    }
+    files_.remove(path.c_str());
     return failure;
   }
 
@@ -352,35 +395,49 @@ class Saver {
   // -- The new version --
 
   Failure write_new() {
-    const Failure failure = write_version(new_, job_.after, new_file_, new_status_);
+    Failure failure = write_unflushed(new_, job_.after, new_file_);
     wrote_new_ = new_file_.get() >= 0;
-    return failure;
+    if (failure.happened()) return failure;
+    failure = check_new();
+    return failure.happened() ? failure : flush_version(new_, new_file_, new_status_);
+  }
+
+  Failure check_new() noexcept try {
+    if (job_.is_acceptable()) return kNone;
+    return {result::other, config_.c_str(), "would not be well formed after the change", 0};
+  } catch (...) {
+    return {result::no_memory, config_.c_str(), "cannot be checked for want of memory", 0};
   }
 
   // Writes a version to a file of its own, which nobody else can read before it has the permissions
-  // of the configuration file, and flushes it. The file stays open: its number must not become
-  // another file's while it is compared. After a failed flush what is on the disk is unknown, and
-  // another flush would only say that nothing is left to write; the file is given up.
-  Failure write_version(const std::string& path, const FileText& text, OpenFile& file,
-                        struct stat& status) {
+  // of the configuration file.
+  Failure write_unflushed(const std::string& path, const FileText& text, OpenFile& file) {
     constexpr int kFlags = O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW;
     if (!file.open(path.c_str(), kFlags, 0600)) return failed(path, "cannot be created");
     Failure failure = write_text(path, text, file.get());
     if (failure.happened()) return failure;
-    failure = keep_permissions(path, file.get());
-    if (failure.happened()) return failure;
+    return keep_permissions(path, file.get());
+  }
+
+  // The file stays open: its number must not become another file's while it is compared. After a
+  // failed flush what is on the disk is unknown, and another flush would only say that nothing is
+  // left to write; the file is given up.
+  Failure flush_version(const std::string& path, const OpenFile& file, struct stat& status) {
     if (files_.flush(file.get()) != 0) return failed(path, "cannot be flushed");
     if (files_.status(file.get(), status) != 0) return failed(path, "cannot be examined");
     return kNone;
   }
 
   Failure write_text(const std::string& path, const FileText& text, int file) {
+    constexpr std::size_t kPiece = std::size_t{1} << 20;
     const char* from = text.begin();
     std::size_t left = text.size();
     while (left > 0) {
-      const ssize_t n = uninterrupted([&] { return files_.write(file, from, left); });
+      const std::size_t piece = std::min(left, kPiece);
+      const ssize_t n = uninterrupted([&] { return files_.write(file, from, piece); });
       if (n == 0) errno = EIO;
       if (n <= 0) return failed(path, "cannot be written");
+      files_.start_flush(file);
       from += n;
       left -= static_cast<std::size_t>(n);
     }
@@ -425,18 +482,33 @@ class Saver {
     return failure;
   }
 
-  // Where there is no exchange: comes to the same names, but an edit in the moment between the
-  // comparison and the renaming is only found in the save file.
+  // Where there is no exchange: comes to the same names. An edit that comes between the last look
+  // at the file and the renaming, with no call in between, is lost; only if it was written into the
+  // old file, and the old file has another name by a hard link, it is found there and put back.
   Failure rename_into_place() {
-    exchanges_ = false;
     if (files_.rename(swap_.c_str(), new_.c_str()) != 0) return failed(new_, "cannot be made");
+    OpenFile file(files_);
     Failure failure = keep_old_as(swap_);
-    if (!failure.happened()) failure = check_replaced();
+    if (!failure.happened()) failure = check_in_place(file);
     if (!failure.happened() && files_.rename(new_.c_str(), config_.c_str()) != 0) {
       failure = failed(config_, "cannot be replaced");
     }
     if (failure.happened()) files_.remove(new_.c_str());
     return failure;
+  }
+
+  // Whether the file that is about to be replaced is the one that was read. It is left open:
+  // closing it would come between.
+  Failure check_in_place(OpenFile& file) {
+    if (!file.open(config_.c_str(), kReadFlags)) return failed(config_, "cannot be opened");
+    struct stat read {};
+    if (files_.status(file.get(), read) != 0) return failed(config_, "cannot be examined");
+    if (!S_ISREG(read.st_mode)) return changed_by_others();
+    const Failure failure = check_is_before(config_, file.get());
+    if (failure.happened()) return failure;
+    struct stat named {};
+    if (files_.status_of(config_.c_str(), named) != 0) return failed(config_, "cannot be examined");
+    return identity_of(named) == identity_of(read) ? kNone : changed_by_others();
   }
 
   // Whether the file that was replaced is the one that was read.
@@ -445,9 +517,7 @@ class Saver {
     if (!file.open(swap_.c_str(), kReadFlags)) return failed(swap_, "cannot be opened");
     struct stat status {};
     if (files_.status(file.get(), status) != 0) return failed(swap_, "cannot be examined");
-    if (!S_ISREG(status.st_mode)) {
-      return {result::busy, config_.c_str(), "was changed by somebody else", 0};
-    }
+    if (!S_ISREG(status.st_mode)) return changed_by_others();
     return check_is_before(swap_, file.get());
   }
 
@@ -470,20 +540,34 @@ class Saver {
   // Puts what was replaced back in place. If that fails as well, the disk is beyond help; the
   // change is answered with its failure and may be seen all the same.
   void take_back() {
-    if (exchanges_ && files_.exchange(config_.c_str(), swap_.c_str()) == 0) {
-      struct stat out {};
-      if (files_.status_of(swap_.c_str(), out) != 0) return;
-      if (is_same_inode(out, new_status_)) {
-        files_.remove(swap_.c_str());
-      } else {
-        // Somebody replaced our version meanwhile: his is the latest, and belongs in place.
-        files_.exchange(config_.c_str(), swap_.c_str());
-        files_.rename(swap_.c_str(), rescued_.c_str());
-      }
-    } else {
-      files_.rename(swap_.c_str(), config_.c_str());
+    if (!exchange_back()) {
+      write_diagnostics_line(
+          "a change of the configuration that failed could not be taken back, and may be in place");
     }
     flush_directory(directory_);
+  }
+
+  bool exchange_back() {
+    if (files_.exchange(config_.c_str(), swap_.c_str()) != 0) return rename_back();
+    struct stat out {};
+    if (files_.status_of(swap_.c_str(), out) != 0) return true;
+    if (is_same_inode(out, new_status_)) {
+      files_.remove(swap_.c_str());
+    } else {
+      // Somebody replaced our version meanwhile: his is the latest, and belongs in place.
+      files_.exchange(config_.c_str(), swap_.c_str());
+      rescue();
+    }
+    return true;
+  }
+
+  bool rename_back() {
+    struct stat in_place {};
+    if (files_.status_of(config_.c_str(), in_place) == 0 && !is_same_inode(in_place, new_status_)) {
+      // Somebody replaced our version meanwhile. What to do with ".swap", the next writer sees.
+      return true;
+    }
+    return files_.rename(swap_.c_str(), config_.c_str()) == 0;
   }
 
   FileCalls& files_;
@@ -493,7 +577,9 @@ class Saver {
   std::string new_;
   std::string swap_;
   std::string lock_;
-  std::string rescued_;
+  static constexpr std::size_t kRescueDigits = 8;
+  std::string rescued_;  // for an edit that is not to be lost: the name, or a number behind it
+  std::size_t first_rescued_ = 0;
   const std::string save_;
   const std::string save_new_;
   const std::string save_directory_;
@@ -503,7 +589,6 @@ class Saver {
   struct stat old_status_ {};
   struct stat new_status_ {};
   bool wrote_new_ = false;
-  bool exchanges_ = true;
   Block first_block_;
   Block second_block_;
 };

@@ -14,6 +14,7 @@
 #include <cstdint>
 #include <cstdlib>
 #include <memory>
+#include <new>
 #include <utility>
 
 #include "cfg/result_codes.h"
@@ -61,6 +62,14 @@ bool split_scheme(std::string_view stored, std::string_view& scheme,
   return true;
 }
 
+std::string with_scheme(std::string_view scheme, std::string_view rest) {
+  std::string stored(1, '{');
+  stored += scheme;
+  stored += '}';
+  stored += rest;
+  return stored;
+}
+
 constexpr std::string_view kSealedScheme = "AES256";
 
 // ---- Digests ----
@@ -85,12 +94,12 @@ bool digest(const EVP_MD* type, std::string_view first, std::string_view second,
          EVP_DigestFinal_ex(context.get(), out.bytes.data(), &out.length) == 1;
 }
 
-// Compares texts of any lengths in a time that depends on neither's content.
-bool same_text(std::string_view a, std::string_view b) noexcept {
+// Compares texts of any lengths in a time that depends on neither's content. Throws std::bad_alloc.
+bool same_text(std::string_view a, std::string_view b) {
   Digest digest_a;
   Digest digest_b;
   if (!digest(EVP_sha256(), a, "", digest_a) || !digest(EVP_sha256(), b, "", digest_b)) {
-    return false;
+    throw std::bad_alloc();
   }
   const bool same =
       CRYPTO_memcmp(digest_a.bytes.data(), digest_b.bytes.data(), digest_a.length) == 0;
@@ -157,7 +166,7 @@ bool seal(const Key& key, SecretPlace place, std::string_view clear, std::string
   return true;
 }
 
-// Opens the bytes of a sealed value, wherever it was sealed for.
+// Opens the bytes of a sealed value, wherever it was sealed for. Throws std::bad_alloc.
 bool open_sealed(const Key& key, std::string_view sealed, std::string& clear) {
   if (sealed.size() < kMinSealedLength || sealed.size() > INT32_MAX ||
       static_cast<unsigned char>(sealed[0]) != kSealVersion) {
@@ -173,7 +182,7 @@ bool open_sealed(const Key& key, std::string_view sealed, std::string& clear) {
   const CipherContext context(EVP_CIPHER_CTX_new());
   int length = 0;
   int rest = 0;
-  const bool done =
+  const bool ready =
       context != nullptr &&
       EVP_DecryptInit_ex(context.get(), EVP_aes_256_gcm(), nullptr, key.data(), bytes_of(nonce)) ==
           1 &&
@@ -181,17 +190,21 @@ bool open_sealed(const Key& key, std::string_view sealed, std::string& clear) {
                         static_cast<int>(header.size())) == 1 &&
       EVP_DecryptUpdate(context.get(), bytes_of(out), &length, bytes_of(text),
                         static_cast<int>(text.size())) == 1 &&
-      EVP_CIPHER_CTX_ctrl(context.get(), EVP_CTRL_GCM_SET_TAG, kTagLength, tag.data()) == 1 &&
-      EVP_DecryptFinal_ex(context.get(), bytes_of(out) + length, &rest) == 1;
-  if (!done) return false;
+      EVP_CIPHER_CTX_ctrl(context.get(), EVP_CTRL_GCM_SET_TAG, kTagLength, tag.data()) == 1;
+  // Only the last step looks at the value; what the others want is memory.
+  if (!ready) throw std::bad_alloc();
+  if (EVP_DecryptFinal_ex(context.get(), bytes_of(out) + length, &rest) != 1) return false;
   wipe(clear);
   clear.assign(out, 0, text.size());
   return true;
 }
 
-bool decode_base64(std::string_view text, std::string& bytes) noexcept {
+// Throws std::bad_alloc.
+bool decode_base64(std::string_view text, std::string& bytes) {
   std::size_t error_at = 0;
-  return base64_decode(text, bytes, error_at) == result::success;
+  const int rc = base64_decode(text, bytes, error_at);
+  if (rc == result::no_memory) throw std::bad_alloc();
+  return rc == result::success;
 }
 
 bool verify_sealed(const Key* key, SecretPlace place, std::string_view encoded,
@@ -200,13 +213,15 @@ bool verify_sealed(const Key* key, SecretPlace place, std::string_view encoded,
   std::string opened;
   const WipeAtEnd wiped(opened);
   std::array<unsigned char, kHeaderLength> header{};
-  if (key == nullptr || !decode_base64(encoded, sealed) || !make_header(place, header) ||
-      !open_sealed(*key, sealed, opened)) {
-    return false;
-  }
+  if (key == nullptr || !decode_base64(encoded, sealed)) return false;
+  if (!make_header(place, header)) throw std::bad_alloc();
+  if (!open_sealed(*key, sealed, opened)) return false;
   const bool here = CRYPTO_memcmp(sealed.data(), header.data(), header.size()) == 0;
   return same_text(opened, clear) && here;
 }
+
+// Where others keep passwords, this one keeps somebody out.
+constexpr std::string_view kNobodys = "*";
 
 // ---- Hashed values ----
 
@@ -227,7 +242,7 @@ bool verify_salted(const EVP_MD* type, std::string_view encoded, std::string_vie
   const auto length = static_cast<std::size_t>(EVP_MD_get_size(type));
   if (stored.size() <= length || stored.size() > length + kMaxSaltLength) return false;
   Digest made;
-  if (!digest(type, clear, std::string_view(stored).substr(length), made)) return false;
+  if (!digest(type, clear, std::string_view(stored).substr(length), made)) throw std::bad_alloc();
   return CRYPTO_memcmp(made.bytes.data(), stored.data(), length) == 0;
 }
 
@@ -272,7 +287,7 @@ bool verify_pbkdf2(const EVP_MD* type, std::string_view rest, std::string_view c
   if (PKCS5_PBKDF2_HMAC(clear.data(), static_cast<int>(clear.size()), bytes_of(salt),
                         static_cast<int>(salt.size()), iterations, type,
                         static_cast<int>(hash.size()), made.data()) != 1) {
-    return false;
+    throw std::bad_alloc();
   }
   return CRYPTO_memcmp(made.data(), hash.data(), hash.size()) == 0;
 }
@@ -282,6 +297,85 @@ bool verify_pbkdf2(const EVP_MD* type, std::string_view rest, std::string_view c
 constexpr std::string_view kCryptScheme = "CRYPT";
 
 #ifdef ORV_HAS_CRYPT
+
+// What a text of crypt(3) costs, in iterations of a hash function: some of its methods carry a
+// number that takes hours, or all memory, to compute. 0: too much, or a text that is none.
+class CryptCost {
+ public:
+  static std::uint64_t of(std::string_view text) noexcept {
+    if (text.empty() || text.front() == '*') return 0;
+    if (text.front() == '_') return kDes;
+    if (text.front() != '$') return text.size() == kDesLength ? kDes : 0;
+    for (const Method& method : kMethods)
+      if (text.starts_with(method.prefix)) return method.cost(text.substr(method.prefix.size()));
+    return 0;
+  }
+
+ private:
+  struct Method {
+    std::string_view prefix;
+    std::uint64_t (*cost)(std::string_view rest) noexcept;
+  };
+
+  static constexpr std::uint64_t kDes = 1000;
+  static constexpr std::size_t kDesLength = 13;
+
+  static std::uint64_t of_rounds(std::string_view rest) noexcept {
+    constexpr std::string_view kRounds = "rounds=";
+    constexpr std::uint64_t kDefault = 5000;
+    if (!rest.starts_with(kRounds)) return kDefault;
+    rest.remove_prefix(kRounds.size());
+    return of_number(rest);
+  }
+
+  static std::uint64_t of_number(std::string_view rest) noexcept {
+    return static_cast<std::uint64_t>(read_iterations(rest.substr(0, rest.find('$'))));
+  }
+
+  static std::uint64_t of_blowfish(std::string_view rest) noexcept {
+    constexpr int kMost = 16;
+    constexpr std::uint64_t kWork = 64;
+    if (rest.size() < 3 || rest[2] != '$' || !is_ascii_digit(rest[0]) || !is_ascii_digit(rest[1]))
+      return 0;
+    const int cost = (rest[0] - '0') * 10 + (rest[1] - '0');
+    return cost > kMost ? 0 : kWork << cost;
+  }
+
+  // 64 digits, from "." to "z".
+  static int digit(char c) noexcept {
+    constexpr std::string_view kDigits =
+        "./0123456789ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz";
+    const std::size_t at = kDigits.find(c);
+    return at == std::string_view::npos ? 64 : static_cast<int>(at);
+  }
+
+  static std::uint64_t of_memory(int exponent) noexcept {
+    constexpr int kMost = 16;  // 256 MiB with the usual block size
+    constexpr std::uint64_t kWork = 10;
+    return exponent > kMost ? 0 : kWork << exponent;
+  }
+
+  // Only the form that the platform makes itself: flags, size and block size, a character each.
+  static std::uint64_t of_yescrypt(std::string_view rest) noexcept {
+    constexpr int kLargestBlock = 48;
+    if (rest.size() < 4 || rest[3] != '$' || digit(rest[2]) >= kLargestBlock) return 0;
+    return of_memory(digit(rest[1]) + 1);
+  }
+
+  static std::uint64_t of_scrypt(std::string_view rest) noexcept {
+    if (rest.size() < 11 || rest.substr(1, 10) != "U..../....") return 0;
+    return of_memory(digit(rest[0]));
+  }
+
+  static std::uint64_t of_little(std::string_view) noexcept { return kDes; }
+
+  static constexpr Method kMethods[] = {
+      {"$1$", of_little},    {"$3$", of_little},    {"$5$", of_rounds},    {"$6$", of_rounds},
+      {"$2a$", of_blowfish}, {"$2b$", of_blowfish}, {"$2x$", of_blowfish}, {"$2y$", of_blowfish},
+      {"$y$", of_yescrypt},  {"$gy$", of_yescrypt}, {"$7$", of_scrypt},    {"$sha1$", of_number},
+      {"$md5,", of_rounds},
+  };
+};
 
 struct CryptDeleter {
   void operator()(crypt_data* data) const noexcept {
@@ -316,21 +410,30 @@ int make_crypt(std::string_view clear, std::string& stored) {
   const WipeAtEnd wiped(password);
   std::string made;
   const int rc = run_crypt(password, setting, made);
-  if (rc == result::success) stored = "{CRYPT}" + made;
+  if (rc == result::success) stored = with_scheme(kCryptScheme, made);
   return rc;
 }
 
 bool verify_crypt(std::string_view stored, std::string_view clear) {
+  if (CryptCost::of(stored) == 0) return false;
   std::string password(clear);
   const WipeAtEnd wiped(password);
   std::string made;
-  return run_crypt(password, std::string(stored), made) == result::success &&
-         made.size() == stored.size() &&
+  const int rc = run_crypt(password, std::string(stored), made);
+  if (rc == result::no_memory) throw std::bad_alloc();
+  return rc == result::success && made.size() == stored.size() &&
          CRYPTO_memcmp(made.data(), stored.data(), made.size()) == 0;
+}
+
+std::uint64_t cost_of_crypt(std::string_view stored) noexcept {
+  return CryptCost::of(stored);
 }
 
 #else
 
+std::uint64_t cost_of_crypt(std::string_view) noexcept {
+  return 0;
+}
 int make_crypt(std::string_view, std::string&) {
   return result::unwilling_to_perform;
 }
@@ -374,7 +477,7 @@ int make_salted(const SaltedScheme& scheme, std::string_view clear, std::string&
   if (!make_salt(salt) || !digest(scheme.type(), clear, salt, made)) return result::no_memory;
   const std::string bytes(made.bytes.begin(), made.bytes.begin() + made.length);
   if (base64_encode(bytes + salt, encoded) != result::success) return result::no_memory;
-  stored = "{" + std::string(scheme.name) + "}" + encoded;
+  stored = with_scheme(scheme.name, encoded);
   return result::success;
 }
 
@@ -402,8 +505,8 @@ int make_pbkdf2(const SaltedScheme& scheme, int iterations, std::string_view cle
   if (!encode_unpadded(salt, salt_text) || !encode_unpadded(hash, hash_text)) {
     return result::no_memory;
   }
-  stored = "{" + std::string(scheme.name) + "}" + std::to_string(iterations) + "$" + salt_text +
-           "$" + hash_text;
+  stored = with_scheme(scheme.name, std::to_string(iterations));
+  for (const std::string& part : {salt_text, hash_text}) (stored += '$') += part;
   return result::success;
 }
 
@@ -416,11 +519,7 @@ int seal_secret(const Key& key, SecretPlace place, std::string_view clear,
   if (!seal(key, place, clear, sealed) || base64_encode(sealed, encoded) != result::success) {
     return result::no_memory;
   }
-  std::string text = "{";
-  text += kSealedScheme;
-  text += '}';
-  text += encoded;
-  stored = std::move(text);
+  stored = with_scheme(kSealedScheme, encoded);
   return result::success;
 } catch (...) {
   return result::no_memory;
@@ -441,15 +540,35 @@ OpenResult open_secret(const Key* key, std::string_view stored, std::string& cle
   return OpenResult::broken;
 }
 
-bool verify_secret(const Key* key, SecretPlace place, std::string_view stored,
+Match match_secret(const Key* key, SecretPlace place, std::string_view stored,
                    std::string_view clear) noexcept try {
-  if (clear.empty()) return false;
+  if (clear.empty() || stored == kNobodys) return Match::no;
   std::string_view scheme;
   std::string_view rest;
-  if (!split_scheme(stored, scheme, rest)) return same_text(stored, clear);
-  return verify_scheme(key, place, scheme, rest, clear);
+  const bool same = split_scheme(stored, scheme, rest)
+                        ? verify_scheme(key, place, scheme, rest, clear)
+                        : same_text(stored, clear);
+  return same ? Match::yes : Match::no;
 } catch (...) {
-  return false;
+  return Match::no_memory;
+}
+
+bool verify_secret(const Key* key, SecretPlace place, std::string_view stored,
+                   std::string_view clear) noexcept {
+  return match_secret(key, place, stored, clear) == Match::yes;
+}
+
+std::uint64_t verification_cost(std::string_view stored) noexcept {
+  std::string_view scheme;
+  std::string_view rest;
+  if (!split_scheme(stored, scheme, rest)) return 0;
+  if (equals_ignore_ascii_case(scheme, kCryptScheme)) return cost_of_crypt(rest);
+  for (const SaltedScheme& known : kPbkdf2Schemes) {
+    if (equals_ignore_ascii_case(scheme, known.name)) {
+      return static_cast<std::uint64_t>(read_iterations(rest.substr(0, rest.find('$'))));
+    }
+  }
+  return 0;
 }
 
 void verify_nothing(std::string_view clear) noexcept try {

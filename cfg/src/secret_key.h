@@ -31,6 +31,11 @@ using SharedKey = std::shared_ptr<const Key>;
 // nobody holds it any more. Thread-safe.
 int share_key_stash(const char* path, SharedKey& key, std::string& why) noexcept;
 
+// As verify_secret, for those who must not take want of memory for a "no".
+enum class Match { no, yes, no_memory };
+Match match_secret(const Key* key, SecretPlace place, std::string_view stored,
+                   std::string_view clear) noexcept;
+
 // Wipes a buffer when the scope ends.
 class WipeAtEnd {
  public:

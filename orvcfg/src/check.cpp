@@ -1,5 +1,7 @@
 #include "check.h"
 
+#include <fstream>
+#include <iterator>
 #include <map>
 #include <utility>
 #include <vector>
@@ -8,6 +10,7 @@
 #include "cfg/secret.h"
 #include "file_session.h"
 #include "schema_check.h"
+#include "slapi/file_doubts.h"
 
 namespace orv::orvcfg {
 
@@ -24,12 +27,19 @@ class FileCheck {
       report(entry, problem);
     }
     check_secrets(entry);
+    check_addresses(entry);
     check_identity(entry, "orv-slapdAdminDN");
     check_identity(entry, "orv-slapdMasterDN");
   }
 
   void report(const FileEntry& entry, const std::string& problem) {
     out_ << entry.dn << ": " << problem << "\n";
+    ++problems_;
+  }
+
+  // What concerns no entry but the text of the file.
+  void report(const std::string& problem) {
+    out_ << problem << "\n";
     ++problems_;
   }
 
@@ -63,6 +73,12 @@ class FileCheck {
     }
   }
 
+  void check_addresses(const FileEntry& entry) {
+    for (const std::string& address : entry.values("orv-slapdIpAddress")) {
+      if (const std::string doubt = address_doubt(address); !doubt.empty()) report(entry, doubt);
+    }
+  }
+
   void check_identity(const FileEntry& entry, const char* type) {
     for (const std::string& value : entry.values(type)) {
       std::string name;
@@ -91,9 +107,15 @@ bool conclude(const std::string& file, std::size_t entries, int problems, std::o
   return problems == 0;
 }
 
+std::string text_of(const std::string& file) {
+  std::ifstream in(file, std::ios::binary);
+  return {std::istreambuf_iterator<char>(in), {}};
+}
+
 bool check_entries(const std::string& file, const std::vector<FileEntry>& entries,
                    const cfg::Key* key, std::ostream& out) {
   FileCheck check(key, out);
+  for (const std::string& line : numbered_types(text_of(file))) check.report(file + ": " + line);
   for (const FileEntry& entry : entries) check.check(entry);
   return conclude(file, entries.size(), check.problems(), out);
 }

@@ -6,7 +6,6 @@
 #pragma once
 
 #include <string>
-#include <string_view>
 #include <vector>
 
 namespace orv::server {
@@ -17,12 +16,5 @@ namespace orv::server {
 // cannot be read gives its cause. Throws std::bad_alloc.
 std::vector<std::string> doubts_about_file(const std::string& config_file,
                                            const std::string& key_stash_file);
-
-// The lines of an LDIF text whose attribute type is a number, as "line N: ...".
-std::vector<std::string> numbered_types(std::string_view ldif);
-
-// Whether `address` can be none of this host's: a literal address that no interface has. Wildcards
-// and names pass.
-bool is_foreign_address(const std::string& address);
 
 }  // namespace orv::server

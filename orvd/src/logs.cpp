@@ -2,7 +2,6 @@
 
 #include <fcntl.h>
 #include <poll.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -53,55 +52,6 @@ LogLevel level_of(std::string_view name) {
   if (name == "debug") return LogLevel::debug;
   if (name == "off") return LogLevel::off;
   return LogLevel::info;
-}
-
-// ---- files
-
-bool same_file(const struct stat& a, const struct stat& b) noexcept {
-  return a.st_dev == b.st_dev && a.st_ino == b.st_ino;
-}
-
-// A log file that was opened, and which file it turned out to be.
-struct LogFile {
-  Descriptor descriptor;
-  struct stat status {};
-  bool made = false;
-};
-
-// O_NONBLOCK: a named pipe without a reader must not hold the server up. A file that is not there
-// is made for its owner only.
-bool open_log_file(const std::string& path, LogFile& file) {
-  constexpr int kFlags = O_WRONLY | O_APPEND | O_CLOEXEC | O_NONBLOCK | O_NOCTTY;
-  int fd = ::open(path.c_str(), kFlags);
-  if (fd < 0 && errno == ENOENT) {
-    fd = ::open(path.c_str(), kFlags | O_CREAT | O_EXCL, 0600);
-    file.made = fd >= 0;
-    if (fd < 0 && errno == EEXIST) fd = ::open(path.c_str(), kFlags | O_CREAT, 0600);
-  }
-  file.descriptor = Descriptor(fd);
-  return fd >= 0;
-}
-
-// Why the opened file cannot be a log, or "".
-std::string refuse(const LogFile& file, const std::vector<std::string>& guarded) {
-  if (!S_ISREG(file.status.st_mode)) return "not a regular file";
-  for (const std::string& other : guarded) {
-    struct stat status {};
-    if (stat(other.c_str(), &status) == 0 && same_file(file.status, status))
-      return "the same file as " + other;
-  }
-  return "";
-}
-
-// Opens a log that is none of the guarded files. It is examined once it is open: what its name
-// meant before may be something else by now.
-std::string open_guarded(const std::string& path, const std::vector<std::string>& guarded,
-                         LogFile& file) {
-  if (!open_log_file(path, file) || fstat(file.descriptor.number(), &file.status) != 0)
-    return std::strerror(errno);
-  std::string reason = refuse(file, guarded);
-  if (!reason.empty() && file.made) ::unlink(path.c_str());
-  return reason;
 }
 
 // ---- sinks
@@ -155,7 +105,7 @@ struct Logs::Log {
   };
 
   std::shared_ptr<spdlog::logger> logger;
-  struct stat file {};  // st_ino 0: no file
+  FileIdentity file;  // none: standard error
   std::deque<Line> lines;
   std::size_t bytes = 0;
   std::uint64_t lost = 0;
@@ -236,9 +186,12 @@ struct Logs::Writer {
 
 namespace {
 
+constexpr const char* kErrorLog = "the error log";
+constexpr const char* kAccessLog = "the access log";
+
 // What one log is to become.
 struct Candidate {
-  LogFile file;  // with a path and a level only
+  AppendedFile file;  // with a path and a level only
   std::string path;
   LogLevel level = LogLevel::off;
   std::string reason;  // it is refused
@@ -246,19 +199,18 @@ struct Candidate {
   bool accepted() const { return reason.empty(); }
 };
 
-Candidate examine(const std::string& path, const std::string& level,
-                  const std::vector<std::string>& guarded) {
+Candidate examine(const std::string& path, const std::string& level, const GuardedFiles& guarded) {
   Candidate wanted;
   wanted.path = path;
   wanted.level = level_of(level);
   if (path.empty() || wanted.level == LogLevel::off) return wanted;
-  wanted.reason = open_guarded(path, guarded, wanted.file);
+  wanted.reason = open_to_append(path, O_WRONLY, guarded, wanted.file);
   return wanted;
 }
 
-void refuse_if_same(Candidate& wanted, const struct stat& other, const char* other_name) {
-  if (!wanted.accepted() || other.st_ino == 0 || !same_file(wanted.file.status, other)) return;
-  wanted.reason = std::string("the same file as the ") + other_name;
+void refuse_if_same(Candidate& wanted, const FileIdentity& other, const char* as) {
+  if (!wanted.accepted() || !other || wanted.file.identity != other) return;
+  wanted.reason = std::string("the same file as ") + as;
 }
 
 std::shared_ptr<spdlog::logger> make_logger(Candidate& wanted, bool access) {
@@ -278,8 +230,8 @@ std::shared_ptr<spdlog::logger> make_logger(Candidate& wanted, bool access) {
 
 }  // namespace
 
-Logs::Logs(std::vector<std::string> guarded_files)
-    : guarded_files_(std::move(guarded_files)),
+Logs::Logs(GuardedFiles guarded)
+    : guarded_(std::move(guarded)),
       writer_(std::make_shared<Writer>()),
       thread_([writer = writer_] { writer->run(); }) {
   Candidate standard_error;
@@ -291,18 +243,20 @@ Logs::~Logs() {
   finish();
 }
 
-std::vector<std::string> Logs::open(const Settings& settings) {
+std::vector<std::string> Logs::open(const Settings& settings,
+                                    const std::vector<FileInUse>& others) {
   std::vector<std::string> problems;
   try {
-    std::vector<std::string> guarded = guarded_files_;
-    guarded.push_back(settings.audit_log);
+    GuardedFiles guarded = guarded_;
+    guarded.names.push_back(settings.audit_log);
+    guarded.in_use.insert(guarded.in_use.end(), others.begin(), others.end());
     Candidate error = examine(settings.error_log, settings.error_log_level, guarded);
     Candidate access = examine(settings.access_log, settings.access_log_level, guarded);
     const std::lock_guard lock(writer_->mutex);
     // Who is refused keeps what it had, which the other one may not take either.
-    if (error.accepted()) refuse_if_same(access, error.file.status, "error log");
-    if (!access.accepted()) refuse_if_same(error, writer_->access.file, "access log");
-    if (!error.accepted()) refuse_if_same(access, writer_->error.file, "error log");
+    if (error.accepted()) refuse_if_same(access, error.file.identity, kErrorLog);
+    if (!access.accepted()) refuse_if_same(error, writer_->access.file, kAccessLog);
+    if (!error.accepted()) refuse_if_same(access, writer_->error.file, kErrorLog);
     for (Candidate* const wanted : {&error, &access}) {
       if (!wanted->accepted()) {
         problems.push_back("cannot log to " + wanted->path + ": " + wanted->reason);
@@ -310,7 +264,7 @@ std::vector<std::string> Logs::open(const Settings& settings) {
       }
       Log& log = writer_->log(wanted == &access);
       log.logger = make_logger(*wanted, wanted == &access);
-      log.file = wanted->file.status;
+      log.file = wanted->file.identity;
     }
     if (access.accepted())
       access_on_.store(access.level == LogLevel::info || access.level == LogLevel::debug,
@@ -321,13 +275,12 @@ std::vector<std::string> Logs::open(const Settings& settings) {
   return problems;
 }
 
-bool Logs::writes_to(const std::string& path) const {
-  struct stat status {};
-  if (stat(path.c_str(), &status) != 0) return false;
+std::vector<FileInUse> Logs::files_in_use() const {
   const std::lock_guard lock(writer_->mutex);
-  for (const Log* const log : {&writer_->error, &writer_->access})
-    if (log->file.st_ino != 0 && same_file(log->file, status)) return true;
-  return false;
+  std::vector<FileInUse> files;
+  if (writer_->error.file) files.push_back({writer_->error.file, kErrorLog});
+  if (writer_->access.file) files.push_back({writer_->access.file, kAccessLog});
+  return files;
 }
 
 // ---- writing

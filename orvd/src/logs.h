@@ -17,6 +17,7 @@
 #include <thread>
 #include <vector>
 
+#include "guarded_file.h"
 #include "settings.h"
 
 namespace orv::server {
@@ -30,20 +31,22 @@ class Logs {
   // How long finish() waits for what is queued.
   static constexpr std::chrono::milliseconds kPatience{3000};
 
-  // Starts with the error log on standard error at level info and no access log. `guarded_files`
-  // are files that no log may share (the configuration file, its save file, the key stash).
-  explicit Logs(std::vector<std::string> guarded_files = {});
+  // Starts with the error log on standard error at level info and no access log. `guarded` are
+  // files that no log may ever be (the configuration file, its save file, the key stash).
+  explicit Logs(GuardedFiles guarded = {});
   ~Logs();
   Logs(const Logs&) = delete;
   Logs& operator=(const Logs&) = delete;
 
   // Opens what the settings name, also when they name the same files again (somebody may have moved
-  // them away). A log that cannot be opened, or is a guarded file or the other log under whatever
+  // them away). A log that cannot be opened, or is a guarded file, one of `others` (that further
+  // logs have open now), the audit log that the settings name, or the other log, under whatever
   // name, keeps the file it had; the reasons are returned, one line each.
-  std::vector<std::string> open(const Settings& settings);
+  std::vector<std::string> open(const Settings& settings,
+                                const std::vector<FileInUse>& others = {});
 
-  // Whether the error log or the access log is open on the file at `path`.
-  bool writes_to(const std::string& path) const;
+  // The files that the logs go to now.
+  std::vector<FileInUse> files_in_use() const;
 
   // Writes one line to the error log.
   void write(LogLevel level, std::string_view line) noexcept;
@@ -73,7 +76,7 @@ class Logs {
   // False when the log is not open or closed again.
   bool queue(bool access, LogLevel level, std::string_view text);
 
-  const std::vector<std::string> guarded_files_;
+  const GuardedFiles guarded_;
   std::shared_ptr<Writer> writer_;  // shared with its thread
   std::thread thread_;
   std::atomic<bool> access_on_{false};

@@ -5,11 +5,13 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -22,10 +24,13 @@
 #include "broken_file.h"
 #include "cfg/attribute_table.h"
 #include "cfg/diagnostics.h"
+#include "cfg/masked_dn.h"
 #include "cfg/object_class_table.h"
 #include "cfg/result_codes.h"
+#include "cfg/session.h"
 #include "directory_backend.h"
 #include "file_report.h"
+#include "guarded_file.h"
 #include "logs.h"
 #include "ops/persistent_search.h"
 #include "options.h"
@@ -81,11 +86,14 @@ void tell(Logs& logs, const std::string& error, const std::vector<std::string>& 
 
 class StoredIdentities final : public Authenticator {
  public:
-  StoredIdentities(const Options& options, Logs& logs)
-      : store_(options.config_file, options.key_stash_file,
-               [&logs](const std::string& error, const std::vector<std::string>& warnings) {
-                 tell(logs, error, warnings);
-               }),
+  // `follow` as in IdentityStore.
+  StoredIdentities(const Options& options, Logs& logs, std::function<bool()> follow)
+      : store_(
+            options.config_file, options.key_stash_file,
+            [&logs](const std::string& error, const std::vector<std::string>& warnings) {
+              tell(logs, error, warnings);
+            },
+            std::move(follow)),
         logs_(logs) {}
 
   bool reload(std::string& error) {
@@ -119,16 +127,22 @@ class StoredIdentities final : public Authenticator {
     return !identities || identities->defined_by(entry_dn);
   }
 
-  // Reads what has changed; what is found is told.
-  void refresh() noexcept { store_.current(); }
+  // Reads what has changed; what is found is told. Whether something was read.
+  bool refresh() noexcept {
+    const std::uint64_t before = store_.generation();
+    store_.current();
+    return store_.generation() != before;
+  }
 
  private:
   // Once for each reading of the file: strangers must not fill the log.
   void tell_of_claim(std::string_view name) {
     const std::uint64_t generation = store_.generation();
     if (told_.exchange(generation) == generation) return;
+    std::string shown = "not a DN";
+    cfg::mask_dn(name, shown);
     std::string line = "nobody can bind as ";
-    append_quoted(line, name);
+    append_quoted(line, shown);
     logs_.error(line + ": more than one entry defines that identity");
   }
 
@@ -150,13 +164,13 @@ constexpr Renewal kMethods{"the method of storing passwords", renew_password_met
 constexpr Renewal kAdministrators{"the administrators", renew_administrators};
 
 // One at a time, so that what was read before a change never comes after what was read behind it.
-void renew(const Renewal& renewal, const Options& options, Logs& logs) noexcept {
+bool renew(const Renewal& renewal, const Options& options, Logs& logs) noexcept {
   static std::mutex renewing;
   try {
     const std::lock_guard lock(renewing);
     std::string error;
     const int code = renewal.renew(options.config_file, options.key_stash_file, error);
-    if (code == result::success) return;
+    if (code == result::success) return true;
     if (error.empty()) error = "result " + std::to_string(code);
     if (code == result::no_such_object) error = "the configuration file has no entry for it";
     logs.warning(std::string(renewal.what) + " stays as it was: " + error);
@@ -164,18 +178,22 @@ void renew(const Renewal& renewal, const Options& options, Logs& logs) noexcept 
     logs.error(renewal.what);
     logs.error("could not be read: out of memory");
   }
+  return false;
 }
 
+// The administrators are taken over with the identities.
 void renew_all(const Options& options, Logs& logs) noexcept {
-  for (const Renewal& renewal : {kAdministrators, kPolicy, kMethods}) renew(renewal, options, logs);
+  for (const Renewal& renewal : {kPolicy, kMethods}) renew(renewal, options, logs);
 }
 
-void take_over(const Consequences& consequences, StoredIdentities& identities,
+bool take_over(const Consequences& consequences, bool made, StoredIdentities& identities,
                const Options& options, Logs& logs) noexcept {
-  if (consequences.identities) identities.refresh();
-  if (consequences.identities) renew(kAdministrators, options, logs);
+  // A change that failed is looked for: the old file could perhaps not be put back.
+  const bool read = (consequences.identities || !made) && identities.refresh();
+  if (!made && !read) return false;
   if (consequences.policy) renew(kPolicy, options, logs);
   if (consequences.methods) renew(kMethods, options, logs);
+  return read;
 }
 
 // ---- the process
@@ -205,13 +223,21 @@ void prepare_process() {
 
 // Files that nothing may be written to but what belongs there.
 std::vector<std::string> own_files(const Options& options) {
-  const std::string& config = options.config_file;
+  const std::string& config = options.config_file;  // without symbolic links
   std::vector<std::string> files = {config, options.key_stash_file,
                                     config.substr(0, config.rfind('/') + 1) + "admin.pw"};
   // What a change of the configuration file leaves beside it, and uses on the way.
-  for (const char* const ending : {".save", ".lock", ".new", ".swap", ".rescued"})
+  for (const char* const ending : {".save", ".save.new", ".lock", ".new", ".swap", ".rescued"})
     files.push_back(config + ending);
   return files;
+}
+
+// What no log may be: those, and where else something is written from the start to the end.
+GuardedFiles guarded_files(const Options& options, const FileIdentity& standard_error) {
+  GuardedFiles guarded{own_files(options), {}};
+  guarded.names.push_back(options.trace_file);
+  if (standard_error) guarded.in_use.push_back({standard_error, "standard error"});
+  return guarded;
 }
 
 bool may_be_traced_to(const Options& options) {
@@ -324,18 +350,16 @@ void report(Logs& logs, const std::vector<std::string>& problems) {
   for (const std::string& problem : problems) logs.error(problem);
 }
 
-// Before the other logs, which then keep off its file.
-void open_audit_log(const Options& options, const Settings& settings, Logs& logs, AuditLog& audit) {
-  std::vector<std::string> guarded = own_files(options);
-  guarded.push_back(options.trace_file);
-  const std::string reason = logs.writes_to(settings.audit_log)
-                                 ? "another log is there"
-                                 : audit.open(settings.audit_log, guarded);
+// The audit log first: what is its file then, wanted or not, is kept from the other logs.
+void open_logs(const Settings& settings, GuardedFiles guarded, Logs& logs, AuditLog& audit) {
+  for (FileInUse& file : logs.files_in_use()) guarded.in_use.push_back(std::move(file));
+  const std::string reason = audit.open(settings.audit_log, guarded);
   if (!reason.empty()) logs.error("cannot record changes in " + settings.audit_log + ": " + reason);
+  report(logs, logs.open(settings, audit.files_in_use()));
 }
 
-int serve(const Options& options, const Settings& settings, Logs& logs, AuditLog& audit,
-          StoredIdentities& identities, BackendPlace& place) {
+int serve(const Options& options, const Settings& settings, const GuardedFiles& guarded, Logs& logs,
+          AuditLog& audit, StoredIdentities& identities, BackendPlace& place) {
   BrokenFileReporter broken_file(options.config_file, options.key_stash_file, logs);
   Server server({builtin_schema(), place.backend, identities, publications(), logs,
                  slapi_supported_controls(), settings,
@@ -348,17 +372,16 @@ int serve(const Options& options, const Settings& settings, Logs& logs, AuditLog
                      return false;
                    }
                    renew_all(options, logs);
-                   open_audit_log(options, wanted, logs, audit);
-                   report(logs, logs.open(wanted));
+                   open_logs(wanted, guarded, logs, audit);
                    configfile_read.fetch_add(1, std::memory_order_relaxed);
                    logs.info("settings taken over");
                    return true;
                  },
                  [&broken_file] { broken_file.note_failure(); }, &audit,
-                 [&](const Consequences& consequences) {
-                   take_over(consequences, identities, options, logs);
+                 [&](const Consequences& consequences, bool made) {
+                   return take_over(consequences, made, identities, options, logs);
                  },
-                 options.guards});
+                 options.guards, [&identities] { identities.refresh(); }, cfg_changes_made});
   std::string error;
   const auto& addresses = options.addresses.empty() ? settings.addresses : options.addresses;
   const auto port = options.port.value_or(static_cast<std::uint16_t>(settings.port));
@@ -373,7 +396,7 @@ int serve(const Options& options, const Settings& settings, Logs& logs, AuditLog
   return server.serve();
 }
 
-int run(const Options& options) {
+int run(const Options& options, const FileIdentity& standard_error) {
   if (!apply_options(options)) return 1;
   if (cfg::register_attribute_types(builtin_schema().attribute_table()) != 0) return 1;
   if (cfg::register_object_classes(builtin_schema().object_class_table()) != 0) return 1;
@@ -385,16 +408,17 @@ int run(const Options& options) {
   }
   configfile_read.store(1, std::memory_order_relaxed);
 
-  std::vector<std::string> guarded = own_files(options);
-  if (!options.trace_file.empty()) guarded.push_back(options.trace_file);
-  Logs logs(std::move(guarded));
+  const GuardedFiles guarded = guarded_files(options, standard_error);
+  Logs logs(guarded);
   sink_logs = &logs;
   set_message_sink(message_to_log);
   cfg::set_diagnostics_sink(diagnostics_to_log);
   int status = 1;
+  bool recorded = true;
   static BackendPlace place;  // referred to by what the backend keeps
   {
-    StoredIdentities identities(options, logs);
+    StoredIdentities identities(
+        options, logs, [&options, &logs] { return renew(kAdministrators, options, logs); });
     if (!identities.reload(error)) {
       std::fprintf(stderr, "orvd: %s\n", error.c_str());
     } else if (start_backend(options, place)) {
@@ -408,17 +432,19 @@ int run(const Options& options) {
         status = 0;
       } else {
         AuditLog audit([&logs](std::string_view line) { logs.error(line); });
-        open_audit_log(options, settings, logs, audit);
-        report(logs, logs.open(settings));
+        open_logs(settings, guarded, logs, audit);
         announce_controls();
-        status = serve(options, settings, logs, audit, identities, place);
+        status = serve(options, settings, guarded, logs, audit, identities, place);
+        recorded = audit.finish();
       }
     }
   }
   const bool finished = logs.finish();
   sink_logs = nullptr;
-  if (!finished) std::_Exit(status);  // something still holds on to what destructors take away
-  return status;
+  if (finished && recorded) return status;
+  // Something still holds on to what destructors take away.
+  drain_standard_error(StandardError::kPatience);
+  std::_Exit(status);
 }
 
 }  // namespace
@@ -430,9 +456,10 @@ int main(int argc, char** argv) {
   int status = 0;
   if (parse_options(argc, argv, options, status) == Parsed::exit) return status;
   prepare_process();
+  const FileIdentity standard_error_file = regular_file_of(STDERR_FILENO);
   const StandardError standard_error;
   try {
-    return run(options);
+    return run(options, standard_error_file);
   } catch (const std::exception& error) {
     std::fprintf(stderr, "orvd: %s\n", error.what());
     return 1;

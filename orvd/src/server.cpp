@@ -8,6 +8,7 @@
 #include <thread>
 #include <utility>
 
+#include "audit/log.h"
 #include "slapi/globals.h"
 #include "standard_error.h"
 #include "stop_watchdog.h"
@@ -19,6 +20,8 @@ constexpr std::size_t kChangeThreads = 1;  // the gate lets no more than one in
 constexpr std::size_t kVerifierThreads = 2;
 // How often waiting operations are checked for their deadline.
 constexpr std::chrono::milliseconds kGateInterval{100};
+// How often the files are looked at that nobody says have changed.
+constexpr std::chrono::milliseconds kFileInterval{1000};
 // How long a stopping server waits for the operation in hand, and for clients to leave.
 constexpr std::chrono::seconds kPatience{30};
 constexpr std::chrono::seconds kFarewell{3};
@@ -40,6 +43,7 @@ Server::Server(ServerParts parts)
     : parts_(std::move(parts)),
       signals_(control_),
       gate_timer_(control_),
+      file_timer_(control_),
       backend_(parts_.backend,
                [this](std::string_view why) {
                  parts_.logs.error("the backend threw: " + std::string(why) +
@@ -63,6 +67,7 @@ Server::Server(ServerParts parts)
   services_.audit = parts_.audit;
   services_.guards = parts_.guards;
   services_.take_over = parts_.take_over;
+  services_.changes_made = parts_.changes_made;
   services_.renew_settings = [this] { renew_settings(); };
   for (unsigned i = 0; i < std::max(1U, parts_.loops); ++i)
     loops_.push_back(std::make_unique<Loop>(parts_.logs, settings_));
@@ -78,6 +83,7 @@ void Server::stop_workers() {
     pool->stop();
     pool->join();
   }
+  if (parts_.audit) parts_.audit->settle();
 }
 
 bool Server::listen(const std::vector<std::string>& addresses, std::uint16_t port,
@@ -102,6 +108,7 @@ void Server::await_signal() {
 int Server::serve() {
   const auto work = asio::make_work_guard(control_);
   watch_gate();
+  watch_files();
   for (const auto& loop : loops_) loop->start();
   listeners_.start(settings_);
   control();
@@ -132,6 +139,26 @@ void Server::watch_gate() {
   });
 }
 
+// Reading may take long: workers do it, one at a time.
+void Server::watch_files() {
+  if (!parts_.look_after) return;
+  file_timer_.expires_after(kFileInterval);
+  file_timer_.async_wait([this](const asio::error_code& error) {
+    if (error) return;
+    watch_files();
+    if (looking_.exchange(true)) return;
+    try {
+      asio::post(verifiers_, [this] {
+        parts_.look_after();
+        looking_.store(false);
+      });
+    } catch (...) {
+      looking_.store(false);
+      throw;
+    }
+  });
+}
+
 void Server::wind_up() {
   const StopWatchdog watchdog(kPatience + kWindUp);
   parts_.logs.info("stopping");
@@ -151,6 +178,7 @@ void Server::wind_up() {
   }
   // The answer to the operation in hand goes to its loop before the farewell does.
   changes_.join();
+  if (parts_.audit) parts_.audit->settle();
   for (const auto& loop : loops_) loop->disconnect_all();
   const Clock::time_point end = Clock::now() + kFarewell;
   while (!backend_.failed() && counter_.count() > 0 && Clock::now() < end)

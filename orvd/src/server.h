@@ -9,6 +9,7 @@
 #include <asio/io_context.hpp>
 #include <asio/signal_set.hpp>
 #include <asio/steady_timer.hpp>
+#include <atomic>
 #include <functional>
 #include <memory>
 #include <mutex>
@@ -38,10 +39,14 @@ struct ServerParts {
   // Told when an operation failed because the backend could not open its session. May be empty.
   std::function<void()> note_failure{};
   AuditLog* audit = nullptr;  // null: changes are not recorded
-  // Takes over identities and password policy after a change. Inside the gate; must not throw. May
-  // be empty.
-  std::function<void(const Consequences&)> take_over{};
+  // Takes over identities and password policy after a change (Services::take_over). Inside the
+  // gate; must not throw. May be empty.
+  std::function<bool(const Consequences&, bool made)> take_over{};
   bool guards = true;  // the server's own, in front of the backend
+  // Looks after what time may have changed, about once a second and on a worker. Must not throw.
+  // May be empty.
+  std::function<void()> look_after{};
+  unsigned long (*changes_made)() = nullptr;  // Services::changes_made
 };
 
 class Server {
@@ -80,6 +85,7 @@ class Server {
   void renew_settings() noexcept;
   void control();
   void watch_gate();
+  void watch_files();
   void wind_up();
   void stop_workers();
   void await_signal();
@@ -88,6 +94,8 @@ class Server {
   asio::io_context control_{1};
   asio::signal_set signals_;
   asio::steady_timer gate_timer_;
+  asio::steady_timer file_timer_;
+  std::atomic<bool> looking_{false};  // a worker is at it, or will be
   BackendHost backend_;
   Services services_;
   ConnectionCounter counter_;

@@ -43,6 +43,7 @@ constexpr SettingRow kRows[] = {
     row("orv-slapdMaxPersistentSearches", &Settings::max_persistent_searches),
     row("orv-slapdMaxPersistentSearchesPerConnection",
         &Settings::max_persistent_searches_per_connection),
+    row("orv-slapdMaxFailedChangeSize", &Settings::max_failed_change_size),
 };
 
 constexpr const char* kAddresses = "orv-slapdIpAddress";

@@ -31,7 +31,8 @@ struct Settings {
   std::int64_t message_timeout = 30;          // seconds to finish a message once begun
   std::int64_t max_persistent_searches = 64;  // in all, 0: there are none
   std::int64_t max_persistent_searches_per_connection = 8;
-  std::vector<std::string> addresses;  // empty: every address
+  std::int64_t max_failed_change_size = 16777216;  // bytes of one identity within a day
+  std::vector<std::string> addresses;              // empty: every address
 
   std::string error_log;  // path; empty: standard error
   std::string error_log_level = "info";

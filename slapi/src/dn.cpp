@@ -6,6 +6,7 @@
 #include "cfg/dn.h"
 #include "cfg/result_codes.h"
 #include "memory.h"
+#include "reserves.h"
 #include "slapi/connection.h"
 
 namespace orv {
@@ -20,11 +21,10 @@ bool is_suffix(const Backend* backend, std::string_view dn) noexcept {
 
 // Stands for a parent without memory: no DN, so that nothing is found there.
 constexpr std::string_view kNowhere = "=";
-// NOLINTNEXTLINE(cert-err58-cpp) filled when the library is loaded, and throws nothing
-slapi::Reserve g_nowhere(kNowhere.size() + 1);
+static_assert(kNowhere.size() < slapi::kReservedText);
 
 char* nowhere() noexcept {
-  auto* const text = static_cast<char*>(g_nowhere.take());
+  auto* const text = static_cast<char*>(slapi::text_reserve().take());
   if (text != nullptr) kNowhere.copy(text, kNowhere.size());
   return text;
 }
@@ -67,7 +67,7 @@ char* dn_parent_norm(const Backend* backend, const char* normalized_dn) {
   if (normalized_dn == nullptr || is_suffix(backend, normalized_dn)) return nullptr;
   const std::string_view parent = cfg::parent_of_normal_dn(normalized_dn);
   if (parent.empty()) return nullptr;
-  g_nowhere.fill();
+  slapi::text_reserve().fill();
   char* const text = slapi::copy_bytes(parent);
   return text == nullptr ? nowhere() : text;
 }

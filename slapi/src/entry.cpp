@@ -39,7 +39,7 @@ std::size_t count_values(berval* const* values) noexcept {
 void free_values(berval** values) noexcept {
   if (values == nullptr) return;
   for (berval** value = values; *value != nullptr; ++value) {
-    std::free((*value)->bv_val);
+    slapi::wipe_and_free((*value)->bv_val);
     std::free(*value);
   }
   std::free(values);
@@ -174,16 +174,29 @@ void set_object_classes(entry& e, attr* classes, slapi::MallocPtr<ShortValue> li
 
 // ---- Merging ---------------------------------------------------------------------------------
 
+// The equality key of a value of an entry, in whatever code page it holds its texts: letters of
+// another one than UTF-8 have no case until they are converted.
+std::string key_in(const entry& e, cfg::MatchingRule rule, std::string_view value) {
+  if (!e.local_code_page || local_code_page_is_utf8()) return slapi::equality_key(rule, value);
+  const std::string local(value);
+  char* converted = nullptr;
+  std::size_t length = 0;
+  const int rc = xlate_localcp_to_utf8(local.c_str(), &converted, &length);
+  const slapi::MallocPtr<char> utf8(converted);
+  if (rc == result::no_memory) throw std::bad_alloc();
+  return slapi::equality_key(rule, rc == result::success ? std::string_view(utf8.get()) : value);
+}
+
 // Whether one of the added values is there already, in the attribute or among those added before
 // it. Linear in the number of values.
-bool adds_duplicate(const attr& present, berval* const* added) {
+bool adds_duplicate(const entry& e, const attr& present, berval* const* added) {
   const cfg::MatchingRule rule = rule_of(present, present.syntax);
   std::unordered_set<std::string> keys;
   keys.reserve(count_values(present.values) + count_values(added));
   for (berval* const* value = present.values; value != nullptr && *value != nullptr; ++value)
-    keys.insert(slapi::equality_key(rule, bytes_of(**value)));
+    keys.insert(key_in(e, rule, bytes_of(**value)));
   for (; *added != nullptr; ++added)
-    if (!keys.insert(slapi::equality_key(rule, bytes_of(**added))).second) return true;
+    if (!keys.insert(key_in(e, rule, bytes_of(**added))).second) return true;
   return false;
 }
 
@@ -265,14 +278,14 @@ int doom_equal(const entry& e, const attr& present, const std::vector<std::strin
   std::unordered_multimap<std::string, std::size_t> held;
   held.reserve(doomed.size());
   for (std::size_t i = 0; i < doomed.size(); ++i)
-    held.emplace(slapi::equality_key(rule, bytes_of(*present.values[i])), i);
+    held.emplace(key_in(e, rule, bytes_of(*present.values[i])), i);
   for (const std::string_view value : wanted) {
     slapi::MallocPtr<char> text;
     std::size_t length = 0;
     std::string copy(value);  // with the NUL that counted values have behind them
     const berval counted{copy.size(), copy.data()};
     if (const int rc = text_for_entry(e, counted, text, length); rc != result::success) return rc;
-    const auto found = held.find(slapi::equality_key(rule, {text.get(), length}));
+    const auto found = held.find(key_in(e, rule, {text.get(), length}));
     if (found == held.end()) return result::no_such_attribute;
     doomed[found->second] = true;
     held.erase(found);
@@ -297,7 +310,7 @@ int remove_values(entry& e, attr& present, const Doomed& doomed) noexcept {
   }
   for (std::size_t i = 0; i < doomed.size(); ++i) {
     if (!doomed[i]) continue;
-    std::free(present.values[i]->bv_val);
+    slapi::wipe_and_free(present.values[i]->bv_val);
     std::free(present.values[i]);
   }
   std::free(present.values);
@@ -406,7 +419,7 @@ int attr_merge(entry* e, const char* type, berval** values, int /*syntax_normali
   try {
     // A secret's code must not depend on its content: whoever may not read it would learn it so.
     if (check_duplicates != 0 && count != 0 && !slapi::is_secret_type(type) &&
-        adds_duplicate(*present, copies.get()))
+        adds_duplicate(*e, *present, copies.get()))
       return result::attribute_or_value_exists;
   } catch (const std::bad_alloc&) {
     return result::no_memory;

@@ -13,6 +13,7 @@
 #include <cstring>
 #include <string_view>
 
+#include "masked_text.h"
 #include "record_writer.h"
 
 namespace orv {
@@ -166,13 +167,16 @@ class Line {
   void add(std::string_view text) noexcept {
     for (const char c : text) put(c);
   }
+  // Without the passwords in it: what somebody named, and is told of, may hold one.
   void add_argument(const char* text) noexcept {
+    const std::size_t begin = length_;
     for (const char c : std::string_view(text == nullptr ? "(null)" : text)) {
       if (static_cast<unsigned char>(c) < 0x20 || c == 0x7F)
         add_hex(static_cast<unsigned char>(c));
       else
         put(c);
     }
+    length_ = slapi::mask_secrets(text_, begin, length_, sizeof text_ - 1);
   }
   const char* c_str() noexcept {
     if (cut_) std::memcpy(text_ + length_ - 3, "...", 3);

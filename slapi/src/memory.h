@@ -24,6 +24,13 @@ inline char* copy_bytes(std::string_view bytes) noexcept {
   return copy;
 }
 
+// Frees a NUL-terminated text that may be a password; null is a no-op.
+inline void wipe_and_free(char* text) noexcept {
+  if (text == nullptr) return;
+  explicit_bzero(text, std::strlen(text));
+  std::free(text);
+}
+
 // A zeroed block put aside while there is memory, for the one answer that must not fail: where null
 // would be read as "nothing to do". Whoever gets the block releases it with free; the next call of
 // `fill` puts another one aside. Thread-safe.
@@ -34,11 +41,14 @@ class Reserve {
   Reserve(const Reserve&) = delete;
   Reserve& operator=(const Reserve&) = delete;
 
-  void fill() noexcept {
-    if (block_.load(std::memory_order_relaxed) != nullptr) return;
+  // False when there is no memory for one.
+  bool fill() noexcept {
+    if (block_.load(std::memory_order_relaxed) != nullptr) return true;
     void* const made = std::calloc(1, size_);
+    if (made == nullptr) return false;
     void* none = nullptr;
     if (!block_.compare_exchange_strong(none, made)) std::free(made);
+    return true;
   }
   // Null only when it was taken and could not be filled again.
   void* take() noexcept { return block_.exchange(nullptr); }

@@ -5,6 +5,7 @@
 
 #include "admitted.h"
 #include "memory.h"
+#include "reserves.h"
 #include "slapi/entry.h"
 
 namespace orv {
@@ -13,13 +14,15 @@ namespace {
 // ---- Release ---------------------------------------------------------------------------------
 
 void free_strings(char** strings) noexcept {
-  charray_free(strings);
+  if (strings == nullptr) return;
+  for (char** text = strings; *text != nullptr; ++text) slapi::wipe_and_free(*text);
+  std::free(strings);
 }
 
 void free_counted(berval** values) noexcept {
   if (values == nullptr) return;
   for (berval** value = values; *value != nullptr; ++value) {
-    std::free((*value)->bv_val);
+    slapi::wipe_and_free((*value)->bv_val);
     std::free(*value);
   }
   std::free(values);
@@ -54,9 +57,10 @@ std::size_t count_values(const attr& a) noexcept {
   return count;
 }
 
-// Values are read up to their NUL: in a translated list their lengths count it.
+// Values are read up to their NUL: in a translated list their lengths count it. Null without
+// memory, and for a value without a text, which is what is left of one whose translation failed.
 char* copy_value(const berval& value) noexcept {
-  return slapi::copy_bytes(value.bv_val == nullptr ? "" : value.bv_val);
+  return value.bv_val == nullptr ? nullptr : slapi::copy_bytes(value.bv_val);
 }
 
 // Null without memory.
@@ -82,13 +86,9 @@ ldapmod** new_array(std::size_t records) noexcept {
   return static_cast<ldapmod**>(std::calloc(records + 1, sizeof(ldapmod*)));
 }
 
-// An array of one record: without a list the caller would report a success that wrote nothing.
-// NOLINTNEXTLINE(cert-err58-cpp) filled when the library is loaded, and throws nothing
-slapi::Reserve g_reserve(2 * sizeof(ldapmod*));
-
 // The array that says that the list could not be made. `array` is reused when there is one.
 ldapmod** refusal(ldapmod** array) noexcept {
-  if (array == nullptr) array = static_cast<ldapmod**>(g_reserve.take());
+  if (array == nullptr) array = static_cast<ldapmod**>(slapi::list_reserve().take());
   if (array == nullptr) return nullptr;
   free_ldmll(array[0]);
   array[0] = &refused_record();
@@ -130,7 +130,7 @@ bool slapi::is_cut_short(const attr* attributes) noexcept {
 
 ldapmod** EntryToLDAPMod(attr* attributes) {
   if (attributes == nullptr) return nullptr;
-  g_reserve.fill();
+  slapi::list_reserve().fill();
   ldapmod** const array = new_array(count_attributes(attributes));
   if (array == nullptr || slapi::is_cut_short(attributes)) return refusal(array);
   ldapmod** next = array;

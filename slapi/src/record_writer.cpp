@@ -11,6 +11,8 @@
 #include <cstring>
 #include <mutex>
 
+#include "masked_text.h"
+
 namespace orv::slapi {
 namespace {
 
@@ -77,6 +79,7 @@ void Record::add_list(const char* format, std::va_list arguments) noexcept {
 void Record::write() noexcept {
   static constexpr char kCutMark[] = " ...\n";
   const int saved_errno = errno;
+  length_ = mask_secrets(text_, 0, length_, kSize - kRoomForEnd);
   if (cut_) {
     std::memcpy(text_ + length_, kCutMark, sizeof kCutMark - 1);
     length_ += sizeof kCutMark - 1;

@@ -19,7 +19,8 @@ class Record {
   [[gnu::format(printf, 2, 3)]] void add(const char* format, ...) noexcept;
   void add_list(const char* format, std::va_list arguments) noexcept;
 
-  // Ends the line, unless its text did, and writes it.
+  // Ends the line, unless its text did, and writes it, without the passwords that stand in it as
+  // "type=value": in a DN or a filter.
   void write() noexcept;
 
  private:

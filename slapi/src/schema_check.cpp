@@ -8,6 +8,7 @@
 
 #include "admitted.h"
 #include "cfg/dn.h"
+#include "cfg/masked_dn.h"
 #include "cfg/result_codes.h"
 #include "equality.h"
 #include "memory.h"
@@ -224,10 +225,19 @@ class EntryCheck {
     return true;
   }
 
+  // The entry's name for a message, without a password that somebody put into it.
+  [[nodiscard]] std::string shown_dn() const {
+    if (entry_.dn == nullptr) return "";
+    std::string utf8;
+    std::string shown = "not a DN";
+    if (to_utf8(entry_.dn, utf8) && cfg::mask_dn(utf8, shown) == result::no_memory)
+      throw std::bad_alloc();
+    return shown == utf8 ? entry_.dn : shown;
+  }
+
   [[nodiscard]] int refuse(int code, int number, const char* first = "",
-                           const char* second = "") const noexcept {
-    const char* const dn = entry_.dn == nullptr ? "" : entry_.dn;
-    PrintMessage(0, message::schema_set, number, dn, first, second);
+                           const char* second = "") const {
+    PrintMessage(0, message::schema_set, number, shown_dn().c_str(), first, second);
     return code;
   }
 

@@ -10,20 +10,26 @@
 
 #include "cfg/diagnostics.h"
 #include "cfg/dn.h"
+#include "cfg/ldif.h"
 #include "cfg/matching.h"
+#include "cfg/secret.h"
 #include "cfg_fixture.h"
 #include "file_calls.h"
 #include "session_state.h"
 
 #if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
 extern "C" void* __interceptor_malloc(std::size_t size);
+extern "C" void* __interceptor_calloc(std::size_t count, std::size_t size);
 extern "C" void* __interceptor_realloc(void* memory, std::size_t size);
 #define ORV_SYSTEM_MALLOC __interceptor_malloc
+#define ORV_SYSTEM_CALLOC __interceptor_calloc
 #define ORV_SYSTEM_REALLOC __interceptor_realloc
 #else
 extern "C" void* __libc_malloc(std::size_t size);
+extern "C" void* __libc_calloc(std::size_t count, std::size_t size);
 extern "C" void* __libc_realloc(void* memory, std::size_t size);
 #define ORV_SYSTEM_MALLOC __libc_malloc
+#define ORV_SYSTEM_CALLOC __libc_calloc
 #define ORV_SYSTEM_REALLOC __libc_realloc
 #endif
 
@@ -34,6 +40,9 @@ namespace {
 
 thread_local long fail_at = -1;  // counts down to the allocation that fails; negative: none does
 thread_local bool failed = false;
+// The C library aborts when a thread cannot note that it has something to destroy; so only tests of
+// what calls calloc itself let it fail, when nothing is left to note.
+bool callocs_fail = false;
 
 bool fails_now() noexcept {
   if (fail_at < 0) return false;
@@ -46,6 +55,9 @@ bool fails_now() noexcept {
 
 extern "C" void* malloc(std::size_t size) {
   return fails_now() ? nullptr : ORV_SYSTEM_MALLOC(size);
+}
+extern "C" void* calloc(std::size_t count, std::size_t size) {
+  return callocs_fail && fails_now() ? nullptr : ORV_SYSTEM_CALLOC(count, size);
 }
 extern "C" void* realloc(void* memory, std::size_t size) {
   return fails_now() ? nullptr : ORV_SYSTEM_REALLOC(memory, size);
@@ -186,6 +198,35 @@ TEST_F(AllocationTest, CanonicalValuesAnswerNinetyAndStayAsTheyWere) {
   }
 }
 
+TEST_F(AllocationTest, ARecordIsComparedOrAnsweredNinety) {
+  fail_each([] {
+    bool matches = false;
+    const int rc = cfg::ldif_record_matches(
+        "dn: cn=a long name so that it needs a block of its own\ncn: a\nou: x\n",
+        "(&(ou=a value that is long enough for a block, which no entry has)(cn=*))", matches);
+    return is_memory_or_success(rc) && !matches;
+  });
+}
+
+TEST_F(AllocationTest, AKeyStashIsMadeAndReadOrAnsweredNinety) {
+  const std::string path = directory_.file("key.stash");
+  fail_each([&] {
+    ::unlink(path.c_str());
+    std::string why;
+    const int made = cfg::create_key_stash(path.c_str(), why);
+    if (made != 0) return made == 90 && failed;
+    cfg::KeyPtr key;
+    const int rc = cfg::load_key_stash(path.c_str(), key, why);
+    return is_memory_or_success(rc) && (rc == 0) == (key != nullptr);
+  });
+  fail_each([&] {
+    std::string why;
+    cfg::KeyPtr key;
+    const int rc = cfg::load_key_stash("/a/path/long/enough/for/a/block/of/its/own", key, why);
+    return rc == 1 || (rc == 90 && failed);
+  });
+}
+
 // ---- Changes ----
 
 // Nothing is flushed: it is memory that is short here.
@@ -222,6 +263,7 @@ class ChangeAllocationTest : public AllocationTest {
         const int rc = change(session.get());
         fail_at_end();
         const std::string now = read_all(path_);
+        if (::access((path_ + ".new").c_str(), F_OK) == 0) return false;
         return rc == 0 ? now == after_ : rc == 90 && failed && now == before_;
       });
     }
@@ -265,25 +307,76 @@ TEST_F(ChangeAllocationTest, AnAddIsDoneOrAnsweredNinety) {
 }
 
 TEST_F(ChangeAllocationTest, APasswordIsProtectedOrTheAddAnsweredNinety) {
+  using cfg::SecretMethod;
   char type[] = "orv-slapdAdminPW";
   char value[] = "correct horse battery staple";
   char* values[] = {value, nullptr};
   ldapmod mod{kModAdd, type, {values}, nullptr};
   ldapmod* mods[] = {&mod, nullptr};
   const char* const dn = "cn=new,cn=a long name of the top so that it takes a block";
+  std::string why;
+  const std::string stash = directory_.file("key.stash");
+  ASSERT_EQ(cfg::create_key_stash(stash.c_str(), why), 0);
+  QuickFiles files(true);
+  for (const auto& [method, scheme] : {std::pair{SecretMethod::sealed, "{AES256}"},
+                                       {SecretMethod::ssha384, "{SSHA384}"},
+                                       {SecretMethod::ssha512, "{SSHA512}"},
+                                       {SecretMethod::crypt, "{CRYPT}"}}) {
+    if (!cfg::can_make_secret(method)) continue;
+    cfg::set_secret_method(method);
+    callocs_fail = method == SecretMethod::crypt;
+    const char* const expected = scheme;
+    next_ = 0;
+    fail_each([&] {
+      fail_at_end();
+      write_file(path_, kBefore);
+      const CfgSession session = unbound();
+      cfg_set_option(session.get(), kCfgOptKeyStashFile, stash.c_str());
+      if (cfg_bind_s(session.get(), nullptr, nullptr, 128) != 0) return false;
+      cfg::session_of(session.get())->files = &files;
+      fail_at_start();
+      const int rc = cfg_add_s(session.get(), dn, mods);
+      fail_at_end();
+      const std::string now = read_all(path_);
+      if (now.find("horse") != std::string::npos) return false;
+      return rc == 0 ? now.find(expected) != std::string::npos : rc == 90 && now == kBefore;
+    });
+  }
+  callocs_fail = false;
+  cfg::set_secret_method(SecretMethod::sealed);
+}
+
+// A sealed password that is deleted by its clear text.
+TEST_F(ChangeAllocationTest, ASealedPasswordIsFoundByItsClearTextOrTheModifyAnsweredNinety) {
+  std::string why;
+  const std::string stash = directory_.file("key.stash");
+  ASSERT_EQ(cfg::create_key_stash(stash.c_str(), why), 0);
+  cfg::KeyPtr key;
+  ASSERT_EQ(cfg::load_key_stash(stash.c_str(), key, why), 0);
+  char type[] = "orv-slapdAdminPW";
+  char value[] = "correct horse battery staple";
+  char* values[] = {value, nullptr};
+  ldapmod mod{kModDelete, type, {values}, nullptr};
+  ldapmod* mods[] = {&mod, nullptr};
+  const char* const dn = "cn=a long name of the top so that it takes a block";
+  std::string normal;
+  std::string stored;
+  ASSERT_EQ(cfg::normalize_dn(dn, normal), 0);
+  ASSERT_EQ(cfg::seal_secret(*key, {type, normal}, value, stored), 0);
+  before_ = std::string(kBefore) + "orv-slapdAdminPW: " + stored + "\n";
   QuickFiles files(true);
   fail_each([&] {
     fail_at_end();
-    write_file(path_, kBefore);
+    write_file(path_, before_);
     const CfgSession session = unbound();
+    cfg_set_option(session.get(), kCfgOptKeyStashFile, stash.c_str());
     if (cfg_bind_s(session.get(), nullptr, nullptr, 128) != 0) return false;
     cfg::session_of(session.get())->files = &files;
     fail_at_start();
-    const int rc = cfg_add_s(session.get(), dn, mods);
+    const int rc = cfg_modify_s(session.get(), dn, mods);
     fail_at_end();
     const std::string now = read_all(path_);
-    if (now.find("horse") != std::string::npos) return false;
-    return rc == 0 ? now.find("{SSHA512}") != std::string::npos : rc == 90 && now == kBefore;
+    return rc == 0 ? now == kBefore : rc == 90 && failed && now == before_;
   });
 }
 
@@ -312,6 +405,29 @@ TEST_F(ChangeAllocationTest, AModifyIsDoneOrAnsweredNinety) {
   fail_each_of([&](_CFG* session) {
     return cfg_modify_s(session, "cn=a long name of the top so that it takes a block", mods);
   });
+}
+
+// A comparison for which there was no memory is no "no": that would be the code 16, or a second
+// value.
+TEST_F(ChangeAllocationTest, AStoredPasswordIsFoundByItsClearTextOrTheModifyAnsweredNinety) {
+  char type[] = "orv-slapdAdminPW";
+  char value[] = "correct horse battery staple";
+  char* values[] = {value, nullptr};
+  for (const cfg::SecretMethod method :
+       {cfg::SecretMethod::ssha512, cfg::SecretMethod::clear, cfg::SecretMethod::crypt}) {
+    std::string stored;
+    if (!cfg::can_make_secret(method)) continue;
+    ASSERT_EQ(cfg::make_secret(method, value, stored), 0);
+    after_ = kBefore;
+    before_ = std::string(kBefore) + "orv-slapdAdminPW: " + stored + "\n";
+    ldapmod mod{kModDelete, type, {values}, nullptr};
+    ldapmod* mods[] = {&mod, nullptr};
+    callocs_fail = method == cfg::SecretMethod::crypt;
+    fail_each_of([&](_CFG* session) {
+      return cfg_modify_s(session, "cn=a long name of the top so that it takes a block", mods);
+    });
+  }
+  callocs_fail = false;
 }
 
 TEST_F(ChangeAllocationTest, ARefusalIsAnsweredWithItsCodeOrNinety) {

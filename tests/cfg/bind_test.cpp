@@ -128,6 +128,37 @@ TEST_F(BindTest, AFileOfMoreThanAGigabyteIsRefused) {
   EXPECT_NE(bind_failure(path_).find("larger than 1 GiB"), std::string::npos);
 }
 
+TEST_F(BindTest, AFileThatCannotBeReadOrNeverStaysTheSameIsRefused) {
+  // Files of the kernel's, which say that they are regular and empty.
+  EXPECT_NE(bind_failure("/proc/self/mem").find("cannot be read"), std::string::npos);
+  EXPECT_EQ(bind_failure("/proc/self/status"),
+            "/proc/self/status: the file kept changing while it was read");
+}
+
+// Beyond the sizes of which a thread keeps the memory.
+TEST_F(BindTest, AFileOfSeveralMegabytesIsSearchedAndChanged) {
+  std::string text = "dn: cn=top\ncn: top\n";
+  constexpr int kEntries = 40000;
+  for (int i = 0; i < kEntries; ++i) {
+    const std::string name = std::to_string(i);
+    text += "\ndn: cn=" + name + ",cn=top\ncn: " + name +
+            "\ndescription: " + std::string(100, static_cast<char>('a' + i % 26)) + "\n";
+  }
+  const CfgSession session = open(text);
+  EXPECT_EQ(search(session, "cn=top", 2, "(description=b*)").size(), (kEntries + 24) / 26);
+  EXPECT_EQ(search(session, "cn=39999,cn=top", 0, nullptr).size(), 1U);
+  char type[] = "ou";
+  char value[] = "x";
+  char* values[] = {value, nullptr};
+  ldapmod mod{kModAdd, type, {values}, nullptr};
+  ldapmod* mods[] = {&mod, nullptr};
+  EXPECT_EQ(cfg_modify_s(session.get(), "cn=0,cn=top", mods), 0);
+  text.insert(text.find("\n\ndn: cn=1,") + 1, "ou: x\n");
+  std::ifstream file(path_, std::ios::binary);
+  EXPECT_TRUE(std::string(std::istreambuf_iterator<char>(file), {}) == text);
+  EXPECT_EQ(search(session, "cn=top", 2, "(ou=x)").size(), 1U);
+}
+
 TEST_F(BindTest, ASymbolicLinkIsFollowed) {
   write_file(path_, kSmall);
   const std::string link = directory_.file("link");

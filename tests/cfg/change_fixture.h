@@ -4,6 +4,7 @@
 #include <fstream>
 #include <iterator>
 #include <memory>
+#include <mutex>
 #include <string>
 #include <utility>
 #include <vector>
@@ -82,6 +83,13 @@ inline int remove(const CfgSession& session, const std::string& dn) {
   return rc;
 }
 
+inline int modify(const CfgSession& session, const std::string& dn, const NewEntry& list) {
+  Mods mods(list);
+  const int rc = cfg_modify_s(session.get(), dn.c_str(), mods.get());
+  EXPECT_EQ(cfg_get_errno(session.get()), rc);
+  return rc;
+}
+
 inline std::string read_file(const std::string& path) {
   std::ifstream file(path, std::ios::binary);
   return {std::istreambuf_iterator<char>(file), std::istreambuf_iterator<char>()};
@@ -106,14 +114,19 @@ class ChangeTest : public CfgTest {
  protected:
   using CfgTest::CfgTest;
 
-  // Reasons of refusals go to `told`, for the length of a test.
+  // Reasons of refusals go to `told`, for the length of a test; from any thread, to be read when
+  // the threads have ended.
   void SetUp() override {
     CfgTest::SetUp();
     told.clear();
-    cfg::set_diagnostics_sink([](const char* line) noexcept { (told += line) += '\n'; });
+    cfg::set_diagnostics_sink([](const char* line) noexcept {
+      const std::lock_guard lock(told_mutex);
+      (told += line) += '\n';
+    });
   }
   void TearDown() override { cfg::set_diagnostics_sink(nullptr); }
   inline static std::string told;
+  inline static std::mutex told_mutex;
 
   // A handle with the paths of file and save file set.
   CfgSession unbound_with_save() {

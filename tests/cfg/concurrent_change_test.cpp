@@ -20,15 +20,32 @@ constexpr const char* kAfter = "dn: cn=top\ncn: top\n\ndn: cn=a,cn=top\ncn: a\n"
 
 class ConcurrentChangeTest : public ChangeTest {
  protected:
+  ConcurrentChangeTest() : ChangeTest(memory_directory()) {}
+
   // Adds until it is in; false when it is refused for another reason than another writer.
   bool add_in_turn(const std::string& dn) {
+    return in_turn([&](_CFG* session) {
+      Mods mods(NewEntry{{"ou", {dn}}});
+      return cfg_add_s(session, dn.c_str(), mods.get());
+    });
+  }
+
+  // The same with a value more for an entry that all writers change.
+  bool modify_in_turn(const std::string& value) {
+    return in_turn([&](_CFG* session) {
+      Mods mods(NewEntry{{"ou", {value}}});
+      return cfg_modify_s(session, "cn=top", mods.get());
+    });
+  }
+
+  template <class Change>
+  bool in_turn(Change change) {
     while (true) {
       CfgSession session(cfg_init(nullptr, 0));
       cfg_set_option(session.get(), kCfgOptConfigFile, path_.c_str());
       cfg_set_option(session.get(), kCfgOptSaveFile, save_.c_str());
       if (cfg_bind_s(session.get(), nullptr, nullptr, 128) != 0) return false;
-      Mods mods(NewEntry{{"ou", {dn}}});
-      const int rc = cfg_add_s(session.get(), dn.c_str(), mods.get());
+      const int rc = change(session.get());
       if (rc != 51) return rc == 0;
     }
   }
@@ -86,6 +103,30 @@ TEST_F(ConcurrentChangeTest, TwoProcessesThatWriteLoseNothing) {
   expect_tidy();
 }
 
+TEST_F(ConcurrentChangeTest, TwoProcessesThatModifyOneEntryLoseNothing) {
+  constexpr int kEach = 15;
+  write_file(path_, kBefore);
+  std::vector<pid_t> children;
+  for (int writer = 0; writer < 2; ++writer) {
+    children.push_back(::fork());
+    ASSERT_GE(children.back(), 0);
+    if (children.back() != 0) continue;
+    for (int i = 0; i < kEach; ++i) {
+      if (!modify_in_turn(std::to_string(writer) + "-" + std::to_string(i))) ::_exit(1);
+    }
+    ::_exit(0);
+  }
+  for (const pid_t child : children) {
+    int status = 0;
+    ASSERT_EQ(::waitpid(child, &status, 0), child);
+    EXPECT_EQ(status, 0);
+  }
+  const auto attributes = search(reopen(), "cn=top", 0, nullptr)[0].attributes;
+  ASSERT_EQ(attributes.size(), 2U);
+  EXPECT_EQ(attributes[1].second.size(), 2U * kEach);
+  expect_tidy();
+}
+
 TEST_F(ConcurrentChangeTest, ThreadsThatWriteLoseNothing) {
   constexpr int kEach = 10;
   write_file(path_, kBefore);
@@ -129,6 +170,44 @@ TEST_F(ConcurrentChangeTest, ALockFileThatIsRemovedMeanwhileIsTakenAnew) {
   InterposedFiles files("lock", 0, [&] { ::unlink((path_ + ".lock").c_str()); });
   EXPECT_EQ(add_with(files), 0);
   EXPECT_TRUE(exists(path_ + ".lock"));
+}
+
+// A lock on a file that has lost its name to another excludes nobody.
+TEST_F(ConcurrentChangeTest, ALockFileThatIsReplacedMeanwhileIsNotTheLock) {
+  write_file(path_, kBefore);
+  const std::string name = path_ + ".lock";
+  int others = -1;
+  InterposedFiles files("lock", 0, [&] {
+    ::unlink(name.c_str());
+    others = ::open(name.c_str(), O_RDWR | O_CREAT, 0600);
+    ASSERT_EQ(::flock(others, LOCK_EX), 0);
+  });
+  EXPECT_EQ(add_with(files), 51);
+  EXPECT_EQ(read_file(path_), kBefore);
+  ::close(others);
+  EXPECT_EQ(add_with(files), 0);
+}
+
+TEST_F(ConcurrentChangeTest, ALockFileThatIsReplacedAgainAndAgainIsGivenUp) {
+  write_file(path_, kBefore);
+  class ReplacedLock : public ObservedFiles {
+   public:
+    explicit ReplacedLock(std::string path) : path_(std::move(path)) {}
+    int before_call(const char* name, const std::string& /*subject*/) override {
+      if (name == std::string("lock")) {
+        ::unlink(path_.c_str());
+        write_file(path_, "");
+      }
+      return 0;
+    }
+
+   private:
+    std::string path_;
+  };
+  ReplacedLock files(path_ + ".lock");
+  EXPECT_EQ(add_with(files), 51);
+  EXPECT_NE(told.find("keeps being replaced"), std::string::npos);
+  EXPECT_EQ(read_file(path_), kBefore);
 }
 
 TEST_F(ConcurrentChangeTest, ALockFileThatIsALinkIsNotFollowed) {
@@ -178,6 +257,62 @@ TEST_F(ConcurrentChangeTest, AFileThatWasOnlyTouchedIsChanged) {
   EXPECT_EQ(read_file(path_), kAfter);
 }
 
+// The comparison goes by blocks of 64 KiB.
+TEST_F(ConcurrentChangeTest, FilesOfAllSizesAreCompared) {
+  constexpr std::size_t kBlock = std::size_t{64} * 1024;
+  for (const std::size_t size : {kBlock - 1, kBlock, kBlock + 1, 2 * kBlock, 2 * kBlock + 1}) {
+    SCOPED_TRACE(size);
+    std::string text = std::string(kBefore) + "# ";
+    text += std::string(size - text.size() - 1, 'x') + "\n";
+    const CfgSession touched = open_for_change(text);
+    replace_file(text);
+    EXPECT_EQ(add(touched, "cn=a,cn=top", kEntry), 0);
+    for (const auto& edited : {text + "\n", text.substr(0, size - 2) + "\n",
+                               text.substr(0, size - 2) + "y\n", text.substr(0, text.size() / 2)}) {
+      const CfgSession session = open_for_change(text);
+      replace_file(edited);
+      EXPECT_EQ(add(session, "cn=a,cn=top", kEntry), 51);
+      EXPECT_EQ(read_file(path_), edited);
+    }
+  }
+}
+
+TEST_F(ConcurrentChangeTest, AnEditThatCannotBeKeptStopsTheNextWriter) {
+  write_file(path_, kBefore);
+  write_file(save_, "dn: cn=older\n");
+  write_file(path_ + ".swap", kEdited);
+  FaultyFiles undisturbed;
+  // Every call that looks for a name, or gives it.
+  for (const char* call : {"rename", "status_of"}) {
+    RefusedCalls refusing(call, EACCES, ".rescued");
+    EXPECT_EQ(add_with(refusing), 53);
+    EXPECT_EQ(read_file(path_ + ".swap"), kEdited);
+    EXPECT_EQ(read_file(path_), kBefore);
+  }
+  EXPECT_EQ(add_with(undisturbed), 0);
+  EXPECT_EQ(read_file(path_ + ".rescued"), kEdited);
+}
+
+TEST_F(ConcurrentChangeTest, FileSystemsThatCannotExchangeOrLinkSayItInTheirWays) {
+  const auto code = [this](const char* call, int error) {
+    ::unlink(path_.c_str());
+    ::unlink(save_.c_str());
+    write_file(path_, kBefore);
+    RefusedCalls files(call, error);
+    const int rc = add_with(files);
+    EXPECT_EQ(read_file(path_), rc == 0 ? kAfter : kBefore);
+    if (rc == 0) {
+      EXPECT_EQ(read_file(save_), kBefore);
+    }
+    return rc;
+  };
+  for (const int error : {EINVAL, ENOSYS, ENOTSUP}) EXPECT_EQ(code("exchange", error), 0);
+  for (const int error : {EXDEV, EPERM, EMLINK, ENOTSUP, ENOSYS}) EXPECT_EQ(code("link", error), 0);
+  EXPECT_EQ(code("exchange", EIO), 80);
+  EXPECT_EQ(code("link", EIO), 80);
+  EXPECT_EQ(code("link", EACCES), 53);
+}
+
 TEST_F(ConcurrentChangeTest, AFileThatIsGoneIsNotMadeAnew) {
   const CfgSession session = open_for_change(kBefore);
   ASSERT_EQ(::unlink(path_.c_str()), 0);
@@ -185,27 +320,194 @@ TEST_F(ConcurrentChangeTest, AFileThatIsGoneIsNotMadeAnew) {
   EXPECT_FALSE(exists(path_));
 }
 
-TEST_F(ConcurrentChangeTest, AnEditAtAnyMomentOfASaveIsNotOverwritten) {
-  for (const char* call : {"lock", "open", "write", "flush", "link", "rename", "exchange"}) {
-    for (int number = 0; number < 4; ++number) {
-      SCOPED_TRACE(::testing::Message() << call << " " << number);
-      ::unlink(path_.c_str());
-      write_file(path_, kBefore);
-      bool edited = false;
-      InterposedFiles files(call, number, [&] {
-        replace_file(kEdited);
-        edited = true;
-      });
-      const int rc = add_with(files);
-      if (!edited) break;
-      // Behind the exchange the edit replaces the change, as any later edit does.
+// What file systems can do.
+constexpr Abilities kAllAbilities[] = {{true, true}, {true, false}, {false, true}, {false, false}};
+
+// Edits the file before the n-th call of all, on a file system with these abilities.
+class EditedMeanwhile : public FaultyFiles {
+ public:
+  EditedMeanwhile(Abilities abilities, std::size_t number, std::function<void()> edit)
+      : FaultyFiles(abilities), number_(number), edit_(std::move(edit)) {}
+
+  int before_call(const char* name, const std::string& subject) override {
+    if (calls().size() == number_) {
+      edit_();
+      edited_ = true;
+    }
+    return FaultyFiles::before_call(name, subject);
+  }
+  [[nodiscard]] bool edited() const { return edited_; }
+
+ private:
+  std::size_t number_;
+  std::function<void()> edit_;
+  bool edited_ = false;
+};
+
+class EditedSaveTest : public ConcurrentChangeTest, public ::testing::WithParamInterface<bool> {
+ protected:
+  int change_with(cfg::FileCalls& files) {
+    if (!GetParam()) return add_with(files);
+    const CfgSession session = reopen();
+    write_through(session, files);
+    return modify(session, "cn=top", {{"ou", {"y"}}});
+  }
+  static const char* after() { return GetParam() ? "dn: cn=top\ncn: top\nou: y\n" : kAfter; }
+
+  void start_anew() {
+    for (const char* ending : {"", ".save", ".swap", ".rescued", ".lock"}) {
+      ::unlink((path_ + ending).c_str());
+    }
+    write_file(path_, kBefore);
+    write_file(save_, kSavedBefore);
+  }
+
+  // Whether the call is the one in front of which an edit cannot be noticed any more: a renaming
+  // over the file.
+  [[nodiscard]] bool is_renaming(const FaultyFiles::Call& call) const {
+    return call.name == "rename" && call.subject == path_;
+  }
+
+  void expect_next_write() {
+    const std::string content = read_file(path_);
+    const CfgSession session = reopen();
+    EXPECT_EQ(add(session, "cn=n,cn=top", {{"cn", {"n"}}}), 0) << told;
+    EXPECT_EQ(read_file(path_), content + "\ndn: cn=n,cn=top\ncn: n\n");
+    expect_tidy();
+  }
+
+  static constexpr const char* kSavedBefore = "dn: cn=older\ncn: older\n";
+};
+
+TEST_P(EditedSaveTest, AnEditAtAnyMomentOfASaveIsNotOverwritten) {
+  for (const Abilities abilities : kAllAbilities) {
+    std::size_t lost = 0;
+    for (std::size_t number = 0;; ++number) {
+      SCOPED_TRACE(::testing::Message() << "exchange " << abilities.exchange << ", link "
+                                        << abilities.link << ", call " << number);
+      start_anew();
+      EditedMeanwhile files(abilities, number, [&] { replace_file(kEdited); });
+      const int rc = change_with(files);
+      if (!files.edited()) break;
+      if (!abilities.exchange && is_renaming(files.calls()[number])) {
+        // One moment is left where nothing but a renaming can be had.
+        EXPECT_EQ(rc, 0);
+        ++lost;
+        continue;
+      }
+      // Behind the last comparison the edit replaces the change, as any later edit does.
       EXPECT_TRUE(rc == 51 || rc == 0) << rc;
       EXPECT_EQ(read_file(path_), kEdited);
-      EXPECT_EQ(reopen()->key, nullptr);
-      expect_tidy();
+      EXPECT_FALSE(exists(path_ + ".rescued"));
+      expect_next_write();
+      if (HasFailure()) return;
+    }
+    EXPECT_EQ(lost, abilities.exchange ? 0U : 1U);
+  }
+}
+
+TEST_P(EditedSaveTest, AnEditInPlaceAtAnyMomentOfASaveIsNotOverwritten) {
+  for (const Abilities abilities : kAllAbilities) {
+    std::size_t lost = 0;
+    for (std::size_t number = 0;; ++number) {
+      SCOPED_TRACE(::testing::Message() << "exchange " << abilities.exchange << ", link "
+                                        << abilities.link << ", call " << number);
+      start_anew();
+      EditedMeanwhile files(abilities, number, [&] { write_file(path_, kEdited); });
+      const int rc = change_with(files);
+      if (!files.edited()) break;
+      if (!abilities.exchange && !abilities.link && is_renaming(files.calls()[number])) {
+        EXPECT_EQ(rc, 0);
+        ++lost;
+        continue;
+      }
+      EXPECT_TRUE(rc == 51 || rc == 0) << rc;
+      EXPECT_EQ(read_file(path_), kEdited);
+      expect_next_write();
+      if (HasFailure()) return;
+    }
+    EXPECT_EQ(lost, abilities.exchange || abilities.link ? 0U : 1U);
+  }
+}
+
+TEST_P(EditedSaveTest, AnEditWhileAChangeIsTakenBackStays) {
+  for (const Abilities abilities : kAllAbilities) {
+    start_anew();
+    FaultyFiles undisturbed(abilities);
+    ASSERT_EQ(change_with(undisturbed), 0);
+    std::size_t last_flush = undisturbed.calls().size();
+    while (undisturbed.calls()[--last_flush].name != "flush") {
+    }
+    for (std::size_t number = last_flush;; ++number) {
+      SCOPED_TRACE(::testing::Message() << "exchange " << abilities.exchange << ", link "
+                                        << abilities.link << ", call " << number);
+      start_anew();
+      EditedMeanwhile files(abilities, number, [&] { replace_file(kEdited); });
+      files.fail_at(last_flush, EIO, FaultyFiles::Lasting::once);
+      const int rc = change_with(files);
+      if (!files.edited()) break;
+      EXPECT_EQ(rc, 80);
+      if (!abilities.exchange && is_renaming(files.calls()[number])) continue;
+      EXPECT_EQ(read_file(path_), kEdited);
+      expect_next_write();
+      if (HasFailure()) return;
     }
   }
 }
+
+TEST_P(EditedSaveTest, AnEditDoesNotBecomeTheSaveFile) {
+  start_anew();
+  InterposedFiles files("link", 0, [&] { replace_file(kEdited); });
+  EXPECT_EQ(change_with(files), 51);
+  EXPECT_EQ(read_file(path_), kEdited);
+  EXPECT_EQ(read_file(save_), kSavedBefore);
+  expect_tidy();
+}
+
+// The change is in place when the disk fails, and stays there when it fails for good.
+TEST_P(EditedSaveTest, AChangeThatCannotBeTakenBackIsAnsweredWithAFailureAndToldAbout) {
+  for (const Abilities abilities : kAllAbilities) {
+    start_anew();
+    FaultyFiles undisturbed(abilities);
+    ASSERT_EQ(change_with(undisturbed), 0);
+    std::size_t last_flush = undisturbed.calls().size();
+    while (undisturbed.calls()[--last_flush].name != "flush") {
+    }
+    start_anew();
+    told.clear();
+    FaultyFiles files(abilities);
+    files.fail_at(last_flush, EIO, FaultyFiles::Lasting::all);
+    EXPECT_EQ(change_with(files), 80);
+    EXPECT_EQ(read_file(path_), after());
+    EXPECT_NE(told.find("could not be taken back"), std::string::npos) << told;
+    expect_next_write();
+  }
+}
+
+TEST_P(EditedSaveTest, WhatIsNoFilePutInPlaceAtAnyMomentStays) {
+  for (const Abilities abilities : kAllAbilities) {
+    for (std::size_t number = 0;; ++number) {
+      SCOPED_TRACE(::testing::Message() << "exchange " << abilities.exchange << ", link "
+                                        << abilities.link << ", call " << number);
+      start_anew();
+      EditedMeanwhile files(abilities, number, [&] {
+        ::unlink(path_.c_str());
+        ASSERT_EQ(::mkfifo(path_.c_str(), 0600), 0);
+      });
+      const int rc = change_with(files);
+      if (!files.edited()) break;
+      if (!abilities.exchange && is_renaming(files.calls()[number])) continue;
+      EXPECT_TRUE(rc == 51 || rc == 53 || rc == 0) << rc;
+      struct stat status {};
+      ASSERT_EQ(::lstat(path_.c_str(), &status), 0);
+      EXPECT_TRUE(S_ISFIFO(status.st_mode));
+      expect_tidy();
+      if (HasFailure()) return;
+    }
+  }
+}
+
+INSTANTIATE_TEST_SUITE_P(AddsAndModifies, EditedSaveTest, ::testing::Bool());
 
 // Edits before the exchange, and again before the edit is put back in place.
 class TwiceEdited : public ObservedFiles {
@@ -238,6 +540,24 @@ TEST_F(ConcurrentChangeTest, WhatAStoppedWriterFoundInPlaceIsKept) {
   EXPECT_EQ(add(reopen(), "cn=a,cn=top", kEntry), 0);
   EXPECT_EQ(read_file(path_ + ".rescued"), kEdited);
   EXPECT_NE(told.find(".rescued"), std::string::npos);
+  expect_tidy();
+}
+
+TEST_F(ConcurrentChangeTest, WhatWasKeptOnceIsNotOverwritten) {
+  write_file(path_, kBefore);
+  FaultyFiles files;
+  for (int i = 1; i <= 3; ++i) {
+    write_file(save_, "dn: cn=older\n");
+    write_file(path_ + ".swap", std::string(kEdited) + std::to_string(i));
+    const std::string dn = "cn=" + std::to_string(i) + ",cn=top";
+    const CfgSession session = reopen();
+    write_through(session, files);
+    EXPECT_EQ(add(session, dn, kEntry), 0);
+  }
+  EXPECT_EQ(read_file(path_ + ".rescued"), std::string(kEdited) + "1");
+  EXPECT_EQ(read_file(path_ + ".rescued-2"), std::string(kEdited) + "2");
+  EXPECT_EQ(read_file(path_ + ".rescued-3"), std::string(kEdited) + "3");
+  EXPECT_NE(told.find(".rescued-3: holds"), std::string::npos) << told;
   expect_tidy();
 }
 
@@ -286,6 +606,25 @@ TEST_F(ConcurrentChangeTest, AnAccessListIsKept) {
   EXPECT_EQ(std::memcmp(list, kAccessList, sizeof kAccessList), 0);
 }
 
+TEST_F(ConcurrentChangeTest, AnAccessListThatWasInheritedIsTakenAway) {
+  constexpr const char* kName = "system.posix_acl_access";
+  write_file(path_, kBefore);
+  write_file(save_, kBefore);
+  if (::setxattr(save_.c_str(), kName, kAccessList, sizeof kAccessList, 0) != 0) {
+    GTEST_SKIP() << "this file system has no access lists";
+  }
+  cfg::FileCalls& calls = cfg::system_file_calls();
+  const int from = calls.open(path_.c_str(), O_RDONLY, 0);
+  const int to = calls.open(save_.c_str(), O_WRONLY, 0);
+  EXPECT_EQ(calls.copy_access_list(from, to), 0);
+  EXPECT_LT(::getxattr(save_.c_str(), kName, nullptr, 0), 0);
+  EXPECT_EQ(calls.copy_access_list(from, to), 0);
+  EXPECT_EQ(calls.copy_access_list(-1, to), -1);
+  EXPECT_EQ(calls.copy_access_list(from, -1), -1);
+  calls.close(from);
+  calls.close(to);
+}
+
 TEST_F(ConcurrentChangeTest, ASymbolicLinkStaysAndItsTargetChanges) {
   const std::string target = directory_.file("real.ldif");
   write_file(target, kBefore);
@@ -322,7 +661,7 @@ TEST_F(ConcurrentChangeTest, WithoutASaveFileNoneIsMade) {
 }
 
 TEST_F(ConcurrentChangeTest, ASaveFileMayLieInAnotherDirectory) {
-  const TemporaryDirectory other(memory_directory());
+  const TemporaryDirectory other;  // on another file system
   write_file(path_, kBefore);
   CfgSession session = unbound();
   ASSERT_EQ(cfg_set_option(session.get(), kCfgOptSaveFile, other.file("kept").c_str()), 0);

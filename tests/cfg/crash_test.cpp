@@ -225,6 +225,10 @@ constexpr const char* kAfter =
 const NewEntry kEntry = {{"cn", {"a"}},
                          {"ou", {"a longer text, so that the file is written in several pieces"}}};
 
+constexpr const char* kModified =
+    "# a\ndn: cn=top\ncn: top\nou: a longer text, so that the file is written in several pieces\n\n"
+    "# b\n";
+
 class CrashTest : public ChangeTest {
  protected:
   CrashTest() : ChangeTest(memory_directory()) {}
@@ -249,18 +253,29 @@ class CrashTest : public ChangeTest {
     }
   }
 
+  // The change that is stopped, and one that undoes it.
+  int change(const CfgSession& session) const {
+    if (modifies_) return modify(session, "cn=top", {{"ou", kEntry[1].values, true}});
+    return add(session, "cn=a,cn=top", kEntry);
+  }
+  int undo(const CfgSession& session) const {
+    if (modifies_) return modify(session, "cn=top", {{"ou", {}, true, kModReplace}});
+    return remove(session, "cn=a,cn=top");
+  }
+  [[nodiscard]] const char* after() const { return modifies_ ? kModified : kAfter; }
+
   void start_anew() {
     put_on_disk({{{"config.ldif", 1}, {"config.ldif.save", 2}}, {{1, kBefore}, {2, kOlder}}});
   }
 
-  std::vector<Recorder::Moment> record_add(Abilities abilities) {
+  std::vector<Recorder::Moment> record_change(Abilities abilities) {
     const CfgSession session = reopen();
     Recorder recorder(all_paths());
     recorder.exchanges = abilities.exchange;
     recorder.links = abilities.link;
     write_through(session, recorder);
-    EXPECT_EQ(add(session, "cn=a,cn=top", kEntry), 0) << told;
-    EXPECT_EQ(read_file(path_), kAfter);
+    EXPECT_EQ(change(session), 0) << told;
+    EXPECT_EQ(read_file(path_), after());
     return recorder.moments();
   }
 
@@ -269,27 +284,28 @@ class CrashTest : public ChangeTest {
     put_on_disk(found);
     const std::string content = read_file(path_);
     if (acknowledged || content != kBefore) {
-      ASSERT_EQ(content, kAfter);
+      ASSERT_EQ(content, after());
     }
-    check_next_write(content == kAfter);
+    check_next_write(content == after());
   }
 
   void check_next_write(bool changed) {
     FaultyFiles quick;  // nothing fails, nothing is flushed
     const CfgSession session = reopen();
     write_through(session, quick);
-    ASSERT_EQ(changed ? remove(session, "cn=a,cn=top") : add(session, "cn=a,cn=top", kEntry), 0)
-        << told;
-    ASSERT_EQ(read_file(path_), changed ? kBefore : kAfter);
-    ASSERT_EQ(read_file(save_), changed ? kAfter : kBefore);
+    ASSERT_EQ(changed ? undo(session) : change(session), 0) << told;
+    ASSERT_EQ(read_file(path_), changed ? kBefore : after());
+    ASSERT_EQ(read_file(save_), changed ? after() : kBefore);
     for (const char* leftover : {".new", ".swap", ".save.new"}) {
       ASSERT_FALSE(exists(path_ + leftover)) << leftover;
     }
   }
 
+  bool modifies_ = false;
+
   void crash_everywhere(Abilities abilities) {
     start_anew();
-    const auto moments = record_add(abilities);
+    const auto moments = record_change(abilities);
     std::size_t states = 0;
     std::size_t commit = moments.size();
     while (moments[--commit].call != "flush") {
@@ -323,9 +339,19 @@ TEST_F(CrashTest, TheOldFileOrTheNewIsFoundWholeWhereThereIsNeither) {
   crash_everywhere({false, false});
 }
 
+TEST_F(CrashTest, AModifyLeavesTheOldFileOrTheNewWhole) {
+  modifies_ = true;
+  crash_everywhere({});
+}
+
+TEST_F(CrashTest, AModifyLeavesTheOldFileOrTheNewWholeWhereThereIsNeither) {
+  modifies_ = true;
+  crash_everywhere({false, false});
+}
+
 TEST_F(CrashTest, TheNextWriterMayFailAndMayBeStoppedToo) {
   start_anew();
-  const auto moments = record_add({});
+  const auto moments = record_change({});
   for (std::size_t i = 0; i < moments.size() && !HasFatalFailure(); ++i) {
     const Found found = after_kill(moments[i]);
     // It fails at every call.
@@ -333,21 +359,21 @@ TEST_F(CrashTest, TheNextWriterMayFailAndMayBeStoppedToo) {
       SCOPED_TRACE(::testing::Message() << "stopped after call " << i << ", then call " << number);
       put_on_disk(found);
       const std::string content = read_file(path_);
-      const bool changed = content == kAfter;
+      const bool changed = content == after();
       FaultyFiles files;
       files.fail_at(number, EIO, FaultyFiles::Lasting::once);
       const CfgSession session = reopen();
       write_through(session, files);
-      const int rc = changed ? remove(session, "cn=a,cn=top") : add(session, "cn=a,cn=top", kEntry);
+      const int rc = changed ? undo(session) : change(session);
       if (!files.has_failed()) break;
-      ASSERT_EQ(read_file(path_), (rc == 0) != changed ? kAfter : kBefore);
+      ASSERT_EQ(read_file(path_), (rc == 0) != changed ? after() : kBefore);
       check_next_write((rc == 0) != changed);
       if (HasFatalFailure()) return;
     }
     // It is stopped at every call, by a power failure.
     put_on_disk(found);
     if (read_file(path_) != kBefore) continue;
-    for (const Recorder::Moment& moment : record_add({})) {
+    for (const Recorder::Moment& moment : record_change({})) {
       check(found_with(moment.since_flush.back(), moment, Data::torn), false);
       check(found_with(moment.since_flush.front(), moment, Data::dropped), false);
       if (HasFatalFailure()) return;
@@ -378,16 +404,16 @@ TEST_F(CrashTest, AProcessThatIsKilledLeavesNoLockBehind) {
       Killer files(calls);
       const CfgSession session = reopen();
       write_through(session, files);
-      ::_exit(add(session, "cn=a,cn=top", kEntry));
+      ::_exit(change(session));
     }
     int status = 0;
     ASSERT_EQ(::waitpid(child, &status, 0), child);
     ASSERT_TRUE(WIFEXITED(status));
     const std::string content = read_file(path_);
     if (WEXITSTATUS(status) == 0 || content != kBefore) {
-      ASSERT_EQ(content, kAfter);
+      ASSERT_EQ(content, after());
     }
-    check_next_write(content == kAfter);
+    check_next_write(content == after());
     if (HasFatalFailure()) FAIL() << "killed at call " << calls;
     if (WEXITSTATUS(status) == 0) return;
   }

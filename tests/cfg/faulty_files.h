@@ -125,6 +125,22 @@ class FaultyFiles : public ObservedFiles {
   bool has_failed_ = false;
 };
 
+// Lets all calls of one kind fail, or those of them that are about a certain name.
+class RefusedCalls : public ObservedFiles {
+ public:
+  RefusedCalls(std::string name, int error, std::string part_of_subject = {})
+      : name_(std::move(name)), error_(error), part_(std::move(part_of_subject)) {}
+
+  int before_call(const char* name, const std::string& subject) override {
+    return name == name_ && subject.find(part_) != std::string::npos ? error_ : 0;
+  }
+
+ private:
+  std::string name_;
+  int error_;
+  std::string part_;
+};
+
 // Runs something of the test's own before the n-th call of one kind (counted from 0).
 class InterposedFiles : public ObservedFiles {
  public:

@@ -14,13 +14,6 @@ class ModifyTest : public ChangeTest {
  protected:
   ModifyTest() : ChangeTest(memory_directory()) {}
 
-  static int modify(const CfgSession& session, const char* dn, const NewEntry& list) {
-    Mods mods(list);
-    const int rc = cfg_modify_s(session.get(), dn, mods.get());
-    EXPECT_EQ(cfg_get_errno(session.get()), rc);
-    return rc;
-  }
-
   std::string after(std::string_view content, const NewEntry& list) {
     const CfgSession session = open_for_change(content);
     EXPECT_EQ(modify(session, "CN=A, cn=top", list), 0) << cfg_dump_exception(session.get());
@@ -29,6 +22,7 @@ class ModifyTest : public ChangeTest {
   }
 
   int refused(std::string_view content, const NewEntry& list) {
+    ::unlink(save_.c_str());
     const CfgSession session = open_for_change(content);
     const int rc = modify(session, "cn=a,cn=top", list);
     EXPECT_EQ(read_file(path_), content);
@@ -95,7 +89,8 @@ TEST_F(ModifyTest, RecordsAreAppliedInOrder) {
 TEST_F(ModifyTest, WhatChangesNothingWritesNothing) {
   for (const NewEntry& list :
        {NewEntry{}, NewEntry{replaces("ou", {"x", "Long er"})}, NewEntry{replaces("o")},
-        NewEntry{adds("o", {"1"}), deletes("o", {"1"})}}) {
+        NewEntry{adds("o", {"1"}), deletes("o", {"1"})},
+        NewEntry{deletes("number", {"7"}), adds("number", {"7"})}}) {
     const CfgSession session = open_for_change(tree(kLines));
     EXPECT_EQ(modify(session, "cn=a,cn=top", list), 0);
     EXPECT_EQ(read_file(path_), tree(kLines));
@@ -110,6 +105,35 @@ TEST_F(ModifyTest, LineEndsAreThoseOfTheEntry) {
   EXPECT_EQ(after("dn: cn=top\ncn: top\n\ndn: cn=a,cn=top\r\ncn: a\r\nou: x\r\n",
                   {replaces("ou", {"y"}), adds("o", {"z"})}),
             "dn: cn=top\ncn: top\n\ndn: cn=a,cn=top\r\ncn: a\r\nou: y\r\no: z\r\n");
+}
+
+TEST_F(ModifyTest, ACommentAtTheEndOfTheFileMayLackItsNewline) {
+  const std::string above = "dn: cn=top\ncn: top\n\ndn: cn=a,cn=top\ncn: a\n";
+  EXPECT_EQ(after(above + "ou: x\n# end", {adds("ou", {"y"})}), above + "ou: x\nou: y\n# end");
+  EXPECT_EQ(after(above + "ou: x\n# end", {deletes("ou")}), above + "# end");
+}
+
+TEST_F(ModifyTest, CommentsAboveAValueStayWhenItGoes) {
+  EXPECT_EQ(after(tree("# 1\n# 2\n  more\ncn: a\n# 3\n# 4\nou: x\n# 5\n"),
+                  {deletes("ou"), replaces("cn", {"A"})}),
+            tree("# 1\n# 2\n  more\ncn: A\n# 3\n# 4\n# 5\n"));
+}
+
+// The types of a hand-edited file, and those that no schema knows.
+TEST_F(ModifyTest, LinesAreFoundUnderEveryNameOfTheirType) {
+  const std::string lines =
+      "cn: a\norganizationalUnitName: x\n2.5.4.11: y\nOU: z\nUnKnown: 1\nunk\n nown: 2\noth\n er: "
+      "3\nan\n other: 4\n";
+  const std::string others = "UnKnown: 1\nunk\n nown: 2\noth\n er: 3\nan\n other: 4\n";
+  EXPECT_EQ(after(tree(lines), {deletes("ou")}), tree("cn: a\n" + others));
+  EXPECT_EQ(after(tree(lines), {deletes("ou", {"X", "Y", "Z"})}), tree("cn: a\n" + others));
+  EXPECT_EQ(refused(tree(lines), {adds("ou", {"X"})}), 20);
+  EXPECT_EQ(refused(tree(lines), {adds("unknown", {"2"})}), 20);
+  const std::string known = "cn: a\norganizationalUnitName: x\n2.5.4.11: y\nOU: z\n";
+  EXPECT_EQ(after(tree(lines), {deletes("unknown"), adds("OTHER", {"5"})}),
+            tree(known + "oth\n er: 3\nOTHER: 5\nan\n other: 4\n"));
+  EXPECT_EQ(after(tree(lines), {deletes("another", {"4"}), adds("unknown", {"0"})}),
+            tree(known + "UnKnown: 1\nunk\n nown: 2\nunknown: 0\noth\n er: 3\n"));
 }
 
 TEST_F(ModifyTest, EqualLinesOfAHandEditedFileGoTogether) {
@@ -136,6 +160,137 @@ TEST_F(ModifyTest, AllOrNothing) {
   EXPECT_EQ(modify(session, "cn=x,cn=top", {adds("o", {"1"})}), 9);
   EXPECT_EQ(modify(session, "x", {adds("o", {"1"})}), 34);
   EXPECT_EQ(cfg_modify_s(nullptr, "cn=a,cn=top", nullptr), 1);
+}
+
+// ---- Bad input ----
+
+TEST_F(ModifyTest, ValuesOfEveryKindAreReadBackAsTheyWereGiven) {
+  const Values values = {"\n",       "two\nlines",
+                         " leading", "trailing ",
+                         ":",        "<file:x",
+                         "\xC3\xB6", "\xE4\xFF",
+                         "\r",       "",
+                         "\t",       "\x7F",
+                         "dn: cn=x", std::string(77, ' '),
+                         "- ",       "#comment",
+                         "{SSHA}x",  std::string(1 << 20, 'x') + "\n"};
+  for (const int code : {kModAdd, kModReplace}) {
+    const CfgSession session = open_for_change(tree("cn: a\n"));
+    EXPECT_EQ(modify(session, "cn=a,cn=top", {{"bytes", values, true, code}}), 0);
+    const CfgSession again = reopen();
+    EXPECT_EQ(search(again, "cn=a,cn=top", 0, nullptr, {"bytes"})[0].attributes[0].second, values);
+    EXPECT_EQ(modify(again, "cn=a,cn=top", {deletes("bytes", values)}), 0);
+    EXPECT_EQ(read_file(path_), tree("cn: a\n"));
+  }
+}
+
+TEST_F(ModifyTest, TenThousandValuesAreNoBurden) {
+  Values values;
+  for (int i = 0; i < 10000; ++i) values.push_back("value " + std::to_string(i));
+  const CfgSession session = open_for_change(tree("cn: a\n"));
+  EXPECT_EQ(modify(session, "cn=a,cn=top", {adds("ou", values)}), 0);
+  EXPECT_EQ(search(reopen(), "cn=a,cn=top", 0, nullptr, {"ou"})[0].attributes[0].second, values);
+  EXPECT_EQ(modify(session, "cn=a,cn=top", {adds("ou", {"VALUE  9999"})}), 20);
+  EXPECT_EQ(modify(session, "cn=a,cn=top", {deletes("ou", values)}), 0);
+  EXPECT_EQ(read_file(path_), tree("cn: a\n"));
+}
+
+TEST_F(ModifyTest, OneAttributeUnderAllItsNamesIsOne) {
+  EXPECT_EQ(after(tree(kLines), {deletes("2.5.4.11", {"x"}), adds("organizationalUnitName", {"y"}),
+                                 deletes("OU", {"long er"})}),
+            tree("cn: a\n# one\nou: y\n# two\nnumber: 7\ndescription: last\n# end\n"));
+  for (const char* type : {"ou;x", "ou;lang-en", "2.5.4.11;x", "ou;binary", "", "o u", "-ou", "1.",
+                           "ou:", "changetype", "DN", "control", "\xC3\xB6"}) {
+    EXPECT_EQ(refused(tree(kLines), {adds(type, {"1"})}), 17) << type;
+    EXPECT_EQ(refused(tree(kLines), {deletes(type)}), 17) << type;
+    EXPECT_EQ(refused(tree(kLines), {replaces(type, {"1"})}), 17) << type;
+  }
+  // A type that nobody knows is stored under the name that it was given; options of a password too
+  // are refused, or they would be another attribute.
+  EXPECT_EQ(after(tree("cn: a\n"), {adds("1.2.3", {"y"}), adds("Other-Type", {"z"})}),
+            tree("cn: a\n1.2.3: y\nOther-Type: z\n"));
+  EXPECT_EQ(refused(tree("cn: a\n"), {adds("orv-slapdAdminPW;x", {"secret"})}), 17);
+}
+
+TEST_F(ModifyTest, TheEntryIsFoundInEverySpellingOfItsName) {
+  for (const char* dn : {"cn=a,cn=top", "CN = A , CN = Top", "2.5.4.3=a,commonName=top",
+                         "cn=\\61,cn=top", "cn=#0c0161,cn=top", "oid.2.5.4.3=a,cn=top"}) {
+    const CfgSession session = open_for_change(tree("cn: a\n"));
+    const int rc = modify(session, dn, {adds("o", {"1"})});
+    EXPECT_TRUE(rc == 0 || (rc == 34 && std::string(dn).starts_with("oid."))) << dn << " " << rc;
+    EXPECT_EQ(read_file(path_), tree(rc == 0 ? "cn: a\no: 1\n" : "cn: a\n"));
+  }
+  for (const char* dn : {"", "cn=a", "cn=a,cn=top,", "cn=a;cn=top", "cn=a,cn=top,cn=none"}) {
+    const CfgSession session = open_for_change(tree("cn: a\n"));
+    const int rc = modify(session, dn, {adds("o", {"1"})});
+    EXPECT_TRUE(rc == 9 || rc == 34) << dn << " " << rc;
+    EXPECT_EQ(read_file(path_), tree("cn: a\n"));
+  }
+}
+
+// Whether the name's own values may go is for the schema to say.
+TEST_F(ModifyTest, ValuesOfTheNameAreLikeOthersHere) {
+  EXPECT_EQ(after(tree("cn: a\nou: x\n"), {deletes("cn", {"A"})}), tree("ou: x\n"));
+  EXPECT_EQ(after(tree("cn: a\n"), {replaces("cn", {"b"})}), tree("cn: b\n"));
+  EXPECT_EQ(after(tree("cn: a\n"), {adds("cn", {"b"})}), tree("cn: a\ncn: b\n"));
+}
+
+TEST_F(ModifyTest, ValuesAreComparedByTheSyntaxOfTheirAttribute) {
+  const std::string lines =
+      "cn: a\nexactText: Word\nbytes: Word\nmember: cn=X, o=Y\nnumber: 7\nflag: TRUE\n"
+      "telephoneNumber: +1 23-4\nmoment: 20200101000000Z\nobjectClass: top\n";
+  const auto found = [&](const char* type, const char* value) {
+    const CfgSession session = open_for_change(tree(lines));
+    const int exists = modify(session, "cn=a,cn=top", {adds(type, {value})});
+    const CfgSession again = open_for_change(tree(lines));
+    const int gone = modify(again, "cn=a,cn=top", {deletes(type, {value})});
+    EXPECT_EQ(exists == 20, gone == 0) << exists << " " << gone;
+    EXPECT_TRUE(exists == 0 || exists == 20) << exists;
+    EXPECT_TRUE(gone == 0 || gone == 16) << gone;
+    return gone == 0;
+  };
+  EXPECT_TRUE(found("exactText", "Word"));
+  EXPECT_FALSE(found("exactText", "word"));
+  EXPECT_TRUE(found("bytes", "Word"));
+  EXPECT_FALSE(found("bytes", "word"));
+  EXPECT_FALSE(found("bytes", "Word "));
+  EXPECT_TRUE(found("member", "CN=x,O=y"));
+  EXPECT_FALSE(found("member", "cn=x"));
+  EXPECT_TRUE(found("telephoneNumber", "+1234"));
+  EXPECT_TRUE(found("objectClass", "TOP"));
+  EXPECT_TRUE(found("flag", "TRUE"));
+  EXPECT_FALSE(found("flag", "FALSE"));
+  EXPECT_TRUE(found("number", "7"));
+  EXPECT_FALSE(found("number", "70"));
+  EXPECT_FALSE(found("number", "not a number"));
+}
+
+TEST_F(ModifyTest, NullPartsOfAListAreRefused) {
+  char type[] = "ou";
+  char text[] = "x";
+  berval good{1, text};
+  berval empty{0, nullptr};
+  berval* values[] = {&good, &empty, nullptr};
+  ldapmod without_text{kModAdd | kModBvalues, type, {}, nullptr};
+  without_text.mod_vals.modv_bvals = values;
+  ldapmod without_type{kModAdd, nullptr, {}, nullptr};
+  berval* none[] = {nullptr};
+  ldapmod without_values{kModAdd | kModBvalues, type, {}, nullptr};
+  without_values.mod_vals.modv_bvals = none;
+  const auto code = [&](ldapmod& mod) {
+    const CfgSession session = open_for_change(tree("cn: a\n"));
+    ldapmod* mods[] = {&mod, nullptr};
+    const int rc = cfg_modify_s(session.get(), "cn=a,cn=top", mods);
+    EXPECT_EQ(read_file(path_), tree("cn: a\n"));
+    return rc;
+  };
+  EXPECT_EQ(code(without_text), 21);
+  EXPECT_EQ(code(without_type), 90);
+  EXPECT_EQ(code(without_values), 2);
+  ldapmod* mods[] = {&without_text, nullptr};
+  const CfgSession session = open_for_change(tree("cn: a\n"));
+  EXPECT_EQ(cfg_modify_s(session.get(), nullptr, mods), 9);
+  EXPECT_EQ(cfg_modify_s(unbound().get(), "cn=a,cn=top", mods), 1);
 }
 
 // ---- Passwords ----
@@ -187,6 +342,64 @@ TEST_F(ModifySecretTest, AStoredTextStaysAndMayBeDeleted) {
   EXPECT_EQ(password(), stored_);
   EXPECT_EQ(change({deletes("orv-slapdAdminPW", {stored_})}), 0);
   EXPECT_EQ(password(), "");
+}
+
+TEST_F(ModifySecretTest, EveryStoredFormIsDeletedByItsClearText) {
+  using cfg::SecretMethod;
+  for (const SecretMethod method :
+       {SecretMethod::ssha256, SecretMethod::ssha384, SecretMethod::ssha512, SecretMethod::crypt,
+        SecretMethod::pbkdf2_sha256, SecretMethod::clear}) {
+    if (!cfg::can_make_secret(method)) continue;
+    std::string stored;
+    ASSERT_EQ(cfg::make_secret(method, "the one", stored), 0);
+    const std::string content = tree("cn: a\norv-slapdAdminPW: " + stored + "\n");
+    write_file(path_, content);
+    EXPECT_EQ(change({deletes("orv-slapdAdminPW", {"the One"})}), 16);
+    EXPECT_EQ(change({deletes("orv-slapdAdminPW", {""})}), 16);
+    EXPECT_EQ(read_file(path_), content);
+    EXPECT_EQ(change({deletes("orv-slapdAdminPW", {"the one"})}), 0);
+    EXPECT_EQ(read_file(path_), tree("cn: a\n"));
+    write_file(path_, content);
+    EXPECT_EQ(change({deletes("orv-slapdAdminPW", {stored})}), 0);
+    EXPECT_EQ(read_file(path_), tree("cn: a\n"));
+  }
+}
+
+TEST_F(ModifySecretTest, TheMethodInForceProtects) {
+  using cfg::SecretMethod;
+  for (const auto& [method, beginning] : {std::pair{SecretMethod::ssha256, "{SSHA256}"},
+                                          {SecretMethod::clear, "new one"},
+                                          {SecretMethod::sealed, "{AES256}"}}) {
+    cfg::set_secret_method(method);
+    EXPECT_EQ(change({replaces("orv-slapdAdminPW", {"new one"})}), 0);
+    EXPECT_TRUE(password().starts_with(beginning)) << password();
+    EXPECT_TRUE(is_password("new one"));
+  }
+}
+
+TEST_F(ModifySecretTest, APasswordSealedElsewhereIsNotFoundByItsClearText) {
+  write_file(path_,
+             "dn: cn=top\ncn: top\n\ndn: cn=b,cn=top\ncn: b\norv-slapdAdminPW: " + stored_ + "\n");
+  EXPECT_EQ(modify(keyed(), "cn=b,cn=top", {deletes("orv-slapdAdminPW", {"old one"})}), 16);
+  EXPECT_EQ(modify(keyed(), "cn=b,cn=top", {adds("orv-slapdMasterPW", {"old one"})}), 0);
+  EXPECT_EQ(modify(keyed(), "cn=b,cn=top", {deletes("orv-slapdAdminPW", {stored_})}), 0);
+}
+
+TEST_F(ModifySecretTest, WithoutItsKeyASealedPasswordIsOnlyFoundByItsStoredText) {
+  EXPECT_EQ(modify(reopen(), "cn=a,cn=top", {deletes("orv-slapdAdminPW", {"old one"})}), 16);
+  EXPECT_EQ(modify(reopen(), "cn=a,cn=top", {deletes("orv-slapdAdminPW", {stored_})}), 0);
+}
+
+TEST_F(ModifySecretTest, AMalformedPasswordGoesByItsStoredTextOrWhole) {
+  for (const char* stored : {"{unknown}x", "{AES256}!", "{CRYPT}*0", "*", "{PBKDF2-SHA256}x"}) {
+    const std::string content = tree(std::string("cn: a\norv-slapdAdminPW: ") + stored + "\n");
+    write_file(path_, content);
+    EXPECT_EQ(change({deletes("orv-slapdAdminPW", {"x"})}), 16) << stored;
+    EXPECT_EQ(change({deletes("orv-slapdAdminPW", {stored})}), 0) << stored;
+    write_file(path_, content);
+    EXPECT_EQ(change({replaces("orv-slapdAdminPW", {"new one"})}), 0) << stored;
+    EXPECT_TRUE(is_password("new one"));
+  }
 }
 
 TEST_F(ModifySecretTest, Refusals) {

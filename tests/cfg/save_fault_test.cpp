@@ -3,10 +3,14 @@
 #include <dirent.h>
 
 #include <algorithm>
+#include <cstring>
+#include <new>
 #include <set>
 
 #include "change_fixture.h"
 #include "faulty_files.h"
+#include "file_text.h"
+#include "save.h"
 
 namespace orv::cfg_test {
 namespace {
@@ -15,10 +19,25 @@ using Lasting = FaultyFiles::Lasting;
 
 constexpr const char* kBefore = "# a\ndn: cn=top\ncn: top\n\n# b\n";
 constexpr const char* kAfter = "# a\ndn: cn=top\ncn: top\n\ndn: cn=a,cn=top\ncn: a\n\n# b\n";
-constexpr const char* kNext =
-    "# a\ndn: cn=top\ncn: top\n\ndn: cn=a,cn=top\ncn: a\n\ndn: cn=n,cn=top\ncn: n\n\n# b\n";
-constexpr const char* kNextAlone = "# a\ndn: cn=top\ncn: top\n\ndn: cn=n,cn=top\ncn: n\n\n# b\n";
+constexpr const char* kModified = "# a\ndn: cn=top\ncn: top\nou: y\n\n# b\n";
 constexpr const char* kSavedBefore = "dn: cn=older\ncn: older\n";
+
+// A change, and what it makes of a file.
+struct TriedChange {
+  const char* before;
+  const char* after;
+  int (*run)(const CfgSession& session);
+};
+constexpr TriedChange kAdd = {kBefore, kAfter, [](const CfgSession& session) {
+                                return add(session, "cn=a,cn=top", {{"cn", {"a"}}});
+                              }};
+constexpr TriedChange kDelete = {
+    kAfter, kBefore, [](const CfgSession& session) { return remove(session, "cn=a,cn=top"); }};
+constexpr TriedChange kModify = {
+    kBefore, kModified, [](const CfgSession& session) {
+      return modify(session, "cn=top",
+                    {{"o", {"x"}}, {"ou", {"y"}, true}, {"o", {}, true, kModDelete}});
+    }};
 
 class SaveFaultTest : public ChangeTest {
  protected:
@@ -36,7 +55,7 @@ class SaveFaultTest : public ChangeTest {
 
   void set_up_files(bool leftovers) {
     for (const std::string& name : names()) ::unlink(directory_.file(name).c_str());
-    write_file(path_, kBefore);
+    write_file(path_, change_.before);
     write_file(save_, kSavedBefore);
     if (!leftovers) return;
     write_file(path_ + ".new", "dn: cn=to");
@@ -44,15 +63,15 @@ class SaveFaultTest : public ChangeTest {
     write_file(path_ + ".swap", kSavedBefore);
   }
 
-  // The calls of an add that nothing disturbs.
+  // The calls of a change that nothing disturbs.
   std::vector<FaultyFiles::Call> undisturbed(Abilities abilities, bool leftovers) {
     set_up_files(leftovers);
     FaultyFiles files(abilities);
     const CfgSession session = reopen();
     write_through(session, files);
-    EXPECT_EQ(add(session, "cn=a,cn=top", {{"cn", {"a"}}}), 0);
-    EXPECT_EQ(read_file(path_), kAfter);
-    EXPECT_EQ(read_file(save_), kBefore);
+    EXPECT_EQ(change_.run(session), 0);
+    EXPECT_EQ(read_file(path_), change_.after);
+    EXPECT_EQ(read_file(save_), change_.before);
     EXPECT_EQ(names(), kTidy);
     return files.calls();
   }
@@ -70,20 +89,24 @@ class SaveFaultTest : public ChangeTest {
     return name == "open" || name == "read" || name == "write" || name == "lock";
   }
 
-  void check_refused(int rc, const CfgSession& session) {
+  void check_refused(int rc, const CfgSession& session, const std::vector<FoundEntry>& shown) {
     EXPECT_TRUE(rc == 51 || rc == 53 || rc == 80 || rc == 90) << rc;
-    EXPECT_EQ(read_file(path_), kBefore);
-    EXPECT_EQ(search_code(session, "cn=a,cn=top", 0, nullptr), 32);
+    EXPECT_EQ(read_file(path_), change_.before);
     EXPECT_STRNE(cfg_dump_exception(session.get()), "");
+    EXPECT_EQ(search(session, "cn=top", 2, nullptr), shown);
   }
 
-  void check_next_write(bool added) {
+  // An entry more, between what is there and the comment at the end.
+  void check_next_write() {
+    const std::string content = read_file(path_);
     const CfgSession session = reopen();
     FaultyFiles files;
     write_through(session, files);
     EXPECT_EQ(add(session, "cn=n,cn=top", {{"cn", {"n"}}}), 0) << told;
-    EXPECT_EQ(read_file(path_), added ? kNext : kNextAlone);
-    EXPECT_EQ(read_file(save_), added ? kAfter : kBefore);
+    const std::string end = "\n# b\n";
+    EXPECT_EQ(read_file(path_),
+              content.substr(0, content.size() - end.size()) + "\ndn: cn=n,cn=top\ncn: n\n" + end);
+    EXPECT_EQ(read_file(save_), content);
     EXPECT_EQ(names(), kTidy);
   }
 
@@ -95,7 +118,8 @@ class SaveFaultTest : public ChangeTest {
     files.fail_at(number, error, lasting);
     const CfgSession session = reopen();
     write_through(session, files);
-    const int rc = add(session, "cn=a,cn=top", {{"cn", {"a"}}});
+    const auto shown = search(session, "cn=top", 2, nullptr);
+    const int rc = change_.run(session);
     EXPECT_TRUE(files.has_failed());
     if (must_refuse) {
       EXPECT_NE(rc, 0);
@@ -104,14 +128,14 @@ class SaveFaultTest : public ChangeTest {
       EXPECT_EQ(rc, 0);
     }
     if (rc == 0) {
-      EXPECT_EQ(read_file(path_), kAfter);
-    } else if (lasting == Lasting::all && read_file(path_) != kBefore) {
+      EXPECT_EQ(read_file(path_), change_.after);
+    } else if (lasting == Lasting::all && read_file(path_) != change_.before) {
       // Nothing could be taken back any more; whole it is all the same.
-      EXPECT_EQ(read_file(path_), kAfter);
+      EXPECT_EQ(read_file(path_), change_.after);
     } else {
-      check_refused(rc, session);
+      check_refused(rc, session, shown);
     }
-    check_next_write(read_file(path_) == kAfter);
+    check_next_write();
   }
 
   void try_every_fault(Abilities abilities, bool leftovers) {
@@ -135,6 +159,7 @@ class SaveFaultTest : public ChangeTest {
     }
   }
 
+  TriedChange change_ = kAdd;
   static const std::set<std::string> kTidy;
 };
 
@@ -164,26 +189,28 @@ TEST_F(SaveFaultTest, EveryCallFailsWhileLeftoversAreCleared) {
 }
 
 TEST_F(SaveFaultTest, EveryCallOfADeleteFails) {
-  const auto delete_with = [this](FaultyFiles& files) {
-    set_up_files(false);
-    write_file(path_, kAfter);
-    const CfgSession session = reopen();
-    write_through(session, files);
-    return remove(session, "cn=a,cn=top");
-  };
-  FaultyFiles undisturbed;
-  ASSERT_EQ(delete_with(undisturbed), 0);
-  ASSERT_EQ(read_file(path_), kBefore);
-  for (std::size_t number = 0; number < undisturbed.calls().size(); ++number) {
-    FaultyFiles files;
-    files.fail_at(number, EIO, Lasting::once);
-    SCOPED_TRACE(undisturbed.calls()[number].name);
-    EXPECT_EQ(read_file(path_), delete_with(files) == 0 ? kBefore : kAfter);
-    const CfgSession session = reopen();
-    FaultyFiles next;
-    write_through(session, next);
-    EXPECT_EQ(add(session, "cn=n,cn=top", {{"cn", {"n"}}}), 0);
-  }
+  change_ = kDelete;
+  try_every_fault({}, false);
+}
+
+TEST_F(SaveFaultTest, EveryCallOfAModifyFails) {
+  change_ = kModify;
+  try_every_fault({}, false);
+}
+
+TEST_F(SaveFaultTest, EveryCallOfAModifyFailsWhereThereIsNoExchange) {
+  change_ = kModify;
+  try_every_fault({false, true}, false);
+}
+
+TEST_F(SaveFaultTest, EveryCallOfAModifyFailsWhereThereAreNoHardLinks) {
+  change_ = kModify;
+  try_every_fault({true, false}, true);
+}
+
+TEST_F(SaveFaultTest, EveryCallOfAModifyFailsWhereThereIsNeither) {
+  change_ = kModify;
+  try_every_fault({false, false}, true);
 }
 
 TEST_F(SaveFaultTest, CodesTellWhatAnAdministratorCanDo) {
@@ -205,6 +232,28 @@ TEST_F(SaveFaultTest, CodesTellWhatAnAdministratorCanDo) {
   EXPECT_EQ(code("rename", EPERM), 53);
   EXPECT_EQ(code("write", ENOMEM), 90);
   EXPECT_NE(told.find("No space left on device"), std::string::npos);
+}
+
+// ---- Versions that must not be put in place ----
+
+TEST_F(SaveFaultTest, AVersionThatIsNotAcceptableIsNotPutInPlace) {
+  for (const bool throws : {false, true}) {
+    set_up_files(false);
+    cfg::FileText before;
+    cfg::FileText after;
+    std::string why;
+    ASSERT_TRUE(before.read(path_.c_str(), why)) << why;
+    after.assign(kAfter, std::strlen(kAfter));
+    const cfg::SaveJob job{path_.c_str(), save_.c_str(), before, after, [throws] {
+                             if (throws) throw std::bad_alloc();
+                             return false;
+                           }};
+    EXPECT_EQ(cfg::save(cfg::system_file_calls(), job, why), throws ? 90 : 80);
+    EXPECT_NE(why.find(path_), std::string::npos);
+    EXPECT_EQ(read_file(path_), kBefore);
+    EXPECT_EQ(read_file(save_), kSavedBefore);
+    EXPECT_EQ(names(), kTidy);
+  }
 }
 
 // ---- Short writes ----

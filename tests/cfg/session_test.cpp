@@ -135,5 +135,42 @@ TEST_F(SessionTest, PerrorWritesTextAndReasonToTheSink) {
   cfg::set_diagnostics_sink(nullptr);
 }
 
+TEST_F(SessionTest, PerrorHasWordsForTheCodesOfTheLibrary) {
+  cfg::set_diagnostics_sink([](const char* line) noexcept { reported = line; });
+  const CfgSession session = open("dn: cn=top\ncn: top\n\ndn: cn=a,cn=top\ncn: a\n");
+  const auto said = [&](int rc, int code) {
+    EXPECT_EQ(rc, code);
+    cfg_perror(session.get(), nullptr);
+    return reported;
+  };
+  char type[] = "cn";
+  char value[] = "a";
+  char empty[] = "";
+  char* values[] = {value, nullptr};
+  const auto change = [&](int operation, const char* dn, bool adds = false) {
+    ldapmod mod{operation, type, {values}, nullptr};
+    ldapmod* mods[] = {&mod, nullptr};
+    return adds ? cfg_add_s(session.get(), dn, mods) : cfg_modify_s(session.get(), dn, mods);
+  };
+  _CFGMessage* chain = nullptr;
+  EXPECT_EQ(said(cfg_set_option(session.get(), 4711, 1), 1), "operations error");
+  EXPECT_EQ(said(cfg_search_s(session.get(), "cn=top", 0, "(", nullptr, 0, &chain), 2),
+            "the request cannot be read");
+  EXPECT_EQ(said(change(kModAdd, "cn=none"), 9), "no such entry, or no parent for it");
+  EXPECT_EQ(said(change(kModDelete, "cn=top"), 16), "no such attribute");
+  EXPECT_EQ(said(change(kModAdd, "cn=a,cn=top"), 20), "the value exists already");
+  EXPECT_EQ(said(cfg_delete_s(session.get(), "cn=top"), 66), "the entry has children");
+  EXPECT_EQ(said(change(kModAdd, "cn=a,cn=top", true), 68), "the entry exists already");
+  EXPECT_EQ(said(change(kModAdd, "no dn"), 34), "not a DN");
+  EXPECT_EQ(said(change(kModReplace, "cn=a,cn=top"), 0), "success");
+  type[0] = '-';
+  EXPECT_EQ(said(change(kModAdd, "cn=a,cn=top"), 17), "failed");
+  write_file(path_, "dn: cn=top\ncn: edited\n");
+  type[0] = 'c';
+  values[0] = empty;
+  EXPECT_EQ(said(change(kModAdd, "cn=a,cn=top"), 51), "busy");
+  cfg::set_diagnostics_sink(nullptr);
+}
+
 }  // namespace
 }  // namespace orv::cfg_test

@@ -257,17 +257,32 @@ class Check(Tool):
                    .replace("orv-slapdPort: 3389", "orv-slapdPort: 65535"), "i", "config.ldif")
         self.assertIn("nothing wrong", self.succeed("check", "i/config.ldif"))
 
-    def test_types_by_their_numbers_and_second_names_are_what_they_name(self):
+    def test_types_by_their_numbers_are_named_with_their_lines(self):
         oid = "2.25.83817390626969804497818767862655265745.1.20"
-        self.write(self.config.replace("orv-slapdSizeLimit: 0\n", f"{oid}: 0\n")
-                   .replace("cn: Digest\n", "commonName: Digest\n")
-                   .replace("cn: Audit\n", "2.5.4.3: Audit\n"), "i", "config.ldif")
-        self.assertIn("nothing wrong", self.succeed("check", "i/config.ldif"))
+        text = self.found("orv-slapdSizeLimit: 0\n", f"{oid}: 0\n")
+        line = self.config.splitlines().index("orv-slapdSizeLimit: 0") + 1
+        self.assertEqual(text.splitlines(), [
+            f"i/config.ldif: line {line}: the attribute type {oid} stands under its number",
+            text.splitlines()[-1]])
+        self.assertRegex(text.splitlines()[-1], ", 1 problem$")
+        # What such a line says is looked at all the same.
         self.assertIn("orv-slapdSizeLimit is not an integer",
                       self.found("orv-slapdSizeLimit: 0\n", f"{oid}: many\n"))
         self.assertIn("orv-slapdPort is not allowed",
                       self.found("cn: Digest\n",
                                  "cn: Digest\n2.25.83817390626969804497818767862655265745.1.18: 1\n"))
+
+    def test_types_by_their_second_names_are_what_they_name(self):
+        self.write(self.config.replace("cn: Digest\n", "commonName: Digest\n"), "i", "config.ldif")
+        self.assertIn("nothing wrong", self.succeed("check", "i/config.ldif"))
+
+    def test_finds_listening_addresses_that_the_host_lacks(self):
+        text = self.found("orv-slapdIpAddress: 127.0.0.1\n", "orv-slapdIpAddress: 127.0.0.1\n"
+                          "orv-slapdIpAddress: 192.0.2.1\norv-slapdIpAddress: ::\n")
+        self.assertIn("CN=CONFIGURATION: orv-slapdIpAddress 192.0.2.1 is no address of this host; "
+                      "changes of this entry will be refused\n", text)
+        self.assertIn("orv-slapdIpAddress :: stands for every address of the host", text)
+        self.assertIn("2 problems", text)
 
     def test_finds_second_values_of_a_single_valued_type_under_two_names(self):
         oid = "2.25.83817390626969804497818767862655265745.1.20"
@@ -296,7 +311,13 @@ class Check(Tool):
 
     def test_finds_identities_that_cannot_bind(self):
         self.assertIn("claimed by CN=CONFIGURATION too", self.added(self.member("CN = Root", "x")))
-        self.assertIn("lies inside", self.added(self.member("cn=m,cn=configuration", "x")))
+        for inside in ("cn=m,cn=configuration", "CN = Configuration", "2.5.4.3=x, cn=\\63onfiguration"):
+            self.assertIn("orv-slapdAdminDN lies inside CN=CONFIGURATION, so nobody can bind as it",
+                          self.added(self.member(inside, "x")))
+        self.assertIn("orv-slapdMasterDN lies inside", self.added(
+            "dn: CN=MASTER SERVER,CN=CONFIGURATION\nobjectClass: top\n"
+            "objectClass: orv-slapdConfigEntry\nobjectClass: orv-slapdReplication\n"
+            "cn: Master Server\norv-slapdMasterDN: cn=digest,cn=configuration\n"))
 
     def test_finds_a_password_that_was_copied_from_another_entry(self):
         sealed = re.search(r"^orv-slapdAdminPW: (.*)$", self.config, re.MULTILINE).group(1)

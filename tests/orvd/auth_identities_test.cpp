@@ -1,6 +1,7 @@
 // Who may bind, and what is granted: read from real files, proven with real passwords.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -416,6 +417,49 @@ TEST_F(IdentitiesOfAFile, PasswordOfAnUnknownSchemeNeverMatches) {
   EXPECT_EQ(identities->authenticate("cn=root", "abc"), nullptr);
 }
 
+// What an administrator, or a tool of another system, may have left in the file.
+TEST_F(IdentitiesOfAFile, MalformedStoredPasswordNeverMatches) {
+  const std::string hash = "MDEyMzQ1Njc4OTAxMjM0NQ";
+  const std::vector<std::string> stored{
+      "*",
+      "{" + std::string(512, 'A') + "}x",
+      "{SSHA512}",
+      "{SSHA512}=",
+      "{SSHA512}AAAA",
+      "{AES256}",
+      "{AES256}AAAA",
+      "{PBKDF2-SHA256}",
+      "{PBKDF2-SHA256}$$",
+      "{PBKDF2-SHA256}0$c2FsdA$" + hash,
+      "{PBKDF2-SHA256}-1$c2FsdA$" + hash,
+      "{PBKDF2-SHA256}4294967297$c2FsdA$" + hash,
+      "{PBKDF2-SHA512}99999999999999999999$c2FsdA$" + hash,
+      "{PBKDF2-SHA512}10000001$c2FsdA$" + hash,
+      "{CRYPT}",
+      "{CRYPT}*",
+      "{CRYPT}*0",
+      "{CRYPT}!",
+      "{CRYPT}x",
+      "{CRYPT}$6$rounds=999999999$salt$x",
+      "{CRYPT}$5$rounds=4294967297$salt$x",
+      "{CRYPT}$2b$31$abcdefghijklmnopqrstuuAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAA",
+      "{CRYPT}$y$jzT$abcdefghijklmnop$x",
+      "{CRYPT}$y$j9TAAAA$abcdefghijklmnop$x",
+      "{CRYPT}$7$zU..../....salt$x",
+      "{CRYPT}$7$",
+      "{CRYPT}$sha1$4294967295$salt$x",
+      "{CRYPT}$md5,rounds=4294967295$salt$x",
+      "{CRYPT}_",
+      "{CRYPT}$",
+  };
+  for (const std::string& value : stored) {
+    const auto identities = read(top_with(value));
+    ASSERT_TRUE(identities) << value << error_;
+    for (const std::string& guess : {value, std::string("*"), std::string("x"), "secret"s})
+      EXPECT_EQ(identities->authenticate("cn=root", guess), nullptr) << value << " / " << guess;
+  }
+}
+
 TEST_F(IdentitiesOfAFile, NameOfBlanksIsNobodys) {
   const auto identities = read(
       "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\n"
@@ -609,6 +653,27 @@ TEST_F(CostOfATry, CountsNoNumberOfIterationsThatIsNeverComputed) {
   EXPECT_THAT(tried(*identities, "cn=nobody"), ElementsAre(many_));
 }
 
+TEST_F(CostOfATry, OfATextOfCryptIsThatOfACostlyOne) {
+  if (!cfg::can_make_secret(cfg::SecretMethod::crypt)) GTEST_SKIP() << "the platform has none";
+  std::string crypt;
+  ASSERT_EQ(cfg::make_secret(cfg::SecretMethod::crypt, "secret", crypt), 0);
+  const auto identities =
+      read(kTop + kGroup + member("b", "cn=b", crypt) + member("c", "cn=c", cheap_));
+  ASSERT_TRUE(identities) << error_;
+  EXPECT_THAT(tried(*identities, "cn=nobody"), ElementsAre(crypt));
+  EXPECT_THAT(tried(*identities, "cn=b"), ElementsAre(crypt));
+  EXPECT_THAT(tried(*identities, "cn=c"), ElementsAre(cheap_, crypt));
+}
+
+TEST_F(CostOfATry, OfHashesThatTakeLongerIsMore) {
+  if (!cfg::can_make_secret(cfg::SecretMethod::crypt)) GTEST_SKIP() << "the platform has none";
+  const std::string rounds = "{CRYPT}$6$rounds=700000$salt$x";
+  const auto identities =
+      read(kTop + kGroup + member("a", "cn=a", many_) + member("b", "cn=b", rounds));
+  ASSERT_TRUE(identities) << error_;
+  EXPECT_THAT(tried(*identities, "cn=nobody"), ElementsAre(rounds));
+}
+
 TEST_F(CostOfATry, NeverMakesTheAnswerOfAnotherPasswordCount) {
   const auto identities = read(kTop);
   ASSERT_TRUE(identities) << error_;
@@ -700,6 +765,119 @@ TEST_F(Store, TellsDoubtsOnceForEachStateOfTheFile) {
   replace(kTop + kGroup + member("a", "cn=a", "x") + member("b", "cn=a", "y"));
   for (int i = 0; i < 3; ++i) store.current();
   EXPECT_THAT(told, ElementsAre(HasSubstr("same bind DN")));
+}
+
+// ---- What keeps the files from being read, and passes
+
+// While it lives, the process can open no file.
+class NoMoreFiles {
+ public:
+  NoMoreFiles() {
+    getrlimit(RLIMIT_NOFILE, &before_);
+    const int lowest_free = dup(STDIN_FILENO);
+    close(lowest_free);
+    rlimit none = before_;
+    none.rlim_cur = static_cast<rlim_t>(lowest_free);
+    EXPECT_EQ(setrlimit(RLIMIT_NOFILE, &none), 0);
+  }
+  ~NoMoreFiles() { setrlimit(RLIMIT_NOFILE, &before_); }
+
+ private:
+  rlimit before_{};
+};
+
+TEST_F(Store, ReadsAgainAfterAPauseWhenWhatWasInTheWayHasPassed) {
+  const auto start = IdentityStore::Clock::now();
+  write(top_with("one"));
+  std::vector<std::string> told;
+  IdentityStore store(config(), "",
+                      [&](const std::string& error, const auto&) { told.push_back(error); });
+  ASSERT_TRUE(store.reload(error_, warnings_)) << error_;
+  replace(top_with("two"));
+  const auto proves = [&](IdentityStore::Clock::time_point when, const char* password) {
+    return store.current(when)->authenticate("cn=root", password) != nullptr;
+  };
+  {
+    const NoMoreFiles none;
+    EXPECT_TRUE(proves(start, "one"));
+    EXPECT_TRUE(proves(start + IdentityStore::kFirstPause, "one"));
+  }
+  EXPECT_TRUE(proves(start + IdentityStore::kFirstPause, "one")) << "the second pause";
+  EXPECT_FALSE(proves(start + 3 * IdentityStore::kFirstPause, "one"));
+  EXPECT_TRUE(proves(start + 3 * IdentityStore::kFirstPause, "two"));
+  EXPECT_THAT(told, ElementsAre(HasSubstr("open files")));
+}
+
+TEST_F(Store, ReadsAgainAfterAReloadThatFailed) {
+  write(top_with("one"));
+  IdentityStore store(config(), "");
+  ASSERT_TRUE(store.reload(error_, warnings_)) << error_;
+  replace(top_with("two"));
+  {
+    const NoMoreFiles none;
+    EXPECT_FALSE(store.reload(error_, warnings_));
+  }
+  const auto later = IdentityStore::Clock::now() + IdentityStore::kFirstPause;
+  EXPECT_NE(store.current(later)->authenticate("cn=root", "two"), nullptr);
+}
+
+TEST_F(Store, PausesLongerEachTimeButReadsAtOnceWhatIsNew) {
+  auto now = IdentityStore::Clock::now();
+  write(top_with("one"));
+  int attempts = 0;
+  IdentityStore store(config(), "", {}, [&] {
+    ++attempts;
+    return false;
+  });
+  const auto attempts_by = [&](std::chrono::seconds later) {
+    store.current(now + later);
+    return attempts;
+  };
+  using std::chrono::seconds;
+  EXPECT_EQ(attempts_by(seconds(0)), 1);
+  EXPECT_EQ(attempts_by(seconds(0)), 1);
+  EXPECT_EQ(attempts_by(seconds(1)), 2);
+  EXPECT_EQ(attempts_by(seconds(2)), 2);
+  EXPECT_EQ(attempts_by(seconds(3)), 3);
+  EXPECT_EQ(attempts_by(seconds(6)), 3);
+  EXPECT_EQ(attempts_by(seconds(7)), 4);
+  for (int i = 1; i <= 10; ++i) {
+    now += IdentityStore::kLongestPause;
+    EXPECT_EQ(attempts_by(seconds(7)), 4 + i) << "no pause is longer";
+  }
+  replace(top_with("two"));
+  EXPECT_EQ(attempts_by(seconds(7)), 15);
+  EXPECT_EQ(attempts_by(seconds(8)), 16) << "and the pauses begin anew";
+}
+
+TEST_F(Store, HasOthersFollowEachReadingBeforeItServes) {
+  write(top_with("one"));
+  int followed = 0;
+  IdentityStore store(config(), "", {}, [&] {
+    ++followed;
+    return true;
+  });
+  ASSERT_TRUE(store.reload(error_, warnings_)) << error_;
+  EXPECT_EQ(followed, 1);
+  store.current();
+  EXPECT_EQ(followed, 1);
+  replace(top_with("two"));
+  EXPECT_TRUE(binds(store, "two"));
+  EXPECT_EQ(followed, 2);
+  replace("damaged\n");
+  store.current();
+  EXPECT_EQ(followed, 2);
+}
+
+TEST_F(Store, TellsTheSameCauseOnceHoweverOftenItTries) {
+  const auto start = IdentityStore::Clock::now();
+  write(top_with("one"));
+  int told = 0;
+  IdentityStore store(config(), "", [&](const std::string&, const auto&) { ++told; });
+  ASSERT_TRUE(store.reload(error_, warnings_)) << error_;
+  replace("damaged\n");
+  for (int hour = 0; hour < 5; ++hour) store.current(start + std::chrono::hours(hour));
+  EXPECT_EQ(told, 1);
 }
 
 TEST_F(Store, NoticesThatAMissingFileCameAndWentAgain) {

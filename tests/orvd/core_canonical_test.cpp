@@ -245,5 +245,28 @@ TEST_F(Canonical, FiltersAreShownWithoutValuesOfSecrets) {
             "(orv-slapdAdminPW=*)");
 }
 
+TEST_F(Canonical, FiltersAreShownWithoutWhatMayBeASecret) {
+  const auto shown = [this](const std::string& filter) {
+    return rewrite_filter(schema, filter, FilterUse::show);
+  };
+  // Under a name that nobody knows, or none.
+  EXPECT_EQ(shown("(|(orv-slapdAdminPasswd>=guess)(1.2.3=g*s)(unknown=*))"),
+            "(|(orv-slapdAdminPasswd>=***)(1.2.3=***)(unknown=*))");
+  EXPECT_EQ(shown("(:2.5.13.5:=guess)"), "(:2.5.13.5:=***)");
+  EXPECT_EQ(shown("(orv-slapdAdminPW;x-a:dn:=guess)"), "(orv-slapdAdminPW;x-a:dn:=***)");
+  // In a DN, also where its characters are escaped.
+  EXPECT_EQ(shown("(orv-slapdAdminDN=cn=a,orv-slapdAdminPW=guess)"), "(orv-slapdAdminDN=***)");
+  EXPECT_EQ(shown("(cn=orv-slapdAdminPW\\3dgu\\28ess)"), "(cn=***)");
+  EXPECT_EQ(shown("(orv-slapdAdminDN=cn=a,o=b)"), "(orv-slapdAdminDN=cn=a,o=b)");
+  // What should be a DN and is not.
+  EXPECT_EQ(shown("(orv-slapdAdminDN=orv-slapdAdminPW=guess,,)"), "(orv-slapdAdminDN=***)");
+  EXPECT_EQ(shown("(orv-slapdAdminDN=guess*)"), "(orv-slapdAdminDN=***)");
+  // What was cut off.
+  EXPECT_EQ(shown("(&(cn=a)(cn=orv-slapdAdminPW=guess\\2"), "(&(cn=a)(cn=***");
+  // All else.
+  EXPECT_EQ(shown("(&(cn=a*b)(!(description~=c=d))(description;x-a=e)(cn:2.5.13.5:=f))"),
+            "(&(cn=a*b)(!(description~=c=d))(description;x-a=e)(cn:2.5.13.5:=f))");
+}
+
 }  // namespace
 }  // namespace orv::server

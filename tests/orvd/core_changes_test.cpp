@@ -1,14 +1,17 @@
 // What the server does about changes before and after the backend: guards, consequences, and rights
 // that shrank while an operation waited.
 #include <algorithm>
+#include <atomic>
 #include <fstream>
 #include <iterator>
+#include <mutex>
+#include <utility>
 
 #include "core_server_fixture.h"
-#include "file_report.h"
 #include "ops/canonical.h"
 #include "ops/consequences.h"
 #include "ops/guards.h"
+#include "ops/persistent_search.h"
 
 namespace orv::server {
 namespace {
@@ -121,27 +124,6 @@ TEST(Consequences, OfEntriesThatHoldSettings) {
       consequences_of_change("CN=X,CN=XLOG MANAGEMENT,CN=CONFIGURATION", identities).settings);
 }
 
-// ---- the file as somebody left it
-
-TEST(FileReport, FindsTypesUnderTheirNumbers) {
-  EXPECT_EQ(
-      numbered_types("version: 1\n# 2.5.4.3: no\ndn: cn=x\n2.5.4.3: x\n 2.5.4.4: folded\n"
-                     "2.5.4.0:: dG9w\n2.5.4.3;x: y\ncn: 2.5.4.3: z\n2.5.4"),
-      (std::vector<std::string>{"line 4: the attribute type 2.5.4.3 stands under its number",
-                                "line 6: the attribute type 2.5.4.0 stands under its number",
-                                "line 7: the attribute type 2.5.4.3 stands under its number"}));
-  EXPECT_TRUE(numbered_types("").empty());
-}
-
-TEST(FileReport, KnowsAddressesOfThisHost) {
-  EXPECT_FALSE(is_foreign_address("127.0.0.1"));
-  EXPECT_FALSE(is_foreign_address("0.0.0.0"));
-  EXPECT_FALSE(is_foreign_address("::"));
-  EXPECT_FALSE(is_foreign_address("localhost"));
-  EXPECT_TRUE(is_foreign_address("192.0.2.1"));
-  EXPECT_TRUE(is_foreign_address("2001:db8::1"));
-}
-
 }  // namespace
 
 namespace test {
@@ -180,6 +162,127 @@ TEST_F(BlockedServer, OperationThatWaitedIsServedWhenItsIdentityIsStillTheSame) 
   EXPECT_EQ(replies.back().code, 53);
   stop();
   EXPECT_EQ(backend.calls(parameter::delete_function), 2);
+}
+
+// ---- changes that are not what the backend says
+
+// How many changes the library has made; only the gate's holder counts.
+std::atomic<unsigned long>& library_changes() {
+  static std::atomic<unsigned long> made{0};
+  return made;
+}
+
+class ReportedChanges : public LoopbackServer {
+ protected:
+  ReportedChanges() {
+    changes_made = [] { return library_changes().load(); };
+    backend.on_change = [this](pblock* parameters) {
+      if (writes) ++library_changes();
+      const int rc = code;
+      send_ldap_result(connection_of(parameters), operation_of(parameters), rc, nullptr, "");
+      return rc;
+    };
+    take_over = [this](const Consequences& consequences, bool made) {
+      const std::lock_guard lock(mutex);
+      taken_over.emplace_back(consequences.identities, made);
+      return read_anew.load();
+    };
+  }
+  ~ReportedChanges() override { stop(); }
+
+  using Told = std::vector<std::pair<bool, bool>>;  // identities, made
+  Told told() {
+    const std::lock_guard lock(mutex);
+    return std::exchange(taken_over, {});
+  }
+
+  std::atomic<bool> writes{true};
+  std::atomic<int> code{0};
+  std::atomic<bool> read_anew{false};
+
+ private:
+  std::mutex mutex;
+  Told taken_over;
+};
+
+TEST_F(ReportedChanges, ThatWereNotMadeAreAnsweredWith90) {
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  const std::string added = "cn=x,cn=configuration";
+  writes = false;
+  EXPECT_EQ(code_of(client, add_entry(2, added, "objectClass", "orv-slapdSupplier")), 90);
+  EXPECT_EQ(code_of(client, modify(3, kTop, "description", "x")), 90);
+  EXPECT_EQ(code_of(client, delete_entry(4, added)), 90);
+  EXPECT_EQ(told(), (Told{{true, false}, {true, false}, {true, false}})) << "looked for, not taken";
+  writes = true;
+  EXPECT_EQ(code_of(client, modify(5, kTop, "description", "x")), 0);
+  EXPECT_EQ(told(), (Told{{true, true}}));
+}
+
+TEST_F(ReportedChanges, AreLookedForInTheFileWhateverTheResult) {
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  for (const int failure : {1, 50, 51, 53, 80, 90}) {
+    code = failure;
+    EXPECT_EQ(code_of(client, delete_entry(failure, "cn=x,cn=configuration")), failure);
+    EXPECT_EQ(told().size(), 1U) << failure;
+  }
+}
+
+TEST_F(ReportedChanges, ThatFailedAndStandInTheFileHaveTheirSettingsRead) {
+  std::atomic<int> reloads{0};
+  reload = [&](Settings&) {
+    ++reloads;
+    return false;
+  };
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  code = 80;
+  EXPECT_EQ(code_of(client, modify(2, kTop, "description", "x")), 80);
+  EXPECT_EQ(reloads, 0);
+  read_anew = true;
+  EXPECT_EQ(code_of(client, modify(3, kTop, "description", "x")), 80);
+  EXPECT_EQ(reloads, 1);
+}
+
+TEST_F(ReportedChanges, ThatWereNotMadeAreNotTold) {
+  controls = {kPersistentSearchOid, kEntryChangeOid};
+  backend.on_search = [](pblock* parameters) { return finish_search(parameters, 0, 0); };
+  start();
+  WireClient listener(port());
+  WireClient client(port());
+  bind_as_root(listener);
+  bind_as_root(client);
+  const std::string value = tlv(0x30, integer(15) + tlv(0x01, "\xFF") + tlv(0x01, "\xFF"));
+  const std::string wish =
+      tlv(0x30, tlv(0x04, kPersistentSearchOid) + tlv(0x01, "\xFF") + tlv(0x04, value));
+  listener.send(
+      message(7,
+              tlv(0x63, tlv(0x04, kTop) + tlv(0x0A, "\x02") + tlv(0x0A, std::string(1, '\0')) +
+                            integer(0) + integer(0) + tlv(0x01, std::string(1, '\0')) +
+                            tlv(0x87, "objectClass") + tlv(0x30, "")),
+              wish));
+  listener.send(extended(8, "1.2.3"));
+  ASSERT_TRUE(listener.receive());
+  writes = false;
+  EXPECT_EQ(code_of(client, add_entry(2, "cn=x,cn=configuration", "cn", "x")), 90);
+  listener.send(extended(9, "1.2.3"));
+  ASSERT_TRUE(listener.receive());
+  EXPECT_EQ(backend.calls(parameter::search_function), 1) << "that of the first part";
+}
+
+TEST_F(LoopbackServer, FilesAreLookedAfterAgainAndAgainWithoutARequest) {
+  Event looked_twice;
+  std::atomic<int> looks{0};
+  look_after = [&] {
+    if (++looks == 2) looked_twice.happen();
+  };
+  start();
+  EXPECT_TRUE(looked_twice.wait());
+  stop();
 }
 
 }  // namespace

@@ -159,6 +159,18 @@ TEST(ModificationList, OfOneTypeIsNotInTheWayOfAnother) {
   EXPECT_EQ(code_of({add({"x"}, "cn"), replace({"x"}), remove({"y"}, "cn")}), 0);
 }
 
+TEST(ModificationList, DeletedRolesStandBehindWhatElseIsTakenAway) {
+  constexpr const char* kRole = "orv-slapdAdminRole";
+  EXPECT_EQ(code_of({remove({"A", "B"}, kRole), remove({"x"})}), 53);
+  EXPECT_EQ(code_of({remove({"A"}, kRole), add({"C"}, kRole), replace({"x"})}), 53);
+  EXPECT_EQ(code_of({remove({"A"}, kRole), add({"y"}), remove({}, "cn")}), 53);
+  EXPECT_EQ(code_of({remove({"x"}), remove({"A", "B"}, kRole)}), 0);
+  EXPECT_EQ(code_of({remove({"A", "B"}, kRole), add({"x"})}), 0);
+  EXPECT_EQ(code_of({add({"A"}, kRole), remove({"x"})}), 0);
+  EXPECT_EQ(code_of({replace({"A"}, kRole), remove({"x"})}), 0);
+  EXPECT_EQ(code_of({remove({}, kRole), remove({"x"})}), 0);
+}
+
 // ---- classes
 
 int class_code(const TypeChange& change) {

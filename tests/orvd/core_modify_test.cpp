@@ -6,6 +6,7 @@
 
 #include "cfg/ldapmod.h"
 #include "core_server_fixture.h"
+#include "ops/failed_changes.h"
 #include "ops/guards.h"
 
 namespace orv::server::test {
@@ -175,6 +176,126 @@ TEST(ValueGuards, LookAtAddedEntriesToo) {
   EXPECT_EQ(code_of_adding({"orv-slapdLogLevel", {"Debug"}}), 0);
   EXPECT_EQ(code_of_adding({"orv-slapdSizeLimit", {"-1"}}), 19);
   EXPECT_EQ(code_of_adding({"objectClass", {"orv-slapdAdminGroupSettings"}}), 53);
+}
+
+// ---- modifications that fail
+
+class FailingModifies : public ModifyServer {
+ protected:
+  FailingModifies() {
+    settings.max_failed_change_size = kLimit;
+    code = 50;
+  }
+  static std::string large(int id, std::size_t bytes = kLimit / 16) {
+    return modify(id, kTop, "description", std::string(bytes, 'x'));
+  }
+  // How many large ones get to the backend, one after the other, before one is refused.
+  int until_refused(WireClient& client) {
+    for (int n = 0; n < 100; ++n) {
+      const int got = code_of(client, large(10 + n));
+      if (got == 51) return n;
+      EXPECT_EQ(got, code);
+    }
+    return 100;
+  }
+  int modifies() { return backend.calls(parameter::modify_function); }
+
+  static constexpr std::int64_t kLimit = 65536;
+};
+
+TEST_F(FailingModifies, AreRefusedWhenAConnectionHasUsedUpItsShare) {
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  const int admitted = until_refused(client);
+  EXPECT_GE(admitted, 3);
+  EXPECT_LE(admitted, 5);
+  EXPECT_EQ(modifies(), admitted);
+  WireClient other(port());
+  bind_as_root(other);
+  EXPECT_EQ(code_of(other, large(2)), 50) << "another connection has a share of its own";
+}
+
+TEST_F(FailingModifies, AreRefusedOnEveryConnectionOfWhoHasUsedUpTheAllowance) {
+  start();
+  int admitted = 0;
+  int last = -1;
+  for (int i = 0; i < 10 && last != 0; ++i) {
+    WireClient client(port());
+    bind_as_root(client);
+    admitted += last = until_refused(client);
+  }
+  EXPECT_EQ(last, 0);
+  EXPECT_GE(admitted, 15);
+  EXPECT_LE(admitted, 18);
+  EXPECT_EQ(modifies(), admitted);
+  WireClient member(port());
+  bind_as(member, kMember);
+  EXPECT_EQ(code_of(member, large(2)), 50) << "others are not concerned";
+}
+
+TEST_F(FailingModifies, LeaveOtherRequestsAsTheyWere) {
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  until_refused(client);
+  EXPECT_EQ(code_of(client, delete_entry(200, kTop)), 50);
+  EXPECT_EQ(code_of(client, add_entry(201, "cn=x,cn=configuration", "cn", "x")), 50);
+  code = 0;
+  EXPECT_EQ(code_of(client, large(202)), 51) << "nor is one that would succeed let through";
+}
+
+TEST_F(FailingModifies, CostNothingWhenTheySucceed) {
+  code = 0;
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  EXPECT_EQ(until_refused(client), 100);
+}
+
+TEST_F(FailingModifies, CountManySmallValuesByWhatTheyTake) {
+  settings.max_values = 10000;
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  Change many{0, "description", {}};
+  for (int i = 0; i < 1000; ++i) many.values.push_back(std::to_string(i));
+  EXPECT_EQ(code_of(client, modify_with(2, kTop, {many})), 50);
+  EXPECT_EQ(code_of(client, modify_with(3, kTop, {many})), 51);
+}
+
+TEST(FailedChanges, ComeBackWithinADay) {
+  using std::chrono::hours;
+  constexpr std::int64_t kLimit = 1000;
+  const Clock::time_point start = Clock::now();
+  FailedChanges owed;
+  owed.charge(1000, kLimit, start);
+  EXPECT_FALSE(owed.used_up(kLimit, start));
+  owed.charge(500, kLimit, start);
+  EXPECT_TRUE(owed.used_up(kLimit, start));
+  EXPECT_TRUE(owed.used_up(kLimit, start + hours(11)));
+  EXPECT_FALSE(owed.used_up(kLimit, start + hours(13)));
+  EXPECT_FALSE(owed.settled(kLimit, start + hours(35)));
+  EXPECT_TRUE(owed.settled(kLimit, start + hours(37)));
+}
+
+TEST(FailedChanges, ShutNobodyOutForLongerThanADay) {
+  constexpr std::int64_t kLimit = 1000;
+  const Clock::time_point start = Clock::now();
+  FailedChanges owed;
+  owed.charge(1000000, kLimit, start);
+  EXPECT_TRUE(owed.used_up(kLimit, start + std::chrono::hours(23)));
+  EXPECT_FALSE(owed.used_up(kLimit, start + std::chrono::hours(25)));
+}
+
+TEST(FailedChanges, OfNamesThatOweNothingAreForgotten) {
+  constexpr std::int64_t kLimit = 1000;
+  const Clock::time_point start = Clock::now();
+  FailedChangesByName owed;
+  for (int i = 0; i < 5000; ++i)
+    owed.charge("cn=" + std::to_string(i), 1, kLimit, start + i * std::chrono::hours(1));
+  EXPECT_LE(owed.names(), 1100U);
+  EXPECT_FALSE(owed.used_up("cn=4999", kLimit, start));
 }
 
 // ---- settings

@@ -3,13 +3,18 @@
 
 #include <gtest/gtest.h>
 
+#include <cstdlib>
+#include <cstring>
 #include <string>
+#include <thread>
+#include <utility>
 #include <vector>
 
 #include "cfg/attribute_table.h"
 #include "core_fake_backend.h"
 #include "core_server_fixture.h"
 #include "core_wire.h"
+#include "slapi/codepage.h"
 #include "slapi/schema.h"
 
 namespace orv::server {
@@ -210,6 +215,98 @@ TEST_F(DeletedEntry, HidesTheAdministratorOfTheTopEntry) {
   EXPECT_FALSE(shows("CN=CONFIGURATION", &member, "orv-slapdAdminDN"));
   EXPECT_FALSE(shows("CN=CONFIGURATION", &member, "orv-slapdAdminGroupEnabled"));
   EXPECT_TRUE(shows("CN=CONFIGURATION", &root, "orv-slapdAdminDN"));
+}
+
+// ---- which searches are told of a deleted entry
+
+class DeletionIn : public OneSearch {
+ protected:
+  static void SetUpTestSuite() {
+    ASSERT_EQ(cfg::register_attribute_types(builtin_schema().attribute_table()), 0);
+  }
+  static void speak(const char* code_page) {
+    set_local_code_page(code_page);
+    ASSERT_EQ(initIconvHandle(), 0);
+  }
+  void TearDown() override { speak("UTF-8"); }
+
+  // As the backend keeps it: values are given in UTF-8 and come into the entry's code page.
+  static EntryPtr deleted(const char* dn, const std::string& description) {
+    EntryPtr made = test::make_test_entry(dn);
+    made->local_code_page = true;
+    std::string text = description;
+    berval value{text.size(), text.data()};
+    berval* values[] = {&value, nullptr};
+    attr_merge(made.get(), "description", values, 1, 1, nullptr);
+    return made;
+  }
+  PersistentSearchPtr listen(const char* filter) {
+    SearchRequest request;
+    request.scope = 2;
+    auto search =
+        std::make_shared<PersistentSearch>(home, 1, PersistentSearchControl{15, true, true},
+                                           request, "CN=ADMINGROUP,CN=CONFIGURATION", filter);
+    EXPECT_TRUE(all.count(*search, 10));
+    EXPECT_TRUE(all.join(search));
+    return search;
+  }
+  void announce(EntryPtr before) {
+    all.announce(all.audience(ChangeType::remove, kNormalMember, std::move(before)));
+  }
+
+  PersistentSearches all;
+};
+
+TEST_F(DeletionIn, AnotherCodePageMatchesByCharactersAndIsToldInUtf8) {
+  speak("ISO-8859-1");
+  const PersistentSearchPtr asked = listen("(description=caf\xC3\xA9)");
+  const PersistentSearchPtr another = listen("(description=caf\xC3\x83\xC2\xA9)");
+  announce(deleted(kMember, "Caf\xC3\xA9"));
+  const ChangePtr change = asked->take();
+  ASSERT_TRUE(change);
+  const attr* const told = attr_find(change->before.get(), "description", 0, 0);
+  ASSERT_TRUE(told);
+  EXPECT_STREQ(told->values[0]->bv_val, "Caf\xC3\xA9");
+  EXPECT_FALSE(another->take()) << "what it asked for has other characters";
+  EXPECT_EQ(asked->failure(), 0);
+  EXPECT_EQ(another->failure(), 0);
+}
+
+TEST_F(DeletionIn, AnotherCodePageIsMatchedBeforeItIsConverted) {
+  speak("ISO-8859-1");
+  const PersistentSearchPtr asked = listen("(description=\xC3\x83\xC2\xA9)");
+  // Two characters, whose bytes in the file are one character of UTF-8.
+  announce(deleted(kMember, "\xC3\x83\xC2\xA9"));
+  EXPECT_TRUE(asked->take());
+}
+
+TEST_F(DeletionIn, ACodePageWithoutTheNameEndsTheSearchesThatShouldHearOfIt) {
+  speak("EUC-JP");
+  const PersistentSearchPtr asked = listen("(description=text)");
+  const PersistentSearchPtr another = listen("(description=something else)");
+  EntryPtr before = deleted(kMember, "text");
+  std::free(before->dn);
+  before->dn = strdup("cn=\xFF\xFF,cn=admingroup,cn=configuration");
+  announce(std::move(before));
+  EXPECT_FALSE(asked->take());
+  EXPECT_NE(asked->failure(), 0);
+  EXPECT_GT(home->news, 0);
+}
+
+TEST_F(DeletionIn, TheBackendsKeepingThatFailedEndsTheSearches) {
+  const PersistentSearchPtr asked = listen("(objectClass=*)");
+  announce(nullptr);
+  EXPECT_FALSE(asked->take());
+  EXPECT_EQ(asked->failure(), 80);
+}
+
+TEST_F(DeletionIn, AFilterThatCannotBeReadEndsItsSearchAlone) {
+  const PersistentSearchPtr broken = listen("(description=");
+  const PersistentSearchPtr asked = listen("(description=text)");
+  announce(deleted(kMember, "text"));
+  EXPECT_EQ(broken->failure(), 2);
+  EXPECT_FALSE(broken->take());
+  EXPECT_TRUE(asked->take());
 }
 
 // ---- over the wire
@@ -418,6 +515,37 @@ TEST_F(PersistentWire, ABindEndsItAndIsAnswered) {
   EXPECT_EQ(code_of(listener, test::bind(9, test::kRoot, test::kSecret)), 0);
   listener.send(test::search(7, test::kTop));
   EXPECT_EQ(listener.receive_result().back().code, 0) << "its message id is free again";
+}
+
+// A bind that is answered at once, when the end of the last search leaves nothing outstanding.
+TEST_F(PersistentWire, ABindEndsItAlsoWhileANoticeWaitsForItsTurn) {
+  test::Event first_goes_on;
+  test::Event second_goes_on;
+  std::atomic<int> changes{0};
+  backend.on_change = [&](pblock* parameters) {
+    (changes.fetch_add(1) == 0 ? first_goes_on : second_goes_on).wait();
+    send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 0, nullptr,
+                     "");
+    return 0;
+  };
+  start();
+  WireClient listener(port());
+  WireClient one(port());
+  WireClient two(port());
+  for (WireClient* const client : {&listener, &one, &two}) bind_as_root(*client);
+  listener.send(persistent_search(7));
+  ASSERT_TRUE(taken(listener, 8));
+
+  one.send(test::add_entry(2, kMember, "cn", "x"));
+  while (changes.load() == 0) std::this_thread::yield();
+  two.send(test::add_entry(2, kMember, "cn", "x"));
+  ASSERT_TRUE(wait_for_waiters(1)) << "the second add waits";
+  first_goes_on.happen();
+  while (changes.load() == 1) std::this_thread::yield();
+  ASSERT_TRUE(wait_for_waiters(1)) << "the notice waits behind the second add";
+  EXPECT_EQ(code_of(listener, test::bind(9, "", "")), 0);
+  second_goes_on.happen();
+  EXPECT_TRUE(taken(listener, 10));
 }
 
 TEST_F(PersistentWire, TheBoundsHold) {

@@ -80,7 +80,11 @@ class LoopbackServer : public testing::Test {
                                loops,
                                reload,
                                {},
-                               audit});
+                               audit,
+                               take_over,
+                               true,
+                               look_after,
+                               changes_made});
     std::string error;
     ASSERT_TRUE(server->listen(addresses, 0, error)) << error;
     if (reload) server->handle_signals();
@@ -123,6 +127,9 @@ class LoopbackServer : public testing::Test {
   Logs logs;
   std::function<bool(Settings&)> reload;
   AuditLog* audit = nullptr;
+  std::function<bool(const Consequences&, bool made)> take_over;
+  std::function<void()> look_after;
+  unsigned long (*changes_made)() = nullptr;
   std::vector<std::string> addresses{"127.0.0.1"};
   unsigned loops = 1;
   std::optional<Server> server;

@@ -157,7 +157,7 @@ TEST_F(SettingsTest, LogIsNeverAFileOfTheServersOwnOrNoFileAtAll) {
   const std::string before = directory.read("config.ldif");
   ASSERT_EQ(link(config.c_str(), directory.file("alias").c_str()), 0);
   ASSERT_EQ(mkfifo(directory.file("pipe").c_str(), 0600), 0);
-  Logs logs({config});
+  Logs logs({{config}, {}});
   for (const std::string& target : {config, directory.file("alias"), directory.file("pipe"),
                                     directory.file("missing/error.log")}) {
     settings.error_log = target;

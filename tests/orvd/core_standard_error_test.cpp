@@ -1,5 +1,6 @@
 // Logs that somebody stopped reading: what is kept, what is given up, and how an end is found.
 #include <fcntl.h>
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -12,6 +13,8 @@
 #include <sstream>
 #include <string>
 #include <thread>
+#include <utility>
+#include <vector>
 
 #include "logs.h"
 #include "standard_error.h"
@@ -231,9 +234,45 @@ TEST_F(LogFiles, DoNotTakeWhatTheOtherOneKeeps) {
   EXPECT_EQ(content(file("access.log")), "");
 }
 
+TEST_F(LogFiles, AreNoFileThatAnotherLogHasOpenUnderWhateverName) {
+  const std::string audit = file("audit.log");
+  std::ofstream(audit) << "dn: cn=a\n";
+  struct stat status {};
+  ASSERT_EQ(stat(audit.c_str(), &status), 0);
+  const std::vector<FileInUse> others = {{{status.st_dev, status.st_ino}, "the audit log"}};
+  ASSERT_EQ(rename(audit.c_str(), file("moved").c_str()), 0);
+  Logs logs;
+  ASSERT_TRUE(logs.open(settings_, others).empty());
+  const Settings before = settings_;
+  settings_.error_log = file("moved");
+  settings_.access_log = file("moved");
+  EXPECT_THAT(logs.open(settings_, others),
+              testing::Each(testing::EndsWith("the same file as the audit log")));
+  logs.error("an error");
+  logs.write_access("an access\n");
+  logs.finish();
+  EXPECT_EQ(content(file("moved")), "dn: cn=a\n");
+  EXPECT_NE(content(before.error_log).find("an error"), std::string::npos);
+  EXPECT_NE(content(before.access_log).find("an access"), std::string::npos);
+}
+
+TEST_F(LogFiles, AreToldWithWhatTheyAreUsedFor) {
+  Logs logs;
+  EXPECT_TRUE(logs.files_in_use().empty());
+  ASSERT_TRUE(logs.open(settings_).empty());
+  const std::vector<FileInUse> files = logs.files_in_use();
+  ASSERT_EQ(files.size(), 2U);
+  EXPECT_EQ(files[0].as, "the error log");
+  EXPECT_EQ(files[1].as, "the access log");
+  settings_.error_log = "";
+  settings_.access_log_level = "off";
+  ASSERT_TRUE(logs.open(settings_).empty());
+  EXPECT_TRUE(logs.files_in_use().empty());
+}
+
 TEST_F(LogFiles, AreNotMadeInPlaceOfAGuardedFileThatIsMissing) {
   settings_.error_log = file("config.ldif.save");
-  Logs logs({file("config.ldif.save")});
+  Logs logs({{file("config.ldif.save")}, {}});
   EXPECT_EQ(logs.open(settings_).size(), 1U);
   EXPECT_FALSE(std::filesystem::exists(settings_.error_log));
 }

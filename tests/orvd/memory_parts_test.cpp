@@ -3,6 +3,7 @@
 // again. A program of its own, because it replaces the allocation functions of the process.
 #include <gtest/gtest.h>
 
+#include <chrono>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
@@ -213,6 +214,26 @@ TEST_F(MemoryOfABind, WantOfItIsNoWrongPassword) {
     return identities->authenticate("CN = A name that is not short", "a password that is not short",
                                     compare) != nullptr;
   });
+}
+
+// The file is good, so nothing about it will change when there is memory again.
+TEST_F(MemoryOfABind, WantOfItWhileTheFileIsReadIsMadeGoodAfterAPauseAndToldOnce) {
+  int told = 0;
+  IdentityStore store(config(), "", [&](const std::string&, const auto&) { ++told; });
+  ASSERT_TRUE(store.reload(error_, warnings_)) << error_;
+  const auto generation = store.generation();
+  std::filesystem::last_write_time(config(), std::filesystem::file_time_type::clock::now());
+  const auto now = IdentityStore::Clock::now();
+  {
+    const AllocationFault fault(1);
+    store.current(now);
+  }
+  store.current(now);
+  EXPECT_EQ(store.generation(), generation);
+  EXPECT_EQ(told, 1);
+  store.current(now + IdentityStore::kFirstPause);
+  EXPECT_GT(store.generation(), generation);
+  EXPECT_EQ(told, 1);
 }
 
 // ---- the session

@@ -119,12 +119,18 @@ TEST(Decoder, Delete) {
 }
 
 TEST(Decoder, RenameWithAndWithoutNewSuperior) {
-  EXPECT_EQ(accepted<ModifyDnRequest>(message(modify_dn("cn=x"))).dn, "cn=x");
-  EXPECT_EQ(
-      accepted<ModifyDnRequest>(message(tlv(0x6C, join({octets("cn=y"), octets("cn=z"),
-                                                        boolean(false), tlv(0x80, "cn=above")}))))
-          .dn,
-      "cn=y");
+  const auto plain = accepted<ModifyDnRequest>(message(modify_dn("cn=x")));
+  EXPECT_EQ(plain.dn, "cn=x");
+  EXPECT_FALSE(plain.new_superior);
+  const auto moved = accepted<ModifyDnRequest>(message(
+      tlv(0x6C, join({octets("cn=y"), octets("cn=z"), boolean(false), tlv(0x80, "cn=above")}))));
+  EXPECT_EQ(moved.dn, "cn=y");
+  EXPECT_EQ(moved.new_rdn, "cn=z");
+  EXPECT_FALSE(moved.delete_old_rdn);
+  EXPECT_EQ(moved.new_superior, "cn=above");
+  EXPECT_TRUE(accepted<ModifyDnRequest>(
+                  message(tlv(0x6C, join({octets("cn=y"), octets("cn=z"), boolean(true)}))))
+                  .delete_old_rdn);
 }
 
 TEST(Decoder, Compare) {

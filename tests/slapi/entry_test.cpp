@@ -204,6 +204,17 @@ TEST(AttrMerge, ConvertsWhatGoesIntoAnEntryOfTheFile) {
   ASSERT_EQ(initIconvHandle(), 0);
 }
 
+TEST(AttrMerge, IgnoresTheCaseOfLettersOfTheFilesCodePage) {
+  set_local_code_page("ISO-8859-1");
+  ASSERT_EQ(initIconvHandle(), 0);
+  const EntryPtr e = empty_entry();
+  e->local_code_page = true;
+  EXPECT_EQ(merge(e, "cn", {"\xC3\x96L"}), 0);
+  EXPECT_EQ(merge(e, "cn", {"\xC3\xB6l"}), 20);
+  set_local_code_page("UTF-8");
+  ASSERT_EQ(initIconvHandle(), 0);
+}
+
 TEST(ObjectClassReference, FollowsEveryMergeAndDelete) {
   const EntryPtr e = empty_entry();
   EXPECT_EQ(merge(e, "cn", {"a"}), 0);

@@ -8,6 +8,8 @@
 #include <thread>
 #include <vector>
 
+#include "cfg/attribute_table.h"
+#include "slapi/schema.h"
 #include "slapi/trace.h"
 #include "temporary_directory.h"
 
@@ -123,6 +125,23 @@ TEST_F(Messages, AreOneLineWhateverTheirArgumentsHold) {
       testing::ElementsAre(
           "0/8/179 The value 'a\\0Aforged\\0D\\7F %s\\09' of orv-slapdPtaURL is not an LDAP URL.",
           "0/8/179 The value '(null)' of orv-slapdPtaURL is not an LDAP URL."));
+}
+
+TEST_F(Messages, ShowNoPasswordThatStandsInAnArgument) {
+  ASSERT_EQ(cfg::register_attribute_types(builtin_schema().attribute_table()), 0);
+  PrintMessage(0, 8, 179, "ldap://h/orv-slapdAdminPW=hidden\n, o=x??sub");
+  PrintMessage(0, 8, 179, "ldap://h/orv-slapdAdminPW%3dhidden");
+  PrintMessage(0, 8, 167, "ORV-SLAPDMASTERPW=HIDDEN", "OU=B,ORV-SLAPDMASTERPW=HIDDEN");
+  EXPECT_THAT(
+      g_messages,
+      testing::ElementsAre(
+          "0/8/179 The value 'ldap://h/orv-slapdAdminPW=********, o=x??sub' of orv-slapdPtaURL is "
+          "not an LDAP URL.",
+          "0/8/179 The value 'ldap://h/orv-slapdAdminPW%3d********' of orv-slapdPtaURL is not an "
+          "LDAP URL.",
+          "0/8/167 The pass-through subtrees 'ORV-SLAPDMASTERPW=********' and "
+          "'OU=B,ORV-SLAPDMASTERPW=********' overlap. Each subtree may be passed to one server "
+          "only."));
 }
 
 TEST_F(Messages, ThatAreTooLongAreCutAndSaySo) {

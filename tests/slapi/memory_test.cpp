@@ -20,6 +20,7 @@
 #include "slapi/log.h"
 #include "slapi/owners.h"
 #include "slapi/password_method.h"
+#include "slapi/reserves.h"
 #include "slapi/schema.h"
 #include "slapi/services.h"
 #include "slapi/strings.h"
@@ -289,6 +290,32 @@ TEST_F(OutOfMemory, ListOfAttributesIsRefusedEachTimeFromTheReserve) {
   ASSERT_NE(list, nullptr);
   EXPECT_EQ(list[0]->mod_type, nullptr);
   free_list(list);
+}
+
+TEST_F(OutOfMemory, ReserveThatWasUsedIsFilledBeforeTheNextHandlerOrItIsNotCalled) {
+  const EntryPtr e = test::make_entry(nullptr, {{"cn", {"box"}}});
+  ASSERT_TRUE(fill_reserves());
+  ldapmod** held = nullptr;
+  {
+    AllocationFault fault(1);
+    held = EntryToLDAPMod(e->attributes);
+  }
+  ASSERT_EQ(held[0]->mod_type, nullptr);
+  {
+    AllocationFault fault(1);
+    EXPECT_FALSE(fill_reserves());
+  }
+  EXPECT_TRUE(fill_reserves());
+  {
+    AllocationFault fault(1);
+    EXPECT_TRUE(fill_reserves()) << "it is full";
+    EXPECT_FALSE(fault.hit());
+    ldapmod** const list = EntryToLDAPMod(e->attributes);
+    ASSERT_NE(list, nullptr);
+    EXPECT_EQ(list[0]->mod_type, nullptr);
+    free_list(list);
+  }
+  free_list(held);
 }
 
 TEST_F(OutOfMemory, DeletedValuesStay) {

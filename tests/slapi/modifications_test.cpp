@@ -85,9 +85,29 @@ TEST(ListOfAttributes, HasANullArrayForNoValues) {
   }
 }
 
-TEST(ListOfAttributes, TakesANullTextForAnEmptyValue) {
+// What a translation leaves that failed for one value and not for the last: written, that would be
+// an empty value in the place of the client's.
+TEST(ListOfAttributes, WithAValueWithoutATextIsOneRecordThatNoChangeAccepts) {
   char type[] = "cn";
-  berval value{0, nullptr};
+  char text[] = "box";
+  berval lost{0, nullptr};
+  berval kept{4, text};
+  berval* values[] = {&lost, &kept, nullptr};
+  attr a{type, values, 2, 0, nullptr};
+  attr before{type, &values[1], 1, 0, &a};
+  for (attr* const attributes : {&a, &before}) {
+    const List list(EntryToLDAPMod(attributes));
+    ASSERT_NE(list, nullptr);
+    ASSERT_NE(list.get()[0], nullptr);
+    EXPECT_EQ(list.get()[0]->mod_type, nullptr);
+    EXPECT_EQ(list.get()[1], nullptr);
+  }
+}
+
+TEST(ListOfAttributes, KeepsAnEmptyText) {
+  char type[] = "cn";
+  char text[] = "";
+  berval value{1, text};
   berval* values[] = {&value, nullptr};
   attr a{type, values, 1, 0, nullptr};
   const List list(EntryToLDAPMod(&a));
@@ -231,6 +251,21 @@ TEST(DeleteValues, GoesByTheEqualityRule) {
     EXPECT_EQ(test::texts_of(attr_find(e.get(), "cn", 0, 0)), std::vector<std::string>{"box"});
     EXPECT_EQ(attr_find(e.get(), "cn", 0, 0)->count, 1);
   }
+}
+
+TEST(DeleteValues, IgnoresTheCaseOfLettersOfTheFilesCodePage) {
+  set_local_code_page("ISO-8859-1");
+  ASSERT_EQ(initIconvHandle(), 0);
+  const EntryPtr e = make_entry("cn=box", {{"cn", {"\xD6L", "STRASSE"}}});
+  e->local_code_page = true;
+  EXPECT_EQ(delete_values(*e, "cn", {"\xC3\xB6l"}), 0);
+  EXPECT_EQ(delete_values(*e, "cn",
+                          {"stra\xC3\x9F"
+                           "e"}),
+            0);
+  EXPECT_EQ(attr_find(e.get(), "cn", 0, 0), nullptr);
+  set_local_code_page("UTF-8");
+  ASSERT_EQ(initIconvHandle(), 0);
 }
 
 TEST(DeleteValues, TakesTheAttributeWithItsLastValue) {

@@ -7,6 +7,7 @@
 #include <cstring>
 #include <sstream>
 
+#include "cfg/attribute_table.h"
 #include "cfg/owners.h"
 #include "config/default_config.h"
 #include "configuration_file.h"
@@ -301,6 +302,23 @@ TEST_F(SchemaCheck, RefusesAPasswordInANameWith64) {
     EXPECT_EQ(check(e), 64) << dn;
     EXPECT_THAT(messages_.take(), ElementsAre(testing::HasSubstr("'orv-slapdAdminPW' is a "
                                                                  "password")));
+  }
+}
+
+TEST_F(SchemaCheck, DoesNotTellAPasswordThatStandsInAName) {
+  ASSERT_EQ(cfg::register_attribute_types(builtin_schema().attribute_table()), 0);
+  for (const auto& [dn, shown] :
+       {std::pair{"orv-slapdAdminPW=hidden,CN=CONFIGURATION",
+                  "'orv-slapdAdminPW=********,cn=CONFIGURATION'"},
+        {"cn=box,cn=a+2.25.83817390626969804497818767862655265745.1.2=hidden,CN=CONFIGURATION",
+         "'cn=box,cn=a+orv-slapdAdminPW=********,cn=CONFIGURATION'"},
+        {"orv-slapdAdminPW=hidden,,", "'not a DN'"}}) {
+    const EntryPtr e = container();
+    std::free(e->dn);
+    e->dn = strdup(dn);
+    set_values(*e, "objectClass", {"nonsense"});
+    EXPECT_EQ(check(e), 65) << dn;
+    EXPECT_THAT(messages_.take(), ElementsAre(testing::HasSubstr(shown)));
   }
 }
 

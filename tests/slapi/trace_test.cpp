@@ -11,6 +11,7 @@
 #include <thread>
 #include <vector>
 
+#include "cfg/attribute_table.h"
 #include "slapi/schema.h"
 #include "temporary_directory.h"
 
@@ -24,7 +25,7 @@ using testing::Not;
 class Trace : public testing::Test {
  protected:
   void SetUp() override {
-    current_schema();
+    ASSERT_EQ(cfg::register_attribute_types(current_schema().attribute_table()), 0);
     ASSERT_EQ(set_trace_file(directory_.file("trace").c_str()), 0);
   }
   void TearDown() override {
@@ -158,6 +159,58 @@ TEST_F(Trace, AppendsToItsFileAndKeepsItFromOthers) {
   EXPECT_EQ(std::filesystem::status(directory_.file("trace")).permissions() &
                 std::filesystem::perms::mask,
             std::filesystem::perms::owner_read | std::filesystem::perms::owner_write);
+}
+
+// What a record shows of a text.
+class SecretInTrace : public Trace {
+ protected:
+  std::string shown(const std::string& text) {
+    trcEvents = kTraceDebug;
+    const std::string before = written();
+    ldtr_function_local(0x01020100).debug(trace::detail, "entry %s\n", text.c_str());
+    const std::string record = written().substr(before.size());
+    const std::size_t begin = record.find(" entry ") + 7;
+    return record.substr(begin, record.size() - begin - 1);
+  }
+};
+
+TEST_F(SecretInTrace, IsMaskedWhereItStandsInADn) {
+  EXPECT_EQ(shown("orv-slapdAdminPW=secret,O=X"), "orv-slapdAdminPW=********,O=X");
+  EXPECT_EQ(shown("CN=A+ORV-SLAPDMASTERPW=S\\,ECRET\\2C+CN=B"),
+            "CN=A+ORV-SLAPDMASTERPW=********+CN=B");
+  EXPECT_EQ(shown("cn=a,orv-slapdAdminPW = (se) cret"), "cn=a,orv-slapdAdminPW =********");
+  EXPECT_EQ(shown("cn=a,orv-slapdAdminPW=se\ncret"), "cn=a,orv-slapdAdminPW=********");
+  EXPECT_EQ(shown("CN=ORV-SLAPDADMINPW\\3DSECRET\\2CO\\3DX,O=X"),
+            "CN=ORV-SLAPDADMINPW\\3D********,O=X");
+  EXPECT_EQ(shown("cn=cn\\=orv-slapdAdminPW\\\\\\=secret"),
+            "cn=cn\\=orv-slapdAdminPW\\\\\\=********");
+  EXPECT_EQ(shown("orv-slapdAdminPW=,O=X"), "orv-slapdAdminPW=********,O=X");
+}
+
+TEST_F(SecretInTrace, IsMaskedUnderTheNumberOfItsType) {
+  const std::string oid = current_schema().attribute("orv-slapdAdminPW")->oid;
+  EXPECT_EQ(shown(oid + "=secret,o=x"), oid + "=********,o=x");
+}
+
+TEST_F(SecretInTrace, IsMaskedInAFilter) {
+  EXPECT_EQ(shown("(&(orv-slapdAdminPW>=se,cr+et)(cn=a))"),
+            "(&(orv-slapdAdminPW>=********)(cn=a))");
+  EXPECT_EQ(shown("(orv-slapdAdminPW;x-a:dn:2.5.13.5:=secret)"),
+            "(orv-slapdAdminPW;x-a:dn:2.5.13.5:=********)");
+}
+
+TEST_F(SecretInTrace, LeavesEverythingElseAsItIs) {
+  for (const char* text : {"cn=a,o=x", "rc =3 for cn=a.", "=", "a=b=c", "(cn=orv-slapdAdminPW)",
+                           "orv-slapdAdminPW", "\\=", "description=\\3D"})
+    EXPECT_EQ(shown(text), text);
+}
+
+TEST_F(SecretInTrace, IsMaskedWhenTheRecordIsFull) {
+  const std::string text = shown(std::string(8100, ',') +
+                                 "orv-slapdAdminPW=s,orv-slapdAdminPW=s,"
+                                 "orv-slapdAdminPW=s,cn=a");
+  EXPECT_THAT(text, Not(HasSubstr("=s")));
+  EXPECT_THAT(shown("orv-slapdAdminPW=" + std::string(9000, 's')), Not(HasSubstr("ss")));
 }
 
 TEST_F(Trace, GoesToStandardErrorByDefault) {

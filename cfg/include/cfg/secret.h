@@ -5,7 +5,9 @@
 //   {SSHA512}base64  salted SHA-512; also {SSHA384}, {SSHA256}, {SSHA}: can only be verified
 //   {PBKDF2-SHA256}iterations$salt$hash (base64 without padding), also -SHA512: can only be
 //                    verified
-//   {CRYPT}text      as crypt(3) makes it, where the platform has it: can only be verified
+//   {CRYPT}text      as crypt(3) makes it, where the platform has it: can only be verified. Methods
+//                    with a count or size that would take minutes to compute never match
+//   *                matches nothing, not even itself
 //   anything else    the clear text, unless it begins with "{" name "}" of an unknown scheme, which
 //                    never matches
 //
@@ -16,6 +18,7 @@
 #pragma once
 
 #include <cstddef>
+#include <cstdint>
 #include <memory>
 #include <string>
 #include <string_view>
@@ -57,6 +60,11 @@ OpenResult open_secret(const Key* key, std::string_view stored, std::string& cle
 // a sealed value that belongs elsewhere, a missing key.
 bool verify_secret(const Key* key, SecretPlace place, std::string_view stored,
                    std::string_view clear) noexcept;
+
+// What a verification against a stored value costs, in iterations of a hash function, roughly. 0
+// for all that costs next to nothing, and for what is never computed: counts and sizes that would
+// take minutes, or most of the memory, match nothing.
+std::uint64_t verification_cost(std::string_view stored) noexcept;
 
 // Spends the time of a verification on nothing, for identities that do not exist.
 void verify_nothing(std::string_view clear) noexcept;

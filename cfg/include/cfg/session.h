@@ -140,9 +140,11 @@ void cfg_perror(_CFG* session, const char* text);
 // Changes.
 //
 // A change that returned 0 survives a power failure. At every instant the file is the old version
-// or the new one, whole; after any other answer it is the old one. Only the lines of the entry that
-// is meant change: every other byte of the file stays as it was. The version before the change
-// becomes the save file (option 1006), and permissions, access list, owner and group are kept.
+// or the new one, whole; after any other answer it is the old one. (Only when the disk fails in the
+// last step, and again while the change is taken back, the answer is its failure and the new one
+// may stay; the diagnostics stream tells.) Only the lines of the entry that is meant change: every
+// other byte of the file stays as it was. The version before the change becomes the save file
+// (option 1006), and permissions, access list, owner and group are kept.
 //
 // Writers exclude each other by an advisory lock on a file beside the configuration file (its name
 // with ".lock" added, which stays there). A file that somebody edited or replaced since this
@@ -182,10 +184,14 @@ int cfg_delete_s(_CFG* session, const char* dn);
 // attribute, or at the end of the entry. Values are compared by the type's equality rule. A
 // password is given in clear and protected as in cfg_add_s; to delete one, its clear text will do,
 // or the text that is stored. A replace keeps values that are there byte for byte, protected ones
-// too. 0, also for a null or empty list and when nothing changes, without writing; 9 the entry is
-// missing; 16 a value or an attribute to delete is; 20 a value to add exists, or is given twice; 2
-// add without values, or an unknown code; 17, 19 and 21 as in cfg_add_s; 65 no attribute would be
-// left.
+// too, but protects a password that stands there in clear. 0, also for a null or empty list and
+// when nothing changes, without writing; 9 the entry is missing; 16 a value or an attribute to
+// delete is; 20 a value to add exists, or is given twice; 2 add without values, or an unknown code;
+// 17, 19 and 21 as in cfg_add_s; 65 no attribute would be left.
 int cfg_modify_s(_CFG* session, const char* dn, ldapmod** mods);
+
+// How many calls of the three above this thread has had answered with 0. Whoever stands behind
+// somebody who makes changes can tell by it whether a success that is reported was one.
+unsigned long cfg_changes_made();
 
 }  // namespace orv

@@ -45,6 +45,8 @@ inline constexpr SettingRange kSettingRanges[] = {
     {"orv-slapdMessageTimeOut", 1, setting_bounds::seconds},
     {"orv-slapdMaxPersistentSearches", 0, setting_bounds::count},
     {"orv-slapdMaxPersistentSearchesPerConnection", 1, setting_bounds::count},
+    // A client must be able to fail now and then whatever it sends.
+    {"orv-slapdMaxFailedChangeSize", 65536, setting_bounds::bytes / 4},
     {"pwdMinLength", 0, setting_bounds::policy_length},
     {"passwordMinAlphaChars", 0, setting_bounds::policy_length},
     {"passwordMinOtherChars", 0, setting_bounds::policy_length},

@@ -2,64 +2,27 @@
 
 #include <algorithm>
 #include <ctime>
-#include <vector>
+#include <new>
+#include <utility>
 
-#include "cfg/dn.h"
 #include "cfg/ldif.h"
+#include "cfg/masked_dn.h"
 #include "cfg/result_codes.h"
 
 namespace orv::server {
 namespace {
 
-constexpr std::string_view kMask = "********";
 constexpr std::string_view kDnSyntax = "1.3.6.1.4.1.1466.115.121.1.12";
 
 const SchemaAttribute* find_type(const Schema& schema, std::string_view description) {
   return schema.attribute(description.substr(0, description.find(';')));
 }
 
-bool is_secret(const Schema& schema, const cfg::Ava& part) {
-  const SchemaAttribute* const type = find_type(schema, part.type);
-  return type && type->secret;
-}
-
-bool holds_secret(const Schema& schema, const cfg::Dn& dn) {
-  return std::any_of(dn.begin(), dn.end(), [&](const cfg::Rdn& rdn) {
-    return std::any_of(rdn.begin(), rdn.end(),
-                       [&](const cfg::Ava& part) { return is_secret(schema, part); });
-  });
-}
-
-// A value as it may stand in a DN: everything that might mean something there as \XX.
-void append_rdn_value(std::string& out, std::string_view value) {
-  constexpr char kHex[] = "0123456789ABCDEF";
-  for (const char c : value) {
-    const bool plain = (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') ||
-                       c == '-' || c == '.' || c == '_' || c == '@' || c == '/' || c == ':';
-    if (plain) {
-      out += c;
-      continue;
-    }
-    const auto byte = static_cast<unsigned char>(c);
-    out += {'\\', kHex[byte >> 4], kHex[byte & 15]};
-  }
-}
-
-std::string rewritten(const Schema& schema, const cfg::Dn& dn) {
-  std::string text;
-  for (const cfg::Rdn& rdn : dn) {
-    for (const cfg::Ava& part : rdn) {
-      if (&part != &rdn.front()) text += '+';
-      text += part.type;
-      text += '=';
-      if (is_secret(schema, part))
-        text += kMask;
-      else
-        append_rdn_value(text, part.value);
-    }
-    if (&rdn != &dn.back()) text += ',';
-  }
-  return text;
+// False when `dn` is no DN; `shown` is then unchanged.
+bool mask_dn(std::string_view dn, std::string& shown) {
+  const int code = cfg::mask_dn(dn, shown);
+  if (code == result::no_memory) throw std::bad_alloc();
+  return code == result::success;
 }
 
 // Writes the lines of a change, up to a bound.
@@ -69,13 +32,19 @@ class ChangeText {
       : schema_(schema), most_(detail == AuditDetail::whole ? std::string::npos : kBriefBytes) {}
 
   void target(std::string_view dn, std::string_view change_type) {
+    name("dn", "# target", dn);
+    line("changetype", change_type);
+  }
+
+  // A line whose value is a DN. One that is not shown is empty, and a comment says why.
+  void name(std::string_view field, std::string_view comment, std::string_view dn) {
+    const bool cut = most_ != std::string::npos && dn.size() > most_ - std::min(most_, out_.size());
     std::string shown;
-    if (dn.size() > most_ || !mask_dn(schema_, dn, shown)) {
-      line("# target", dn.size() > most_ ? "cut, too long" : "not a DN");
+    if (cut || !mask_dn(dn, shown)) {
+      line(comment, cut ? "cut, too long" : "not a DN");
       shown.clear();
     }
-    line("dn", shown);
-    line("changetype", change_type);
+    line(field, shown);
   }
 
   void values(const Attribute& attribute) {
@@ -86,39 +55,56 @@ class ChangeText {
   void line(std::string_view name, std::string_view text) {
     cfg::append_ldif_line(out_, name, text);
   }
-  void end_of_modification() { out_ += "-\n"; }
-
-  // Whether something more may be written; what may not is counted.
-  bool room_for(std::size_t bytes) {
-    if (most_ == std::string::npos || (out_.size() < most_ && bytes < most_ - out_.size()))
-      return true;
-    ++left_out_;
-    return false;
+  // What is left out is said where it was: a delete without values would be one of all of them.
+  void end_of_modification() {
+    say_what_was_cut();
+    out_ += "-\n";
   }
 
+  bool has_room_for(std::size_t bytes) const {
+    return most_ == std::string::npos || (out_.size() < most_ && bytes < most_ - out_.size());
+  }
+  void leave_out_modification() { ++modifications_left_out_; }
+
   std::string take() {
-    if (left_out_ > 0) line("# cut", std::to_string(left_out_) + " values are not shown");
+    say_what_was_cut();
+    if (modifications_left_out_ > 0)
+      line("# cut", std::to_string(modifications_left_out_) + " modifications are not shown");
     return std::move(out_);
   }
 
  private:
   void value(const std::string& name, const SchemaAttribute* type, std::string_view value) {
     if (!type || type->secret) {
-      if (room_for(name.size())) line(name, kMask);
+      if (room_for(name.size())) line(name, cfg::kMask);
       return;
     }
     if (!room_for(name.size() + value.size())) return;
     // Any value may be a DN, whatever the syntax of its type; one that should be and is not, is not
     // looked into.
     std::string shown(value);
-    const bool is_dn = mask_dn(schema_, value, shown);
-    line(name, is_dn || type->syntax != kDnSyntax ? std::string_view(shown) : kMask);
+    if (!mask_dn(value, shown) && (type->syntax == kDnSyntax || cfg::find_secret(value, 0)))
+      shown = cfg::kMask;
+    line(name, shown);
+  }
+
+  void say_what_was_cut() {
+    if (left_out_ == 0) return;
+    line("# cut", std::to_string(std::exchange(left_out_, 0)) + " values are not shown");
+  }
+
+  // What there is no room for is counted.
+  bool room_for(std::size_t bytes) {
+    const bool room = has_room_for(bytes);
+    if (!room) ++left_out_;
+    return room;
   }
 
   const Schema& schema_;
   const std::size_t most_;
   std::string out_;
-  std::size_t left_out_ = 0;
+  std::size_t left_out_ = 0;  // values
+  std::size_t modifications_left_out_ = 0;
 };
 
 std::string_view modification_name(int operation) {
@@ -142,13 +128,6 @@ void append_time(std::string& out, std::chrono::system_clock::time_point when) {
 
 }  // namespace
 
-bool mask_dn(const Schema& schema, std::string_view dn, std::string& shown) {
-  cfg::Dn parsed;
-  if (cfg::parse_dn(dn, parsed) != result::success) return false;
-  shown = holds_secret(schema, parsed) ? rewritten(schema, parsed) : std::string(dn);
-  return true;
-}
-
 std::string describe_change(const Schema& schema, const AddRequest& request, AuditDetail detail) {
   ChangeText text(schema, detail);
   text.target(request.dn, "add");
@@ -168,11 +147,24 @@ std::string describe_change(const Schema& schema, const ModifyRequest& request,
   ChangeText text(schema, detail);
   text.target(request.dn, "modify");
   for (const Modification& modification : request.modifications) {
-    if (!text.room_for(modification.attribute.type.size())) continue;
+    if (!text.has_room_for(modification.attribute.type.size())) {
+      text.leave_out_modification();
+      continue;
+    }
     text.line(modification_name(modification.operation), modification.attribute.type);
     text.values(modification.attribute);
     text.end_of_modification();
   }
+  return text.take();
+}
+
+std::string describe_change(const Schema& schema, const ModifyDnRequest& request,
+                            AuditDetail detail) {
+  ChangeText text(schema, detail);
+  text.target(request.dn, "modrdn");
+  text.name("newrdn", "# newrdn", request.new_rdn);
+  text.line("deleteoldrdn", request.delete_old_rdn ? "1" : "0");
+  if (request.new_superior) text.name("newsuperior", "# newsuperior", *request.new_superior);
   return text.take();
 }
 

@@ -38,6 +38,8 @@ inline constexpr std::size_t kBriefBytes = 4096;
 std::string describe_change(const Schema& schema, const AddRequest& request, AuditDetail detail);
 std::string describe_change(const Schema& schema, const DeleteRequest& request, AuditDetail detail);
 std::string describe_change(const Schema& schema, const ModifyRequest& request, AuditDetail detail);
+std::string describe_change(const Schema& schema, const ModifyDnRequest& request,
+                            AuditDetail detail);
 
 struct AuditFacts {
   std::chrono::system_clock::time_point time;  // of the result
@@ -52,9 +54,5 @@ inline constexpr int kNotPerformed = -1;
 
 // The whole record with the blank line that ends it.
 std::string audit_record(const AuditFacts& facts, std::string_view change);
-
-// A DN with the values of secret types replaced. False when `dn` is none; `shown` is then
-// unchanged.
-bool mask_dn(const Schema& schema, std::string_view dn, std::string& shown);
 
 }  // namespace orv::server

@@ -3,7 +3,6 @@
 #include <openssl/evp.h>
 
 #include <algorithm>
-#include <charconv>
 #include <new>
 #include <unordered_map>
 #include <utility>
@@ -11,7 +10,6 @@
 #include "auth/identity_reader.h"
 #include "cfg/dn.h"
 #include "cfg/result_codes.h"
-#include "cfg/text.h"
 #include "slapi/codepage.h"
 #include "slapi/owners.h"
 
@@ -45,23 +43,6 @@ class Secret {
   Secret& operator=(const Secret&) = delete;
   std::string text;
 };
-
-// ---- What a verification costs
-
-// Iterations of a stored password that is hashed with many; 0 for all others, which cost nothing
-// beside it, and for numbers beyond those that are computed at all.
-std::uint64_t cost_of(std::string_view stored) noexcept {
-  constexpr std::uint64_t kMost = 10'000'000;
-  constexpr std::string_view kSchemes[] = {"{PBKDF2-SHA256}", "{PBKDF2-SHA512}"};
-  for (const std::string_view scheme : kSchemes) {
-    if (!cfg::equals_ignore_ascii_case(stored.substr(0, scheme.size()), scheme)) continue;
-    const std::string_view count = stored.substr(scheme.size(), stored.find('$') - scheme.size());
-    std::uint64_t iterations = 0;
-    std::from_chars(count.data(), count.data() + count.size(), iterations);
-    return iterations <= kMost ? iterations : 0;
-  }
-  return 0;
-}
 
 void digest_password(IdentityRecord& record) {
   const std::string& stored = record.stored_password;
@@ -103,7 +84,7 @@ struct Identities::Data {
 
   void remember_cost(const IdentityRecord& record) {
     if (record.stored_password.empty()) return;
-    const std::uint64_t cost = cost_of(record.stored_password);
+    const std::uint64_t cost = cfg::verification_cost(record.stored_password);
     if (costliest != nullptr && cost <= highest_cost) return;
     costliest = &record;
     highest_cost = cost;
@@ -130,7 +111,8 @@ struct Identities::Data {
     const bool possible = to_file_form(password, form.text);
     const IdentityRecord* record = possible ? find(name) : nullptr;
     if (record != nullptr && proves(*record, form.text, verify)) return &record->identity;
-    if (record == nullptr || (highest_cost > 0 && cost_of(record->stored_password) == 0)) {
+    if (record == nullptr ||
+        (highest_cost > 0 && cfg::verification_cost(record->stored_password) == 0)) {
       spend_highest_cost(password, verify);
     }
     return nullptr;

@@ -15,6 +15,7 @@
 #pragma once
 
 #include <array>
+#include <chrono>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -54,7 +55,7 @@ class Identities {
   // The identity that `name` (any spelling) and `password` prove; null when they prove none. So
   // that time does not tell which names exist, an unknown name takes the work of the costliest
   // password of all, and a wrong password takes it too where its own is cheap. Only passwords
-  // hashed with different numbers of iterations can be told apart. Throws std::bad_alloc: want of
+  // that are hashed at different expense can be told apart. Throws std::bad_alloc: want of
   // memory is no wrong password.
   const Identity* authenticate(std::string_view name, std::string_view password,
                                Verify verify = cfg::verify_secret) const;
@@ -84,18 +85,29 @@ using IdentityReport =
 
 // The current snapshot. It is read again when the configuration file is not the file it was read
 // from any more (device, inode, size, times), and on reload(); when that fails the last good one
-// stays.
+// stays, and it is read again after a pause: what was in the way may have passed (memory, open
+// files, the disk), and somebody may have lost rights meanwhile.
 class IdentityStore {
  public:
-  // `report` (may be empty) is told what current() finds, once for each state of the files.
-  IdentityStore(std::string config_file, std::string key_stash_file, IdentityReport report = {});
+  using Clock = std::chrono::steady_clock;
+
+  // Between two attempts on the same files, each pause twice the one before.
+  static constexpr std::chrono::seconds kFirstPause{1};
+  static constexpr std::chrono::seconds kLongestPause{60};
+
+  // `report` (may be empty) is told what current() finds, once for each state of the files and
+  // cause. `follow` (may be empty) takes over what else goes by the same entries, after each
+  // successful reading and before anybody is served by it; false when that failed, and is then
+  // tried again as a reading is. One at a time; must not throw.
+  IdentityStore(std::string config_file, std::string key_stash_file, IdentityReport report = {},
+                std::function<bool()> follow = {});
   ~IdentityStore();
 
   // Reads anew whatever the file's times say. False (with the cause) when the last good one stays.
   bool reload(std::string& error, std::vector<std::string>& warnings) noexcept;
 
   // Never null after the first successful reload.
-  std::shared_ptr<const Identities> current() noexcept;
+  std::shared_ptr<const Identities> current(Clock::time_point now = Clock::now()) noexcept;
 
   // The same without looking at the files, and how often they were read with success. Never block.
   std::shared_ptr<const Identities> latest() const noexcept;

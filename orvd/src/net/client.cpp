@@ -150,19 +150,30 @@ void Client::make_room() {
     if (in_.size() > kReadBytes) std::vector<char>(kReadBytes).swap(in_);
   }
   if (end_ < in_.size()) return;
+  // What moves leaves no password behind.
   if (begin_ > 0) {
-    std::memmove(in_.data(), in_.data() + begin_, end_ - begin_);
-    end_ -= begin_;
+    const std::size_t end = std::exchange(end_, end_ - begin_);
+    std::memmove(in_.data(), in_.data() + begin_, end_);
+    cfg::wipe(in_.data() + end_, end - end_);
     begin_ = 0;
   } else {
-    in_.resize(in_.size() * 2);
+    std::vector<char> larger(in_.size() * 2);
+    std::copy(in_.begin(), in_.end(), larger.begin());
+    in_.swap(larger);
+    cfg::wipe(larger.data(), larger.size());
   }
+}
+
+// Gives up what has been read and not handled.
+void Client::forget_input() {
+  cfg::wipe(in_.data(), end_);
+  begin_ = end_ = 0;
 }
 
 void Client::received(std::size_t length) {
   if (state_ == State::parting) {
-    begin_ = end_ = 0;
-    return;
+    end_ += length;
+    return forget_input();
   }
   if (begin_ == end_) message_begun_ = Clock::now();
   end_ += length;
@@ -364,7 +375,7 @@ void Client::disconnect(int code, std::string_view text) {
   client_left();
   if (state_ == State::closed) return;
   flush();
-  begin_ = end_ = 0;
+  forget_input();
   if (!processing_) watch();
 }
 

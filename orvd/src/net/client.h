@@ -71,6 +71,7 @@ class Client final : public Session {
   bool process_one();
   void make_room();
   void consume(std::size_t length);
+  void forget_input();
   std::string_view unread() const noexcept { return {in_.data() + begin_, end_ - begin_}; }
   std::shared_ptr<Client> self() { return std::static_pointer_cast<Client>(shared_from_this()); }
 

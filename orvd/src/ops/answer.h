@@ -40,6 +40,13 @@ class Answer {
   // A result with what only some responses carry.
   void result(const ResultAnswer& answer) noexcept;
 
+  // Takes back the result of an operation that has no entries: it was not true.
+  void retract() noexcept {
+    bytes_.clear();
+    answered_ = false;
+    code_ = 0;
+  }
+
   // The answer is part of a persistent search: a successful result is not sent, since more is to
   // come. Without `entries` no entry is sent either.
   void keep_open(bool entries) noexcept {

@@ -7,6 +7,7 @@
 #include <utility>
 
 #include "cfg/dn.h"
+#include "cfg/masked_dn.h"
 #include "cfg/result_codes.h"
 #include "cfg/secret.h"
 #include "cfg/text.h"
@@ -18,6 +19,7 @@ namespace orv::server {
 namespace {
 
 constexpr std::string_view kObjectClass = "objectClass";
+constexpr std::string_view kDnSyntax = "1.3.6.1.4.1.1466.115.121.1.12";
 constexpr std::string_view kTargetNotADn = "the target is not a DN";
 
 Refusal refuse(int code, std::string_view what, std::string_view name = "") {
@@ -144,10 +146,17 @@ void* checked(void* memory) {
   return memory;
 }
 
+// There may be passwords among the values.
+void wipe_and_free(char* text) noexcept {
+  if (!text) return;
+  cfg::wipe(text, std::strlen(text));
+  std::free(text);
+}
+
 void free_values(berval** values) noexcept {
   if (!values) return;
   for (berval** value = values; *value; ++value) {
-    std::free((*value)->bv_val);
+    wipe_and_free((*value)->bv_val);
     std::free(*value);
   }
   std::free(values);
@@ -305,12 +314,6 @@ bool hidden_from_members(const Schema& schema, std::string_view attribute) {
   return type == "orv-slapdAdminDN" || type == "orv-slapdAdminGroupEnabled";
 }
 
-bool secret(const Schema& schema, std::string_view attribute) {
-  if (attribute.empty()) return true;
-  const SchemaAttribute* const found = schema.attribute(attribute);
-  return found && found->secret;
-}
-
 int hex_digit(char c) noexcept {
   if (c >= '0' && c <= '9') return c - '0';
   if (c >= 'a' && c <= 'f') return c - 'a' + 10;
@@ -348,15 +351,33 @@ void append_evaluated(const Schema& schema, std::string_view item, const FilterI
   }
 }
 
-void rewrite_item(const Schema& schema, std::string_view item, FilterUse use, std::string& out) {
+// Whether a log may show the value of an assertion: not what may be a password, under a name that
+// nobody knows, or within a DN. What should be a DN and is not, is not looked into; nor is a value
+// that was cut off.
+bool may_be_shown(const Schema& schema, const FilterItem& parts, bool whole) {
+  const SchemaAttribute* const type = schema.attribute(parts.attribute);
+  if (!type || type->secret || !whole) return false;
+  const bool should_be_dn = type->syntax == kDnSyntax;
+  if (!should_be_dn && parts.value.find_first_of("=\\%") == std::string_view::npos) return true;
+  const std::string value = unescaped(parts.value);
+  std::string shown;
+  const int code = cfg::mask_dn(value, shown);
+  if (code == result::no_memory) throw std::bad_alloc();
+  if (code == result::success) return shown == value;
+  return !should_be_dn && !cfg::find_secret(value, 0);
+}
+
+void rewrite_item(const Schema& schema, std::string_view item, FilterUse use, bool whole,
+                  std::string& out) {
   const FilterItem parts = split_item(item);
   const bool presence =
       parts.value == "*" && parts.before_value.size() == parts.attribute.size() + 1;
   if (presence) {
     out += item;
   } else if (use == FilterUse::show) {
-    out += secret(schema, parts.attribute) ? parts.before_value : item;
-    if (secret(schema, parts.attribute)) out += "***";
+    const bool shown = may_be_shown(schema, parts, whole);
+    out += shown ? item : parts.before_value;
+    if (!shown) out += "***";
   } else if (use == FilterUse::evaluate_for_administrators &&
              hidden_from_members(schema, parts.attribute)) {
     // No value assertion on a password is ever true or false.
@@ -451,7 +472,7 @@ std::string rewrite_filter(const Schema& schema, std::string_view filter, Filter
     if (!opens_item) continue;
     // Parentheses inside values are escaped, so the next one closes the item.
     const std::size_t end = std::min(filter.find(')', at), filter.size());
-    rewrite_item(schema, filter.substr(at, end - at), use, out);
+    rewrite_item(schema, filter.substr(at, end - at), use, end < filter.size(), out);
     at = end;
   }
   return out;

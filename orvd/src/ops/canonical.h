@@ -65,7 +65,7 @@ Refusal check_target_code_page(std::string_view normal_dn);
 enum class FilterUse {
   evaluate,                     // by somebody who sees everything
   evaluate_for_administrators,  // hidden from everybody but the primary administrator: Undefined
-  show,                         // values of secret attributes are replaced by asterisks
+  show,                         // for a log: values that may be secret are replaced by asterisks
 };
 
 // Rewrites the items of a filter (in the decoder's text form), item by item, leaving presence

@@ -16,6 +16,7 @@ namespace orv::server {
 namespace {
 
 constexpr std::string_view kObjectClass = "objectClass";
+constexpr std::string_view kRole = "orv-slapdAdminRole";
 
 constexpr std::string_view kTwice = "the same value twice";
 constexpr std::string_view kIsThere = "a value is added that is there already";
@@ -24,6 +25,8 @@ constexpr std::string_view kAddedAndDeleted =
     "one request cannot both add and delete the same value";
 constexpr std::string_view kLateReplace =
     "one request cannot add or delete values and then replace or delete all of them";
+constexpr std::string_view kRolesAlone =
+    "one request cannot delete roles and then delete or replace values of other attributes";
 constexpr std::string_view kClasses = "only auxiliary object classes can be added or deleted";
 constexpr std::string_view kName = "a value of the entry's name cannot be taken away";
 
@@ -106,6 +109,10 @@ class TypeFold {
     return adds ? add_to_known(change) : delete_from_known(change);
   }
 
+  std::string_view type() const noexcept { return type_; }
+  bool deletes_values() const noexcept { return known_ == Known::nothing && !deleted_.empty(); }
+  bool takes_away() const noexcept { return known_ != Known::nothing || !deleted_.empty(); }
+
   void hand_over(TypeChanges& folded) const {
     if (known_ == Known::emptied) {
       folded.push_back({kModDelete, type_, {}});
@@ -182,6 +189,19 @@ class TypeFold {
   ValueSet deleted_;  // only where they are not
 };
 
+using TypeFolds = std::vector<std::unique_ptr<TypeFold>>;
+
+// The rule on roles counts the values that are deleted and looks for the last one only. That all of
+// them are the member's is found by the trial on a copy, which forgets a failure at the next delete
+// or replace that succeeds: together the two would take all roles away for a list that must fail.
+bool loses_count_of_roles(const TypeFolds& folds) {
+  const auto roles = std::find_if(folds.begin(), folds.end(), [](const auto& fold) {
+    return fold->type() == kRole && fold->deletes_values();
+  });
+  return roles != folds.end() &&
+         std::any_of(roles + 1, folds.end(), [](const auto& fold) { return fold->takes_away(); });
+}
+
 // ---- names
 
 // Names ignore the case of letters whatever the type's own equality says.
@@ -206,7 +226,7 @@ bool takes_away(const TypeChange& change, const std::string& key) {
 }  // namespace
 
 Refusal fold_changes(const Schema& schema, const TypeChanges& given, TypeChanges& folded) {
-  std::vector<std::unique_ptr<TypeFold>> folds;
+  TypeFolds folds;
   std::unordered_map<std::string_view, TypeFold*> by_type;
   for (const TypeChange& change : given) {
     TypeFold*& fold = by_type[change.type];
@@ -216,6 +236,7 @@ Refusal fold_changes(const Schema& schema, const TypeChanges& given, TypeChanges
     }
     if (Refusal refusal = fold->take(change)) return refusal;
   }
+  if (loses_count_of_roles(folds)) return refuse(result::unwilling_to_perform, kRolesAlone, kRole);
   folded.reserve(2 * folds.size());  // what moves leaves passwords behind
   for (const auto& fold : folds) fold->hand_over(folded);
   return {};

@@ -14,6 +14,8 @@
 //   values added or deleted, and then all          refused with 53: whether the first part would
 //     deleted or replaced                            have succeeded would be forgotten
 //   a value added that is deleted, or the reverse  refused with 53
+//   roles deleted one by one, and other types      refused with 53: the rule on roles counts, and
+//     deleted or replaced behind them                would not see that they are not the member's
 //
 // What an entry holds after a folded list is what it would hold after the client's own, and a list
 // that would have failed fails. There is one exception: a delete of all with others behind it no

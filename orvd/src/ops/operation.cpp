@@ -1,6 +1,7 @@
 #include "ops/operation.h"
 
 #include <algorithm>
+#include <cstring>
 #include <new>
 #include <optional>
 #include <utility>
@@ -8,7 +9,9 @@
 #include "cfg/dn.h"
 #include "cfg/result_codes.h"
 #include "ops/guards.h"
+#include "ops/log_text.h"
 #include "slapi/administrators.h"
+#include "slapi/reserves.h"
 
 namespace orv::server {
 namespace {
@@ -27,6 +30,20 @@ ListForm list_form(unsigned flags, std::string_view normal_dn) noexcept {
   const bool member = (flags & authority::group_member) != 0;
   return member && cfg::normal_dn_is_at_or_below(normal_dn, kGroup) ? ListForm::as_sent
                                                                     : ListForm::folded;
+}
+
+// What the copy of a list takes that the backend makes: its blocks, with what the allocator adds.
+std::int64_t cost_of_list(const ldapmod* first) noexcept {
+  constexpr std::size_t kList = 256;
+  constexpr std::size_t kRecord = 160;
+  constexpr std::size_t kValue = 96;
+  std::size_t bytes = kList;
+  for (; first; first = first->mod_next) {
+    bytes += kRecord + std::strlen(first->mod_type);
+    for (berval** value = first->mod_vals.modv_bvals; value && *value; ++value)
+      bytes += kValue + (*value)->bv_len;
+  }
+  return static_cast<std::int64_t>(bytes);
 }
 
 }  // namespace
@@ -89,8 +106,8 @@ Refusal PendingOperation::prepare_search(Services& services, SearchRequest& requ
   return {};
 }
 
-Refusal PendingOperation::prepare_add(Services& services, const AddRequest& request,
-                                      std::string_view normal_dn) {
+Refusal PendingOperation::prepare(Services& services, const AddRequest& request,
+                                  std::string_view normal_dn) {
   begin(services, parameter::add_function, normal_dn);
   if (Refusal refusal = make_entry(services.schema, request, entry_)) return refusal;
   if (services.guards)
@@ -102,20 +119,22 @@ Refusal PendingOperation::prepare_add(Services& services, const AddRequest& requ
   return {};
 }
 
-Refusal PendingOperation::prepare_delete(Services& services, std::string_view normal_dn) {
+Refusal PendingOperation::prepare(Services& services, const DeleteRequest& /*request*/,
+                                  std::string_view normal_dn) {
   begin(services, parameter::delete_function, normal_dn);
   if (Refusal refusal = check_target_code_page(normal_dn)) return refusal;
   if (!services.guards) return {};
   return guarded(GuardedChange::remove, normal_dn, operation_.authority, nullptr);
 }
 
-Refusal PendingOperation::prepare_modify(Services& services, const ModifyRequest& request,
-                                         std::string_view normal_dn) {
+Refusal PendingOperation::prepare(Services& services, const ModifyRequest& request,
+                                  std::string_view normal_dn) {
   begin(services, parameter::modify_function, normal_dn);
   if (Refusal refusal = check_target_code_page(normal_dn)) return refusal;
   ldapmod* first = nullptr;
   const ListForm form = list_form(operation_.authority, normal_dn);
   if (Refusal refusal = make_modifications(services.schema, request, form, first)) return refusal;
+  cost_of_failure_ = cost_of_list(first);
   // From here the block holds the list: the handler clears the parameter when it released it.
   if (!set(parameter::modifications, first)) {
     free_modifications(first);
@@ -146,15 +165,43 @@ bool PendingOperation::rights_hold(const Services& services) noexcept {
   return false;
 }
 
+// A modify waits while those of its client that failed have cost too much.
+bool PendingOperation::may_fail(Services& services) noexcept {
+  if (cost_of_failure_ == 0) return true;
+  const Clock::time_point now = Clock::now();
+  if (!home_->failed_changes().used_up(share_of_connection(failure_limit), now) &&
+      !services.failed_changes.used_up(bound_dn(), failure_limit, now))
+    return true;
+  constexpr std::string_view kReason = "too many modifications failed, try again later";
+  answer_.result(result::busy, "", kReason);
+  try {
+    std::string line = "modify by ";
+    append_client_text(line, bound_dn());
+    line += " refused with 51: ";
+    line += kReason;
+    services.logs.warning(line);
+  } catch (...) {
+    // Without memory the line is lost.
+  }
+  return false;
+}
+
+bool PendingOperation::has_reserves() noexcept {
+  if (!is_change() || fill_reserves()) return true;
+  answer_.result(result::no_memory, "", "");
+  return false;
+}
+
 // Inside the gate: the next operation must find the identities as this one left them.
 void PendingOperation::take_over(Services& services, int code) noexcept {
-  if (code != result::success) return;
+  const bool made = code == result::success;
   const Consequences consequences =
       handler_ == parameter::add_function
           ? consequences_
           : consequences_of_change(changed_dn_, services.authenticator);
-  settings_changed_ = consequences.settings;
-  if (services.take_over && consequences.any()) services.take_over(consequences);
+  settings_changed_ = made && consequences.settings;
+  if (!services.take_over || (made && !consequences.any())) return;
+  if (services.take_over(consequences, made)) settings_changed_ = consequences.settings;
 }
 
 void PendingOperation::renew_settings(Services& services) noexcept {
@@ -185,22 +232,54 @@ PersistentSearches::Audience PendingOperation::changed(Services& services, int c
                                                EntryPtr(before));
 }
 
+// Whether a change was made that the handler reports as made.
+bool PendingOperation::was_made(const Services& services,
+                                unsigned long made_before) const noexcept {
+  return !is_change() || !services.changes_made || services.changes_made() != made_before;
+}
+
+// Calls the handler and sees to the result.
+int PendingOperation::call(Services& services) noexcept {
+  const unsigned long made_before = services.changes_made ? services.changes_made() : 0;
+  int code = services.backend.call_keeping_gate(handler_, parameters_.get(), home_->connection(),
+                                                is_change());
+  // Where memory runs out at one place, handlers take it that nothing was to be written.
+  if (code == result::success && !was_made(services, made_before)) {
+    code = result::no_memory;
+    answer_.retract();
+    services.logs.error("a change was reported as made that was not, for want of memory");
+  }
+  if (!answer_.answered()) answer_.result(code != 0 ? code : result::other, "", "");
+  returned_ = code;
+  return code;
+}
+
+// What follows a change, whatever became of it.
+void PendingOperation::settle_change(Services& services, int code) noexcept {
+  settle_password_changes(code == result::success);
+  if (code != result::success && cost_of_failure_ != 0) {
+    const Clock::time_point now = Clock::now();
+    home_->failed_changes().charge(cost_of_failure_, share_of_connection(failure_limit), now);
+    services.failed_changes.charge(bound_dn(), cost_of_failure_, failure_limit, now);
+  }
+  take_over(services, code);
+}
+
 void PendingOperation::run(Services& services, bool on_home_thread) noexcept {
   PersistentSearches::Audience audience;
-  if (!answer_.abandoned() && rights_hold(services) && take_budget(services)) {
+  if (!answer_.abandoned() && rights_hold(services) && take_budget(services) &&
+      may_fail(services) && has_reserves()) {
     on_home_thread_ = on_home_thread;
     next_look_ = Clock::now() + kLookInterval;
-    const bool search = handler_ == parameter::search_function;
     std::optional<cfg::InterruptScope> scope;
-    if (search) scope.emplace(&PendingOperation::interrupted, this);
-    const int code = services.backend.call_keeping_gate(handler_, parameters_.get(),
-                                                        home_->connection(), !search);
-    returned_ = code;
-    if (!answer_.answered()) answer_.result(code != 0 ? code : result::other, "", "");
-    if (search) learn_cost(services, code);
-    if (!search) settle_password_changes(code == result::success);
-    if (!search) take_over(services, code);
-    if (!search) audience = changed(services, code);
+    if (!is_change()) scope.emplace(&PendingOperation::interrupted, this);
+    const int code = call(services);
+    if (is_change()) {
+      settle_change(services, code);
+      audience = changed(services, code);
+    } else {
+      learn_cost(services, code);
+    }
     // A search that could not join would miss changes.
     if (persistent && !notice_of && answer_.code() == result::success &&
         !services.persistent_searches.join(persistent))

@@ -39,6 +39,9 @@ class OperationHome {
 
   // What the client has not read yet.
   virtual OutputShare& output() noexcept = 0;
+
+  // What its changes that failed have cost. Only from inside the gate.
+  virtual FailedChanges& failed_changes() noexcept = 0;
 };
 
 // What is to be done next with an operation that comes back to its connection's thread.
@@ -59,10 +62,9 @@ class PendingOperation final : public GateWaiter,
 
   // Take over a request. A refusal leaves the operation to be answered with it.
   Refusal prepare_search(Services& services, SearchRequest& request, std::string_view normal_dn);
-  Refusal prepare_add(Services& services, const AddRequest& request, std::string_view normal_dn);
-  Refusal prepare_delete(Services& services, std::string_view normal_dn);
-  Refusal prepare_modify(Services& services, const ModifyRequest& request,
-                         std::string_view normal_dn);
+  Refusal prepare(Services& services, const AddRequest& request, std::string_view normal_dn);
+  Refusal prepare(Services& services, const DeleteRequest& request, std::string_view normal_dn);
+  Refusal prepare(Services& services, const ModifyRequest& request, std::string_view normal_dn);
 
   // Calls the handler and makes sure that there is a result. The caller holds the gate, which is
   // open or passed on afterwards. `on_home_thread`: the connection's thread runs it.
@@ -92,6 +94,9 @@ class PendingOperation final : public GateWaiter,
   // Which reading of the identities the bound one was good by.
   std::uint64_t identity_generation = 0;
 
+  // The limit of what changes that fail may cost, in bytes.
+  std::int64_t failure_limit = 0;
+
   std::string log_text;  // what the access log says of the request; empty when it is off
 
   std::string audit_text;            // what the audit log says of the request,
@@ -120,6 +125,11 @@ class PendingOperation final : public GateWaiter,
   bool must_stop() noexcept;
   bool take_budget(const Services& services) noexcept;
   bool rights_hold(const Services& services) noexcept;
+  bool may_fail(Services& services) noexcept;
+  bool has_reserves() noexcept;
+  int call(Services& services) noexcept;
+  bool was_made(const Services& services, unsigned long made_before) const noexcept;
+  void settle_change(Services& services, int code) noexcept;
   void take_over(Services& services, int code) noexcept;
   void learn_cost(Services& services, int code) noexcept;
   PersistentSearches::Audience changed(Services& services, int code) noexcept;
@@ -134,10 +144,11 @@ class PendingOperation final : public GateWaiter,
   bool long_running_ = false;
   bool wants_worker_ = true;
   std::size_t charged_ = 0;
-  std::optional<int> returned_;    // by the handler
-  std::string changed_dn_;         // of a change: handlers may rewrite their own copy
-  Consequences consequences_;      // of an add, while it is as the client wrote it
-  bool settings_changed_ = false;  // by a change that was made
+  std::optional<int> returned_;       // by the handler
+  std::string changed_dn_;            // of a change: handlers may rewrite their own copy
+  Consequences consequences_;         // of an add, while it is as the client wrote it
+  bool settings_changed_ = false;     // by a change that was made
+  std::int64_t cost_of_failure_ = 0;  // what the backend keeps if it fails, in bytes
 
   // Arguments of the handler, released with the operation.
   PblockPtr parameters_;

@@ -323,24 +323,35 @@ void PersistentSearches::announce(Audience audience) noexcept {
         Change{audience.type, audience.dn, nullptr, audience.dn.size() + kValueBytes});
     for (const PersistentSearchPtr& search : audience.searches) search->tell(change);
   } catch (...) {
-    for (const PersistentSearchPtr& search : audience.searches) search->fail(result::no_memory);
+    fail_each(audience.searches, result::no_memory);
   }
 }
 
-// Whether a deleted entry matches is decided here and now: nobody can search for it any more.
+// Whether a deleted entry matches is decided here and now: nobody can search for it any more. It is
+// compared as it stood in the file, in the file's code page; only what is sent is converted. Who
+// cannot be told of it is told that: it would believe to have heard of everything.
 void PersistentSearches::announce_deletion(Audience& audience) {
-  if (!audience.before) return;  // the backend could not keep it: the notice is lost
-  const std::shared_ptr<const entry> before(in_utf8(std::move(audience.before)));
-  if (!before) return;
-  const std::string record = record_of(*before);
-  const auto change =
-      std::make_shared<const Change>(Change{audience.type, audience.dn, before, bytes_of(*before)});
+  if (!audience.before) return fail_each(audience.searches, result::other);
+  const std::string record = record_of(*audience.before);
+  std::vector<PersistentSearchPtr> matching;
   for (const PersistentSearchPtr& search : audience.searches) {
     bool matches = false;
-    const int code = cfg::ldif_record_matches(record, search->filter.c_str(), matches);
-    if (code == result::no_memory) search->fail(code);
-    if (code == 0 && matches) search->tell(change);
+    if (const int code = cfg::ldif_record_matches(record, search->filter.c_str(), matches))
+      search->fail(code);
+    else if (matches)
+      matching.push_back(search);
   }
+  if (matching.empty()) return;
+  const std::shared_ptr<const entry> before(in_utf8(std::move(audience.before)));
+  if (!before) return fail_each(matching, result::other);
+  const auto change =
+      std::make_shared<const Change>(Change{audience.type, audience.dn, before, bytes_of(*before)});
+  for (const PersistentSearchPtr& search : matching) search->tell(change);
+}
+
+void PersistentSearches::fail_each(const std::vector<PersistentSearchPtr>& searches,
+                                   int code) noexcept {
+  for (const PersistentSearchPtr& search : searches) search->fail(code);
 }
 
 void PersistentSearches::fail_all(int code) noexcept {
@@ -350,7 +361,7 @@ void PersistentSearches::fail_all(int code) noexcept {
       const std::lock_guard lock(mutex_);
       all = joined_;
     }
-    for (const PersistentSearchPtr& search : all) search->fail(code);
+    fail_each(all, code);
   } catch (...) {
     // Told at the next tick of their connections.
     const std::lock_guard lock(mutex_);

@@ -186,11 +186,13 @@ class PersistentSearches {
   // `before` is the entry before its deletion, as the backend filled it in; null otherwise.
   Audience audience(ChangeType type, std::string_view normal_dn, EntryPtr before) noexcept;
 
-  // Tells them. After the change has left the gate.
+  // Tells them. After the change has left the gate. Searches that cannot be told of a deletion (it
+  // was not kept, or has no form in UTF-8) end with 80, those without memory with 90.
   void announce(Audience audience) noexcept;
 
  private:
   void announce_deletion(Audience& audience);
+  static void fail_each(const std::vector<PersistentSearchPtr>& searches, int code) noexcept;
   void fail_all(int code) noexcept;
 
   PSearchMonitor monitor_;

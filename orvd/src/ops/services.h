@@ -15,6 +15,7 @@
 #include "logs.h"
 #include "ops/backend_host.h"
 #include "ops/consequences.h"
+#include "ops/failed_changes.h"
 #include "ops/output_meter.h"
 #include "ops/persistent_search.h"
 #include "ops/search_cost.h"
@@ -69,13 +70,18 @@ struct Services {
   std::function<void()> note_failure{};
   OutputMeter output{};
   SearchCost search_cost{};
-  // Told of what a change that was made means for the server, inside the gate. May be empty; must
-  // not throw.
-  std::function<void(const Consequences&)> take_over{};
+  // Told of what a change means for the server, inside the gate; `made`: it was reported as made. A
+  // failed one may have changed the file all the same. Returns whether there was anything new. May
+  // be empty; must not throw.
+  std::function<bool(const Consequences&, bool made)> take_over{};
   // Takes the settings of the file over, outside the gate and on a worker. May be empty; must not
   // throw.
   std::function<void()> renew_settings{};
   bool guards = true;  // the server's own, in front of the backend
+  // How many changes this thread has made to the file, as the library counts them: a backend that
+  // reports a change without having made one is not believed. Null: it always is.
+  unsigned long (*changes_made)() = nullptr;
+  FailedChangesByName failed_changes{};
   PersistentSearches persistent_searches{};
   AuditLog* audit = nullptr;  // null: changes are not recorded
 };

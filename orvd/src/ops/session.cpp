@@ -6,6 +6,7 @@
 #include <utility>
 
 #include "cfg/dn.h"
+#include "cfg/masked_dn.h"
 #include "cfg/result_codes.h"
 #include "cfg/secret.h"
 #include "ops/log_text.h"
@@ -78,16 +79,27 @@ std::int64_t stricter(std::int64_t a, std::int64_t b) {
   return std::min(a, b);
 }
 
-// NAME dn="...".
-std::string describe(std::string_view name, std::string_view dn, std::string_view key = " dn=") {
+// A name as logs may show it: what is no DN may be anything, a password too.
+std::string shown_dn(std::string_view dn) {
+  std::string shown = "not a DN";
+  if (cfg::mask_dn(dn, shown) == result::no_memory) throw std::bad_alloc();
+  return shown;
+}
+
+// NAME dn="...". `normal` is the normal form of the DN, if that is known.
+std::string describe_dn(std::string_view name, std::string_view dn, std::string_view normal = {}) {
   std::string text(name);
-  text += key;
-  append_client_text(text, dn);
+  text += " dn=";
+  if (!normal.empty() && !cfg::normal_dn_may_hold_secret(normal))
+    append_client_text(text, dn);
+  else
+    append_client_text(text, shown_dn(dn));
   return text;
 }
 
-std::string describe_search(const Schema& schema, const SearchRequest& request) {
-  std::string text = describe("SEARCH", request.base);
+std::string describe_search(const Schema& schema, const SearchRequest& request,
+                            std::string_view normal = {}) {
+  std::string text = describe_dn("SEARCH", request.base, normal);
   text += " scope=";
   append_number(text, request.scope);
   text += " filter=";
@@ -105,22 +117,22 @@ std::string describe(const Schema& schema, const Request& request) {
     std::string operator()(const UnbindRequest&) const { return "UNBIND"; }
     std::string operator()(const AbandonRequest&) const { return "ABANDON"; }
     std::string operator()(const SearchRequest& r) const { return describe_search(schema, r); }
-    std::string operator()(const AddRequest& r) const { return describe("ADD", r.dn); }
-    std::string operator()(const DeleteRequest& r) const { return describe("DELETE", r.dn); }
-    std::string operator()(const ModifyRequest& r) const { return describe("MODIFY", r.dn); }
-    std::string operator()(const ModifyDnRequest& r) const { return describe("MODIFYDN", r.dn); }
-    std::string operator()(const CompareRequest& r) const { return describe("COMPARE", r.dn); }
+    std::string operator()(const AddRequest& r) const { return describe_dn("ADD", r.dn); }
+    std::string operator()(const DeleteRequest& r) const { return describe_dn("DELETE", r.dn); }
+    std::string operator()(const ModifyRequest& r) const { return describe_dn("MODIFY", r.dn); }
+    std::string operator()(const ModifyDnRequest& r) const { return describe_dn("MODIFYDN", r.dn); }
+    std::string operator()(const CompareRequest& r) const { return describe_dn("COMPARE", r.dn); }
     std::string operator()(const ExtendedRequest& r) const {
-      return describe("EXTENDED", r.oid, " oid=");
+      std::string text = "EXTENDED oid=";
+      append_client_text(text, r.oid);
+      return text;
     }
   };
   return std::visit(Describe{schema}, request);
 }
 
 // Why a change of somebody with access did not reach the backend, which tells of its own refusals.
-void tell(Logs& logs, std::string_view what, std::string_view dn, const Refusal& refusal) {
-  if (!refusal) return;
-  std::string line = describe(what, dn);
+void tell(Logs& logs, std::string line, const Refusal& refusal) {
   line += " refused with ";
   append_number(line, refusal.code);
   line += ": ";
@@ -128,10 +140,25 @@ void tell(Logs& logs, std::string_view what, std::string_view dn, const Refusal&
   logs.warning(line);
 }
 
+void wipe_values(Attribute& attribute) noexcept {
+  for (std::string& value : attribute.values) cfg::wipe(value);
+}
+
 void wipe_credentials(BindRequest& request) noexcept {
   cfg::wipe(request.password);
   if (request.credentials) cfg::wipe(*request.credentials);
 }
+
+// Passwords stand in binds, and among the values of changes.
+struct WipedMessage : Message {
+  ~WipedMessage() {
+    if (auto* const bind = std::get_if<BindRequest>(&request)) wipe_credentials(*bind);
+    if (auto* const add = std::get_if<AddRequest>(&request))
+      for (Attribute& attribute : add->attributes) wipe_values(attribute);
+    if (auto* const modify = std::get_if<ModifyRequest>(&request))
+      for (Modification& modification : modify->modifications) wipe_values(modification.attribute);
+  }
+};
 
 // Copies, because a moved-from short text still holds its characters.
 void take_over(BindRequest& from, BindRequest& to) {
@@ -165,11 +192,7 @@ Session::Session(Services& services, AccessLane& access, std::uint64_t number)
 // ---- messages
 
 void Session::handle(std::string_view frame) {
-  struct WipedMessage : Message {
-    ~WipedMessage() {
-      if (auto* const bind = std::get_if<BindRequest>(&request)) wipe_credentials(*bind);
-    }
-  } message;
+  WipedMessage message;
   const Decoded decoded = decode(frame, decoder_limits(settings()), message);
   if (decoded.state == DecodeState::fatal) return disconnect(decoded.code, decoded.text);
   if (decoded.state == DecodeState::decoded) return take(message);
@@ -188,11 +211,13 @@ void Session::take(Message& message) {
   Request& request = message.request;
   if (std::holds_alternative<UnbindRequest>(request)) return drop();
   // RFC 4511, 4.1.1.1: answers could not be told apart.
-  if (outstanding(id) || persistent_search(id))
+  if (outstanding(id) || persistent_search(id)) {
+    audit_refused(message, result::protocol_error);
     return disconnect(result::protocol_error, "message ID is in use");
+  }
   if (const auto* given_up = std::get_if<AbandonRequest>(&request))
     return abandon(given_up->message_id);
-  if (!identity_holds()) return;
+  if (!identity_holds()) return audit_refused(message, result::stronger_auth_required);
   const int answer_tag = response_tag(request);
   PersistentWish wish;
   Refusal refusal = read_controls(message, wish);
@@ -203,12 +228,13 @@ void Session::take(Message& message) {
     return respond(id, answer_tag, refusal.code, refusal.text, described(request));
   }
   if (auto* wanted = std::get_if<SearchRequest>(&request)) return search(id, *wanted, wish);
-  if (const auto* wanted = std::get_if<AddRequest>(&request)) return add(id, *wanted);
-  if (const auto* wanted = std::get_if<DeleteRequest>(&request)) return remove(id, *wanted);
-  if (const auto* wanted = std::get_if<ModifyRequest>(&request)) return modify(id, *wanted);
+  if (const auto* wanted = std::get_if<AddRequest>(&request)) return change(id, *wanted);
+  if (const auto* wanted = std::get_if<DeleteRequest>(&request)) return change(id, *wanted);
+  if (const auto* wanted = std::get_if<ModifyRequest>(&request)) return change(id, *wanted);
   if (std::holds_alternative<ExtendedRequest>(request))
     return respond(id, answer_tag, result::protocol_error, "extended operation not supported",
                    described(request));
+  audit_refused(message, result::unwilling_to_perform);
   respond(id, answer_tag, result::unwilling_to_perform, kNotOffered, described(request));
 }
 
@@ -250,7 +276,7 @@ void Session::search(std::int32_t id, SearchRequest& request, const PersistentWi
       make_operation(id, tag::search_done, stricter(settings().time_limit, request.time_limit),
                      stricter(settings().size_limit, request.size_limit));
   if (services_.logs.access_enabled())
-    operation->log_text = describe_search(services_.schema, request);
+    operation->log_text = describe_search(services_.schema, request, normal);
   if (target == Target::not_a_dn)
     return submit(operation, {result::invalid_dn_syntax, "the base object is not a DN"});
   if (target != Target::configuration) return submit(operation, {result::no_such_object, ""});
@@ -276,9 +302,10 @@ void Session::search_published(std::int32_t id, const SearchRequest& request,
   }
   answer.result(code, "", "");
   transmit_answer(answer);
+  // Neither of the names that are published holds a password.
   if (services_.logs.access_enabled())
-    log_result(id, describe_search(services_.schema, request), answer.code(), answer.entries(),
-               started);
+    log_result(id, describe_search(services_.schema, request, kSubschemaNormalDn), answer.code(),
+               answer.entries(), started);
 }
 
 // ---- changes
@@ -291,43 +318,48 @@ Refusal Session::refuse_change(Target target) const {
   return {};
 }
 
-void Session::add(std::int32_t id, const AddRequest& request) {
-  std::string normal;
-  Refusal refusal = refuse_change(find_target(request.dn, normal));
-  const OperationPtr operation = make_operation(id, tag::add_response, 0, 0);
-  if (services_.logs.access_enabled()) operation->log_text = describe("ADD", request.dn);
-  prepare_audit(*operation, request);
-  if (!refusal) {
-    refusal = operation->prepare_add(services_, request, normal);
-    tell(services_.logs, "ADD", request.dn, refusal);
+namespace {
+
+constexpr int tag_of(const AddRequest&) {
+  return tag::add_response;
+}
+constexpr int tag_of(const DeleteRequest&) {
+  return tag::delete_response;
+}
+constexpr int tag_of(const ModifyRequest&) {
+  return tag::modify_response;
+}
+
+}  // namespace
+
+template <typename ChangeRequest>
+void Session::change(std::int32_t id, const ChangeRequest& request) {
+  Refusal refusal;
+  OperationPtr operation;
+  try {
+    operation = prepare_change(id, request, refusal);
+  } catch (...) {
+    audit_attempt(id, request, result::no_memory);
+    throw;
   }
   submit(operation, refusal);
 }
 
-void Session::remove(std::int32_t id, const DeleteRequest& request) {
+template <typename ChangeRequest>
+Session::OperationPtr Session::prepare_change(std::int32_t id, const ChangeRequest& request,
+                                              Refusal& refusal) {
+  const int answer_tag = tag_of(request);
+  const std::string_view name = operation_name(answer_tag);
   std::string normal;
-  Refusal refusal = refuse_change(find_target(request.dn, normal));
-  const OperationPtr operation = make_operation(id, tag::delete_response, 0, 0);
-  if (services_.logs.access_enabled()) operation->log_text = describe("DELETE", request.dn);
+  refusal = refuse_change(find_target(request.dn, normal));
+  OperationPtr operation = make_operation(id, answer_tag, 0, 0);
+  if (services_.logs.access_enabled()) operation->log_text = describe_dn(name, request.dn, normal);
   prepare_audit(*operation, request);
-  if (!refusal) {
-    refusal = operation->prepare_delete(services_, normal);
-    tell(services_.logs, "DELETE", request.dn, refusal);
-  }
-  submit(operation, refusal);
-}
-
-void Session::modify(std::int32_t id, const ModifyRequest& request) {
-  std::string normal;
-  Refusal refusal = refuse_change(find_target(request.dn, normal));
-  const OperationPtr operation = make_operation(id, tag::modify_response, 0, 0);
-  if (services_.logs.access_enabled()) operation->log_text = describe("MODIFY", request.dn);
-  prepare_audit(*operation, request);
-  if (!refusal) {
-    refusal = operation->prepare_modify(services_, request, normal);
-    tell(services_.logs, "MODIFY", request.dn, refusal);
-  }
-  submit(operation, refusal);
+  outstanding_.reserve(outstanding_.size() + 1);
+  if (refusal) return operation;
+  refusal = operation->prepare(services_, request, normal);
+  if (refusal) tell(services_.logs, describe_dn(name, request.dn, normal), refusal);
+  return operation;
 }
 
 // ---- the way of an operation
@@ -341,6 +373,7 @@ Session::OperationPtr Session::make_operation(std::int32_t id, int response_tag,
   auto operation =
       std::make_shared<PendingOperation>(shared_from_this(), identity_, id, response_tag, limits);
   operation->identity_generation = identity_checked_;
+  operation->failure_limit = settings().max_failed_change_size;
   lend_storage(operation->answer().bytes());
   return operation;
 }
@@ -410,9 +443,9 @@ void Session::work(const OperationPtr& operation) noexcept {
   }
   operation->run(services_, false);
   // Before the settings, which may name another audit log, or none.
-  audit(*operation, true);
+  const std::uint64_t record = audit(*operation);
   operation->renew_settings(services_);
-  hand_back(operation, Step::finish);
+  hand_back_recorded(operation, record);
 }
 
 void Session::decided(std::shared_ptr<PendingOperation> operation, Verdict verdict) noexcept {
@@ -482,7 +515,7 @@ void Session::complete(const OperationPtr& operation) {
     operation->held = false;
     --held_;
   }
-  audit(*operation, false);
+  audit(*operation);
   if (operation->notice_of) {
     notice_done(operation);
     return go_on();
@@ -667,9 +700,10 @@ void Session::receive_bind(std::int32_t id, BindRequest& request, Refusal refusa
   take_over(request, bind->request);
   wipe_credentials(request);
   bind->refusal = std::move(refusal);
-  bind_ = std::move(bind);
-  // They would stay outstanding for ever, and the bind would wait as long (RFC 4511, 4.2.1).
+  // They would stay outstanding for ever, and the bind would wait as long (RFC 4511, 4.2.1). It is
+  // not there yet: the end of the last of them would start it, and with luck finish it, in here.
   end_persistent_searches();
+  bind_ = std::move(bind);
   try_bind();
 }
 
@@ -767,7 +801,7 @@ void Session::finish_bind(int code, std::string_view text,
   wipe_credentials(bind->request);
   std::string what;
   if (services_.logs.access_enabled())
-    what = describe("BIND", bind->request.name) + (bind->request.simple ? " simple" : " sasl");
+    what = describe_dn("BIND", bind->request.name) + (bind->request.simple ? " simple" : " sasl");
   log_result(bind->message_id, what, gone_ ? kAbandoned : code, 0, bind->received);
   if (gone_) return settle_if_done();
   become(std::move(identity));

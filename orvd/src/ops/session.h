@@ -33,6 +33,7 @@ class Session : public OperationHome,
   Connection& connection() noexcept override { return connection_; }
   void decided(std::shared_ptr<PendingOperation> operation, Verdict verdict) noexcept override;
   OutputShare& output() noexcept override { return output_; }
+  FailedChanges& failed_changes() noexcept override { return failed_changes_; }
   void has_news(PersistentSearchPtr search) noexcept override;
 
  protected:
@@ -115,9 +116,10 @@ class Session : public OperationHome,
   Refusal read_controls(const Message& message, PersistentWish& wish) const;
 
   void search(std::int32_t id, SearchRequest& request, const PersistentWish& wish);
-  void add(std::int32_t id, const AddRequest& request);
-  void remove(std::int32_t id, const DeleteRequest& request);
-  void modify(std::int32_t id, const ModifyRequest& request);
+  template <typename ChangeRequest>
+  void change(std::int32_t id, const ChangeRequest& request);
+  template <typename ChangeRequest>
+  OperationPtr prepare_change(std::int32_t id, const ChangeRequest& request, Refusal& refusal);
   void search_published(std::int32_t id, const SearchRequest& request,
                         const std::shared_ptr<const entry>& published);
 
@@ -174,7 +176,12 @@ class Session : public OperationHome,
   AuditDetail audit_detail() const noexcept;
   template <typename ChangeRequest>
   void prepare_audit(PendingOperation& operation, const ChangeRequest& request);
-  void audit(PendingOperation& operation, bool wait) noexcept;
+  bool is_stranger() const noexcept;
+  std::uint64_t write_audit(std::string record) noexcept;
+  std::uint64_t audit(PendingOperation& operation) noexcept;
+  void hand_back_recorded(const OperationPtr& operation, std::uint64_t record) noexcept;
+  template <typename ChangeRequest>
+  void audit_attempt(std::int32_t id, const ChangeRequest& request, int code) noexcept;
   void audit_refused(const Message& message, int code) noexcept;
 
   void receive_bind(std::int32_t id, BindRequest& request, Refusal refusal);
@@ -198,6 +205,7 @@ class Session : public OperationHome,
   std::shared_ptr<const Identity> identity_;  // null: anonymous
   std::uint64_t identity_checked_ = 0;        // the generation by which it was good
   OutputShare output_;
+  FailedChanges failed_changes_;
   std::string peer_;
   std::vector<OperationPtr> outstanding_;
   std::vector<PersistentSearchPtr> persistent_;  // whose first part is over

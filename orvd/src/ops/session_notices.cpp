@@ -20,7 +20,8 @@ constexpr const char* kEverything = "(objectClass=*)";
 constexpr const char* kNoAttributes = "1.1";
 
 std::string_view reason(int code) {
-  return code == result::admin_limit_exceeded ? "changes are not read fast enough" : "";
+  if (code == result::admin_limit_exceeded) return "changes are not read fast enough";
+  return code == result::other ? "a deleted entry cannot be told of" : "";
 }
 
 }  // namespace
@@ -223,6 +224,8 @@ PersistentSearchPtr Session::persistent_search(std::int32_t message_id) const no
   return nullptr;
 }
 
+// By value: what is handed over may be an element of the list that it is taken out of.
+// NOLINTNEXTLINE(performance-unnecessary-value-param)
 void Session::end_persistent(PersistentSearchPtr search, int code, std::string_view text) {
   services_.persistent_searches.leave(*search);
   std::erase(persistent_, search);

@@ -339,7 +339,19 @@ class MessageReader {
            read_values(values, attribute.values) && end(rest);
   }
 
+  // As many as there is room for.
+  std::size_t count_values(std::string_view rest) noexcept {
+    const auto most = static_cast<std::size_t>(limits_.values);
+    std::size_t count = 0;
+    Element element;
+    while (count < most && parser_.take(rest, element)) ++count;
+    return count;
+  }
+
   bool read_values(std::string_view rest, std::vector<std::string>& values) {
+    // Room for all of them at once: short texts that move leave their characters behind, and these
+    // may be passwords.
+    values.reserve(count_values(rest));
     while (!rest.empty()) {
       std::string_view value;
       if (!take_octets(rest, value)) return false;
@@ -401,13 +413,12 @@ class MessageReader {
 
   bool read_modify_dn(std::string_view rest) {
     auto& request = message_.request.emplace<ModifyDnRequest>();
-    std::string new_name;
-    bool delete_old = false;
-    if (!take_dn(rest, request.dn) || !take_dn(rest, new_name)) return false;
-    if (!take_boolean(rest, delete_old)) return false;
+    if (!take_dn(rest, request.dn) || !take_dn(rest, request.new_rdn)) return false;
+    if (!take_boolean(rest, request.delete_old_rdn)) return false;
     if (next_is(rest, kNewSuperior)) {
       std::string_view superior;
-      if (!take(rest, kNewSuperior, superior) || !accept_dn(superior, new_name)) return false;
+      if (!take(rest, kNewSuperior, superior)) return false;
+      if (!accept_dn(superior, request.new_superior.emplace())) return false;
     }
     return end(rest);
   }

@@ -65,6 +65,9 @@ struct ModifyRequest {
 
 struct ModifyDnRequest {
   std::string dn;
+  std::string new_rdn;
+  bool delete_old_rdn = false;
+  std::optional<std::string> new_superior;
 };
 
 struct CompareRequest {

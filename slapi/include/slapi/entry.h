@@ -88,14 +88,16 @@ int delete_values_from_entry(entry* e, ldapmod* modification);
 // null-terminated array of add records with deep copies of type and values (strings, read up to
 // their NUL), linked through `mod_next` in array order. Released with `free_ldmll` on the first
 // record, then free on the array.
-// Without memory, and for a list that is shorter than the entry whose schema check came last on
-// this thread (both have the same type texts), the array holds one record without a type, which no
-// change accepts: a backend would otherwise report nothing, or half an entry, as written. Null only
-// for an empty list, and when memory fails again while the last such answer is still held.
+// Without memory, for a value without a text (its translation failed), and for a list that is
+// shorter than the entry whose schema check came last on this thread (both have the same type
+// texts), the array holds one record without a type, which no change accepts: a backend would
+// otherwise report nothing, or half an entry, as written. Null only for an empty list, and when
+// memory fails again while the last such answer is still held.
 ldapmod** EntryToLDAPMod(attr* attributes);
 
 // Frees a linked list of records; null is a no-op. And an array of them: each record, and the array
-// itself when `free_array` is not 0. Values go by the arm that the flag kModBvalues names.
+// itself when `free_array` is not 0. Values go by the arm that the flag kModBvalues names,
+// and are overwritten: there may be passwords among them.
 void free_ldmll(ldapmod* first);
 void ldap_mods_free(ldapmod** array, int free_array);
 

@@ -1,0 +1,36 @@
+// DNs, and other texts, as they may be shown in a log: without the passwords that somebody put into
+// them.
+//
+// Thread-safe.
+#pragma once
+
+#include <cstddef>
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace orv::cfg {
+
+// What stands in the place of a value that is not shown.
+inline constexpr std::string_view kMask = "********";
+
+// Writes a DN with the values of secret types (cfg/attribute_table.h) replaced by kMask, and so the
+// values that are DNs themselves and hold one. A DN without any is written as it was. 0; 34 `dn` is
+// no DN, so that nobody knows what it holds; 90. `shown` is unchanged on failure. Does not throw.
+int mask_dn(std::string_view dn, std::string& shown) noexcept;
+
+// For a DN in normal form, and much cheaper: whether mask_dn may have something to replace.
+bool normal_dn_may_hold_secret(std::string_view normal) noexcept;
+
+struct TextPart {
+  std::size_t begin;
+  std::size_t end;
+};
+
+// The next password, from `from` on, that stands in a text of any kind as "type=value": in what was
+// meant for a DN, in a filter, in a URL. The part is the value; it reaches to where the next part
+// of a DN begins or the filter's item ends, or to the end of the text but for a newline there:
+// rather too far than not far enough. Does not throw or allocate.
+std::optional<TextPart> find_secret(std::string_view text, std::size_t from) noexcept;
+
+}  // namespace orv::cfg
