@@ -1,5 +1,6 @@
 """Fixtures of the end-to-end tests."""
 
+import locale
 import os
 import pathlib
 import sys
@@ -53,3 +54,12 @@ def _plain_environment():
     for name in [name for name in os.environ if name.startswith("LDAP") and name != "LDAPNOINIT"]:
         del os.environ[name]
     os.environ["LDAPNOINIT"] = "1"
+
+
+@pytest.fixture(scope="session", autouse=True)
+def _locale_of_the_environment():
+    """Where one is named, it has to be there: without its files the tests would run under "C"."""
+    if "LOCPATH" in os.environ:
+        kept = locale.setlocale(locale.LC_CTYPE)
+        locale.setlocale(locale.LC_CTYPE, "")
+        locale.setlocale(locale.LC_CTYPE, kept)

@@ -1,16 +1,20 @@
 """The record of changes: every attempt, with who, when, from where and with what result."""
 
+import base64
 import io
 import os
 import re
 import signal
 import stat
+import time
 
 import ldap
 import ldif
 import pytest
 
 from orv_e2e import clients
+from orv_e2e.changes import PLACE
+from orv_e2e.programs import DEADLINE
 from test_persistent_search import CLASSES, PASSWORD, GROUP, add_member, member_dn
 
 
@@ -186,13 +190,213 @@ def test_no_other_log_shares_its_file(instance):
     instance.config.set(entry % "audit", "orv-slapdLog", str(instance.access_log))
     instance.process.send_signal(signal.SIGHUP)
     root = clients.bind(instance)
-    while b"another log is there" not in (instance.directory / "error.log").read_bytes():
+    while b"the same file as the access log" not in (instance.directory / "error.log").read_bytes():
         clients.search(root)
     add_member(root, "alice")
     root.unbind_s()
     instance.stop()
     assert len(Records(log_of(instance)).records) == 5
     assert b"changetype" not in instance.access_log.read_bytes()
+
+
+ENTRY = "cn=%s,cn=log management,cn=configuration"
+
+
+def change_logs(instance, **paths):
+    """Names other files for logs, takes that over, and gives what was said about it."""
+    heard = instance.directory / "log" / "error.log"
+    start = heard.stat().st_size
+    for name, path in paths.items():
+        instance.config.set(ENTRY % name, "orv-slapdLog", str(path))
+    instance.process.send_signal(signal.SIGHUP)
+    deadline = time.monotonic() + DEADLINE
+    while not any(b"settings taken over" in path.read_bytes()[start if path == heard else 0:]
+                  for path in (heard, *paths.values()) if path.is_file()):
+        assert time.monotonic() < deadline
+        time.sleep(0.01)
+    return heard.read_bytes()[start:].decode()
+
+
+@pytest.fixture
+def with_error_log(instance):
+    """An instance whose error log is a file."""
+    heard = instance.directory / "log" / "error.log"
+    instance.config.set(ENTRY % "default", "orv-slapdLog", str(heard))
+    instance.config.set(ENTRY % "default", "orv-slapdLogLevel", "info")
+    return instance.start()
+
+
+def assert_apart(instance):
+    """No line of one log is in the file of another."""
+    for path in instance.directory.rglob("*"):
+        if not path.is_file() or path.suffix not in (".log", ".1"):
+            continue
+        text = path.read_bytes()
+        kinds = [b"changetype: " in text, b" conn=" in text, b" info " in text]
+        assert kinds.count(True) <= 1, (path, text)
+
+
+def change_something(instance):
+    root = clients.bind(instance)
+    add_member(root, "alice")
+    root.delete_s(member_dn("alice"))
+    root.unbind_s()
+
+
+def test_logs_that_change_places_with_it_stay_where_they_are(with_error_log):
+    instance = with_error_log
+    heard = instance.directory / "log" / "error.log"
+    change_something(instance)
+    said = change_logs(instance, audit=heard, default=log_of(instance))
+    assert "cannot record changes in %s: the same file as the error log" % heard in said
+    assert "cannot log to %s: the same file as the audit log" % log_of(instance) in said
+    change_something(instance)
+    instance.stop()
+    assert len(Records(log_of(instance)).records) == 4
+    assert_apart(instance)
+
+
+@pytest.mark.parametrize("kind", ["link", "folder", "own file", "no folder", "pipe"])
+@pytest.mark.parametrize("other", ["default", "access"])
+def test_no_log_takes_its_file_when_it_could_not_move(with_error_log, kind, other):
+    instance = with_error_log
+    wanted = instance.directory / "log" / "wanted"
+    if kind == "link":
+        wanted.symlink_to(instance.directory / "elsewhere")
+    elif kind == "folder":
+        wanted.mkdir()
+    elif kind == "own file":
+        wanted = instance.config.path
+    elif kind == "no folder":
+        wanted = wanted / "audit.log"
+    else:
+        os.mkfifo(wanted)
+    change_something(instance)
+    said = change_logs(instance, **{"audit": wanted, other: log_of(instance)})
+    assert "cannot record changes in %s" % wanted in said
+    assert "cannot log to %s: the same file as the audit log" % log_of(instance) in said
+    change_something(instance)
+    instance.stop()
+    assert len(Records(log_of(instance)).records) == 4
+    assert_apart(instance)
+
+
+def test_no_log_takes_its_file_under_the_name_it_was_moved_to(with_error_log):
+    instance = with_error_log
+    change_something(instance)
+    moved = log_of(instance).with_suffix(".1")
+    log_of(instance).rename(moved)
+    wanted = instance.directory / "nowhere" / "audit.log"
+    said = change_logs(instance, audit=wanted, default=moved)
+    assert "cannot log to %s: the same file as the audit log" % moved in said
+    change_something(instance)
+    instance.stop()
+    assert len(Records(moved).records) == 4
+    assert_apart(instance)
+
+
+def test_it_may_move_and_another_log_take_its_place(with_error_log):
+    instance = with_error_log
+    old = log_of(instance)
+    change_something(instance)
+    old.rename(old.with_suffix(".1"))
+    other = instance.directory / "log" / "other.log"
+    change_logs(instance, audit=other, default=old)
+    change_something(instance)
+    instance.stop()
+    assert len(Records(other).records) == 2
+    assert_apart(instance)
+
+
+def test_it_is_never_the_file_that_standard_error_goes_to(instance):
+    """The daemon's own words would stand among the records."""
+    log_of(instance).parent.mkdir(exist_ok=True)
+    command = ["sh", "-c", 'exec "$@" 2>>"$0"', str(log_of(instance))]
+    instance.start(wrapper=command)
+    change_something(instance)
+    instance.stop()
+    text = log_of(instance).read_bytes()
+    assert b"the same file as standard error" in text
+    assert b"changetype" not in text
+
+
+def test_an_attempt_to_rename_is_there(server, root):
+    with pytest.raises(ldap.UNWILLING_TO_PERFORM):
+        root.rename_s(member_dn("alice"), "cn=bob", GROUP, delold=0)
+    with pytest.raises(ldap.UNWILLING_TO_PERFORM):
+        root.rename_s(member_dn("alice"), "orv-slapdAdminPW=hidden")
+    log = Records(log_of(server))
+    assert [dn for dn, _ in log.records] == [member_dn("alice")] * 2
+    assert log.records[0][1] == {"changetype": [b"modrdn"], "newrdn": [b"cn=bob"],
+                                 "deleteoldrdn": [b"0"], "newsuperior": [GROUP.encode()]}
+    assert log.records[1][1] == {"changetype": [b"modrdn"],
+                                 "newrdn": [b"orv-slapdAdminPW=********"], "deleteoldrdn": [b"1"]}
+    assert [facts["operation"] for facts in log.facts] == ["rename", "rename"]
+    assert [facts["result"] for facts in log.facts] == ["53", "53"]
+
+
+class Modifications(ldif.LDIFParser):
+    """The lists of the modify records of a log, as python3-ldap would send them again."""
+
+    def __init__(self, path):
+        super().__init__(io.BytesIO(path.read_bytes()))
+        self.lists = []
+        self.parse_change_records()
+
+    def handle_modify(self, dn, modops, controls=None):
+        self.lists.append((dn, modops))
+
+
+VALUES = [b"short", b"x" * 5000, bytes(range(256)), b"\xff\xfe" * 2000, b" leading", b"trailing ",
+          b":colon", b"<file:///etc/passwd", b"", "gr\u00fc\u00dfe".encode(), b"two\nlines",
+          b"dn: cn=forged\nchangetype: delete", b"-", b"# comment", b"cr\rlf\r\n", b"\0", b"=,+"]
+
+
+@pytest.mark.parametrize("code", [ldap.MOD_ADD, ldap.MOD_DELETE, ldap.MOD_REPLACE])
+def test_modifications_come_back_as_they_were_sent(server, root, code):
+    lists = [[(code, "description", [value])] for value in VALUES]
+    lists.append([(code, "description", VALUES)])
+    lists.append([(code, "description", [value]) for value in VALUES])
+    lists.append([(ldap.MOD_DELETE, "description", None), (code, "DESCRIPTION", VALUES[:3]),
+                  (ldap.MOD_REPLACE, "2.5.4.13", None), (code, "description;lang-de", [b"x"])])
+    lists.append([(ldap.MOD_ADD, "description", [b"a", b"b"]),
+                  (ldap.MOD_DELETE, "description", [b"a"]),
+                  (ldap.MOD_REPLACE, "description", [b"c"])])
+    for modifications in lists:
+        try:
+            root.modify_s(PLACE, modifications)
+        except ldap.LDAPError:
+            pass
+    found = Modifications(log_of(server)).lists
+    assert [dn for dn, _ in found] == [PLACE] * len(lists)
+    for (_, recorded), sent in zip(found, lists):
+        assert recorded == sent
+
+
+@pytest.mark.parametrize("value", [PASSWORD, b"y" * 5000, b"\xff binary\n", b"Kq8#vz7!Wb2$"])
+def test_modifications_show_no_password_in_any_form(server, root, value):
+    add_member(root, "alice")
+    alice = clients.bind(server, "cn=alice", PASSWORD.decode())
+    name = "orv-slapdAdminPW"
+    lists = [[(ldap.MOD_REPLACE, name, [value])],
+             [(ldap.MOD_DELETE, name, [value]), (ldap.MOD_ADD, name, [value])],
+             [(ldap.MOD_ADD, name, [value, value + b"2"]), (ldap.MOD_DELETE, name, None)]]
+    for client in (root, alice):
+        for modifications in lists:
+            try:
+                client.modify_s(member_dn("alice"), modifications)
+            except ldap.LDAPError:
+                pass
+    text = log_of(server).read_bytes()
+    folded = text.replace(b"\n ", b"")
+    assert value not in folded and base64.b64encode(value).rstrip(b"=")[:-1] not in folded
+    masked = [[(operation, kind, values and [b"********"] * len(values))
+               for operation, kind, values in modifications] for modifications in lists]
+    found = Modifications(log_of(server)).lists
+    expected = masked * 2
+    # A password that was changed ends the connection of whoever used the old one.
+    assert [recorded for _, recorded in found] == expected[:len(found)]
+    assert len(found) >= len(lists)
 
 
 def test_it_can_be_switched_off(instance):

@@ -15,7 +15,7 @@ import time
 import ldap
 import pytest
 
-from orv_e2e import changes, clients
+from orv_e2e import changes, clients, programs
 from orv_e2e.changes import PLACE, container
 
 SECONDS = float(os.environ.get("ORV_LOAD_SECONDS", "3"))
@@ -48,14 +48,19 @@ print(reads)
 
 
 class Worker(threading.Thread):
-    """Adds and deletes entries of its own and keeps what was acknowledged."""
+    """Adds, modifies and deletes entries of its own and keeps what was acknowledged."""
 
     def __init__(self, instance, number, until):
         super().__init__(daemon=True)
         self.instance, self.number, self.until = instance, number, until
-        self.present = {}   # DN: True there, False not there, None not known
-        self.done = 0
+        self.present = {}   # DN: the description that was acknowledged, None not there
+        self.pending = {}   # DN: what it becomes if the change that was not answered was made
+        self.counts = {"add": 0, "modify": 0, "delete": 0}
         self.failure = None
+
+    @property
+    def done(self):
+        return sum(self.counts.values())
 
     def run(self):
         random_source = random.Random(self.number)
@@ -67,20 +72,39 @@ class Worker(threading.Thread):
             self.failure = error
 
     def _change(self, client, random_source):
-        dn, attributes = container("load %d %d" % (self.number, random_source.randrange(20)))
-        there = self.present.get(dn, False)
-        self.present[dn] = None
-        code = changes.delete(client, dn) if there else changes.add(client, dn, attributes)
+        name = "load %d %d" % (self.number, random_source.randrange(20))
+        dn = "cn=%s,%s" % (name, PLACE)
+        text = "%d by %d" % (self.done, self.number)
+        if self.present.get(dn) is None:
+            kind, wanted = "add", text
+        else:
+            kind, wanted = random_source.choice([("modify", text), ("delete", None)])
+        self.pending[dn] = wanted
+        code = self._send(client, kind, dn, name, text)
         if code < 0:  # no answer
             raise ldap.SERVER_DOWN({"result": code})
-        assert code == 0, (dn, there, code)
-        self.present[dn] = not there
-        self.done += 1
+        assert code == 0, (dn, kind, code)
+        self.present[dn] = self.pending.pop(dn)
+        self.counts[kind] += 1
+
+    @staticmethod
+    def _send(client, kind, dn, name, text):
+        if kind == "add":
+            return changes.add(client, *container(name, description=[text]))
+        if kind == "delete":
+            return changes.delete(client, dn)
+        return changes.modify(client, dn, changes.replaced("description", text))
 
 
 def in_file(instance):
+    """The descriptions of the workers' entries."""
     found = clients.parse_ldif(instance.config.read())
-    return {dn for dn in found if dn.startswith("cn=load ")}
+    return {dn: attributes["description"][0].decode() for dn, attributes in found.items()
+            if dn.startswith("cn=load ")}
+
+
+def acknowledged(workers):
+    return {dn: text for worker in workers for dn, text in worker.present.items()}
 
 
 def test_eight_clients_change_while_another_process_reads(server, tmp_path):
@@ -98,10 +122,11 @@ def test_eight_clients_change_while_another_process_reads(server, tmp_path):
         reads, _ = reader.communicate()
         assert reader.returncode == 0 and int(reads) > 0
     assert [worker.failure for worker in workers] == [None] * CLIENTS
-    expected = {dn for worker in workers for dn, there in worker.present.items() if there}
-    assert in_file(server) == expected
+    assert in_file(server) == {dn: text for dn, text in acknowledged(workers).items() if text}
     assert all(worker.done > 0 for worker in workers)
-    print("%d changes, %s readings" % (sum(worker.done for worker in workers), reads.decode()))
+    done = {kind: sum(worker.counts[kind] for worker in workers) for kind in workers[0].counts}
+    assert all(done.values())
+    print("%s, %s readings" % (done, reads.decode().strip()))
 
 
 @pytest.mark.parametrize("seed", range(STOPS))
@@ -111,7 +136,9 @@ def test_killed_server_has_lost_no_acknowledged_change(instance, seed):
     workers = [Worker(instance, number, ended.is_set) for number in range(3)]
     for worker in workers:
         worker.start()
+    deadline = time.monotonic() + programs.DEADLINE
     while sum(worker.done for worker in workers) < 5:
+        assert time.monotonic() < deadline, [worker.failure for worker in workers]
         time.sleep(0.001)
     time.sleep(random.Random(seed).uniform(0, 0.2))
     instance.process.send_signal(signal.SIGKILL)
@@ -121,12 +148,15 @@ def test_killed_server_has_lost_no_acknowledged_change(instance, seed):
         worker.join()
         assert worker.failure is None or isinstance(worker.failure, ldap.SERVER_DOWN)
     there = in_file(instance)
-    known = {dn: is_there for worker in workers for dn, is_there in worker.present.items()
-             if is_there is not None}
-    assert {dn for dn, is_there in known.items() if is_there} <= there
-    assert not {dn for dn, is_there in known.items() if not is_there} & there
+    pending = {dn: text for worker in workers for dn, text in worker.pending.items()}
+    known = {**dict.fromkeys(pending), **acknowledged(workers)}
+    for dn, text in known.items():
+        # What nobody was told of is done wholly or not at all.
+        assert there.get(dn) in (text, pending.get(dn, text)), dn
+    assert set(there) <= set(known)
     instance.start()
     client = clients.bind(instance)
-    assert clients.names(client, "(cn=load *)", PLACE) == there
+    found = clients.search(client, PLACE, filter_text="(cn=load *)", attributes=["description"])
+    assert {dn: values["description"][0].decode() for dn, values in found.items()} == there
     assert changes.add(client, *container("after")) == 0
     client.unbind_s()

@@ -254,6 +254,17 @@ def test_nobody_deletes_the_container_of_pass_through_entries(server, root):
     assert delete(root, "cn=passthrough authentication,cn=configuration") == 53
 
 
+@pytest.mark.parametrize("level, code", [("loud", 19), ("infos", 19), ("", 19), ("Debug", 0)])
+def test_log_level_that_would_stop_the_next_start_is_refused(server, root, level, code):
+    dn = "cn=audit," + changes.LOGS
+    entry = clients.read(root, dn)
+    assert delete(root, dn) == 0
+    entry["orv-slapdLogLevel"] = [level.encode()]
+    assert add(root, dn, list(entry.items())) == code
+    server.stop()
+    server.start()
+
+
 def test_there_is_one_supplier_of_the_whole_server(server, root):
     assert add(root, *changes.supplier("second", kind="orv-slapdReplication")) == 53
     assert add(root, *changes.supplier("master server", kind="orv-slapdReplication",

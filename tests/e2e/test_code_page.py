@@ -6,6 +6,7 @@ import pytest
 
 from orv_e2e import clients, wire
 from orv_e2e.config_file import record
+from orv_e2e.persistent import DELETE, Listener
 
 SHELF = "cn=shelf,cn=schemas,cn=configuration"
 TEXT = "Café Ærø für 5 £"
@@ -60,6 +61,24 @@ def test_base_that_the_code_page_cannot_hold_is_refused_and_serving_goes_on(inst
 
 def test_administrator_binds_whatever_the_code_page(instance):
     clients.bind(latin_1(instance))
+
+
+@pytest.mark.parametrize("filter_text", ["(description=" + TEXT + ")", "(description=*Ærø*)",
+                                         "(description=caf*)"])
+def test_deletion_is_told_to_who_asked_for_text_of_the_file(instance, filter_text):
+    latin_1(instance)
+    root = clients.bind(instance)
+    listener = Listener(clients.bind(instance), filter_text=filter_text).established()
+    # Bytes of the file's text, taken for characters: what nobody asked for must not be told.
+    mistaken = TEXT.encode("utf-8").decode("latin-1")
+    other = Listener(clients.bind(instance),
+                     filter_text="(description=" + mistaken + ")").established()
+    root.delete_s(SHELF)
+    dn, attributes, change = listener.next()
+    assert (dn, change) == (SHELF, DELETE)
+    assert attributes["description"] == [TEXT.encode("utf-8")]
+    other.established()
+    assert not other.has_heard()
 
 
 def test_unknown_code_page_is_refused_at_start(instance):

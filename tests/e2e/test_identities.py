@@ -9,7 +9,7 @@ import subprocess
 import ldap
 import pytest
 
-from orv_e2e import clients, programs
+from orv_e2e import clients, programs, wire
 
 MASTER = "cn=master server,cn=configuration"
 
@@ -246,6 +246,30 @@ def test_member_removed_by_hand_is_gone_at_once(instance):
     assert bind_code(instance, "cn=alice", "in the open") == 0
     instance.config.remove("cn=alice,cn=admingroup,cn=configuration")
     assert bind_code(instance, "cn=alice", "in the open") == 49
+
+
+def test_connection_of_a_member_removed_by_hand_ends_without_anybody_binding(instance):
+    instance.config.add_member("alice", "in the open")
+    instance.start()
+    with wire.Wire(instance) as alice:
+        assert alice.bind("cn=alice", "in the open") == 0
+        instance.config.remove("cn=alice,cn=admingroup,cn=configuration")
+        notice = alice.answer()
+        assert notice is not None and notice.is_notice
+
+
+def test_connection_of_a_member_ends_when_what_kept_its_removal_from_being_read_has_passed(
+        instance):
+    instance.config.add_member("alice", "in the open")
+    instance.start()
+    with wire.Wire(instance) as alice:
+        assert alice.bind("cn=alice", "in the open") == 0
+        os.chmod(instance.key_stash, 0o640)  # refused: others may read it
+        instance.config.remove("cn=alice,cn=admingroup,cn=configuration")
+        assert instance.stderr.wait_for(re.compile("the identities stay as they were").search)
+        os.chmod(instance.key_stash, 0o600)
+        notice = alice.answer()
+        assert notice is not None and notice.is_notice
 
 
 def test_administrator_cannot_bind_under_another_key_than_the_sealing_one(instance):

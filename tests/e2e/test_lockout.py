@@ -62,3 +62,16 @@ def test_new_password_ends_the_lockout(locked, root):
 def test_lockout_ends_when_the_policy_has_none(locked, root):
     replace(root, POLICY, "pwdLockout", "FALSE")
     assert bind_code(locked, PASSWORD) == 0
+
+
+def test_member_added_by_hand_is_locked_out_as_others_are(server, root):
+    replace(root, POLICY, "pwdMaxFailure", str(FAILURES))
+    server.config.add_member("erin", "in the open")
+    for _ in range(FAILURES):
+        assert bind_code(server, "wrong", "cn=erin") == 49
+    assert bind_code(server, "in the open", "cn=erin") == 49
+
+
+def test_password_changed_by_hand_ends_the_lockout_with_the_next_bind(locked):
+    locked.config.set("cn=carol," + GROUP, "orv-slapdAdminPW", "in the open")
+    assert bind_code(locked, "in the open") == 0

@@ -33,13 +33,39 @@ def test_log_in_a_file_of_the_instance_is_refused(instance, name, linked):
     assert (instance.directory / name).read_bytes() == before
 
 
-def test_log_in_place_of_a_save_file_that_is_not_there_is_refused_and_not_made(instance):
-    target = instance.directory / "config.ldif.save"
-    instance.config.set(ACCESS_LOG, "orv-slapdLog", str(target))
+# What a change of the configuration file leaves beside it, and uses on the way.
+COMPANIONS = [".save", ".save.new", ".lock", ".new", ".swap", ".rescued"]
+
+
+@pytest.mark.parametrize("log", [ERROR_LOG, ACCESS_LOG])
+@pytest.mark.parametrize("ending", COMPANIONS)
+def test_log_in_place_of_a_companion_that_is_not_there_is_refused_and_not_made(instance, log,
+                                                                                ending):
+    target = instance.directory / ("config.ldif" + ending)
+    instance.config.set(log, "orv-slapdLog", str(target))
     instance.start()
     instance.stop()
     assert len(refusals(instance)) == 1
     assert not target.exists()
+
+
+@pytest.mark.parametrize("ending", ["", *COMPANIONS])
+def test_companions_stand_where_the_configuration_really_is(instance, ending):
+    real = instance.directory / "real"
+    real.mkdir()
+    target = real / ("settings.ldif" + ending)
+    instance.config.set(ACCESS_LOG, "orv-slapdLog", str(target))
+    instance.config.path.rename(real / "settings.ldif")
+    instance.config.path.symlink_to(real / "settings.ldif")
+    before = (real / "settings.ldif").read_bytes()
+    instance.start()
+    root = clients.bind(instance)
+    clients.search(root)
+    root.unbind_s()
+    instance.stop()
+    assert len(refusals(instance)) == 1
+    assert not ending or not target.exists()
+    assert (real / "settings.ldif").read_bytes() == before
 
 
 def test_both_logs_in_one_file_are_refused(instance):

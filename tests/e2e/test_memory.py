@@ -2,10 +2,14 @@
 
 import os
 import re
+import string
 import subprocess
 import sys
 
-from orv_e2e import programs, wire
+import ldap
+import pytest
+
+from orv_e2e import clients, programs, wire
 
 
 def holds(pid, wanted):
@@ -50,15 +54,28 @@ def test_memory_is_closed_to_other_processes_of_the_same_user(instance):
         other.stdin.close()
 
 
-def test_passwords_sent_to_bind_are_wiped(request, tmp_path):
+def reader(request, tmp_path):
+    """The server of a test that reads its memory; None when it has been run as somebody who may."""
     if os.geteuid() != 0:
         # In a user namespace of its own this very test is root over the daemon that it starts.
         subprocess.run(["unshare", "--map-root-user", sys.executable, "-m", "pytest", "-q", "-p",
                         "no:cacheprovider", "--basetemp", tmp_path / "inside",
                         "%s::%s" % (__file__, request.node.name)], check=True,
                        timeout=2 * programs.DEADLINE)
+        return None
+    return request.getfixturevalue("server")
+
+
+def remains(pid, password):
+    """Whether enough of a password to give it away is in the process's memory."""
+    quarter = len(password) // 4  # the ends may be overwritten by the allocator
+    return holds(pid, password[quarter:-quarter])
+
+
+def test_passwords_sent_to_bind_are_wiped(request, tmp_path):
+    server = reader(request, tmp_path)
+    if server is None:
         return
-    server = request.getfixturevalue("server")
     pid = server.process.pid
     short, long = b"Qx7#kRw2!vT", b"Jz5$" + b"pLm9&wQe" * 8
     with wire.Wire(server) as client:
@@ -67,7 +84,46 @@ def test_passwords_sent_to_bind_are_wiped(request, tmp_path):
             client.bind("no dn", password.decode())
         client.bind("cn=somebody-to-be-found", "wrong")
         for password in (short, long):
-            # Half of it is enough to give it away; the ends may be overwritten by the allocator.
-            half = len(password) // 4
-            assert not holds(pid, password[half:-half])
+            assert not remains(pid, password)
         assert holds(pid, server.config.path.name.encode())  # the search itself works
+
+
+def test_passwords_that_changes_set_are_wiped(request, tmp_path):
+    """What is stored is protected; the clear text is nowhere once the change is made or refused."""
+    server = reader(request, tmp_path)
+    if server is None:
+        return
+    pid = server.process.pid
+    letters = (string.ascii_letters + string.digits + "!#$%&*+-./<=>?@").encode()
+    # Long ones in which no character comes twice, nor in both: the policy counts those. In an order
+    # that nobody else has.
+    shuffled = bytes(letters[29 * i % len(letters)] for i in range(len(letters)))
+    long, other = shuffled[::2], shuffled[1::2]
+    added, changed = [b"Ka1#Tz8!mBn4", long], [b"Mo9#Qw2!vCx7", other]
+    own, refused = b"Ri5#Hy3!sDf6", b"Lu4#Gp8!jEk2"
+
+    def change_password(client, name, password):
+        client.modify_s(dn(name), [(ldap.MOD_REPLACE, "orv-slapdAdminPW", [password])])
+
+    def dn(name):
+        return "cn=%s,cn=admingroup,cn=configuration" % name
+
+    def member(name, password):
+        return [("objectClass", [b"top", b"orv-slapdConfigEntry", b"orv-slapdAdminGroupMember"]),
+                ("cn", name.encode()), ("orv-slapdAdminDN", b"cn=" + name.encode()),
+                ("orv-slapdAdminRole", b"SchemaAdmin"), ("orv-slapdAdminPW", password)]
+
+    root = clients.bind(server)
+    for name, first, second in zip(("short", "long"), added, changed):
+        root.add_s(dn(name), member(name, first))
+        with pytest.raises(ldap.ALREADY_EXISTS):
+            root.add_s(dn(name), member(name, first))
+        change_password(root, name, second)
+    with pytest.raises(ldap.UNDEFINED_TYPE):  # before the backend has it
+        root.add_s(dn("third"), [*member("third", refused), ("orv-none", b"x")])
+    change_password(clients.bind(server, "cn=short", changed[0].decode()), "short", own)
+    clients.bind(server, "cn=short", own.decode())
+    clients.connect(server).search_s("", ldap.SCOPE_BASE)
+    for password in (*added, *changed, own, refused):
+        assert not remains(pid, password), password
+    assert holds(pid, server.config.path.name.encode())  # the search itself works

@@ -7,38 +7,11 @@ import ldap
 import pytest
 
 from orv_e2e import changes, clients
-from orv_e2e.changes import GROUP, LOGS, PASSWORD, add, container, member
+from orv_e2e.changes import (GROUP, LOGS, PASSWORD, add, added, container, deleted, member,
+                             modify, refusal, replaced)
 
 NEW_PASSWORD = "Qm4&wt8?Lb6%"
 TOP = "cn=configuration"
-
-
-def modify(client, dn, *modifications):
-    """The result code of a modify of (operation, type, values); values as texts, or None."""
-    return refusal(client, dn, *modifications)[0]
-
-
-def refusal(client, dn, *modifications):
-    """The code and the text of the result."""
-    encoded = [(operation, name, values and [value.encode() for value in values])
-               for operation, name, values in modifications]
-    try:
-        client.modify_s(dn, encoded)
-        return 0, ""
-    except ldap.LDAPError as error:
-        return error.args[0]["result"], error.args[0].get("info", "")
-
-
-def added(name, *values):
-    return ldap.MOD_ADD, name, list(values)
-
-
-def deleted(name, *values):
-    return ldap.MOD_DELETE, name, list(values) or None
-
-
-def replaced(name, *values):
-    return ldap.MOD_REPLACE, name, list(values) or None
 
 
 def values_of(client, dn, name):

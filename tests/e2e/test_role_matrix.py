@@ -9,7 +9,7 @@ import itertools
 import ldap
 import pytest
 
-from orv_e2e import changes, clients
+from orv_e2e import changes, clients, programs
 from orv_e2e.changes import GROUP, LOGS, add, delete
 
 ROLES = {"AuditAdmin": 0x02, "ReplicationAdmin": 0x0C, "SchemaAdmin": 0x10,
@@ -163,22 +163,39 @@ def test_supplier_and_stranger_change_nothing(members, module_instance):
 
 # ---- other spellings of the same
 
-@pytest.mark.parametrize("spelling", [
+# Legal spellings of CN=AUDIT,CN=LOG MANAGEMENT,CN=CONFIGURATION, which meet the rule ...
+SPELLINGS_OF_AUDIT = [
     "CN=AUDIT,CN=LOG MANAGEMENT,CN=CONFIGURATION", "cn=Audit , cn = Log  Management,cn=Configuration",
+    "  cn=audit,cn=log management,cn=configuration  ",
     "2.5.4.3=audit,cn=log management,cn=configuration",
-    "oid.2.5.4.3=audit,cn=log management,cn=configuration",
     "commonName=audit,cn=log management,cn=configuration",
     "cn=\\61udit,cn=log\\20management,cn=configuration",
     "cn=#04056175646974,cn=log management,cn=configuration",
-    "cn=audit,cn=log management,cn=#040D436F6E66696775726174696F6E"])
-def test_no_spelling_of_a_name_steps_around_a_rule(members, spelling):
+    "cn=audit,cn=log management,cn=#040D436F6E66696775726174696F6E",
+    "cn=\uff41\uff55\uff44\uff49\uff54,cn=log management,cn=configuration",  # full width
+    "cn=au\u00addit,cn=log management,cn=configuration"]              # soft hyphen
+# ... and texts that are no DNs by RFC 4514.
+NO_DNS = [
+    "oid.2.5.4.3=audit,cn=log management,cn=configuration",
+    "cn=audit;cn=log management;cn=configuration",
+    "cn=\"audit\",cn=log management,cn=configuration",
+    "cn=#0405617564697,cn=log management,cn=configuration",
+    "cn=#0406617564697400,cn=log management,cn=configuration",
+    "cn=audit\\00,cn=log management,cn=configuration",
+    "cn=audit,,cn=log management,cn=configuration",
+    "cn;lang-en=audit,cn=log management,cn=configuration"]
+
+
+@pytest.mark.parametrize("spelling, code", [(spelling, 50) for spelling in SPELLINGS_OF_AUDIT]
+                         + [(text, 34) for text in NO_DNS])
+def test_no_spelling_of_a_name_steps_around_a_rule(members, spelling, code):
     root = members["root"]
     clerk = members[("ServerConfigGroupMember",)]
     dn, attributes = ENTRIES["audit"]
     put(root, dn, attributes)
-    assert delete(clerk, spelling) in (34, 50)
+    assert delete(clerk, spelling) == code
     take_away(root, dn)
-    assert add(clerk, spelling, attributes) in (34, 50)
+    assert add(clerk, spelling, attributes) == (code if programs.fits_code_page(spelling) else 21)
     assert not is_there(root, dn)
     put(root, dn, attributes)
 
@@ -189,20 +206,21 @@ def test_no_spelling_of_a_name_steps_around_a_rule(members, spelling):
 def test_no_spelling_of_the_group_lets_a_member_in(members, place):
     clerk = members[("ServerConfigGroupMember",)]
     _, attributes = changes.member("intruder")
-    assert add(clerk, "cn=intruder," + place, attributes) in (34, 50)
+    assert add(clerk, "cn=intruder," + place, attributes) == 50
     assert not is_there(members["root"], "cn=intruder," + GROUP)
 
 
 @pytest.mark.parametrize("type_name", ["objectClass", "OBJECTCLASS", "2.5.4.0"])
-@pytest.mark.parametrize("class_name", ["orv-slapdSupplier", "ORV-SLAPDSUPPLIER", None,
-                                        "orv-slapdSupplier ", "orv-slapdSupplier\0"])
-def test_no_spelling_of_a_class_makes_a_supplier(members, type_name, class_name):
+@pytest.mark.parametrize("class_name, code", [
+    ("orv-slapdSupplier", 50), ("ORV-SLAPDSUPPLIER", 50), (None, 50),
+    ("orv-slapdSupplier ", 65), ("orv-slapdSupplier\0", 21)])
+def test_no_spelling_of_a_class_makes_a_supplier(members, type_name, class_name, code):
     clerk = members[("ServerConfigGroupMember",)]
     given = class_name or changes.numbers_of_classes()["orv-slapdSupplier"]
     dn, attributes = changes.supplier("smuggled", dn="cn=smuggled," + changes.PLACE)
     del attributes["objectClass"]
     attributes[type_name] = ["top", "orv-slapdConfigEntry", given]
-    assert add(clerk, dn, attributes) in (21, 50, 65)
+    assert add(clerk, dn, attributes) == code
     assert not is_there(members["root"], dn)
 
 
@@ -224,3 +242,28 @@ def test_types_by_number_are_stored_under_their_names(members, module_instance):
     assert set(attributes) < set(stored)
     assert stored["objectClass"] == [name.encode() for name in attributes["objectClass"]]
     take_away(members["root"], dn)
+
+
+# ---- the order of the checks
+
+def test_roles_are_asked_for_only_where_an_entry_fits_the_schema(members):
+    idle = members[()]
+    dn, attributes = changes.container("misfit")
+    misfit = {**attributes, "orv-slapdPort": ["1"]}
+    assert add(idle, dn, attributes) == 50
+    assert add(idle, dn, misfit) == 65
+    assert add(idle, "cn=schemas,cn=configuration", misfit) == 68
+    assert add(idle, "cn=misfit,cn=nowhere,cn=configuration", misfit) == 32
+    # What is decided without the configuration comes before all of this.
+    assert add(idle, "cn=schemas,cn=configuration", {**misfit, "noSuchType": ["x"]}) == 17
+    assert add(idle, "cn=misfit", misfit) == 32
+    assert add(idle, "", misfit) == 53
+    assert add(idle, "misfit", misfit) == 34
+    assert not is_there(members["root"], dn)
+
+
+def test_missing_entry_is_told_before_the_roles(members):
+    assert delete(members[()], "cn=nowhere,cn=configuration") == 32
+    assert changes.modify(members[()], "cn=nowhere,cn=configuration",
+                          changes.replaced("description", "x")) == 32
+    assert delete(members[()], "cn=schemas,cn=configuration") == 50

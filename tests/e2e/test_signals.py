@@ -148,11 +148,21 @@ def test_access_log_names_operations_but_no_password(server):
     with pytest.raises(ldap.PROTOCOL_ERROR):
         client.extop_s(ExtendedRequest("1.2.3.4", b"an extended password"))
     clients.search(client, filter_text="(orv-slapdAdminPW=a filtered password)")
+    named = "orv-slapdAdminPW=a named password,cn=configuration"
+    with pytest.raises(ldap.LDAPError):
+        clients.search(client, base=named)
+    with pytest.raises(ldap.LDAPError):
+        client.delete_s(named)
+    with pytest.raises(ldap.LDAPError):
+        client.add_s(named, [("objectClass", [b"top"])])
+    with pytest.raises(ldap.LDAPError):
+        clients.bind(server, who=named, password="x")
     password = server.password.encode()
     server.stop()
     logged = server.access_log.read_bytes() + server.stderr.text().encode()
     assert b"audit" in logged.lower()
-    for secret in (password, b"a very wrong", b"a guessed", b"a filtered", b"an extended"):
+    for secret in (password, b"a very wrong", b"a guessed", b"a filtered", b"an extended",
+                   b"a named"):
         assert secret not in logged
 
 

@@ -21,6 +21,16 @@ BLOCK = re.compile(r"^```sh\n(.*?)^```$", re.MULTILINE | re.DOTALL)
 # These run this check themselves.
 RUN_ELSEWHERE = {"./test", ".ci/run"}
 FIRST_BUILD_SECONDS = 1800
+# What the commands have to print, besides ending well.
+EXPECTED = {
+    "the configuration tree": "dn: CN=CONFIGURATION",
+    "the change of a setting": 'modifying entry "cn=configuration"',
+    "a search that meets the changed limit": "result: 4 Size limit exceeded",
+    "the change of a member's own password":
+        'modifying entry "cn=alice,cn=admingroup,cn=configuration"',
+    "what the member reads with it": "dn: cn=alice,CN=ADMINGROUP,CN=CONFIGURATION",
+    "the check of the file": "nothing wrong",
+}
 
 
 def commands(text):
@@ -94,6 +104,11 @@ def run(place, line, found):
     return result.stdout
 
 
+def unseen(output):
+    return [f"README.md: no command printed {what} ({text})"
+            for what, text in EXPECTED.items() if text.lower() not in output.lower()]
+
+
 def main():
     options = findings.arguments(__doc__)
     lines = commands(findings.read(options.source, "README.md"))
@@ -111,8 +126,7 @@ def main():
         if server:
             stop(server, found)
         place.clean()
-    if "dn: CN=CONFIGURATION" not in output:
-        found.append("README.md: no command printed the configuration tree")
+    found += unseen(output)
     findings.conclude(found, f"commands of README.md ({len(lines)})")
 
 

@@ -9,6 +9,8 @@ sys.path.insert(0, os.path.dirname(os.path.abspath(__file__)))
 
 import check_arrows  # noqa: E402
 import check_configuration_doc  # noqa: E402
+import check_named_tests  # noqa: E402
+import check_readme  # noqa: E402
 import check_schema  # noqa: E402
 import check_tests_built  # noqa: E402
 import check_words  # noqa: E402
@@ -114,6 +116,35 @@ class Schema(Tree):
                      "orv-slapdPort has several values"):
             self.assertIn(f"CN=CONFIGURATION: {text}", found)
         self.assertIn("CN=ADMINGROUP,CN=CONFIGURATION: is missing", found)
+
+
+class NamedTests(Tree):
+    HEAD = "| operation | what guards it | test |\n|---|---|---|\n"
+
+    def test_tests_that_exist_pass(self):
+        self.write("tests/e2e/test_x.py", "def test_one(root):\n    pass\n")
+        text = self.HEAD + "| add | roles | `test_x.py::test_one` |\n"
+        self.assertEqual(check_named_tests.missing(self.top, text), [])
+        self.assertEqual(check_named_tests.unproved(text), [])
+
+    def test_missing_tests_and_files_are_found(self):
+        self.write("tests/e2e/test_x.py", "def test_one(root):\n    def test_two():\n")
+        self.assertEqual(
+            check_named_tests.missing(self.top, "`test_x.py::test_two` `test_y.py::test_one`"),
+            ["README.md: there is no test test_x.py::test_two",
+             "README.md: there is no test test_y.py::test_one"])
+
+    def test_rows_without_a_test_are_found(self):
+        rows = "| add | roles | `test_x.py::test_one` |\n| delete | roles | `test_x.py` |\n"
+        self.assertEqual(check_named_tests.unproved(self.HEAD + rows + "\n"),
+                         ["README.md: names no test: | delete | roles | `test_x.py` |"])
+        self.assertEqual(len(check_named_tests.unproved("no table")), 1)
+
+
+class Readme(unittest.TestCase):
+    def test_output_that_is_missing_is_found(self):
+        self.assertEqual(check_readme.unseen("\n".join(check_readme.EXPECTED.values())), [])
+        self.assertEqual(len(check_readme.unseen("")), len(check_readme.EXPECTED))
 
 
 class ConfigurationDoc(unittest.TestCase):

@@ -71,6 +71,35 @@ def delete(client, dn):
     return _code(client.delete_s, dn)
 
 
+def modify(client, dn, *modifications):
+    """The result code of a modify of (operation, type, values); values as texts, or None."""
+    return refusal(client, dn, *modifications)[0]
+
+
+def refusal(client, dn, *modifications):
+    """The code and the text of the result."""
+    as_bytes = [(operation, name, values and [
+        value if isinstance(value, bytes) else value.encode() for value in values])
+        for operation, name, values in modifications]
+    try:
+        client.modify_s(dn, as_bytes)
+        return 0, ""
+    except ldap.LDAPError as error:
+        return error.args[0]["result"], error.args[0].get("info", "")
+
+
+def added(name, *values):
+    return ldap.MOD_ADD, name, list(values)
+
+
+def deleted(name, *values):
+    return ldap.MOD_DELETE, name, list(values) or None
+
+
+def replaced(name, *values):
+    return ldap.MOD_REPLACE, name, list(values) or None
+
+
 def difference(before, after):
     """The lines that a change took out and put in, in their order, as from a version control."""
     removed, added = [], []

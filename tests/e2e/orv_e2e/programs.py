@@ -26,6 +26,19 @@ def sanitized():
     return bool(os.environ.get("ORV_SANITIZE"))
 
 
+def code_page():
+    """The code page of configuration files: that of the locale that the environment names."""
+    _, dot, name = os.environ.get("LC_ALL", "").partition(".")
+    return name if dot else "utf-8"
+
+
+def fits_code_page(text):
+    try:
+        return bool(text.encode(code_page())) or not text
+    except UnicodeEncodeError:
+        return False
+
+
 # Seconds after which something that should have happened is a failure. Nothing waits this long
 # unless it fails.
 DEADLINE = 60.0 if sanitized() else 20.0
