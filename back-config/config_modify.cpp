@@ -1,8 +1,6 @@
 #include "config_modify.h"
 
-#include <algorithm>
 #include <cerrno>
-#include <climits>
 #include <cstdlib>
 #include <cstring>
 #include <memory>
@@ -898,9 +896,9 @@ constexpr NumberSetting kNumberSettings[] = {
     {"passwordMinDiffChars", &_Admin_pwdPolicy::passwordMinDiffChars},
 };
 
-// What is too large for the member stays too large, instead of wrapping into the allowed range.
+// What an int cannot hold wraps; the server refuses such numbers before it asks.
 int number_of(const char* value) {
-  return static_cast<int>(std::clamp<long>(std::atol(value), INT_MIN, INT_MAX));
+  return static_cast<int>(std::atol(value));
 }
 
 // Puts the modification's value into the policy, whatever its code. False for a type that is none
@@ -1196,17 +1194,22 @@ int check_schema_before_roles(ModifyRequest& request) {
 // ---- Step 4: who is kept out, and what a supplier may do
 
 // A supplier of a suffix has to be that of each suffix that it adds. Each answer of the server is
-// kept in the operation.
+// kept in the operation. Only an answer ends the walk: behind another attribute, which is refused
+// in any case, the server is still asked about the suffixes that follow.
 int check_supplied_suffixes(const ModifyRequest& request) {
   Operation& operation = *request.operation;
+  int rc = result::success;
   for (const ldapmod* m = request.modifications; m != nullptr; m = m->mod_next) {
-    if (!is_of_type(*m, config_names::suffix)) return result::insufficient_access;
+    if (!is_of_type(*m, config_names::suffix)) {
+      rc = result::insufficient_access;
+      continue;
+    }
     for (std::size_t i = 0; const char* suffix = value_text(*m, i); ++i) {
       operation.master_server_result = checkMasterSrvDn(suffix, operation.bound_dn);
       if (operation.master_server_result == 0) return result::insufficient_access;
     }
   }
-  return result::success;
+  return rc;
 }
 
 // All that a supplier does here is to add suffixes to the directory backend.

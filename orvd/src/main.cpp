@@ -436,6 +436,9 @@ int run(const Options& options, const FileIdentity& standard_error) {
         announce_controls();
         status = serve(options, settings, guarded, logs, audit, identities, place);
         recorded = audit.finish();
+        // The end is asked for already: being told once more must not cut it short.
+        std::signal(SIGTERM, SIG_IGN);
+        std::signal(SIGINT, SIG_IGN);
       }
     }
   }

@@ -13,14 +13,7 @@ DEFAULT_ROLES = {b"DirDataAdmin", b"PasswordAdmin", b"SchemaAdmin", b"ServerConf
 
 
 def bind_code(instance, who, password=PASSWORD):
-    client = clients.connect(instance)
-    try:
-        client.simple_bind_s(who, password)
-        return 0
-    except ldap.LDAPError as error:
-        return error.args[0]["result"]
-    finally:
-        client.unbind_s()
+    return clients.bind_code(instance, who, password)
 
 
 def ldif(tmp_path, dn, attributes):

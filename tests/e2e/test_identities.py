@@ -69,18 +69,6 @@ def admin_password_as_stored(config):
     return entries[clients.BASE]["orv-slapdAdminPW"][0].decode()
 
 
-def bind_code(instance, who, password):
-    """The result of a bind as python3-ldap reports it; 0 for success."""
-    client = clients.connect(instance)
-    try:
-        client.simple_bind_s(who, password)
-        return 0
-    except ldap.LDAPError as error:
-        return error.args[0]["result"]
-    finally:
-        client.unbind_s()
-
-
 def search_code(instance, who, password):
     client = clients.connect(instance)
     if who is not None:
@@ -97,19 +85,19 @@ def search_code(instance, who, password):
 @pytest.mark.parametrize("spelling", ["cn=root", "CN=ROOT", "cn = Root", "2.5.4.3=root",
                                       "cn=\\72oot", "commonName=root"])
 def test_administrator_binds_under_every_spelling_of_its_name(people, spelling):
-    assert bind_code(people, spelling, people.password) == 0
+    assert clients.bind_code(people, spelling, people.password) == 0
 
 
 @pytest.mark.parametrize("name, password", [
     ("clear", "in the open"), ("hashed", "salted"), ("ssha256", "salted 256"),
     ("ssha", "salted 1"), ("derived", "derived")])
 def test_member_binds_with_a_password_stored_as(people, name, password):
-    assert bind_code(people, "cn=" + name, password) == 0
-    assert bind_code(people, "cn=" + name, password + "x") == 49
+    assert clients.bind_code(people, "cn=" + name, password) == 0
+    assert clients.bind_code(people, "cn=" + name, password + "x") == 49
 
 
 def test_member_with_a_comma_in_its_name_binds(people):
-    assert bind_code(people, "CN=o\\2c brien,O=X", "in the open") == 0
+    assert clients.bind_code(people, "CN=o\\2c brien,O=X", "in the open") == 0
 
 
 @pytest.mark.parametrize("who, password", [
@@ -117,17 +105,17 @@ def test_member_with_a_comma_in_its_name_binds(people):
     ("cn=unknown", "{ROT13}frperg"), ("cn=unknown", "secret"), ("cn=malformed", "{SSHA512}!!!!"),
     ("cn=hashed", "{SSHA512}"), ("dc=example,dc=com", "in the open")])
 def test_wrong_credentials_are_answered_49(people, who, password):
-    assert bind_code(people, who, password) == 49
+    assert clients.bind_code(people, who, password) == 49
 
 
 def test_stored_form_of_a_password_is_no_password(people):
     stored = admin_password_as_stored(people.config)
-    assert bind_code(people, "cn=root", stored) == 49
+    assert clients.bind_code(people, "cn=root", stored) == 49
 
 
 def test_sealed_password_copied_into_another_entry_matches_nothing(people):
-    assert bind_code(people, "cn=thief", people.password) == 49
-    assert bind_code(people, "cn=thief", admin_password_as_stored(people.config)) == 49
+    assert clients.bind_code(people, "cn=thief", people.password) == 49
+    assert clients.bind_code(people, "cn=thief", admin_password_as_stored(people.config)) == 49
 
 
 @pytest.mark.parametrize("who", [
@@ -135,24 +123,24 @@ def test_sealed_password_copied_into_another_entry_matches_nothing(people):
     "cn=clear,cn=admingroup,cn=configuration", "cn=missing,cn=configuration", MASTER])
 def test_nobody_binds_as_an_entry_of_the_configuration(people, who):
     for password in ["in the open", people.password, "supplies"]:
-        assert bind_code(people, who, password) == 49
+        assert clients.bind_code(people, who, password) == 49
 
 
 def test_member_whose_name_lies_in_the_configuration_cannot_bind(people):
-    assert bind_code(people, "cn=digest,cn=configuration", "in the open") == 49
+    assert clients.bind_code(people, "cn=digest,cn=configuration", "in the open") == 49
 
 
 def test_name_that_two_members_claim_is_nobodys(people):
-    assert bind_code(people, "cn=twin", "twin password") == 49
+    assert clients.bind_code(people, "cn=twin", "twin password") == 49
 
 
 def test_member_entry_outside_the_group_is_no_identity(people):
-    assert bind_code(people, "cn=stray", "in the open") == 49
+    assert clients.bind_code(people, "cn=stray", "in the open") == 49
 
 
 @pytest.mark.parametrize("who", ["cn=root", "cn=nobody", "cn=digest,cn=configuration"])
 def test_name_without_password_is_answered_53(people, who):
-    assert bind_code(people, who, "") == 53
+    assert clients.bind_code(people, who, "") == 53
 
 
 def test_failed_bind_leaves_the_connection_anonymous(people):
@@ -171,7 +159,7 @@ def test_anonymous_bind_takes_the_rights_away(people):
 
 
 def test_bind_with_a_name_that_is_no_dn_is_refused(people):
-    assert bind_code(people, "root", "wrong") in (34, 49)
+    assert clients.bind_code(people, "root", "wrong") in (34, 49)
 
 
 def test_version_2_is_refused(people):
@@ -202,7 +190,7 @@ def test_anonymous_learns_not_whether_an_entry_exists(people):
 
 @pytest.mark.parametrize("who", ["cn=supplier", "cn=near supplier"])
 def test_supplier_binds_but_may_not_read_the_configuration(people, who):
-    assert bind_code(people, who, "supplies") == 0
+    assert clients.bind_code(people, who, "supplies") == 0
     assert search_code(people, who, "supplies") == 50
 
 
@@ -214,14 +202,14 @@ def test_no_member_binds_while_the_group_is_switched_off(instance):
     instance.config.add_member("alice", "in the open")
     instance.config.set(clients.BASE, "orv-slapdAdminGroupEnabled", "FALSE")
     instance.start()
-    assert bind_code(instance, "cn=alice", "in the open") == 49
-    assert bind_code(instance, "cn=root", instance.password) == 0
+    assert clients.bind_code(instance, "cn=alice", "in the open") == 49
+    assert clients.bind_code(instance, "cn=root", instance.password) == 0
 
 
 def test_member_added_by_hand_binds_at_once(server):
-    assert bind_code(server, "cn=alice", "in the open") == 49
+    assert clients.bind_code(server, "cn=alice", "in the open") == 49
     server.config.add_member("alice", "in the open")
-    assert bind_code(server, "cn=alice", "in the open") == 0
+    assert clients.bind_code(server, "cn=alice", "in the open") == 0
 
 
 def test_example_member_of_the_default_configuration_needs_only_a_password(server):
@@ -236,16 +224,16 @@ def test_example_member_of_the_default_configuration_needs_only_a_password(serve
     # The line that was "#" alone separates the record from the comment above it.
     server.config.replace(text[:start].removesuffix(b"#\n") + b"\n" + b"\n".join(chosen) + b"\n\n"
                           + rest)
-    assert bind_code(server, "cn=alice", "chosen") == 0
-    assert bind_code(server, clients.ADMINISTRATOR, server.password) == 0
+    assert clients.bind_code(server, "cn=alice", "chosen") == 0
+    assert clients.bind_code(server, clients.ADMINISTRATOR, server.password) == 0
 
 
 def test_member_removed_by_hand_is_gone_at_once(instance):
     instance.config.add_member("alice", "in the open")
     instance.start()
-    assert bind_code(instance, "cn=alice", "in the open") == 0
+    assert clients.bind_code(instance, "cn=alice", "in the open") == 0
     instance.config.remove("cn=alice,cn=admingroup,cn=configuration")
-    assert bind_code(instance, "cn=alice", "in the open") == 49
+    assert clients.bind_code(instance, "cn=alice", "in the open") == 49
 
 
 def test_connection_of_a_member_removed_by_hand_ends_without_anybody_binding(instance):
@@ -275,7 +263,7 @@ def test_connection_of_a_member_ends_when_what_kept_its_removal_from_being_read_
 def test_administrator_cannot_bind_under_another_key_than_the_sealing_one(instance):
     instance.key_stash.write_text("orv-key-1 " + "5a" * 32 + "\n")
     instance.start()
-    assert bind_code(instance, "cn=root", instance.password) == 49
+    assert clients.bind_code(instance, "cn=root", instance.password) == 49
     assert instance.stderr.wait_for(
         re.compile("warning CN=CONFIGURATION: orv-slapdAdminPW does not open with the key").search)
 

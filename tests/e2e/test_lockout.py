@@ -11,14 +11,7 @@ FAILURES = 3
 
 
 def bind_code(instance, password, who="cn=carol"):
-    client = clients.connect(instance)
-    try:
-        client.simple_bind_s(who, password)
-        return 0
-    except ldap.LDAPError as error:
-        return error.args[0]["result"]
-    finally:
-        client.unbind_s()
+    return clients.bind_code(instance, who, password)
 
 
 def replace(client, dn, name, value):

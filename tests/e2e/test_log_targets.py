@@ -5,7 +5,7 @@ import signal
 
 import pytest
 
-from orv_e2e import changes, clients
+from orv_e2e import clients
 from orv_e2e.changes import LOGS, add, delete
 
 ACCESS_LOG = "cn=access," + LOGS

@@ -18,17 +18,6 @@ def values_of(client, dn, name):
     return clients.read(client, dn, [name]).get(name, [])
 
 
-def bind_code(instance, who, password):
-    client = clients.connect(instance)
-    try:
-        client.simple_bind_s(who, password)
-        return 0
-    except ldap.LDAPError as error:
-        return error.args[0]["result"]
-    finally:
-        client.unbind_s()
-
-
 @pytest.fixture(name="place")
 def place_fixture(root):
     dn, attributes = container("to be changed")
@@ -94,8 +83,8 @@ def test_member_that_changes_its_own_password_hears_of_it_before_it_is_disconnec
     assert modify(carol, "cn=carol," + GROUP, replaced("orv-slapdAdminPW", NEW_PASSWORD)) == 0
     with pytest.raises(ldap.LDAPError):
         clients.search(other)
-    assert bind_code(server, "cn=carol", PASSWORD) == 49
-    assert bind_code(server, "cn=carol", NEW_PASSWORD) == 0
+    assert clients.bind_code(server, "cn=carol", PASSWORD) == 49
+    assert clients.bind_code(server, "cn=carol", NEW_PASSWORD) == 0
 
 
 def test_member_that_loses_a_role_is_disconnected(server, root):
@@ -113,7 +102,7 @@ def test_members_are_disconnected_when_the_group_is_switched_off(server, root):
     assert modify(root, TOP, replaced("orv-slapdAdminGroupEnabled", "FALSE")) == 0
     with pytest.raises(ldap.LDAPError):
         clients.search(carol)
-    assert bind_code(server, "cn=carol", PASSWORD) == 49
+    assert clients.bind_code(server, "cn=carol", PASSWORD) == 49
 
 
 def test_member_may_not_send_more_than_the_one_modification_of_its_password(server, root):

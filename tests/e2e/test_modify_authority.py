@@ -9,7 +9,6 @@ import itertools
 import os
 import subprocess
 
-import ldap
 import pytest
 
 from orv_e2e import authority, changes, clients, programs

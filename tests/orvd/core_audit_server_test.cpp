@@ -35,6 +35,7 @@ class AuditedServer : public test::LoopbackServer {
   }
   ~AuditedServer() override {
     stop();
+    server.reset();  // before the log that it writes to
     std::filesystem::remove_all(folder);
   }
 

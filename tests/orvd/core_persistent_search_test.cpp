@@ -228,7 +228,10 @@ class DeletionIn : public OneSearch {
     set_local_code_page(code_page);
     ASSERT_EQ(initIconvHandle(), 0);
   }
-  void TearDown() override { speak("UTF-8"); }
+  void TearDown() override {
+    for (const PersistentSearchPtr& search : joined) all.leave(*search);
+    speak("UTF-8");
+  }
 
   // As the backend keeps it: values are given in UTF-8 and come into the entry's code page.
   static EntryPtr deleted(const char* dn, const std::string& description) {
@@ -248,6 +251,7 @@ class DeletionIn : public OneSearch {
                                            request, "CN=ADMINGROUP,CN=CONFIGURATION", filter);
     EXPECT_TRUE(all.count(*search, 10));
     EXPECT_TRUE(all.join(search));
+    joined.push_back(search);
     return search;
   }
   void announce(EntryPtr before) {
@@ -255,6 +259,7 @@ class DeletionIn : public OneSearch {
   }
 
   PersistentSearches all;
+  std::vector<PersistentSearchPtr> joined;
 };
 
 TEST_F(DeletionIn, AnotherCodePageMatchesByCharactersAndIsToldInUtf8) {

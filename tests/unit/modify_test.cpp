@@ -625,11 +625,19 @@ TEST_F(ModifyBySupplier, RefusalOfTheSchemaNotesTheFirstAnswerNevertheless) {
   EXPECT_EQ(operation.master_server_result, 4);
 }
 
-TEST_F(ModifyBySupplier, WalkEndsAtTheFirstOtherAttribute) {
+TEST_F(ModifyBySupplier, WalkGoesOnBehindAnotherAttribute) {
   EXPECT_EQ(modify({{kAdd, "description", {{"x"}}}, {kAdd, kSuffix, {{"O=A"}}}}), 50);
   expect_answered(50);
-  EXPECT_THAT(platform.calls({"checkMasterSrvDn"}),
-              ElementsAre("checkMasterSrvDn(null, \"CN=S\")"));
+  EXPECT_THAT(
+      platform.calls({"checkMasterSrvDn"}),
+      ElementsAre("checkMasterSrvDn(null, \"CN=S\")", "checkMasterSrvDn(\"O=A\", \"CN=S\")"));
+  EXPECT_EQ(operation.master_server_result, 5);
+}
+
+TEST_F(ModifyBySupplier, WalkEndsAtTheFirstRefusal) {
+  EXPECT_EQ(modify({{kAdd, kSuffix, {{"O=X"}}}, {kAdd, kSuffix, {{"O=A"}}}}), 50);
+  EXPECT_EQ(platform.count("checkMasterSrvDn"), 2);
+  EXPECT_EQ(operation.master_server_result, 0);
 }
 
 TEST_F(ModifyBySupplier, WalkAsksForEveryModification) {

@@ -34,6 +34,18 @@ def bind(instance, who=ADMINISTRATOR, password=None):
     return client
 
 
+def bind_code(instance, who, password):
+    """The result of a bind as python3-ldap reports it; 0 for success."""
+    client = connect(instance)
+    try:
+        client.simple_bind_s(who, password)
+        return 0
+    except ldap.LDAPError as error:
+        return error.args[0]["result"]
+    finally:
+        client.unbind_s()
+
+
 def search(client, base=BASE, scope=ldap.SCOPE_SUBTREE, filter_text="(objectClass=*)",
            attributes=None, types_only=0):
     """The entries as a dictionary from comparable DN to attributes."""
