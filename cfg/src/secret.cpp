@@ -280,8 +280,9 @@ bool verify_pbkdf2(const EVP_MD* type, std::string_view rest, std::string_view c
     return false;
   }
   std::array<unsigned char, EVP_MAX_MD_SIZE> made{};
-  if (salt.empty() || salt.size() > kMaxSaltLength || hash.size() < 16 ||
-      hash.size() > made.size()) {
+  // A shorter hash is the beginning of the whole one, so one that was cut would match as well.
+  if (salt.empty() || salt.size() > kMaxSaltLength ||
+      hash.size() != static_cast<std::size_t>(EVP_MD_get_size(type))) {
     return false;
   }
   if (PKCS5_PBKDF2_HMAC(clear.data(), static_cast<int>(clear.size()), bytes_of(salt),
