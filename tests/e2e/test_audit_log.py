@@ -389,6 +389,7 @@ def test_modifications_show_no_password_in_any_form(server, root, value):
                 client.modify_s(member_dn("alice"), modifications)
             except ldap.LDAPError:
                 pass
+    server.stop()
     text = log_of(server).read_bytes()
     folded = text.replace(b"\n ", b"")
     assert value not in folded and base64.b64encode(value).rstrip(b"=")[:-1] not in folded
