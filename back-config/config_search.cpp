@@ -122,7 +122,6 @@ template class AutoFree<char>;
 
 namespace {
 
-constexpr unsigned kAnySupplier = authority::supplier_of_server | authority::supplier_of_suffix;
 constexpr int kServerOfMarkedCallers = 3;
 constexpr int kMarked = 1;
 
@@ -135,10 +134,7 @@ int has_search_authority(const Connection* /*connection*/, const Operation* oper
       operation->server_kind_marker != kMarked) {
     return trace.exit(result::no_such_object);
   }
-  if ((operation->authority & kAnySupplier) != 0) return trace.exit(result::insufficient_access);
-  if (operation->authority == authority::no_configuration_access) {
-    return trace.exit(result::insufficient_access);
-  }
+  if (has_no_configuration_access(*operation)) return trace.exit(result::insufficient_access);
   return trace.exit(result::success);
 }
 

@@ -16,6 +16,7 @@
 #include "cfg/dn.h"
 #include "cfg/owners.h"
 #include "cfg/result_codes.h"
+#include "local_text.h"
 #include "messages.h"
 #include "slapi/codepage.h"
 #include "slapi/dn.h"
@@ -120,6 +121,15 @@ struct ReadFailure {
   int code;
 };
 
+// Texts of the file are in its own code page. False for what is no DN. Throws std::bad_alloc.
+bool normalize(std::string_view dn, std::string& normal) {
+  std::string utf8;
+  const int rc = slapi::local_to_utf8(dn, utf8) ? cfg::normalize_dn(utf8, normal)
+                                                : static_cast<int>(result::invalid_dn_syntax);
+  if (rc == result::no_memory) throw std::bad_alloc();
+  return rc == result::success;
+}
+
 // Throws ReadFailure and std::bad_alloc.
 class AdministratorReader {
  public:
@@ -188,17 +198,6 @@ class AdministratorReader {
 
   static bool is_empty(const CfgValues& values) noexcept {
     return values == nullptr || values.get()[0] == nullptr;
-  }
-
-  // Texts of the file are in its own code page. False for what is no DN.
-  static bool normalize(const char* dn, std::string& normal) {
-    char* converted = nullptr;
-    std::size_t length = 0;
-    int rc = xlate_localcp_to_utf8(dn, &converted, &length);
-    const MallocText text(converted);
-    if (rc == result::success) rc = cfg::normalize_dn(text.get(), normal);
-    if (rc == result::no_memory) throw std::bad_alloc();
-    return rc == result::success;
   }
 
   static PasswordDigest digest(std::string_view stored) {
@@ -328,13 +327,8 @@ void settle_password_changes(bool written) noexcept try {
 
 AdminPasswordRecord* findAdminPWDPAttrib(const char* dn) try {
   if (dn == nullptr) return nullptr;
-  char* converted = nullptr;
-  std::size_t length = 0;
-  const int rc = xlate_localcp_to_utf8(dn, &converted, &length);
-  const MallocText text(converted);
   std::string normal;
-  if (rc != result::success || cfg::normalize_dn(text.get(), normal) != result::success)
-    return nullptr;
+  if (!normalize(dn, normal)) return nullptr;
   Known& all = known();
   const std::lock_guard lock(all.mutex);
   return all.find(normal);

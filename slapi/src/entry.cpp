@@ -13,6 +13,7 @@
 #include "cfg/result_codes.h"
 #include "cfg/text.h"
 #include "equality.h"
+#include "local_text.h"
 #include "memory.h"
 #include "slapi/codepage.h"
 #include "slapi/dn.h"
@@ -68,7 +69,7 @@ berval* adopt_value(slapi::MallocPtr<char> text, std::size_t length) noexcept {
 int text_for_entry(const entry& e, const berval& value, slapi::MallocPtr<char>& text,
                    std::size_t& length) noexcept {
   char* converted = nullptr;
-  if (e.local_code_page && !local_code_page_is_utf8() && value.bv_val != nullptr) {
+  if (slapi::has_foreign_texts(e) && value.bv_val != nullptr) {
     const int rc = xlate_utf8_to_localcp(value.bv_val, &converted, &length);
     if (rc != result::success) return rc;
     --length;  // the converter counts the NUL
@@ -177,14 +178,9 @@ void set_object_classes(entry& e, attr* classes, slapi::MallocPtr<ShortValue> li
 // The equality key of a value of an entry, in whatever code page it holds its texts: letters of
 // another one than UTF-8 have no case until they are converted.
 std::string key_in(const entry& e, cfg::MatchingRule rule, std::string_view value) {
-  if (!e.local_code_page || local_code_page_is_utf8()) return slapi::equality_key(rule, value);
-  const std::string local(value);
-  char* converted = nullptr;
-  std::size_t length = 0;
-  const int rc = xlate_localcp_to_utf8(local.c_str(), &converted, &length);
-  const slapi::MallocPtr<char> utf8(converted);
-  if (rc == result::no_memory) throw std::bad_alloc();
-  return slapi::equality_key(rule, rc == result::success ? std::string_view(utf8.get()) : value);
+  std::string utf8;
+  return slapi::equality_key(
+      rule, slapi::has_foreign_texts(e) && slapi::local_to_utf8(value, utf8) ? utf8 : value);
 }
 
 // Whether one of the added values is there already, in the attribute or among those added before

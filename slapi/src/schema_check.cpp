@@ -11,6 +11,7 @@
 #include "cfg/masked_dn.h"
 #include "cfg/result_codes.h"
 #include "equality.h"
+#include "local_text.h"
 #include "memory.h"
 #include "messages.h"
 #include "slapi/codepage.h"
@@ -153,7 +154,7 @@ class EntryCheck {
   int check_one_value(const SchemaAttribute& type, const berval& value) {
     const char* problem = "";
     int rc = result::success;
-    if (!is_foreign() || type.secret) {
+    if (!slapi::has_foreign_texts(entry_) || type.secret) {
       rc = check_value(type, bytes_of(value), &problem);
     } else if (std::string text; to_utf8(bytes_of(value), text)) {
       rc = check_value(type, text, &problem);
@@ -204,25 +205,9 @@ class EntryCheck {
 
   // ---- Texts
 
-  // Whether texts of the entry are in a code page other than UTF-8.
-  [[nodiscard]] bool is_foreign() const noexcept {
-    return entry_.local_code_page && !local_code_page_is_utf8();
-  }
-
   // False for text that the code page lacks. It came from the file, where it stays as it is.
   bool to_utf8(std::string_view text, std::string& utf8) const {
-    if (!is_foreign()) {
-      utf8 = text;
-      return true;
-    }
-    char* converted = nullptr;
-    std::size_t length = 0;
-    const int rc = xlate_localcp_to_utf8(std::string(text).c_str(), &converted, &length);
-    const slapi::MallocPtr<char> owned(converted);
-    if (rc == result::no_memory) throw std::bad_alloc();
-    if (rc != result::success) return false;
-    utf8 = converted;
-    return true;
+    return slapi::text_to_utf8(entry_, text, utf8);
   }
 
   // The entry's name for a message, without a password that somebody put into it.
