@@ -63,6 +63,20 @@ class ConcurrentChangeTest : public ChangeTest {
     return add(session, "cn=a,cn=top", kEntry);
   }
 
+  // Two processes, each of which writes so often, with a mark of its own each time. They end with 0
+  // when every write succeeded.
+  static void fork_writers(std::vector<pid_t>& children, int each,
+                           const std::function<bool(const std::string& mark)>& write) {
+    for (int writer = 0; writer < 2; ++writer) {
+      children.push_back(::fork());
+      ASSERT_GE(children.back(), 0);
+      if (children.back() != 0) continue;
+      for (int i = 0; i < each; ++i)
+        if (!write(std::to_string(writer) + "-" + std::to_string(i))) ::_exit(1);
+      ::_exit(0);
+    }
+  }
+
   void expect_tidy() {
     for (const char* leftover : {".new", ".swap", ".save.new"}) {
       EXPECT_FALSE(exists(path_ + leftover)) << leftover;
@@ -78,16 +92,8 @@ TEST_F(ConcurrentChangeTest, TwoProcessesThatWriteLoseNothing) {
   constexpr int kEach = 20;
   write_file(path_, kBefore);
   std::vector<pid_t> children;
-  for (int writer = 0; writer < 2; ++writer) {
-    children.push_back(::fork());
-    ASSERT_GE(children.back(), 0);
-    if (children.back() != 0) continue;
-    for (int i = 0; i < kEach; ++i) {
-      const std::string dn = "cn=" + std::to_string(writer) + "-" + std::to_string(i) + ",cn=top";
-      if (!add_in_turn(dn)) ::_exit(1);
-    }
-    ::_exit(0);
-  }
+  fork_writers(children, kEach,
+               [this](const std::string& mark) { return add_in_turn("cn=" + mark + ",cn=top"); });
   // Meanwhile each reader finds a whole file, and never fewer entries than before.
   std::size_t seen = 0;
   for (std::size_t done = 0; done < children.size();) {
@@ -107,15 +113,7 @@ TEST_F(ConcurrentChangeTest, TwoProcessesThatModifyOneEntryLoseNothing) {
   constexpr int kEach = 15;
   write_file(path_, kBefore);
   std::vector<pid_t> children;
-  for (int writer = 0; writer < 2; ++writer) {
-    children.push_back(::fork());
-    ASSERT_GE(children.back(), 0);
-    if (children.back() != 0) continue;
-    for (int i = 0; i < kEach; ++i) {
-      if (!modify_in_turn(std::to_string(writer) + "-" + std::to_string(i))) ::_exit(1);
-    }
-    ::_exit(0);
-  }
+  fork_writers(children, kEach, [this](const std::string& mark) { return modify_in_turn(mark); });
   for (const pid_t child : children) {
     int status = 0;
     ASSERT_EQ(::waitpid(child, &status, 0), child);

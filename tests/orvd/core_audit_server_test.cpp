@@ -49,18 +49,23 @@ class AuditedServer : public test::LoopbackServer {
     return text.str();
   }
 
+  // Each change waits inside the backend until `let_go` happens.
+  void hold_changes(int code) {
+    backend.on_change = [this, code](pblock*) {
+      entered.happen();
+      let_go.wait();
+      return code;
+    };
+  }
+
+  Event entered;
+  Event let_go;
   std::string folder;
   AuditLog log{[](std::string_view) {}};
 };
 
 TEST_F(AuditedServer, RecordsTheResultOfAChangeThatWasGivenUpMeanwhile) {
-  Event entered;
-  Event let_go;
-  backend.on_change = [&](pblock*) {
-    entered.happen();
-    let_go.wait();
-    return 68;
-  };
+  hold_changes(68);
   start();
   WireClient client(port());
   bind_as_root(client);
@@ -74,13 +79,7 @@ TEST_F(AuditedServer, RecordsTheResultOfAChangeThatWasGivenUpMeanwhile) {
 }
 
 TEST_F(AuditedServer, RecordsWhatWasGivenUpBeforeItsTurn) {
-  Event entered;
-  Event let_go;
-  backend.on_change = [&](pblock*) {
-    entered.happen();
-    let_go.wait();
-    return 0;
-  };
+  hold_changes(0);
   start();
   WireClient first(port());
   bind_as_root(first);
@@ -180,13 +179,7 @@ TEST_F(AuditedSession, RecordsAChangeOnAConnectionWhoseIdentityWasRevokedMeanwhi
 }
 
 TEST_F(AuditedServer, RecordsAChangeWithAMessageIdThatIsInUse) {
-  Event entered;
-  Event let_go;
-  backend.on_change = [&](pblock*) {
-    entered.happen();
-    let_go.wait();
-    return 0;
-  };
+  hold_changes(0);
   start();
   WireClient client(port());
   bind_as_root(client);
