@@ -896,9 +896,10 @@ constexpr NumberSetting kNumberSettings[] = {
     {"passwordMinDiffChars", &_Admin_pwdPolicy::passwordMinDiffChars},
 };
 
-// What an int cannot hold wraps; the server refuses such numbers before it asks.
+// What an int cannot hold wraps; the server refuses such numbers before it asks. A value without
+// digits is 0.
 int number_of(const char* value) {
-  return static_cast<int>(std::atol(value));
+  return static_cast<int>(std::atol(value));  // NOLINT(cert-err34-c)
 }
 
 // Puts the modification's value into the policy, whatever its code. False for a type that is none

@@ -115,7 +115,8 @@ std::string text_of(const std::string& file) {
 bool check_entries(const std::string& file, const std::vector<FileEntry>& entries,
                    const cfg::Key* key, std::ostream& out) {
   FileCheck check(key, out);
-  for (const std::string& line : numbered_types(text_of(file))) check.report(file + ": " + line);
+  const std::string prefix = file + ": ";
+  for (const std::string& line : numbered_types(text_of(file))) check.report(prefix + line);
   for (const FileEntry& entry : entries) check.check(entry);
   return conclude(file, entries.size(), check.problems(), out);
 }
