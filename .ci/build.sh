@@ -43,7 +43,9 @@ ensure_packages() {
 
 install_packages() {
   export DEBIAN_FRONTEND=noninteractive
-  apt-get -q update && apt-get -q -y --no-install-recommends install "$@"
+  # A machine that has just started may be installing updates of its own.
+  apt-get -q update &&
+    apt-get -q -y -o DPkg::Lock::Timeout=600 --no-install-recommends install "$@"
 }
 
 # step LOG TEXT COMMAND...: says TEXT, runs the command with its output in build/LOG.log, and ends the
