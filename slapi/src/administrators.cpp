@@ -18,7 +18,6 @@
 #include "cfg/result_codes.h"
 #include "local_text.h"
 #include "messages.h"
-#include "slapi/codepage.h"
 #include "slapi/dn.h"
 #include "slapi/owners.h"
 #include "slapi/services.h"
