@@ -13,6 +13,7 @@
 #include "slapi/owners.h"
 #include "slapi/strings.h"
 #include "slapi/trace.h"
+#include "source_name.h"
 
 namespace orv {
 namespace {
@@ -49,7 +50,7 @@ MallocText zeroed_text(std::size_t size) {
 }
 
 int overflow(const ldtr_function_local& trace, int place) {
-  trace.debug(trace::info, kTextOverflow, __FILE__, place);
+  trace.debug(trace::info, kTextOverflow, source_name(__FILE__), place);
   return result::operations_error;
 }
 

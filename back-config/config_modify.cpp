@@ -22,6 +22,7 @@
 #include "slapi/services.h"
 #include "slapi/strings.h"
 #include "slapi/trace.h"
+#include "source_name.h"
 
 namespace orv {
 
@@ -109,7 +110,7 @@ char* gen_checkIPaddrs_err(int kind, const berval* value) {
   if (copy == nullptr) return nullptr;
   char* text = nullptr;
   if (kel_asprintf(&text, format, copy) == -1) {
-    trace.debug(trace::error, kAddressTextFailed, __FILE__, __LINE__);
+    trace.debug(trace::error, kAddressTextFailed, source_name(__FILE__), __LINE__);
     std::free(copy);
     return nullptr;
   }
@@ -707,7 +708,7 @@ MallocText resolve(const ldtr_function_local& trace, const char* path) {
   }
   MallocText resolved(static_cast<char*>(std::calloc(1, kPathSize)));
   if (resolved == nullptr) {
-    trace.debug(trace::error, kNoPathBuffer, __FILE__, __LINE__);
+    trace.debug(trace::error, kNoPathBuffer, source_name(__FILE__), __LINE__);
     return nullptr;
   }
   if (realpath(path, resolved.get()) != nullptr) return resolved;
@@ -780,7 +781,7 @@ int read_audit_log_file(const ldtr_function_local& trace, _CFG* session, MallocT
   }
   file.reset(slapi_ch_strdup(values.get()[0]));
   if (file != nullptr) return result::success;
-  trace.debug(trace::error, kNoAuditCopy, __FILE__, __LINE__);
+  trace.debug(trace::error, kNoAuditCopy, source_name(__FILE__), __LINE__);
   return result::no_memory;
 }
 
@@ -811,7 +812,7 @@ int resolve_audit_log_file(const ldtr_function_local& trace, _CFG* session, Mall
   MallocText file(get_audit_log_filename(session));
   if (file == nullptr) file.reset(slapi_ch_strdup(kDefaultAuditLogFile));
   if (file == nullptr) {
-    trace.debug(trace::error, kNoDefaultCopy, __FILE__, __LINE__);
+    trace.debug(trace::error, kNoDefaultCopy, source_name(__FILE__), __LINE__);
     return result::no_memory;
   }
   resolved.reset(resolve_path(file.get()));

@@ -25,11 +25,7 @@ if(ORV_CCACHE)
 endif()
 
 # __FILE__ names a file by its path in the source tree, wherever that tree lies.
-file(RELATIVE_PATH orv_source_from_build "${CMAKE_BINARY_DIR}" "${CMAKE_SOURCE_DIR}")
-add_compile_options(
-  "-fmacro-prefix-map=${CMAKE_SOURCE_DIR}/="
-  # As a compiler cache with a base directory names the sources.
-  "-fmacro-prefix-map=${orv_source_from_build}=")
+add_compile_options("-fmacro-prefix-map=${CMAKE_SOURCE_DIR}/=")
 
 # Symbols are bound at start: binding one at its first call saves the registers on the stack, and with
 # them pieces of a password that a vector instruction held, where nobody wipes them.
