@@ -15,6 +15,7 @@
 #include "config/default_config.h"
 #include "new_file.h"
 #include "password.h"
+#include "self_signed.h"
 #include "template.h"
 
 namespace orv::orvcfg {
@@ -130,6 +131,24 @@ bool provide_password(const Instance& instance, Undo& undo, ClearText& password,
   return true;
 }
 
+bool provide_certificate(const Instance& instance, Undo& undo, std::string& why) {
+  if (exists(instance.certificate()) && exists(instance.certificate_key())) return true;
+  // Half a pair is of no use, and may be somebody's.
+  for (const std::string& path : {instance.certificate(), instance.certificate_key()})
+    if (exists(path)) {
+      why = path + " stands without the other of tls.crt and tls.key; remove it and try again";
+      return false;
+    }
+  SelfSigned made;
+  if (!make_self_signed(made, why)) return false;
+  const bool has_key = write_new_file(instance.certificate_key(), made.key, why);
+  if (has_key) undo.file(instance.certificate_key());
+  cfg::wipe(made.key);
+  if (!has_key || !write_new_file(instance.certificate(), made.certificate, why)) return false;
+  undo.file(instance.certificate());
+  return true;
+}
+
 bool write_config(const Instance& instance, const cfg::Key& key, const ClearText& password,
                   Undo& undo, std::string& why) {
   std::string sealed;
@@ -166,6 +185,7 @@ bool create_instance(const std::string& directory, Instance& instance, std::stri
   if (!lock_directory(lock, instance.directory, why) || !refuse_if_made(instance, why) ||
       !make_directory(instance.log_directory(), undo, why) ||
       !provide_key(instance, undo, key, why) || !provide_password(instance, undo, password, why) ||
+      !provide_certificate(instance, undo, why) ||
       !write_config(instance, *key, password, undo, why)) {
     return false;
   }

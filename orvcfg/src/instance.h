@@ -10,14 +10,17 @@ struct Instance {
   [[nodiscard]] std::string config() const { return directory + "/config.ldif"; }
   [[nodiscard]] std::string key_stash() const { return directory + "/key.stash"; }
   [[nodiscard]] std::string admin_password() const { return directory + "/admin.pw"; }
+  [[nodiscard]] std::string certificate() const { return directory + "/tls.crt"; }
+  [[nodiscard]] std::string certificate_key() const { return directory + "/tls.key"; }
   [[nodiscard]] std::string log_directory() const { return directory + "/log"; }
 };
 
-// Makes DIR and DIR/log (0700) where they are missing, and DIR/key.stash, DIR/admin.pw and
-// DIR/config.ldif (0600) in this order: an instance exists when its config.ldif does.
+// Makes DIR and DIR/log (0700) where they are missing, and DIR/key.stash, DIR/admin.pw,
+// DIR/tls.key, DIR/tls.crt and DIR/config.ldif (0600) in this order: an instance exists when its
+// config.ldif does.
 //
 // Nothing is overwritten; an existing config.ldif is a failure. What an interrupted run left of the
-// other two is used again. After a failure everything that this call made is gone. False with what
+// others is used again. After a failure everything that this call made is gone. False with what
 // went wrong, where, and what to do about it in `why`.
 bool create_instance(const std::string& directory, Instance& instance, std::string& why);
 

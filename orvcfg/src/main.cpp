@@ -6,6 +6,7 @@
 #include <exception>
 #include <iostream>
 #include <string>
+#include <string_view>
 
 #include "check.h"
 #include "config/default_config.h"
@@ -47,15 +48,41 @@ std::string shell_word(const std::string& text) {
   return quoted + "'";
 }
 
+// A path inside a URL (RFC 3986, 2.1).
+std::string url_text(const std::string& path) {
+  constexpr std::string_view kPlain =
+      "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789-._~";
+  constexpr char kHex[] = "0123456789ABCDEF";
+  std::string text;
+  for (const char c : path) {
+    const auto byte = static_cast<unsigned char>(c);
+    if (kPlain.find(c) != std::string_view::npos)
+      text += c;
+    else
+      text.append(1, '%').append(1, kHex[byte >> 4]).append(1, kHex[byte & 15]);
+  }
+  return text;
+}
+
 void print_welcome(const Instance& instance, const Arguments& arguments) {
   const std::string port = arguments.port == 0 ? "PORT" : std::to_string(arguments.port);
   std::cout << "A new instance was made in " << instance.directory << ":\n"
             << "  config.ldif  its configuration\n"
             << "  key.stash    the key that opens the passwords in it\n"
             << "  admin.pw     the password of the primary administrator, cn=root\n"
+            << "  tls.crt      a certificate for TLS that the instance has signed itself\n"
+            << "  tls.key      its private key\n"
             << "Read the configuration of the running server with\n"
             << "  ldapsearch -x -H ldap://127.0.0.1:" << port << " -D cn=root -y "
-            << shell_word(arguments.directory + "/admin.pw") << " -b cn=configuration\n";
+            << shell_word(arguments.directory + "/admin.pw") << " -b cn=configuration\n"
+            << "with TLS\n"
+            << "  LDAPTLS_CACERT=" << shell_word(instance.certificate())
+            << " ldapsearch -x -ZZ -H ldap://127.0.0.1:" << port << " -D cn=root -y "
+            << shell_word(arguments.directory + "/admin.pw") << " -b cn=configuration\n"
+            << "and as root or the user of the server without a password\n"
+            << "  ldapsearch -Q -Y EXTERNAL -H "
+            << shell_word("ldapi://" + url_text(instance.directory + "/ldapi"))
+            << " -b cn=configuration\n";
 }
 
 int run_init(const Arguments& arguments) {

@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <charconv>
+#include <iterator>
 #include <optional>
 #include <span>
 #include <string_view>
@@ -62,6 +63,8 @@ struct Vocabulary {
   std::span<const std::string_view> words;
 };
 constexpr Vocabulary kVocabularies[] = {{"orv-slapdLogLevel", kLogLevels},
+                                        {"orv-slapdTlsClientCertificate", kClientCertificates},
+                                        {"orv-slapdTlsMinimumVersion", kTlsVersions},
                                         {"orv-slapdAdminRole", kAdminRoles}};
 
 std::string word_problem(std::string_view name, const std::string& value) {
@@ -83,7 +86,9 @@ std::string word_problem(std::string_view name, const std::string& value) {
 std::string value_problem(const SchemaAttribute& type, const std::string& value) {
   std::string problem = syntax_problem(type, value);
   if (problem.empty()) problem = word_problem(type.names.front(), value);
-  if (problem.empty() && type.names.front() == "orv-slapdLog" && !value.starts_with('/')) {
+  const bool is_path = std::find(std::begin(kPathSettings), std::end(kPathSettings),
+                                 type.names.front()) != std::end(kPathSettings);
+  if (problem.empty() && is_path && !value.starts_with('/')) {
     problem = "is not an absolute path";
   }
   return problem;

@@ -63,6 +63,12 @@ std::string open_to_append(const std::string& path, int access, const GuardedFil
   return "";
 }
 
+FileIdentity file_at(const std::string& path) noexcept {
+  struct stat status {};
+  if (path.empty() || ::stat(path.c_str(), &status) != 0) return {};
+  return identity_of(status);
+}
+
 FileIdentity regular_file_of(int descriptor) noexcept {
   struct stat status {};
   if (::fstat(descriptor, &status) != 0 || !S_ISREG(status.st_mode)) return {};

@@ -49,6 +49,9 @@ struct AppendedFile {
 std::string open_to_append(const std::string& path, int access, const GuardedFiles& guarded,
                            AppendedFile& file);
 
+// What a path leads to; none when it leads to nothing.
+FileIdentity file_at(const std::string& path) noexcept;
+
 // The regular file that a descriptor leads to; none when it leads elsewhere.
 FileIdentity regular_file_of(int descriptor) noexcept;
 

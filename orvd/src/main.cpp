@@ -21,6 +21,7 @@
 
 #include "audit/log.h"
 #include "auth/identities.h"
+#include "auth/sasl_external.h"
 #include "broken_file.h"
 #include "cfg/attribute_table.h"
 #include "cfg/diagnostics.h"
@@ -32,6 +33,7 @@
 #include "file_report.h"
 #include "guarded_file.h"
 #include "logs.h"
+#include "net/tls.h"
 #include "ops/persistent_search.h"
 #include "options.h"
 #include "plugin/loader.h"
@@ -84,7 +86,7 @@ void tell(Logs& logs, const std::string& error, const std::vector<std::string>& 
   for (const std::string& warning : warnings) logs.warning(warning);
 }
 
-class StoredIdentities final : public Authenticator {
+class StoredIdentities final : public Authenticator, public ExternalIdentities {
  public:
   // `follow` as in IdentityStore.
   StoredIdentities(const Options& options, Logs& logs, std::function<bool()> follow)
@@ -113,6 +115,18 @@ class StoredIdentities final : public Authenticator {
     if (!found && identities->claimed_twice(name)) tell_of_claim(name);
     if (!found) return nullptr;
     return {identities, found};  // the snapshot lives as long as somebody is bound by it
+  }
+
+  std::shared_ptr<const Identity> primary_administrator() override {
+    const std::shared_ptr<const Identities> identities = store_.current();
+    const Identity* const found = identities ? identities->primary_administrator() : nullptr;
+    if (!found) return nullptr;
+    return {identities, found};
+  }
+
+  std::shared_ptr<const Identity> of_certificate(std::string_view subject) override {
+    const std::shared_ptr<const Identities> identities = store_.current();
+    return identities ? identities->of_certificate(subject) : nullptr;
   }
 
   std::uint64_t generation() const noexcept override { return store_.generation(); }
@@ -342,55 +356,98 @@ Publications publications() {
   // The schema does not change while the server runs, and making the entry costs more than a
   // search.
   std::shared_ptr<const entry> subschema = make_subschema(builtin_schema(), std::time(nullptr));
-  return {[facts] { return make_root_dse(facts); },
+  return {[facts](const Offer& offer) {
+            ServerFacts shown = facts;
+            shown.sasl_mechanisms = offer.sasl_mechanisms;
+            if (offer.start_tls) shown.supported_extensions.emplace_back(kStartTlsOid);
+            return std::shared_ptr<const entry>(make_root_dse(shown));
+          },
           [subschema] { return std::shared_ptr<const entry>(subschema); }};
+}
+
+// What clients may bind with besides passwords.
+SaslMechanisms make_mechanisms(StoredIdentities& identities) {
+  SaslMechanisms mechanisms;
+  mechanisms.push_back(make_external(identities));
+  return mechanisms;
+}
+
+bool can_use_certificate(const Settings& settings) {
+  std::string error;
+  if (settings.tls.certificate_file.empty() || TlsContext::load(settings.tls, error)) return true;
+  std::fprintf(stderr, "orvd: %s\n", error.c_str());
+  return false;
 }
 
 void report(Logs& logs, const std::vector<std::string>& problems) {
   for (const std::string& problem : problems) logs.error(problem);
 }
 
+std::vector<FileInUse> files_of_tls(const TlsSettings& tls) {
+  std::vector<FileInUse> files;
+  for (const std::string& path : {tls.certificate_file, tls.key_file, tls.ca_file})
+    if (const FileIdentity file = file_at(path)) files.push_back({file, path});
+  return files;
+}
+
 // The audit log first: what is its file then, wanted or not, is kept from the other logs.
 void open_logs(const Settings& settings, GuardedFiles guarded, Logs& logs, AuditLog& audit) {
+  std::vector<FileInUse> others = files_of_tls(settings.tls);
+  guarded.in_use.insert(guarded.in_use.end(), others.begin(), others.end());
   for (FileInUse& file : logs.files_in_use()) guarded.in_use.push_back(std::move(file));
   const std::string reason = audit.open(settings.audit_log, guarded);
   if (!reason.empty()) logs.error("cannot record changes in " + settings.audit_log + ": " + reason);
-  report(logs, logs.open(settings, audit.files_in_use()));
+  for (FileInUse& file : audit.files_in_use()) others.push_back(std::move(file));
+  report(logs, logs.open(settings, others));
+}
+
+// A second server of the same configuration, on another port, must not need the first one's places.
+MoreListeners more_listeners(const Options& options, const Settings& settings) {
+  MoreListeners more;
+  more.secure_port = options.secure_port;
+  if (!more.secure_port && settings.secure_port > 0)
+    more.secure_port = options.port ? 0 : static_cast<std::uint16_t>(settings.secure_port);
+  more.local_socket = options.local_socket.value_or(settings.local_socket);
+  return more;
 }
 
 int serve(const Options& options, const Settings& settings, const GuardedFiles& guarded, Logs& logs,
           AuditLog& audit, StoredIdentities& identities, BackendPlace& place) {
   BrokenFileReporter broken_file(options.config_file, options.key_stash_file, logs);
-  Server server({builtin_schema(), place.backend, identities, publications(), logs,
-                 slapi_supported_controls(), settings,
-                 std::max(1U, std::thread::hardware_concurrency()),
-                 [&](Settings& wanted) {
-                   std::string error;
-                   if (!read_settings(options.config_file, options.key_stash_file, wanted, error) ||
-                       !identities.reload(error)) {
-                     logs.error("settings not taken over: " + error);
-                     return false;
-                   }
-                   renew_all(options, logs);
-                   open_logs(wanted, guarded, logs, audit);
-                   configfile_read.fetch_add(1, std::memory_order_relaxed);
-                   logs.info("settings taken over");
-                   return true;
-                 },
-                 [&broken_file] { broken_file.note_failure(); }, &audit,
-                 [&](const Consequences& consequences, bool made) {
-                   return take_over(consequences, made, identities, options, logs);
-                 },
-                 options.guards, [&identities] { identities.refresh(); }, cfg_changes_made});
+  const SaslMechanisms mechanisms = make_mechanisms(identities);
+  Server server(
+      {builtin_schema(), place.backend, identities, publications(), logs,
+       slapi_supported_controls(), settings, std::max(1U, std::thread::hardware_concurrency()),
+       [&](Settings& wanted) {
+         std::string error;
+         if (!read_settings(options.config_file, options.key_stash_file, wanted, error) ||
+             !identities.reload(error)) {
+           logs.error("settings not taken over: " + error);
+           return false;
+         }
+         renew_all(options, logs);
+         open_logs(wanted, guarded, logs, audit);
+         configfile_read.fetch_add(1, std::memory_order_relaxed);
+         logs.info("settings taken over");
+         return true;
+       },
+       [&broken_file] { broken_file.note_failure(); }, &audit,
+       [&](const Consequences& consequences, bool made) {
+         return take_over(consequences, made, identities, options, logs);
+       },
+       options.guards, [&identities] { identities.refresh(); }, cfg_changes_made, &mechanisms});
   std::string error;
+  const MoreListeners more = more_listeners(options, settings);
   const auto& addresses = options.addresses.empty() ? settings.addresses : options.addresses;
   const auto port = options.port.value_or(static_cast<std::uint16_t>(settings.port));
-  if (!server.listen(addresses, port, error)) {
+  if (!server.listen(addresses, port, error, more)) {
     std::fprintf(stderr, "orvd: %s\n", error.c_str());
     return 1;
   }
   server.handle_signals();
-  logs.info("orvd " ORV_VERSION " serves " + options.config_file + " at " + server.url());
+  std::string urls;
+  for (const std::string& url : server.urls()) urls += " " + url;
+  logs.info("orvd " ORV_VERSION " serves " + options.config_file + " at" + urls);
   std::printf("orvd ready %s\n", server.url().c_str());
   std::fflush(stdout);
   return server.serve();
@@ -427,7 +484,9 @@ int run(const Options& options, const FileIdentity& standard_error) {
       for (const std::string& doubt :
            doubts_about_file(options.config_file, options.key_stash_file))
         logs.warning(doubt);
-      if (options.check) {
+      if (options.check && !can_use_certificate(settings)) {
+        status = 1;
+      } else if (options.check) {
         std::printf("%s: good\n", options.config_file.c_str());
         status = 0;
       } else {

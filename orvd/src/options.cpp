@@ -56,6 +56,12 @@ Parsed parse_options(int argc, char** argv, Options& options, int& status) {
       ->type_name("ADDRESS");
   app.add_option("--port", options.port, "Port to listen on, instead of the configured; 0: any")
       ->type_name("N");
+  app.add_option("--secure-port", options.secure_port,
+                 "Port for TLS, instead of the configured; 0: any; also with --port")
+      ->type_name("N");
+  app.add_option("--local-socket", options.local_socket,
+                 "Unix socket to listen at, instead of the configured; \"\": none")
+      ->type_name("FILE");
   app.add_option("--server-type", options.server_type, "Kind of server")->type_name("N");
   app.add_flag("--safe-mode", options.safe_mode, "Start in safe mode");
   app.add_option("--code-page", options.code_page, "Code page of the configuration file")

@@ -12,8 +12,10 @@ struct Options {
   std::string config_file;     // absolute, symbolic links resolved
   std::string key_stash_file;  // "" for none
   std::string plugin_file;
-  std::vector<std::string> addresses;  // not empty: instead of the configured ones
-  std::optional<std::uint16_t> port;   // instead of the configured one
+  std::vector<std::string> addresses;        // not empty: instead of the configured ones
+  std::optional<std::uint16_t> port;         // instead of the configured one
+  std::optional<std::uint16_t> secure_port;  // instead of the configured one
+  std::optional<std::string> local_socket;   // instead of the configured one; "": none
   int server_type = 0;
   bool safe_mode = false;
   std::string code_page;  // "": the environment's

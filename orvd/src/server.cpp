@@ -69,6 +69,8 @@ Server::Server(ServerParts parts)
   services_.take_over = parts_.take_over;
   services_.changes_made = parts_.changes_made;
   services_.renew_settings = [this] { renew_settings(); };
+  services_.mechanisms = parts_.mechanisms;
+  services_.tls = &tls_;
   for (unsigned i = 0; i < std::max(1U, parts_.loops); ++i)
     loops_.push_back(std::make_unique<Loop>(parts_.logs, settings_));
 }
@@ -87,8 +89,43 @@ void Server::stop_workers() {
 }
 
 bool Server::listen(const std::vector<std::string>& addresses, std::uint16_t port,
-                    std::string& error) {
-  return listeners_.open(addresses, port, error);
+                    std::string& error, const MoreListeners& more) {
+  if (!load_certificate(settings_->tls, error) || !listeners_.open(addresses, port, false, error))
+    return false;
+  const bool secure = more.secure_port && tls_.current();
+  if (secure && !listeners_.open(addresses, *more.secure_port, true, error)) return false;
+  // Another server of the same instance may be there, or the path be too long: no reason to serve
+  // nobody.
+  std::string failure;
+  if (!more.local_socket.empty() && !listeners_.open_local(more.local_socket, failure))
+    parts_.logs.error(failure);
+  return true;
+}
+
+// Without one in the settings, TLS is not offered to new connections any more.
+bool Server::load_certificate(const TlsSettings& settings, std::string& error) {
+  std::shared_ptr<const TlsContext> context;
+  if (!settings.certificate_file.empty()) {
+    context = TlsContext::load(settings, error);
+    if (!context) return false;
+    const std::shared_ptr<const TlsContext> before = tls_.current();
+    if (!before || before->description() != context->description())
+      parts_.logs.info("certificate for TLS: " + context->description());
+    if (context->has_expired()) parts_.logs.warning("the certificate for TLS has expired");
+  }
+  tls_.put(std::move(context));
+  return true;
+}
+
+// The files may hold something else than before under the same names.
+void Server::renew_certificate(Settings& wanted) {
+  std::string error;
+  // Whoever connected to a port for TLS must find it.
+  if (wanted.tls.certificate_file.empty() && secure_port() != 0)
+    error = "orv-slapdTlsCertificateFile is gone, which the port for TLS needs";
+  if (error.empty() && load_certificate(wanted.tls, error)) return;
+  parts_.logs.error("TLS stays as it was: " + error);
+  wanted.tls = settings_->tls;
 }
 
 void Server::handle_signals() {
@@ -110,7 +147,10 @@ int Server::serve() {
   watch_gate();
   watch_files();
   for (const auto& loop : loops_) loop->start();
-  listeners_.start(settings_);
+  {
+    const std::lock_guard lock(reloading_);
+    listeners_.start(settings_);
+  }
   control();
   wind_up();
   return backend_.failed() ? 1 : 0;
@@ -197,6 +237,9 @@ void Server::reload() {
   // What listens is not changed; the settings say what runs.
   wanted.port = settings_->port;
   wanted.addresses = settings_->addresses;
+  wanted.secure_port = settings_->secure_port;
+  wanted.local_socket = settings_->local_socket;
+  renew_certificate(wanted);
   settings_ = std::make_shared<const Settings>(std::move(wanted));
   for (const auto& loop : loops_) loop->renew(settings_);
   asio::post(control_, [this, settings = settings_] { listeners_.renew(settings); });

@@ -13,12 +13,14 @@
 #include <functional>
 #include <memory>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <vector>
 
 #include "net/limits.h"
 #include "net/listener.h"
 #include "net/loop.h"
+#include "net/tls.h"
 #include "ops/services.h"
 #include "settings.h"
 
@@ -46,7 +48,14 @@ struct ServerParts {
   // Looks after what time may have changed, about once a second and on a worker. Must not throw.
   // May be empty.
   std::function<void()> look_after{};
-  unsigned long (*changes_made)() = nullptr;  // Services::changes_made
+  unsigned long (*changes_made)() = nullptr;   // Services::changes_made
+  const SaslMechanisms* mechanisms = nullptr;  // null: none
+};
+
+// Where a server listens, besides its addresses for connections in clear.
+struct MoreListeners {
+  std::optional<std::uint16_t> secure_port;  // on the same addresses; 0: the kernel chooses
+  std::string local_socket;                  // "": none
 };
 
 class Server {
@@ -56,10 +65,14 @@ class Server {
   Server(const Server&) = delete;
   Server& operator=(const Server&) = delete;
 
-  // Opens the listeners. False with the cause.
-  bool listen(const std::vector<std::string>& addresses, std::uint16_t port, std::string& error);
+  // Reads the server's certificate, if the settings name one, and opens the listeners. False with
+  // the cause.
+  bool listen(const std::vector<std::string>& addresses, std::uint16_t port, std::string& error,
+              const MoreListeners& more = {});
   std::string url() const { return listeners_.url(); }
+  std::vector<std::string> urls() const { return listeners_.urls(); }
   std::uint16_t port() const { return listeners_.port(); }
+  std::uint16_t secure_port() const { return listeners_.port(true); }
 
   // Takes SIGTERM and SIGINT as stop, SIGHUP as reload.
   void handle_signals();
@@ -83,6 +96,8 @@ class Server {
 
  private:
   void renew_settings() noexcept;
+  bool load_certificate(const TlsSettings& settings, std::string& error);
+  void renew_certificate(Settings& wanted);
   void control();
   void watch_gate();
   void watch_files();
@@ -97,6 +112,7 @@ class Server {
   asio::steady_timer file_timer_;
   std::atomic<bool> looking_{false};  // a worker is at it, or will be
   BackendHost backend_;
+  TlsHolder tls_;
   Services services_;
   ConnectionCounter counter_;
   std::mutex reloading_;

@@ -3,6 +3,7 @@
 #include <charconv>
 #include <optional>
 
+#include "auth/certificate_map.h"
 #include "cfg/owners.h"
 #include "cfg/result_codes.h"
 #include "cfg/session.h"
@@ -44,10 +45,16 @@ constexpr SettingRow kRows[] = {
     row("orv-slapdMaxPersistentSearchesPerConnection",
         &Settings::max_persistent_searches_per_connection),
     row("orv-slapdMaxFailedChangeSize", &Settings::max_failed_change_size),
+    row("orv-slapdSecurePort", &Settings::secure_port, true),
+    row("orv-slapdMaxUnauthenticatedConnections", &Settings::max_unauthenticated_connections),
+    row("orv-slapdBindTimeOut", &Settings::bind_timeout),
+    row("orv-slapdTlsHandshakeTimeOut", &Settings::handshake_timeout),
 };
 
 constexpr const char* kAddresses = "orv-slapdIpAddress";
+constexpr const char* kLocalSocket = "orv-slapdLocalSocket";
 constexpr const char* kConfiguration = "CN=CONFIGURATION";
+constexpr const char* kGroup = "CN=ADMINGROUP,CN=CONFIGURATION";
 constexpr const char* kErrorLogEntry = "CN=DEFAULT,CN=LOG MANAGEMENT,CN=CONFIGURATION";
 constexpr const char* kAccessLogEntry = "CN=ACCESS,CN=LOG MANAGEMENT,CN=CONFIGURATION";
 constexpr const char* kAuditLogEntry = "CN=AUDIT,CN=LOG MANAGEMENT,CN=CONFIGURATION";
@@ -131,6 +138,47 @@ bool read_audit_log(_CFG* session, std::string& path, std::string& error) {
   return true;
 }
 
+bool read_path(const FileEntry& entry, const char* name, std::string& path, std::string& error) {
+  path = entry.first(name).value_or("");
+  if (path.empty() || path.front() == '/') return true;
+  error = std::string(name) + " is not an absolute path";
+  return false;
+}
+
+// Which of the words stands there; the first one when none does.
+bool read_word(const FileEntry& entry, const char* name, std::span<const std::string_view> words,
+               std::size_t& number, std::string& error) {
+  const std::string word = entry.first(name).value_or(std::string(words.front()));
+  for (number = 0; number < words.size(); ++number)
+    if (cfg::equals_ignore_ascii_case(words[number], word)) return true;
+  error = std::string(name) + " " + value_problem(name, word);
+  return false;
+}
+
+void read_flag(const FileEntry& entry, const char* name, bool& flag) {
+  if (const std::optional<std::string> value = entry.first(name))
+    flag = !cfg::equals_ignore_ascii_case(*value, "FALSE");
+}
+
+// What an absent entry would say is the default.
+bool read_tls(_CFG* session, Settings& settings, std::string& error) {
+  const FileEntry group(session, kGroup);
+  TlsSettings& tls = settings.tls;
+  std::size_t version = 0;
+  std::size_t clients = 0;
+  if (!read_path(group, "orv-slapdTlsCertificateFile", tls.certificate_file, error) ||
+      !read_path(group, "orv-slapdTlsKeyFile", tls.key_file, error) ||
+      !read_path(group, "orv-slapdTlsCaFile", tls.ca_file, error) ||
+      !read_word(group, "orv-slapdTlsMinimumVersion", kTlsVersions, version, error) ||
+      !read_word(group, "orv-slapdTlsClientCertificate", kClientCertificates, clients, error))
+    return false;
+  tls.tls_1_2 = version == 0;
+  tls.client_certificates = static_cast<ClientCertificates>(clients);
+  read_flag(group, "orv-slapdTlsForPasswords", settings.tls_for_passwords);
+  read_flag(group, "orv-slapdTlsForLocalPasswords", settings.tls_for_local_passwords);
+  return true;
+}
+
 bool read_integers(const FileEntry& top, Settings& settings, std::string& error) {
   for (const SettingRow& row : setting_rows()) {
     const std::optional<std::string> value = top.first(std::string(row.name).c_str());
@@ -143,6 +191,24 @@ bool read_integers(const FileEntry& top, Settings& settings, std::string& error)
 
 std::span<const SettingRow> setting_rows() noexcept {
   return kRows;
+}
+
+std::string value_problem(std::string_view name, std::string_view value) {
+  const auto none_of = [value](std::span<const std::string_view> words) {
+    std::string problem = "is none of";
+    for (const std::string_view word : words) {
+      if (cfg::equals_ignore_ascii_case(word, value)) return std::string();
+      problem.append(" ").append(word);
+    }
+    return problem;
+  };
+  if (name == "orv-slapdLogLevel") return none_of(kLogLevels);
+  if (name == "orv-slapdTlsClientCertificate") return none_of(kClientCertificates);
+  if (name == "orv-slapdTlsMinimumVersion") return none_of(kTlsVersions);
+  CertificateMapping mapping;
+  if (name == kCertificateMap && !parse_certificate_mapping(value, mapping))
+    return "is not SUBJECT => NAME, two DNs";
+  return "";
 }
 
 bool apply_setting(const SettingRow& row, std::string_view value, Settings& settings,
@@ -193,7 +259,8 @@ bool read_settings(const std::string& config_file, const std::string& key_stash_
   }
   Settings read;
   read.addresses = top.values(kAddresses);
-  if (read_integers(top, read, error) &&
+  if (read_integers(top, read, error) && read_path(top, kLocalSocket, read.local_socket, error) &&
+      read_tls(session.get(), read, error) &&
       read_log(session.get(), kErrorLogEntry, read.error_log, read.error_log_level, error) &&
       read_log(session.get(), kAccessLogEntry, read.access_log, read.access_log_level, error) &&
       read_audit_log(session.get(), read.audit_log, error)) {
@@ -209,6 +276,7 @@ std::vector<std::string> restart_settings() {
   for (const SettingRow& row : setting_rows())
     if (row.needs_restart) names.emplace_back(row.name);
   names.emplace_back(kAddresses);
+  names.emplace_back(kLocalSocket);
   return names;
 }
 
@@ -217,6 +285,7 @@ std::vector<std::string_view> restart_needed(const Settings& running, const Sett
   for (const SettingRow& row : setting_rows())
     if (row.needs_restart && running.*row.member != wanted.*row.member) names.push_back(row.name);
   if (running.addresses != wanted.addresses) names.push_back(kAddresses);
+  if (running.local_socket != wanted.local_socket) names.push_back(kLocalSocket);
   return names;
 }
 

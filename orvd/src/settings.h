@@ -12,6 +12,19 @@
 
 namespace orv::server {
 
+enum class ClientCertificates { none, optional, required };
+
+// How TLS is spoken; on CN=ADMINGROUP,CN=CONFIGURATION, which the primary administrator alone may
+// change: these settings decide whom the server believes, and what administrators take for it.
+struct TlsSettings {
+  std::string certificate_file;  // PEM, the server's own first; "": TLS is not offered
+  std::string key_file;          // PEM; "": the key is in the certificate file
+  std::string ca_file;           // PEM: who may sign clients' certificates
+  ClientCertificates client_certificates = ClientCertificates::none;
+  bool tls_1_2 = true;  // besides 1.3
+  bool operator==(const TlsSettings&) const = default;
+};
+
 struct Settings {
   std::int64_t port = 3389;                 // TCP; 0 lets the kernel choose
   std::int64_t size_limit = 0;              // entries of one search, 0 no limit
@@ -31,8 +44,17 @@ struct Settings {
   std::int64_t message_timeout = 30;          // seconds to finish a message once begun
   std::int64_t max_persistent_searches = 64;  // in all, 0: there are none
   std::int64_t max_persistent_searches_per_connection = 8;
-  std::int64_t max_failed_change_size = 16777216;  // bytes of one identity within a day
-  std::vector<std::string> addresses;              // empty: every address
+  std::int64_t max_failed_change_size = 16777216;       // bytes of one identity within a day
+  std::int64_t secure_port = 0;                         // of ldaps; 0: none
+  std::int64_t max_unauthenticated_connections = 3072;  // on which nobody is bound
+  std::int64_t bind_timeout = 30;                       // seconds to finish a bind in several steps
+  std::int64_t handshake_timeout = 10;                  // seconds to finish a handshake of TLS
+  std::vector<std::string> addresses;                   // empty: every address
+  std::string local_socket;                             // path; empty: none
+
+  TlsSettings tls;
+  bool tls_for_passwords = true;         // binds with passwords need it
+  bool tls_for_local_passwords = false;  // also from the same host
 
   std::string error_log;  // path; empty: standard error
   std::string error_log_level = "info";
@@ -53,6 +75,10 @@ struct SettingRow {
 
 // All integer settings, in the order of the documentation.
 std::span<const SettingRow> setting_rows() noexcept;
+
+// What is wrong with a value of a setting that is a word, or of a map of certificates; "" when
+// nothing is, or the setting is another one. With such a value the server would not start.
+std::string value_problem(std::string_view name, std::string_view value);
 
 // Takes one value over. False, with the reason in `error`, when `value` is not an integer within
 // the row's bounds.

@@ -239,6 +239,10 @@ constexpr TypeTest kTypeTests[] = {
     {"orv-slapdAdminPW", test_not_empty},
     {"orv-slapdMasterPW", test_not_empty},
     {"orv-slapdLog", test_absolute_path},
+    {"orv-slapdLocalSocket", test_absolute_path},
+    {"orv-slapdTlsCertificateFile", test_absolute_path},
+    {"orv-slapdTlsKeyFile", test_absolute_path},
+    {"orv-slapdTlsCaFile", test_absolute_path},
     {"orv-slapdLog", test_ascii_in_other_code_pages},
     {"orv-slapdPtaSubtree", test_ascii_in_other_code_pages},
 };

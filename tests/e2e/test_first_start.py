@@ -15,7 +15,7 @@ from orv_e2e import clients, programs
 from orv_e2e.instance import READY, Instance
 from orv_e2e.output import LineCollector
 
-MADE = ["config.ldif", "key.stash", "admin.pw"]
+MADE = ["config.ldif", "key.stash", "admin.pw", "tls.crt", "tls.key"]
 
 
 def mode(path):
@@ -40,7 +40,7 @@ def test_modes_do_not_depend_on_the_umask(tmp_path):
     directory = tmp_path / "loose"
     subprocess.run([programs.orvcfg(), "init", "--dir", directory], check=True, umask=0,
                    stdout=subprocess.DEVNULL, timeout=programs.DEADLINE)
-    assert [mode(directory / name) for name in MADE] == [0o600] * 3
+    assert [mode(directory / name) for name in MADE] == [0o600] * len(MADE)
     assert mode(directory) == 0o700
 
 
@@ -104,6 +104,7 @@ def test_name_in_the_place_of_an_address_is_refused_with_what_is_wanted(instance
 def test_port_and_address_of_the_file_hold_without_options(instance):
     with clients_port() as port:
         instance.config.set(clients.BASE, "orv-slapdPort", str(port))
+    instance.config.set(clients.BASE, "orv-slapdSecurePort", "0")
     command = [str(programs.orvd()), "--config", str(instance.config.path), "--key-stash",
                str(instance.key_stash)]
     instance._spawn(command, None)  # pylint: disable=protected-access
@@ -169,7 +170,7 @@ def test_serve_makes_an_instance_once_and_serves_it(tmp_path):
         assert ready, stderr.text()
         said_before = stdout.lines()[:stdout.lines().index(ready)]
         assert any("ldapsearch" in line for line in said_before)
-        assert [mode(directory / name) for name in MADE] == [0o600] * 3
+        assert [mode(directory / name) for name in MADE] == [0o600] * len(MADE)
         made = contents(directory)
         port = int(READY.match(ready).group("port"))
         found = subprocess.run(

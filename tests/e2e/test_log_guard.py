@@ -14,7 +14,7 @@ def refusals(instance):
     return [line for line in instance.stderr.lines() if "cannot log to" in line]
 
 
-@pytest.mark.parametrize("name", ["config.ldif", "key.stash", "admin.pw"])
+@pytest.mark.parametrize("name", ["config.ldif", "key.stash", "admin.pw", "tls.key"])
 @pytest.mark.parametrize("linked", [False, True])
 def test_log_in_a_file_of_the_instance_is_refused(instance, name, linked):
     target = instance.directory / name

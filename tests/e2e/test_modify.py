@@ -58,7 +58,8 @@ def test_log_file_is_in_use_when_its_change_was_answered(server, root):
 
 def test_server_tells_which_settings_need_a_restart(server, root):
     shown = clients.search(root, "", ldap.SCOPE_BASE, attributes=["orv-restartSettings"])[""]
-    assert set(shown["orv-restartSettings"]) == {b"orv-slapdPort", b"orv-slapdIpAddress"}
+    assert set(shown["orv-restartSettings"]) == {
+        b"orv-slapdPort", b"orv-slapdIpAddress", b"orv-slapdSecurePort", b"orv-slapdLocalSocket"}
     port = server.url
     assert modify(root, TOP, replaced("orv-slapdPort", "0")) == 0
     assert server.url == port

@@ -11,7 +11,7 @@ import unittest
 
 PROGRAM = os.path.join(os.environ["ORV_BIN_DIR"], "orvcfg")
 SOURCE = os.path.dirname(os.path.dirname(os.path.dirname(os.path.abspath(__file__))))
-FILES = ["admin.pw", "config.ldif", "key.stash"]
+FILES = ["admin.pw", "config.ldif", "key.stash", "tls.crt", "tls.key"]
 
 
 class Tool(unittest.TestCase):
@@ -56,8 +56,8 @@ class Init(Tool):
         for number, umask in enumerate((0, 0o022, 0o777)):
             name = f"i{number}"
             self.succeed("init", "--dir", name, umask=umask)
-            self.assertEqual(sorted(os.listdir(self.path(name))), [*FILES, "log"])
-            self.assertEqual([self.mode(name, file) for file in FILES], [0o600] * 3)
+            self.assertEqual(sorted(os.listdir(self.path(name))), sorted([*FILES, "log"]))
+            self.assertEqual([self.mode(name, file) for file in FILES], [0o600] * len(FILES))
             self.assertEqual((self.mode(name), self.mode(name, "log")), (0o700, 0o700))
 
     def test_what_it_makes_has_nothing_wrong(self):
@@ -71,7 +71,8 @@ class Init(Tool):
         made = self.read("i", "config.ldif").splitlines()
         differing = [new for old, new in zip(template, made, strict=True) if old != new]
         self.assertEqual([line.split(":")[0] for line in differing],
-                         ["orv-slapdAdminPW", "orv-slapdLog", "orv-slapdLog"])
+                         ["orv-slapdAdminPW", "orv-slapdLocalSocket", "orv-slapdTlsCertificateFile",
+                          "orv-slapdTlsKeyFile", "orv-slapdLog", "orv-slapdLog"])
         self.assertIn(f"orv-slapdLog: {self.path('i', 'log', 'access.log')}", differing)
 
     def test_passwords_meet_the_default_policy_and_differ(self):
@@ -111,7 +112,7 @@ class Init(Tool):
         self.write("half", "i", "config.ldif.new")
         self.succeed("init", "--dir", "i")
         self.assertEqual([self.read("i", file) for file in ("admin.pw", "key.stash")], kept)
-        self.assertEqual(sorted(os.listdir(self.path("i"))), [*FILES, "log"])
+        self.assertEqual(sorted(os.listdir(self.path("i"))), sorted([*FILES, "log"]))
         self.succeed("check", "i/config.ldif", "--key-stash", "i/key.stash")
 
     def test_a_failed_write_leaves_nothing(self):
@@ -338,7 +339,7 @@ class Check(Tool):
     def test_changes_nothing(self):
         self.succeed("check", "i/config.ldif", "--key-stash", "i/key.stash")
         self.assertEqual(self.read("i", "config.ldif"), self.config)
-        self.assertEqual(sorted(os.listdir(self.path("i"))), [*FILES, "log"])
+        self.assertEqual(sorted(os.listdir(self.path("i"))), sorted([*FILES, "log"]))
 
 
 class Show(Tool):

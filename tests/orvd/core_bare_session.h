@@ -23,12 +23,17 @@ namespace orv::server::test {
 class BareSession final : public Session {
  public:
   BareSession(Services& services, AccessLane& lane, const Settings& settings)
-      : Session(services, lane, 1), settings_(settings) {}
+      : Session(services, lane, 1), settings_(settings) {
+    TransportFacts facts;
+    facts.loopback = true;
+    set_transport(facts);
+  }
 
   using Session::client_left;
   using Session::handle;
   using Session::idle;
   using Session::output_is;
+  using Session::set_transport;
   using Session::tick;
 
   // Runs what was posted until `done`, for ten seconds at most.

@@ -67,26 +67,28 @@ class LoopbackServer : public testing::Test {
 
   void start() {
     logs.open(settings);
-    server.emplace(ServerParts{builtin_schema(),
-                               backend.record(),
-                               authenticator,
-                               {[] {
-                                  return make_root_dse({{kTop}, {}, {}, {}, "v", "1"});
-                                },
-                                [] { return make_subschema(builtin_schema(), 0); }},
-                               logs,
-                               controls,
-                               settings,
-                               loops,
-                               reload,
-                               {},
-                               audit,
-                               take_over,
-                               true,
-                               look_after,
-                               changes_made});
+    ServerParts parts{builtin_schema(),
+                      backend.record(),
+                      authenticator,
+                      {[](const Offer&) {
+                         return make_root_dse({{kTop}, {}, {}, {}, "v", "1"});
+                       },
+                       [] { return make_subschema(builtin_schema(), 0); }},
+                      logs,
+                      controls,
+                      settings,
+                      loops,
+                      reload,
+                      {},
+                      audit,
+                      take_over,
+                      true,
+                      look_after,
+                      changes_made};
+    parts.mechanisms = &mechanisms;
+    server.emplace(std::move(parts));
     std::string error;
-    ASSERT_TRUE(server->listen(addresses, 0, error)) << error;
+    ASSERT_TRUE(server->listen(addresses, 0, error, more)) << error;
     if (reload) server->handle_signals();
     control = std::thread([this] { status = server->serve(); });
   }
@@ -131,6 +133,8 @@ class LoopbackServer : public testing::Test {
   std::function<void()> look_after;
   unsigned long (*changes_made)() = nullptr;
   std::vector<std::string> addresses{"127.0.0.1"};
+  MoreListeners more;
+  SaslMechanisms mechanisms;
   unsigned loops = 1;
   std::optional<Server> server;
   std::thread control;

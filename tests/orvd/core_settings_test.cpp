@@ -133,6 +133,52 @@ TEST_F(SettingsTest, OfTheListenersNeedARestart) {
   wanted.addresses = {"::1"};
   EXPECT_EQ(restart_needed(settings, wanted),
             (std::vector<std::string_view>{"orv-slapdPort", "orv-slapdIpAddress"}));
+  wanted = settings;
+  wanted.secure_port = 1;
+  wanted.local_socket = "/x";
+  EXPECT_EQ(restart_needed(settings, wanted),
+            (std::vector<std::string_view>{"orv-slapdSecurePort", "orv-slapdLocalSocket"}));
+}
+
+// ---- TLS
+
+std::string group(const std::string& values) {
+  return "dn: cn=admingroup,cn=configuration\nobjectClass: container\n"
+         "objectClass: orv-slapdAdminGroupSettings\ncn: admingroup\n" +
+         values;
+}
+
+TEST_F(SettingsTest, OfTlsAreReadFromTheContainerOfTheGroup) {
+  const std::string file = configuration(
+      "orv-slapdSecurePort: 1636\norv-slapdLocalSocket: /run/orv/ldapi\n",
+      group("orv-slapdTlsCertificateFile: /c\norv-slapdTlsKeyFile: /k\norv-slapdTlsCaFile: /a\n"
+            "orv-slapdTlsClientCertificate: Required\norv-slapdTlsMinimumVersion: 1.3\n"
+            "orv-slapdTlsForPasswords: FALSE\norv-slapdTlsForLocalPasswords: TRUE\n"));
+  ASSERT_TRUE(read_settings(file, "", settings, error)) << error;
+  EXPECT_EQ(settings.secure_port, 1636);
+  EXPECT_EQ(settings.local_socket, "/run/orv/ldapi");
+  EXPECT_EQ(settings.tls, (TlsSettings{"/c", "/k", "/a", ClientCertificates::required, false}));
+  EXPECT_FALSE(settings.tls_for_passwords);
+  EXPECT_TRUE(settings.tls_for_local_passwords);
+}
+
+TEST_F(SettingsTest, OfTlsAreOfNoEffectAnywhereElse) {
+  const std::string file = configuration(
+      "orv-slapdTlsCertificateFile: /c\n"
+      "orv-slapdTlsForPasswords: FALSE\n");
+  ASSERT_TRUE(read_settings(file, "", settings, error)) << error;
+  EXPECT_EQ(settings.tls, TlsSettings());
+  EXPECT_TRUE(settings.tls_for_passwords);
+  EXPECT_FALSE(settings.tls_for_local_passwords);
+}
+
+TEST_F(SettingsTest, OfTlsThatAreNoneAreRefusedByName) {
+  for (const std::string name : {"orv-slapdTlsClientCertificate", "orv-slapdTlsMinimumVersion",
+                                 "orv-slapdTlsCaFile", "orv-slapdTlsKeyFile"}) {
+    const std::string file = configuration("", group(name + ": 1.1\n"));
+    EXPECT_FALSE(read_settings(file, "", settings, error));
+    EXPECT_NE(error.find(name), std::string::npos) << error;
+  }
 }
 
 // ---- logs

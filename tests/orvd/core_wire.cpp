@@ -78,8 +78,11 @@ std::string bind(int id, std::string_view name, std::string_view password) {
   return message(id, tlv(0x60, integer(3) + tlv(0x04, name) + tlv(0x80, password)));
 }
 
-std::string sasl_bind(int id, std::string_view mechanism) {
-  return message(id, tlv(0x60, integer(3) + tlv(0x04, "") + tlv(0xA3, tlv(0x04, mechanism))));
+std::string sasl_bind(int id, std::string_view mechanism,
+                      const std::optional<std::string>& credentials) {
+  std::string sasl = tlv(0x04, mechanism);
+  if (credentials) sasl += tlv(0x04, *credentials);
+  return message(id, tlv(0x60, integer(3) + tlv(0x04, "") + tlv(0xA3, sasl)));
 }
 
 std::string search(int id, std::string_view base, int scope, int size_limit, int time_limit) {

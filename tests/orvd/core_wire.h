@@ -15,7 +15,8 @@ std::string integer(int value);
 
 std::string message(int id, std::string_view operation, std::string_view controls = "");
 std::string bind(int id, std::string_view name, std::string_view password);
-std::string sasl_bind(int id, std::string_view mechanism);
+std::string sasl_bind(int id, std::string_view mechanism,
+                      const std::optional<std::string>& credentials = std::nullopt);
 std::string search(int id, std::string_view base, int scope = 0, int size_limit = 0,
                    int time_limit = 0);
 std::string delete_entry(int id, std::string_view dn);
@@ -41,22 +42,24 @@ class WireClient {
   // To a literal IPv4 or IPv6 address, from a certain one of this host ("": any). Throws
   // std::runtime_error when there is no connection.
   WireClient(const std::string& address, std::uint16_t port, const std::string& from = "");
-  ~WireClient();
+  virtual ~WireClient();
   WireClient(const WireClient&) = delete;
   WireClient& operator=(const WireClient&) = delete;
 
-  void send(std::string_view bytes);
+  virtual void send(std::string_view bytes);
   // The next answer, or nothing when the server closed the connection (or ten seconds passed).
   std::optional<Reply> receive();
   // Answers up to and including the first that is no search entry.
   std::vector<Reply> receive_result();
   // Whether the server closes the connection without another answer.
-  bool closed();
+  virtual bool closed();
   void close();
   int descriptor() const { return socket_; }
 
- private:
-  bool fill();
+ protected:
+  WireClient() = default;
+  // Adds what comes in; false when nothing does any more.
+  virtual bool fill();
   int socket_ = -1;
   std::string received_;
 };

@@ -14,6 +14,7 @@
 
 #include "../slapi/failing_allocation.h"
 #include "auth/identities.h"
+#include "auth/sasl_external.h"
 #include "core_bare_session.h"
 #include "ops/canonical.h"
 #include "protocol/decoder.h"
@@ -216,6 +217,17 @@ TEST_F(MemoryOfABind, WantOfItIsNoWrongPassword) {
   });
 }
 
+TEST_F(MemoryOfABind, WantOfItIsNoCertificateOfNobody) {
+  std::ofstream(config(), std::ios::app)
+      << "\ndn: cn=admingroup,cn=configuration\nobjectClass: orv-slapdAdminGroupSettings\n"
+         "cn: admingroup\norv-slapdCertificateMap: cn=a subject that is not short => "
+         "cn=a name that is not short\n";
+  const auto identities = Identities::read(config().c_str(), "", error_, warnings_);
+  ASSERT_TRUE(identities) << error_;
+  expect_throws(
+      [&] { return identities->of_certificate("CN=A SUBJECT THAT IS NOT SHORT") != nullptr; });
+}
+
 // The file is good, so nothing about it will change when there is memory again.
 TEST_F(MemoryOfABind, WantOfItWhileTheFileIsReadIsMadeGoodAfterAPauseAndToldOnce) {
   int told = 0;
@@ -239,8 +251,17 @@ TEST_F(MemoryOfABind, WantOfItWhileTheFileIsReadIsMadeGoodAfterAPauseAndToldOnce
 // ---- the session
 
 class MemoryOfASession : public test::BareSessionTest,
+                         public ExternalIdentities,
                          public testing::WithParamInterface<std::string> {
  protected:
+  MemoryOfASession() {
+    mechanisms_.push_back(make_external(*this));
+    services.mechanisms = &mechanisms_;
+  }
+  std::shared_ptr<const Identity> primary_administrator() override {
+    return std::make_shared<Identity>(Identity{"CN=ROOT", 0x0C, 0, ""});
+  }
+  std::shared_ptr<const Identity> of_certificate(std::string_view) override { return nullptr; }
   bool gate_is_open() {
     class NoWaiter final : public GateWaiter {
       void gate_decided(Verdict) noexcept override {}
@@ -252,9 +273,14 @@ class MemoryOfASession : public test::BareSessionTest,
   }
   std::shared_ptr<test::BareSession> fresh_session(bool bound) {
     session = std::make_shared<test::BareSession>(services, lane, settings);
+    TransportFacts facts;
+    facts.local = true;
+    facts.peer_uid = 0;
+    session->set_transport(facts);
     if (bound) bind_as_root();
     return session;
   }
+  SaslMechanisms mechanisms_;
 };
 
 // A client is answered or its connection ends; its socket's side ends it when `handle` throws.
@@ -287,6 +313,9 @@ TEST_P(MemoryOfASession, AnswersOrEnds) {
 std::vector<std::string> messages() {
   return {test::bind(2, test::kRoot, test::kSecret),
           test::bind(2, "cn=somebody,cn=configuration", "a password that is not short"),
+          test::sasl_bind(2, "EXTERNAL", "dn:cn=root"),
+          test::sasl_bind(2, "EXTERNAL"),
+          test::sasl_bind(2, "A-MECHANISM-THAT-IS-NOT-SHORT", "credentials that are not short"),
           test::search(2, test::kTop, 2),
           test::search(2, "cn=a name that is not short,cn=configuration"),
           test::add_entry(2, "cn=x,cn=configuration", "cn", "x"),

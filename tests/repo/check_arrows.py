@@ -32,7 +32,7 @@ INCLUDES = {
     "orvd": (["slapi", "cfg", "schema", "config"],
              ["asio.hpp", "asio/", "sasl/", "openssl/", "ldap.h", "lber.h", "spdlog/", "CLI/",
               "utf8proc.h"]),
-    "orvcfg": (["slapi", "cfg", "config"], ["CLI/"]),
+    "orvcfg": (["slapi", "cfg", "config"], ["CLI/", "openssl/"]),
     "schema": (["schema"], []),
     "config": (["config"], []),
 }
@@ -49,7 +49,7 @@ LINKS = {
     "lib/libback-config.so": ([r"libslapi\.so", r"libcfg\.so"], ["libslapi.so"]),
     "bin/orvd": ([r"libslapi\.so", r"libcfg\.so", LDAP, OPENSSL, r"lib(spdlog|fmt)\.so.*",
                   r"libsasl2\.so.*"], ["libslapi.so"]),
-    "bin/orvcfg": ([r"libslapi\.so", r"libcfg\.so"], ["libcfg.so"]),
+    "bin/orvcfg": ([r"libslapi\.so", r"libcfg\.so", OPENSSL], ["libcfg.so"]),
 }
 
 FORBIDDEN_CALLS = {"setlocale", "uselocale"}

@@ -53,7 +53,8 @@ class Place:
 
     def __init__(self, source):
         self.source = source
-        self.as_written = not os.path.exists(os.path.join(source, "var")) and port_is_free(3389)
+        self.as_written = (not os.path.exists(os.path.join(source, "var"))
+                           and port_is_free(3389) and port_is_free(3636))
         self.folder = os.path.join(source, "var")
         if not self.as_written:
             self.folder = os.path.join(tempfile.mkdtemp(), "instance")

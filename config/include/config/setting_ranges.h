@@ -45,6 +45,10 @@ inline constexpr SettingRange kSettingRanges[] = {
     {"orv-slapdMessageTimeOut", 1, setting_bounds::seconds},
     {"orv-slapdMaxPersistentSearches", 0, setting_bounds::count},
     {"orv-slapdMaxPersistentSearchesPerConnection", 1, setting_bounds::count},
+    {"orv-slapdSecurePort", 0, 65535},
+    {"orv-slapdMaxUnauthenticatedConnections", 1, setting_bounds::count},
+    {"orv-slapdBindTimeOut", 1, setting_bounds::seconds},
+    {"orv-slapdTlsHandshakeTimeOut", 1, setting_bounds::seconds},
     // A client must be able to fail now and then whatever it sends.
     {"orv-slapdMaxFailedChangeSize", 65536, setting_bounds::bytes / 4},
     {"pwdMinLength", 0, setting_bounds::policy_length},
@@ -55,6 +59,18 @@ inline constexpr SettingRange kSettingRanges[] = {
     {"pwdMaxFailure", 0, setting_bounds::policy_number},
     {"pwdFailureCountInterval", 0, setting_bounds::policy_number},
     {"pwdLockoutDuration", 0, setting_bounds::policy_number},
+};
+
+// Values of orv-slapdTlsClientCertificate, in any letter case.
+inline constexpr std::string_view kClientCertificates[] = {"none", "optional", "required"};
+
+// Values of orv-slapdTlsMinimumVersion.
+inline constexpr std::string_view kTlsVersions[] = {"1.2", "1.3"};
+
+// Settings whose values are absolute paths of files.
+inline constexpr std::string_view kPathSettings[] = {
+    "orv-slapdLog",        "orv-slapdLocalSocket", "orv-slapdTlsCertificateFile",
+    "orv-slapdTlsKeyFile", "orv-slapdTlsCaFile",
 };
 
 // Values of orv-slapdLogLevel, in any letter case.

@@ -11,6 +11,7 @@
 #include "cfg/dn.h"
 #include "cfg/result_codes.h"
 #include "slapi/codepage.h"
+#include "slapi/connection.h"
 #include "slapi/owners.h"
 
 namespace orv::server {
@@ -63,7 +64,9 @@ struct Identities::Data {
   cfg::KeyPtr key;
   std::vector<IdentityRecord> records;
   std::unordered_map<std::string_view, const IdentityRecord*> by_dn;  // null: claimed twice
-  const IdentityRecord* costliest = nullptr;                          // null: nobody has a password
+  // Subjects of certificates, to normal bind DNs; "": mapped twice.
+  std::unordered_map<std::string, std::string> by_subject;
+  const IdentityRecord* costliest = nullptr;  // null: nobody has a password
   std::uint64_t highest_cost = 0;
 
   ~Data() {
@@ -82,6 +85,25 @@ struct Identities::Data {
     }
   }
 
+  void map_certificates(std::vector<CertificateMapping>& mappings,
+                        std::vector<std::string>& warnings) {
+    for (CertificateMapping& mapping : mappings) {
+      if (find_bindable(mapping.bound_dn) == nullptr)
+        warnings.push_back(std::string(kCertificateMap) + ": nobody can bind as " +
+                           mapping.bound_dn);
+      const auto [place, fresh] = by_subject.try_emplace(mapping.subject, mapping.bound_dn);
+      if (fresh) continue;
+      place->second.clear();
+      warnings.push_back(std::string(kCertificateMap) + ": " + mapping.subject +
+                         " is mapped twice, nobody can bind with it");
+    }
+  }
+
+  const IdentityRecord* find_mapped(const std::string& subject) const noexcept {
+    const auto place = by_subject.find(subject);
+    return place == by_subject.end() ? nullptr : find_bindable(place->second);
+  }
+
   void remember_cost(const IdentityRecord& record) {
     if (record.stored_password.empty()) return;
     const std::uint64_t cost = cfg::verification_cost(record.stored_password);
@@ -95,14 +117,15 @@ struct Identities::Data {
     const int code = cfg::normalize_dn(name, normal);
     if (code == result::no_memory) throw std::bad_alloc();
     if (code != 0 || !may_be_bound(normal)) return nullptr;
-    return find_normal(normal);
+    const IdentityRecord* const record = find_bindable(normal);
+    return record != nullptr && !record->stored_password.empty() ? record : nullptr;
   }
 
-  const IdentityRecord* find_normal(std::string_view normal) const noexcept {
+  // Somebody who may bind, whether with a password or otherwise.
+  const IdentityRecord* find_bindable(std::string_view normal) const noexcept {
     const auto place = by_dn.find(normal);
     if (place == by_dn.end() || place->second == nullptr) return nullptr;
-    const IdentityRecord* record = place->second;
-    return record->enabled && !record->stored_password.empty() ? record : nullptr;
+    return place->second->enabled ? place->second : nullptr;
   }
 
   const Identity* authenticate(std::string_view name, std::string_view password,
@@ -144,6 +167,7 @@ std::shared_ptr<const Identities> Identities::read(const char* config_file,
     identities->data_->key = std::move(read.key);
     identities->data_->records = std::move(read.records);
     identities->data_->index(warnings);
+    identities->data_->map_certificates(read.certificates, warnings);
     return identities;
   } catch (...) {
     error.assign("out of memory");
@@ -158,9 +182,27 @@ const Identity* Identities::authenticate(std::string_view name, std::string_view
   return data_->authenticate(name, password, verify);
 }
 
+const Identity* Identities::primary_administrator() const noexcept {
+  for (const IdentityRecord& record : data_->records)
+    if (record.identity.authority == authority::primary_administrator)
+      return data_->find_bindable(record.identity.bound_dn) == &record ? &record.identity : nullptr;
+  return nullptr;
+}
+
+std::shared_ptr<const Identity> Identities::of_certificate(std::string_view subject) const {
+  std::string own(subject);
+  const IdentityRecord* const record = data_->find_mapped(own);
+  if (record == nullptr) return nullptr;
+  auto identity = std::make_shared<Identity>(record->identity);
+  identity->certificate_subject = std::move(own);
+  return identity;
+}
+
 bool Identities::still_valid(const Identity& bound) const noexcept {
-  const IdentityRecord* const record = data_->find_normal(bound.bound_dn);
-  return record != nullptr && same_grant(record->identity, bound);
+  const IdentityRecord* const record = data_->find_bindable(bound.bound_dn);
+  if (record == nullptr || !same_grant(record->identity, bound)) return false;
+  return bound.certificate_subject.empty() ||
+         data_->find_mapped(bound.certificate_subject) == record;
 }
 
 bool Identities::claimed_twice(std::string_view name) const {

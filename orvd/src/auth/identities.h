@@ -8,6 +8,9 @@
 //   supplier of a suffix    entries of class orv-slapdSupplier              flags 0x02
 //   everybody else                                                          flags 0x24
 //
+// To these come certificates of clients that orv-slapdCertificateMap of CN=ADMINGROUP maps to one
+// of them; they prove an identity that has no password, too.
+//
 // Only the first value of an identity's DN and password counts. A DN that two entries claim binds
 // as neither. DNs inside CN=CONFIGURATION and the empty DN are nobody's.
 //
@@ -34,6 +37,7 @@ struct Identity {
   unsigned roles = 0;
   std::string entry_dn;                             // normal form of the entry that defines it
   std::array<unsigned char, 32> password_digest{};  // SHA-256 of the password as it is stored
+  std::string certificate_subject{};  // normal form; of whom a certificate has proved to be it
 };
 
 // Role bits of a list of orv-slapdAdminRole values; 0 when "NoAdmin" is among them.
@@ -60,8 +64,16 @@ class Identities {
   const Identity* authenticate(std::string_view name, std::string_view password,
                                Verify verify = cfg::verify_secret) const;
 
+  // The primary administrator, whom somebody proves to be without a password; null when nobody can
+  // bind as it.
+  const Identity* primary_administrator() const noexcept;
+
+  // The identity that the subject of a certificate (a normal form) is mapped to; null when it is
+  // mapped to nobody, or more than once, or who it is mapped to cannot bind. Throws std::bad_alloc.
+  std::shared_ptr<const Identity> of_certificate(std::string_view subject) const;
+
   // Whether what `bound` (of any snapshot) was granted still stands here: the same entry, bind DN,
-  // flags, roles and stored password, and it may bind.
+  // flags, roles and stored password, the map of the certificate that proved it, and it may bind.
   bool still_valid(const Identity& bound) const noexcept;
 
   // Whether more than one entry claims the DN that is spelled so. Throws std::bad_alloc.

@@ -63,7 +63,8 @@ class RecordReader {
 
   bool read(const char* config_file, const char* key_stash_file) {
     return load_key(key_stash_file) && open(config_file, key_stash_file) && read_kind(kPrimary) &&
-           read_kind(kMember) && read_kind(kServerSupplier) && read_kind(kSuffixSupplier);
+           read_kind(kMember) && read_kind(kServerSupplier) && read_kind(kSuffixSupplier) &&
+           read_certificate_map();
   }
 
  private:
@@ -101,6 +102,26 @@ class RecordReader {
     for (_CFGMessage* record = cfg_first_entry(session_.get(), chain.get()); record != nullptr;
          record = cfg_next_entry(session_.get(), record)) {
       if (!read_entry(kind, record)) return false;
+    }
+    return true;
+  }
+
+  bool read_certificate_map() {
+    _CFGMessage* found = nullptr;
+    const int code =
+        cfg_search_s(session_.get(), kGroup, kScopeBase, kEveryEntry, nullptr, 0, &found);
+    const CfgResult chain(found);
+    if (code == result::no_such_object) return true;
+    if (code != 0) return fail(code, kGroup);
+    _CFGMessage* const entry = cfg_first_entry(session_.get(), chain.get());
+    if (entry == nullptr) return true;
+    for (const std::string& value : values(entry, kCertificateMap)) {
+      CertificateMapping mapping;
+      std::string text;
+      if (!to_utf8(value.c_str(), text) || !parse_certificate_mapping(text, mapping))
+        warn(kGroup, std::string("a value of ") + kCertificateMap + " is not SUBJECT => NAME");
+      else
+        result_.certificates.push_back(std::move(mapping));
     }
     return true;
   }
@@ -204,12 +225,20 @@ class RecordReader {
 
   // DNs in the file are in its own code page.
   static bool normalize_from_file(const char* dn, std::string& normal) {
+    std::string text;
+    if (!to_utf8(dn, text)) return false;
+    const int code = cfg::normalize_dn(text, normal);
+    if (code == result::no_memory) throw std::bad_alloc();
+    return code == 0;
+  }
+
+  static bool to_utf8(const char* local, std::string& text) {
     char* converted = nullptr;
     std::size_t length = 0;
-    int code = xlate_localcp_to_utf8(dn, &converted, &length);
-    const MallocText text(converted);
-    if (code == 0) code = cfg::normalize_dn(text.get(), normal);
+    const int code = xlate_localcp_to_utf8(local, &converted, &length);
+    const MallocText owned(converted);
     if (code == result::no_memory) throw std::bad_alloc();
+    if (code == 0) text = owned.get();
     return code == 0;
   }
 

@@ -7,6 +7,7 @@
 #include <string_view>
 #include <vector>
 
+#include "auth/certificate_map.h"
 #include "auth/identities.h"
 
 namespace orv::server {
@@ -21,6 +22,7 @@ struct IdentityRecord {
 
 struct IdentityRecords {
   std::vector<IdentityRecord> records;
+  std::vector<CertificateMapping> certificates;
   cfg::KeyPtr key;  // opens sealed passwords; null without a key stash
 };
 

@@ -5,12 +5,14 @@
 #include <algorithm>
 #include <asio/buffer.hpp>
 #include <asio/error.hpp>
+#include <asio/ip/tcp.hpp>
 #include <cstring>
 #include <exception>
 #include <new>
 #include <utility>
 
 #include "cfg/result_codes.h"
+#include "ops/log_text.h"
 
 namespace orv::server {
 namespace {
@@ -41,15 +43,16 @@ bool later(const asio::error_code& error) {
 
 }  // namespace
 
-Client::Client(Loop& loop, Services& services, std::uint64_t number, Descriptor arrived,
-               tcp protocol, ConnectionCounter::Ticket ticket)
+Client::Client(Loop& loop, Services& services, std::uint64_t number, Arrival arrival)
     : Session(services, loop.access(), number),
       loop_(loop),
-      arrived_(std::move(arrived)),
-      protocol_(protocol),
+      arrived_(std::move(arrival.socket)),
+      protocol_(arrival.protocol),
       socket_(loop.context()),
-      ticket_(std::move(ticket)),
+      ticket_(std::move(arrival.ticket)),
+      tls_(arrival.secure ? Tls::shaking_hands : Tls::none),
       in_(kReadBytes) {
+  set_transport(std::move(arrival.facts));
   loop_.change_load(1);
 }
 
@@ -66,14 +69,18 @@ void Client::begin(const std::string& peer) {
   arrived_.release();
   socket_.non_blocking(true);
   asio::error_code ignored;
-  socket_.set_option(tcp::no_delay(true), ignored);
-  socket_.set_option(tcp::socket::keep_alive(true), ignored);
+  if (!transport().local) {
+    socket_.set_option(tcp::no_delay(true), ignored);
+    socket_.set_option(tcp::socket::keep_alive(true), ignored);
+  }
   loop_.add(self());
   set_peer(peer);
   if (std::string* const line = begin_access_line()) {
     line->append("ACCEPT from=").append(peer);
+    if (tls_ == Tls::shaking_hands) *line += " tls";
     end_access_line();
   }
+  if (tls_ == Tls::shaking_hands) return begin_handshake();
   watch();
 }
 
@@ -84,20 +91,34 @@ void Client::post(std::function<void()> work) {
 // ---- waiting
 
 void Client::watch() noexcept {
-  if (!waiting_ && !continuing_ && may_read())
-    waiting_ = await(tcp::socket::wait_read, &Client::readable);
+  if (waiting_ || continuing_ || !may_read()) return;
+  waiting_ =
+      stream_ && stream_->has_more() ? read_soon() : await(Socket::wait_read, &Client::readable);
 }
 
-bool Client::await(tcp::socket::wait_type what, void (Client::*then)()) noexcept {
+void Client::go_on(void (Client::*then)()) noexcept {
+  if (state_ == State::closed) return;
   try {
-    socket_.async_wait(what, [self = self(), then](const asio::error_code&) {
-      if (self->state_ == State::closed) return;
-      try {
-        (self.get()->*then)();
-      } catch (const std::exception& error) {
-        self->close(error.what());
-      }
-    });
+    (this->*then)();
+  } catch (const std::exception& error) {
+    close(error.what());
+  }
+}
+
+bool Client::await(Socket::wait_type what, void (Client::*then)()) noexcept {
+  try {
+    socket_.async_wait(what, [self = self(), then](const asio::error_code&) { self->go_on(then); });
+    return true;
+  } catch (const std::exception& error) {
+    close(error.what());
+    return false;
+  }
+}
+
+// What TLS has already taken from the socket would not wake anybody up.
+bool Client::read_soon() noexcept {
+  try {
+    loop_.post([self = self()] { self->go_on(&Client::readable); });
     return true;
   } catch (const std::exception& error) {
     close(error.what());
@@ -108,6 +129,7 @@ bool Client::await(tcp::socket::wait_type what, void (Client::*then)()) noexcept
 // Whether bytes have come that nobody had the time to read.
 bool Client::unread_in_system() noexcept {
   asio::error_code failure;
+  if (stream_ && stream_->has_more()) return true;
   return socket_.available(failure) > 0 && !failure;
 }
 
@@ -119,9 +141,98 @@ bool Client::lost() noexcept {
          failure != 0;
 }
 
+// ---- TLS
+
+bool Client::can_start_tls() const noexcept {
+  try {
+    return !transport().local && services().tls && services().tls->current();
+  } catch (...) {
+    return false;
+  }
+}
+
+void Client::start_tls() {
+  tls_ = Tls::answering;
+  handshake_begun_ = Clock::now();
+  if (backlog() == 0) begin_handshake();
+}
+
+void Client::begin_handshake() {
+  tls_ = Tls::shaking_hands;
+  handshake_begun_ = Clock::now();
+  std::shared_ptr<const TlsContext> context = services().tls->current();
+  if (!context) return close("no certificate");
+  stream_ = std::make_unique<TlsStream>(std::move(context), socket_.native_handle());
+  shake_hands();
+}
+
+void Client::shake_hands() {
+  switch (stream_->shake_hands()) {
+    case Flow::moved:
+      return tls_stands();
+    case Flow::needs_input:
+      await(Socket::wait_read, &Client::shake_hands);
+      return;
+    case Flow::needs_output:
+      await(Socket::wait_write, &Client::shake_hands);
+      return;
+    case Flow::ended:
+    case Flow::failed:
+      break;
+  }
+  const std::string& why = stream_->failure();
+  close(why.empty() ? "connection lost in the TLS handshake" : "TLS handshake failed: " + why);
+}
+
+void Client::tls_stands() {
+  TransportFacts facts = transport();
+  stream_->describe(facts);
+  if (std::string* const line = begin_access_line()) {
+    line->append("TLS version=").append(facts.tls_version);
+    line->append(" cipher=").append(facts.tls_cipher).append(" bits=");
+    append_number(*line, facts.tls_strength);
+    if (!facts.certificate_subject.empty())
+      append_client_text(line->append(" subject="), facts.certificate_subject);
+    end_access_line();
+  }
+  set_transport(std::move(facts));
+  tls_ = Tls::standing;
+  last_activity_ = Clock::now();
+  watch();
+}
+
+Flow Client::receive_some(char* to, std::size_t room, std::size_t& length) {
+  if (stream_) return stream_->read(to, room, length);
+  asio::error_code failure;
+  length = socket_.receive(asio::buffer(to, room), 0, failure);
+  if (!failure) return Flow::moved;
+  if (failure == asio::error::eof) return Flow::ended;
+  return later(failure) ? Flow::needs_input : Flow::failed;
+}
+
+Flow Client::send_some(std::size_t& length) {
+  const char* const from = out_.data() + out_sent_;
+  if (stream_) return stream_->write(from, backlog(), length);
+  asio::error_code failure;
+  do length = socket_.send(asio::buffer(from, backlog()), 0, failure);
+  while (failure == asio::error::interrupted);
+  if (!failure) return Flow::moved;
+  return later(failure) ? Flow::needs_output : Flow::failed;
+}
+
+// The layer protects what follows the bind: what came in clear behind it is nobody's message.
+void Client::protect(std::unique_ptr<SecurityLayer> layer) {
+  const std::string rest(layer_ ? std::string_view() : unread());
+  layer_ = std::move(layer);
+  if (rest.empty()) return;
+  begin_ = end_ = 0;
+  if (!unwrap(rest)) close("not protected by the security layer");
+}
+
 // ---- reading
 
 bool Client::may_read() const noexcept {
+  if (!is_set_up()) return false;
   if (state_ == State::parting) return true;
   return state_ == State::open && !busy() && backlog() < kBacklogMark;
 }
@@ -133,13 +244,55 @@ void Client::readable() {
 }
 
 void Client::read() {
-  make_room();
-  asio::error_code failure;
-  const std::size_t length =
-      socket_.receive(asio::buffer(in_.data() + end_, in_.size() - end_), 0, failure);
-  if (!failure) return received(length);
-  if (failure == asio::error::eof) return close("end of stream");
-  if (!later(failure)) close("connection lost");
+  char wire[kReadBytes];
+  if (!layer_) make_room();
+  char* const to = layer_ ? wire : in_.data() + end_;
+  const std::size_t room = layer_ ? sizeof wire : in_.size() - end_;
+  std::size_t length = 0;
+  switch (receive_some(to, room, length)) {
+    case Flow::moved:
+      return layer_ ? received_wrapped({wire, length}) : received(length);
+    case Flow::needs_input:
+      return nothing_yet();
+    case Flow::needs_output:
+      waiting_ = await(Socket::wait_write, &Client::readable);
+      return;
+    case Flow::ended:
+      return close("end of stream");
+    case Flow::failed:
+      return close("connection lost");
+  }
+}
+
+// Whoever sends half a record has as long for the other half as for that of a message.
+void Client::nothing_yet() {
+  if (!stream_) return;
+  const bool in_pieces = stream_->has_part_of_record();
+  if (in_pieces && !in_pieces_ && begin_ == end_) message_begun_ = Clock::now();
+  in_pieces_ = in_pieces;
+}
+
+void Client::received_wrapped(std::string_view wire) {
+  if (state_ == State::parting) return;
+  const bool waited = in_pieces_ || begin_ != end_;
+  if (!unwrap(wire)) return close("not protected by the security layer");
+  if (!waited) message_begun_ = Clock::now();
+  in_pieces_ = begin_ == end_;
+  process();
+}
+
+// Adds what is in it to what is to be handled.
+bool Client::unwrap(std::string_view wire) {
+  std::string clear;
+  if (!layer_->unwrap(wire, clear)) return false;
+  std::memmove(in_.data(), in_.data() + begin_, end_ - begin_);
+  end_ -= std::exchange(begin_, 0);
+  if (end_ == 0) make_room();
+  if (in_.size() - end_ < clear.size()) in_.resize(end_ + clear.size());
+  std::memcpy(in_.data() + end_, clear.data(), clear.size());
+  end_ += clear.size();
+  cfg::wipe(clear);
+  return true;
 }
 
 // Keeps room for reading: the message at hand moves to the front, and only what has really arrived
@@ -175,7 +328,8 @@ void Client::received(std::size_t length) {
     end_ += length;
     return forget_input();
   }
-  if (begin_ == end_) message_begun_ = Clock::now();
+  if (begin_ == end_ && !in_pieces_) message_begun_ = Clock::now();
+  in_pieces_ = false;
   end_ += length;
   process();
 }
@@ -186,7 +340,8 @@ void Client::process() {
   processing_ = true;
   try {
     int left = kMessagesAtOnce;
-    while (state_ == State::open && !busy() && backlog() < kBacklogMark && process_one())
+    while (state_ == State::open && is_set_up() && !busy() && backlog() < kBacklogMark &&
+           process_one())
       if (--left == 0) {
         continuing_ = true;
         break;
@@ -269,16 +424,28 @@ bool gives_up(std::string_view bytes, std::int32_t message_id) {
 
 }  // namespace
 
+Flow Client::peek(char* to, std::size_t room, std::size_t& length) noexcept {
+  try {
+    if (stream_) return stream_->peek(to, room, length);
+  } catch (...) {
+    return Flow::needs_input;
+  }
+  asio::error_code failure;
+  length = socket_.receive(asio::buffer(to, room), Socket::message_peek, failure);
+  if (!failure) return Flow::moved;
+  return later(failure) ? Flow::needs_input : Flow::failed;
+}
+
 // Only looks: what is found here is read and handled in its turn, when the operation has ended.
 bool Client::lost_interest(PendingOperation& operation) noexcept {
   char bytes[512];
-  asio::error_code failure;
-  const std::size_t length =
-      socket_.receive(asio::buffer(bytes), tcp::socket::message_peek, failure);
-  if (failure && !later(failure)) {
+  std::size_t length = 0;
+  const Flow flow = peek(bytes, sizeof bytes, length);
+  if (flow == Flow::ended || flow == Flow::failed) {
     operation.answer().abandon();
     return true;
   }
+  if (layer_) length = 0;  // nothing can be told from a part of what it protects
   const std::int32_t id = operation.answer().message_id();
   try {
     // What came in one packet with the operation's own message was read along with it.
@@ -295,6 +462,7 @@ bool Client::lost_interest(PendingOperation& operation) noexcept {
 
 void Client::transmit(std::string& bytes) {
   if (state_ != State::open || bytes.empty()) return bytes.clear();
+  if (layer_ && !wrap(bytes)) return close("the security layer failed");
   if (backlog() == 0) {
     out_.swap(bytes);
     bytes.clear();
@@ -308,6 +476,14 @@ void Client::transmit(std::string& bytes) {
   output_is(backlog());
 }
 
+bool Client::wrap(std::string& bytes) {
+  std::string wire;
+  const bool good = layer_->wrap(bytes, wire);
+  bytes.swap(wire);
+  cfg::wipe(wire);
+  return good;
+}
+
 void Client::lend_storage(std::string& bytes) noexcept {
   if (backlog() == 0 && !writing_) bytes.swap(out_);
   bytes.clear();
@@ -319,16 +495,15 @@ void Client::flush() {
 
 void Client::write() {
   while (backlog() > 0) {
-    asio::error_code failure;
-    const std::size_t sent =
-        socket_.send(asio::buffer(out_.data() + out_sent_, backlog()), 0, failure);
-    if (!failure) {
+    std::size_t sent = 0;
+    const Flow flow = send_some(sent);
+    if (flow == Flow::moved) {
       out_sent_ += sent;
       write_progress_ = Clock::now();
-    } else if (failure == asio::error::interrupted) {
-      continue;
-    } else if (later(failure)) {
-      if (!writing_) writing_ = await(tcp::socket::wait_write, &Client::writable);
+    } else if (flow == Flow::needs_output || flow == Flow::needs_input) {
+      if (!writing_)
+        writing_ = await(flow == Flow::needs_output ? Socket::wait_write : Socket::wait_read,
+                         &Client::writable);
       return output_is(state_ == State::closed ? 0 : backlog());
     } else {
       return close("connection lost");
@@ -353,6 +528,7 @@ void Client::all_sent() {
   else
     out_.clear();
   if (state_ == State::parting) part();
+  if (state_ == State::open && tls_ == Tls::answering) begin_handshake();
 }
 
 // ---- ending
@@ -367,8 +543,11 @@ void Client::disconnect(int code, std::string_view text) {
     append_quoted(*line, text);
     end_access_line();
   }
+  // In the middle of a handshake nothing can be told.
+  if (!is_set_up()) return close("not told");
   std::string notice;
   if (!encode_notice_of_disconnection(notice, code, text)) return close("out of memory");
+  if (layer_ && !wrap(notice)) return close("the security layer failed");
   out_ += notice;
   state_ = State::parting;
   parting_since_ = Clock::now();
@@ -389,14 +568,19 @@ void Client::drop() {
 // throw the notice away, so the client is given time to close, unless the server is stopping.
 void Client::part() {
   asio::error_code ignored;
-  socket_.shutdown(tcp::socket::shutdown_send, ignored);
+  if (stream_) stream_->say_goodbye();
+  socket_.shutdown(Socket::shutdown_send, ignored);
   if (services().stopping.load(std::memory_order_relaxed)) close("server is stopping");
 }
 
 void Client::close(std::string_view why) noexcept {
   if (state_ == State::closed) return;
+  const bool unread = backlog() > 0;
   state_ = State::closed;
   asio::error_code ignored;
+  // It would come in the middle of a record otherwise.
+  if (stream_ && !unread) stream_->say_goodbye();
+  stream_.reset();
   socket_.close(ignored);
   try {
     if (std::string* const line = begin_access_line()) {
@@ -438,13 +622,20 @@ void Client::sweep(Clock::time_point now) {
     return past(since, seconds) && !unread_in_system();
   };
   if (!waiting_ && lost()) return close("connection lost");
+  if (!is_set_up()) {
+    if (past(handshake_begun_, limits.handshake_timeout))
+      close("TLS handshake not finished in time");
+    return;
+  }
   if (state_ == State::parting) {
     if (now - parting_since_ >= kPartingTime) close("gone");
   } else if (backlog() > 0) {
     if (past(write_progress_, limits.write_timeout)) write();  // it may have read just now
     if (backlog() > 0 && past(write_progress_, limits.write_timeout))
       close("does not read its answers");
-  } else if (begin_ != end_ && may_read()) {
+  } else if (bind_is_overdue(now)) {
+    disconnect(result::unavailable, "bind not finished in time");
+  } else if ((begin_ != end_ || in_pieces_) && may_read()) {
     if (late(message_begun_, limits.message_timeout))
       disconnect(result::unavailable, "message not finished in time");
   } else if (idle() && !listens() && limits.idle_timeout > 0) {

@@ -1,4 +1,5 @@
-// A client's TCP connection: its socket, its buffers and its deadlines.
+// A client's connection, over TCP or a Unix socket: its socket, its buffers and its deadlines; and
+// what may lie between the bytes on the socket and the messages, TLS and a security layer of SASL.
 //
 // Asio says when the socket can be read or written; reading and writing then are plain calls that
 // do not block. An idle connection has no read under way that would own a buffer, and what has not
@@ -12,7 +13,7 @@
 // Threads: the loop's thread, except construction.
 #pragma once
 
-#include <asio/ip/tcp.hpp>
+#include <asio/generic/stream_protocol.hpp>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -23,15 +24,24 @@
 #include "descriptor.h"
 #include "net/limits.h"
 #include "net/loop.h"
+#include "net/tls.h"
 #include "ops/session.h"
 
 namespace orv::server {
 
+// A connection as it comes from its listener.
+struct Arrival {
+  Descriptor socket;
+  asio::generic::stream_protocol protocol{0, 0};
+  TransportFacts facts;
+  bool secure = false;  // TLS comes first
+  ConnectionCounter::Ticket ticket;
+};
+
 class Client final : public Session {
  public:
-  // `arrived` is a connected socket of `protocol`. Any thread.
-  Client(Loop& loop, Services& services, std::uint64_t number, Descriptor arrived,
-         asio::ip::tcp protocol, ConnectionCounter::Ticket ticket);
+  // Any thread.
+  Client(Loop& loop, Services& services, std::uint64_t number, Arrival arrival);
   ~Client() override { loop_.change_load(-1); }
 
   // Begins to serve. On the loop's thread.
@@ -52,30 +62,59 @@ class Client final : public Session {
   void drop() override;
   void resume() override;
   void settled() override;
+  bool can_start_tls() const noexcept override;
+  void start_tls() override;
+  bool more_is_here() const noexcept override { return !last_here_; }
+  void protect(std::unique_ptr<SecurityLayer> layer) override;
 
  private:
+  using Socket = asio::generic::stream_protocol::socket;
+
   enum class State {
     open,
     parting,  // a notice of disconnection is on its way; what still comes in is thrown away
     closed,
   };
 
+  // TLS of a connection that has some, or is to have it.
+  enum class Tls {
+    none,
+    answering,  // the answer to StartTLS is on its way, in clear
+    shaking_hands,
+    standing,
+  };
+
   void begin(const std::string& peer);
+
+  // ---- TLS
+  // Messages can be exchanged.
+  bool is_set_up() const noexcept { return tls_ == Tls::none || tls_ == Tls::standing; }
+  void begin_handshake();
+  void shake_hands();
+  void tls_stands();
+  Flow receive_some(char* to, std::size_t room, std::size_t& length);
+  Flow send_some(std::size_t& length);
 
   // ---- reading
   bool may_read() const noexcept;
   void readable();
   void read();
   void received(std::size_t length);
+  void received_wrapped(std::string_view wire);
   void process();
   bool process_one();
   void make_room();
+  bool unwrap(std::string_view wire);
+  void nothing_yet();
   void consume(std::size_t length);
   void forget_input();
   std::string_view unread() const noexcept { return {in_.data() + begin_, end_ - begin_}; }
   std::shared_ptr<Client> self() { return std::static_pointer_cast<Client>(shared_from_this()); }
 
+  Flow peek(char* to, std::size_t room, std::size_t& length) noexcept;
+
   // ---- writing
+  bool wrap(std::string& bytes);
   std::size_t backlog() const noexcept { return out_.size() - out_sent_; }
   void writable();
   void write();
@@ -85,7 +124,9 @@ class Client final : public Session {
   // Waits for bytes, when some may be read.
   void watch() noexcept;
   // Calls `then` when the socket is ready. False, with the connection closed, without memory.
-  bool await(asio::ip::tcp::socket::wait_type what, void (Client::*then)()) noexcept;
+  bool await(Socket::wait_type what, void (Client::*then)()) noexcept;
+  bool read_soon() noexcept;
+  void go_on(void (Client::*then)()) noexcept;
   bool unread_in_system() noexcept;
   bool lost() noexcept;
 
@@ -95,10 +136,13 @@ class Client final : public Session {
 
   Loop& loop_;
   Descriptor arrived_;  // until it begins
-  const asio::ip::tcp protocol_;
-  asio::ip::tcp::socket socket_;
+  const asio::generic::stream_protocol protocol_;
+  Socket socket_;
   ConnectionCounter::Ticket ticket_;
   State state_ = State::open;
+  Tls tls_ = Tls::none;
+  std::unique_ptr<TlsStream> stream_;     // once its handshake has begun
+  std::unique_ptr<SecurityLayer> layer_;  // null: none
 
   std::vector<char> in_;  // bytes [begin_, end_) are received and not handled yet
   std::size_t begin_ = 0;
@@ -106,6 +150,7 @@ class Client final : public Session {
   bool processing_ = false;
   bool last_here_ = false;   // the message at hand is the last one that is here
   bool continuing_ = false;  // a continuation of process() is posted
+  bool in_pieces_ = false;   // part of a record is here that nothing can be told from
 
   std::string out_;  // bytes from out_sent_ on are to be written
   std::size_t out_sent_ = 0;
@@ -113,9 +158,10 @@ class Client final : public Session {
   bool waiting_ = false;  // for bytes
 
   // When each began; meaningful while the condition lasts.
-  Clock::time_point last_activity_ = Clock::now();   // nothing outstanding
-  Clock::time_point message_begun_ = Clock::now();   // part of a message is here
-  Clock::time_point write_progress_ = Clock::now();  // something is unwritten
+  Clock::time_point last_activity_ = Clock::now();    // nothing outstanding
+  Clock::time_point message_begun_ = Clock::now();    // part of a message is here
+  Clock::time_point write_progress_ = Clock::now();   // something is unwritten
+  Clock::time_point handshake_begun_ = Clock::now();  // TLS does not stand yet
   Clock::time_point parting_since_{};
   bool settled_ = false;
 };

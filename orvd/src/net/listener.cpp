@@ -1,19 +1,33 @@
 #include "net/listener.h"
 
+#include <algorithm>
+#include <asio/ip/tcp.hpp>
 #include <asio/ip/v6_only.hpp>
+#include <cstring>
 #include <exception>
+#include <limits>
 #include <utility>
 
 #include "cfg/result_codes.h"
-#include "net/client.h"
 
 namespace orv::server {
 namespace {
 
 using asio::ip::tcp;
+using Endpoint = asio::generic::stream_protocol::endpoint;
 
 // How long accepting rests when the process has no descriptor or memory left for a connection.
 constexpr std::chrono::milliseconds kAcceptPause{100};
+// What all clients of the Unix socket are counted as.
+constexpr const char* kLocalPeer = "local";
+
+tcp::endpoint tcp_endpoint(const Endpoint& endpoint) {
+  tcp::endpoint result;
+  const std::size_t size = std::min(endpoint.size(), result.capacity());
+  std::memcpy(result.data(), endpoint.data(), size);
+  result.resize(size);
+  return result;
+}
 
 std::string endpoint_text(const tcp::endpoint& endpoint) {
   const std::string address = endpoint.address().to_string();
@@ -22,10 +36,57 @@ std::string endpoint_text(const tcp::endpoint& endpoint) {
 }
 
 // One client behind an IPv4-mapped address is the same client as behind the plain one.
-std::string counted_address(const asio::ip::address& address) {
+asio::ip::address plain_address(const asio::ip::address& address) {
   if (address.is_v6() && address.to_v6().is_v4_mapped())
-    return asio::ip::make_address_v4(asio::ip::v4_mapped, address.to_v6()).to_string();
-  return address.to_string();
+    return asio::ip::make_address_v4(asio::ip::v4_mapped, address.to_v6());
+  return address;
+}
+
+// A path inside a URL (RFC 3986, 2.1).
+std::string url_text(const std::string& path) {
+  constexpr std::string_view kPlain =
+      "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789-._~";
+  constexpr char kHex[] = "0123456789ABCDEF";
+  std::string text;
+  for (const char c : path) {
+    const auto byte = static_cast<unsigned char>(c);
+    if (kPlain.find(c) != std::string_view::npos)
+      text += c;
+    else
+      text.append(1, '%').append(1, kHex[byte >> 4]).append(1, kHex[byte & 15]);
+  }
+  return text;
+}
+
+// Who holds the other end, and as whom it is counted. False when it has gone already.
+struct Peer {
+  std::string text;
+  std::string counted;
+};
+using Socket = asio::generic::stream_protocol::socket;
+
+bool describe_tcp(Socket& socket, TransportFacts& facts, Peer& peer) {
+  asio::error_code gone;
+  const Endpoint remote = socket.remote_endpoint(gone);
+  if (gone) return false;
+  const Endpoint local = socket.local_endpoint(gone);
+  if (gone) return false;
+  const asio::ip::address address = plain_address(tcp_endpoint(remote).address());
+  peer = {endpoint_text(tcp_endpoint(remote)), address.to_string()};
+  facts.peer = peer.text;
+  facts.own = endpoint_text(tcp_endpoint(local));
+  facts.loopback = address.is_loopback();
+  return true;
+}
+
+bool describe_local(Socket& socket, TransportFacts& facts, Peer& peer) {
+  uid_t user = 0;
+  pid_t process = 0;
+  if (!peer_of(socket.native_handle(), user, process)) return false;
+  facts.local = true;
+  facts.peer_uid = user;
+  peer = {"local uid=" + std::to_string(user) + " pid=" + std::to_string(process), kLocalPeer};
+  return true;
 }
 
 }  // namespace
@@ -34,18 +95,20 @@ Listeners::Listeners(asio::io_context& context, Services& services, ConnectionCo
                      std::vector<std::unique_ptr<Loop>>& loops)
     : context_(context), services_(services), counter_(counter), loops_(loops) {}
 
-bool Listeners::open(const std::vector<std::string>& addresses, std::uint16_t port,
+bool Listeners::open(const std::vector<std::string>& addresses, std::uint16_t port, bool secure,
                      std::string& error) {
+  const auto chosen = [&] { return port != 0 ? port : this->port(secure); };
   if (addresses.empty()) {
     // A host without IPv6 is served over IPv4 alone.
-    return open_one("0.0.0.0", port, true, error) && open_one("::", this->port(), false, error);
+    return open_one("0.0.0.0", port, secure, true, error) &&
+           open_one("::", chosen(), secure, false, error);
   }
   for (const std::string& address : addresses)
-    if (!open_one(address, listeners_.empty() ? port : this->port(), true, error)) return false;
+    if (!open_one(address, chosen(), secure, true, error)) return false;
   return true;
 }
 
-bool Listeners::open_one(const std::string& address, std::uint16_t port, bool required,
+bool Listeners::open_one(const std::string& address, std::uint16_t port, bool secure, bool required,
                          std::string& error) {
   asio::error_code failure;
   const asio::ip::address parsed = asio::ip::make_address(address, failure);
@@ -53,8 +116,8 @@ bool Listeners::open_one(const std::string& address, std::uint16_t port, bool re
     error = "cannot listen on '" + address + "': not an IP address, such as 127.0.0.1 or ::1";
     return false;
   }
-  auto made = std::make_unique<Listener>(context_);
-  tcp::acceptor& acceptor = made->acceptor;
+  auto made = std::make_unique<Listener>(context_, secure ? Kind::secure : Kind::clear);
+  Acceptor& acceptor = made->acceptor;
   const tcp::endpoint endpoint(parsed, port);
   acceptor.open(endpoint.protocol(), failure);
   if (!failure) acceptor.set_option(tcp::acceptor::reuse_address(true), failure);
@@ -71,29 +134,43 @@ bool Listeners::open_one(const std::string& address, std::uint16_t port, bool re
   return true;
 }
 
+bool Listeners::open_local(const std::string& path, std::string& error) {
+  Descriptor socket = local_.listen(path, error);
+  if (!socket) return false;
+  auto made = std::make_unique<Listener>(context_, Kind::local);
+  asio::error_code failure;
+  made->acceptor.assign(asio::generic::stream_protocol(AF_UNIX, 0), socket.number(), failure);
+  if (failure) {
+    error = "cannot listen at " + path + ": " + failure.message();
+    return false;
+  }
+  socket.release();
+  listeners_.push_back(std::move(made));
+  return true;
+}
+
 void Listeners::start(std::shared_ptr<const Settings> settings) {
   settings_ = std::move(settings);
   for (const auto& listener : listeners_) accept(*listener);
 }
 
 void Listeners::accept(Listener& listener) {
-  listener.acceptor.async_accept(
-      [this, &listener](const asio::error_code& error, tcp::socket socket) {
-        if (error == asio::error::operation_aborted) return;
-        if (!error) {
-          try {
-            accepted(std::move(socket));
-          } catch (const std::exception& failure) {
-            services_.logs.error("a new connection is lost: " + std::string(failure.what()));
-          }
-          return accept(listener);
-        }
-        services_.logs.error("cannot accept a connection: " + error.message());
-        listener.pause.expires_after(kAcceptPause);
-        listener.pause.async_wait([this, &listener](const asio::error_code& stopped) {
-          if (!stopped) accept(listener);
-        });
-      });
+  listener.acceptor.async_accept([this, &listener](const asio::error_code& error, Socket socket) {
+    if (error == asio::error::operation_aborted) return;
+    if (!error) {
+      try {
+        accepted(listener, std::move(socket));
+      } catch (const std::exception& failure) {
+        services_.logs.error("a new connection is lost: " + std::string(failure.what()));
+      }
+      return accept(listener);
+    }
+    services_.logs.error("cannot accept a connection: " + error.message());
+    listener.pause.expires_after(kAcceptPause);
+    listener.pause.async_wait([this, &listener](const asio::error_code& stopped) {
+      if (!stopped) accept(listener);
+    });
+  });
 }
 
 // Beginning with the one after the last, so that a few connections spread.
@@ -107,28 +184,45 @@ Loop& Listeners::next_loop() noexcept {
   return *least;
 }
 
-void Listeners::accepted(tcp::socket socket) {
+// Why one more connection cannot be; "" when it can. Strangers must not be able to keep out who
+// administers the server on its own host.
+std::string Listeners::admit(Arrival& arrival, const std::string& counted) {
+  constexpr std::int64_t kAny = std::numeric_limits<std::int64_t>::max();
+  const Settings& limits = *settings_;
+  const bool local = arrival.facts.local;
+  if (!local && services_.unauthenticated.load(std::memory_order_relaxed) >=
+                    limits.max_unauthenticated_connections)
+    return "too many connections on which nobody is bound";
+  arrival.ticket = counter_.admit(counted, local ? kAny : limits.max_connections,
+                                  limits.max_connections_per_address);
+  return arrival.ticket ? "" : "too many connections";
+}
+
+void Listeners::accepted(const Listener& listener, Socket socket) {
+  Arrival arrival;
+  Peer peer;
+  const bool local = listener.kind == Kind::local;
+  arrival.secure = listener.kind == Kind::secure;
+  if (local ? !describe_local(socket, arrival.facts, peer)
+            : !describe_tcp(socket, arrival.facts, peer))
+    return;
   asio::error_code gone;
-  const tcp::endpoint peer = socket.remote_endpoint(gone);
-  if (gone) return;
-  const std::string text = endpoint_text(peer);
-  ConnectionCounter::Ticket ticket =
-      counter_.admit(counted_address(peer.address()), settings_->max_connections,
-                     settings_->max_connections_per_address);
-  if (!ticket) {
-    services_.logs.warning("too many connections: refused " + text);
+  if (const std::string refusal = admit(arrival, peer.counted); !refusal.empty()) {
+    services_.logs.warning(refusal + ": refused " + peer.text);
+    if (arrival.secure) return;  // whose client would not understand
     std::string notice;
-    encode_notice_of_disconnection(notice, result::busy, "too many connections");
+    encode_notice_of_disconnection(notice, result::busy, refusal);
     socket.non_blocking(true, gone);
     socket.send(asio::buffer(notice), 0, gone);
     return;
   }
-  Descriptor descriptor(socket.release(gone));
+  const Endpoint own = socket.local_endpoint(gone);
+  if (!gone) arrival.protocol = own.protocol();
+  if (!gone) arrival.socket = Descriptor(socket.release(gone));
   if (gone) return;
   Loop& loop = next_loop();
-  const auto client = std::make_shared<Client>(
-      loop, services_, next_number_++, std::move(descriptor), peer.protocol(), std::move(ticket));
-  loop.post([client, text] { client->start(text); });
+  const auto client = std::make_shared<Client>(loop, services_, next_number_++, std::move(arrival));
+  loop.post([client, text = peer.text] { client->start(text); });
 }
 
 void Listeners::close() noexcept {
@@ -137,17 +231,32 @@ void Listeners::close() noexcept {
     listener->acceptor.close(ignored);
     listener->pause.cancel();
   }
+  local_.remove();
 }
 
-std::uint16_t Listeners::port() const {
+std::uint16_t Listeners::port(bool secure) const {
   asio::error_code ignored;
-  return listeners_.empty() ? std::uint16_t{0}
-                            : listeners_.front()->acceptor.local_endpoint(ignored).port();
+  for (const auto& listener : listeners_)
+    if (listener->kind == (secure ? Kind::secure : Kind::clear))
+      return tcp_endpoint(listener->acceptor.local_endpoint(ignored)).port();
+  return 0;
+}
+
+std::string Listeners::url(const Listener& listener) const {
+  if (listener.kind == Kind::local) return "ldapi://" + url_text(local_.path());
+  asio::error_code ignored;
+  return (listener.kind == Kind::secure ? "ldaps://" : "ldap://") +
+         endpoint_text(tcp_endpoint(listener.acceptor.local_endpoint(ignored)));
 }
 
 std::string Listeners::url() const {
-  asio::error_code ignored;
-  return "ldap://" + endpoint_text(listeners_.front()->acceptor.local_endpoint(ignored));
+  return url(*listeners_.front());
+}
+
+std::vector<std::string> Listeners::urls() const {
+  std::vector<std::string> all;
+  for (const auto& listener : listeners_) all.push_back(url(*listener));
+  return all;
 }
 
 }  // namespace orv::server

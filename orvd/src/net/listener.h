@@ -3,14 +3,17 @@
 // Threads: everything on the thread that runs the context it was given.
 #pragma once
 
+#include <asio/basic_socket_acceptor.hpp>
+#include <asio/generic/stream_protocol.hpp>
 #include <asio/io_context.hpp>
-#include <asio/ip/tcp.hpp>
 #include <asio/steady_timer.hpp>
 #include <memory>
 #include <string>
 #include <vector>
 
+#include "net/client.h"
 #include "net/limits.h"
+#include "net/local_socket.h"
 #include "net/loop.h"
 #include "ops/services.h"
 
@@ -21,9 +24,13 @@ class Listeners {
   Listeners(asio::io_context& context, Services& services, ConnectionCounter& counter,
             std::vector<std::unique_ptr<Loop>>& loops);
 
-  // Opens a socket on each address (literal IPv4 or IPv6; none: every address of the host). With
-  // port 0 the first one's port, which the kernel chose, serves for all. False with the cause.
-  bool open(const std::vector<std::string>& addresses, std::uint16_t port, std::string& error);
+  // Opens a socket on each address (literal IPv4 or IPv6; none: every address of the host), for
+  // connections that begin in clear or with TLS. With port 0 the first one's port, which the kernel
+  // chose, serves for all. False with the cause.
+  bool open(const std::vector<std::string>& addresses, std::uint16_t port, bool secure,
+            std::string& error);
+  // Opens a Unix socket, for its owner and root.
+  bool open_local(const std::string& path, std::string& error);
 
   // Begins to accept. `settings` is asked for the limits in force.
   void start(std::shared_ptr<const Settings> settings);
@@ -33,18 +40,29 @@ class Listeners {
 
   // "ldap://ADDRESS:PORT" of the first listener.
   std::string url() const;
-  std::uint16_t port() const;
+  // Those of all listeners.
+  std::vector<std::string> urls() const;
+  // Of the first listener of that kind; 0 when there is none.
+  std::uint16_t port(bool secure = false) const;
 
  private:
+  using Acceptor = asio::basic_socket_acceptor<asio::generic::stream_protocol>;
+  using Socket = asio::generic::stream_protocol::socket;
+  enum class Kind { clear, secure, local };
   struct Listener {
-    explicit Listener(asio::io_context& context) : acceptor(context), pause(context) {}
-    asio::ip::tcp::acceptor acceptor;
+    Listener(asio::io_context& context, Kind listens_for)
+        : kind(listens_for), acceptor(context), pause(context) {}
+    const Kind kind;
+    Acceptor acceptor;
     asio::steady_timer pause;
   };
 
-  bool open_one(const std::string& address, std::uint16_t port, bool required, std::string& error);
+  bool open_one(const std::string& address, std::uint16_t port, bool secure, bool required,
+                std::string& error);
   void accept(Listener& listener);
-  void accepted(asio::ip::tcp::socket socket);
+  void accepted(const Listener& listener, Socket socket);
+  std::string admit(Arrival& arrival, const std::string& counted);
+  std::string url(const Listener& listener) const;
   Loop& next_loop() noexcept;
 
   asio::io_context& context_;
@@ -52,6 +70,7 @@ class Listeners {
   ConnectionCounter& counter_;
   std::vector<std::unique_ptr<Loop>>& loops_;
   std::vector<std::unique_ptr<Listener>> listeners_;
+  LocalSocket local_;
   std::shared_ptr<const Settings> settings_;
   std::size_t last_loop_ = 0;
   std::uint64_t next_number_ = 1;

@@ -17,7 +17,8 @@ Consequences of_place(std::string_view normal_dn) noexcept {
   Consequences found;
   found.policy = normal_dn == kPolicy;
   found.methods = normal_dn == kTop || normal_dn == kGroup;
-  found.settings = normal_dn == kTop || cfg::normal_dn_is_at_or_below(normal_dn, kLogs);
+  found.settings =
+      normal_dn == kTop || normal_dn == kGroup || cfg::normal_dn_is_at_or_below(normal_dn, kLogs);
   return found;
 }
 
@@ -28,13 +29,16 @@ Consequences consequences_of_add(std::string_view normal_dn, const entry& added)
   for (const std::string_view name : kClassesOfIdentities)
     if (value_find_short_list(added.object_class_list, name.data(), name.size()) == 0)
       found.identities = true;
+  // Its settings say whom certificates belong to.
+  if (normal_dn == kGroup) found.identities = true;
   return found;
 }
 
 Consequences consequences_of_change(std::string_view normal_dn,
                                     const Authenticator& authenticator) noexcept {
   Consequences found = of_place(normal_dn);
-  found.identities = normal_dn == kTop || authenticator.may_define(normal_dn);
+  found.identities =
+      normal_dn == kTop || normal_dn == kGroup || authenticator.may_define(normal_dn);
   return found;
 }
 

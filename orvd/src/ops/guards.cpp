@@ -1,11 +1,9 @@
 #include "ops/guards.h"
 
-#include <algorithm>
 #include <string>
 
 #include "cfg/result_codes.h"
 #include "cfg/text.h"
-#include "config/setting_ranges.h"
 #include "settings.h"
 #include "slapi/connection.h"
 
@@ -15,7 +13,6 @@ namespace {
 constexpr std::string_view kPolicy = "CN=PWDPOLICY ADMIN,CN=CONFIGURATION";
 constexpr std::string_view kPassThrough = "CN=PASSTHROUGH AUTHENTICATION,CN=CONFIGURATION";
 constexpr std::string_view kObjectClass = "objectClass";
-constexpr std::string_view kLogLevel = "orv-slapdLogLevel";
 
 constexpr Guard kGuards[] = {
     // With a policy of their own making, members could set any password they like.
@@ -55,16 +52,10 @@ Refusal refuse_class(std::string_view normal_dn, std::string_view name) {
   return {};
 }
 
-bool is_level(std::string_view value) noexcept {
-  return std::any_of(std::begin(kLogLevels), std::end(kLogLevels), [&](std::string_view level) {
-    return cfg::equals_ignore_ascii_case(level, value);
-  });
-}
-
 Refusal refuse_value(std::string_view normal_dn, std::string_view type, std::string_view value) {
   if (type == kObjectClass) return refuse_class(normal_dn, value);
-  if (type == kLogLevel && !is_level(value))
-    return {result::constraint_violation, std::string(type) + " is no level of a log"};
+  if (const std::string problem = value_problem(type, value); !problem.empty())
+    return {result::constraint_violation, std::string(type) + " " + problem};
   for (const SettingRow& row : setting_rows()) {
     Settings scratch;
     std::string error;

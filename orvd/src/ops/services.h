@@ -12,6 +12,7 @@
 #include <vector>
 
 #include "auth/identities.h"
+#include "auth/sasl.h"
 #include "logs.h"
 #include "ops/backend_host.h"
 #include "ops/consequences.h"
@@ -25,6 +26,7 @@
 namespace orv::server {
 
 class AuditLog;
+class TlsHolder;
 
 // Proves who a client is.
 class Authenticator {
@@ -47,9 +49,15 @@ class Authenticator {
   virtual bool may_define(std::string_view) const noexcept { return true; }
 };
 
+// What one connection is offered, as the root DSE tells it.
+struct Offer {
+  std::vector<std::string> sasl_mechanisms;
+  bool start_tls = false;
+};
+
 // Entries of the server's own outside every backend; null without memory.
 struct Publications {
-  std::function<std::shared_ptr<const entry>()> root_dse;
+  std::function<std::shared_ptr<const entry>(const Offer&)> root_dse;
   std::function<std::shared_ptr<const entry>()> subschema;
 };
 
@@ -83,7 +91,10 @@ struct Services {
   unsigned long (*changes_made)() = nullptr;
   FailedChangesByName failed_changes{};
   PersistentSearches persistent_searches{};
-  AuditLog* audit = nullptr;  // null: changes are not recorded
+  AuditLog* audit = nullptr;                     // null: changes are not recorded
+  const SaslMechanisms* mechanisms = nullptr;    // null: none
+  TlsHolder* tls = nullptr;                      // null: TLS is not offered
+  std::atomic<std::int64_t> unauthenticated{0};  // connections on which nobody is bound
 };
 
 }  // namespace orv::server

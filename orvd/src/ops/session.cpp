@@ -9,6 +9,7 @@
 #include "cfg/masked_dn.h"
 #include "cfg/result_codes.h"
 #include "cfg/secret.h"
+#include "cfg/text.h"
 #include "ops/log_text.h"
 #include "publish/match.h"
 #include "publish/root_dse.h"
@@ -187,6 +188,11 @@ Session::Session(Services& services, AccessLane& access, std::uint64_t number)
   connection_.aux = &aux_;
   connection_.server = this;
   install_senders(connection_);
+  count_as_unauthenticated(true);
+}
+
+Session::~Session() {
+  count_as_unauthenticated(false);
 }
 
 // ---- messages
@@ -223,6 +229,9 @@ void Session::take(Message& message) {
   Refusal refusal = read_controls(message, wish);
   if (auto* bind = std::get_if<BindRequest>(&request))
     return receive_bind(id, *bind, std::move(refusal));
+  // RFC 4511, 4.2.1: nothing may come between the steps of a bind.
+  if (std::exchange(exchange_, nullptr))
+    refusal = {result::operations_error, "a bind is under way"};
   if (refusal) {
     audit_refused(message, refusal.code);
     return respond(id, answer_tag, refusal.code, refusal.text, described(request));
@@ -231,6 +240,9 @@ void Session::take(Message& message) {
   if (const auto* wanted = std::get_if<AddRequest>(&request)) return change(id, *wanted);
   if (const auto* wanted = std::get_if<DeleteRequest>(&request)) return change(id, *wanted);
   if (const auto* wanted = std::get_if<ModifyRequest>(&request)) return change(id, *wanted);
+  if (const auto* wanted = std::get_if<ExtendedRequest>(&request);
+      wanted && wanted->oid == kStartTlsOid)
+    return begin_tls(id, *wanted);
   if (std::holds_alternative<ExtendedRequest>(request))
     return respond(id, answer_tag, result::protocol_error, "extended operation not supported",
                    described(request));
@@ -268,7 +280,7 @@ void Session::search(std::int32_t id, SearchRequest& request, const PersistentWi
     return respond(id, tag::search_done, result::unavailable_critical_extension,
                    "persistent searches are for the configuration", described(request));
   if (target == Target::root_dse && request.scope == 0)
-    return search_published(id, request, services_.publications.root_dse());
+    return search_published(id, request, services_.publications.root_dse(offer()));
   if (target == Target::subschema)
     return search_published(id, request, services_.publications.subschema());
 
@@ -659,6 +671,8 @@ void Session::client_left() noexcept {
   gone_ = true;
   connection_.state.store(0, std::memory_order_relaxed);
   aux_.client_gone.store(1, std::memory_order_relaxed);
+  count_as_unauthenticated(false);
+  exchange_.reset();
   end_persistent_searches();
   for (std::size_t i = 0; i < outstanding_.size();) {
     const OperationPtr operation = outstanding_[i];
@@ -722,11 +736,14 @@ void Session::try_bind() {
 void Session::start_bind() {
   const BindPtr bind = bind_;  // outlives the answer to it
   const BindRequest& request = bind->request;
+  // RFC 4513, 5.2.1: any other bind than one by the same mechanism ends an exchange.
+  if (bind->refusal || request.simple ||
+      !cfg::equals_ignore_ascii_case(request.mechanism, mechanism_))
+    exchange_.reset();
   if (bind_->refusal) return finish_bind(bind_->refusal.code, bind_->refusal.text, nullptr);
   if (request.version != 3)
     return finish_bind(result::protocol_error, "only LDAP version 3 is supported", nullptr);
-  if (!request.simple)
-    return finish_bind(result::auth_method_not_supported, "mechanism not supported", nullptr);
+  if (!request.simple) return start_step();
   std::string normal;
   const Target target = find_target(request.name, normal);
   if (target == Target::not_a_dn)
@@ -736,17 +753,31 @@ void Session::start_bind() {
   if (request.password.empty())
     return finish_bind(result::unwilling_to_perform, "a name without a password proves nothing",
                        nullptr);
+  if (needs_confidentiality())
+    return finish_bind(result::confidentiality_required, "passwords need TLS here", nullptr);
   if (target == Target::configuration) return ask_backend_to_bind();
   verify_password();
 }
 
-void Session::verify_password() {
+bool Session::needs_confidentiality() const noexcept {
+  if (transport_.encrypted()) return false;
+  return transport_.local || transport_.loopback ? settings().tls_for_local_passwords
+                                                 : settings().tls_for_passwords;
+}
+
+// `work` ends by coming back.
+template <typename Work>
+void Session::on_verifier(Work work) {
   try {
     asio::post(services_.verifiers,
-               [this, self = shared_from_this(), bind = bind_] { verify(bind); });
+               [self = shared_from_this(), bind = bind_, work] { work(bind); });
   } catch (const std::bad_alloc&) {
     finish_bind(result::no_memory, "", nullptr);
   }
+}
+
+void Session::verify_password() {
+  on_verifier([this](const BindPtr& bind) { verify(bind); });
 }
 
 // On a worker.
@@ -763,6 +794,11 @@ void Session::verify(const BindPtr& bind) noexcept {
     bind->code = result::other;
   }
   wipe_credentials(bind->request);
+  come_back(bind);
+}
+
+// On a worker.
+void Session::come_back(const BindPtr& bind) noexcept {
   bind->verified.store(true);
   try {
     post([this, self = shared_from_this(), bind] {
@@ -779,9 +815,77 @@ void Session::verify(const BindPtr& bind) noexcept {
 
 void Session::verified(const BindPtr& bind) {
   if (bind_ != bind) return;
-  finish_bind(bind->code, "", bind->identity);
+  if (bind->exchange)
+    finish_step(bind);
+  else
+    finish_bind(bind->code, "", bind->identity);
   resume();
 }
+
+// ---- bind by SASL
+
+// Takes the next step of the exchange that the request goes on with, or the first of a new one.
+void Session::start_step() {
+  if (!exchange_) {
+    const SaslMechanism* const mechanism =
+        services_.mechanisms
+            ? find_mechanism(*services_.mechanisms, bind_->request.mechanism, transport_)
+            : nullptr;
+    if (!mechanism)
+      return finish_bind(result::auth_method_not_supported, "mechanism not supported", nullptr);
+    // Whoever is found by any of the steps is no newer than this.
+    exchange_generation_ = services_.authenticator.generation();
+    exchange_begun_ = Clock::now();
+    mechanism_ = mechanism->name();
+    exchange_ = mechanism->start(transport_);
+    if (!exchange_) throw std::bad_alloc();
+  }
+  bind_->generation = exchange_generation_;
+  bind_->exchange = std::move(exchange_);
+  on_verifier([this](const BindPtr& bind) { take_step_of(*bind), come_back(bind); });
+}
+
+// On a worker.
+void Session::take_step_of(Bind& bind) noexcept {
+  try {
+    std::optional<std::string_view> credentials;
+    if (bind.request.credentials) credentials = *bind.request.credentials;
+    bind.outcome = bind.exchange->step(credentials);
+  } catch (const std::bad_alloc&) {
+    bind.outcome.code = result::no_memory;
+  } catch (...) {
+    bind.outcome.code = result::other;
+  }
+  wipe_credentials(bind.request);
+}
+
+void Session::finish_step(const BindPtr& bind) {
+  SaslOutcome& outcome = bind->outcome;
+  switch (outcome.state) {
+    case SaslOutcome::State::go_on:
+      if (!gone_) exchange_ = std::move(bind->exchange);
+      return finish_bind(result::sasl_bind_in_progress, "", nullptr);
+    case SaslOutcome::State::done:
+      if (!outcome.identity) return finish_bind(result::other, "", nullptr);
+      return finish_bind(result::success, "", outcome.identity);
+    case SaslOutcome::State::failed:
+      break;
+  }
+  outcome.reply.reset();
+  const bool fails =
+      outcome.code != result::success && outcome.code != result::sasl_bind_in_progress;
+  finish_bind(fails ? outcome.code : result::other, outcome.text, nullptr);
+}
+
+bool Session::bind_is_overdue(Clock::time_point now) const noexcept {
+  return exchange_ && now - exchange_begun_ >= std::chrono::seconds(settings().bind_timeout);
+}
+
+void Session::protect(std::unique_ptr<SecurityLayer>) {
+  disconnect(result::other, "no security layer is possible here");
+}
+
+// ---- the result of a bind
 
 void Session::ask_backend_to_bind() {
   Answer answer(bind_->message_id, tag::bind_response, {});
@@ -800,21 +904,85 @@ void Session::finish_bind(int code, std::string_view text,
   bind_ = nullptr;
   wipe_credentials(bind->request);
   std::string what;
-  if (services_.logs.access_enabled())
-    what = describe_dn("BIND", bind->request.name) + (bind->request.simple ? " simple" : " sasl");
+  if (services_.logs.access_enabled()) what = describe_bind(*bind, identity.get());
   log_result(bind->message_id, what, gone_ ? kAbandoned : code, 0, bind->received);
   if (gone_) return settle_if_done();
   become(std::move(identity));
   identity_checked_ = bind->generation;
   Answer answer(bind->message_id, tag::bind_response, {});
-  answer.result(code, "", text);
+  ResultAnswer result{};
+  result.code = code;
+  result.text = text;
+  if (bind->outcome.reply) result.sasl_credentials = &*bind->outcome.reply;
+  answer.result(result);
   transmit_answer(answer);
+  if (code != result::success || !bind->outcome.layer) return;
+  protected_ = true;
+  protect(std::move(bind->outcome.layer));
+}
+
+std::string Session::describe_bind(const Bind& bind, const Identity* identity) {
+  std::string text = describe_dn("BIND", bind.request.name);
+  if (bind.request.simple) {
+    text += " simple";
+  } else {
+    text += " sasl mechanism=";
+    append_client_text(text, bind.request.mechanism);
+  }
+  if (!bind.outcome.name.empty()) append_client_text(text += " name=", bind.outcome.name);
+  if (identity) append_client_text(text += " as=", identity->bound_dn);
+  return text;
 }
 
 void Session::become(std::shared_ptr<const Identity> identity) noexcept {
   identity_ = std::move(identity);
   connection_.authority = identity_ ? identity_->authority : authority::no_configuration_access;
   connection_.roles = identity_ ? identity_->roles : 0;
+  count_as_unauthenticated(!identity_ && !gone_);
+}
+
+void Session::count_as_unauthenticated(bool counted) noexcept {
+  if (std::exchange(unauthenticated_, counted) == counted) return;
+  services_.unauthenticated.fetch_add(counted ? 1 : -1, std::memory_order_relaxed);
+}
+
+// ---- StartTLS (RFC 4511, 4.14)
+
+Refusal Session::refuse_tls(const ExtendedRequest& request) const {
+  if (request.value) return {result::protocol_error, "StartTLS takes no value"};
+  if (transport_.encrypted()) return {result::operations_error, "TLS is in use already"};
+  if (protected_) return {result::operations_error, "a security layer is in use"};
+  if (!outstanding_.empty() || listens())
+    return {result::operations_error, "operations are outstanding"};
+  if (!can_start_tls()) return {result::protocol_error, "TLS is not offered here"};
+  return {};
+}
+
+// What was proved in clear, where others may have had a hand in it, does not hold under TLS.
+void Session::begin_tls(std::int32_t id, const ExtendedRequest& request) {
+  const Refusal refusal = refuse_tls(request);
+  // Whoever put it there, it must never be taken for something said under TLS.
+  if (!refusal && more_is_here())
+    return disconnect(result::protocol_error, "something follows a StartTLS request");
+  const Clock::time_point started = Clock::now();
+  Answer answer(id, tag::extended_response, {});
+  ResultAnswer result{};
+  result.code = refusal.code;
+  result.text = refusal.text;
+  result.response_name = kStartTlsOid;
+  answer.result(result);
+  if (!refusal) become(nullptr);
+  transmit_answer(answer);
+  log_result(id, "STARTTLS", refusal.code, 0, started);
+  if (!refusal) start_tls();
+}
+
+Offer Session::offer() const {
+  Offer offer;
+  if (services_.mechanisms)
+    offer.sasl_mechanisms = offered_mechanisms(*services_.mechanisms, transport_);
+  offer.start_tls = !transport_.encrypted() && can_start_tls();
+  return offer;
 }
 
 bool Session::awaits_change() const noexcept {

@@ -3,7 +3,8 @@
 //
 // Rules kept here (RFC 4511): a bind waits until nothing is outstanding, and nothing else is read
 // meanwhile; a failed bind leaves the connection anonymous; abandon and unbind have no answer; a
-// message ID that is still in use ends the connection; unknown critical controls are refused.
+// message ID that is still in use ends the connection; unknown critical controls are refused; what
+// follows a StartTLS request in clear is not looked at.
 // Callers without access to the configuration are refused before the backend is entered.
 //
 // Threads: everything on the connection's loop thread, except `decided`.
@@ -16,6 +17,7 @@
 #include <string_view>
 #include <vector>
 
+#include "auth/sasl.h"
 #include "ops/operation.h"
 #include "ops/services.h"
 #include "protocol/decoder.h"
@@ -24,11 +26,14 @@
 
 namespace orv::server {
 
+inline constexpr const char* kStartTlsOid = "1.3.6.1.4.1.1466.20037";
+
 class Session : public OperationHome,
                 public ChangeListener,
                 public std::enable_shared_from_this<Session> {
  public:
   Session(Services& services, AccessLane& access, std::uint64_t number);
+  ~Session() override;
 
   Connection& connection() noexcept override { return connection_; }
   void decided(std::shared_ptr<PendingOperation> operation, Verdict verdict) noexcept override;
@@ -55,6 +60,14 @@ class Session : public OperationHome,
   virtual void resume() = 0;
   // Nothing is outstanding any more on a connection that has ended.
   virtual void settled() = 0;
+  // Whether TLS could be started now, if nothing but the transport were asked.
+  virtual bool can_start_tls() const noexcept { return false; }
+  // The answer to StartTLS is queued: no message is handled any more before TLS stands.
+  virtual void start_tls() {}
+  // Whether bytes are here that the client sent behind the message at hand.
+  virtual bool more_is_here() const noexcept { return false; }
+  // From what is queued next on, and for what comes in from now on, `layer` is used.
+  virtual void protect(std::unique_ptr<SecurityLayer> layer);
 
   // ---- what the subclass calls
   // Handles one whole message; `frame` need not outlive the call.
@@ -69,6 +82,11 @@ class Session : public OperationHome,
   bool listens() const noexcept { return !persistent_.empty(); }
   // Who the client is, for the audit log.
   void set_peer(std::string_view peer) { peer_ = peer; }
+  // What the transport proves; before the first message, and when TLS stands.
+  void set_transport(TransportFacts facts) { transport_ = std::move(facts); }
+  const TransportFacts& transport() const noexcept { return transport_; }
+  // Whether a bind in several steps has taken until `now` longer than it may.
+  bool bind_is_overdue(Clock::time_point now) const noexcept;
   // The subclass has so many bytes to write now. To be called whenever that changes.
   void output_is(std::size_t unwritten) noexcept;
   // To be called a few times a second, also when the client is gone.
@@ -79,7 +97,7 @@ class Session : public OperationHome,
   std::string* begin_access_line();
   void end_access_line() { access_.end(); }
 
-  Services& services() noexcept { return services_; }
+  Services& services() const noexcept { return services_; }
 
  private:
   // A bind request that waits or is being verified. It does not move, so that the password is in
@@ -95,7 +113,9 @@ class Session : public OperationHome,
     // The verification's outcome; valid from `verified` on.
     int code = 0;
     std::shared_ptr<const Identity> identity;
-    std::uint64_t generation = 0;  // of the identities, not newer than what was asked
+    std::unique_ptr<SaslExchange> exchange;  // whose step this is
+    SaslOutcome outcome;                     // of that step
+    std::uint64_t generation = 0;            // of the identities, not newer than what was asked
     std::atomic<bool> verified{false};
   };
   using BindPtr = std::shared_ptr<Bind>;
@@ -187,12 +207,26 @@ class Session : public OperationHome,
   void receive_bind(std::int32_t id, BindRequest& request, Refusal refusal);
   void try_bind();
   void start_bind();
+  bool needs_confidentiality() const noexcept;
   void verify_password();
+  void start_step();
+  static void take_step_of(Bind& bind) noexcept;
+  void finish_step(const BindPtr& bind);
+  template <typename Work>
+  void on_verifier(Work work);
+  void come_back(const BindPtr& bind) noexcept;
+  static std::string describe_bind(const Bind& bind, const Identity* identity);
   void verify(const BindPtr& bind) noexcept;
   void verified(const BindPtr& bind);
   void ask_backend_to_bind();
   void finish_bind(int code, std::string_view text, std::shared_ptr<const Identity> identity);
   void become(std::shared_ptr<const Identity> identity) noexcept;
+  void count_as_unauthenticated(bool counted) noexcept;
+
+  // ---- extended operations that concern the connection
+  void begin_tls(std::int32_t id, const ExtendedRequest& request);
+  Refusal refuse_tls(const ExtendedRequest& request) const;
+  Offer offer() const;
   bool identity_holds();
   bool awaits_change() const noexcept;
   void settle_if_done();
@@ -213,6 +247,13 @@ class Session : public OperationHome,
   OperationPtr notice_;                          // that is being looked up
   bool notice_posted_ = false;
   BindPtr bind_;
+  TransportFacts transport_;
+  bool protected_ = false;                  // a security layer of SASL is in use
+  std::unique_ptr<SaslExchange> exchange_;  // between two of its steps
+  std::string mechanism_;                   // of the exchange
+  Clock::time_point exchange_begun_{};
+  std::uint64_t exchange_generation_ = 0;  // of the identities when it began
+  bool unauthenticated_ = false;           // counted as such
   bool gone_ = false;
   bool starting_held_ = false;
   std::size_t held_ = 0;               // of the outstanding ones

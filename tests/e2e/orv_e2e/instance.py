@@ -47,6 +47,26 @@ class Instance:
         return "ldap://%s:%d" % (self.host, self.port)
 
     @property
+    def secure_url(self):
+        return self._listener("ldaps")
+
+    @property
+    def secure_port(self):
+        return int(self.secure_url.rsplit(":", 1)[1])
+
+    @property
+    def local_url(self):
+        return self._listener("ldapi")
+
+    def _listener(self, kind):
+        line = self.stderr.wait_for(lambda text: " serves " in text)
+        return re.search(kind + r"://\S+", line).group()
+
+    @property
+    def certificate(self):
+        return self.directory / "tls.crt"
+
+    @property
     def password(self):
         return (self.directory / "admin.pw").read_text()
 

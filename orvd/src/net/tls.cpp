@@ -1,0 +1,296 @@
+#include "net/tls.h"
+
+#include <fcntl.h>
+#include <lber.h>
+#include <ldap.h>
+#include <openssl/err.h>
+#include <openssl/evp.h>
+#include <openssl/pem.h>
+#include <openssl/ssl.h>
+#include <openssl/x509.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+#include <new>
+#include <utility>
+
+#include "cfg/dn.h"
+#include "descriptor.h"
+
+namespace orv::server {
+namespace {
+
+// Of TLS 1.2; those of 1.3 are all of this kind.
+constexpr const char* kSuites = "ECDHE+AESGCM:ECDHE+CHACHA20";
+constexpr const char* kGroups = "X25519:P-256:P-384";
+// 112 bits at least: RSA from 2048 bits on, no SHA-1 signatures.
+constexpr int kSecurityLevel = 2;
+// Certificates between a client's own and the authority.
+constexpr int kChainDepth = 8;
+
+template <auto Release>
+struct Releaser {
+  template <typename T>
+  void operator()(T* object) const noexcept {
+    Release(object);
+  }
+};
+using Context = std::unique_ptr<SSL_CTX, Releaser<SSL_CTX_free>>;
+using Bio = std::unique_ptr<BIO, Releaser<BIO_free>>;
+using Certificate = std::unique_ptr<X509, Releaser<X509_free>>;
+
+// The first of the queued errors in words; empties the queue.
+std::string queued_error() {
+  const unsigned long code = ERR_peek_error();
+  const char* const reason = code != 0 ? ERR_reason_error_string(code) : nullptr;
+  std::string text = reason ? reason : "";
+  if (code != 0 && !reason) {
+    char buffer[160];
+    ERR_error_string_n(code, buffer, sizeof buffer);
+    text = buffer;
+  }
+  ERR_clear_error();
+  return text;
+}
+
+bool fail(std::string& error, const std::string& file, const std::string& what) {
+  const std::string why = queued_error();
+  error = file + ": " + what + (why.empty() ? "" : ": " + why);
+  return false;
+}
+
+// OpenSSL would report a file that cannot be opened as one more of its own errors.
+bool can_read(const std::string& file, std::string& error) {
+  if (::access(file.c_str(), R_OK) == 0) return true;
+  error = file + ": " + std::strerror(errno);
+  return false;
+}
+
+bool is_private(const std::string& file, std::string& error) {
+  const Descriptor opened(::open(file.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
+  struct stat status {};
+  if (!opened || ::fstat(opened.number(), &status) != 0) {
+    error = file + ": " + std::strerror(errno);
+    return false;
+  }
+  if (!S_ISREG(status.st_mode)) {
+    error = file + ": not a regular file";
+    return false;
+  }
+  if ((status.st_mode & (S_IRWXO | S_IWGRP)) == 0) return true;
+  error = file +
+          ": others may read the private key, or change it; take these rights away "
+          "(chmod 600)";
+  return false;
+}
+
+int no_passphrase(char*, int, int, void*) {
+  return -1;  // there is nobody to ask
+}
+
+void set_rules(SSL_CTX* context, const TlsSettings& settings) {
+  SSL_CTX_set_security_level(context, kSecurityLevel);
+  SSL_CTX_set_min_proto_version(context, settings.tls_1_2 ? TLS1_2_VERSION : TLS1_3_VERSION);
+  SSL_CTX_set_options(context, SSL_OP_NO_RENEGOTIATION | SSL_OP_NO_COMPRESSION |
+                                   SSL_OP_CIPHER_SERVER_PREFERENCE | SSL_OP_PRIORITIZE_CHACHA |
+                                   SSL_OP_NO_TICKET | SSL_OP_CLEANSE_PLAINTEXT);
+  SSL_CTX_set_session_cache_mode(context, SSL_SESS_CACHE_OFF);
+  SSL_CTX_set_num_tickets(context, 0);
+  SSL_CTX_set_mode(context, SSL_MODE_ENABLE_PARTIAL_WRITE | SSL_MODE_ACCEPT_MOVING_WRITE_BUFFER |
+                                SSL_MODE_RELEASE_BUFFERS);
+  SSL_CTX_set_default_passwd_cb(context, no_passphrase);
+}
+
+bool load_own(SSL_CTX* context, const TlsSettings& settings, std::string& error) {
+  const std::string& certificate = settings.certificate_file;
+  const std::string& key = settings.key_file.empty() ? certificate : settings.key_file;
+  if (!can_read(certificate, error) || !is_private(key, error)) return false;
+  if (SSL_CTX_use_certificate_chain_file(context, certificate.c_str()) != 1)
+    return fail(error, certificate, "no usable certificate");
+  if (SSL_CTX_use_PrivateKey_file(context, key.c_str(), SSL_FILETYPE_PEM) != 1)
+    return fail(error, key, "no usable private key");
+  if (SSL_CTX_check_private_key(context) != 1)
+    return fail(error, key, "not the key of the certificate in " + certificate);
+  return true;
+}
+
+bool load_authorities(SSL_CTX* context, const TlsSettings& settings, std::string& error) {
+  if (settings.client_certificates == ClientCertificates::none) return true;
+  const std::string& file = settings.ca_file;
+  if (file.empty()) {
+    error =
+        "clients' certificates are asked for, but orv-slapdTlsCaFile does not say who signs them";
+    return false;
+  }
+  if (!can_read(file, error)) return false;
+  if (SSL_CTX_load_verify_file(context, file.c_str()) != 1)
+    return fail(error, file, "no usable certificates");
+  STACK_OF(X509_NAME)* const names = SSL_load_client_CA_file(file.c_str());
+  if (!names) return fail(error, file, "no usable certificates");
+  SSL_CTX_set_client_CA_list(context, names);
+  const bool required = settings.client_certificates == ClientCertificates::required;
+  SSL_CTX_set_verify(context, SSL_VERIFY_PEER | (required ? SSL_VERIFY_FAIL_IF_NO_PEER_CERT : 0),
+                     nullptr);
+  SSL_CTX_set_verify_depth(context, kChainDepth);
+  return true;
+}
+
+// The DN as LDAP writes it; "" when it has none.
+std::string ldap_name(const X509_NAME* name) {
+  unsigned char* encoded = nullptr;
+  const int length = i2d_X509_NAME(name, &encoded);
+  if (length < 0) throw std::bad_alloc();
+  berval der{static_cast<ber_len_t>(length), reinterpret_cast<char*>(encoded)};
+  berval text{};
+  const int code = ldap_X509dn2bv(&der, &text, nullptr, 0);
+  OPENSSL_free(encoded);
+  std::string dn;
+  if (code == LDAP_SUCCESS && text.bv_val) dn.assign(text.bv_val, text.bv_len);
+  ber_memfree(text.bv_val);
+  if (code == LDAP_NO_MEMORY) throw std::bad_alloc();
+  return dn;
+}
+
+std::string normal_name(const X509_NAME* name) {
+  std::string normal;
+  if (cfg::normalize_dn(ldap_name(name), normal) != 0) normal.clear();
+  return normal;
+}
+
+std::string time_text(const ASN1_TIME* time) {
+  const Bio memory(BIO_new(BIO_s_mem()));
+  char buffer[64];
+  if (!memory || ASN1_TIME_print(memory.get(), time) != 1) return "?";
+  const int length = BIO_read(memory.get(), buffer, sizeof buffer);
+  return std::string(buffer, length > 0 ? static_cast<std::size_t>(length) : 0);
+}
+
+// RFC 5929, 4.1: the hash of the certificate's own signature, SHA-256 in place of weaker ones.
+std::string end_point_of(const X509* certificate) {
+  int digest = NID_undef;
+  if (X509_get_signature_info(const_cast<X509*>(certificate), &digest, nullptr, nullptr, nullptr) !=
+          1 ||
+      digest == NID_undef || digest == NID_md5 || digest == NID_sha1)
+    digest = NID_sha256;
+  unsigned char hash[EVP_MAX_MD_SIZE];
+  unsigned int size = 0;
+  if (X509_digest(certificate, EVP_get_digestbynid(digest), hash, &size) != 1) size = 0;
+  return {reinterpret_cast<const char*>(hash), size};
+}
+
+}  // namespace
+
+// ---- what connections share
+
+TlsContext::~TlsContext() {
+  SSL_CTX_free(context_);
+}
+
+std::shared_ptr<const TlsContext> TlsContext::load(const TlsSettings& settings,
+                                                   std::string& error) {
+  ERR_clear_error();
+  Context made(SSL_CTX_new(TLS_server_method()));
+  if (!made) throw std::bad_alloc();
+  set_rules(made.get(), settings);
+  if (SSL_CTX_set_cipher_list(made.get(), kSuites) != 1 ||
+      SSL_CTX_set1_groups_list(made.get(), kGroups) != 1) {
+    error = "OpenSSL does not know the suites: " + queued_error();
+    return nullptr;
+  }
+  if (!load_own(made.get(), settings, error) || !load_authorities(made.get(), settings, error))
+    return nullptr;
+  const std::shared_ptr<TlsContext> context(new TlsContext(made.release()));
+  const X509* const certificate = SSL_CTX_get0_certificate(context->context_);
+  context->end_point_ = end_point_of(certificate);
+  context->description_ = ldap_name(X509_get_subject_name(certificate)) + ", good until " +
+                          time_text(X509_get0_notAfter(certificate));
+  context->expired_ = X509_cmp_current_time(X509_get0_notAfter(certificate)) < 0;
+  ERR_clear_error();
+  return context;
+}
+
+// ---- one connection
+
+TlsStream::TlsStream(std::shared_ptr<const TlsContext> context, int socket)
+    : context_(std::move(context)), ssl_(SSL_new(context_->get())) {
+  if (!ssl_) throw std::bad_alloc();
+  if (SSL_set_fd(ssl_, socket) != 1) {
+    SSL_free(ssl_);
+    throw std::bad_alloc();
+  }
+  SSL_set_accept_state(ssl_);
+}
+
+TlsStream::~TlsStream() {
+  SSL_free(ssl_);
+}
+
+Flow TlsStream::outcome(int returned) {
+  if (returned > 0) return Flow::moved;
+  switch (SSL_get_error(ssl_, returned)) {
+    case SSL_ERROR_WANT_READ:
+      return Flow::needs_input;
+    case SSL_ERROR_WANT_WRITE:
+      return Flow::needs_output;
+    case SSL_ERROR_ZERO_RETURN:
+      return Flow::ended;
+    default:
+      broken_ = true;
+      failure_ = queued_error();
+      return Flow::failed;
+  }
+}
+
+Flow TlsStream::shake_hands() {
+  ERR_clear_error();
+  return outcome(SSL_do_handshake(ssl_));
+}
+
+Flow TlsStream::read(char* to, std::size_t room, std::size_t& length) {
+  ERR_clear_error();
+  length = 0;
+  return outcome(SSL_read_ex(ssl_, to, room, &length));
+}
+
+Flow TlsStream::write(const char* from, std::size_t size, std::size_t& length) {
+  ERR_clear_error();
+  length = 0;
+  return outcome(SSL_write_ex(ssl_, from, size, &length));
+}
+
+Flow TlsStream::peek(char* to, std::size_t room, std::size_t& length) {
+  ERR_clear_error();
+  length = 0;
+  return outcome(SSL_peek_ex(ssl_, to, room, &length));
+}
+
+bool TlsStream::has_more() const noexcept {
+  return SSL_pending(ssl_) > 0;
+}
+
+bool TlsStream::has_part_of_record() const noexcept {
+  return SSL_pending(ssl_) == 0 && SSL_has_pending(ssl_) == 1;
+}
+
+void TlsStream::say_goodbye() noexcept {
+  if (broken_ || !SSL_is_init_finished(ssl_)) return;
+  ERR_clear_error();
+  SSL_shutdown(ssl_);
+  ERR_clear_error();
+}
+
+void TlsStream::describe(TransportFacts& facts) const {
+  facts.tls_version = SSL_get_version(ssl_);
+  facts.tls_cipher = SSL_get_cipher_name(ssl_);
+  facts.tls_strength = SSL_get_cipher_bits(ssl_, nullptr);
+  facts.server_end_point = context_->end_point();
+  facts.certificate_subject.clear();
+  const Certificate certificate(SSL_get1_peer_certificate(ssl_));
+  if (certificate && SSL_get_verify_result(ssl_) == X509_V_OK)
+    facts.certificate_subject = normal_name(X509_get_subject_name(certificate.get()));
+}
+
+}  // namespace orv::server

@@ -1,0 +1,164 @@
+#include "core_tls_client.h"
+
+#include <openssl/err.h>
+#include <openssl/evp.h>
+#include <openssl/pem.h>
+#include <openssl/x509v3.h>
+#include <poll.h>
+#include <stdlib.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/time.h>
+
+#include <cstdio>
+#include <filesystem>
+#include <stdexcept>
+
+namespace orv::server::test {
+namespace {
+
+constexpr int kPatienceSeconds = 10;
+
+void must(bool done) {
+  if (!done) throw std::runtime_error("OpenSSL refuses");
+}
+
+using File = std::unique_ptr<FILE, int (*)(FILE*)>;
+
+File open_file(const std::string& path, const char* mode) {
+  File file(std::fopen(path.c_str(), mode), &std::fclose);
+  must(file != nullptr);
+  return file;
+}
+
+X509* read_certificate(const std::string& path) {
+  return PEM_read_X509(open_file(path, "r").get(), nullptr, nullptr, nullptr);
+}
+
+EVP_PKEY* read_key(const std::string& path) {
+  return PEM_read_PrivateKey(open_file(path, "r").get(), nullptr, nullptr, nullptr);
+}
+
+}  // namespace
+
+Certificates::Certificates() {
+  folder_ = std::filesystem::temp_directory_path() / "orv-tls-XXXXXX";
+  must(mkdtemp(folder_.data()) != nullptr);
+}
+
+Certificates::~Certificates() {
+  std::filesystem::remove_all(folder_);
+}
+
+Pair Certificates::make(const std::string& name, const Pair* issuer, bool authority) {
+  EVP_PKEY* const key = EVP_EC_gen("P-256");
+  X509* const certificate = X509_new();
+  must(key && certificate);
+  X509_set_version(certificate, X509_VERSION_3);
+  ASN1_INTEGER_set(X509_get_serialNumber(certificate), ++made_);
+  X509_gmtime_adj(X509_getm_notBefore(certificate), -60);
+  X509_gmtime_adj(X509_getm_notAfter(certificate), 3600);
+  X509_NAME* const subject = X509_get_subject_name(certificate);
+  X509_NAME_add_entry_by_txt(subject, "O", MBSTRING_UTF8,
+                             reinterpret_cast<const unsigned char*>("Orv Test"), -1, -1, 0);
+  X509_NAME_add_entry_by_txt(subject, "CN", MBSTRING_UTF8,
+                             reinterpret_cast<const unsigned char*>(name.c_str()), -1, -1, 0);
+  X509* const parent = issuer ? read_certificate(issuer->certificate) : certificate;
+  EVP_PKEY* const parent_key = issuer ? read_key(issuer->key) : key;
+  X509_set_issuer_name(certificate, X509_get_subject_name(parent));
+  X509_set_pubkey(certificate, key);
+  X509_EXTENSION* const basic = X509V3_EXT_conf_nid(nullptr, nullptr, NID_basic_constraints,
+                                                    authority ? "critical,CA:TRUE" : "CA:FALSE");
+  X509_add_ext(certificate, basic, -1);
+  must(X509_sign(certificate, parent_key, EVP_sha256()) > 0);
+  const std::string base = path(std::to_string(made_));
+  const Pair pair{base + ".crt", base + ".key"};
+  must(PEM_write_X509(open_file(pair.certificate, "w").get(), certificate) == 1);
+  must(PEM_write_PrivateKey(open_file(pair.key, "w").get(), key, nullptr, nullptr, 0, nullptr,
+                            nullptr) == 1);
+  must(::chmod(pair.key.c_str(), 0600) == 0);
+  X509_EXTENSION_free(basic);
+  if (issuer) X509_free(parent);
+  if (issuer) EVP_PKEY_free(parent_key);
+  X509_free(certificate);
+  EVP_PKEY_free(key);
+  return pair;
+}
+
+Pair Certificates::self_signed(const std::string& name) {
+  return make(name, nullptr, false);
+}
+
+const std::string& Certificates::authority() {
+  if (authority_.certificate.empty()) authority_ = make("Authority", nullptr, true);
+  return authority_.certificate;
+}
+
+Pair Certificates::of_client(const std::string& name) {
+  authority();
+  return make(name, &authority_, false);
+}
+
+// ---- the client
+
+TlsClient::~TlsClient() {
+  SSL_free(ssl_);
+  SSL_CTX_free(context_);
+}
+
+bool TlsClient::shake_hands(const TlsWish& wish) {
+  context_ = SSL_CTX_new(TLS_client_method());
+  must(context_ != nullptr);
+  SSL_CTX_set_security_level(context_, 0);
+  SSL_CTX_set_min_proto_version(context_, wish.oldest);
+  SSL_CTX_set_max_proto_version(context_, wish.newest);
+  if (!wish.suites.empty()) must(SSL_CTX_set_cipher_list(context_, wish.suites.c_str()) == 1);
+  if (wish.own) {
+    must(SSL_CTX_use_certificate_file(context_, wish.own->certificate.c_str(), SSL_FILETYPE_PEM) ==
+         1);
+    must(SSL_CTX_use_PrivateKey_file(context_, wish.own->key.c_str(), SSL_FILETYPE_PEM) == 1);
+  }
+  const timeval patience{kPatienceSeconds, 0};
+  ::setsockopt(socket_, SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
+  ssl_ = SSL_new(context_);
+  must(ssl_ && SSL_set_fd(ssl_, socket_) == 1);
+  const bool done = SSL_connect(ssl_) == 1;
+  ERR_clear_error();
+  return done;
+}
+
+void TlsClient::send(std::string_view bytes) {
+  if (!ssl_) return WireClient::send(bytes);
+  if (!bytes.empty()) SSL_write(ssl_, bytes.data(), static_cast<int>(bytes.size()));
+  ERR_clear_error();
+}
+
+bool TlsClient::fill() {
+  if (!ssl_) return WireClient::fill();
+  char bytes[65536];
+  const int length = SSL_read(ssl_, bytes, sizeof bytes);
+  ERR_clear_error();
+  if (length <= 0) return false;
+  received_.append(bytes, static_cast<std::size_t>(length));
+  return true;
+}
+
+bool TlsClient::closed() {
+  if (!ssl_) return WireClient::closed();
+  char byte;
+  const int length = SSL_read(ssl_, &byte, 1);
+  const int error = SSL_get_error(ssl_, length);
+  ERR_clear_error();
+  return length <= 0 && error != SSL_ERROR_WANT_READ;
+}
+
+std::string TlsClient::peer_name() const {
+  X509* const certificate = SSL_get1_peer_certificate(ssl_);
+  if (!certificate) return "";
+  char name[128] = {};
+  X509_NAME_get_text_by_NID(X509_get_subject_name(certificate), NID_commonName, name, sizeof name);
+  X509_free(certificate);
+  return name;
+}
+
+}  // namespace orv::server::test

@@ -1,0 +1,71 @@
+// Certificates made on the spot, and a client that speaks TLS with them.
+#pragma once
+
+#include <openssl/ssl.h>
+
+#include <memory>
+#include <string>
+#include <string_view>
+
+#include "core_wire.h"
+
+namespace orv::server::test {
+
+// A certificate and its key, in two PEM files (0600).
+struct Pair {
+  std::string certificate;
+  std::string key;
+};
+
+// Makes pairs in a folder of its own, which goes with it.
+class Certificates {
+ public:
+  Certificates();
+  ~Certificates();
+
+  Pair self_signed(const std::string& name);
+  // By an authority that is made with the first of them.
+  Pair of_client(const std::string& name);
+  const std::string& authority();
+  std::string path(const std::string& name) const { return folder_ + "/" + name; }
+
+ private:
+  Pair make(const std::string& name, const Pair* issuer, bool authority);
+  std::string folder_;
+  Pair authority_;
+  int made_ = 0;
+};
+
+// How a client shakes hands.
+struct TlsWish {
+  int oldest = TLS1_2_VERSION;
+  int newest = TLS1_3_VERSION;
+  const Pair* own = nullptr;
+  std::string suites{};  // of TLS 1.2; "": all that OpenSSL has
+};
+
+// A connection in clear until it shakes hands. It trusts every server.
+class TlsClient final : public WireClient {
+ public:
+  explicit TlsClient(std::uint16_t port) : WireClient(port) {}
+  ~TlsClient() override;
+
+  // False when it fails; under TLS 1.3 a server may still refuse the client's certificate.
+  bool shake_hands(const TlsWish& wish = {});
+  // In clear, whatever stands.
+  void send_raw(std::string_view bytes) { WireClient::send(bytes); }
+  void send(std::string_view bytes) override;
+  bool closed() override;
+  void say_goodbye() { SSL_shutdown(ssl_); }
+  SSL* ssl() const { return ssl_; }
+  std::string peer_name() const;
+
+ protected:
+  bool fill() override;
+
+ private:
+  SSL_CTX* context_ = nullptr;
+  SSL* ssl_ = nullptr;
+};
+
+}  // namespace orv::server::test
