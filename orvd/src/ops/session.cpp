@@ -6,11 +6,11 @@
 #include <utility>
 
 #include "cfg/dn.h"
-#include "cfg/masked_dn.h"
 #include "cfg/result_codes.h"
-#include "cfg/secret.h"
 #include "cfg/text.h"
 #include "ops/log_text.h"
+#include "ops/request_text.h"
+#include "ops/wiped_request.h"
 #include "publish/match.h"
 #include "publish/root_dse.h"
 #include "slapi/globals.h"
@@ -21,8 +21,6 @@ namespace {
 constexpr std::string_view kSuffix = "CN=CONFIGURATION";
 constexpr std::string_view kNotOffered = "operation not supported";
 constexpr std::string_view kStopping = "server is stopping";
-// Stands for "no result" in the access log.
-constexpr int kAbandoned = -1;
 
 // The tag of the answer to a request, 0 for requests without one.
 int response_tag(const Request& request) {
@@ -41,29 +39,6 @@ int response_tag(const Request& request) {
   return std::visit(Tags{}, request);
 }
 
-std::string_view operation_name(int tag) {
-  switch (tag) {
-    case tag::bind_response:
-      return "BIND";
-    case tag::search_done:
-      return "SEARCH";
-    case tag::add_response:
-      return "ADD";
-    case tag::delete_response:
-      return "DELETE";
-    case tag::modify_response:
-      return "MODIFY";
-    case tag::modify_dn_response:
-      return "MODIFYDN";
-    case tag::compare_response:
-      return "COMPARE";
-    case tag::extended_response:
-      return "EXTENDED";
-    default:
-      return "REQUEST";
-  }
-}
-
 DecoderLimits decoder_limits(const Settings& settings) {
   DecoderLimits limits;
   limits.message_bytes = static_cast<std::size_t>(settings.max_message_size);
@@ -80,58 +55,6 @@ std::int64_t stricter(std::int64_t a, std::int64_t b) {
   return std::min(a, b);
 }
 
-// A name as logs may show it: what is no DN may be anything, a password too.
-std::string shown_dn(std::string_view dn) {
-  std::string shown = "not a DN";
-  if (cfg::mask_dn(dn, shown) == result::no_memory) throw std::bad_alloc();
-  return shown;
-}
-
-// NAME dn="...". `normal` is the normal form of the DN, if that is known.
-std::string describe_dn(std::string_view name, std::string_view dn, std::string_view normal = {}) {
-  std::string text(name);
-  text += " dn=";
-  if (!normal.empty() && !cfg::normal_dn_may_hold_secret(normal))
-    append_client_text(text, dn);
-  else
-    append_client_text(text, shown_dn(dn));
-  return text;
-}
-
-std::string describe_search(const Schema& schema, const SearchRequest& request,
-                            std::string_view normal = {}) {
-  std::string text = describe_dn("SEARCH", request.base, normal);
-  text += " scope=";
-  append_number(text, request.scope);
-  text += " filter=";
-  // Cut before it is rewritten: a long filter costs no more than a short one.
-  append_client_text(text, rewrite_filter(schema, logged_part(request.filter), FilterUse::show));
-  if (request.filter.size() > kLoggedBytes) text += "...";
-  return text;
-}
-
-// What stands in the access log for a request that is answered on the spot.
-std::string describe(const Schema& schema, const Request& request) {
-  struct Describe {
-    const Schema& schema;
-    std::string operator()(const BindRequest&) const { return "BIND"; }
-    std::string operator()(const UnbindRequest&) const { return "UNBIND"; }
-    std::string operator()(const AbandonRequest&) const { return "ABANDON"; }
-    std::string operator()(const SearchRequest& r) const { return describe_search(schema, r); }
-    std::string operator()(const AddRequest& r) const { return describe_dn("ADD", r.dn); }
-    std::string operator()(const DeleteRequest& r) const { return describe_dn("DELETE", r.dn); }
-    std::string operator()(const ModifyRequest& r) const { return describe_dn("MODIFY", r.dn); }
-    std::string operator()(const ModifyDnRequest& r) const { return describe_dn("MODIFYDN", r.dn); }
-    std::string operator()(const CompareRequest& r) const { return describe_dn("COMPARE", r.dn); }
-    std::string operator()(const ExtendedRequest& r) const {
-      std::string text = "EXTENDED oid=";
-      append_client_text(text, r.oid);
-      return text;
-    }
-  };
-  return std::visit(Describe{schema}, request);
-}
-
 // Why a change of somebody with access did not reach the backend, which tells of its own refusals.
 void tell(Logs& logs, std::string line, const Refusal& refusal) {
   line += " refused with ";
@@ -139,36 +62,6 @@ void tell(Logs& logs, std::string line, const Refusal& refusal) {
   line += ": ";
   append_client_text(line, refusal.text);
   logs.warning(line);
-}
-
-void wipe_values(Attribute& attribute) noexcept {
-  for (std::string& value : attribute.values) cfg::wipe(value);
-}
-
-void wipe_credentials(BindRequest& request) noexcept {
-  cfg::wipe(request.password);
-  if (request.credentials) cfg::wipe(*request.credentials);
-}
-
-// Passwords stand in binds, and among the values of changes.
-struct WipedMessage : Message {
-  ~WipedMessage() {
-    if (auto* const bind = std::get_if<BindRequest>(&request)) wipe_credentials(*bind);
-    if (auto* const add = std::get_if<AddRequest>(&request))
-      for (Attribute& attribute : add->attributes) wipe_values(attribute);
-    if (auto* const modify = std::get_if<ModifyRequest>(&request))
-      for (Modification& modification : modify->modifications) wipe_values(modification.attribute);
-  }
-};
-
-// Copies, because a moved-from short text still holds its characters.
-void take_over(BindRequest& from, BindRequest& to) {
-  to.version = from.version;
-  to.name = from.name;
-  to.simple = from.simple;
-  to.mechanism = from.mechanism;
-  to.password = from.password;
-  to.credentials = from.credentials;
 }
 
 bool has_no_access(unsigned authority) {
@@ -700,250 +593,6 @@ void Session::unbind() noexcept {
   if (parameters) services_.backend.call(parameter::unbind_function, parameters.get());
   // The handler leaves the handle in the slot though it is released.
   connection_.config_session = nullptr;
-}
-
-// ---- bind
-
-Session::Bind::~Bind() {
-  wipe_credentials(request);
-}
-
-void Session::receive_bind(std::int32_t id, BindRequest& request, Refusal refusal) {
-  auto bind = std::make_shared<Bind>();
-  bind->message_id = id;
-  take_over(request, bind->request);
-  wipe_credentials(request);
-  bind->refusal = std::move(refusal);
-  // They would stay outstanding for ever, and the bind would wait as long (RFC 4511, 4.2.1). It is
-  // not there yet: the end of the last of them would start it, and with luck finish it, in here.
-  end_persistent_searches();
-  bind_ = std::move(bind);
-  try_bind();
-}
-
-void Session::try_bind() {
-  if (!outstanding_.empty() || bind_->started) return;
-  bind_->started = true;
-  become(nullptr);
-  try {
-    start_bind();
-  } catch (...) {
-    bind_.reset();  // nothing is outstanding on a connection that ends for this
-    throw;
-  }
-}
-
-void Session::start_bind() {
-  const BindPtr bind = bind_;  // outlives the answer to it
-  const BindRequest& request = bind->request;
-  // RFC 4513, 5.2.1: any other bind than one by the same mechanism ends an exchange.
-  if (bind->refusal || request.simple ||
-      !cfg::equals_ignore_ascii_case(request.mechanism, mechanism_))
-    exchange_.reset();
-  if (bind_->refusal) return finish_bind(bind_->refusal.code, bind_->refusal.text, nullptr);
-  if (request.version != 3)
-    return finish_bind(result::protocol_error, "only LDAP version 3 is supported", nullptr);
-  if (!request.simple) return start_step();
-  std::string normal;
-  const Target target = find_target(request.name, normal);
-  if (target == Target::not_a_dn)
-    return finish_bind(result::invalid_dn_syntax, "the bind name is not a DN", nullptr);
-  if (target == Target::root_dse && request.password.empty())
-    return finish_bind(result::success, "", nullptr);
-  if (request.password.empty())
-    return finish_bind(result::unwilling_to_perform, "a name without a password proves nothing",
-                       nullptr);
-  if (needs_confidentiality())
-    return finish_bind(result::confidentiality_required, "passwords need TLS here", nullptr);
-  if (target == Target::configuration) return ask_backend_to_bind();
-  verify_password();
-}
-
-bool Session::needs_confidentiality() const noexcept {
-  if (transport_.encrypted()) return false;
-  return transport_.local || transport_.loopback ? settings().tls_for_local_passwords
-                                                 : settings().tls_for_passwords;
-}
-
-// `work` ends by coming back.
-template <typename Work>
-void Session::on_verifier(Work work) {
-  try {
-    asio::post(services_.verifiers,
-               [self = shared_from_this(), bind = bind_, work] { work(bind); });
-  } catch (const std::bad_alloc&) {
-    finish_bind(result::no_memory, "", nullptr);
-  }
-}
-
-void Session::verify_password() {
-  on_verifier([this](const BindPtr& bind) { verify(bind); });
-}
-
-// On a worker.
-void Session::verify(const BindPtr& bind) noexcept {
-  bind->code = result::invalid_credentials;
-  bind->generation = services_.authenticator.generation();
-  try {
-    bind->identity =
-        services_.authenticator.authenticate(bind->request.name, bind->request.password);
-    if (bind->identity) bind->code = result::success;
-  } catch (const std::bad_alloc&) {
-    bind->code = result::no_memory;
-  } catch (...) {
-    bind->code = result::other;
-  }
-  wipe_credentials(bind->request);
-  come_back(bind);
-}
-
-// On a worker.
-void Session::come_back(const BindPtr& bind) noexcept {
-  bind->verified.store(true);
-  try {
-    post([this, self = shared_from_this(), bind] {
-      try {
-        verified(bind);
-      } catch (...) {
-        end_for_want_of_memory();
-      }
-    });
-  } catch (...) {
-    stranded_.store(true);
-  }
-}
-
-void Session::verified(const BindPtr& bind) {
-  if (bind_ != bind) return;
-  if (bind->exchange)
-    finish_step(bind);
-  else
-    finish_bind(bind->code, "", bind->identity);
-  resume();
-}
-
-// ---- bind by SASL
-
-// Takes the next step of the exchange that the request goes on with, or the first of a new one.
-void Session::start_step() {
-  if (!exchange_) {
-    const SaslMechanism* const mechanism =
-        services_.mechanisms
-            ? find_mechanism(*services_.mechanisms, bind_->request.mechanism, transport_)
-            : nullptr;
-    if (!mechanism)
-      return finish_bind(result::auth_method_not_supported, "mechanism not supported", nullptr);
-    // Whoever is found by any of the steps is no newer than this.
-    exchange_generation_ = services_.authenticator.generation();
-    exchange_begun_ = Clock::now();
-    mechanism_ = mechanism->name();
-    exchange_ = mechanism->start(transport_);
-    if (!exchange_) throw std::bad_alloc();
-  }
-  bind_->generation = exchange_generation_;
-  bind_->exchange = std::move(exchange_);
-  on_verifier([this](const BindPtr& bind) { take_step_of(*bind), come_back(bind); });
-}
-
-// On a worker.
-void Session::take_step_of(Bind& bind) noexcept {
-  try {
-    std::optional<std::string_view> credentials;
-    if (bind.request.credentials) credentials = *bind.request.credentials;
-    bind.outcome = bind.exchange->step(credentials);
-  } catch (const std::bad_alloc&) {
-    bind.outcome.code = result::no_memory;
-  } catch (...) {
-    bind.outcome.code = result::other;
-  }
-  wipe_credentials(bind.request);
-}
-
-void Session::finish_step(const BindPtr& bind) {
-  SaslOutcome& outcome = bind->outcome;
-  switch (outcome.state) {
-    case SaslOutcome::State::go_on:
-      if (!gone_) exchange_ = std::move(bind->exchange);
-      return finish_bind(result::sasl_bind_in_progress, "", nullptr);
-    case SaslOutcome::State::done:
-      if (!outcome.identity) return finish_bind(result::other, "", nullptr);
-      return finish_bind(result::success, "", outcome.identity);
-    case SaslOutcome::State::failed:
-      break;
-  }
-  outcome.reply.reset();
-  const bool fails =
-      outcome.code != result::success && outcome.code != result::sasl_bind_in_progress;
-  finish_bind(fails ? outcome.code : result::other, outcome.text, nullptr);
-}
-
-bool Session::bind_is_overdue(Clock::time_point now) const noexcept {
-  return exchange_ && now - exchange_begun_ >= std::chrono::seconds(settings().bind_timeout);
-}
-
-void Session::protect(std::unique_ptr<SecurityLayer>) {
-  disconnect(result::other, "no security layer is possible here");
-}
-
-// ---- the result of a bind
-
-void Session::ask_backend_to_bind() {
-  Answer answer(bind_->message_id, tag::bind_response, {});
-  Operation operation;
-  operation.server = &answer;
-  const PblockPtr parameters = make_parameters(services_.backend.backend(), connection_, operation);
-  int code = result::no_memory;
-  if (parameters) code = services_.backend.call(parameter::bind_function, parameters.get());
-  // Nobody becomes anybody here, whatever a backend may say.
-  finish_bind(code != 0 ? code : result::invalid_credentials, "", nullptr);
-}
-
-void Session::finish_bind(int code, std::string_view text,
-                          std::shared_ptr<const Identity> identity) {
-  const BindPtr bind = std::move(bind_);
-  bind_ = nullptr;
-  wipe_credentials(bind->request);
-  std::string what;
-  if (services_.logs.access_enabled()) what = describe_bind(*bind, identity.get());
-  log_result(bind->message_id, what, gone_ ? kAbandoned : code, 0, bind->received);
-  if (gone_) return settle_if_done();
-  become(std::move(identity));
-  identity_checked_ = bind->generation;
-  Answer answer(bind->message_id, tag::bind_response, {});
-  ResultAnswer result{};
-  result.code = code;
-  result.text = text;
-  if (bind->outcome.reply) result.sasl_credentials = &*bind->outcome.reply;
-  answer.result(result);
-  transmit_answer(answer);
-  if (code != result::success || !bind->outcome.layer) return;
-  protected_ = true;
-  protect(std::move(bind->outcome.layer));
-}
-
-std::string Session::describe_bind(const Bind& bind, const Identity* identity) {
-  std::string text = describe_dn("BIND", bind.request.name);
-  if (bind.request.simple) {
-    text += " simple";
-  } else {
-    text += " sasl mechanism=";
-    append_client_text(text, bind.request.mechanism);
-  }
-  if (!bind.outcome.name.empty()) append_client_text(text += " name=", bind.outcome.name);
-  if (identity) append_client_text(text += " as=", identity->bound_dn);
-  return text;
-}
-
-void Session::become(std::shared_ptr<const Identity> identity) noexcept {
-  identity_ = std::move(identity);
-  connection_.authority = identity_ ? identity_->authority : authority::no_configuration_access;
-  connection_.roles = identity_ ? identity_->roles : 0;
-  count_as_unauthenticated(!identity_ && !gone_);
-}
-
-void Session::count_as_unauthenticated(bool counted) noexcept {
-  if (std::exchange(unauthenticated_, counted) == counted) return;
-  services_.unauthenticated.fetch_add(counted ? 1 : -1, std::memory_order_relaxed);
 }
 
 // ---- StartTLS (RFC 4511, 4.14)

@@ -170,7 +170,8 @@ class Session : public OperationHome,
   void end_for_want_of_memory() noexcept;
   void respond(std::int32_t id, int response_tag, int code, std::string_view text,
                std::string_view what);
-  // `code` kAbandoned: there was no result.
+  // In the place of a result code: the operation had none.
+  static constexpr int kAbandoned = -1;
   void log_result(std::int32_t id, std::string_view what, int code, std::int64_t entries,
                   Clock::time_point started) noexcept;
 
@@ -204,6 +205,7 @@ class Session : public OperationHome,
   void audit_attempt(std::int32_t id, const ChangeRequest& request, int code) noexcept;
   void audit_refused(const Message& message, int code) noexcept;
 
+  // ---- binds, in session_bind.cpp
   void receive_bind(std::int32_t id, BindRequest& request, Refusal refusal);
   void try_bind();
   void start_bind();

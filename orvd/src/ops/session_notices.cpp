@@ -13,8 +13,6 @@
 namespace orv::server {
 namespace {
 
-// Stands for "no result" in the access log.
-constexpr int kAbandoned = -1;
 constexpr std::string_view kWhat = "PERSISTENT SEARCH";
 constexpr const char* kEverything = "(objectClass=*)";
 constexpr const char* kNoAttributes = "1.1";
