@@ -374,6 +374,48 @@ TEST_F(TlsTest, DamagedRecordEndsTheConnectionAndNothingOfItIsExecuted) {
   EXPECT_EQ(changes(), 0);
 }
 
+// As many key updates as one likes in one piece; what is asked behind them comes last.
+std::string key_updates(SSL* ssl, int count, std::string_view request) {
+  BIO* const memory = BIO_new(BIO_s_mem());
+  BIO* const socket = SSL_get_wbio(ssl);
+  BIO_up_ref(socket);
+  SSL_set0_wbio(ssl, memory);
+  for (int i = 0; i < count; ++i) {
+    SSL_key_update(ssl, SSL_KEY_UPDATE_NOT_REQUESTED);
+    SSL_do_handshake(ssl);
+  }
+  SSL_write(ssl, request.data(), static_cast<int>(request.size()));
+  char* data = nullptr;
+  const long length = BIO_get_mem_data(memory, &data);
+  std::string bytes(data, static_cast<std::size_t>(length));
+  SSL_set0_wbio(ssl, socket);
+  return bytes;
+}
+
+TEST_F(TlsTest, KeysMayBeRenewedNowAndThen) {
+  start();
+  TlsClient client(secure_port());
+  ASSERT_TRUE(client.shake_hands({TLS1_3_VERSION, TLS1_3_VERSION}));
+  for (int i = 1; i < 100; ++i) {
+    client.send_raw(key_updates(client.ssl(), 3, test::search(i, "")));
+    const std::optional<Reply> reply = client.receive();
+    ASSERT_TRUE(reply) << i;
+    ASSERT_TRUE(client.receive()) << i;
+  }
+}
+
+// Each costs the server more than the client, and as long as they come no other client of the same
+// loop would have its turn.
+TEST_F(TlsTest, FloodOfKeyUpdatesEndsTheConnection) {
+  write_access_log();
+  start();
+  TlsClient client(secure_port());
+  ASSERT_TRUE(client.shake_hands({TLS1_3_VERSION, TLS1_3_VERSION}));
+  client.send_raw(key_updates(client.ssl(), 1000, test::search(1, "")));
+  EXPECT_FALSE(client.receive());
+  EXPECT_NE(stop_and_read_log().find("too many records without data"), std::string::npos);
+}
+
 TEST_F(TlsTest, ClientThatFinishesTlsInOrderIsToldSo) {
   start();
   TlsClient client(secure_port());

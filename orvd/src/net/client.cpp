@@ -220,6 +220,12 @@ Flow Client::send_some(std::size_t& length) {
   return later(failure) ? Flow::needs_output : Flow::failed;
 }
 
+// Reading or writing has failed.
+void Client::lose() {
+  const std::string why = stream_ ? stream_->failure() : "";
+  close(why.empty() ? "connection lost" : "TLS failed: " + why);
+}
+
 // The layer protects what follows the bind: what came in clear behind it is nobody's message.
 void Client::protect(std::unique_ptr<SecurityLayer> layer) {
   const std::string rest(layer_ ? std::string_view() : unread());
@@ -260,7 +266,7 @@ void Client::read() {
     case Flow::ended:
       return close("end of stream");
     case Flow::failed:
-      return close("connection lost");
+      return lose();
   }
 }
 
@@ -506,7 +512,7 @@ void Client::write() {
                          &Client::writable);
       return output_is(state_ == State::closed ? 0 : backlog());
     } else {
-      return close("connection lost");
+      return lose();
     }
   }
   all_sent();

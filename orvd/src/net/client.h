@@ -94,6 +94,7 @@ class Client final : public Session {
   void tls_stands();
   Flow receive_some(char* to, std::size_t room, std::size_t& length);
   Flow send_some(std::size_t& length);
+  void lose();
 
   // ---- reading
   bool may_read() const noexcept;

@@ -30,6 +30,10 @@ constexpr const char* kGroups = "X25519:P-256:P-384";
 constexpr int kSecurityLevel = 2;
 // Certificates between a client's own and the authority.
 constexpr int kChainDepth = 8;
+// Of the socket, in search of data, before others have their turn: two for each record. Nobody
+// needs more than a few records without data in a row (new keys, padding), and whoever sent them
+// without an end would keep the thread to himself: OpenSSL goes on as long as some come.
+constexpr int kReadsInSearchOfData = 64;
 
 template <auto Release>
 struct Releaser {
@@ -221,11 +225,28 @@ TlsStream::TlsStream(std::shared_ptr<const TlsContext> context, int socket)
     SSL_free(ssl_);
     throw std::bad_alloc();
   }
+  BIO* const bio = SSL_get_rbio(ssl_);
+  BIO_set_callback_ex(bio, before_or_after_socket);
+  BIO_set_callback_arg(bio, reinterpret_cast<char*>(this));
   SSL_set_accept_state(ssl_);
 }
 
 TlsStream::~TlsStream() {
   SSL_free(ssl_);
+}
+
+// Called by OpenSSL around everything it does with the socket; what is not positive forbids it.
+long TlsStream::before_or_after_socket(BIO* bio, int operation, const char*, std::size_t, int, long,
+                                       int result, std::size_t*) {
+  if (operation != BIO_CB_READ) return result;
+  auto* const stream = reinterpret_cast<TlsStream*>(BIO_get_callback_arg(bio));
+  if (!SSL_is_init_finished(stream->ssl_) || stream->spend_read()) return result;
+  BIO_clear_retry_flags(bio);
+  return -1;
+}
+
+bool TlsStream::spend_read() noexcept {
+  return reads_left_-- > 0;
 }
 
 Flow TlsStream::outcome(int returned) {
@@ -240,6 +261,7 @@ Flow TlsStream::outcome(int returned) {
     default:
       broken_ = true;
       failure_ = queued_error();
+      if (failure_.empty() && reads_left_ < 0) failure_ = "too many records without data";
       return Flow::failed;
   }
 }
@@ -252,6 +274,7 @@ Flow TlsStream::shake_hands() {
 Flow TlsStream::read(char* to, std::size_t room, std::size_t& length) {
   ERR_clear_error();
   length = 0;
+  reads_left_ = kReadsInSearchOfData;
   return outcome(SSL_read_ex(ssl_, to, room, &length));
 }
 
@@ -264,6 +287,7 @@ Flow TlsStream::write(const char* from, std::size_t size, std::size_t& length) {
 Flow TlsStream::peek(char* to, std::size_t room, std::size_t& length) {
   ERR_clear_error();
   length = 0;
+  reads_left_ = kReadsInSearchOfData;
   return outcome(SSL_peek_ex(ssl_, to, room, &length));
 }
 

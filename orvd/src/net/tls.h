@@ -98,14 +98,18 @@ class TlsStream {
   // After the handshake: version, cipher, and the subject of the client's certificate. Throws
   // std::bad_alloc.
   void describe(TransportFacts& facts) const;
-  // Why it failed, in OpenSSL's words; "" for a connection that was lost.
+  // Why it failed, mostly in OpenSSL's words; "" for a connection that was lost.
   const std::string& failure() const noexcept { return failure_; }
 
  private:
+  static long before_or_after_socket(bio_st* bio, int operation, const char* data, std::size_t size,
+                                     int argument, long number, int result, std::size_t* moved);
+  bool spend_read() noexcept;
   Flow outcome(int returned);
   std::shared_ptr<const TlsContext> context_;
   ssl_st* const ssl_;
   bool broken_ = false;  // nothing more can be said
+  int reads_left_ = 0;   // of the socket, for the call under way
   std::string failure_;
 };
 
