@@ -39,6 +39,19 @@ EVP_PKEY* read_key(const std::string& path) {
   return PEM_read_PrivateKey(open_file(path, "r").get(), nullptr, nullptr, nullptr);
 }
 
+void extend(X509* certificate, int kind, const char* value) {
+  X509_EXTENSION* const extension = X509V3_EXT_conf_nid(nullptr, nullptr, kind, value);
+  must(extension && X509_add_ext(certificate, extension, -1) == 1);
+  X509_EXTENSION_free(extension);
+}
+
+Wording named(const std::string& name, const char* constraint = "CA:FALSE") {
+  Wording wording;
+  wording.subject = {{"O", V_ASN1_UTF8STRING, "Orv Test"}, {"CN", V_ASN1_UTF8STRING, name}};
+  wording.constraint = constraint;
+  return wording;
+}
+
 }  // namespace
 
 Certificates::Certificates() {
@@ -50,26 +63,26 @@ Certificates::~Certificates() {
   std::filesystem::remove_all(folder_);
 }
 
-Pair Certificates::make(const std::string& name, const Pair* issuer, bool authority) {
+Pair Certificates::make(const Wording& wording, const Pair* issuer) {
   EVP_PKEY* const key = EVP_EC_gen("P-256");
   X509* const certificate = X509_new();
   must(key && certificate);
   X509_set_version(certificate, X509_VERSION_3);
   ASN1_INTEGER_set(X509_get_serialNumber(certificate), ++made_);
-  X509_gmtime_adj(X509_getm_notBefore(certificate), -60);
-  X509_gmtime_adj(X509_getm_notAfter(certificate), 3600);
+  X509_gmtime_adj(X509_getm_notBefore(certificate), wording.begins);
+  X509_gmtime_adj(X509_getm_notAfter(certificate), wording.ends);
   X509_NAME* const subject = X509_get_subject_name(certificate);
-  X509_NAME_add_entry_by_txt(subject, "O", MBSTRING_UTF8,
-                             reinterpret_cast<const unsigned char*>("Orv Test"), -1, -1, 0);
-  X509_NAME_add_entry_by_txt(subject, "CN", MBSTRING_UTF8,
-                             reinterpret_cast<const unsigned char*>(name.c_str()), -1, -1, 0);
+  for (const NamePart& part : wording.subject)
+    must(X509_NAME_add_entry_by_txt(subject, part.type, part.kind,
+                                    reinterpret_cast<const unsigned char*>(part.value.data()),
+                                    static_cast<int>(part.value.size()), -1,
+                                    part.joins ? -1 : 0) == 1);
   X509* const parent = issuer ? read_certificate(issuer->certificate) : certificate;
   EVP_PKEY* const parent_key = issuer ? read_key(issuer->key) : key;
   X509_set_issuer_name(certificate, X509_get_subject_name(parent));
   X509_set_pubkey(certificate, key);
-  X509_EXTENSION* const basic = X509V3_EXT_conf_nid(nullptr, nullptr, NID_basic_constraints,
-                                                    authority ? "critical,CA:TRUE" : "CA:FALSE");
-  X509_add_ext(certificate, basic, -1);
+  extend(certificate, NID_basic_constraints, wording.constraint);
+  if (wording.purpose) extend(certificate, NID_ext_key_usage, wording.purpose);
   must(X509_sign(certificate, parent_key, EVP_sha256()) > 0);
   const std::string base = path(std::to_string(made_));
   const Pair pair{base + ".crt", base + ".key"};
@@ -77,7 +90,6 @@ Pair Certificates::make(const std::string& name, const Pair* issuer, bool author
   must(PEM_write_PrivateKey(open_file(pair.key, "w").get(), key, nullptr, nullptr, 0, nullptr,
                             nullptr) == 1);
   must(::chmod(pair.key.c_str(), 0600) == 0);
-  X509_EXTENSION_free(basic);
   if (issuer) X509_free(parent);
   if (issuer) EVP_PKEY_free(parent_key);
   X509_free(certificate);
@@ -86,17 +98,26 @@ Pair Certificates::make(const std::string& name, const Pair* issuer, bool author
 }
 
 Pair Certificates::self_signed(const std::string& name) {
-  return make(name, nullptr, false);
+  return make(named(name), nullptr);
 }
 
 const std::string& Certificates::authority() {
-  if (authority_.certificate.empty()) authority_ = make("Authority", nullptr, true);
+  if (authority_.certificate.empty())
+    authority_ = make(named("Authority", "critical,CA:TRUE"), nullptr);
   return authority_.certificate;
 }
 
 Pair Certificates::of_client(const std::string& name) {
+  return of_client(named(name));
+}
+
+Pair Certificates::of_client(const Wording& wording) {
   authority();
-  return make(name, &authority_, false);
+  return make(wording, &authority_);
+}
+
+Pair Certificates::signed_by(const Pair& issuer, const Wording& wording) {
+  return make(wording, &issuer);
 }
 
 // ---- the client

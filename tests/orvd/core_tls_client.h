@@ -6,6 +6,7 @@
 #include <memory>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "core_wire.h"
 
@@ -17,6 +18,23 @@ struct Pair {
   std::string key;
 };
 
+// One attribute of a subject, encoded as is: `kind` V_ASN1_UTF8STRING and the like.
+struct NamePart {
+  const char* type;  // name or number
+  int kind;
+  std::string value;
+  bool joins = false;  // the RDN of the part before it
+};
+
+// What a certificate says; as it should be, unless told otherwise.
+struct Wording {
+  std::vector<NamePart> subject{};  // first part first
+  long begins = -60;                // seconds from now
+  long ends = 3600;
+  const char* purpose = nullptr;  // extendedKeyUsage
+  const char* constraint = "CA:FALSE";
+};
+
 // Makes pairs in a folder of its own, which goes with it.
 class Certificates {
  public:
@@ -26,11 +44,13 @@ class Certificates {
   Pair self_signed(const std::string& name);
   // By an authority that is made with the first of them.
   Pair of_client(const std::string& name);
+  Pair of_client(const Wording& wording);
+  Pair signed_by(const Pair& issuer, const Wording& wording);
   const std::string& authority();
   std::string path(const std::string& name) const { return folder_ + "/" + name; }
 
  private:
-  Pair make(const std::string& name, const Pair* issuer, bool authority);
+  Pair make(const Wording& wording, const Pair* issuer);
   std::string folder_;
   Pair authority_;
   int made_ = 0;

@@ -8,6 +8,7 @@
 #include <fstream>
 #include <sstream>
 
+#include "auth/certificate_map.h"
 #include "cfg/owners.h"
 #include "core_server_fixture.h"
 #include "core_tls_client.h"
@@ -23,11 +24,13 @@ using test::kNotice;
 using test::kRoot;
 using test::kSecret;
 using test::kTop;
+using test::NamePart;
 using test::Pair;
 using test::Reply;
 using test::TlsClient;
 using test::TlsWish;
 using test::WireClient;
+using test::Wording;
 
 constexpr const char* kStartTls = kStartTlsOid;
 constexpr int kExtended = 0x78;
@@ -556,6 +559,106 @@ TEST_F(TlsTest, CertificateThatNobodyTrustedSignedIsRefusedEvenWhereNoneIsRequir
     client.shake_hands({version, version, &stranger});
     EXPECT_EQ(code_of(client, test::search(1, "")), -1);
   }
+}
+
+// ---- what is read in a certificate
+
+class ClientCertificate : public TlsTest {
+ protected:
+  void SetUp() override {
+    settings.tls.client_certificates = ClientCertificates::optional;
+    settings.tls.ca_file = certificates.authority();
+    write_access_log();
+    start();
+  }
+  // Whether the server talks to a client that shows it.
+  bool accepted(const Pair& pair) {
+    TlsClient client(secure_port());
+    client.shake_hands({TLS1_2_VERSION, TLS1_3_VERSION, &pair});
+    return code_of(client, test::search(1, "")) == 0;
+  }
+  bool accepted(const Wording& wording) { return accepted(certificates.of_client(wording)); }
+  // As the access log has it; "" for none.
+  std::string subject_of(const std::vector<NamePart>& parts) {
+    Wording wording;
+    wording.subject = parts;
+    EXPECT_TRUE(accepted(wording));
+    std::string text = stop_and_read_log();
+    const std::size_t place = text.find("subject=\"");
+    if (place == std::string::npos) return "";
+    text.erase(0, place + 9);
+    return text.substr(0, text.find("\"\n"));
+  }
+};
+
+constexpr int kUtf8 = V_ASN1_UTF8STRING;
+const NamePart kOrganisation{"O", kUtf8, "Orv Test"};
+
+TEST_F(ClientCertificate, SubjectIsTheSameHoweverItsTextIsEncoded) {
+  EXPECT_EQ(subject_of({{"O", V_ASN1_PRINTABLESTRING, "orv  TEST"},
+                        {"OU", V_ASN1_UNIVERSALSTRING, std::string("\0\0\0u", 4)},
+                        {"CN", V_ASN1_BMPSTRING, std::string("\0A\0l", 4)}}),
+            "CN=AL,OU=U,O=ORV TEST");
+}
+
+TEST_F(ClientCertificate, SubjectIsTheSameInWhateverOrderThePartsOfAnRdnAre) {
+  EXPECT_EQ(subject_of({kOrganisation, {"OU", kUtf8, "x"}, {"CN", kUtf8, "alice", true}}),
+            "CN=ALICE+OU=X,O=ORV TEST");
+}
+
+TEST_F(ClientCertificate, SubjectThatEndsForOthersAtANulIsNone) {
+  EXPECT_EQ(subject_of({kOrganisation, {"CN", kUtf8, std::string("alice\0evil", 10)}}), "");
+}
+
+TEST_F(ClientCertificate, SubjectWithANulInWideCharactersIsNone) {
+  EXPECT_EQ(subject_of({{"CN", V_ASN1_BMPSTRING, std::string("\0A\0\0\0B", 6)}}), "");
+}
+
+// What looks like further parts of a DN is within the value, also when it is copied from the log.
+TEST_F(ClientCertificate, SubjectInTheLogCanBeCopiedIntoTheMap) {
+  const std::string subject = subject_of({{"CN", kUtf8, "alice,o=Orv Test"}});
+  EXPECT_EQ(subject, "CN=ALICE\\2CO\\3DORV TEST");
+  CertificateMapping mapping;
+  ASSERT_TRUE(parse_certificate_mapping(subject + " => cn=alice", mapping));
+  EXPECT_EQ(mapping.subject, "CN=ALICE\\2CO\\3DORV TEST");
+}
+
+TEST_F(ClientCertificate, SubjectNamesTypesThatAreUnknownByTheirNumbers) {
+  const std::string subject = subject_of({kOrganisation,
+                                          {"emailAddress", V_ASN1_IA5STRING, "a@b"},
+                                          {"serialNumber", V_ASN1_PRINTABLESTRING, "1"},
+                                          {"1.2.3.4.5", kUtf8, "x"}});
+  EXPECT_EQ(subject, "1.2.3.4.5=X,2.5.4.5=1,EMAIL=A@B,O=ORV TEST");
+  CertificateMapping mapping;
+  ASSERT_TRUE(parse_certificate_mapping(subject + " => cn=alice", mapping));
+  EXPECT_EQ(mapping.subject, subject);
+}
+
+TEST_F(ClientCertificate, IsRefusedBeforeAndAfterItsTime) {
+  Wording wording;
+  wording.subject = {kOrganisation};
+  wording.begins = -7200;
+  wording.ends = -3600;
+  EXPECT_FALSE(accepted(wording));
+  wording.begins = 3600;
+  wording.ends = 7200;
+  EXPECT_FALSE(accepted(wording));
+}
+
+TEST_F(ClientCertificate, IsRefusedWhenItIsForServersAlone) {
+  Wording wording;
+  wording.subject = {kOrganisation};
+  wording.purpose = "serverAuth";
+  EXPECT_FALSE(accepted(wording));
+  wording.purpose = "clientAuth";
+  EXPECT_TRUE(accepted(wording));
+}
+
+TEST_F(ClientCertificate, MakesNobodyAnAuthority) {
+  Wording wording;
+  wording.subject = {kOrganisation};
+  const Pair alice = certificates.of_client("alice");
+  EXPECT_FALSE(accepted(certificates.signed_by(alice, wording)));
 }
 
 TEST_F(TlsTest, CertificateIsNotAskedForWhereNoneIsWanted) {

@@ -192,7 +192,7 @@ void Client::tls_stands() {
     line->append(" cipher=").append(facts.tls_cipher).append(" bits=");
     append_number(*line, facts.tls_strength);
     if (!facts.certificate_subject.empty())
-      append_client_text(line->append(" subject="), facts.certificate_subject);
+      append_normal_dn(line->append(" subject="), facts.certificate_subject);
     end_access_line();
   }
   set_transport(std::move(facts));

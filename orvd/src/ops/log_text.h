@@ -16,6 +16,10 @@ inline constexpr std::size_t kLoggedBytes = 1024;
 // length after the closing quote tell. Throws std::bad_alloc.
 void append_client_text(std::string& line, std::string_view text);
 
+// The same for a DN in normal form, whose own backslashes stay: what is logged is a DN again,
+// unless it was cut.
+void append_normal_dn(std::string& line, std::string_view normal);
+
 // The part of `text` that would be shown; no character is cut in two.
 std::string_view logged_part(std::string_view text) noexcept;
 

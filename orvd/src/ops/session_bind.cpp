@@ -251,7 +251,7 @@ std::string Session::describe_bind(const Bind& bind, const Identity* identity) {
     append_client_text(text, bind.request.mechanism);
   }
   if (!bind.outcome.name.empty()) append_client_text(text += " name=", bind.outcome.name);
-  if (identity) append_client_text(text += " as=", identity->bound_dn);
+  if (identity) append_normal_dn(text += " as=", identity->bound_dn);
   return text;
 }
 
