@@ -5,6 +5,7 @@
 #include <sys/socket.h>
 
 #include <fstream>
+#include <sstream>
 
 #include "core_bare_session.h"
 #include "core_server_fixture.h"
@@ -274,6 +275,12 @@ TEST_F(SaslTest, AccessLogNamesMechanismClaimAndIdentityButNoCredentials) {
     step(client, 3, "QUESTION", "marker-two");
     step(client, 4, "QUESTION", "marker-three");
     step(client, 5, "NO\nBODY", "marker-four");
+    client.send(test::bind(6, kRoot, "wrong"));
+    client.receive();
+    std::string old = test::bind(7, kRoot, "marker-five");
+    old.replace(old.find("\x02\x01\x03"), 3, "\x02\x01\x02");
+    client.send(old);
+    EXPECT_EQ(client.receive()->code, 2);
   }
   stop();
   std::ifstream file(name);
@@ -285,6 +292,15 @@ TEST_F(SaslTest, AccessLogNamesMechanismClaimAndIdentityButNoCredentials) {
             std::string::npos);
   EXPECT_NE(text.find("sasl mechanism=\"QUESTION\" name=\"asker\" result=49"), std::string::npos);
   EXPECT_NE(text.find("mechanism=\"NO\\0ABODY\" result=7"), std::string::npos);
+  EXPECT_NE(text.find("op=7 BIND malformed result=2"), std::string::npos) << text;
+  std::istringstream lines(text);
+  int binds = 0;
+  for (std::string line; std::getline(lines, line);)
+    if (line.find(" BIND ") != std::string::npos) {
+      ++binds;
+      EXPECT_NE(line.find(" from=127.0.0.1:"), std::string::npos) << line;
+    }
+  EXPECT_EQ(binds, 7);
   EXPECT_EQ(text.find("marker"), std::string::npos);
   EXPECT_EQ(text.find(kSecret), std::string::npos);
 }

@@ -660,7 +660,7 @@ std::string* Session::begin_access_line() {
 }
 
 void Session::log_result(std::int32_t id, std::string_view what, int code, std::int64_t entries,
-                         Clock::time_point started) noexcept try {
+                         Clock::time_point started, std::string_view from) noexcept try {
   std::string* const line = begin_access_line();
   if (!line) return;
   using std::chrono::duration_cast;
@@ -678,6 +678,7 @@ void Session::log_result(std::int32_t id, std::string_view what, int code, std::
   append_number(*line, entries);
   *line += " us=";
   append_number(*line, duration_cast<microseconds>(Clock::now() - started).count());
+  if (!from.empty()) line->append(" from=").append(from);
   end_access_line();
 } catch (...) {
   // Without memory the line is lost.

@@ -172,8 +172,9 @@ class Session : public OperationHome,
                std::string_view what);
   // In the place of a result code: the operation had none.
   static constexpr int kAbandoned = -1;
+  // `from`: who the client is, where that belongs on the line.
   void log_result(std::int32_t id, std::string_view what, int code, std::int64_t entries,
-                  Clock::time_point started) noexcept;
+                  Clock::time_point started, std::string_view from = {}) noexcept;
 
   // ---- persistent searches, in session_notices.cpp
   Refusal begin_persistent(PendingOperation& operation, const PersistentSearchControl& control,

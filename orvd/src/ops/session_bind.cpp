@@ -226,7 +226,7 @@ void Session::finish_bind(int code, std::string_view text,
   wipe_credentials(bind->request);
   std::string what;
   if (services_.logs.access_enabled()) what = describe_bind(*bind, identity.get());
-  log_result(bind->message_id, what, gone_ ? kAbandoned : code, 0, bind->received);
+  log_result(bind->message_id, what, gone_ ? kAbandoned : code, 0, bind->received, peer_);
   if (gone_) return settle_if_done();
   become(std::move(identity));
   identity_checked_ = bind->generation;
@@ -243,6 +243,8 @@ void Session::finish_bind(int code, std::string_view text,
 }
 
 std::string Session::describe_bind(const Bind& bind, const Identity* identity) {
+  // Nothing is known of one that was refused for its form.
+  if (bind.request.version == 0) return "BIND malformed";
   std::string text = describe_dn("BIND", bind.request.name);
   if (bind.request.simple) {
     text += " simple";
