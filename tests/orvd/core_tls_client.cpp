@@ -143,6 +143,7 @@ bool TlsClient::shake_hands(const TlsWish& wish) {
   ::setsockopt(socket_, SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
   ssl_ = SSL_new(context_);
   must(ssl_ && SSL_set_fd(ssl_, socket_) == 1);
+  if (wish.session) must(SSL_set_session(ssl_, wish.session) == 1);
   const bool done = SSL_connect(ssl_) == 1;
   ERR_clear_error();
   return done;

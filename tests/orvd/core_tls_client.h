@@ -61,7 +61,8 @@ struct TlsWish {
   int oldest = TLS1_2_VERSION;
   int newest = TLS1_3_VERSION;
   const Pair* own = nullptr;
-  std::string suites{};  // of TLS 1.2; "": all that OpenSSL has
+  std::string suites{};            // of TLS 1.2; "": all that OpenSSL has
+  SSL_SESSION* session = nullptr;  // to go on with
 };
 
 // A connection in clear until it shakes hands. It trusts every server.

@@ -295,6 +295,11 @@ TEST_F(TlsTest, SessionsAreNotResumed) {
     EXPECT_EQ(SSL_SESSION_is_resumable(session) == 1 && SSL_SESSION_has_ticket(session) == 1,
               false);
     EXPECT_EQ(SSL_SESSION_get_ticket_lifetime_hint(session), 0U);
+    TlsClient again(secure_port());
+    TlsWish wish{version, version};
+    wish.session = session;
+    EXPECT_TRUE(again.shake_hands(wish));
+    EXPECT_EQ(SSL_session_reused(again.ssl()), 0);
     SSL_SESSION_free(session);
   }
 }
@@ -755,6 +760,22 @@ TEST_F(TlsFiles, CauseOfARefusalNamesTheFile) {
   settings = good;
   write(own.certificate, "no certificate");
   EXPECT_NE(refusal().find(own.certificate + ": no usable certificate"), std::string::npos);
+}
+
+// Nobody would ever write to it, and whoever waited would be the thread that controls the server.
+TEST_F(TlsFiles, PipesAreRefusedWithoutWaiting) {
+  const std::string pipe = certificates.path("pipe");
+  ASSERT_EQ(::mkfifo(pipe.c_str(), 0600), 0);
+  const TlsSettings good = settings;
+  settings.certificate_file = pipe;
+  EXPECT_EQ(refusal(), pipe + ": not a regular file");
+  settings = good;
+  settings.key_file = pipe;
+  EXPECT_EQ(refusal(), pipe + ": not a regular file");
+  settings = good;
+  settings.client_certificates = ClientCertificates::optional;
+  settings.ca_file = pipe;
+  EXPECT_EQ(refusal(), pipe + ": not a regular file");
 }
 
 TEST_F(TlsFiles, KeyThatOthersMayReadIsRefused) {

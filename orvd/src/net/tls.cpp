@@ -66,16 +66,10 @@ bool fail(std::string& error, const std::string& file, const std::string& what) 
   return false;
 }
 
-// OpenSSL would report a file that cannot be opened as one more of its own errors.
-bool can_read(const std::string& file, std::string& error) {
-  if (::access(file.c_str(), R_OK) == 0) return true;
-  error = file + ": " + std::strerror(errno);
-  return false;
-}
-
-bool is_private(const std::string& file, std::string& error) {
+// OpenSSL would report a file that cannot be opened as one more of its own errors, and wait for
+// ever at a pipe that nobody writes to.
+bool can_read(const std::string& file, struct stat& status, std::string& error) {
   const Descriptor opened(::open(file.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
-  struct stat status {};
   if (!opened || ::fstat(opened.number(), &status) != 0) {
     error = file + ": " + std::strerror(errno);
     return false;
@@ -84,6 +78,17 @@ bool is_private(const std::string& file, std::string& error) {
     error = file + ": not a regular file";
     return false;
   }
+  return true;
+}
+
+bool can_read(const std::string& file, std::string& error) {
+  struct stat status {};
+  return can_read(file, status, error);
+}
+
+bool is_private(const std::string& file, std::string& error) {
+  struct stat status {};
+  if (!can_read(file, status, error)) return false;
   if ((status.st_mode & (S_IRWXO | S_IWGRP)) == 0) return true;
   error = file +
           ": others may read the private key, or change it; take these rights away "
