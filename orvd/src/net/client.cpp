@@ -13,6 +13,7 @@
 
 #include "cfg/result_codes.h"
 #include "ops/log_text.h"
+#include "ops/wiped_request.h"
 
 namespace orv::server {
 namespace {
@@ -417,7 +418,7 @@ bool gives_up(std::string_view bytes, std::int32_t message_id) {
   for (;;) {
     const Frame frame = next_frame(bytes, bytes.size());
     if (frame.state != FrameState::complete) return false;
-    Message message;
+    WipedMessage message;
     const Decoded decoded = decode(bytes.substr(0, frame.length), limits, message);
     if (decoded.state == DecodeState::decoded) {
       const auto* const abandon = std::get_if<AbandonRequest>(&message.request);
@@ -461,6 +462,7 @@ bool Client::lost_interest(PendingOperation& operation) noexcept {
   } catch (const std::bad_alloc&) {
     // It is handled late, then.
   }
+  cfg::wipe(bytes, sizeof bytes);
   return operation.answer().abandoned();
 }
 
@@ -588,6 +590,7 @@ void Client::close(std::string_view why) noexcept {
   if (stream_ && !unread) stream_->say_goodbye();
   stream_.reset();
   socket_.close(ignored);
+  forget_input();
   try {
     if (std::string* const line = begin_access_line()) {
       line->append("CLOSE reason=").append(why);
