@@ -77,7 +77,8 @@ struct SettingRow {
 std::span<const SettingRow> setting_rows() noexcept;
 
 // What is wrong with a value of a setting that is a word, or of a map of certificates; "" when
-// nothing is, or the setting is another one. With such a value the server would not start.
+// nothing is, or the setting is another one. With such a word the server would not start; of a map
+// it would leave the value out, and warn.
 std::string value_problem(std::string_view name, std::string_view value);
 
 // Takes one value over. False, with the reason in `error`, when `value` is not an integer within

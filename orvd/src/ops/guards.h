@@ -29,8 +29,8 @@ std::span<const Guard> entry_guards() noexcept;
 // The refusal of adding or deleting an entry by somebody with these authority flags; none when no
 // guard stands in the way. `added` is the entry to add, null for a delete. 50 or 53 by the table;
 // 53 an object class out of its place; 19 a value with which the server would not start, nor take
-// over any settings while it runs: an integer setting out of its bounds, or another whose value
-// is none of the words that it may be, or no map of certificates.
+// over any settings while it runs (an integer setting out of its bounds, or another whose value
+// is none of the words that it may be), or a map of certificates that maps nothing.
 Refusal guarded(GuardedChange change, std::string_view normal_dn, unsigned authority,
                 const entry* added);
 
