@@ -5,6 +5,7 @@ import re
 import string
 import subprocess
 import sys
+import time
 
 import ldap
 import pytest
@@ -86,6 +87,24 @@ def test_passwords_sent_to_bind_are_wiped(request, tmp_path):
         for password in (short, long):
             assert not remains(pid, password)
         assert holds(pid, server.config.path.name.encode())  # the search itself works
+
+
+def test_passwords_that_never_became_whole_messages_are_wiped(request, tmp_path):
+    """Of connections that ended meanwhile."""
+    server = reader(request, tmp_path)
+    if server is None:
+        return
+    pid = server.process.pid
+    password = b"Wn8%" + b"tYv3!zAh" * 8
+    bind = wire.bind_request(1, "cn=root", password)
+    with wire.Wire(server) as client:
+        client.send(bind[:-1])
+        until = time.monotonic() + programs.DEADLINE
+        while not remains(pid, password):  # it has been read
+            assert time.monotonic() < until
+    until = time.monotonic() + programs.DEADLINE
+    while remains(pid, password):
+        assert time.monotonic() < until
 
 
 def test_passwords_that_changes_set_are_wiped(request, tmp_path):

@@ -318,6 +318,41 @@ def test_members_cannot_change_what_the_server_trusts(server, root, name, value)
         assert refusal.value.args[0]["result"] in (50, 53)
 
 
+NUMBERS = "2.25.83817390626969804497818767862655265745."
+MAP_TO_ROOT = "cn=x => cn=root"
+
+
+def test_members_cannot_change_the_map_in_any_spelling(server, root):
+    assert add(root, *member("alice", roles=ROLES)) == 0
+    alice = clients.bind(server, "cn=alice", PASSWORD)
+    before = clients.read(root, GROUP)
+    for dn in (GROUP, "CN = AdminGroup , CN = Configuration", "cn=\\41dmingroup,cn=configuration",
+               "2.5.4.3=#0C0A41646D696E47726F7570,cn=configuration",
+               "commonname=admingroup,cn=configuration"):
+        for name in ("ORV-SLAPDCERTIFICATEMAP", NUMBERS + "1.72", "orv-slapdCertificateMap;lang-en",
+                     NUMBERS + "1.72;x-a", " orv-slapdCertificateMap", "orv-slapdCertificateMap "):
+            for how in (ldap.MOD_ADD, ldap.MOD_REPLACE):
+                with pytest.raises((ldap.INSUFFICIENT_ACCESS, ldap.PROTOCOL_ERROR,
+                                    ldap.UNDEFINED_TYPE, ldap.UNWILLING_TO_PERFORM)):
+                    modify(alice, dn, (how, name, [MAP_TO_ROOT]))
+    assert clients.read(root, GROUP) == before
+
+
+def test_members_cannot_put_what_is_trusted_into_other_entries(server, root):
+    assert add(root, *member("alice", roles=ROLES)) == 0
+    alice = clients.bind(server, "cn=alice", PASSWORD)
+    for name in ("orv-slapdAdminGroupSettings", "ORV-SLAPDADMINGROUPSETTINGS", NUMBERS + "2.17"):
+        for parent in (clients.BASE, GROUP, "cn=schemas,cn=configuration"):
+            assert add(alice, "cn=new," + parent, {
+                "objectClass": ["top", "container", name], "cn": ["new"],
+                "orv-slapdCertificateMap": [MAP_TO_ROOT]}) in (50, 53)
+    # Not by putting an entry of their own in its place either.
+    before = clients.read(root, GROUP)
+    with pytest.raises((ldap.INSUFFICIENT_ACCESS, ldap.NOT_ALLOWED_ON_NONLEAF)):
+        alice.delete_s(GROUP)
+    assert clients.read(root, GROUP) == before
+
+
 @pytest.mark.parametrize("name,value", [
     ("orv-slapdTlsMinimumVersion", "1.1"), ("orv-slapdTlsClientCertificate", "maybe"),
     ("orv-slapdTlsCaFile", "relative"), ("orv-slapdCertificateMap", "nonsense"),
