@@ -1,5 +1,5 @@
-"""Checks that the tests that README.md names exist, and that every row of its table of guards names
-one."""
+"""Checks that the tests that README.md and docs/security.md name exist, and that every row of the
+former's table of guards names one."""
 
 import os
 import re
@@ -7,6 +7,9 @@ import re
 import findings
 
 FOLDER = "tests/e2e"
+SECURITY = "docs/security.md"
+# `Suite.Name`, `.Name` in the suite that was named last, `Suite.*`, or `test_name`.
+OF_SECURITY = re.compile(r"`(?:([A-Z]\w*)?\.([A-Z]\w*|\*)|(test_\w+))`")
 NAMED = re.compile(r"`(test_\w+\.py)::(\w+)`")
 TABLE = re.compile(r"^\| operation \| what guards it \| test \|\n\|[-|]+\|\n((?:\|.*\n)+)", re.MULTILINE)
 
@@ -26,6 +29,29 @@ def missing(source, text):
             if name not in defined(source, file)]
 
 
+def all_defined(source):
+    """Names of pytest functions, and (suite, name) of GoogleTest, in the whole of tests/."""
+    functions, cases = set(), set()
+    for path in findings.files(os.path.join(source, "tests"), (".py", ".cpp", ".h")):
+        text = findings.read(source, os.path.join("tests", path))
+        functions.update(re.findall(r"^def (test_\w+)\(", text, re.MULTILINE))
+        cases.update(re.findall(r"^TEST(?:_[FP])?\(\s*(\w+),\s*(\w+)\)", text, re.MULTILINE))
+    return functions, cases
+
+
+def missing_of_security(source, text):
+    functions, cases = all_defined(source)
+    suites = {suite for suite, _ in cases}
+    found, suite = [], ""
+    for named, case, function in OF_SECURITY.findall(text):
+        suite = named or suite
+        known = (function in functions if function else
+                 suite in suites if case == "*" else (suite, case) in cases)
+        if not known:
+            found.append(f"{SECURITY}: there is no test {function or suite + '.' + case}")
+    return found
+
+
 def unproved(text):
     tables = TABLE.findall(text)
     if not tables:
@@ -37,7 +63,10 @@ def unproved(text):
 def main():
     options = findings.arguments(__doc__)
     text = findings.read(options.source, "README.md")
-    findings.conclude(missing(options.source, text) + unproved(text), "tests named in README.md")
+    security = findings.read(options.source, SECURITY)
+    findings.conclude(missing(options.source, text) + unproved(text) +
+                      missing_of_security(options.source, security),
+                      "tests named in README.md and docs/security.md")
 
 
 if __name__ == "__main__":
