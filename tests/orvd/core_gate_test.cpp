@@ -1,10 +1,12 @@
-// The gate: one holder, first come first served, deadlines, closing.
+// The gate: one holder, who is admitted before whom, deadlines, closing.
 #include "ops/gate.h"
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <atomic>
 #include <functional>
+#include <string>
 #include <thread>
 #include <vector>
 
@@ -47,7 +49,7 @@ TEST(Gate, AdmitsTheFirstAtOnceAndQueuesTheSecond) {
   EXPECT_EQ(gate.enter(first, kNever), Gate::Entry::inside);
 }
 
-TEST(Gate, AdmitsWaitersInTheOrderTheyCame) {
+TEST(Gate, AdmitsWaitersOfOneKindInTheOrderTheyCame) {
   Gate gate;
   std::vector<int> order;
   EXPECT_EQ(gate.enter(waiter(), kNever), Gate::Entry::inside);
@@ -171,6 +173,156 @@ TEST(Gate, LetsOneAtATimeThroughFromManyThreads) {
   for (std::thread& thread : threads) thread.join();
   EXPECT_EQ(left.load(), 0);
   EXPECT_EQ(unguarded, kThreads * kRounds);
+}
+
+// ---- brief and lasting waiters
+
+Clock::time_point scripted_now;  // of the gates below
+
+class SharedGate : public testing::Test {
+ protected:
+  SharedGate() {
+    scripted_now = Clock::time_point{} + 1h;
+    gate.enter(waiter(), kNever);
+  }
+  void search(const std::string& name, GateUser* user = nullptr) {
+    gate.enter(noting(name), kNever, user);
+  }
+  void change(const std::string& name, GateUser* user = nullptr) {
+    gate.enter_elsewhere(noting(name), kNever, user);
+  }
+  // Who is admitted one after the other, until nobody waits.
+  std::vector<std::string> order() {
+    while (gate.waiting() > 0) gate.leave();
+    return admitted;
+  }
+
+  Gate gate{[] { return scripted_now; }};
+  std::vector<std::string> admitted;
+
+ private:
+  std::shared_ptr<Recorder> noting(const std::string& name) {
+    return waiter([this, name](Verdict) { admitted.push_back(name); });
+  }
+};
+
+TEST_F(SharedGate, SearchGoesBeforeChangesThatWait) {
+  for (const char* name : {"first change", "second change", "third change"}) change(name);
+  search("search");
+  EXPECT_EQ(order(),
+            (std::vector<std::string>{"search", "first change", "second change", "third change"}));
+}
+
+TEST_F(SharedGate, SearchesThatNeverEndLetAChangeInAfterABoundedNumber) {
+  change("change");
+  for (int i = 0; i < 10 * Gate::kMostOvertaking; ++i) {
+    search("search");
+    gate.leave();
+    if (admitted.back() == "change") break;
+  }
+  EXPECT_EQ(admitted.back(), "change");
+  EXPECT_EQ(admitted.size(), Gate::kMostOvertaking + 1U);
+}
+
+TEST_F(SharedGate, SearchesThatTakeLongLetAChangeInAfterABoundedTime) {
+  change("change");
+  const Clock::time_point first = scripted_now;
+  while (admitted.empty() || admitted.back() != "change") {
+    search("search");
+    gate.leave();
+    scripted_now += 1ms;
+    ASSERT_LE(admitted.size(), 100U);
+  }
+  EXPECT_LE(scripted_now - first, Gate::kOvertakingTime + 2ms);
+  EXPECT_GE(admitted.size(), 2U);
+}
+
+TEST_F(SharedGate, TimeBeforeTheFirstSearchDoesNotCountAgainstIt) {
+  change("change");
+  scripted_now += 10s;  // the holder takes its time
+  search("search");
+  EXPECT_EQ(order(), (std::vector<std::string>{"search", "change"}));
+}
+
+TEST_F(SharedGate, EachChangeInTurnIsOvertakenByABoundedNumber) {
+  constexpr int kChanges = 5;
+  for (int i = 0; i < kChanges; ++i) change("change");
+  int searches_in_between = 0;
+  int changes = 0;
+  while (changes < kChanges) {
+    search("search");
+    gate.leave();
+    if (admitted.back() == "change") {
+      ++changes;
+      searches_in_between = 0;
+    } else {
+      ++searches_in_between;
+    }
+    ASSERT_LE(searches_in_between, Gate::kMostOvertaking);
+  }
+}
+
+TEST_F(SharedGate, ChangesThatNeverEndLetEachSearchInAtOnce) {
+  for (int i = 0; i < 50; ++i) {
+    change("change");
+    search("search");
+    change("change");
+    gate.leave();
+    EXPECT_EQ(admitted.back(), "search") << i;
+    gate.leave();
+    EXPECT_EQ(admitted.back(), "change") << i;
+  }
+}
+
+TEST_F(SharedGate, SearchThatCameBeforeAChangeIsNotHeldBackByIt) {
+  for (int i = 0; i < 2 * Gate::kMostOvertaking; ++i) search("early");
+  change("change");
+  search("late");
+  const std::vector<std::string> all = order();
+  const auto place = std::find(all.begin(), all.end(), "change") - all.begin();
+  EXPECT_EQ(std::count(all.begin(), all.begin() + place, "early"), 2 * Gate::kMostOvertaking);
+}
+
+TEST_F(SharedGate, WhatOneConnectionSendsIsDoneInItsOrder) {
+  GateUser one;
+  GateUser other;
+  change("change of another", &other);
+  change("own change", &one);
+  search("own search", &one);
+  change("second own change", &one);
+  search("second own search", &one);
+  GateUser reader;
+  search("search of a third", &reader);
+  EXPECT_EQ(order(),
+            (std::vector<std::string>{"search of a third", "change of another", "own change",
+                                      "own search", "second own change", "second own search"}));
+  // Nothing of it waits any more: the next search is free to go first again.
+  change("change", &other);
+  search("search", &one);
+  admitted.clear();
+  EXPECT_EQ(order(), (std::vector<std::string>{"search", "change"}));
+}
+
+TEST_F(SharedGate, ChangeThatWasGivenUpHoldsNoSearchOfItsConnectionBack) {
+  GateUser user;
+  const auto given_up = waiter();
+  const auto late = waiter();
+  change("change of another");
+  gate.enter_elsewhere(given_up, kNever, &user);
+  gate.enter_elsewhere(late, scripted_now, &user);
+  EXPECT_TRUE(gate.withdraw(*given_up));
+  gate.expire(scripted_now);
+  EXPECT_EQ(late->verdicts, std::vector{Verdict::late});
+  search("search", &user);
+  EXPECT_EQ(order(), (std::vector<std::string>{"search", "change of another"}));
+}
+
+TEST_F(SharedGate, ClosingTellsBothKinds) {
+  change("change");
+  search("search");
+  gate.close();
+  EXPECT_EQ(admitted.size(), 2U);
+  EXPECT_EQ(gate.waiting(), 0U);
 }
 
 }  // namespace

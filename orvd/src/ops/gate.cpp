@@ -4,86 +4,122 @@
 #include <utility>
 
 namespace orv::server {
-namespace {
 
-constexpr int kMostInARow = 16;
-
-}  // namespace
-
-Gate::Entry Gate::enter(const std::shared_ptr<GateWaiter>& waiter, Clock::time_point deadline) {
-  return join(waiter, deadline, false);
+Gate::Entry Gate::enter(const std::shared_ptr<GateWaiter>& waiter, Clock::time_point deadline,
+                        GateUser* user) {
+  return join({waiter, deadline, std::this_thread::get_id(), user, 0}, false);
 }
 
 Gate::Entry Gate::enter_elsewhere(const std::shared_ptr<GateWaiter>& waiter,
-                                  Clock::time_point deadline) {
-  return join(waiter, deadline, true);
+                                  Clock::time_point deadline, GateUser* user) {
+  return join({waiter, deadline, std::this_thread::get_id(), user, 0}, true);
 }
 
-Gate::Entry Gate::join(const std::shared_ptr<GateWaiter>& waiter, Clock::time_point deadline,
-                       bool elsewhere) {
+Gate::Entry Gate::join(const Place& place, bool elsewhere) {
   {
     const std::lock_guard lock(mutex_);
     if (closed_) return Entry::closed;
     if (held_) {
-      queue_.push_back({waiter, deadline, std::this_thread::get_id()});
+      const bool lasting = elsewhere || must_stay_behind(place);
+      Queue& queue = lasting ? lasting_ : brief_;
+      queue.push_back(place);
+      queue.back().number = ++arrivals_;
+      if (lasting && place.user) ++place.user->lasting_;
       return Entry::queued;
     }
     // Open means that nobody waits: a holder that leaves hands over while there is a queue.
     held_ = true;
   }
   if (!elsewhere) return Entry::inside;
-  waiter->gate_decided(Verdict::admitted);
+  place.waiter->gate_decided(Verdict::admitted);
   return Entry::queued;
+}
+
+bool Gate::must_stay_behind(const Place& place) const noexcept {
+  return place.user && place.user->lasting_ > 0;
 }
 
 void Gate::leave() noexcept {
   Queue next;  // destroyed after the mutex is released
   {
     const std::lock_guard lock(mutex_);
-    if (queue_.empty()) {
+    if (brief_.empty() && lasting_.empty()) {
       held_ = false;
       in_a_row_ = 0;
       if (closed_) emptied_.notify_all();
       return;
     }
-    next.splice(next.begin(), queue_, next_in_turn());
+    admit_next(next);
   }
   next.front().waiter->gate_decided(Verdict::admitted);
 }
 
-// The queue is not empty.
-Gate::Queue::iterator Gate::next_in_turn() noexcept {
+// Somebody waits.
+void Gate::admit_next(Queue& next) noexcept {
+  if (lasting_.empty()) {
+    overtaking_ = 0;
+    return next.splice(next.begin(), brief_, next_brief());
+  }
+  if (!brief_.empty() && may_go_first()) return next.splice(next.begin(), brief_, next_brief());
+  if (!brief_.empty() && brief_.front().number < lasting_.front().number)
+    return next.splice(next.begin(), brief_, brief_.begin());
+  take_lasting(next, lasting_.begin());
+  overtaking_ = 0;
+}
+
+// Whether one more brief waiter may go before the lasting one in front, and counts it.
+bool Gate::may_go_first() noexcept {
+  const Clock::time_point now = now_();
+  if (overtaking_ == 0) first_overtaking_ = now;
+  if (overtaking_ == kMostOvertaking || now - first_overtaking_ >= kOvertakingTime) return false;
+  ++overtaking_;
+  return true;
+}
+
+// Some brief waiter is there.
+Gate::Queue::iterator Gate::next_brief() noexcept {
   const std::thread::id here = std::this_thread::get_id();
   const auto own = in_a_row_ < kMostInARow
-                       ? std::find_if(queue_.begin(), queue_.end(),
+                       ? std::find_if(brief_.begin(), brief_.end(),
                                       [here](const Place& place) { return place.thread == here; })
-                       : queue_.end();
-  if (own == queue_.begin() || own == queue_.end()) {
+                       : brief_.end();
+  if (own == brief_.begin() || own == brief_.end()) {
     in_a_row_ = 0;
-    return queue_.begin();
+    return brief_.begin();
   }
   ++in_a_row_;
   return own;
 }
 
+void Gate::take_lasting(Queue& to, Queue::iterator place) noexcept {
+  if (place->user) --place->user->lasting_;
+  to.splice(to.end(), lasting_, place);
+}
+
 bool Gate::withdraw(const GateWaiter& waiter) noexcept {
   Queue removed;  // destroyed after the mutex is released
   const std::lock_guard lock(mutex_);
-  for (auto it = queue_.begin(); it != queue_.end(); ++it) {
-    if (it->waiter.get() != &waiter) continue;
-    removed.splice(removed.begin(), queue_, it);
-    return true;
+  const auto is_it = [&waiter](const Place& place) { return place.waiter.get() == &waiter; };
+  if (const auto it = std::find_if(brief_.begin(), brief_.end(), is_it); it != brief_.end()) {
+    removed.splice(removed.begin(), brief_, it);
+  } else if (const auto at = std::find_if(lasting_.begin(), lasting_.end(), is_it);
+             at != lasting_.end()) {
+    take_lasting(removed, at);
   }
-  return false;
+  return !removed.empty();
 }
 
 void Gate::expire(Clock::time_point now) {
   Queue late;
   {
     const std::lock_guard lock(mutex_);
-    for (auto it = queue_.begin(); it != queue_.end();) {
+    for (auto it = brief_.begin(); it != brief_.end();) {
       const auto place = it++;
-      if (place->deadline <= now) late.splice(late.end(), queue_, place);
+      if (place->deadline <= now) late.splice(late.end(), brief_, place);
+    }
+    for (auto it = lasting_.begin(); it != lasting_.end();) {
+      const auto place = it++;
+      if (place->deadline <= now) take_lasting(late, place);
     }
   }
   for (const Place& place : late) place.waiter->gate_decided(Verdict::late);
@@ -94,7 +130,8 @@ void Gate::close() noexcept {
   {
     const std::lock_guard lock(mutex_);
     closed_ = true;
-    refused.swap(queue_);
+    refused.swap(brief_);
+    while (!lasting_.empty()) take_lasting(refused, lasting_.begin());
   }
   for (const Place& place : refused) place.waiter->gate_decided(Verdict::closed);
 }
@@ -107,7 +144,7 @@ bool Gate::close_and_wait_until_empty(std::chrono::milliseconds patience) {
 
 std::size_t Gate::waiting() const {
   const std::lock_guard lock(mutex_);
-  return queue_.size();
+  return brief_.size() + lasting_.size();
 }
 
 }  // namespace orv::server

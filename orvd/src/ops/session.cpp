@@ -299,8 +299,8 @@ void Session::start(const OperationPtr& operation) {
                             : Clock::now() + std::chrono::seconds(settings().operation_wait);
   Gate::Entry entry = Gate::Entry::closed;
   try {
-    entry = operation->wants_worker() ? gate.enter_elsewhere(operation, deadline)
-                                      : gate.enter(operation, deadline);
+    entry = operation->wants_worker() ? gate.enter_elsewhere(operation, deadline, &gate_user_)
+                                      : gate.enter(operation, deadline, &gate_user_);
   } catch (const std::bad_alloc&) {
     return answer_and_complete(operation, result::no_memory, "");
   }

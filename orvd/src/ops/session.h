@@ -242,6 +242,7 @@ class Session : public OperationHome,
   std::shared_ptr<const Identity> identity_;  // null: anonymous
   std::uint64_t identity_checked_ = 0;        // the generation by which it was good
   OutputShare output_;
+  GateUser gate_user_;
   FailedChanges failed_changes_;
   std::string peer_;
   std::vector<OperationPtr> outstanding_;
