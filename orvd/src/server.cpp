@@ -175,7 +175,9 @@ void Server::watch_gate() {
   gate_timer_.async_wait([this](const asio::error_code& error) {
     if (error) return;
     watch_gate();
-    backend_.gate().expire(Clock::now());
+    const Clock::time_point now = Clock::now();
+    backend_.gate().expire(now);
+    services_.cut_offs.tick(now);
   });
 }
 

@@ -26,27 +26,31 @@ struct TlsSettings {
 };
 
 struct Settings {
-  std::int64_t port = 3389;                 // TCP; 0 lets the kernel choose
-  std::int64_t size_limit = 0;              // entries of one search, 0 no limit
-  std::int64_t time_limit = 60;             // seconds of one search, 0 no limit
-  std::int64_t idle_timeout = 600;          // seconds, 0 no limit
-  std::int64_t max_message_size = 1048576;  // bytes
-  std::int64_t max_connections = 4096;      // in all
+  std::int64_t port = 3389;                               // TCP; 0 lets the kernel choose
+  std::int64_t size_limit = 0;                            // entries of one search, 0 no limit
+  std::int64_t time_limit = 60;                           // seconds of one search, 0 no limit
+  std::int64_t idle_timeout = 600;                        // seconds, 0 no limit
+  std::int64_t max_message_size = 1048576;                // bytes
+  std::int64_t max_unauthenticated_message_size = 65536;  // bytes, while nobody is bound
+  std::int64_t max_connections = 4096;                    // in all
   std::int64_t max_connections_per_address = 1024;
   std::int64_t max_pending_operations = 64;  // outstanding on one connection
   std::int64_t max_filter_depth = 32;
+  std::int64_t max_filter_items = 4096;
   std::int64_t max_controls = 32;             // in one message
   std::int64_t max_attributes = 1024;         // in one message
   std::int64_t max_values = 10000;            // in one message
   std::int64_t max_result_size = 67108864;    // bytes of one answer
   std::int64_t operation_wait = 30;           // seconds until an operation that waits gets 51
   std::int64_t write_timeout = 30;            // seconds without progress of a slow reader
+  std::int64_t min_read_rate = 4096;          // bytes a second of a reader, 0 no limit
   std::int64_t message_timeout = 30;          // seconds to finish a message once begun
   std::int64_t max_persistent_searches = 64;  // in all, 0: there are none
   std::int64_t max_persistent_searches_per_connection = 8;
   std::int64_t max_failed_change_size = 16777216;       // bytes of one identity within a day
   std::int64_t secure_port = 0;                         // of ldaps; 0: none
   std::int64_t max_unauthenticated_connections = 3072;  // on which nobody is bound
+  std::int64_t unauthenticated_timeout = 300;           // seconds with nobody bound, 0 no limit
   std::int64_t bind_timeout = 30;                       // seconds to finish a bind in several steps
   std::int64_t handshake_timeout = 10;                  // seconds to finish a handshake of TLS
   std::vector<std::string> addresses;                   // empty: every address

@@ -169,6 +169,7 @@ class AccessLogTest : public ConnectionTest {
 };
 
 TEST_F(AccessLogTest, LongTextsOfStrangersMakeShortLines) {
+  settings.max_unauthenticated_message_size = settings.max_message_size;
   start();
   WireClient client(port());
   EXPECT_EQ(code_of(client, test::search(1, "cn=" + std::string(500000, 'x'))), 34);

@@ -23,6 +23,8 @@ using asio::ip::tcp;
 constexpr std::size_t kReadBytes = 4096;
 // Above this much unread output a client's requests wait.
 constexpr std::size_t kBacklogMark = 256 * 1024;
+// The same while nobody is bound: strangers may be many.
+constexpr std::size_t kStrangersMark = 32 * 1024;
 // Answers to requests that came together are written together, up to about this much.
 constexpr std::size_t kWriteBatch = 32 * 1024;
 // Storage that an idle connection may keep.
@@ -32,8 +34,10 @@ constexpr int kMessagesAtOnce = 32;
 // How long a parting client may take to read the notice.
 constexpr std::chrono::seconds kPartingTime{2};
 
-std::string too_big(std::int64_t limit) {
-  return "message too big: more than " + std::to_string(limit) + " bytes (orv-slapdMaxMessageSize)";
+std::string too_big(std::int64_t limit, bool for_everybody) {
+  return "message too big: more than " + std::to_string(limit) + " bytes (" +
+         (for_everybody ? "orv-slapdMaxMessageSize" : "orv-slapdMaxUnauthenticatedMessageSize") +
+         ")";
 }
 
 // Nothing can be read or written at the moment.
@@ -238,10 +242,21 @@ void Client::protect(std::unique_ptr<SecurityLayer> layer) {
 
 // ---- reading
 
+// While nobody is bound, less is kept for a client: there may be many, and of any kind.
+std::int64_t Client::largest_message() const noexcept {
+  const Settings& limits = loop_.settings();
+  if (!is_unauthenticated()) return limits.max_message_size;
+  return std::min(limits.max_message_size, limits.max_unauthenticated_message_size);
+}
+
+bool Client::reads_enough() const noexcept {
+  return backlog() < (is_unauthenticated() ? kStrangersMark : kBacklogMark);
+}
+
 bool Client::may_read() const noexcept {
   if (!is_set_up()) return false;
   if (state_ == State::parting) return true;
-  return state_ == State::open && !busy() && backlog() < kBacklogMark;
+  return state_ == State::open && !busy() && reads_enough();
 }
 
 void Client::readable() {
@@ -347,8 +362,7 @@ void Client::process() {
   processing_ = true;
   try {
     int left = kMessagesAtOnce;
-    while (state_ == State::open && is_set_up() && !busy() && backlog() < kBacklogMark &&
-           process_one())
+    while (state_ == State::open && is_set_up() && !busy() && reads_enough() && process_one())
       if (--left == 0) {
         continuing_ = true;
         break;
@@ -373,13 +387,14 @@ void Client::process() {
 bool Client::process_one() {
   const std::string_view bytes = unread();
   if (bytes.empty()) return false;
-  const Frame frame =
-      next_frame(bytes, static_cast<std::size_t>(loop_.settings().max_message_size));
+  const std::int64_t limit = largest_message();
+  const Frame frame = next_frame(bytes, static_cast<std::size_t>(limit));
   switch (frame.state) {
     case FrameState::need_more:
       return false;
     case FrameState::too_big:
-      disconnect(result::protocol_error, too_big(loop_.settings().max_message_size));
+      cut_off(CutOff::message, result::protocol_error,
+              too_big(limit, limit == loop_.settings().max_message_size));
       return false;
     case FrameState::malformed:
       disconnect(result::protocol_error, "not an LDAP message");
@@ -475,7 +490,7 @@ void Client::transmit(std::string& bytes) {
     out_.swap(bytes);
     bytes.clear();
     out_sent_ = 0;
-    write_progress_ = Clock::now();
+    pace_.begin(Clock::now());
   } else {
     out_ += bytes;
     bytes.clear();
@@ -507,7 +522,7 @@ void Client::write() {
     const Flow flow = send_some(sent);
     if (flow == Flow::moved) {
       out_sent_ += sent;
-      write_progress_ = Clock::now();
+      pace_.took(sent, Clock::now());
     } else if (flow == Flow::needs_output || flow == Flow::needs_input) {
       if (!writing_)
         writing_ = await(flow == Flow::needs_output ? Socket::wait_write : Socket::wait_read,
@@ -523,10 +538,10 @@ void Client::write() {
 
 void Client::writable() {
   writing_ = false;
-  const bool was_full = backlog() >= kBacklogMark;
+  const bool was_full = !reads_enough();
   flush();
   watch();
-  if (was_full && backlog() < kBacklogMark) resume();
+  if (was_full && reads_enough()) resume();
 }
 
 void Client::all_sent() {
@@ -622,35 +637,68 @@ void Client::sweep(Clock::time_point now) {
   tick();
   if (settled_) return loop_.remove(self());
   if (state_ == State::closed) return;
+  if (!waiting_ && lost()) return close("connection lost");
+  look_at_deadlines(now);
+}
+
+namespace {
+
+bool past(Clock::time_point now, Clock::time_point since, std::int64_t seconds) {
+  return now - since >= std::chrono::seconds(seconds);
+}
+
+}  // namespace
+
+void Client::look_at_deadlines(Clock::time_point now) {
   const Settings& limits = loop_.settings();
-  const auto past = [now](Clock::time_point since, std::int64_t seconds) {
-    return now - since >= std::chrono::seconds(seconds);
-  };
   // A loop that was busy for long may not have read what came in time.
   const auto late = [&](Clock::time_point since, std::int64_t seconds) {
-    return past(since, seconds) && !unread_in_system();
+    return past(now, since, seconds) && !unread_in_system();
   };
-  if (!waiting_ && lost()) return close("connection lost");
   if (!is_set_up()) {
-    if (past(handshake_begun_, limits.handshake_timeout))
-      close("TLS handshake not finished in time");
+    if (past(now, handshake_begun_, limits.handshake_timeout))
+      cut_off_without_notice(CutOff::handshake, "TLS handshake not finished in time");
     return;
   }
   if (state_ == State::parting) {
     if (now - parting_since_ >= kPartingTime) close("gone");
-  } else if (backlog() > 0) {
-    if (past(write_progress_, limits.write_timeout)) write();  // it may have read just now
-    if (backlog() > 0 && past(write_progress_, limits.write_timeout))
-      close("does not read its answers");
+  } else if (backlog() > 0 && does_not_read(now)) {
+    cut_off_without_notice(CutOff::output, "does not read its answers");
   } else if (bind_is_overdue(now)) {
-    disconnect(result::unavailable, "bind not finished in time");
+    cut_off(CutOff::bind, result::unavailable, "bind not finished in time");
+  } else if (limits.unauthenticated_timeout > 0 && !transport().local && idle() &&
+             without_identity(now) >= std::chrono::seconds(limits.unauthenticated_timeout)) {
+    cut_off(CutOff::bind, result::unavailable, "nobody bound for too long");
   } else if ((begin_ != end_ || in_pieces_) && may_read()) {
     if (late(message_begun_, limits.message_timeout))
-      disconnect(result::unavailable, "message not finished in time");
-  } else if (idle() && !listens() && limits.idle_timeout > 0) {
+      cut_off(CutOff::message, result::unavailable, "message not finished in time");
+  } else if (backlog() == 0 && idle() && !listens() && limits.idle_timeout > 0) {
     if (late(last_activity_, limits.idle_timeout))
       disconnect(result::unavailable, "idle for too long");
   }
+}
+
+bool Client::does_not_read(Clock::time_point now) {
+  const Settings& limits = loop_.settings();
+  const auto too_slow = [&] {
+    return pace_.too_slow(now, limits.write_timeout, limits.min_read_rate);
+  };
+  if (too_slow()) write();  // it may have read just now
+  return state_ == State::open && backlog() > 0 && too_slow();
+}
+
+void Client::cut_off(CutOff what, int code, const std::string& why) {
+  tell_of(what, why);
+  disconnect(code, why);
+}
+
+void Client::cut_off_without_notice(CutOff what, const std::string& why) {
+  tell_of(what, why);
+  close(why);
+}
+
+void Client::tell_of(CutOff what, std::string_view why) {
+  services().cut_offs.tell(what, std::string(why).append(": closed ").append(peer()));
 }
 
 }  // namespace orv::server

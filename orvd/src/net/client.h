@@ -24,6 +24,7 @@
 #include "descriptor.h"
 #include "net/limits.h"
 #include "net/loop.h"
+#include "net/pace.h"
 #include "net/tls.h"
 #include "ops/session.h"
 
@@ -97,6 +98,7 @@ class Client final : public Session {
   void lose();
 
   // ---- reading
+  std::int64_t largest_message() const noexcept;
   bool may_read() const noexcept;
   void readable();
   void read();
@@ -117,6 +119,7 @@ class Client final : public Session {
   // ---- writing
   bool wrap(std::string& bytes);
   std::size_t backlog() const noexcept { return out_.size() - out_sent_; }
+  bool reads_enough() const noexcept;
   void writable();
   void write();
   void all_sent();
@@ -132,6 +135,12 @@ class Client final : public Session {
   bool lost() noexcept;
 
   // ---- ending
+  // The client met a limit: the same as disconnect and close, with a line of the error log.
+  void cut_off(CutOff what, int code, const std::string& why);
+  void cut_off_without_notice(CutOff what, const std::string& why);
+  void tell_of(CutOff what, std::string_view why);
+  void look_at_deadlines(Clock::time_point now);
+  bool does_not_read(Clock::time_point now);
   void part();
   void close(std::string_view why) noexcept;
 
@@ -161,7 +170,7 @@ class Client final : public Session {
   // When each began; meaningful while the condition lasts.
   Clock::time_point last_activity_ = Clock::now();    // nothing outstanding
   Clock::time_point message_begun_ = Clock::now();    // part of a message is here
-  Clock::time_point write_progress_ = Clock::now();   // something is unwritten
+  Pace pace_;                                         // something is unwritten
   Clock::time_point handshake_begun_ = Clock::now();  // TLS does not stand yet
   Clock::time_point parting_since_{};
   bool settled_ = false;

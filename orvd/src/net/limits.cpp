@@ -1,8 +1,37 @@
 #include "net/limits.h"
 
+#include <sys/resource.h>
+
+#include <algorithm>
+#include <limits>
 #include <utility>
 
 namespace orv::server {
+namespace {
+
+// Descriptors that are no connections of other hosts: logs, loops, files of operations in hand.
+constexpr rlim_t kOtherDescriptors = 96;
+
+asio::ip::address_v6 network(const asio::ip::address_v6& address) {
+  auto bytes = address.to_bytes();
+  std::fill(bytes.begin() + 8, bytes.end(), static_cast<unsigned char>(0));
+  return asio::ip::address_v6(bytes, address.scope_id());
+}
+
+}  // namespace
+
+std::string counted_as(const asio::ip::address& address) {
+  if (!address.is_v6() || address.to_v6().is_link_local()) return address.to_string();
+  return network(address.to_v6()).to_string() + "/64";
+}
+
+std::int64_t connections_that_fit() noexcept {
+  constexpr rlim_t kMost = std::numeric_limits<std::int32_t>::max();
+  rlimit files{};
+  if (::getrlimit(RLIMIT_NOFILE, &files) != 0) return static_cast<std::int64_t>(kMost);
+  const rlim_t all = std::min(files.rlim_cur, kMost);  // RLIM_INFINITY is the largest
+  return all > kOtherDescriptors ? static_cast<std::int64_t>(all - kOtherDescriptors) : 0;
+}
 
 ConnectionCounter::Ticket::Ticket(Ticket&& other) noexcept
     : counter_(std::exchange(other.counter_, nullptr)), address_(std::move(other.address_)) {}

@@ -1,12 +1,22 @@
 // How many connections there are, in all and from each address.
 #pragma once
 
+#include <asio/ip/address.hpp>
 #include <cstdint>
 #include <mutex>
 #include <string>
 #include <unordered_map>
 
 namespace orv::server {
+
+// As whom a client with this address is counted: in IPv6 its network of 64 bits, of which one host
+// has as many addresses as it likes; except on the link, where all hosts share one.
+std::string counted_as(const asio::ip::address& address);
+
+// How many connections from other hosts there may be by the descriptors that the process may open
+// (RLIMIT_NOFILE), so that some are left for files, and for who administers the server on its own
+// host.
+std::int64_t connections_that_fit() noexcept;
 
 // Thread-safe; must outlive its tickets.
 class ConnectionCounter {

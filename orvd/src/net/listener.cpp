@@ -1,8 +1,12 @@
 #include "net/listener.h"
 
+#include <fcntl.h>
+#include <sys/socket.h>
+
 #include <algorithm>
 #include <asio/ip/tcp.hpp>
 #include <asio/ip/v6_only.hpp>
+#include <cerrno>
 #include <cstring>
 #include <exception>
 #include <limits>
@@ -16,10 +20,27 @@ namespace {
 using asio::ip::tcp;
 using Endpoint = asio::generic::stream_protocol::endpoint;
 
-// How long accepting rests when the process has no descriptor or memory left for a connection.
+// How long accepting rests when the process has no descriptor or memory left for a connection, and
+// how many clients are told so in one go.
 constexpr std::chrono::milliseconds kAcceptPause{100};
+constexpr int kTurnedAwayAtOnce = 64;
 // What all clients of the Unix socket are counted as.
 constexpr const char* kLocalPeer = "local";
+
+Descriptor open_reserve() noexcept {
+  return Descriptor(::open("/dev/null", O_RDONLY | O_CLOEXEC));
+}
+
+bool no_descriptors_left(const asio::error_code& error) {
+  return error.value() == EMFILE || error.value() == ENFILE;
+}
+
+// Without waiting for the client.
+void send_notice(int socket, std::string_view why) {
+  std::string notice;
+  encode_notice_of_disconnection(notice, result::busy, why);
+  static_cast<void>(::send(socket, notice.data(), notice.size(), MSG_DONTWAIT | MSG_NOSIGNAL));
+}
 
 tcp::endpoint tcp_endpoint(const Endpoint& endpoint) {
   tcp::endpoint result;
@@ -72,7 +93,7 @@ bool describe_tcp(Socket& socket, TransportFacts& facts, Peer& peer) {
   const Endpoint local = socket.local_endpoint(gone);
   if (gone) return false;
   const asio::ip::address address = plain_address(tcp_endpoint(remote).address());
-  peer = {endpoint_text(tcp_endpoint(remote)), address.to_string()};
+  peer = {endpoint_text(tcp_endpoint(remote)), counted_as(address)};
   facts.peer = peer.text;
   facts.own = endpoint_text(tcp_endpoint(local));
   facts.loopback = address.is_loopback();
@@ -151,6 +172,12 @@ bool Listeners::open_local(const std::string& path, std::string& error) {
 
 void Listeners::start(std::shared_ptr<const Settings> settings) {
   settings_ = std::move(settings);
+  reserve_ = open_reserve();
+  if (settings_->max_connections > connections_that_fit())
+    services_.logs.warning("orv-slapdMaxConnections is " +
+                           std::to_string(settings_->max_connections) +
+                           ", but the limit of open files (RLIMIT_NOFILE) has room for " +
+                           std::to_string(connections_that_fit()) + " connections");
   for (const auto& listener : listeners_) accept(*listener);
 }
 
@@ -165,12 +192,37 @@ void Listeners::accept(Listener& listener) {
       }
       return accept(listener);
     }
-    services_.logs.error("cannot accept a connection: " + error.message());
-    listener.pause.expires_after(kAcceptPause);
-    listener.pause.async_wait([this, &listener](const asio::error_code& stopped) {
-      if (!stopped) accept(listener);
-    });
+    cannot_accept(listener, error);
   });
+}
+
+// What is lacking will not be there at once.
+void Listeners::cannot_accept(Listener& listener, const asio::error_code& error) {
+  services_.cut_offs.tell(CutOff::descriptors, "cannot accept a connection: " + error.message());
+  if (no_descriptors_left(error) && listener.kind != Kind::local) turn_away(listener);
+  listener.pause.expires_after(kAcceptPause);
+  listener.pause.async_wait([this, &listener](const asio::error_code& stopped) {
+    if (!stopped) accept(listener);
+  });
+}
+
+// Who has connected already would wait for an answer otherwise. At the Unix socket that is better:
+// who administers the server on its own host gets in with the next descriptor.
+void Listeners::turn_away(Listener& listener) noexcept {
+  asio::error_code ignored;
+  listener.acceptor.native_non_blocking(true, ignored);
+  for (int left = kTurnedAwayAtOnce; left > 0; --left) {
+    reserve_.close();
+    const Descriptor client(::accept4(listener.acceptor.native_handle(), nullptr, nullptr,
+                                      SOCK_CLOEXEC | SOCK_NONBLOCK));
+    if (!client) break;
+    try {
+      if (listener.kind == Kind::clear) send_notice(client.number(), "no descriptor is left");
+    } catch (...) {
+      // It is closed without a word, then.
+    }
+  }
+  reserve_ = open_reserve();
 }
 
 // Beginning with the one after the last, so that a few connections spread.
@@ -193,8 +245,9 @@ std::string Listeners::admit(Arrival& arrival, const std::string& counted) {
   if (!local && services_.unauthenticated.load(std::memory_order_relaxed) >=
                     limits.max_unauthenticated_connections)
     return "too many connections on which nobody is bound";
-  arrival.ticket = counter_.admit(counted, local ? kAny : limits.max_connections,
-                                  limits.max_connections_per_address);
+  const std::int64_t in_all = std::min(limits.max_connections, connections_that_fit());
+  arrival.ticket =
+      counter_.admit(counted, local ? kAny : in_all, limits.max_connections_per_address);
   return arrival.ticket ? "" : "too many connections";
 }
 
@@ -208,12 +261,9 @@ void Listeners::accepted(const Listener& listener, Socket socket) {
     return;
   asio::error_code gone;
   if (const std::string refusal = admit(arrival, peer.counted); !refusal.empty()) {
-    services_.logs.warning(refusal + ": refused " + peer.text);
-    if (arrival.secure) return;  // whose client would not understand
-    std::string notice;
-    encode_notice_of_disconnection(notice, result::busy, refusal);
-    socket.non_blocking(true, gone);
-    socket.send(asio::buffer(notice), 0, gone);
+    services_.cut_offs.tell(CutOff::connections, refusal + ": refused " + peer.text);
+    // A client that begins with TLS would not understand.
+    if (!arrival.secure) send_notice(socket.native_handle(), refusal);
     return;
   }
   const Endpoint own = socket.local_endpoint(gone);

@@ -11,6 +11,7 @@
 #include <string>
 #include <vector>
 
+#include "descriptor.h"
 #include "net/client.h"
 #include "net/limits.h"
 #include "net/local_socket.h"
@@ -61,6 +62,8 @@ class Listeners {
                 std::string& error);
   void accept(Listener& listener);
   void accepted(const Listener& listener, Socket socket);
+  void cannot_accept(Listener& listener, const asio::error_code& error);
+  void turn_away(Listener& listener) noexcept;
   std::string admit(Arrival& arrival, const std::string& counted);
   std::string url(const Listener& listener) const;
   Loop& next_loop() noexcept;
@@ -71,6 +74,8 @@ class Listeners {
   std::vector<std::unique_ptr<Loop>>& loops_;
   std::vector<std::unique_ptr<Listener>> listeners_;
   LocalSocket local_;
+  // Given up for the moment in which a client is told that there is no other descriptor left.
+  Descriptor reserve_;
   std::shared_ptr<const Settings> settings_;
   std::size_t last_loop_ = 0;
   std::uint64_t next_number_ = 1;

@@ -179,7 +179,7 @@ bool PendingOperation::may_fail(Services& services) noexcept {
     append_client_text(line, bound_dn());
     line += " refused with 51: ";
     line += kReason;
-    services.logs.warning(line);
+    services.cut_offs.tell(CutOff::changes, line);
   } catch (...) {
     // Without memory the line is lost.
   }

@@ -13,6 +13,7 @@
 
 #include "auth/identities.h"
 #include "auth/sasl.h"
+#include "cut_off_log.h"
 #include "logs.h"
 #include "ops/backend_host.h"
 #include "ops/consequences.h"
@@ -95,6 +96,7 @@ struct Services {
   const SaslMechanisms* mechanisms = nullptr;    // null: none
   TlsHolder* tls = nullptr;                      // null: TLS is not offered
   std::atomic<std::int64_t> unauthenticated{0};  // connections on which nobody is bound
+  CutOffLog cut_offs{logs};
 };
 
 }  // namespace orv::server

@@ -43,6 +43,7 @@ DecoderLimits decoder_limits(const Settings& settings) {
   DecoderLimits limits;
   limits.message_bytes = static_cast<std::size_t>(settings.max_message_size);
   limits.filter_depth = static_cast<int>(settings.max_filter_depth);
+  limits.filter_items = static_cast<int>(settings.max_filter_items);
   limits.controls = static_cast<int>(settings.max_controls);
   limits.attributes = static_cast<int>(settings.max_attributes);
   limits.values = static_cast<int>(settings.max_values);

@@ -87,6 +87,12 @@ class Session : public OperationHome,
   const TransportFacts& transport() const noexcept { return transport_; }
   // Whether a bind in several steps has taken until `now` longer than it may.
   bool bind_is_overdue(Clock::time_point now) const noexcept;
+  bool is_unauthenticated() const noexcept { return unauthenticated_; }
+  // For how long nobody has been bound on the connection, if nobody is.
+  Clock::duration without_identity(Clock::time_point now) const noexcept {
+    return unauthenticated_ ? now - unauthenticated_since_ : Clock::duration::zero();
+  }
+  std::string_view peer() const noexcept { return peer_; }
   // The subclass has so many bytes to write now. To be called whenever that changes.
   void output_is(std::size_t unwritten) noexcept;
   // To be called a few times a second, also when the client is gone.
@@ -258,6 +264,7 @@ class Session : public OperationHome,
   Clock::time_point exchange_begun_{};
   std::uint64_t exchange_generation_ = 0;  // of the identities when it began
   bool unauthenticated_ = false;           // counted as such
+  Clock::time_point unauthenticated_since_{};
   bool gone_ = false;
   bool starting_held_ = false;
   std::size_t held_ = 0;               // of the outstanding ones

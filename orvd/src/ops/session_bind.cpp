@@ -266,6 +266,7 @@ void Session::become(std::shared_ptr<const Identity> identity) noexcept {
 
 void Session::count_as_unauthenticated(bool counted) noexcept {
   if (std::exchange(unauthenticated_, counted) == counted) return;
+  unauthenticated_since_ = Clock::now();
   services_.unauthenticated.fetch_add(counted ? 1 : -1, std::memory_order_relaxed);
 }
 
