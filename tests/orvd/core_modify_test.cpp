@@ -5,6 +5,7 @@
 #include <sstream>
 
 #include "cfg/ldapmod.h"
+#include "cfg/session.h"
 #include "core_server_fixture.h"
 #include "ops/failed_changes.h"
 #include "ops/guards.h"
@@ -251,6 +252,41 @@ TEST_F(FailingModifies, CostNothingWhenTheySucceed) {
   WireClient client(port());
   bind_as_root(client);
   EXPECT_EQ(until_refused(client), 100);
+}
+
+TEST_F(FailingModifies, CostNothingWhenTheFileCannotBeOpened) {
+  _CFG handle;
+  backend.on_change = [&](pblock* parameters) {
+    connection_of(parameters)->config_session = &handle;
+    return 1;
+  };
+  backend.on_search = [](pblock* parameters) {
+    connection_of(parameters)->config_session = nullptr;
+    return 50;
+  };
+  code = 1;
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  EXPECT_EQ(until_refused(client), 100);
+}
+
+TEST_F(FailingModifies, AreNotForgottenWhenTheirClientConnectsAgain) {
+  start();
+  int admitted = 0;
+  // One at a time, far below what one connection may.
+  while (admitted < 100) {
+    WireClient client(port());
+    bind_as_root(client);
+    const int got = code_of(client, large(2));
+    if (got == 51) break;
+    EXPECT_EQ(got, 50);
+    ++admitted;
+    client.send(unbind(3));
+    EXPECT_TRUE(client.closed());
+  }
+  EXPECT_GE(admitted, 15);
+  EXPECT_LE(admitted, 18);
 }
 
 TEST_F(FailingModifies, CountManySmallValuesByWhatTheyTake) {

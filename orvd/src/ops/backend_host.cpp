@@ -57,7 +57,8 @@ int BackendHost::call_inside_gate(int handler, pblock* parameters, Connection& c
 int BackendHost::call_keeping_gate(int handler, pblock* parameters, Connection& connection,
                                    bool leaves_slot) noexcept {
   const int code = guarded(handler, parameters);
-  if (!failed() && leaves_slot && connection.config_session) return_to_rest(connection);
+  left_slot_ = !failed() && leaves_slot && connection.config_session;
+  if (left_slot_) return_to_rest(connection);
   return code;
 }
 

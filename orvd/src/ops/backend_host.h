@@ -43,6 +43,9 @@ class BackendHost {
   // The two halves of it, for a caller with something to do before others get in.
   int call_keeping_gate(int handler, pblock* parameters, Connection& connection,
                         bool leaves_slot) noexcept;
+  // Whether the handler called last could not open its session, and so did nothing. For who holds
+  // the gate.
+  bool could_not_open() const noexcept { return left_slot_; }
   void leave_gate() noexcept;
 
   // Runs a handler that needs no gate: bind and unbind. 52 without a call when a handler threw.
@@ -69,6 +72,7 @@ class BackendHost {
   std::function<void(std::string_view)> on_failure_;
   std::atomic<bool> failed_{false};
   std::atomic<int> in_call_{0};
+  bool left_slot_ = false;  // by the handler called last; belongs to who holds the gate
 
   // Made beforehand, so that the way back to rest needs no memory.
   Connection rest_connection_;

@@ -257,7 +257,7 @@ int PendingOperation::call(Services& services) noexcept {
 // What follows a change, whatever became of it.
 void PendingOperation::settle_change(Services& services, int code) noexcept {
   settle_password_changes(code == result::success);
-  if (code != result::success && cost_of_failure_ != 0) {
+  if (code != result::success && cost_of_failure_ != 0 && !services.backend.could_not_open()) {
     const Clock::time_point now = Clock::now();
     home_->failed_changes().charge(cost_of_failure_, share_of_connection(failure_limit), now);
     services.failed_changes.charge(bound_dn(), cost_of_failure_, failure_limit, now);
