@@ -1,8 +1,12 @@
 // The key for sealed values.
 #pragma once
 
+#include <openssl/crypto.h>
+
 #include <array>
+#include <cstddef>
 #include <memory>
+#include <new>
 #include <string>
 
 #include "cfg/secret.h"
@@ -19,6 +23,15 @@ class Key {
   Key& operator=(const Key&) = delete;
 
   [[nodiscard]] const unsigned char* data() const noexcept { return bytes_.data(); }
+
+  // In the memory for keys, where the process has set some apart.
+  static void* operator new(std::size_t size, const std::nothrow_t&) noexcept {
+    return OPENSSL_secure_malloc(size);
+  }
+  static void operator delete(void* key) noexcept { OPENSSL_secure_free(key); }
+  static void operator delete(void* key, const std::nothrow_t&) noexcept {
+    OPENSSL_secure_free(key);
+  }
 
  private:
   Bytes bytes_;

@@ -1,5 +1,7 @@
 #include "check.h"
 
+#include <unistd.h>
+
 #include <fstream>
 #include <iterator>
 #include <map>
@@ -11,6 +13,7 @@
 #include "file_session.h"
 #include "schema_check.h"
 #include "slapi/file_doubts.h"
+#include "slapi/file_trust.h"
 
 namespace orv::orvcfg {
 
@@ -112,10 +115,16 @@ std::string text_of(const std::string& file) {
   return {std::istreambuf_iterator<char>(in), {}};
 }
 
-bool check_entries(const std::string& file, const std::vector<FileEntry>& entries,
-                   const cfg::Key* key, std::ostream& out) {
+// As the server would, which runs as the owner of the file.
+std::vector<std::string> distrust(const std::string& file, const std::string& key_stash) {
+  return distrusted_files(file, key_stash, owner_of(file, ::geteuid()));
+}
+
+bool check_entries(const std::string& file, const std::string& key_stash,
+                   const std::vector<FileEntry>& entries, const cfg::Key* key, std::ostream& out) {
   FileCheck check(key, out);
   const std::string prefix = file + ": ";
+  for (const std::string& line : distrust(file, key_stash)) check.report(line);
   for (const std::string& line : numbered_types(text_of(file))) check.report(prefix + line);
   for (const FileEntry& entry : entries) check.check(entry);
   return conclude(file, entries.size(), check.problems(), out);
@@ -127,6 +136,7 @@ bool check_file(const std::string& file, const std::string& key_stash, std::ostr
   std::string why;
   cfg::KeyPtr key;
   if (!key_stash.empty() && cfg::load_key_stash(key_stash.c_str(), key, why) != 0) {
+    for (const std::string& line : distrust(file, key_stash)) out << line << "\n";
     out << why << "\n";
     return false;
   }
@@ -136,7 +146,7 @@ bool check_file(const std::string& file, const std::string& key_stash, std::ostr
     out << (session ? file + ": " : "") << why << "\n";
     return false;
   }
-  return check_entries(file, entries, key.get(), out);
+  return check_entries(file, key_stash, entries, key.get(), out);
 }
 
 }  // namespace orv::orvcfg

@@ -1,6 +1,7 @@
 #include "instance.h"
 
 #include <fcntl.h>
+#include <grp.h>
 #include <sys/file.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -24,6 +25,30 @@ namespace {
 
 constexpr cfg::SecretPlace kAdminPasswordPlace{"orv-slapdAdminPW", "CN=CONFIGURATION"};
 
+// Works as another user for as long as it lives; the groups of the process stay behind.
+class ActingAs {
+ public:
+  ActingAs() = default;
+  ActingAs(const ActingAs&) = delete;
+  ActingAs& operator=(const ActingAs&) = delete;
+  ~ActingAs() {
+    if (!active_) return;
+    // Whoever cannot be root again must not go on.
+    if (::seteuid(0) != 0 || ::setegid(0) != 0) std::abort();
+  }
+
+  bool become(const Account& account) {
+    const bool groups = account.name.empty()
+                            ? ::setgroups(0, nullptr) == 0
+                            : ::initgroups(account.name.c_str(), account.group) == 0;
+    active_ = groups && ::setegid(account.group) == 0 && ::seteuid(account.user) == 0;
+    return active_;
+  }
+
+ private:
+  bool active_ = false;
+};
+
 // Removes what was made, the latest first, unless everything succeeded.
 class Undo {
  public:
@@ -38,6 +63,7 @@ class Undo {
   void file(std::string path) { made_.push_back({std::move(path), false}); }
   void directory(std::string path) { made_.push_back({std::move(path), true}); }
   void keep_all() noexcept { made_.clear(); }
+  [[nodiscard]] bool empty() const noexcept { return made_.empty(); }
 
  private:
   struct Made {
@@ -172,11 +198,42 @@ bool refuse_if_made(const Instance& instance, std::string& why) {
   return false;
 }
 
+// The rest is made as the owner of the directory, which is made sure of without following a link.
+bool give_to(const std::string& directory, const Account& owner, bool is_new, ActingAs& acting,
+             std::string& why) {
+  if (::geteuid() == owner.user) return true;
+  if (::geteuid() != 0) {
+    why = "only root can make an instance for another user";
+    return false;
+  }
+  const Descriptor opened(
+      ::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  struct stat status {};
+  if (!opened.valid() || ::fstat(opened.get(), &status) != 0) {
+    why = system_failure("cannot examine", directory);
+    return false;
+  }
+  const std::string user = user_name(owner.user);
+  if (!is_new && status.st_uid != owner.user) {
+    why = directory + " belongs to " + user_name(status.st_uid) + "; give it to " + user +
+          " (chown), or name another one";
+    return false;
+  }
+  if (::fchown(opened.get(), owner.user, owner.group) == 0 && acting.become(owner)) return true;
+  why = system_failure("cannot make an instance for the user " + user, directory);
+  return false;
+}
+
 }  // namespace
 
-bool create_instance(const std::string& directory, Instance& instance, std::string& why) {
-  Undo undo;
-  if (!make_directory(directory, undo, why) || !resolve(directory, instance.directory, why)) {
+bool create_instance(const std::string& directory, const std::optional<Account>& owner,
+                     Instance& instance, std::string& why) {
+  Undo of_directory;
+  ActingAs acting;
+  Undo undo;  // as the owner
+  if (!make_directory(directory, of_directory, why) ||
+      (owner && !give_to(directory, *owner, !of_directory.empty(), acting, why)) ||
+      !resolve(directory, instance.directory, why)) {
     return false;
   }
   const Descriptor lock(::open(instance.directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
@@ -190,6 +247,7 @@ bool create_instance(const std::string& directory, Instance& instance, std::stri
     return false;
   }
   undo.keep_all();
+  of_directory.keep_all();
   return true;
 }
 

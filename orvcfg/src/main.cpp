@@ -5,6 +5,7 @@
 #include <cstdlib>
 #include <exception>
 #include <iostream>
+#include <optional>
 #include <string>
 #include <string_view>
 
@@ -12,6 +13,7 @@
 #include "config/default_config.h"
 #include "instance.h"
 #include "show.h"
+#include "slapi/account.h"
 
 namespace {
 
@@ -22,6 +24,8 @@ constexpr int kUsageError = 2;
 struct Arguments {
   std::string directory;
   int port = 3389;
+  std::string user;
+  std::string group;
   std::string file;
   std::string key_stash;
   std::string base = "CN=CONFIGURATION";
@@ -88,7 +92,11 @@ void print_welcome(const Instance& instance, const Arguments& arguments) {
 int run_init(const Arguments& arguments) {
   Instance instance;
   std::string why;
-  if (!orv::orvcfg::create_instance(arguments.directory, instance, why)) return fail(why);
+  std::optional<orv::Account> owner;
+  if (!arguments.user.empty() &&
+      !orv::find_account(arguments.user, arguments.group, owner.emplace(), why))
+    return fail(why);
+  if (!orv::orvcfg::create_instance(arguments.directory, owner, instance, why)) return fail(why);
   print_welcome(instance, arguments);
   return finish_output();
 }
@@ -120,6 +128,12 @@ void declare_commands(CLI::App& app, Arguments& arguments, int& status) {
   init->add_option("--port", arguments.port, "port to name in the instructions that are printed")
       ->check(CLI::Range(0, 65535))
       ->type_name("N");
+  CLI::Option* const user =
+      init->add_option("--user", arguments.user, "user to make it for, when run as root")
+          ->type_name("NAME");
+  init->add_option("--group", arguments.group, "its group, instead of the user's own")
+      ->type_name("NAME")
+      ->needs(user);
   init->callback([&] { status = run_init(arguments); });
 
   CLI::App* check = app.add_subcommand("check", "say what is wrong with a configuration file");

@@ -1,10 +1,8 @@
 // orvd: reads its configuration, loads the configuration backend and serves it over LDAP.
-#include <fcntl.h>
-#include <sys/prctl.h>
-#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <csignal>
 #include <cstdio>
@@ -37,14 +35,22 @@
 #include "ops/persistent_search.h"
 #include "options.h"
 #include "plugin/loader.h"
+#include "process/call_filter.h"
+#include "process/file_access.h"
+#include "process/key_memory.h"
+#include "process/privileges.h"
+#include "process/service_manager.h"
+#include "process/surroundings.h"
 #include "publish/root_dse.h"
 #include "publish/subschema.h"
 #include "server.h"
 #include "settings.h"
+#include "slapi/account.h"
 #include "slapi/administrators.h"
 #include "slapi/backends.h"
 #include "slapi/codepage.h"
 #include "slapi/control.h"
+#include "slapi/file_trust.h"
 #include "slapi/globals.h"
 #include "slapi/log.h"
 #include "slapi/schema.h"
@@ -212,27 +218,51 @@ bool take_over(const Consequences& consequences, bool made, StoredIdentities& id
 
 // ---- the process
 
-// A file of the server's must never become what the libraries take for standard error.
-void open_standard_descriptors() {
-  int opened = 0;
-  do opened = open("/dev/null", O_RDWR);
-  while (opened >= 0 && opened <= STDERR_FILENO);
-  if (opened >= 0) close(opened);
+// What the process was given by whoever started it.
+struct Inheritance {
+  ServiceManager manager;
+  std::vector<ListeningSocket> sockets;
+};
+
+bool prepare_process(Inheritance& inherited) {
+  settle_standard_streams();
+  close_inherited_descriptors(inherited_count());
+  std::string error;
+  // Without its notices the server serves all the same.
+  if (!inherited.manager.connect(error)) std::fprintf(stderr, "orvd: %s\n", error.c_str());
+  if (!inherit_sockets(inherited.sockets, error)) {
+    std::fprintf(stderr, "orvd: %s\n", error.c_str());
+    return false;
+  }
+  clean_environment();
+  settle_process();
+  forbid_core_dumps();
+  forbid_new_privileges();
+  protect_keys();
+  return true;
 }
 
-void prepare_process() {
-  open_standard_descriptors();
-  std::signal(SIGPIPE, SIG_IGN);
-  umask(077);
-#if !defined(__SANITIZE_ADDRESS__)  // the leak check attaches to its own process
-  // Core dumps would hold passwords in clear.
-  prctl(PR_SET_DUMPABLE, 0);
-#endif
-  rlimit files{};
-  if (getrlimit(RLIMIT_NOFILE, &files) == 0 && files.rlim_cur < files.rlim_max) {
-    files.rlim_cur = files.rlim_max;
-    setrlimit(RLIMIT_NOFILE, &files);
-  }
+bool become_user(const Options& options) {
+  if (options.user.empty()) return true;
+  Account account;
+  std::string error;
+  if (find_account(options.user, options.group, account, error) && become(account, error))
+    return true;
+  std::fprintf(stderr, "orvd: %s\n", error.c_str());
+  return false;
+}
+
+bool report_problems(const std::vector<std::string>& problems) {
+  for (const std::string& problem : problems) std::fprintf(stderr, "orvd: %s\n", problem.c_str());
+  return problems.empty();
+}
+
+// Root may check the files of another user's instance, but does not serve them.
+std::vector<std::string> distrusted_files(const Options& options) {
+  const bool may_be_anybodys = options.check && geteuid() == 0;
+  return orv::distrusted_files(
+      options.named_config_file, options.named_key_stash,
+      may_be_anybodys ? owner_of(options.config_file, geteuid()) : geteuid());
 }
 
 // Files that nothing may be written to but what belongs there.
@@ -411,40 +441,73 @@ MoreListeners more_listeners(const Options& options, const Settings& settings) {
   return more;
 }
 
-int serve(const Options& options, const Settings& settings, const GuardedFiles& guarded, Logs& logs,
-          AuditLog& audit, StoredIdentities& identities, BackendPlace& place) {
-  BrokenFileReporter broken_file(options.config_file, options.key_stash_file, logs);
-  const SaslMechanisms mechanisms = make_mechanisms(identities);
-  Server server(
-      {builtin_schema(), place.backend, identities, publications(), logs,
-       slapi_supported_controls(), settings, std::max(1U, std::thread::hardware_concurrency()),
-       [&](Settings& wanted) {
-         std::string error;
-         if (!read_settings(options.config_file, options.key_stash_file, wanted, error) ||
-             !identities.reload(error)) {
-           logs.error("settings not taken over: " + error);
-           return false;
-         }
-         renew_all(options, logs);
-         open_logs(wanted, guarded, logs, audit);
-         configfile_read.fetch_add(1, std::memory_order_relaxed);
-         logs.info("settings taken over");
-         return true;
-       },
-       [&broken_file] { broken_file.note_failure(); }, &audit,
-       [&](const Consequences& consequences, bool made) {
-         return take_over(consequences, made, identities, options, logs);
-       },
-       options.guards, [&identities] { identities.refresh(); }, cfg_changes_made, &mechanisms});
-  std::string error;
+// Opens what may need root's right to low ports, and gives that up.
+bool open_sockets(const Options& options, const Settings& settings,
+                  std::vector<ListeningSocket>& sockets, std::string& error) {
+  const bool inherited = std::any_of(sockets.begin(), sockets.end(), [](const auto& socket) {
+    return socket.kind != ListenerKind::local;
+  });
+  if (inherited) return give_up_capabilities(error);
   const MoreListeners more = more_listeners(options, settings);
   const auto& addresses = options.addresses.empty() ? settings.addresses : options.addresses;
   const auto port = options.port.value_or(static_cast<std::uint16_t>(settings.port));
-  if (!server.listen(addresses, port, error, more)) {
+  const bool secure = more.secure_port && !settings.tls.certificate_file.empty();
+  return open_tcp(addresses, port, false, sockets, error) &&
+         (!secure || open_tcp(addresses, *more.secure_port, true, sockets, error)) &&
+         give_up_capabilities(error);
+}
+
+void restrict_process(const Options& options, Logs& logs) {
+  std::string why;
+  if (geteuid() == 0)
+    logs.warning("the server runs as root; make a user for it, and name that with --user");
+  if (!options.call_filter) {
+    logs.warning("system calls are not restricted, as --without-call-filter asks for");
+  } else if (const CallFilter filter = restrict_calls(why); filter == CallFilter::on) {
+    logs.info("system calls are restricted");
+  } else {
+    const std::string line = "system calls are not restricted: " + why;
+    filter == CallFilter::refused ? logs.warning(line) : logs.info(line);
+  }
+}
+
+int serve(const Options& options, const Settings& settings, const GuardedFiles& guarded, Logs& logs,
+          AuditLog& audit, StoredIdentities& identities, BackendPlace& place,
+          Inheritance& inherited) {
+  BrokenFileReporter broken_file(options.config_file, options.key_stash_file, logs);
+  const SaslMechanisms mechanisms = make_mechanisms(identities);
+  Server server({builtin_schema(), place.backend, identities, publications(), logs,
+                 slapi_supported_controls(), settings,
+                 std::max(1U, std::thread::hardware_concurrency()),
+                 [&](Settings& wanted) {
+                   std::string error;
+                   if (!read_settings(options.config_file, options.key_stash_file, wanted, error) ||
+                       !identities.reload(error)) {
+                     logs.error("settings not taken over: " + error);
+                     return false;
+                   }
+                   for (const std::string& problem : distrusted_files(options)) logs.error(problem);
+                   renew_all(options, logs);
+                   open_logs(wanted, guarded, logs, audit);
+                   configfile_read.fetch_add(1, std::memory_order_relaxed);
+                   logs.info("settings taken over");
+                   return true;
+                 },
+                 [&broken_file] { broken_file.note_failure(); }, &audit,
+                 [&](const Consequences& consequences, bool made) {
+                   return take_over(consequences, made, identities, options, logs);
+                 },
+                 options.guards, [&identities] { identities.refresh(); }, cfg_changes_made,
+                 &mechanisms, &inherited.manager});
+  std::string error;
+  if (!server.take(std::move(inherited.sockets), error) ||
+      !server.listen({}, 0, error, more_listeners(options, settings))) {
     std::fprintf(stderr, "orvd: %s\n", error.c_str());
     return 1;
   }
   server.handle_signals();
+  accept_hangup();
+  restrict_process(options, logs);
   std::string urls;
   for (const std::string& url : server.urls()) urls += " " + url;
   logs.info("orvd " ORV_VERSION " serves " + options.config_file + " at" + urls);
@@ -453,13 +516,24 @@ int serve(const Options& options, const Settings& settings, const GuardedFiles& 
   return server.serve();
 }
 
-int run(const Options& options, const FileIdentity& standard_error) {
+int run(const Options& options, const FileIdentity& standard_error, Inheritance& inherited) {
+  if (!become_user(options) ||
+      !report_problems(missing_read_access({options.config_file, options.key_stash_file})) ||
+      !report_problems(distrusted_files(options)))
+    return 1;
   if (!apply_options(options)) return 1;
   if (cfg::register_attribute_types(builtin_schema().attribute_table()) != 0) return 1;
   if (cfg::register_object_classes(builtin_schema().object_class_table()) != 0) return 1;
   Settings settings;
   std::string error;
   if (!read_settings(options.config_file, options.key_stash_file, settings, error)) {
+    std::fprintf(stderr, "orvd: %s\n", error.c_str());
+    return 1;
+  }
+  if (!report_problems(missing_write_access(options.config_file, settings,
+                                            more_listeners(options, settings).local_socket)))
+    return 1;
+  if (!options.check && !open_sockets(options, settings, inherited.sockets, error)) {
     std::fprintf(stderr, "orvd: %s\n", error.c_str());
     return 1;
   }
@@ -493,7 +567,7 @@ int run(const Options& options, const FileIdentity& standard_error) {
         AuditLog audit([&logs](std::string_view line) { logs.error(line); });
         open_logs(settings, guarded, logs, audit);
         announce_controls();
-        status = serve(options, settings, guarded, logs, audit, identities, place);
+        status = serve(options, settings, guarded, logs, audit, identities, place, inherited);
         recorded = audit.finish();
         // The end is asked for already: being told once more must not cut it short.
         std::signal(SIGTERM, SIG_IGN);
@@ -517,11 +591,12 @@ int main(int argc, char** argv) {
   Options options;
   int status = 0;
   if (parse_options(argc, argv, options, status) == Parsed::exit) return status;
-  prepare_process();
+  Inheritance inherited;
+  if (!prepare_process(inherited)) return 1;
   const FileIdentity standard_error_file = regular_file_of(STDERR_FILENO);
   const StandardError standard_error;
   try {
-    return run(options, standard_error_file);
+    return run(options, standard_error_file, inherited);
   } catch (const std::exception& error) {
     std::fprintf(stderr, "orvd: %s\n", error.what());
     return 1;

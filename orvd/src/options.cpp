@@ -23,6 +23,13 @@ bool resolve(std::string& path) {
   return true;
 }
 
+// What does not depend on the working directory, which is left.
+void make_absolute(std::string& path) {
+  if (path.empty() || path.front() == '/') return;
+  const std::unique_ptr<char, decltype(&free)> here(::getcwd(nullptr, 0), &free);
+  if (here) path = std::string(here.get()) + "/" + path;
+}
+
 bool parse_mask(std::string_view text, std::uint32_t& mask) {
   if (text.starts_with("0x") || text.starts_with("0X")) text.remove_prefix(2);
   const auto [end, status] = std::from_chars(text.data(), text.data() + text.size(), mask, 16);
@@ -62,6 +69,12 @@ Parsed parse_options(int argc, char** argv, Options& options, int& status) {
   app.add_option("--local-socket", options.local_socket,
                  "Unix socket to listen at, instead of the configured; \"\": none")
       ->type_name("FILE");
+  CLI::Option* const user =
+      app.add_option("--user", options.user, "User to become, when started as root")
+          ->type_name("NAME");
+  app.add_option("--group", options.group, "Its group, instead of the user's own")
+      ->type_name("NAME")
+      ->needs(user);
   app.add_option("--server-type", options.server_type, "Kind of server")->type_name("N");
   app.add_flag("--safe-mode", options.safe_mode, "Start in safe mode");
   app.add_option("--code-page", options.code_page, "Code page of the configuration file")
@@ -71,6 +84,8 @@ Parsed parse_options(int argc, char** argv, Options& options, int& status) {
   app.add_flag("--debug", options.debug, "Write debug output");
   app.add_flag("!--without-guards", options.guards,
                "Leave out the server's own guards, to test the backend's rules");
+  app.add_flag("!--without-call-filter", options.call_filter,
+               "Do not restrict the system calls of the serving process, to debug it");
   app.add_flag("--check", options.check, "Read the configuration, report, and exit");
   try {
     app.parse(argc, argv);
@@ -81,6 +96,12 @@ Parsed parse_options(int argc, char** argv, Options& options, int& status) {
   if (!mask.empty()) parse_mask(mask, options.trace_mask.emplace());
   if (options.plugin_file.empty())
     options.plugin_file = executable_directory() + "../lib/libback-config.so";
+  for (std::string* const path :
+       {&options.config_file, &options.key_stash_file, &options.plugin_file, &options.trace_file})
+    make_absolute(*path);
+  if (options.local_socket) make_absolute(*options.local_socket);
+  options.named_config_file = options.config_file;
+  options.named_key_stash = options.key_stash_file;
   if (!resolve(options.config_file)) {
     std::fprintf(stderr, "orvd: %s: %s\n", options.config_file.c_str(), std::strerror(errno));
     status = 1;

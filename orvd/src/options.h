@@ -11,6 +11,9 @@ namespace orv::server {
 struct Options {
   std::string config_file;     // absolute, symbolic links resolved
   std::string key_stash_file;  // "" for none
+  // The same as they were named, absolute.
+  std::string named_config_file;
+  std::string named_key_stash;
   std::string plugin_file;
   std::vector<std::string> addresses;        // not empty: instead of the configured ones
   std::optional<std::uint16_t> port;         // instead of the configured one
@@ -22,8 +25,11 @@ struct Options {
   std::optional<std::uint32_t> trace_mask;
   std::string trace_file;  // "": standard error
   bool debug = false;
-  bool guards = true;  // the server's own, in front of the backend
-  bool check = false;  // read everything, report, do not serve
+  std::string user;         // to become; "": stay
+  std::string group;        // to go with it; "": the user's
+  bool call_filter = true;  // the serving process is restricted to the system calls it needs
+  bool guards = true;       // the server's own, in front of the backend
+  bool check = false;       // read everything, report, do not serve
 };
 
 enum class Parsed { run, exit };

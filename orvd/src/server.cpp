@@ -44,6 +44,7 @@ Server::Server(ServerParts parts)
       signals_(control_),
       gate_timer_(control_),
       file_timer_(control_),
+      loop_timer_(control_),
       backend_(parts_.backend,
                [this](std::string_view why) {
                  parts_.logs.error("the backend threw: " + std::string(why) +
@@ -88,16 +89,28 @@ void Server::stop_workers() {
   if (parts_.audit) parts_.audit->settle();
 }
 
+bool Server::take(std::vector<ListeningSocket> sockets, std::string& error) {
+  for (ListeningSocket& socket : sockets)
+    if (!listeners_.adopt(std::move(socket), error)) return false;
+  return true;
+}
+
 bool Server::listen(const std::vector<std::string>& addresses, std::uint16_t port,
                     std::string& error, const MoreListeners& more) {
-  if (!load_certificate(settings_->tls, error) || !listeners_.open(addresses, port, false, error))
+  const bool taken = listeners_.has(ListenerKind::clear) || listeners_.has(ListenerKind::secure);
+  if (!load_certificate(settings_->tls, error)) return false;
+  if (listeners_.has(ListenerKind::secure) && !tls_.current()) {
+    error = "there is a socket for TLS, but orv-slapdTlsCertificateFile names no certificate";
     return false;
-  const bool secure = more.secure_port && tls_.current();
+  }
+  if (!taken && !listeners_.open(addresses, port, false, error)) return false;
+  const bool secure = !taken && more.secure_port && tls_.current();
   if (secure && !listeners_.open(addresses, *more.secure_port, true, error)) return false;
   // Another server of the same instance may be there, or the path be too long: no reason to serve
   // nobody.
   std::string failure;
-  if (!more.local_socket.empty() && !listeners_.open_local(more.local_socket, failure))
+  if (!more.local_socket.empty() && !listeners_.has(ListenerKind::local) &&
+      !listeners_.open_local(more.local_socket, failure))
     parts_.logs.error(failure);
   return true;
 }
@@ -138,7 +151,9 @@ void Server::await_signal() {
     if (error) return;
     if (number != SIGHUP) return stop();
     await_signal();
+    if (parts_.manager) parts_.manager->reloading();
     reload();
+    tell_ready();
   });
 }
 
@@ -151,6 +166,9 @@ int Server::serve() {
     const std::lock_guard lock(reloading_);
     listeners_.start(settings_);
   }
+  tell_ready();
+  turning_.store(loops_.size());
+  watch_loops();
   control();
   wind_up();
   return backend_.failed() ? 1 : 0;
@@ -201,8 +219,32 @@ void Server::watch_files() {
   });
 }
 
+// Tells the manager that the server lives, for as long as every loop turns.
+void Server::watch_loops() {
+  if (!parts_.manager || parts_.manager->watchdog_interval().count() <= 0) return;
+  loop_timer_.expires_after(parts_.manager->watchdog_interval());
+  loop_timer_.async_wait([this](const asio::error_code& error) {
+    if (error) return;
+    watch_loops();
+    if (turning_.load() < loops_.size()) return;
+    parts_.manager->alive();
+    turning_.store(0);
+    for (const auto& loop : loops_) loop->post([this] { ++turning_; });
+  });
+}
+
+void Server::tell_ready() noexcept try {
+  if (!parts_.manager) return;
+  std::string status = "Serving";
+  for (const std::string& url : urls()) status += " " + url;
+  parts_.manager->ready(status);
+} catch (...) {
+  parts_.manager->ready("");
+}
+
 void Server::wind_up() {
   const StopWatchdog watchdog(kPatience + kWindUp);
+  if (parts_.manager) parts_.manager->stopping();
   parts_.logs.info("stopping");
   listeners_.close();
   // What was cancelled is told so.

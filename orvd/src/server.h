@@ -22,6 +22,7 @@
 #include "net/loop.h"
 #include "net/tls.h"
 #include "ops/services.h"
+#include "process/service_manager.h"
 #include "settings.h"
 
 namespace orv::server {
@@ -50,6 +51,7 @@ struct ServerParts {
   std::function<void()> look_after{};
   unsigned long (*changes_made)() = nullptr;   // Services::changes_made
   const SaslMechanisms* mechanisms = nullptr;  // null: none
+  const ServiceManager* manager = nullptr;     // who is told how the server is; null: nobody
 };
 
 // Where a server listens, besides its addresses for connections in clear.
@@ -65,8 +67,12 @@ class Server {
   Server(const Server&) = delete;
   Server& operator=(const Server&) = delete;
 
-  // Reads the server's certificate, if the settings name one, and opens the listeners. False with
-  // the cause.
+  // Takes over sockets that listen already, before listen(). False with the cause.
+  bool take(std::vector<ListeningSocket> sockets, std::string& error);
+
+  // Reads the server's certificate, if the settings name one, and opens the listeners, except
+  // where some were taken over: no more for TCP, or none for the local socket. False with the
+  // cause.
   bool listen(const std::vector<std::string>& addresses, std::uint16_t port, std::string& error,
               const MoreListeners& more = {});
   std::string url() const { return listeners_.url(); }
@@ -101,6 +107,8 @@ class Server {
   void control();
   void watch_gate();
   void watch_files();
+  void watch_loops();
+  void tell_ready() noexcept;
   void wind_up();
   void stop_workers();
   void await_signal();
@@ -110,7 +118,9 @@ class Server {
   asio::signal_set signals_;
   asio::steady_timer gate_timer_;
   asio::steady_timer file_timer_;
-  std::atomic<bool> looking_{false};  // a worker is at it, or will be
+  asio::steady_timer loop_timer_;
+  std::atomic<bool> looking_{false};     // a worker is at it, or will be
+  std::atomic<std::size_t> turning_{0};  // loops that have answered since they were asked
   BackendHost backend_;
   TlsHolder tls_;
   Services services_;

@@ -19,6 +19,7 @@
 #include <string_view>
 
 #include "descriptor.h"
+#include "process/privileges.h"
 
 #if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
 // The reports of the sanitizers end the process before anybody could carry them over.
@@ -235,7 +236,12 @@ StandardError::StandardError() noexcept {
     auto state = std::make_shared<State>();
     if (!state->open()) return;
     state_ = state;
-    thread_ = std::thread([state] { state->carry(); });
+    thread_ = std::thread([state] {
+      // It is here before the server gives up what a service manager may have let it keep.
+      std::string ignored;
+      give_up_capabilities(ignored);
+      state->carry();
+    });
     watched.carrying.store(&state->carrying, std::memory_order_release);
     watched.outlet.store(state->outlet.number(), std::memory_order_release);
 #ifdef ORV_REPORTS_OF_SANITIZERS

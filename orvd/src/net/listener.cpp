@@ -1,11 +1,12 @@
 #include "net/listener.h"
 
 #include <fcntl.h>
+#include <netinet/in.h>
 #include <sys/socket.h>
+#include <sys/un.h>
 
 #include <algorithm>
 #include <asio/ip/tcp.hpp>
-#include <asio/ip/v6_only.hpp>
 #include <cerrno>
 #include <cstring>
 #include <exception>
@@ -79,6 +80,13 @@ std::string url_text(const std::string& path) {
   return text;
 }
 
+// Where a Unix socket is; "" for one without a name in the file system.
+std::string local_path(const Endpoint& endpoint) {
+  sockaddr_un address{};
+  std::memcpy(&address, endpoint.data(), std::min(endpoint.size(), sizeof address));
+  return {address.sun_path, ::strnlen(address.sun_path, sizeof address.sun_path)};
+}
+
 // Who holds the other end, and as whom it is counted. False when it has gone already.
 struct Peer {
   std::string text;
@@ -118,56 +126,36 @@ Listeners::Listeners(asio::io_context& context, Services& services, ConnectionCo
 
 bool Listeners::open(const std::vector<std::string>& addresses, std::uint16_t port, bool secure,
                      std::string& error) {
-  const auto chosen = [&] { return port != 0 ? port : this->port(secure); };
-  if (addresses.empty()) {
-    // A host without IPv6 is served over IPv4 alone.
-    return open_one("0.0.0.0", port, secure, true, error) &&
-           open_one("::", chosen(), secure, false, error);
-  }
-  for (const std::string& address : addresses)
-    if (!open_one(address, chosen(), secure, true, error)) return false;
-  return true;
-}
-
-bool Listeners::open_one(const std::string& address, std::uint16_t port, bool secure, bool required,
-                         std::string& error) {
-  asio::error_code failure;
-  const asio::ip::address parsed = asio::ip::make_address(address, failure);
-  if (failure) {
-    error = "cannot listen on '" + address + "': not an IP address, such as 127.0.0.1 or ::1";
-    return false;
-  }
-  auto made = std::make_unique<Listener>(context_, secure ? Kind::secure : Kind::clear);
-  Acceptor& acceptor = made->acceptor;
-  const tcp::endpoint endpoint(parsed, port);
-  acceptor.open(endpoint.protocol(), failure);
-  if (!failure) acceptor.set_option(tcp::acceptor::reuse_address(true), failure);
-  if (!failure && parsed.is_v6()) acceptor.set_option(asio::ip::v6_only(true), failure);
-  if (!failure) acceptor.bind(endpoint, failure);
-  if (!failure) acceptor.listen(1024, failure);
-  if (failure) {
-    if (!required) return true;
-    error =
-        "cannot listen on " + address + " port " + std::to_string(port) + ": " + failure.message();
-    return false;
-  }
-  listeners_.push_back(std::move(made));
+  std::vector<ListeningSocket> sockets;
+  if (!open_tcp(addresses, port, secure, sockets, error)) return false;
+  for (ListeningSocket& socket : sockets)
+    if (!adopt(std::move(socket), error)) return false;
   return true;
 }
 
 bool Listeners::open_local(const std::string& path, std::string& error) {
   Descriptor socket = local_.listen(path, error);
-  if (!socket) return false;
-  auto made = std::make_unique<Listener>(context_, Kind::local);
+  return socket && adopt({std::move(socket), Kind::local, AF_UNIX}, error);
+}
+
+bool Listeners::adopt(ListeningSocket socket, std::string& error) {
+  const int protocol = socket.kind == Kind::local ? 0 : IPPROTO_TCP;
+  auto made = std::make_unique<Listener>(context_, socket.kind);
   asio::error_code failure;
-  made->acceptor.assign(asio::generic::stream_protocol(AF_UNIX, 0), socket.number(), failure);
+  made->acceptor.assign(asio::generic::stream_protocol(socket.family, protocol),
+                        socket.socket.number(), failure);
   if (failure) {
-    error = "cannot listen at " + path + ": " + failure.message();
+    error = "cannot accept connections: " + failure.message();
     return false;
   }
-  socket.release();
+  socket.socket.release();
   listeners_.push_back(std::move(made));
   return true;
+}
+
+bool Listeners::has(Kind kind) const noexcept {
+  return std::any_of(listeners_.begin(), listeners_.end(),
+                     [kind](const auto& listener) { return listener->kind == kind; });
 }
 
 void Listeners::start(std::shared_ptr<const Settings> settings) {
@@ -293,8 +281,9 @@ std::uint16_t Listeners::port(bool secure) const {
 }
 
 std::string Listeners::url(const Listener& listener) const {
-  if (listener.kind == Kind::local) return "ldapi://" + url_text(local_.path());
   asio::error_code ignored;
+  if (listener.kind == Kind::local)
+    return "ldapi://" + url_text(local_path(listener.acceptor.local_endpoint(ignored)));
   return (listener.kind == Kind::secure ? "ldaps://" : "ldap://") +
          endpoint_text(tcp_endpoint(listener.acceptor.local_endpoint(ignored)));
 }

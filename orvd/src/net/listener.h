@@ -14,6 +14,7 @@
 #include "descriptor.h"
 #include "net/client.h"
 #include "net/limits.h"
+#include "net/listening_socket.h"
 #include "net/local_socket.h"
 #include "net/loop.h"
 #include "ops/services.h"
@@ -32,6 +33,11 @@ class Listeners {
             std::string& error);
   // Opens a Unix socket, for its owner and root.
   bool open_local(const std::string& path, std::string& error);
+  // Accepts from a socket that is open already. One of the file system stays there at the end: it
+  // is whoever's opened it. False with the cause.
+  bool adopt(ListeningSocket socket, std::string& error);
+  // Whether there is one of that kind.
+  bool has(ListenerKind kind) const noexcept;
 
   // Begins to accept. `settings` is asked for the limits in force.
   void start(std::shared_ptr<const Settings> settings);
@@ -49,7 +55,7 @@ class Listeners {
  private:
   using Acceptor = asio::basic_socket_acceptor<asio::generic::stream_protocol>;
   using Socket = asio::generic::stream_protocol::socket;
-  enum class Kind { clear, secure, local };
+  using Kind = ListenerKind;
   struct Listener {
     Listener(asio::io_context& context, Kind listens_for)
         : kind(listens_for), acceptor(context), pause(context) {}
@@ -58,8 +64,6 @@ class Listeners {
     asio::steady_timer pause;
   };
 
-  bool open_one(const std::string& address, std::uint16_t port, bool secure, bool required,
-                std::string& error);
   void accept(Listener& listener);
   void accepted(const Listener& listener, Socket socket);
   void cannot_accept(Listener& listener, const asio::error_code& error);

@@ -1,0 +1,58 @@
+#include "slapi/account.h"
+
+#include <grp.h>
+#include <pwd.h>
+
+#include <charconv>
+#include <optional>
+
+namespace orv {
+namespace {
+
+// The largest number means "leave it as it is" to the system.
+std::optional<id_t> as_number(const std::string& text) {
+  id_t number = 0;
+  const auto [end, status] = std::from_chars(text.data(), text.data() + text.size(), number);
+  if (status != std::errc() || end != text.data() + text.size()) return std::nullopt;
+  if (number == static_cast<id_t>(-1)) return std::nullopt;
+  return number;
+}
+
+bool find_group(const std::string& group, gid_t& number, std::string& error) {
+  if (const struct group* const found = ::getgrnam(group.c_str())) {
+    number = found->gr_gid;
+    return true;
+  }
+  if (const std::optional<id_t> given = as_number(group)) {
+    number = *given;
+    return true;
+  }
+  error = "there is no group " + group + " on this host; make it (groupadd), or name another one";
+  return false;
+}
+
+}  // namespace
+
+bool find_account(const std::string& user, const std::string& group, Account& account,
+                  std::string& error) {
+  const passwd* found = ::getpwnam(user.c_str());
+  const std::optional<id_t> number = found ? std::nullopt : as_number(user);
+  if (number) found = ::getpwuid(*number);
+  if (!found && !number) {
+    error = "there is no user " + user + " on this host; make it (useradd), or name another one";
+    return false;
+  }
+  if (!found && group.empty()) {
+    error = "the host knows no group of the user " + user + "; name one as well (--group)";
+    return false;
+  }
+  account = found ? Account{found->pw_uid, found->pw_gid, found->pw_name} : Account{*number, 0, ""};
+  return group.empty() || find_group(group, account.group, error);
+}
+
+std::string user_name(uid_t user) {
+  const passwd* const found = ::getpwuid(user);
+  return found ? found->pw_name : std::to_string(user);
+}
+
+}  // namespace orv
