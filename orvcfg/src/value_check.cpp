@@ -65,6 +65,7 @@ struct Vocabulary {
 constexpr Vocabulary kVocabularies[] = {{"orv-slapdLogLevel", kLogLevels},
                                         {"orv-slapdTlsClientCertificate", kClientCertificates},
                                         {"orv-slapdTlsMinimumVersion", kTlsVersions},
+                                        {"orv-slapdSaslMechanisms", kSaslMechanisms},
                                         {"orv-slapdAdminRole", kAdminRoles}};
 
 std::string word_problem(std::string_view name, const std::string& value) {
@@ -91,6 +92,8 @@ std::string value_problem(const SchemaAttribute& type, const std::string& value)
   if (problem.empty() && is_path && !value.starts_with('/')) {
     problem = "is not an absolute path";
   }
+  if (problem.empty() && type.names.front() == "orv-slapdDigestRealm" && !is_digest_realm(value))
+    problem = "is not 1 to 255 characters of ASCII without quotes and backslashes";
   return problem;
 }
 

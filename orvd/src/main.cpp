@@ -12,6 +12,7 @@
 #include <functional>
 #include <memory>
 #include <mutex>
+#include <set>
 #include <string>
 #include <thread>
 #include <utility>
@@ -19,6 +20,7 @@
 
 #include "audit/log.h"
 #include "auth/identities.h"
+#include "auth/sasl_cyrus.h"
 #include "auth/sasl_external.h"
 #include "broken_file.h"
 #include "cfg/attribute_table.h"
@@ -92,7 +94,9 @@ void tell(Logs& logs, const std::string& error, const std::vector<std::string>& 
   for (const std::string& warning : warnings) logs.warning(warning);
 }
 
-class StoredIdentities final : public Authenticator, public ExternalIdentities {
+class StoredIdentities final : public Authenticator,
+                               public ExternalIdentities,
+                               public SaslIdentities {
  public:
   // `follow` as in IdentityStore.
   StoredIdentities(const Options& options, Logs& logs, std::function<bool()> follow)
@@ -135,6 +139,34 @@ class StoredIdentities final : public Authenticator, public ExternalIdentities {
     return identities ? identities->of_certificate(subject) : nullptr;
   }
 
+  std::shared_ptr<const Identity> of_user(std::string_view name, std::string& password) override {
+    const std::shared_ptr<const Identities> identities = store_.current();
+    if (!identities) return nullptr;
+    std::string unreadable;
+    std::shared_ptr<const Identity> found = identities->of_user(name, password, unreadable);
+    if (!unreadable.empty()) tell_of_unreadable(unreadable);
+    return found;
+  }
+
+  std::shared_ptr<const Identity> of_principal(std::string_view principal) override {
+    const std::shared_ptr<const Identities> identities = store_.current();
+    return identities ? identities->of_principal(principal) : nullptr;
+  }
+
+  bool settle(const Identity& identity, bool proved) noexcept override {
+    return settle_administrator_bind(identity.bound_dn, proved, std::chrono::steady_clock::now());
+  }
+
+  bool has_users() const noexcept override {
+    const std::shared_ptr<const Identities> identities = store_.latest();
+    return identities && identities->has_users();
+  }
+
+  bool has_principals() const noexcept override {
+    const std::shared_ptr<const Identities> identities = store_.latest();
+    return identities && identities->has_principals();
+  }
+
   std::uint64_t generation() const noexcept override { return store_.generation(); }
 
   bool still_valid(const Identity& bound) const noexcept override {
@@ -166,9 +198,28 @@ class StoredIdentities final : public Authenticator, public ExternalIdentities {
     logs_.error(line + ": more than one entry defines that identity");
   }
 
+  // The same.
+  void tell_of_unreadable(const std::string& entry_dn) {
+    {
+      const std::lock_guard lock(unreadable_mutex_);
+      const std::uint64_t generation = store_.generation();
+      if (std::exchange(unreadable_read_, generation) != generation) unreadable_told_.clear();
+      if (!unreadable_told_.insert(entry_dn).second) return;
+    }
+    std::string line;
+    append_quoted(line, entry_dn);
+    logs_.warning(line +
+                  ": the password does not serve DIGEST-MD5 and SCRAM-SHA-256, which need one that "
+                  "is stored in clear or sealed, not hashed: set orv-slapdPwEncryption to AES256, "
+                  "and the password anew");
+  }
+
   IdentityStore store_;
   Logs& logs_;
   std::atomic<std::uint64_t> told_{0};
+  std::mutex unreadable_mutex_;
+  std::uint64_t unreadable_read_ = 0;
+  std::set<std::string> unreadable_told_;
 };
 
 // ---- what the rules know
@@ -396,10 +447,22 @@ Publications publications() {
 }
 
 // What clients may bind with besides passwords.
-SaslMechanisms make_mechanisms(StoredIdentities& identities) {
+SaslMechanisms make_mechanisms(StoredIdentities& identities, CyrusSasl& sasl) {
   SaslMechanisms mechanisms;
-  mechanisms.push_back(make_external(identities));
+  mechanisms.push_back(
+      offer_while([&sasl] { return sasl.allows("EXTERNAL"); }, make_external(identities)));
+  sasl.add_mechanisms(mechanisms);
   return mechanisms;
+}
+
+// Text of a client's may be in it.
+void tell_of_exchange(Logs& logs, std::string_view what) noexcept {
+  try {
+    std::string line = "bind: ";
+    append_quoted(line, what);
+    logs.write(LogLevel::debug, line);
+  } catch (...) {
+  }
 }
 
 bool can_use_certificate(const Settings& settings) {
@@ -413,16 +476,18 @@ void report(Logs& logs, const std::vector<std::string>& problems) {
   for (const std::string& problem : problems) logs.error(problem);
 }
 
-std::vector<FileInUse> files_of_tls(const TlsSettings& tls) {
+std::vector<FileInUse> files_of_keys(const Settings& settings) {
+  const TlsSettings& tls = settings.tls;
   std::vector<FileInUse> files;
-  for (const std::string& path : {tls.certificate_file, tls.key_file, tls.ca_file})
+  for (const std::string& path :
+       {tls.certificate_file, tls.key_file, tls.ca_file, settings.sasl.keytab})
     if (const FileIdentity file = file_at(path)) files.push_back({file, path});
   return files;
 }
 
 // The audit log first: what is its file then, wanted or not, is kept from the other logs.
 void open_logs(const Settings& settings, GuardedFiles guarded, Logs& logs, AuditLog& audit) {
-  std::vector<FileInUse> others = files_of_tls(settings.tls);
+  std::vector<FileInUse> others = files_of_keys(settings);
   guarded.in_use.insert(guarded.in_use.end(), others.begin(), others.end());
   for (FileInUse& file : logs.files_in_use()) guarded.in_use.push_back(std::move(file));
   const std::string reason = audit.open(settings.audit_log, guarded);
@@ -475,7 +540,16 @@ int serve(const Options& options, const Settings& settings, const GuardedFiles& 
           AuditLog& audit, StoredIdentities& identities, BackendPlace& place,
           Inheritance& inherited) {
   BrokenFileReporter broken_file(options.config_file, options.key_stash_file, logs);
-  const SaslMechanisms mechanisms = make_mechanisms(identities);
+  std::string error;
+  const std::unique_ptr<const SaslLibrary> library = SaslLibrary::open(error);
+  if (!library) {
+    std::fprintf(stderr, "orvd: %s\n", error.c_str());
+    return 1;
+  }
+  CyrusSasl sasl(*library, identities,
+                 [&logs](std::string_view what) { tell_of_exchange(logs, what); });
+  report(logs, sasl.configure(settings.sasl));
+  const SaslMechanisms mechanisms = make_mechanisms(identities, sasl);
   Server server({builtin_schema(), place.backend, identities, publications(), logs,
                  slapi_supported_controls(), settings,
                  std::max(1U, std::thread::hardware_concurrency()),
@@ -488,6 +562,7 @@ int serve(const Options& options, const Settings& settings, const GuardedFiles& 
                    }
                    for (const std::string& problem : distrusted_files(options)) logs.error(problem);
                    renew_all(options, logs);
+                   report(logs, sasl.configure(wanted.sasl));
                    open_logs(wanted, guarded, logs, audit);
                    configfile_read.fetch_add(1, std::memory_order_relaxed);
                    logs.info("settings taken over");
@@ -499,7 +574,6 @@ int serve(const Options& options, const Settings& settings, const GuardedFiles& 
                  },
                  options.guards, [&identities] { identities.refresh(); }, cfg_changes_made,
                  &mechanisms, &inherited.manager});
-  std::string error;
   if (!server.take(std::move(inherited.sockets), error) ||
       !server.listen({}, 0, error, more_listeners(options, settings))) {
     std::fprintf(stderr, "orvd: %s\n", error.c_str());

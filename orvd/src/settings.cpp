@@ -59,6 +59,9 @@ constexpr const char* kAddresses = "orv-slapdIpAddress";
 constexpr const char* kLocalSocket = "orv-slapdLocalSocket";
 constexpr const char* kConfiguration = "CN=CONFIGURATION";
 constexpr const char* kGroup = "CN=ADMINGROUP,CN=CONFIGURATION";
+constexpr const char* kSaslMechanismSetting = "orv-slapdSaslMechanisms";
+constexpr const char* kDigestEntry = "CN=DIGEST,CN=CONFIGURATION";
+constexpr const char* kDigestRealm = "orv-slapdDigestRealm";
 constexpr const char* kErrorLogEntry = "CN=DEFAULT,CN=LOG MANAGEMENT,CN=CONFIGURATION";
 constexpr const char* kAccessLogEntry = "CN=ACCESS,CN=LOG MANAGEMENT,CN=CONFIGURATION";
 constexpr const char* kAuditLogEntry = "CN=AUDIT,CN=LOG MANAGEMENT,CN=CONFIGURATION";
@@ -183,6 +186,27 @@ bool read_tls(_CFG* session, Settings& settings, std::string& error) {
   return true;
 }
 
+bool is_good(const char* name, const std::string& value, std::string& error) {
+  const std::string problem = value_problem(name, value);
+  if (!problem.empty()) error = std::string(name) + " " + problem;
+  return problem.empty();
+}
+
+// Mechanisms and keytab decide whom the server believes, the realm only what clients are asked.
+bool read_sasl(_CFG* session, SaslSettings& sasl, std::string& error) {
+  const FileEntry group(session, kGroup);
+  sasl.mechanisms = group.values(kSaslMechanismSetting);
+  for (std::string& name : sasl.mechanisms) {
+    if (!is_good(kSaslMechanismSetting, name, error)) return false;
+    for (char& c : name)
+      if (c >= 'a' && c <= 'z') c = static_cast<char>(c - 'a' + 'A');
+  }
+  const std::optional<std::string> realm = FileEntry(session, kDigestEntry).first(kDigestRealm);
+  if (realm && !is_good(kDigestRealm, *realm, error)) return false;
+  sasl.digest_realm = realm.value_or("");
+  return read_path(group, "orv-slapdKrbKeytab", sasl.keytab, error);
+}
+
 bool read_integers(const FileEntry& top, Settings& settings, std::string& error) {
   for (const SettingRow& row : setting_rows()) {
     const std::optional<std::string> value = top.first(std::string(row.name).c_str());
@@ -209,6 +233,9 @@ std::string value_problem(std::string_view name, std::string_view value) {
   if (name == "orv-slapdLogLevel") return none_of(kLogLevels);
   if (name == "orv-slapdTlsClientCertificate") return none_of(kClientCertificates);
   if (name == "orv-slapdTlsMinimumVersion") return none_of(kTlsVersions);
+  if (name == kSaslMechanismSetting) return none_of(kSaslMechanisms);
+  if (name == kDigestRealm && !is_digest_realm(value))
+    return "is not 1 to 255 characters of ASCII without quotes and backslashes";
   CertificateMapping mapping;
   if (name == kCertificateMap && !parse_certificate_mapping(value, mapping))
     return "is not SUBJECT => NAME, two DNs";
@@ -264,7 +291,7 @@ bool read_settings(const std::string& config_file, const std::string& key_stash_
   Settings read;
   read.addresses = top.values(kAddresses);
   if (read_integers(top, read, error) && read_path(top, kLocalSocket, read.local_socket, error) &&
-      read_tls(session.get(), read, error) &&
+      read_tls(session.get(), read, error) && read_sasl(session.get(), read.sasl, error) &&
       read_log(session.get(), kErrorLogEntry, read.error_log, read.error_log_level, error) &&
       read_log(session.get(), kAccessLogEntry, read.access_log, read.access_log_level, error) &&
       read_audit_log(session.get(), read.audit_log, error)) {

@@ -10,6 +10,8 @@
 #include <string_view>
 #include <vector>
 
+#include "auth/sasl_settings.h"
+
 namespace orv::server {
 
 enum class ClientCertificates { none, optional, required };
@@ -57,6 +59,7 @@ struct Settings {
   std::string local_socket;                             // path; empty: none
 
   TlsSettings tls;
+  SaslSettings sasl;
   bool tls_for_passwords = true;         // binds with passwords need it
   bool tls_for_local_passwords = false;  // also from the same host
 
@@ -80,9 +83,9 @@ struct SettingRow {
 // All integer settings, in the order of the documentation.
 std::span<const SettingRow> setting_rows() noexcept;
 
-// What is wrong with a value of a setting that is a word, or of a map of certificates; "" when
-// nothing is, or the setting is another one. With such a word the server would not start; of a map
-// it would leave the value out, and warn.
+// What is wrong with a value of a setting that is a word or a realm, or of a map of certificates;
+// "" when nothing is, or the setting is another one. With such a word or realm the server would not
+// start; of a map it would leave the value out, and warn.
 std::string value_problem(std::string_view name, std::string_view value);
 
 // Takes one value over. False, with the reason in `error`, when `value` is not an integer within

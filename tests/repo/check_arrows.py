@@ -16,7 +16,7 @@ import findings
 # Headers of POSIX, the C library and the compiler that every folder may include.
 POSIX = set("""
 arpa/inet.h dirent.h dlfcn.h errno.h fcntl.h fnmatch.h grp.h iconv.h ifaddrs.h langinfo.h limits.h
-locale.h net/if.h netdb.h netinet/in.h netinet/tcp.h nl_types.h poll.h pthread.h pwd.h sched.h
+locale.h malloc.h net/if.h netdb.h netinet/in.h netinet/tcp.h nl_types.h poll.h pthread.h pwd.h sched.h
 semaphore.h signal.h stdint.h stdlib.h string.h strings.h sys/epoll.h sys/eventfd.h sys/file.h
 sys/ioctl.h sys/mman.h sys/prctl.h sys/random.h sys/resource.h sys/select.h sys/socket.h sys/stat.h
 sys/statvfs.h sys/syscall.h sys/time.h sys/types.h sys/uio.h sys/un.h sys/utsname.h sys/wait.h
@@ -30,7 +30,7 @@ INCLUDES = {
               ["openssl/", "ldap.h", "ldap_schema.h", "lber.h", "spdlog/"]),
     "back-config": (["slapi", "cfg"], []),
     "orvd": (["slapi", "cfg", "schema", "config"],
-             ["asio.hpp", "asio/", "sasl/", "openssl/", "ldap.h", "lber.h", "spdlog/", "CLI/",
+             ["asio.hpp", "asio/", "sasl/", "gssapi/", "openssl/", "ldap.h", "lber.h", "spdlog/", "CLI/",
               "utf8proc.h"]),
     "orvcfg": (["slapi", "cfg", "config"], ["CLI/", "openssl/"]),
     "schema": (["schema"], []),
@@ -48,7 +48,7 @@ LINKS = {
     "lib/libslapi.so": ([r"libcfg\.so", LDAP, OPENSSL, r"lib(spdlog|fmt)\.so.*"], ["libcfg.so"]),
     "lib/libback-config.so": ([r"libslapi\.so", r"libcfg\.so"], ["libslapi.so"]),
     "bin/orvd": ([r"libslapi\.so", r"libcfg\.so", LDAP, OPENSSL, r"lib(spdlog|fmt)\.so.*",
-                  r"libsasl2\.so.*"], ["libslapi.so"]),
+                  r"libsasl2\.so.*", r"libgssapi_krb5\.so.*"], ["libslapi.so"]),
     "bin/orvcfg": ([r"libslapi\.so", r"libcfg\.so", OPENSSL], ["libcfg.so"]),
 }
 

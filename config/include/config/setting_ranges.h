@@ -71,10 +71,21 @@ inline constexpr std::string_view kClientCertificates[] = {"none", "optional", "
 // Values of orv-slapdTlsMinimumVersion.
 inline constexpr std::string_view kTlsVersions[] = {"1.2", "1.3"};
 
+// Values of orv-slapdSaslMechanisms, in any letter case.
+inline constexpr std::string_view kSaslMechanisms[] = {"EXTERNAL", "GSSAPI", "SCRAM-SHA-256",
+                                                       "DIGEST-MD5", "none"};
+
+// Whether a value of orv-slapdDigestRealm can be quoted in a challenge as it is.
+constexpr bool is_digest_realm(std::string_view value) noexcept {
+  for (const char c : value)
+    if (c < ' ' || c > '~' || c == '"' || c == '\\') return false;
+  return !value.empty() && value.size() <= 255;
+}
+
 // Settings whose values are absolute paths of files.
 inline constexpr std::string_view kPathSettings[] = {
     "orv-slapdLog",        "orv-slapdLocalSocket", "orv-slapdTlsCertificateFile",
-    "orv-slapdTlsKeyFile", "orv-slapdTlsCaFile",
+    "orv-slapdTlsKeyFile", "orv-slapdTlsCaFile",   "orv-slapdKrbKeytab",
 };
 
 // Values of orv-slapdLogLevel, in any letter case.

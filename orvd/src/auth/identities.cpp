@@ -35,6 +35,22 @@ bool to_file_form(std::string_view password, std::string& form) {
   return true;
 }
 
+// The reverse, of a password that the file held.
+bool from_file_form(std::string& password) {
+  if (password.find('\0') != std::string::npos) return false;
+  if (local_code_page_is_utf8()) return true;
+  char* converted = nullptr;
+  std::size_t length = 0;
+  const int code = xlate_localcp_to_utf8(password.c_str(), &converted, &length);
+  const MallocText text(converted);
+  if (code == result::no_memory) throw std::bad_alloc();
+  if (code != 0) return false;
+  cfg::wipe(password);
+  password = text.get();
+  cfg::wipe(text.get(), password.size());
+  return true;
+}
+
 // Wiped when it goes out of scope, on every way out.
 class Secret {
  public:
@@ -66,6 +82,11 @@ struct Identities::Data {
   std::unordered_map<std::string_view, const IdentityRecord*> by_dn;  // null: claimed twice
   // Subjects of certificates, to normal bind DNs; "": mapped twice.
   std::unordered_map<std::string, std::string> by_subject;
+  // By the further names; null: claimed twice.
+  std::unordered_map<std::string, const IdentityRecord*> by_user;
+  std::unordered_map<std::string, const IdentityRecord*> by_principal;
+  const IdentityRecord* readable = nullptr;   // somebody who can bind by user name; null: nobody
+  bool has_principals = false;                // somebody can bind by Kerberos
   const IdentityRecord* costliest = nullptr;  // null: nobody has a password
   std::uint64_t highest_cost = 0;
 
@@ -83,6 +104,63 @@ struct Identities::Data {
       warnings.push_back(record.identity.entry_dn +
                          ": another entry has the same bind DN, nobody can bind with it");
     }
+  }
+
+  using ByName = std::unordered_map<std::string, const IdentityRecord*>;
+
+  void index_names(std::vector<std::string>& warnings) {
+    for (const IdentityRecord& record : records) {
+      claim(by_user, record.user_name, record, "orv-slapdDigestAdminUser", warnings);
+      claim(by_principal, record.principal, record, "orv-slapdKrbAdminDN", warnings);
+    }
+    for (const auto& [name, record] : by_user)
+      if (record != nullptr && can_bind(*record) && is_readable(*record)) readable = record;
+    for (const auto& [name, record] : by_principal)
+      if (record != nullptr && can_bind(*record)) has_principals = true;
+  }
+
+  static void claim(ByName& names, const std::string& name, const IdentityRecord& record,
+                    const char* type, std::vector<std::string>& warnings) {
+    if (name.empty()) return;
+    const auto [place, fresh] = names.try_emplace(name, &record);
+    if (fresh) return;
+    place->second = nullptr;
+    warnings.push_back(record.identity.entry_dn + ": another entry has the same " + type +
+                       ", nobody can bind with it");
+  }
+
+  const IdentityRecord* find_named(const ByName& names, const std::string& name) const noexcept {
+    const auto place = names.find(name);
+    if (place == names.end() || place->second == nullptr) return nullptr;
+    return can_bind(*place->second) ? place->second : nullptr;
+  }
+
+  bool can_bind(const IdentityRecord& record) const noexcept {
+    return find_bindable(record.identity.bound_dn) == &record;
+  }
+
+  bool is_readable(const IdentityRecord& record) const {
+    Secret clear;
+    return read_password(record, clear.text);
+  }
+
+  // The password in clear, in UTF-8; false when it is stored in a way that cannot be read back, or
+  // matches nothing. `clear` may hold something then, too.
+  bool read_password(const IdentityRecord& record, std::string& clear) const {
+    const std::string& stored = record.stored_password;
+    const cfg::OpenResult opened = cfg::open_secret(key.get(), stored, clear);
+    if (opened == cfg::OpenResult::broken) return false;
+    if (opened == cfg::OpenResult::not_sealed) {
+      if (cfg::names_scheme(stored)) return false;
+      clear = stored;
+    }
+    return proves(record, clear, cfg::verify_secret) && from_file_form(clear);
+  }
+
+  // The work of reading a password, where there is none to be read.
+  void read_any_password() const {
+    Secret clear;
+    if (readable != nullptr) read_password(*readable, clear.text);
   }
 
   void map_certificates(std::vector<CertificateMapping>& mappings,
@@ -167,6 +245,7 @@ std::shared_ptr<const Identities> Identities::read(const char* config_file,
     identities->data_->key = std::move(read.key);
     identities->data_->records = std::move(read.records);
     identities->data_->index(warnings);
+    identities->data_->index_names(warnings);
     identities->data_->map_certificates(read.certificates, warnings);
     return identities;
   } catch (...) {
@@ -198,11 +277,48 @@ std::shared_ptr<const Identity> Identities::of_certificate(std::string_view subj
   return identity;
 }
 
+std::shared_ptr<const Identity> Identities::of_user(std::string_view name, std::string& password,
+                                                    std::string& unreadable) const {
+  std::string own(name);
+  const IdentityRecord* const record = data_->find_named(data_->by_user, own);
+  Secret clear;
+  if (record == nullptr || !data_->read_password(*record, clear.text)) {
+    if (record != nullptr) unreadable = record->identity.entry_dn;
+    data_->read_any_password();
+    return nullptr;
+  }
+  auto identity = std::make_shared<Identity>(record->identity);
+  identity->user_name = std::move(own);
+  password = clear.text;
+  return identity;
+}
+
+std::shared_ptr<const Identity> Identities::of_principal(std::string_view principal) const {
+  std::string lower = lower_principal(principal);
+  const IdentityRecord* const record = data_->find_named(data_->by_principal, lower);
+  if (record == nullptr) return nullptr;
+  auto identity = std::make_shared<Identity>(record->identity);
+  identity->principal = std::move(lower);
+  return identity;
+}
+
+bool Identities::has_users() const noexcept {
+  return data_->readable != nullptr;
+}
+
+bool Identities::has_principals() const noexcept {
+  return data_->has_principals;
+}
+
 bool Identities::still_valid(const Identity& bound) const noexcept {
-  const IdentityRecord* const record = data_->find_bindable(bound.bound_dn);
+  const Data& data = *data_;
+  const IdentityRecord* const record = data.find_bindable(bound.bound_dn);
   if (record == nullptr || !same_grant(record->identity, bound)) return false;
-  return bound.certificate_subject.empty() ||
-         data_->find_mapped(bound.certificate_subject) == record;
+  if (!bound.certificate_subject.empty() && data.find_mapped(bound.certificate_subject) != record)
+    return false;
+  if (!bound.user_name.empty() && data.find_named(data.by_user, bound.user_name) != record)
+    return false;
+  return bound.principal.empty() || data.find_named(data.by_principal, bound.principal) == record;
 }
 
 bool Identities::claimed_twice(std::string_view name) const {

@@ -9,10 +9,14 @@
 //   everybody else                                                          flags 0x24
 //
 // To these come certificates of clients that orv-slapdCertificateMap of CN=ADMINGROUP maps to one
-// of them; they prove an identity that has no password, too.
+// of them; they prove an identity that has no password, too. So do the Kerberos identities
+// (orv-slapdKrbAdminDN of CN=KERBEROS and of members); the user names (orv-slapdDigestAdminUser of
+// CN=DIGEST and of members) go with the password, where it can be read back.
 //
-// Only the first value of an identity's DN and password counts. A DN that two entries claim binds
-// as neither. DNs inside CN=CONFIGURATION and the empty DN are nobody's.
+// Only the first value of an identity's DN, names and password counts. A DN or name that two
+// entries claim binds as neither. DNs inside CN=CONFIGURATION and the empty DN are nobody's. User
+// names are compared byte for byte, Kerberos identities by what follows their first "=", in any
+// letter case: as the rules for changes do.
 //
 // Threads: `Identities` is an immutable snapshot, shared freely; `IdentityStore` is thread-safe.
 #pragma once
@@ -38,6 +42,8 @@ struct Identity {
   std::string entry_dn;                             // normal form of the entry that defines it
   std::array<unsigned char, 32> password_digest{};  // SHA-256 of the password as it is stored
   std::string certificate_subject{};  // normal form; of whom a certificate has proved to be it
+  std::string user_name{};            // by which a SASL mechanism with passwords has proved it
+  std::string principal{};            // in lower case; by which Kerberos has proved it
 };
 
 // Role bits of a list of orv-slapdAdminRole values; 0 when "NoAdmin" is among them.
@@ -72,8 +78,23 @@ class Identities {
   // mapped to nobody, or more than once, or who it is mapped to cannot bind. Throws std::bad_alloc.
   std::shared_ptr<const Identity> of_certificate(std::string_view subject) const;
 
+  // Who binds with a user name, and in `password` the password in clear, in UTF-8, which the caller
+  // wipes. Null, and no password, when nobody can; if only because the password is stored in a way
+  // that cannot be read back, `unreadable` is then the normal form of the entry. Takes the same
+  // work whoever is asked for. Throws std::bad_alloc.
+  std::shared_ptr<const Identity> of_user(std::string_view name, std::string& password,
+                                          std::string& unreadable) const;
+
+  // The identity of a Kerberos principal, as Kerberos spells it; or null. Throws std::bad_alloc.
+  std::shared_ptr<const Identity> of_principal(std::string_view principal) const;
+
+  // Whether of_user and of_principal could find somebody.
+  bool has_users() const noexcept;
+  bool has_principals() const noexcept;
+
   // Whether what `bound` (of any snapshot) was granted still stands here: the same entry, bind DN,
-  // flags, roles and stored password, the map of the certificate that proved it, and it may bind.
+  // flags, roles and stored password, the map of the certificate or the name that proved it, and it
+  // may bind.
   bool still_valid(const Identity& bound) const noexcept;
 
   // Whether more than one entry claims the DN that is spelled so. Throws std::bad_alloc.

@@ -18,6 +18,8 @@ namespace {
 constexpr const char* kTop = "CN=CONFIGURATION";
 constexpr const char* kGroup = "CN=ADMINGROUP,CN=CONFIGURATION";
 constexpr const char* kMasterServer = "CN=MASTER SERVER,CN=CONFIGURATION";
+constexpr const char* kKerberos = "CN=KERBEROS,CN=CONFIGURATION";
+constexpr const char* kDigest = "CN=DIGEST,CN=CONFIGURATION";
 
 constexpr const char* kAdminDn = "orv-slapdAdminDN";
 constexpr const char* kAdminPassword = "orv-slapdAdminPW";
@@ -25,6 +27,8 @@ constexpr const char* kMasterDn = "orv-slapdMasterDN";
 constexpr const char* kMasterPassword = "orv-slapdMasterPW";
 constexpr const char* kRole = "orv-slapdAdminRole";
 constexpr const char* kGroupEnabled = "orv-slapdAdminGroupEnabled";
+constexpr const char* kKerberosDn = "orv-slapdKrbAdminDN";
+constexpr const char* kUserName = "orv-slapdDigestAdminUser";
 
 constexpr const char* kEveryEntry = "(objectclass=*)";
 constexpr const char* kMembers = "(objectclass=orv-slapdAdminGroupMember)";
@@ -63,8 +67,8 @@ class RecordReader {
 
   bool read(const char* config_file, const char* key_stash_file) {
     return load_key(key_stash_file) && open(config_file, key_stash_file) && read_kind(kPrimary) &&
-           read_kind(kMember) && read_kind(kServerSupplier) && read_kind(kSuffixSupplier) &&
-           read_certificate_map();
+           read_names_of_primary() && read_kind(kMember) && read_kind(kServerSupplier) &&
+           read_kind(kSuffixSupplier) && read_certificate_map();
   }
 
  private:
@@ -106,14 +110,34 @@ class RecordReader {
     return true;
   }
 
-  bool read_certificate_map() {
+  // Finds the one entry, if it is there.
+  bool find(const char* dn, CfgResult& chain, _CFGMessage*& entry) {
     _CFGMessage* found = nullptr;
-    const int code =
-        cfg_search_s(session_.get(), kGroup, kScopeBase, kEveryEntry, nullptr, 0, &found);
-    const CfgResult chain(found);
-    if (code == result::no_such_object) return true;
-    if (code != 0) return fail(code, kGroup);
-    _CFGMessage* const entry = cfg_first_entry(session_.get(), chain.get());
+    const int code = cfg_search_s(session_.get(), dn, kScopeBase, kEveryEntry, nullptr, 0, &found);
+    chain.reset(found);
+    if (code != 0 && code != result::no_such_object) return fail(code, dn);
+    entry = code == 0 ? cfg_first_entry(session_.get(), chain.get()) : nullptr;
+    return true;
+  }
+
+  // They stand in entries of their own.
+  bool read_names_of_primary() {
+    CfgResult chain;
+    _CFGMessage* entry = nullptr;
+    if (!find(kDigest, chain, entry)) return false;
+    std::string user_name = entry ? read_user_name(entry, kDigest) : std::string();
+    if (!find(kKerberos, chain, entry)) return false;
+    std::string principal = entry ? read_principal(entry, kKerberos) : std::string();
+    if (result_.records.empty()) return true;
+    result_.records.front().user_name = std::move(user_name);
+    result_.records.front().principal = std::move(principal);
+    return true;
+  }
+
+  bool read_certificate_map() {
+    CfgResult chain;
+    _CFGMessage* entry = nullptr;
+    if (!find(kGroup, chain, entry)) return false;
     if (entry == nullptr) return true;
     for (const std::string& value : values(entry, kCertificateMap)) {
       CertificateMapping mapping;
@@ -148,6 +172,8 @@ class RecordReader {
     if (&kind == &kMember) {
       record.enabled = group_enabled_;
       record.identity.roles = role_bits(values(entry, kRole));
+      record.user_name = read_user_name(entry, record.identity.entry_dn);
+      record.principal = read_principal(entry, record.identity.entry_dn);
     }
     record.stored_password = first_value(entry, kind.password_type, record.identity.entry_dn);
     doubt_sealed_password(record);
@@ -194,6 +220,41 @@ class RecordReader {
     std::vector<std::string> all = values(entry, type);
     if (all.size() > 1) warn(entry_dn, std::string("only the first value of ") + type + " counts");
     return all.empty() ? std::string() : std::move(all.front());
+  }
+
+  std::string read_user_name(_CFGMessage* entry, const std::string& entry_dn) {
+    const std::string stored = first_value(entry, kUserName, entry_dn);
+    std::string name;
+    if (!to_utf8(stored.c_str(), name))
+      warn(entry_dn, std::string(kUserName) + " is not text, nobody can bind with it");
+    return name;
+  }
+
+  std::string read_principal(_CFGMessage* entry, const std::string& entry_dn) {
+    const std::string stored = first_value(entry, kKerberosDn, entry_dn);
+    std::string principal;
+    if (!stored.empty() && !principal_of(stored, principal))
+      warn(entry_dn, std::string(kKerberosDn) +
+                         " is not orv-kerberosName= or orv-kn= and a principal, nobody can bind "
+                         "with it");
+    return principal;
+  }
+
+  // What follows the first "=" of the plain form, whole: the rules for changes compare just that.
+  static bool principal_of(const std::string& stored, std::string& principal) {
+    std::string text;
+    std::string light;
+    if (!to_utf8(stored.c_str(), text)) return false;
+    const int code = cfg::normalize_dn_light(text, light);
+    if (code == result::no_memory) throw std::bad_alloc();
+    const std::size_t equals = light.find('=');
+    if (code != 0 || equals == std::string::npos) return false;
+    const std::string_view type = std::string_view(light).substr(0, equals);
+    if (!cfg::equals_ignore_ascii_case(type, "orv-kerberosName") &&
+        !cfg::equals_ignore_ascii_case(type, "orv-kn"))
+      return false;
+    principal = lower_principal(std::string_view(light).substr(equals + 1));
+    return !principal.empty();
   }
 
   // Whoever it belongs to would be told no more than that a password is wrong.
@@ -254,6 +315,13 @@ class RecordReader {
 };
 
 }  // namespace
+
+std::string lower_principal(std::string_view principal) {
+  std::string lower(principal);
+  for (char& c : lower)
+    if (c >= 'A' && c <= 'Z') c = static_cast<char>(c - 'A' + 'a');
+  return lower;
+}
 
 bool may_be_bound(std::string_view normal_dn) noexcept {
   return !normal_dn.empty() && !cfg::normal_dn_is_at_or_below(normal_dn, kTop);
