@@ -103,6 +103,8 @@ TEST(Consequences, OfDeletingEntriesThatDefineSomebody) {
   EXPECT_TRUE(
       consequences_of_change("CN=MEMBER,CN=ADMINGROUP,CN=CONFIGURATION", identities).identities);
   EXPECT_TRUE(consequences_of_change("CN=CONFIGURATION", identities).identities);
+  EXPECT_TRUE(consequences_of_change("CN=DIGEST,CN=CONFIGURATION", identities).identities);
+  EXPECT_TRUE(consequences_of_change("CN=KERBEROS,CN=CONFIGURATION", identities).identities);
   EXPECT_FALSE(consequences_of_change("CN=X,CN=CONFIGURATION", identities).any());
 }
 

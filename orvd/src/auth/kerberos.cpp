@@ -106,15 +106,17 @@ KerberosAcceptor::~KerberosAcceptor() {
   gss_release_cred(&minor, &credentials);
 }
 
-std::string principal_of(const void* name) {
+std::string full_principal(const std::string& name) {
   OM_uint32 minor = 0;
+  Name given;
+  Name whole;
   Buffer text;
-  gss_OID type = GSS_C_NO_OID;
-  auto* const given = static_cast<gss_name_t>(const_cast<void*>(name));
-  if (given == GSS_C_NO_NAME || GSS_ERROR(gss_display_name(&minor, given, &text.buffer, &type)))
+  gss_buffer_desc spelled{name.size(), const_cast<char*>(name.data())};
+  if (GSS_ERROR(gss_import_name(&minor, &spelled, GSS_C_NT_USER_NAME, &given.name)) ||
+      GSS_ERROR(gss_canonicalize_name(&minor, given.name, const_cast<gss_OID>(gss_mech_krb5),
+                                      &whole.name)) ||
+      GSS_ERROR(gss_display_name(&minor, whole.name, &text.buffer, nullptr)))
     return "";
-  // Names of other mechanisms, or of the anonymous, may look the same.
-  if (type == GSS_C_NO_OID || gss_oid_equal(type, GSS_KRB5_NT_PRINCIPAL_NAME) == 0) return "";
   return std::string(text.text());
 }
 

@@ -29,9 +29,9 @@ class KerberosAcceptor {
   void* credentials_ = nullptr;
 };
 
-// The principal, with its realm, that a gss_name_t names: "alice@EXAMPLE.COM". "" when it is no
-// name of Kerberos. Throws std::bad_alloc.
-std::string principal_of(const void* name);
+// A principal with its realm, as Kerberos spells it ("alice@EXAMPLE.COM"), of one that may lack it:
+// then it is of the default realm. "" when it is none. Throws std::bad_alloc.
+std::string full_principal(const std::string& name);
 
 // Whether the process has a second implementation of the GSS-API loaded, whose names and
 // credentials must not be mixed with those of this one.

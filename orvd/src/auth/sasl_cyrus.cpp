@@ -277,11 +277,10 @@ class CyrusExchange final : public SaslExchange {
 
   std::shared_ptr<const Identity> prove(SaslOutcome& outcome) {
     if (exchange_->by_password()) return exchange_->user();
-    const void* name = nullptr;
-    if (sasl_getprop(exchange_->connection(), SASL_GSS_PEER_NAME, &name) != SASL_OK) return nullptr;
-    outcome.name = principal_of(name);
-    if (outcome.name.empty()) return nullptr;
-    return identities_.of_principal(outcome.name);
+    const std::string principal = full_principal(exchange_->name());
+    if (principal.empty()) return nullptr;
+    outcome.name = principal;
+    return identities_.of_principal(principal);
   }
 
   // False when what was negotiated is refused.
