@@ -1,0 +1,15 @@
+// Messages of LDAP made of decisions: valid ones, ones that are valid but ask for nonsense, and
+// damaged ones.
+#pragma once
+
+#include <cstdint>
+#include <string>
+
+#include "choices.h"
+
+namespace orv::fuzz {
+
+// One message with this id, or what is left of one.
+std::string make_message(Choices& choices, std::int32_t id);
+
+}  // namespace orv::fuzz
