@@ -11,14 +11,24 @@ namespace orv::cfg {
 
 namespace {
 
+bool is_blank(char c) noexcept {
+  return c == ' ' || c == '\t';
+}
+
+// RFC 2849 would allow control characters. Terminals take some of them for commands, and the value
+// may be a stranger's.
+bool is_shown(char c) noexcept {
+  const auto byte = static_cast<unsigned char>(c);
+  return is_ascii(c) && (byte >= 0x20 || c == '\t') && byte != 0x7F;
+}
+
 // Whether a value reads back the same when it is written as it is (a SAFE-STRING of RFC 2849, and
-// no blank at its end, which editors take away).
+// no blanks at its ends, which editors and readers take away) and can be looked at.
 bool is_safe(std::string_view value) noexcept {
   if (value.empty()) return true;
   const char first = value.front();
-  if (first == ' ' || first == ':' || first == '<' || value.back() == ' ') return false;
-  return std::all_of(value.begin(), value.end(),
-                     [](char c) { return is_ascii(c) && c != '\n' && c != '\r' && c != '\0'; });
+  if (is_blank(first) || first == ':' || first == '<' || is_blank(value.back())) return false;
+  return std::all_of(value.begin(), value.end(), is_shown);
 }
 
 // Where a line that has room for `room` characters of `text` ends: not behind a blank, where that

@@ -8,9 +8,14 @@ namespace orv::orvcfg {
 
 namespace {
 
+bool is_blank(char c) {
+  return c == ' ' || c == '\t';
+}
+
+// No control characters: what is shown may go to a terminal.
 bool is_safe(char c) {
   const auto byte = static_cast<unsigned char>(c);
-  return byte != 0 && byte != '\n' && byte != '\r' && byte < 0x80;
+  return (byte >= 0x20 || c == '\t') && byte < 0x7F;
 }
 
 void append_folded(std::string& ldif, std::string_view line) {
@@ -25,7 +30,7 @@ void append_folded(std::string& ldif, std::string_view line) {
 bool is_safe_ldif_value(std::string_view value) {
   if (value.empty()) return true;
   const char first = value.front();
-  return first != ' ' && first != ':' && first != '<' && value.back() != ' ' &&
+  return !is_blank(first) && first != ':' && first != '<' && !is_blank(value.back()) &&
          std::all_of(value.begin(), value.end(), is_safe);
 }
 

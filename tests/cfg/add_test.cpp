@@ -168,10 +168,16 @@ TEST_F(AddTest, ValuesAreReadBackAsTheyWereGiven) {
 
 TEST_F(AddTest, WhatOthersWouldMisreadIsEncoded) {
   EXPECT_EQ(after_add(kSmall, "cn=a,cn=top",
-                      {{"bytes", {"<x", ":x", " x", "x ", "x\ry", "x\ny", "\xE4"}}}),
+                      {{"bytes", {"<x", ":x", " x", "x ", "x\ry", "x\ny", "\xE4", "\tx", "x\t"}}}),
             "dn: cn=top\ncn: top\n\ndn: cn=a,cn=top\n"
             "bytes:: PHg=\nbytes:: Ong=\nbytes:: IHg=\nbytes:: eCA=\nbytes:: eA15\n"
-            "bytes:: eAp5\nbytes:: 5A==\n");
+            "bytes:: eAp5\nbytes:: 5A==\nbytes:: CXg=\nbytes:: eAk=\n");
+}
+
+TEST_F(AddTest, WhatATerminalWouldTakeForCommandsIsEncoded) {
+  EXPECT_EQ(after_add(kSmall, "cn=a,cn=top", {{"bytes", {"\x1B[m", "\x7F", "\x01", "a\tb"}}}),
+            "dn: cn=top\ncn: top\n\ndn: cn=a,cn=top\n"
+            "bytes:: G1tt\nbytes:: fw==\nbytes:: AQ==\nbytes: a\tb\n");
 }
 
 TEST_F(AddTest, AValueOfAMegabyteIsReadBack) {
