@@ -295,8 +295,20 @@ bool Logs::queue(bool access, LogLevel level, std::string_view text) {
   return true;
 }
 
+namespace {
+
+// A line may hold values that somebody sent, and these may be as long as messages are.
+std::string cut(std::string_view line) {
+  std::size_t end = Logs::kMaxErrorLine - 64;
+  while (end > 0 && (static_cast<unsigned char>(line[end]) & 0xC0U) == 0x80) --end;
+  return std::string(line.substr(0, end)) + "... (" + std::to_string(line.size()) + " bytes)";
+}
+
+}  // namespace
+
 void Logs::write(LogLevel level, std::string_view line) noexcept {
   try {
+    if (line.size() > kMaxErrorLine) return write(level, cut(line));
     if (!queue(false, level, line) && level <= LogLevel::warning)
       std::fprintf(stderr, "%.*s\n", static_cast<int>(line.size()), line.data());
   } catch (...) {

@@ -16,6 +16,7 @@
 #include <utility>
 #include <vector>
 
+#include "cfg/text.h"
 #include "logs.h"
 #include "standard_error.h"
 #include "stop_watchdog.h"
@@ -64,7 +65,7 @@ class StuckStandardError {
 
 class StuckLogs : public testing::Test {
  protected:
-  const std::string line_ = std::string(10000, 'x');
+  const std::string line_ = std::string(Logs::kMaxErrorLine, 'x');
 };
 
 TEST_F(StuckLogs, HoldNoMoreBytesThanTheirBoundAndSayWhatTheyGaveUp) {
@@ -83,10 +84,23 @@ TEST_F(StuckLogs, HoldNoMoreBytesThanTheirBoundAndSayWhatTheyGaveUp) {
   EXPECT_NE(text.find("the last line"), std::string::npos);
 }
 
-TEST_F(StuckLogs, DropALineThatIsLargerThanAll) {
-  Logs logs;
-  logs.info(std::string(Logs::kMaxQueuedBytes, 'x'));
-  EXPECT_EQ(logs.queued_bytes(), 0U);
+TEST_F(StuckLogs, CutALineThatIsTooLongBetweenCharactersAndTellItsLength) {
+  StuckStandardError stuck;
+  std::string text;
+  std::thread reader([&] { text = stuck.read_all(); });
+  for (const char* before : {"", "."}) {
+    std::string line = before;
+    while (line.size() < 2 * Logs::kMaxQueuedBytes) line += "\u00e4";
+    Logs logs;
+    logs.info(line);
+    EXPECT_TRUE(logs.finish(milliseconds(60000)));
+  }
+  stuck.restore();
+  reader.join();
+  EXPECT_LT(text.size(), 2 * (Logs::kMaxErrorLine + 100));
+  EXPECT_NE(text.find("\u00e4... (16777216 bytes)"), std::string::npos) << text;
+  EXPECT_NE(text.find("\u00e4... (16777217 bytes)"), std::string::npos) << text;
+  EXPECT_TRUE(cfg::is_valid_utf8(text));
 }
 
 TEST_F(StuckLogs, AreLeftBehindWhenNobodyTakesThem) {
