@@ -43,10 +43,11 @@ std::string base64(const std::string& bytes) {
 // A new line, with its end.
 std::string rendered(const std::string& type, const std::string& value, const std::string& end) {
   const bool odd_ends =
-      !value.empty() &&
-      (std::string(" :<").find(value.front()) != std::string::npos || value.back() == ' ');
+      !value.empty() && (std::string(" \t:<").find(value.front()) != std::string::npos ||
+                         std::string(" \t").find(value.back()) != std::string::npos);
   const bool odd_bytes = std::any_of(value.begin(), value.end(), [](char c) {
-    return c == '\n' || c == '\r' || static_cast<unsigned char>(c) > 0x7F;
+    const auto byte = static_cast<unsigned char>(c);
+    return (byte < 0x20 && c != '\t') || byte > 0x7E;
   });
   std::string line = type + ":";
   if (odd_ends || odd_bytes) {
