@@ -107,6 +107,26 @@ def test_passwords_that_never_became_whole_messages_are_wiped(request, tmp_path)
         assert time.monotonic() < until
 
 
+def test_passwords_that_prove_user_names_are_wiped(request, tmp_path):
+    """The server opens what is sealed for the bind, and has nothing of it afterwards."""
+    server = reader(request, tmp_path)
+    if server is None:
+        return
+    password = "Qx7#kRw2!vTz4Lp9$bNm6"
+    root = clients.bind(server)
+    root.modify_s("cn=digest,cn=configuration",
+                  [(ldap.MOD_REPLACE, "orv-slapdDigestAdminUser", [b"boss"])])
+    root.modify_s(clients.BASE, [(ldap.MOD_REPLACE, "orv-slapdAdminPW", [password.encode()])])
+    for mechanism in ("DIGEST-MD5", "SCRAM-SHA-256"):
+        for given, expected in ((password, 0), ("wrong", 49)):
+            found = subprocess.run(
+                ["ldapwhoami", "-Q", "-Y", mechanism, "-U", "boss", "-w", given, "-H", server.url],
+                stdout=subprocess.PIPE, stderr=subprocess.PIPE, timeout=programs.DEADLINE,
+                check=False)
+            assert (found.returncode == 49) == (expected == 49), found.stderr
+    assert not remains(server.process.pid, password.encode())
+
+
 def test_passwords_that_changes_set_are_wiped(request, tmp_path):
     """What is stored is protected; the clear text is nowhere once the change is made or refused."""
     server = reader(request, tmp_path)

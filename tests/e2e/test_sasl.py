@@ -209,23 +209,20 @@ def test_realm_that_could_not_be_quoted_is_refused_at_the_start(instance):
 
 # ---- security layers
 
-@pytest.mark.parametrize("strength", ["minssf=1,maxssf=1", "minssf=128"])
-def test_large_tree_arrives_whole_through_a_layer(instance, strength):
-    instance.start()
-    client = clients.bind(instance)
-    assert modify(client, DIGEST, replaced("orv-slapdDigestAdminUser", "boss")) == 0
+def test_large_tree_arrives_whole_through_layers(named, root):
     for number in range(40):
-        dn = "cn=e%d,cn=schemas,cn=configuration" % number
-        assert add(client, dn, {"objectClass": ["top", "container"], "cn": ["e%d" % number],
-                                "description": ["x" * 20000 + str(number)]}) == 0
-    found = subprocess.run(
-        ["ldapsearch", "-LLL", "-Q", "-o", "ldif-wrap=no", "-Y", "DIGEST-MD5", "-U", "boss", "-w",
-         instance.password, "-O", strength, "-H", instance.url, "-b", "cn=schemas,cn=configuration",
-         "(description=*)", "description"], stdout=subprocess.PIPE, stderr=subprocess.PIPE,
-        timeout=DEADLINE, check=False)
-    assert found.returncode == 0, found.stderr
-    for number in range(40):
-        assert b"x" * 20000 + str(number).encode() + b"\n" in found.stdout
+        assert add(root, "cn=e%d,cn=schemas,cn=configuration" % number,
+                   {"objectClass": ["top", "container"], "cn": ["e%d" % number],
+                    "description": ["x" * 20000 + str(number)]}) == 0
+    for strength in ("minssf=1,maxssf=1", "minssf=128", "minssf=1,maxssf=1"):
+        found = subprocess.run(
+            ["ldapsearch", "-LLL", "-Q", "-o", "ldif-wrap=no", "-Y", "DIGEST-MD5", "-U", "boss",
+             "-w", named.password, "-O", strength, "-H", named.url, "-b",
+             "cn=schemas,cn=configuration", "(description=*)", "description"],
+            stdout=subprocess.PIPE, stderr=subprocess.PIPE, timeout=DEADLINE, check=False)
+        assert found.returncode == 0, found.stderr
+        for number in range(40):
+            assert b"x" * 20000 + str(number).encode() + b"\n" in found.stdout
 
 
 def test_weak_ciphers_are_refused(named):
@@ -389,6 +386,16 @@ def test_connection_ends_when_the_kerberos_identity_is_taken_away(kerberized, re
         clients.read(client, clients.BASE)
     assert is_refused(by_ticket(kerberized, realm.ticket("admin")))
     assert is_root(by_ticket(kerberized, realm.ticket("new")))
+
+
+def test_nothing_of_the_library_is_taken_from_the_environment(instance, tmp_path):
+    (tmp_path / "orvd.conf").write_text("mech_list: PLAIN\nreauth_timeout: 100\n")
+    text = instance.config.path.read_text()
+    instance.config.path.write_text(
+        text.replace("\ncn: Digest\n", "\ncn: Digest\norv-slapdDigestAdminUser: boss\n"))
+    instance.start(environment={"SASL_PATH": str(tmp_path), "SASL_CONF_PATH": str(tmp_path)})
+    assert announced(clients.connect(instance)) == ["SCRAM-SHA-256", "DIGEST-MD5"]
+    assert is_root(by_password(instance.url, "DIGEST-MD5", "boss", instance.password))
 
 
 # ---- hostile clients

@@ -248,6 +248,7 @@ class CyrusExchange final : public SaslExchange {
   int take(std::optional<std::string_view> credentials, const char*& reply, unsigned& length) {
     if (++steps_ > kMostSteps) return SASL_BADPROT;
     if (credentials && credentials->size() > kLongestCredentials) return SASL_BADPROT;
+    if (steps_ == 1 && insists_on_channel_binding(credentials)) return SASL_BADPROT;
     // Some mechanisms read their input as a text that ends.
     struct Copy {
       ~Copy() { cfg::wipe(text); }
@@ -262,17 +263,28 @@ class CyrusExchange final : public SaslExchange {
                              credentials ? copy.text.c_str() : nullptr, size, &reply, &length);
   }
 
+  // RFC 5802, 6: what such a client proves about the channel, nobody would look at.
+  bool insists_on_channel_binding(std::optional<std::string_view> credentials) const noexcept {
+    return mechanism_ == kScram && credentials && credentials->starts_with('p');
+  }
+
   void finish(SaslOutcome& outcome) {
-    outcome.state = SaslOutcome::State::failed;
     std::shared_ptr<const Identity> identity = prove(outcome);
-    // Also after a proof: an identity that is locked out stays so, and nothing tells which it was.
-    if (!identity || !settle(true)) return;
-    if (!may_act_as(*identity, outcome.name, exchange_->authorization_id())) {
-      outcome.text = kNobodyElse;
-    } else if (make_layer(outcome)) {
+    if (may_bind(identity.get(), outcome) && make_layer(outcome)) {
       outcome.state = SaslOutcome::State::done;
       outcome.identity = std::move(identity);
+    } else {
+      outcome.state = SaslOutcome::State::failed;
+      outcome.reply.reset();
     }
+  }
+
+  // Also after a proof: an identity that is locked out stays so, and nothing tells which it was.
+  bool may_bind(const Identity* identity, SaslOutcome& outcome) {
+    if (!identity || !settle(true)) return false;
+    if (may_act_as(*identity, outcome.name, exchange_->authorization_id())) return true;
+    outcome.text = kNobodyElse;
+    return false;
   }
 
   std::shared_ptr<const Identity> prove(SaslOutcome& outcome) {
