@@ -86,6 +86,7 @@ void Server::stop_workers() {
     pool->stop();
     pool->join();
   }
+  services_.binds.clear();
   if (parts_.audit) parts_.audit->settle();
 }
 

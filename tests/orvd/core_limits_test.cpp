@@ -3,9 +3,11 @@
 #include <gtest/gtest.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
+#include <sys/un.h>
 
 #include <algorithm>
 #include <cstdlib>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <limits>
@@ -464,6 +466,36 @@ TEST_F(LimitedServer, ClientsForWhomNoDescriptorIsLeftAreToldAndOthersAreServedL
   const std::string lines = log();
   EXPECT_GE(count(lines, "cannot accept a connection"), 1);
   EXPECT_LE(count(lines, "cannot accept a connection"), CutOffLog::kLines);
+}
+
+// Clients of the Unix socket wait for the next descriptor instead: among them is who administers
+// the server.
+class LocalLateClient final : public WireClient {
+ public:
+  LocalLateClient() { socket_ = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0); }
+  bool connect(const std::string& path) {
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
+    return ::connect(socket_, reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0;
+  }
+};
+
+TEST_F(LimitedServer, ClientOfTheUnixSocketWaitsForADescriptor) {
+  more.local_socket = folder.file() + ".ldapi";
+  start();
+  WireClient first(port());
+  ASSERT_EQ(code_of(first, test::search(1, "")), 0);  // it accepts
+  LocalLateClient local;
+  LateClient turned_away;
+  {
+    const AllDescriptors all;
+    ASSERT_TRUE(local.connect(more.local_socket));
+    local.send(test::search(1, ""));
+    ASSERT_TRUE(turned_away.connect(port()));
+    EXPECT_NE(turned_away.rest().find("no descriptor is left"), std::string::npos);
+  }
+  EXPECT_EQ(local.receive_result().back().code, 0);
 }
 
 // ---- the log

@@ -32,6 +32,7 @@ class ScriptedAuthenticator final : public Authenticator {
   std::shared_ptr<const Identity> authenticate(std::string_view name,
                                                std::string_view password) override {
     ++asked;
+    if (meanwhile) meanwhile(name);
     if (password != kSecret) return nullptr;
     if (name == kRoot) return std::make_shared<Identity>(Identity{"CN=ROOT", 0x0C, 0, ""});
     if (name == kMember) return std::make_shared<Identity>(Identity{"CN=MEMBER", 0x14, 0x20, ""});
@@ -47,6 +48,7 @@ class ScriptedAuthenticator final : public Authenticator {
   }
   std::atomic<bool> valid{true};
   std::atomic<int> asked{0};
+  std::function<void(std::string_view)> meanwhile;  // is done while a password is verified
 
  private:
   std::atomic<std::uint64_t> generation_{1};

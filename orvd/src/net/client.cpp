@@ -80,6 +80,7 @@ void Client::begin(const std::string& peer) {
   }
   loop_.add(self());
   set_peer(peer);
+  set_counted_as(ticket_.address());
   if (std::string* const line = begin_access_line()) {
     line->append("ACCEPT from=").append(peer);
     if (tls_ == Tls::shaking_hands) *line += " tls";
@@ -697,8 +698,12 @@ void Client::cut_off_without_notice(CutOff what, const std::string& why) {
   close(why);
 }
 
-void Client::tell_of(CutOff what, std::string_view why) {
-  services().cut_offs.tell(what, std::string(why).append(": closed ").append(peer()));
+void Client::tell_of(CutOff what, std::string_view why) noexcept {
+  try {
+    services().cut_offs.tell(what, std::string(why).append(": closed ").append(peer()));
+  } catch (...) {
+    // Without memory the line is lost.
+  }
 }
 
 }  // namespace orv::server

@@ -138,7 +138,7 @@ class Client final : public Session {
   // The client met a limit: the same as disconnect and close, with a line of the error log.
   void cut_off(CutOff what, int code, const std::string& why);
   void cut_off_without_notice(CutOff what, const std::string& why);
-  void tell_of(CutOff what, std::string_view why);
+  void tell_of(CutOff what, std::string_view why) noexcept;
   void look_at_deadlines(Clock::time_point now);
   bool does_not_read(Clock::time_point now);
   void part();

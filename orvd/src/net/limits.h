@@ -31,6 +31,7 @@ class ConnectionCounter {
     Ticket& operator=(Ticket&& other) noexcept;
     ~Ticket() { release(); }
     explicit operator bool() const noexcept { return counter_ != nullptr; }
+    const std::string& address() const noexcept { return address_; }
 
    private:
     void release() noexcept;

@@ -122,7 +122,11 @@ bool describe_local(Socket& socket, TransportFacts& facts, Peer& peer) {
 
 Listeners::Listeners(asio::io_context& context, Services& services, ConnectionCounter& counter,
                      std::vector<std::unique_ptr<Loop>>& loops)
-    : context_(context), services_(services), counter_(counter), loops_(loops) {}
+    : context_(context),
+      services_(services),
+      counter_(counter),
+      loops_(loops),
+      reserve_(open_reserve()) {}
 
 bool Listeners::open(const std::vector<std::string>& addresses, std::uint16_t port, bool secure,
                      std::string& error) {
@@ -160,7 +164,6 @@ bool Listeners::has(Kind kind) const noexcept {
 
 void Listeners::start(std::shared_ptr<const Settings> settings) {
   settings_ = std::move(settings);
-  reserve_ = open_reserve();
   if (settings_->max_connections > connections_that_fit())
     services_.logs.warning("orv-slapdMaxConnections is " +
                            std::to_string(settings_->max_connections) +

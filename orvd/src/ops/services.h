@@ -18,6 +18,7 @@
 #include "ops/backend_host.h"
 #include "ops/consequences.h"
 #include "ops/failed_changes.h"
+#include "ops/fair_queue.h"
 #include "ops/output_meter.h"
 #include "ops/persistent_search.h"
 #include "ops/search_cost.h"
@@ -97,6 +98,7 @@ struct Services {
   TlsHolder* tls = nullptr;                      // null: TLS is not offered
   std::atomic<std::int64_t> unauthenticated{0};  // connections on which nobody is bound
   CutOffLog cut_offs{logs};
+  FairQueue binds{verifiers};
 };
 
 }  // namespace orv::server

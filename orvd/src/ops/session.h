@@ -82,6 +82,8 @@ class Session : public OperationHome,
   bool listens() const noexcept { return !persistent_.empty(); }
   // Who the client is, for the audit log.
   void set_peer(std::string_view peer) { peer_ = peer; }
+  // As whom the client takes turns with others where work queues.
+  void set_counted_as(std::string_view address) { counted_as_ = address; }
   // What the transport proves; before the first message, and when TLS stands.
   void set_transport(TransportFacts facts) { transport_ = std::move(facts); }
   const TransportFacts& transport() const noexcept { return transport_; }
@@ -251,6 +253,7 @@ class Session : public OperationHome,
   GateUser gate_user_;
   FailedChanges failed_changes_;
   std::string peer_;
+  std::string counted_as_;
   std::vector<OperationPtr> outstanding_;
   std::vector<PersistentSearchPtr> persistent_;  // whose first part is over
   std::deque<PersistentSearchPtr> news_;         // one for each change that is to be told

@@ -90,8 +90,8 @@ bool Session::needs_confidentiality() const noexcept {
 template <typename Work>
 void Session::on_verifier(Work work) {
   try {
-    asio::post(services_.verifiers,
-               [self = shared_from_this(), bind = bind_, work] { work(bind); });
+    services_.binds.post(counted_as_,
+                         [self = shared_from_this(), bind = bind_, work] { work(bind); });
   } catch (const std::bad_alloc&) {
     finish_bind(result::no_memory, "", nullptr);
   }
