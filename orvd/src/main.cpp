@@ -289,7 +289,6 @@ bool prepare_process(Inheritance& inherited) {
   settle_process();
   forbid_core_dumps();
   forbid_new_privileges();
-  protect_keys();
   return true;
 }
 
@@ -662,6 +661,7 @@ int run(const Options& options, const FileIdentity& standard_error, Inheritance&
 
 int main(int argc, char** argv) {
   using namespace orv::server;
+  if (!protect_keys()) std::fprintf(stderr, "orvd: keys may stay in memory after use\n");
   Options options;
   int status = 0;
   if (parse_options(argc, argv, options, status) == Parsed::exit) return status;

@@ -13,7 +13,8 @@ BUILD_DIR = programs.bin_dir().parent
 FILES = {"bin/orvd", "bin/orvcfg", "lib/libcfg.so", "lib/libslapi.so", "lib/libback-config.so",
          "share/orv/orvd.cat", "share/man/man8/orvd.8", "share/man/man1/orvcfg.1",
          "share/doc/orv/README.md", "share/doc/orv/CHANGELOG.md", "share/doc/orv/LICENSE",
-         "share/doc/orv/configuration.md"}
+         "share/doc/orv/configuration.md", "lib/systemd/system/orvd.service",
+         "lib/sysusers.d/orv.conf"}
 
 
 @pytest.fixture(scope="module", name="prefix")

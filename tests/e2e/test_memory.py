@@ -1,7 +1,8 @@
-"""What is left in the daemon's memory after a bind, and who may read it."""
+"""What is left in the daemon's memory after a bind, who may read it, and what a core dump would show."""
 
 import os
 import re
+import signal
 import string
 import subprocess
 import sys
@@ -13,22 +14,32 @@ import pytest
 from orv_e2e import clients, programs, wire
 
 
-def holds(pid, wanted):
-    """Whether writable memory of the process contains the bytes."""
-    with open("/proc/%d/maps" % pid, encoding="utf-8") as maps, \
-            open("/proc/%d/mem" % pid, "rb", buffering=0) as memory:
-        for line in maps:
-            found = re.match(r"([0-9a-f]+)-([0-9a-f]+) rw", line)
-            if not found:
-                continue
-            begin, end = (int(edge, 16) for edge in found.groups())
+def mappings(pid):
+    """The writable memory of the process: begin, end, and what the kernel does with it."""
+    with open("/proc/%d/smaps" % pid, encoding="utf-8") as lines:
+        for line in lines:
+            found = re.match(r"([0-9a-f]+)-([0-9a-f]+) (rw)?", line)
+            if found:
+                begin, end, writable = found.groups()
+            elif line.startswith("VmFlags:") and writable:
+                yield int(begin, 16), int(end, 16), line.split()[1:]
+
+
+def places_of(pid, wanted):
+    """Of each piece of writable memory that contains the bytes, what the kernel does with it."""
+    with open("/proc/%d/mem" % pid, "rb", buffering=0) as memory:
+        for begin, end, flags in mappings(pid):
             memory.seek(begin)
             try:
                 if wanted in memory.read(end - begin):
-                    return True
+                    yield flags
             except OSError:  # pages that cannot be read
                 continue
-    return False
+
+
+def holds(pid, wanted):
+    """Whether writable memory of the process contains the bytes."""
+    return next(places_of(pid, wanted), None) is not None
 
 
 def without_rights():
@@ -127,11 +138,28 @@ def test_passwords_that_prove_user_names_are_wiped(request, tmp_path):
     assert not remains(server.process.pid, password.encode())
 
 
-def test_passwords_that_changes_set_are_wiped(request, tmp_path):
+def bound(server, transport, name, password):
+    """A client that is bound over TLS or in clear."""
+    client = ldap.initialize(server.secure_url if transport == "ldaps" else server.url)
+    client.set_option(ldap.OPT_X_TLS_CACERTFILE, str(server.certificate))
+    client.set_option(ldap.OPT_X_TLS_NEWCTX, 0)
+    client.set_option(ldap.OPT_TIMEOUT, programs.DEADLINE)
+    if transport == "starttls":
+        client.start_tls_s()
+    client.simple_bind_s(name, password)
+    return client
+
+
+@pytest.mark.parametrize("transport", ["clear", "ldaps", "starttls"])
+def test_passwords_that_changes_set_are_wiped(request, tmp_path, transport):
     """What is stored is protected; the clear text is nowhere once the change is made or refused."""
     server = reader(request, tmp_path)
     if server is None:
         return
+
+    def client_of(name, password):
+        return bound(server, transport, name, password)
+
     pid = server.process.pid
     letters = (string.ascii_letters + string.digits + "!#$%&*+-./<=>?@").encode()
     # Long ones in which no character comes twice, nor in both: the policy counts those. In an order
@@ -152,7 +180,7 @@ def test_passwords_that_changes_set_are_wiped(request, tmp_path):
                 ("cn", name.encode()), ("orv-slapdAdminDN", b"cn=" + name.encode()),
                 ("orv-slapdAdminRole", b"SchemaAdmin"), ("orv-slapdAdminPW", password)]
 
-    root = clients.bind(server)
+    root = client_of("cn=root", server.password)
     for name, first, second in zip(("short", "long"), added, changed):
         root.add_s(dn(name), member(name, first))
         with pytest.raises(ldap.ALREADY_EXISTS):
@@ -160,9 +188,56 @@ def test_passwords_that_changes_set_are_wiped(request, tmp_path):
         change_password(root, name, second)
     with pytest.raises(ldap.UNDEFINED_TYPE):  # before the backend has it
         root.add_s(dn("third"), [*member("third", refused), ("orv-none", b"x")])
-    change_password(clients.bind(server, "cn=short", changed[0].decode()), "short", own)
-    clients.bind(server, "cn=short", own.decode())
+    change_password(client_of("cn=short", changed[0].decode()), "short", own)
+    client_of("cn=short", own.decode())
+    with pytest.raises(ldap.INVALID_CREDENTIALS):
+        client_of("cn=short", changed[0].decode())
     clients.connect(server).search_s("", ldap.SCOPE_BASE)
     for password in (*added, *changed, own, refused):
         assert not remains(pid, password), password
     assert holds(pid, server.config.path.name.encode())  # the search itself works
+
+
+# ---- keys, and core dumps
+
+def key_of_stash(server):
+    return bytes.fromhex(server.key_stash.read_text().split()[1])
+
+
+def key_of_certificate(server):
+    text = subprocess.run(["openssl", "pkey", "-in", server.directory / "tls.key", "-text", "-noout"],
+                          check=True, text=True, stdout=subprocess.PIPE,
+                          timeout=programs.DEADLINE).stdout
+    digits = re.search(r"priv:\n((?:\s+[0-9a-f:]+\n)+)", text).group(1)
+    return bytes.fromhex(re.sub(r"[^0-9a-f]", "", digits)).lstrip(b"\0")
+
+
+def test_keys_are_only_in_memory_that_no_core_dump_shows(request, tmp_path):
+    server = reader(request, tmp_path)
+    if server is None:
+        return
+    pid = server.process.pid
+    bound(server, "ldaps", "cn=root", server.password)
+    server.process.send_signal(signal.SIGHUP)
+    server.stderr.wait_for(lambda line: "settings taken over" in line)
+    bound(server, "starttls", "cn=root", server.password)
+    stash, private = key_of_stash(server), key_of_certificate(server)
+    # Numbers are kept with their lowest byte first.
+    places = [flags for key in (stash, private, private[::-1]) for flags in places_of(pid, key)]
+    assert places, "the keys are nowhere"
+    assert all("dd" in flags for flags in places), places
+    assert next(places_of(pid, stash), None) and next(places_of(pid, private[::-1]), None)
+    line = (server.directory / "tls.key").read_text().splitlines()[1].encode()
+    assert not holds(pid, line[8:-8]) and not holds(pid, stash.hex().encode())
+
+
+def test_no_core_dump_is_written(instance):
+    instance.start(wrapper=["prlimit", "--core=unlimited:unlimited"])
+    with open("/proc/%d/limits" % instance.process.pid, encoding="utf-8") as limits:
+        core = next(line for line in limits if line.startswith("Max core file size"))
+    assert core.split()[4:6] == ["0", "0"]
+    instance.process.send_signal(signal.SIGQUIT)
+    _, status = os.waitpid(instance.process.pid, 0)
+    instance.process.returncode = 0  # it has been waited for
+    instance.kill()
+    assert os.WTERMSIG(status) == signal.SIGQUIT and not os.WCOREDUMP(status)

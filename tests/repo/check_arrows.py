@@ -20,7 +20,7 @@ locale.h malloc.h net/if.h netdb.h netinet/in.h netinet/tcp.h nl_types.h poll.h 
 semaphore.h signal.h stdint.h stdlib.h string.h strings.h sys/epoll.h sys/eventfd.h sys/file.h
 sys/ioctl.h sys/mman.h sys/prctl.h sys/random.h sys/resource.h sys/select.h sys/socket.h sys/stat.h
 sys/statvfs.h sys/syscall.h sys/time.h sys/types.h sys/uio.h sys/un.h sys/utsname.h sys/wait.h
-sys/xattr.h syslog.h termios.h time.h unistd.h wchar.h linux/fs.h emmintrin.h
+sys/xattr.h syslog.h termios.h time.h unistd.h wchar.h linux/capability.h linux/fs.h emmintrin.h
 """.split())
 
 # folder: folders whose public headers it may include, and third-party headers (by prefix).
@@ -31,7 +31,7 @@ INCLUDES = {
     "back-config": (["slapi", "cfg"], []),
     "orvd": (["slapi", "cfg", "schema", "config"],
              ["asio.hpp", "asio/", "sasl/", "gssapi/", "openssl/", "ldap.h", "lber.h", "spdlog/", "CLI/",
-              "utf8proc.h"]),
+              "utf8proc.h", "seccomp.h"]),
     "orvcfg": (["slapi", "cfg", "config"], ["CLI/", "openssl/"]),
     "schema": (["schema"], []),
     "config": (["config"], []),
@@ -48,7 +48,8 @@ LINKS = {
     "lib/libslapi.so": ([r"libcfg\.so", LDAP, OPENSSL, r"lib(spdlog|fmt)\.so.*"], ["libcfg.so"]),
     "lib/libback-config.so": ([r"libslapi\.so", r"libcfg\.so"], ["libslapi.so"]),
     "bin/orvd": ([r"libslapi\.so", r"libcfg\.so", LDAP, OPENSSL, r"lib(spdlog|fmt)\.so.*",
-                  r"libsasl2\.so.*", r"libgssapi_krb5\.so.*"], ["libslapi.so"]),
+                  r"libsasl2\.so.*", r"libgssapi_krb5\.so.*", r"libseccomp\.so.*"],
+                 ["libslapi.so"]),
     "bin/orvcfg": ([r"libslapi\.so", r"libcfg\.so", OPENSSL], ["libcfg.so"]),
 }
 

@@ -292,6 +292,8 @@ std::string Listeners::url(const Listener& listener) const {
 }
 
 std::string Listeners::url() const {
+  for (const auto& listener : listeners_)
+    if (listener->kind == Kind::clear) return url(*listener);
   return url(*listeners_.front());
 }
 

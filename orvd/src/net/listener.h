@@ -45,7 +45,8 @@ class Listeners {
 
   void close() noexcept;
 
-  // "ldap://ADDRESS:PORT" of the first listener.
+  // "ldap://ADDRESS:PORT" of the first listener for connections in clear; of the first one of all
+  // where there is none.
   std::string url() const;
   // Those of all listeners.
   std::vector<std::string> urls() const;

@@ -18,6 +18,7 @@
 #include <utility>
 
 #include "cfg/dn.h"
+#include "cfg/secret.h"
 #include "descriptor.h"
 
 namespace orv::server {
@@ -45,6 +46,7 @@ struct Releaser {
 using Context = std::unique_ptr<SSL_CTX, Releaser<SSL_CTX_free>>;
 using Bio = std::unique_ptr<BIO, Releaser<BIO_free>>;
 using Certificate = std::unique_ptr<X509, Releaser<X509_free>>;
+using PrivateKey = std::unique_ptr<EVP_PKEY, Releaser<EVP_PKEY_free>>;
 
 // The first of the queued errors in words; empties the queue.
 std::string queued_error() {
@@ -68,33 +70,68 @@ bool fail(std::string& error, const std::string& file, const std::string& what) 
 
 // OpenSSL would report a file that cannot be opened as one more of its own errors, and wait for
 // ever at a pipe that nobody writes to.
-bool can_read(const std::string& file, struct stat& status, std::string& error) {
+bool can_read(const std::string& file, std::string& error) {
   const Descriptor opened(::open(file.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
+  struct stat status {};
   if (!opened || ::fstat(opened.number(), &status) != 0) {
     error = file + ": " + std::strerror(errno);
     return false;
   }
-  if (!S_ISREG(status.st_mode)) {
-    error = file + ": not a regular file";
-    return false;
-  }
-  return true;
-}
-
-bool can_read(const std::string& file, std::string& error) {
-  struct stat status {};
-  return can_read(file, status, error);
-}
-
-bool is_private(const std::string& file, std::string& error) {
-  struct stat status {};
-  if (!can_read(file, status, error)) return false;
-  if ((status.st_mode & (S_IRWXO | S_IWGRP)) == 0) return true;
-  error = file +
-          ": others may read the private key, or change it; take these rights away "
-          "(chmod 600)";
+  if (S_ISREG(status.st_mode)) return true;
+  error = file + ": not a regular file";
   return false;
 }
+
+// What a file says that may hold a key. Read without the buffers of the C library, which keep it.
+class Text {
+ public:
+  Text() = default;
+  ~Text() { cfg::wipe(text_); }
+  Text(const Text&) = delete;
+  Text& operator=(const Text&) = delete;
+
+  // False with the cause: it cannot be read, it is too large, or others may read it who must not.
+  bool read(const std::string& file, bool is_key, std::string& error) {
+    const Descriptor opened(::open(file.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
+    struct stat status {};
+    if (!opened || ::fstat(opened.number(), &status) != 0) {
+      error = file + ": " + std::strerror(errno);
+      return false;
+    }
+    error = refuse(file, status, is_key);
+    return error.empty() && fill(opened.number(), file, error);
+  }
+
+  Bio bio() const { return Bio(BIO_new_mem_buf(text_.data(), static_cast<int>(text_.size()))); }
+
+ private:
+  static constexpr off_t kMost = off_t{1} << 20;
+
+  static std::string refuse(const std::string& file, const struct stat& status, bool is_key) {
+    if (!S_ISREG(status.st_mode)) return file + ": not a regular file";
+    if (status.st_size > kMost) return file + ": too large";
+    if (!is_key || (status.st_mode & (S_IRWXO | S_IWGRP)) == 0) return "";
+    return file +
+           ": others may read the private key, or change it; take these rights away "
+           "(chmod 600)";
+  }
+
+  bool fill(int file, const std::string& name, std::string& error) {
+    text_.resize(static_cast<std::size_t>(kMost));
+    std::size_t length = 0;
+    while (length < text_.size()) {
+      const ssize_t read = ::read(file, text_.data() + length, text_.size() - length);
+      if (read < 0 && errno == EINTR) continue;
+      if (read < 0) error = name + ": " + std::strerror(errno);
+      if (read <= 0) break;
+      length += static_cast<std::size_t>(read);
+    }
+    text_.resize(length);
+    return error.empty();
+  }
+
+  std::string text_;
+};
 
 int no_passphrase(char*, int, int, void*) {
   return -1;  // there is nobody to ask
@@ -113,15 +150,35 @@ void set_rules(SSL_CTX* context, const TlsSettings& settings) {
   SSL_CTX_set_default_passwd_cb(context, no_passphrase);
 }
 
+// The server's own certificate, and behind it those up to the authority.
+bool use_certificates(SSL_CTX* context, BIO* from) {
+  const Certificate own(PEM_read_bio_X509_AUX(from, nullptr, no_passphrase, nullptr));
+  if (!own || SSL_CTX_use_certificate(context, own.get()) != 1) return false;
+  for (;;) {
+    Certificate next(PEM_read_bio_X509(from, nullptr, no_passphrase, nullptr));
+    if (!next) break;
+    if (SSL_CTX_add0_chain_cert(context, next.get()) != 1) return false;
+    static_cast<void>(next.release());
+  }
+  if (ERR_GET_REASON(ERR_peek_last_error()) != PEM_R_NO_START_LINE) return false;
+  ERR_clear_error();  // that is how the end of the file is told
+  return true;
+}
+
 bool load_own(SSL_CTX* context, const TlsSettings& settings, std::string& error) {
   const std::string& certificate = settings.certificate_file;
   const std::string& key = settings.key_file.empty() ? certificate : settings.key_file;
-  if (!can_read(certificate, error) || !is_private(key, error)) return false;
-  if (SSL_CTX_use_certificate_chain_file(context, certificate.c_str()) != 1)
+  Text certificates;
+  Text keys;
+  if (!certificates.read(certificate, false, error) || !keys.read(key, true, error)) return false;
+  const Bio of_certificates = certificates.bio();
+  if (!of_certificates || !use_certificates(context, of_certificates.get()))
     return fail(error, certificate, "no usable certificate");
-  if (SSL_CTX_use_PrivateKey_file(context, key.c_str(), SSL_FILETYPE_PEM) != 1)
-    return fail(error, key, "no usable private key");
-  if (SSL_CTX_check_private_key(context) != 1)
+  const Bio of_keys = keys.bio();
+  const PrivateKey used(
+      of_keys ? PEM_read_bio_PrivateKey(of_keys.get(), nullptr, no_passphrase, nullptr) : nullptr);
+  if (!used) return fail(error, key, "no usable private key");
+  if (SSL_CTX_use_PrivateKey(context, used.get()) != 1 || SSL_CTX_check_private_key(context) != 1)
     return fail(error, key, "not the key of the certificate in " + certificate);
   return true;
 }

@@ -74,25 +74,26 @@ class Instance:
         return [str(programs.orvd()), "--config", str(self.config.path), "--key-stash",
                 str(self.key_stash), "--port", "0", *options]
 
-    def start(self, *options, environment=None, wrapper=()):
+    def start(self, *options, environment=None, wrapper=(), descriptors=()):
         """Starts the daemon and returns when it accepts connections."""
         assert self.process is None, "already running"
-        self._spawn([*wrapper, *self.command(*options)], environment)
+        self._spawn([*wrapper, *self.command(*options)], environment, descriptors)
         return self._wait_until_ready()
 
-    def start_refused(self, *options, environment=None, wrapper=()):
+    def start_refused(self, *options, environment=None, wrapper=(), descriptors=()):
         """Starts a daemon that has to refuse; gives its exit status and its standard error."""
         try:
-            self.start(*options, environment=environment, wrapper=wrapper)
+            self.start(*options, environment=environment, wrapper=wrapper, descriptors=descriptors)
         except StartRefused as refusal:
             return refusal.exit_code, refusal.stderr
         self.stop()
         raise AssertionError("the daemon started")
 
-    def _spawn(self, command, environment):
+    def _spawn(self, command, environment, descriptors=()):
         self.process = subprocess.Popen(
             command, stdin=subprocess.DEVNULL, stdout=subprocess.PIPE, stderr=subprocess.PIPE,
-            env={**os.environ, **(environment or {})}, start_new_session=True)
+            env={**os.environ, **(environment or {})}, start_new_session=True,
+            pass_fds=descriptors)
         self.stdout = LineCollector(self.process.stdout)
         self.stderr = LineCollector(self.process.stderr)
 
