@@ -91,26 +91,27 @@ void Server::stop_workers() {
 }
 
 bool Server::take(std::vector<ListeningSocket> sockets, std::string& error) {
-  for (ListeningSocket& socket : sockets)
+  for (ListeningSocket& socket : sockets) {
+    (socket.kind == ListenerKind::local ? local_taken_ : ports_taken_) = true;
     if (!listeners_.adopt(std::move(socket), error)) return false;
+  }
   return true;
 }
 
 bool Server::listen(const std::vector<std::string>& addresses, std::uint16_t port,
                     std::string& error, const MoreListeners& more) {
-  const bool taken = listeners_.has(ListenerKind::clear) || listeners_.has(ListenerKind::secure);
   if (!load_certificate(settings_->tls, error)) return false;
   if (listeners_.has(ListenerKind::secure) && !tls_.current()) {
     error = "there is a socket for TLS, but orv-slapdTlsCertificateFile names no certificate";
     return false;
   }
-  if (!taken && !listeners_.open(addresses, port, false, error)) return false;
-  const bool secure = !taken && more.secure_port && tls_.current();
+  if (!ports_taken_ && !listeners_.open(addresses, port, false, error)) return false;
+  const bool secure = !ports_taken_ && more.secure_port && tls_.current();
   if (secure && !listeners_.open(addresses, *more.secure_port, true, error)) return false;
   // Another server of the same instance may be there, or the path be too long: no reason to serve
   // nobody.
   std::string failure;
-  if (!more.local_socket.empty() && !listeners_.has(ListenerKind::local) &&
+  if (!more.local_socket.empty() && !local_taken_ &&
       !listeners_.open_local(more.local_socket, failure))
     parts_.logs.error(failure);
   return true;

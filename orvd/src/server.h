@@ -132,6 +132,8 @@ class Server {
   asio::thread_pool changes_;
   asio::thread_pool verifiers_;
   Listeners listeners_;
+  bool ports_taken_ = false;
+  bool local_taken_ = false;
 };
 
 }  // namespace orv::server

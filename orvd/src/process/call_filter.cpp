@@ -177,8 +177,8 @@ void allow_sockets(Rules& rules) {
 
 // What a terminal or a device can be told is more than is needed.
 void allow_controls(Rules& rules) {
-  for (const unsigned long request : {FIONBIO, FIONREAD, FIOCLEX, TCGETS})
-    rules.allow("ioctl", bits(1, 0xFFFFFFFF, request));
+  for (const int request : {FIONBIO, FIONREAD, FIOCLEX, TCGETS})
+    rules.allow("ioctl", bits(1, 0xFFFFFFFF, static_cast<std::uint64_t>(request)));
 }
 
 void add_all(Rules& rules) {
