@@ -123,8 +123,10 @@ class Play {
 
   void hold_gate() {
     if (holding_) return;
-    holding_ = round_.gate().enter(std::make_shared<Holder>(), Clock::time_point::max()) ==
-               orv::server::Gate::Entry::inside;
+    const auto holder = std::make_shared<Holder>();
+    const auto entry = round_.gate().enter(holder, Clock::time_point::max());
+    // Somebody was inside; he may have left by now, and then it is the holder's turn.
+    holding_ = entry == orv::server::Gate::Entry::inside || !round_.gate().withdraw(*holder);
   }
   void release_gate() {
     if (std::exchange(holding_, false)) round_.gate().leave();

@@ -185,5 +185,46 @@ TEST_F(MemoryOfTheBackend, DeleteIsMadeOrRefused) {
                         "CN=OLD,CN=SCHEMAS,CN=CONFIGURATION");
 }
 
+// Of a search nothing is written, so what remains is that it has a result, and the next one all.
+TEST_F(MemoryOfTheBackend, SearchHasAResultAndTheNextOneFindsEverything) {
+  put_back();
+  const auto root = std::make_shared<Identity>(Identity{"CN=ROOT", 0x0C, 0, "CN=CONFIGURATION"});
+  const auto search = [&](long n, std::int64_t& entries, bool& hit) {
+    SearchRequest request;
+    request.scope = 2;
+    request.filter = "(&(objectClass=*)(!(description=*not there*)))";
+    request.attributes = {"cn", "description"};
+    const auto home = std::make_shared<Home>(services.output);
+    const auto operation =
+        std::make_shared<PendingOperation>(home, root, 1, tag::search_done, AnswerLimits{});
+    EXPECT_EQ(operation->prepare_search(services, request, "CN=CONFIGURATION").code, 0);
+    EXPECT_EQ(host.gate().enter(std::make_shared<NoWaiter>(), Clock::time_point::max()),
+              Gate::Entry::inside)
+        << "the gate is open again";
+    AllocationFault fault(n);
+    operation->run(services, true);
+    fault.disarm();
+    hit = fault.hit();
+    entries = operation->answer().entries();
+    return operation->outcome();
+  };
+  bool hit = false;
+  std::int64_t entries = 0;
+  ASSERT_EQ(search(0, entries, hit), 0);
+  ASSERT_EQ(entries, 4);
+  int refused = 0;
+  for (long n = 1;; ++n) {
+    SCOPED_TRACE("allocation " + std::to_string(n));
+    const int code = search(n, entries, hit);
+    EXPECT_TRUE(code != 0 || entries == 4) << entries << " entries, and yet a success";
+    if (code != 0) ++refused;
+    bool none = false;
+    EXPECT_EQ(search(0, entries, none), 0);
+    EXPECT_EQ(entries, 4);
+    if (!hit || HasFailure()) break;
+  }
+  EXPECT_GT(refused, 10);
+}
+
 }  // namespace
 }  // namespace orv::server::test

@@ -426,6 +426,14 @@ void Session::complete(const OperationPtr& operation) {
     notice_done(operation);
     return go_on();
   }
+  // Whatever keeps its first part from being told, a persistent search does not go on without it.
+  struct Unestablished {
+    ~Unestablished() {
+      if (search && !search->established) searches.leave(*search);
+    }
+    PersistentSearches& searches;
+    const PersistentSearchPtr search;
+  } const unestablished{services_.persistent_searches, operation->persistent};
   const Answer& answer = operation->answer();
   if (answer.code() == result::operations_error && services_.note_failure) services_.note_failure();
   const int code = answer.abandoned() ? kAbandoned : answer.code();

@@ -90,7 +90,7 @@ void Session::first_part_done(PendingOperation& operation) {
   // A bind that waits ends what is outstanding before it (RFC 4511, 4.2.1).
   const bool goes_on =
       answer.answered() && answer.code() == 0 && !answer.abandoned() && !gone_ && !bind_;
-  if (!goes_on) return services_.persistent_searches.leave(*search);
+  if (!goes_on) return;
   persistent_.push_back(search);
   search->established = true;
   if (const int code = search->failure()) return end_persistent(search, code, reason(code));
