@@ -1,5 +1,5 @@
-"""Checks that the tests that README.md and docs/security.md name exist, and that every row of the
-former's table of guards names one."""
+"""Checks that the tests that README.md and docs/security.md name exist, and that every row of the table
+of guards, and of the tables of promises, names one."""
 
 import os
 import re
@@ -7,9 +7,6 @@ import re
 import findings
 
 FOLDER = "tests/e2e"
-SECURITY = "docs/security.md"
-# `Suite.Name`, `.Name` in the suite that was named last, `Suite.*`, or `test_name`.
-OF_SECURITY = re.compile(r"`(?:([A-Z]\w*)?\.([A-Z]\w*|\*)|(test_\w+))`")
 NAMED = re.compile(r"`(test_\w+\.py)::(\w+)`")
 TABLE = re.compile(r"^\| operation \| what guards it \| test \|\n\|[-|]+\|\n((?:\|.*\n)+)", re.MULTILINE)
 
@@ -29,29 +26,6 @@ def missing(source, text):
             if name not in defined(source, file)]
 
 
-def all_defined(source):
-    """Names of pytest functions, and (suite, name) of GoogleTest, in the whole of tests/."""
-    functions, cases = set(), set()
-    for path in findings.files(os.path.join(source, "tests"), (".py", ".cpp", ".h")):
-        text = findings.read(source, os.path.join("tests", path))
-        functions.update(re.findall(r"^def (test_\w+)\(", text, re.MULTILINE))
-        cases.update(re.findall(r"^TEST(?:_[FP])?\(\s*(\w+),\s*(\w+)\)", text, re.MULTILINE))
-    return functions, cases
-
-
-def missing_of_security(source, text):
-    functions, cases = all_defined(source)
-    suites = {suite for suite, _ in cases}
-    found, suite = [], ""
-    for named, case, function in OF_SECURITY.findall(text):
-        suite = named or suite
-        known = (function in functions if function else
-                 suite in suites if case == "*" else (suite, case) in cases)
-        if not known:
-            found.append(f"{SECURITY}: there is no test {function or suite + '.' + case}")
-    return found
-
-
 def unproved(text):
     tables = TABLE.findall(text)
     if not tables:
@@ -60,13 +34,56 @@ def unproved(text):
             if not NAMED.search(row)]
 
 
+# ---- docs/security.md: "Suite.Test", "Suite.*", ".Test" of the suite named before, "test_x" and files
+
+SECURITY = "docs/security.md"
+PROMISES = re.compile(r"^\|(?:.*\|)? tested by \|\n\|[-|]+\|\n((?:\|.*\n)+)", re.MULTILINE)
+QUOTED = re.compile(r"`([^`]+)`")
+CASE = re.compile(r"^TEST(?:_[FP])?\(\s*(\w+),\s*(\w+)\)", re.MULTILINE)
+
+
+def all_tests(source):
+    """The names of all tests: functions of Python, and pairs of suite and test."""
+    functions, cases = set(), set()
+    for path in findings.files(os.path.join(source, "tests"), (".py", ".cpp")):
+        text = findings.read(source, os.path.join("tests", path))
+        functions |= set(re.findall(r"^def (test_\w+)\(", text, re.MULTILINE))
+        cases |= set(CASE.findall(text))
+    return functions, cases
+
+
+def is_there(source, name, suite, functions, cases):
+    if name.startswith("test_"):
+        return name in functions
+    if "/" in name:
+        return os.path.exists(os.path.join(source, name))
+    test = name.split(".")[-1]
+    return any(s == suite and (test == "*" or t == test) for s, t in cases)
+
+
+def unkept(source, text):
+    functions, cases = all_tests(source)
+    found, suite = [], ""
+    tables = PROMISES.findall(text)
+    for row in "".join(tables).splitlines():
+        names = QUOTED.findall(row.split(" | ")[-1])
+        if not names and "table above" not in row:
+            found.append(f"{SECURITY}: names no test: {row}")
+        for name in names:
+            if "." in name and not name.startswith((".", "test_")):
+                suite = name.split(".")[0]
+            if not is_there(source, name, suite, functions, cases):
+                found.append(f"{SECURITY}: there is no test {name}")
+    return found if tables else [f"{SECURITY}: there is no table of promises"]
+
+
 def main():
     options = findings.arguments(__doc__)
     text = findings.read(options.source, "README.md")
     security = findings.read(options.source, SECURITY)
-    findings.conclude(missing(options.source, text) + unproved(text) +
-                      missing_of_security(options.source, security),
-                      "tests named in README.md and docs/security.md")
+    findings.conclude(missing(options.source, text) + unproved(text)
+                      + unkept(options.source, security),
+                      f"tests named in README.md and {SECURITY}")
 
 
 if __name__ == "__main__":

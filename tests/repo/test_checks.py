@@ -151,6 +151,16 @@ class NamedTests(Tree):
                          ["README.md: names no test: | delete | roles | `test_x.py` |"])
         self.assertEqual(len(check_named_tests.unproved("no table")), 1)
 
+    def test_promises_are_held_by_tests_that_exist(self):
+        self.write("tests/x/a_test.cpp", "TEST(Suite, One) {\nTEST_F(Suite, Two) {\n")
+        self.write("tests/e2e/test_x.py", "def test_one(root):\n    pass\n")
+        head = "| promise | tested by |\n|---|---|\n"
+        good = head + "| a | `Suite.One`, `.Two`, `test_one` |\n| `b` | `Suite.*`, `tests/e2e` |\n"
+        self.assertEqual(check_named_tests.unkept(self.top, good), [])
+        bad = head + "| a | `Suite.Three`, `.Four`, `test_two`, `No.*`, `x/y` |\n| b | |\n"
+        self.assertEqual(len(check_named_tests.unkept(self.top, bad)), 6)
+        self.assertEqual(len(check_named_tests.unkept(self.top, "no table")), 1)
+
 
 class Readme(unittest.TestCase):
     def test_output_that_is_missing_is_found(self):
