@@ -246,6 +246,37 @@ def test_half_a_million_of_anything_is_refused_in_no_time(server, root, good, wh
     assert root.search(3) == (0, 1)
 
 
+# ---- one request that takes long
+
+def test_requests_of_the_largest_size_take_no_time(server):
+    root = clients.bind(server)
+    dn = "cn=large,%s" % SCHEMAS
+    values = [b"value %d" % number_of_value for number_of_value in range(9990)]
+    root.add_s(dn, [("objectClass", [b"top", b"container"]), ("cn", [b"large"]),
+                    ("description", values)])
+    long_part = "a" * 240000
+    requests = {
+        "values added": (root.modify_s, dn, [(0, "description", [b"n" + value for value in values])]),
+        "values that are there": (root.modify_s, dn, [(0, "description", [b"new", *values[:-1]])]),
+        "values deleted": (root.modify_s, dn, [(1, "description", values[::-1])]),
+        "values that are not there": (root.modify_s, dn, [(1, "description", [
+            b"x" + value for value in values])]),
+        "long values": (root.modify_s, dn, [(2, "description", [b"a" * 480000, b"a" * 480001])]),
+        "part of them": (root.search_s, SCHEMAS, 2, "(description=*%sb*)" % long_part, ["1.1"]),
+        "parts of them": (root.search_s, SCHEMAS, 2, "(description=*%sb)" % ("a*" * 2000), ["1.1"]),
+        "names": (root.search_s, SCHEMAS, 2, "(objectClass=*)", ["x%d" % i for i in range(1000)]),
+    }
+    for name, (call, *arguments) in requests.items():
+        used = Stopwatch(server)
+        try:
+            call(*arguments)
+        except (ldap.TYPE_OR_VALUE_EXISTS, ldap.NO_SUCH_ATTRIBUTE):
+            pass
+        assert used.seconds() < SLOW, name
+    root.delete_s(dn)
+    root.unbind_s()
+
+
 # ---- zero-length values everywhere
 
 def emptied(tree, position):

@@ -153,7 +153,7 @@ TEST_F(Work, OfAFilterOnAPublishedEntryIsLinear) {
             static_cast<void>(entry_matches(*schema, text));
           };
         },
-        200);
+        50);
   }
 }
 
