@@ -28,8 +28,8 @@ class Logs {
  public:
   // The most that one queue holds.
   static constexpr std::size_t kMaxQueuedBytes = 8 * 1024 * 1024;
-  // The longest line of the error log, before control characters are escaped; what is longer is cut,
-  // with its length behind it.
+  // The longest line of the error log, before control characters are escaped; what is longer is
+  // cut, with its length behind it.
   static constexpr std::size_t kMaxErrorLine = 8192;
   // How long finish() waits for what is queued.
   static constexpr std::chrono::milliseconds kPatience{3000};
