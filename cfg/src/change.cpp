@@ -114,15 +114,11 @@ Outcome read_values(const ldapmod& mod, const ModType& type,
 }
 
 std::string value_key(const ModType& type, std::string_view value) {
-  std::string form;
   std::string utf8;
+  std::string key;
   const MatchingRule rule =
       type.known != nullptr ? type.known->equality : MatchingRule::case_ignore;
-  const int rc = canonical_value(rule, as_utf8(value, utf8), form);
-  if (rc == result::no_memory) throw std::bad_alloc();
-  // A value that is not of the syntax equals none but itself.
-  std::string key(1, rc == result::success ? '=' : '#');
-  key += rc == result::success ? std::string_view(form) : value;
+  if (equality_key(rule, as_utf8(value, utf8), key) != result::success) throw std::bad_alloc();
   return key;
 }
 

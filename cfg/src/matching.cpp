@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cstdint>
 #include <optional>
+#include <utility>
 
 #include "assertion.h"
 #include "cfg/result_codes.h"
@@ -202,6 +203,17 @@ int canonical_value(MatchingRule rule, std::string_view value, std::string& cano
   std::optional<std::string> form = canonical_form(rule, value);
   if (!form) return result::invalid_attribute_syntax;
   canonical = std::move(*form);
+  return result::success;
+} catch (...) {
+  return result::no_memory;
+}
+
+int equality_key(MatchingRule rule, std::string_view value, std::string& key) noexcept try {
+  const std::optional<std::string> form = canonical_form(rule, value);
+  // No value outside the syntax is taken for the form of one within.
+  std::string made(1, form ? '=' : '#');
+  made += form ? std::string_view(*form) : value;
+  key = std::move(made);
   return result::success;
 } catch (...) {
   return result::no_memory;

@@ -10,18 +10,13 @@ namespace {
 
 using cfg::MatchingRule;
 
-// False when the value is not of the rule's syntax.
-bool canonicalize(MatchingRule rule, std::string_view value, std::string& canonical) {
-  const int rc = cfg::canonical_value(rule, value, canonical);
-  if (rc == result::no_memory) throw std::bad_alloc();
-  return rc == result::success;
-}
-
-// Empty when the schema in force does not know the name.
+// The name itself when the schema in force does not know it.
 std::string_view canonical_name(std::string_view name) {
   const Schema& schema = current_schema();
-  const std::string_view object_class = schema.canonical_object_class(name);
-  return object_class.empty() ? schema.canonical_attribute(name) : object_class;
+  if (const std::string_view known = schema.canonical_object_class(name); !known.empty())
+    return known;
+  const std::string_view known = schema.canonical_attribute(name);
+  return known.empty() ? name : known;
 }
 
 }  // namespace
@@ -46,14 +41,13 @@ bool is_secret_type(std::string_view type) noexcept {
 }
 
 std::string equality_key(cfg::MatchingRule rule, std::string_view value) {
+  std::string name;
   std::string key;
-  if (!canonicalize(rule, value, key)) {
-    // The NUL keeps it apart from canonical forms, which have none under rules that refuse values.
-    key.assign(1, '\0');
-    return key += value;
+  if (rule == MatchingRule::object_identifier) {
+    if (cfg::canonical_value(rule, value, name) != result::success) throw std::bad_alloc();
+    value = canonical_name(name);
   }
-  if (rule != MatchingRule::object_identifier) return key;
-  if (const std::string_view name = canonical_name(key); !name.empty()) key = name;
+  if (cfg::equality_key(rule, value, key) != result::success) throw std::bad_alloc();
   return key;
 }
 

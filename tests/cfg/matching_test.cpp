@@ -137,6 +137,28 @@ TEST_F(CanonicalValue, OfATimeCountsDaysOverLeapYearsAndCenturies) {
   }
 }
 
+std::string key(MatchingRule rule, std::string_view value) {
+  std::string text = "unchanged";
+  EXPECT_EQ(equality_key(rule, value, text), result::success) << value;
+  return text;
+}
+
+using EqualityKey = CanonicalValue;
+
+TEST_F(EqualityKey, IsTheSameForEqualValuesAndForNoOthers) {
+  EXPECT_EQ(key(MatchingRule::case_ignore, "A  b"), key(MatchingRule::case_ignore, "a B "));
+  EXPECT_NE(key(MatchingRule::case_exact, "a"), key(MatchingRule::case_exact, "A"));
+  EXPECT_EQ(key(MatchingRule::integer, "007"), key(MatchingRule::integer, "7"));
+}
+
+TEST_F(EqualityKey, OfAValueOutsideTheSyntaxIsThatOfNoOtherValue) {
+  EXPECT_EQ(key(MatchingRule::integer, "seven"), key(MatchingRule::integer, "seven"));
+  EXPECT_NE(key(MatchingRule::integer, "seven"), key(MatchingRule::integer, "SEVEN"));
+  // Neither by the form that a value within has, nor by its key.
+  EXPECT_NE(key(MatchingRule::boolean, " true"), key(MatchingRule::boolean, "=TRUE"));
+  EXPECT_NE(key(MatchingRule::boolean, "TRUE"), key(MatchingRule::boolean, "#TRUE"));
+}
+
 TEST(MatchingRuleName, IsKnownByNameInAnyLetterCaseAndByOid) {
   MatchingRule rule{};
   for (const char* name : {"integerMatch", "INTEGERMATCH", "2.5.13.14"}) {

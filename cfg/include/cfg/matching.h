@@ -1,6 +1,6 @@
 // Equality of attribute values (RFC 4517, section 4.2): the one matcher of the whole system.
 //
-// Both functions are thread-safe and do not throw.
+// All functions are thread-safe and do not throw.
 #pragma once
 
 #include <string>
@@ -17,6 +17,11 @@ namespace orv::cfg {
 // 0; 21 the value is not one of the rule's syntax, so that it equals no value; 90. `canonical` is
 // unchanged on failure.
 int canonical_value(MatchingRule rule, std::string_view value, std::string& canonical) noexcept;
+
+// Writes a text that two values have in common exactly when they are equal under `rule`, as a key
+// of tables in which equal values are to meet. A value that is not of the rule's syntax equals none
+// but itself. 0 or 90; `key` is unchanged on failure.
+int equality_key(MatchingRule rule, std::string_view value, std::string& key) noexcept;
 
 // The comparison for attribute types with the equality rule of this name (ignoring ASCII letter
 // case) or numeric OID. False when the rule is unknown; `rule` is then unchanged.

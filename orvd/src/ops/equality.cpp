@@ -12,11 +12,13 @@ std::string equality_key(const Schema& schema, std::string_view type, const std:
   if (known->secret) return value;
   auto rule = cfg::MatchingRule::case_ignore;
   cfg::find_matching_rule(known->equality, rule);
+  return equality_key(rule, value);
+}
+
+std::string equality_key(cfg::MatchingRule rule, std::string_view value) {
   std::string key;
-  const int code = cfg::canonical_value(rule, value, key);
-  if (code == result::no_memory) throw std::bad_alloc();
-  // No value that the rule cannot read is taken for the form of one that it can.
-  return code == result::success ? "=" + key : "!" + value;
+  if (cfg::equality_key(rule, value, key) != result::success) throw std::bad_alloc();
+  return key;
 }
 
 }  // namespace orv::server

@@ -7,7 +7,6 @@
 
 #include "cfg/dn.h"
 #include "cfg/ldapmod.h"
-#include "cfg/matching.h"
 #include "cfg/result_codes.h"
 #include "cfg/secret.h"
 #include "ops/equality.h"
@@ -206,10 +205,7 @@ bool loses_count_of_roles(const TypeFolds& folds) {
 
 // Names ignore the case of letters whatever the type's own equality says.
 std::string name_key(const std::string& value) {
-  std::string key;
-  const int code = cfg::canonical_value(cfg::MatchingRule::case_ignore, value, key);
-  if (code == result::no_memory) throw std::bad_alloc();
-  return code == result::success ? key : value;
+  return equality_key(cfg::MatchingRule::case_ignore, value);
 }
 
 bool holds(const TypeChange& change, const std::string& key) {
