@@ -103,6 +103,15 @@ TEST_F(Canonical, PasswordInTheRdnIsRefused) {
   EXPECT_EQ(add_code({"cn=x+orv-slapdMasterPW=y,cn=configuration", classes}), 64);
 }
 
+TEST_F(Canonical, EntryIsNamedByOneValueOfAnAttribute) {
+  const std::vector<Attribute> classes{{"objectClass", {"container"}}};
+  for (const char* dn : {"cn=x+cn=y,cn=configuration", "cn=x+description=z+commonName=y,cn=a",
+                         "cn=x+2.5.4.3=x,cn=configuration"})
+    EXPECT_EQ(add_code({dn, classes}), 64) << dn;
+  EXPECT_EQ(add_code({"cn=x+description=y,cn=configuration", classes}), 0);
+  EXPECT_EQ(add_code({"cn=x,cn=a+cn=b,cn=configuration", classes}), 0);
+}
+
 TEST_F(Canonical, AttributesOfTheServerAreRefused) {
   EXPECT_EQ(add_code({"cn=x", {{"createTimestamp", {"20260101000000Z"}}}}), 19);
   EXPECT_EQ(modify_code({"cn=x", {{2, {"createTimestamp", {"20260101000000Z"}}}}}), 19);

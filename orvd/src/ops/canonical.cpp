@@ -4,6 +4,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <new>
+#include <unordered_set>
 #include <utility>
 
 #include "cfg/dn.h"
@@ -210,15 +211,20 @@ bool holds_rdn_value(const Schema& schema, const CanonicalAttribute& attribute,
                      });
 }
 
-// RFC 4511, 4.7: values of the RDN that the list lacks are added.
+// RFC 4511, 4.7: values of the RDN that the list lacks are added. RFC 4512, 2.2: of each attribute
+// that names an entry, one value does.
 Refusal complete_rdn(const Schema& schema, const std::string& dn,
                      std::vector<CanonicalAttribute>& attributes) {
   cfg::Dn parsed;
   if (const int code = cfg::parse_dn(dn, parsed)) return refuse(code, kTargetNotADn);
   if (parsed.empty()) return {};
+  std::unordered_set<std::string_view> types;
   for (const cfg::Ava& ava : parsed.front()) {
     std::string_view type;
     if (Refusal refusal = canonical_type(schema, ava.type, type)) return refusal;
+    if (!types.insert(type).second)
+      return refuse(result::naming_violation, "an entry is named by one value of an attribute",
+                    type);
     // Everybody who may search sees DNs.
     if (schema.attribute(type)->secret)
       return refuse(result::naming_violation, "a password cannot be part of a name", type);
