@@ -13,17 +13,25 @@ namespace {
 // DNs within values of DNs are looked at so far down; what lies deeper is not shown.
 constexpr int kDepth = 4;
 
+const AttributeType* find_type(std::string_view description) noexcept {
+  return find_attribute_type(description.substr(0, description.find(';')));
+}
+
 bool is_secret_type(std::string_view description) noexcept {
-  const AttributeType* const type =
-      find_attribute_type(description.substr(0, description.find(';')));
+  const AttributeType* const type = find_type(description);
   return type != nullptr && type->secret;
+}
+
+bool is_hidden_type(std::string_view description, UnknownTypes unknown) noexcept {
+  const AttributeType* const type = find_type(description);
+  return type == nullptr ? unknown == UnknownTypes::hidden : type->secret;
 }
 
 int search_dn(std::string_view text, int depth, bool& found);
 
 // Whether the value is to be replaced.
-int examine(const Ava& part, int depth, bool& found) {
-  found = is_secret_type(part.type);
+int examine(const Ava& part, UnknownTypes unknown, int depth, bool& found) {
+  found = is_hidden_type(part.type, unknown);
   if (found || part.value.find('=') == std::string::npos) return result::success;
   const int code = search_dn(part.value, depth, found);
   return code == result::invalid_dn_syntax ? result::success : code;
@@ -37,7 +45,7 @@ int search_dn(std::string_view text, int depth, bool& found) {
   for (const Rdn& rdn : dn)
     for (const Ava& part : rdn) {
       if (found) return result::success;
-      if (const int code = examine(part, depth - 1, found)) return code;
+      if (const int code = examine(part, UnknownTypes::shown, depth - 1, found)) return code;
     }
   return result::success;
 }
@@ -58,12 +66,12 @@ void append_value(std::string& out, std::string_view value) {
 }
 
 // `replaced`: something was.
-int rewrite(const Dn& dn, std::string& text, bool& replaced) {
+int rewrite(const Dn& dn, UnknownTypes unknown, std::string& text, bool& replaced) {
   for (const Rdn& rdn : dn) {
     if (&rdn != &dn.front()) text += ',';
     for (const Ava& part : rdn) {
       bool found = false;
-      if (const int code = examine(part, kDepth, found)) return code;
+      if (const int code = examine(part, unknown, kDepth, found)) return code;
       if (&part != &rdn.front()) text += '+';
       text.append(part.type) += '=';
       if (found)
@@ -133,12 +141,12 @@ std::size_t end_of_value(std::string_view text, std::size_t at, bool in_filter) 
 
 }  // namespace
 
-int mask_dn(std::string_view dn, std::string& shown) noexcept try {
+int mask_dn(std::string_view dn, UnknownTypes unknown, std::string& shown) noexcept try {
   Dn parsed;
   if (const int code = parse_dn(dn, parsed)) return code;
   std::string text;
   bool replaced = false;
-  if (const int code = rewrite(parsed, text, replaced)) return code;
+  if (const int code = rewrite(parsed, unknown, text, replaced)) return code;
   shown = replaced ? std::move(text) : std::string(dn);
   return result::success;
 } catch (...) {
@@ -146,11 +154,12 @@ int mask_dn(std::string_view dn, std::string& shown) noexcept try {
 }
 
 // In the normal form every "=", "," and "+" that belongs to a value is escaped.
-bool normal_dn_may_hold_secret(std::string_view normal) noexcept {
+bool normal_dn_may_need_mask(std::string_view normal) noexcept {
   if (normal.find("\\3D") != std::string_view::npos) return true;  // perhaps a DN within
   for (std::size_t at = 0; at < normal.size();) {
     const std::size_t equals = std::min(normal.find('=', at), normal.size());
-    if (is_secret_type(normal.substr(at, equals - at))) return true;
+    const std::string_view type = normal.substr(at, equals - at);
+    if (!type.empty() && is_hidden_type(type, UnknownTypes::hidden)) return true;
     at = normal.find_first_of(",+", equals);
     if (at == std::string_view::npos) return false;
     ++at;

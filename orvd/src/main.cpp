@@ -192,7 +192,7 @@ class StoredIdentities final : public Authenticator,
     const std::uint64_t generation = store_.generation();
     if (told_.exchange(generation) == generation) return;
     std::string shown = "not a DN";
-    cfg::mask_dn(name, shown);
+    cfg::mask_dn(name, cfg::UnknownTypes::shown, shown);
     std::string line = "nobody can bind as ";
     append_quoted(line, shown);
     logs_.error(line + ": more than one entry defines that identity");

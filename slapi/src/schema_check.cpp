@@ -213,7 +213,8 @@ class EntryCheck {
     if (entry_.dn == nullptr) return "";
     std::string utf8;
     std::string shown = "not a DN";
-    if (to_utf8(entry_.dn, utf8) && cfg::mask_dn(utf8, shown) == result::no_memory)
+    if (to_utf8(entry_.dn, utf8) &&
+        cfg::mask_dn(utf8, cfg::UnknownTypes::shown, shown) == result::no_memory)
       throw std::bad_alloc();
     return shown == utf8 ? entry_.dn : shown;
   }

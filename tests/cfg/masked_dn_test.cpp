@@ -26,15 +26,15 @@ class MaskedDn : public testing::Test {
   }
   void TearDown() override { ASSERT_EQ(register_attribute_types({}), 0); }
 
-  static std::string shown(const std::string& dn) {
+  static std::string shown(const std::string& dn, UnknownTypes unknown = UnknownTypes::shown) {
     std::string text = "unchanged";
-    const int code = mask_dn(dn, text);
+    const int code = mask_dn(dn, unknown, text);
     return code == 0 ? text : std::to_string(code) + " " + text;
   }
-  static bool may_hold(const std::string& dn) {
+  static bool may_need_mask(const std::string& dn) {
     std::string normal;
     EXPECT_EQ(normalize_dn(dn, normal), 0) << dn;
-    return normal_dn_may_hold_secret(normal);
+    return normal_dn_may_need_mask(normal);
   }
 };
 
@@ -65,6 +65,15 @@ TEST_F(MaskedDn, HidesValuesThatAreDnsWithASecret) {
   }
 }
 
+TEST_F(MaskedDn, HidesValuesOfUnknownTypesWhereItIsToldTo) {
+  const auto hidden = [](const char* dn) { return shown(dn, UnknownTypes::hidden); };
+  EXPECT_EQ(hidden("vaultKeys=hidden,cn=a"), "vaultKeys=********,cn=a");
+  EXPECT_EQ(hidden("cn=a+userPassword=hidden,cn=b"), "cn=a+userPassword=********,cn=b");
+  EXPECT_EQ(hidden("1.2.3.5=hidden,CN=b"), "1.2.3.5=********,cn=b");
+  EXPECT_EQ(hidden("CN = a\\,b,vaultKey=hidden"), "cn=a\\2Cb,vaultKey=********");
+  EXPECT_EQ(hidden("cn=other\\=a"), "cn=other\\=a");
+}
+
 TEST_F(MaskedDn, IsNoDnWhenTheNameIsNone) {
   for (const char* text : {"vaultKey=hidden,,", "hidden", "vaultKey=hidden,cn", "=hidden"})
     EXPECT_EQ(shown(text), "34 unchanged");
@@ -73,9 +82,11 @@ TEST_F(MaskedDn, IsNoDnWhenTheNameIsNone) {
 TEST_F(MaskedDn, CanBeToldFromTheNormalForm) {
   for (const char* dn : {"vaultKey=hidden", "cn=a,vaultWord=x,cn=b", "cn=a+1.2.3.4=x",
                          "cn=cn\\=a\\,vaultKey\\=hidden,cn=b"})
-    EXPECT_TRUE(may_hold(dn)) << dn;
-  for (const char* dn : {"", "cn=a", "cn=vaultKey,cn=b+vault=x", "cn=\\,vaultKey,cn=b"})
-    EXPECT_FALSE(may_hold(dn)) << dn;
+    EXPECT_TRUE(may_need_mask(dn)) << dn;
+  for (const char* dn : {"cn=a,vault=x", "cn=b+vault=x,cn=a", "1.2.3.5=x"})
+    EXPECT_TRUE(may_need_mask(dn)) << dn;
+  for (const char* dn : {"", "cn=a", "cn=vaultKey,cn=b+cn=x", "cn=\\,vaultKey,cn=b"})
+    EXPECT_FALSE(may_need_mask(dn)) << dn;
 }
 
 TEST_F(MaskedDn, SecretIsFoundInTextsOfAnyKind) {

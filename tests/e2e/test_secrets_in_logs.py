@@ -193,6 +193,27 @@ def test_a_password_in_the_wrong_place_is_written_nowhere(traced):
     assert not lines, "\n".join("%s: %r" % line for line in lines[:40])
 
 
+def test_names_of_unknown_types_are_logged_without_their_values(server):
+    """Somebody's password, under the name that it has elsewhere."""
+    for client in (clients.bind(server), clients.connect(server)):
+        for name in ("userPassword", "orv-slapdAdminPassword", "1.2.3.4"):
+            dn = "cn=x+%s=%s,cn=configuration" % (name, MARKER)
+            for base in (dn, "cn=y," + dn, "%s=%s" % (name, MARKER)):
+                attempt(client.search_s, base, ldap.SCOPE_BASE)
+                attempt(client.add_s, base, [("objectClass", [b"top", b"container"])])
+                attempt(client.delete_s, base)
+                attempt(client.modify_s, base, [(ldap.MOD_REPLACE, "description", [b"x"])])
+                attempt(client.rename_s, base, "cn=y")
+                attempt(client.rename_s, GROUP, base, base)
+                attempt(client.compare_s, base, "cn", b"x")
+                attempt(client.simple_bind_s, base, "wrong")
+    server.stop()
+    texts = written(server)
+    assert not [name for name, text in texts.items() if MARKER.encode() in text]
+    assert b'dn="userPassword=********"' in texts["access.log"]
+    assert b"dn: userPassword=********\n" in texts["audit.log"]
+
+
 def test_what_the_access_log_shows_of_names_and_filters(server):
     root = clients.bind(server)
     attempt(root.delete_s, "orv-slapdAdminPW=%s,," % MARKER)

@@ -266,6 +266,7 @@ TEST_F(Canonical, FiltersAreShownWithoutWhatMayBeASecret) {
   // In a DN, also where its characters are escaped.
   EXPECT_EQ(shown("(orv-slapdAdminDN=cn=a,orv-slapdAdminPW=guess)"), "(orv-slapdAdminDN=***)");
   EXPECT_EQ(shown("(cn=orv-slapdAdminPW\\3dgu\\28ess)"), "(cn=***)");
+  EXPECT_EQ(shown("(orv-slapdAdminDN=cn=a,userPassword=guess)"), "(orv-slapdAdminDN=***)");
   EXPECT_EQ(shown("(orv-slapdAdminDN=cn=a,o=b)"), "(orv-slapdAdminDN=cn=a,o=b)");
   // What should be a DN and is not.
   EXPECT_EQ(shown("(orv-slapdAdminDN=orv-slapdAdminPW=guess,,)"), "(orv-slapdAdminDN=***)");

@@ -19,8 +19,8 @@ const SchemaAttribute* find_type(const Schema& schema, std::string_view descript
 }
 
 // False when `dn` is no DN; `shown` is then unchanged.
-bool mask_dn(std::string_view dn, std::string& shown) {
-  const int code = cfg::mask_dn(dn, shown);
+bool show_dn(std::string_view dn, cfg::UnknownTypes unknown, std::string& shown) {
+  const int code = cfg::mask_dn(dn, unknown, shown);
   if (code == result::no_memory) throw std::bad_alloc();
   return code == result::success;
 }
@@ -40,7 +40,7 @@ class ChangeText {
   void name(std::string_view field, std::string_view comment, std::string_view dn) {
     const bool cut = most_ != std::string::npos && dn.size() > most_ - std::min(most_, out_.size());
     std::string shown;
-    if (cut || !mask_dn(dn, shown)) {
+    if (cut || !show_dn(dn, cfg::UnknownTypes::hidden, shown)) {
       line(comment, cut ? "cut, too long" : "not a DN");
       shown.clear();
     }
@@ -83,7 +83,8 @@ class ChangeText {
     // Any value may be a DN, whatever the syntax of its type; one that should be and is not, is not
     // looked into.
     std::string shown(value);
-    if (!mask_dn(value, shown) && (type->syntax == kDnSyntax || cfg::find_secret(value, 0)))
+    if (!show_dn(value, cfg::UnknownTypes::shown, shown) &&
+        (type->syntax == kDnSyntax || cfg::find_secret(value, 0)))
       shown = cfg::kMask;
     line(name, shown);
   }

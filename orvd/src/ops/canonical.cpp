@@ -367,7 +367,8 @@ bool may_be_shown(const Schema& schema, const FilterItem& parts, bool whole) {
   if (!should_be_dn && parts.value.find_first_of("=\\%") == std::string_view::npos) return true;
   const std::string value = unescaped(parts.value);
   std::string shown;
-  const int code = cfg::mask_dn(value, shown);
+  const auto unknown = should_be_dn ? cfg::UnknownTypes::hidden : cfg::UnknownTypes::shown;
+  const int code = cfg::mask_dn(value, unknown, shown);
   if (code == result::no_memory) throw std::bad_alloc();
   if (code == result::success) return shown == value;
   return !should_be_dn && !cfg::find_secret(value, 0);

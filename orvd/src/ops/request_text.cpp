@@ -15,7 +15,8 @@ namespace {
 // A name as logs may show it: what is no DN may be anything, a password too.
 std::string shown_dn(std::string_view dn) {
   std::string shown = "not a DN";
-  if (cfg::mask_dn(dn, shown) == result::no_memory) throw std::bad_alloc();
+  if (cfg::mask_dn(dn, cfg::UnknownTypes::hidden, shown) == result::no_memory)
+    throw std::bad_alloc();
   return shown;
 }
 
@@ -47,7 +48,7 @@ std::string_view operation_name(int tag) {
 std::string describe_dn(std::string_view name, std::string_view dn, std::string_view normal) {
   std::string text(name);
   text += " dn=";
-  if (!normal.empty() && !cfg::normal_dn_may_hold_secret(normal))
+  if (!normal.empty() && !cfg::normal_dn_may_need_mask(normal))
     append_client_text(text, dn);
   else
     append_client_text(text, shown_dn(dn));
