@@ -44,6 +44,7 @@ class Stage:
         self.failures = []
         self.present = {}   # DN: the description that was acknowledged, None for gone
         self.pending = {}   # DN: what it becomes if the change that was not answered was made
+        self.unsure = {}    # DN: all that changes whose client left may have made of it
 
     def count(self, what):
         self.counts[what] = self.counts.get(what, 0) + 1
@@ -258,10 +259,15 @@ class Guest(Actor):
 class Nuisance(Actor):
     """Somebody who means no good. Whatever it does, its connection ends in time."""
 
+    def __init__(self, stage, number):
+        super().__init__(stage)
+        self.name = "soak nuisance %d" % number
+        self.changes = 0
+
     async def act(self):
         deed = self.random.choice((self.garbage, self.stall, self.half, self.drip, self.hoard,
-                                   self.vanish, self.half_handshake, self.nonsense_for_tls,
-                                   self.silence))
+                                   self.vanish, self.vanish_in_a_change, self.silence,
+                                   self.half_handshake, self.nonsense_for_tls))
         reader, writer = await self._raw(deed in (self.half_handshake, self.nonsense_for_tls))
         try:
             await deed(reader, writer)
@@ -328,11 +334,27 @@ class Nuisance(Actor):
         del reader
 
     async def vanish(self, reader, writer):
-        """Is gone by a reset in the middle of an answer, or of a change."""
+        """Is gone by a reset in the middle of an answer."""
         writer.write(self._bind())
         await reader.read(10)
         request = wire.search_request(2, scope=2, attributes=())
         writer.write(request)
+        if self.random.random() < 0.5:
+            await reader.read(10)
+
+    async def vanish_in_a_change(self, reader, writer):
+        """Does not wait for the answer to a change, which is made wholly or not at all."""
+        dn, attributes = container(self.name)
+        possible = self.stage.unsure.setdefault(dn, {None})
+        self.changes += 1
+        text = "%d of %s" % (self.changes, self.name)
+        possible.add(text)
+        add = add_operation(dn, {**attributes, "description": _pair(text)})
+        change = replace_operation(dn, "description", _pair(text))
+        writer.write(self._bind())
+        await reader.read(10)
+        writer.write(b"".join(wire.message(number, operation)
+                              for number, operation in ((2, add), (3, change))))
         if self.random.random() < 0.5:
             await reader.read(10)
 
@@ -426,7 +448,7 @@ def cast(stage, connections):
     actors = [Administrator(stage, number) for number in range(administrators)]
     actors += [Listener(stage) for _ in range(listeners)]
     actors += [Guest(stage, number) for number in range(guests)]  # two connections each
-    actors += [Nuisance(stage) for _ in range(connections - len(actors) - guests)]
+    actors += [Nuisance(stage, number) for number in range(connections - len(actors) - guests)]
     return [*actors, Editor(stage)]
 
 
@@ -439,7 +461,10 @@ def missing_or_torn(stage):
     wrong = ["%s is %s, acknowledged was %s" % (dn, there.get(dn), text)
              for dn, text in known.items()
              if there.get(dn_key(dn)) not in (text, stage.pending.get(dn, text))]
-    wrong += ["%s was never made" % dn for dn in set(there) - {dn_key(dn) for dn in known}]
+    unsure = {dn_key(dn): texts for dn, texts in stage.unsure.items()}
+    wrong += ["%s is %s, which nobody made" % (dn, there[dn])
+              for dn in set(there) - {dn_key(dn) for dn in known}
+              if there[dn] not in unsure.get(dn, {None})]
     wrong += ["%s is left" % dn for dn in found if dn.startswith("cn=guest ")]
     return wrong
 
