@@ -133,9 +133,9 @@ class Administrator(Actor):
         self.stage.pending[dn] = wanted
         code, _ = await self.client.call(operation)
         del self.stage.pending[dn]
+        self.stage.count("changes answered with %d" % code)
         if check(code, "a change"):
             self.stage.present[dn] = wanted
-            self.stage.count("changes made")
 
     async def look(self):
         """Exactly what was acknowledged is there."""

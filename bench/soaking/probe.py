@@ -1,7 +1,9 @@
 """probe.py HOST PORT PASSWORD-FILE PAUSE: searches as an administrator until a line comes in, then
-prints when, how long in milliseconds, and with which code, as JSON."""
+prints when, how long in milliseconds, and with which code, as JSON. From time to time it also comes
+anew, and flushes a page to the disk itself: what a change waits for, and searches behind it."""
 
 import json
+import os
 import pathlib
 import select
 import sys
@@ -11,7 +13,8 @@ sys.path.insert(0, str(pathlib.Path(__file__).resolve().parents[2] / "tests" / "
 
 from orv_e2e import wire  # noqa: E402
 
-NEWCOMER_EVERY = 10
+EVERY = 10
+PAGE = b"x" * 4096
 
 
 class Server:
@@ -36,14 +39,22 @@ def main():
         with wire.Wire(server) as client:
             return client.bind("cn=root", password) or client.search(2)[0]
 
-    searches, newcomers = [], []
+    file = os.open(password_file + ".probe", os.O_RDWR | os.O_CREAT, 0o600)
+
+    def floor():
+        os.pwrite(file, PAGE, 0)
+        os.fsync(file)
+        return 0
+
+    found = {"searches": [], "newcomers": [], "floors": []}
     number = 1
     while not select.select([sys.stdin], [], [], float(pause))[0]:
         number += 1
-        searches.append(timed(lambda: standing.search(number)[0]))
-        if number % NEWCOMER_EVERY == 0:
-            newcomers.append(timed(newcomer))
-    json.dump({"searches": searches, "newcomers": newcomers}, sys.stdout)
+        found["searches"].append(timed(lambda: standing.search(number)[0]))
+        if number % EVERY == 0:
+            found["newcomers"].append(timed(newcomer))
+            found["floors"].append(timed(floor))
+    json.dump(found, sys.stdout)
 
 
 if __name__ == "__main__":
