@@ -26,8 +26,8 @@ def soak(*options):
 
 def test_all_operations_bad_clients_and_edits_at_once_lose_nothing():
     text = soak("--connections", "60", "--pause", "0.05")
-    for deed in ("changes answered with 0", "connections over start-tls", "nuisance: stall", "notices heard",
-                 "edits"):
+    for deed in ("changes answered with 0", "connections over start-tls", "nuisance: stall",
+                 "notices heard", "edits"):
         assert deed in text, deed
 
 
