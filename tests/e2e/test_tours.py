@@ -26,6 +26,20 @@ LIBRARIES = {
     "python": [sys.executable, str(TOURS / "tour.py")],
 }
 
+# What succeeds where a library is there.
+THERE = {
+    "java": ["javac", "-version"],
+    "perl": ["perl", "-MNet::LDAP", "-MIO::Socket::SSL", "-e", "1"],
+    "python": ["true"],
+}
+
+
+def is_there(library):
+    if not shutil.which(THERE[library][0]):
+        return False
+    return subprocess.run(THERE[library], stdout=subprocess.DEVNULL, stderr=subprocess.DEVNULL,
+                          timeout=SECONDS, check=False).returncode == 0
+
 
 @pytest.fixture(name="two_addresses")
 def two_addresses_fixture(instance):
@@ -38,8 +52,8 @@ def two_addresses_fixture(instance):
 @pytest.mark.parametrize("transport", ["start-tls", "ldaps"])
 @pytest.mark.parametrize("library", LIBRARIES)
 def test_tour_of_a_library_shows_what_is_expected(two_addresses, tmp_path, library, transport):
-    if not shutil.which(LIBRARIES[library][0]) and "CI" not in os.environ:
-        pytest.skip("packages.txt names what is needed")
+    if "CI" not in os.environ and not is_there(library):
+        pytest.skip("packages.txt names what is needed, under clients")
     server = two_addresses
     port = server.secure_port if transport == "ldaps" else server.port
     stranger = Authority(tmp_path / "stranger").certificate
