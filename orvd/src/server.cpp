@@ -18,6 +18,7 @@ namespace {
 
 constexpr std::size_t kChangeThreads = 1;  // the gate lets no more than one in
 constexpr std::size_t kVerifierThreads = 2;
+constexpr std::size_t kOwnThreads = 1;
 // How often waiting operations are checked for their deadline.
 constexpr std::chrono::milliseconds kGateInterval{100};
 // How often the files are looked at that nobody says have changed.
@@ -63,6 +64,7 @@ Server::Server(ServerParts parts)
       settings_(std::make_shared<const Settings>(parts_.settings)),
       changes_(kChangeThreads),
       verifiers_(kVerifierThreads),
+      own_work_(kOwnThreads),
       listeners_(control_, services_, counter_, loops_) {
   services_.note_failure = parts_.note_failure;
   services_.audit = parts_.audit;
@@ -71,6 +73,7 @@ Server::Server(ServerParts parts)
   services_.changes_made = parts_.changes_made;
   services_.renew_settings = [this] { renew_settings(); };
   services_.mechanisms = parts_.mechanisms;
+  services_.local_verifiers = &own_work_;
   services_.tls = &tls_;
   for (unsigned i = 0; i < std::max(1U, parts_.loops); ++i)
     loops_.push_back(std::make_unique<Loop>(parts_.logs, settings_));
@@ -82,7 +85,7 @@ Server::~Server() {
 }
 
 void Server::stop_workers() {
-  for (asio::thread_pool* const pool : {&changes_, &verifiers_}) {
+  for (asio::thread_pool* const pool : {&changes_, &verifiers_, &own_work_}) {
     pool->stop();
     pool->join();
   }
@@ -210,7 +213,7 @@ void Server::watch_files() {
     watch_files();
     if (looking_.exchange(true)) return;
     try {
-      asio::post(verifiers_, [this] {
+      asio::post(own_work_, [this] {
         parts_.look_after();
         looking_.store(false);
       });

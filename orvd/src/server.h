@@ -131,6 +131,7 @@ class Server {
   // After the loops: work that was never done goes with the pools and holds connections.
   asio::thread_pool changes_;
   asio::thread_pool verifiers_;
+  asio::thread_pool own_work_;  // that waits for no stranger's: the files, and local clients
   Listeners listeners_;
   bool ports_taken_ = false;
   bool local_taken_ = false;

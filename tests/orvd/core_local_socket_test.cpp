@@ -3,6 +3,7 @@
 
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/time.h>
 #include <sys/un.h>
 #include <unistd.h>
 
@@ -16,6 +17,8 @@
 
 namespace orv::server {
 namespace {
+
+using namespace std::chrono_literals;
 
 using test::kTop;
 using test::Reply;
@@ -192,6 +195,31 @@ TEST_F(LocalServer, IsReachedHoweverManyStrangersAreConnected) {
   EXPECT_EQ(code_of(second, test::search(1, "")), 0);
   LocalClient client(folder.socket());
   EXPECT_EQ(external(client, 1).code, 0);
+}
+
+// Checks of passwords cost time by intention, and strangers may ask for as many as they have
+// connections.
+TEST_F(LocalServer, BindsWhileStrangersHavePasswordsChecked) {
+  test::Event enough;
+  authenticator.meanwhile = [&](std::string_view) { enough.wait(); };
+  std::atomic<bool> looked_after{false};
+  look_after = [&] { looked_after = authenticator.asked >= 2; };
+  start();
+  std::vector<std::unique_ptr<WireClient>> strangers;
+  for (int i = 0; i < 8; ++i) {
+    strangers.push_back(std::make_unique<WireClient>(port()));
+    strangers.back()->send(test::bind(1, "cn=root", "guess"));
+  }
+  const auto end = Clock::now() + 10s;
+  while (authenticator.asked < 2 && Clock::now() < end) std::this_thread::yield();
+  LocalClient client(folder.socket());
+  const timeval patience{5, 0};
+  ::setsockopt(client.descriptor(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
+  EXPECT_EQ(external(client, 1).code, 0);
+  while (!looked_after && Clock::now() < end) std::this_thread::yield();
+  EXPECT_TRUE(looked_after);
+  enough.happen();
+  stop();
 }
 
 TEST_F(LocalServer, RemovesItsSocketWhenItStops) {

@@ -5,6 +5,7 @@
 
 #include <atomic>
 #include <csignal>
+#include <functional>
 #include <optional>
 #include <string>
 #include <thread>

@@ -93,8 +93,11 @@ struct Services {
   unsigned long (*changes_made)() = nullptr;
   FailedChangesByName failed_changes{};
   PersistentSearches persistent_searches{};
-  AuditLog* audit = nullptr;                     // null: changes are not recorded
-  const SaslMechanisms* mechanisms = nullptr;    // null: none
+  AuditLog* audit = nullptr;                   // null: changes are not recorded
+  const SaslMechanisms* mechanisms = nullptr;  // null: none
+  // For binds over Unix sockets, in the place of `verifiers`, so that no stranger keeps out who
+  // administers the server on its own host. Null: there is none.
+  asio::thread_pool* local_verifiers = nullptr;
   TlsHolder* tls = nullptr;                      // null: TLS is not offered
   std::atomic<std::int64_t> unauthenticated{0};  // connections on which nobody is bound
   CutOffLog cut_offs{logs};

@@ -89,9 +89,12 @@ bool Session::needs_confidentiality() const noexcept {
 // `work` ends by coming back.
 template <typename Work>
 void Session::on_verifier(Work work) {
+  auto job = [self = shared_from_this(), bind = bind_, work] { work(bind); };
   try {
-    services_.binds.post(counted_as_,
-                         [self = shared_from_this(), bind = bind_, work] { work(bind); });
+    if (transport_.local && services_.local_verifiers)
+      asio::post(*services_.local_verifiers, std::move(job));
+    else
+      services_.binds.post(counted_as_, std::move(job));
   } catch (const std::bad_alloc&) {
     finish_bind(result::no_memory, "", nullptr);
   }
