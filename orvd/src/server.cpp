@@ -141,7 +141,10 @@ void Server::renew_certificate(Settings& wanted) {
   // Whoever connected to a port for TLS must find it.
   if (wanted.tls.certificate_file.empty() && secure_port() != 0)
     error = "orv-slapdTlsCertificateFile is gone, which the port for TLS needs";
-  if (error.empty() && load_certificate(wanted.tls, error)) return;
+  else if (load_certificate(wanted.tls, error))
+    return;
+  else
+    error += "; mend this before the next start, which it would prevent";
   parts_.logs.error("TLS stays as it was: " + error);
   wanted.tls = settings_->tls;
 }
@@ -162,7 +165,16 @@ void Server::await_signal() {
   });
 }
 
+// The administrator of a port at which nobody answers should not have to guess.
+void Server::tell_what_is_missing() {
+  if (settings_->secure_port > 0 && !tls_.current())
+    parts_.logs.warning(
+        "nobody listens at orv-slapdSecurePort, because TLS needs a certificate: name one in "
+        "orv-slapdTlsCertificateFile and start again, or set the port to 0");
+}
+
 int Server::serve() {
+  tell_what_is_missing();
   const auto work = asio::make_work_guard(control_);
   watch_gate();
   watch_files();

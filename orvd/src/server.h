@@ -104,6 +104,7 @@ class Server {
   void renew_settings() noexcept;
   bool load_certificate(const TlsSettings& settings, std::string& error);
   void renew_certificate(Settings& wanted);
+  void tell_what_is_missing();
   void control();
   void watch_gate();
   void watch_files();

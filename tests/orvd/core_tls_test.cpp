@@ -251,6 +251,19 @@ TEST_F(TlsTest, WithoutACertificateThereIsNoTls) {
 
 // ---- versions, suites, sessions
 
+TEST_F(TlsTest, PortThatIsNotOpenForWantOfACertificateIsToldOf) {
+  settings.tls = {};
+  settings.secure_port = 3636;
+  settings.error_log = certificates.path("error.log");
+  settings.error_log_level = "info";
+  start();
+  stop();
+  std::ifstream file(settings.error_log);
+  const std::string text{std::istreambuf_iterator<char>(file), {}};
+  EXPECT_NE(text.find("nobody listens at orv-slapdSecurePort"), std::string::npos) << text;
+  EXPECT_NE(text.find("orv-slapdTlsCertificateFile"), std::string::npos);
+}
+
 TEST_F(TlsTest, OldVersionsAreRefused) {
   start();
   for (const int version : {TLS1_VERSION, TLS1_1_VERSION}) {
