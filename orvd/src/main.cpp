@@ -167,6 +167,11 @@ class StoredIdentities final : public Authenticator,
     return identities && identities->has_principals();
   }
 
+  bool maps_certificates() const noexcept override {
+    const std::shared_ptr<const Identities> identities = store_.latest();
+    return identities && identities->maps_certificates();
+  }
+
   std::uint64_t generation() const noexcept override { return store_.generation(); }
 
   bool still_valid(const Identity& bound) const noexcept override {

@@ -108,6 +108,17 @@ TEST_F(ExternalIdentitiesOfAFile, CertificateProvesWhomItIsMappedTo) {
   EXPECT_THAT(warnings_, IsEmpty());
 }
 
+TEST_F(ExternalIdentitiesOfAFile, CertificatesStandForSomebodyWhoCanBind) {
+  const std::string alice = member("alice", "cn=alice", "alicepw");
+  EXPECT_FALSE(read(kTop + kGroup + alice)->maps_certificates());
+  for (const char* const useless : {"cn=a => cn=nobody", "nonsense"})
+    EXPECT_FALSE(read(kTop + group_with_map(mapped(useless)) + alice)->maps_certificates());
+  EXPECT_FALSE(
+      read(kTop + group_with_map(mapped("cn=a => cn=alice") + mapped("CN=A => cn=root")) + alice)
+          ->maps_certificates());
+  EXPECT_TRUE(read(kTop + group_with_map(mapped("cn=a => cn=alice")) + alice)->maps_certificates());
+}
+
 TEST_F(ExternalIdentitiesOfAFile, CertificateNeedsNoPassword) {
   const std::string top =
       "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\n"
@@ -197,6 +208,8 @@ class ScriptedExternal final : public ExternalIdentities {
     if (subject != "CN=A") return nullptr;
     return std::make_shared<Identity>(Identity{"CN=ALICE", 0x14, 0, ""});
   }
+  bool maps_certificates() const noexcept override { return maps; }
+  bool maps = true;
 };
 
 class External : public ::testing::Test {
@@ -234,6 +247,16 @@ TEST_F(External, UnderTlsItIsWhomTheCertificateIsMappedTo) {
   EXPECT_EQ(bound(facts, "u:alice"), "none");
   facts.certificate_subject = "CN=B";
   EXPECT_EQ(bound(facts), "none");
+}
+
+TEST_F(External, IsNotOfferedToCertificatesWhereNoneStandsForAnybody) {
+  identities_.maps = false;
+  TransportFacts facts;
+  facts.tls_version = "TLSv1.3";
+  facts.certificate_subject = "CN=A";
+  EXPECT_EQ(bound(facts), "not offered");
+  facts.peer_uid = 0;
+  EXPECT_EQ(bound(facts), "CN=ROOT");
 }
 
 TEST(ActingAs, IsForOneselfAlone) {

@@ -310,6 +310,12 @@ bool Identities::has_principals() const noexcept {
   return data_->has_principals;
 }
 
+bool Identities::maps_certificates() const noexcept {
+  return std::any_of(data_->by_subject.begin(), data_->by_subject.end(), [this](const auto& one) {
+    return data_->find_bindable(one.second) != nullptr;
+  });
+}
+
 bool Identities::still_valid(const Identity& bound) const noexcept {
   const Data& data = *data_;
   const IdentityRecord* const record = data.find_bindable(bound.bound_dn);

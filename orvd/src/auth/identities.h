@@ -92,6 +92,9 @@ class Identities {
   bool has_users() const noexcept;
   bool has_principals() const noexcept;
 
+  // Whether any certificate is mapped to somebody who can bind.
+  bool maps_certificates() const noexcept;
+
   // Whether what `bound` (of any snapshot) was granted still stands here: the same entry, bind DN,
   // flags, roles and stored password, the map of the certificate or the name that proved it, and it
   // may bind.

@@ -56,7 +56,8 @@ class External final : public SaslMechanism {
 
   std::string_view name() const noexcept override { return "EXTERNAL"; }
   bool offered(const TransportFacts& transport) const override {
-    return is_local_administrator(transport) || !transport.certificate_subject.empty();
+    return is_local_administrator(transport) ||
+           (!transport.certificate_subject.empty() && identities_.maps_certificates());
   }
   std::unique_ptr<SaslExchange> start(const TransportFacts& transport) const override {
     return std::make_unique<ExternalExchange>(identities_, transport);

@@ -20,6 +20,8 @@ class ExternalIdentities {
   virtual std::shared_ptr<const Identity> primary_administrator() = 0;
   // The identity that the subject (a normal form) is mapped to, or null. May read files.
   virtual std::shared_ptr<const Identity> of_certificate(std::string_view subject) = 0;
+  // Whether certificates stand for anybody, by what was read last. Must not block.
+  virtual bool maps_certificates() const noexcept { return true; }
 };
 
 std::unique_ptr<const SaslMechanism> make_external(ExternalIdentities& identities);
