@@ -495,6 +495,48 @@ TEST_F(TlsTest, NoticeOfDisconnectionComesThroughTls) {
   EXPECT_EQ(notice->tag, kNotice);
 }
 
+// However a connection ends, it no longer counts among those on which nobody is bound.
+TEST_F(TlsTest, EndsOfAllKindsMakeRoomForStrangers) {
+  settings.max_unauthenticated_connections = 1;
+  start();
+  const auto wait_until_gone = [&] {
+    const auto end = Clock::now() + 10s;
+    while (server->connections() > 0 && Clock::now() < end) std::this_thread::yield();
+  };
+  for (int i = 0; i < 3; ++i) {
+    {
+      WireClient halfway(secure_port());
+      halfway.send(std::string("\x16\x03\x01\x02\x00\x01", 6));
+      ::shutdown(halfway.descriptor(), SHUT_WR);
+      halfway.closed();
+    }
+    wait_until_gone();
+    {
+      WireClient false_one(secure_port());
+      false_one.send("GET / HTTP/1.0\r\n\r\n");
+      false_one.closed();
+    }
+    wait_until_gone();
+    {
+      WireClient asked(port());
+      ASSERT_EQ(start_tls(asked), 0) << i;
+    }
+    wait_until_gone();
+    {
+      TlsClient bound(port());
+      bind_as_root(bound);
+      ASSERT_EQ(start_tls(bound, 2), 0) << i;  // anonymous again
+      ASSERT_TRUE(bound.shake_hands());
+      EXPECT_EQ(code_of(bound, test::bind(3, kRoot, "wrong")), 49);
+      bind_as_root(bound);
+    }
+    wait_until_gone();
+  }
+  TlsClient last(secure_port());
+  ASSERT_TRUE(last.shake_hands());
+  EXPECT_EQ(code_of(last, test::search(1, "")), 0);
+}
+
 TEST_F(TlsTest, ServerStopsInTheMiddleOfHandshakes) {
   start();
   WireClient silent(secure_port());
