@@ -26,7 +26,8 @@ SLOW = 10 if programs.sanitized() else 1
 
 @pytest.fixture(scope="module", name="server")
 def server_fixture(module_instance):
-    module_instance.config.set(clients.BASE, "orv-slapdMaxMessageSize", str(16 << 20))
+    for limit in ("orv-slapdMaxMessageSize", "orv-slapdMaxUnauthenticatedMessageSize"):
+        module_instance.config.set(clients.BASE, limit, str(16 << 20))
     return module_instance.start()
 
 
@@ -482,6 +483,7 @@ def test_malformed_stored_passwords_never_match_and_take_no_time(instance):
         instance.config.add_member("stored%d" % position, stored, bind_dn="cn=stored%d" % position)
     instance.config.set(clients.BASE, "orv-slapdAdminGroupEnabled", "TRUE")
     instance.config.set("cn=pwdpolicy admin,cn=configuration", "pwdLockout", "FALSE")
+    instance.config.set(clients.BASE, "orv-slapdMaxUnauthenticatedMessageSize", str(1 << 20))
     instance.start()
     used = Stopwatch(instance)
     for position, stored in enumerate(STORED):

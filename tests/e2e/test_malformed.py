@@ -13,7 +13,7 @@ import time
 
 import pytest
 
-from orv_e2e import malformed, programs, wire
+from orv_e2e import clients, malformed, programs, wire
 from orv_e2e.programs import DEADLINE
 
 IN_CLEAR = int(os.environ.get("ORV_MALFORMED_MESSAGES", 2000 if programs.sanitized() else 13000))
@@ -39,6 +39,7 @@ def seed_fixture():
 
 @pytest.fixture(scope="module", name="server")
 def server_fixture(module_instance):
+    module_instance.config.set(clients.BASE, "orv-slapdMaxUnauthenticatedMessageSize", str(1 << 20))
     return module_instance.start()
 
 

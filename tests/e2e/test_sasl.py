@@ -267,6 +267,7 @@ def by_ticket(server, ticket, *more):
 
 @pytest.fixture
 def kerberized(instance, realm):
+    instance.config.set(clients.BASE, "orv-slapdMaxUnauthenticatedMessageSize", str(1 << 20))
     with_kerberos(instance, realm.keytab("ldap/localhost"))
     return instance.start(environment=realm.environment)
 

@@ -134,17 +134,6 @@ class NamedTests(Tree):
             ["README.md: there is no test test_x.py::test_two",
              "README.md: there is no test test_y.py::test_one"])
 
-    def test_missing_tests_of_security_are_found(self):
-        self.write("tests/e2e/test_x.py", "def test_one(root):\n")
-        self.write("tests/orvd/x_test.cpp", "TEST_F(Some, Case) {\nTEST(\n    Some, Other) {\n")
-        good = "`Some.Case`, `.Other`, `Some.*` `test_one` `orv-x` `file.cpp` `.hidden`"
-        self.assertEqual(check_named_tests.missing_of_security(self.top, good), [])
-        self.assertEqual(
-            check_named_tests.missing_of_security(
-                self.top, "`Some.Gone` `.Lost` `None.*` `test_two`"),
-            ["docs/security.md: there is no test " + name
-             for name in ("Some.Gone", "Some.Lost", "None.*", "test_two")])
-
     def test_rows_without_a_test_are_found(self):
         rows = "| add | roles | `test_x.py::test_one` |\n| delete | roles | `test_x.py` |\n"
         self.assertEqual(check_named_tests.unproved(self.HEAD + rows + "\n"),
