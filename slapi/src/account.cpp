@@ -4,18 +4,16 @@
 #include <pwd.h>
 
 #include <charconv>
-#include <optional>
+#include <system_error>
 
 namespace orv {
 namespace {
 
 // The largest number means "leave it as it is" to the system.
-std::optional<id_t> as_number(const std::string& text) {
-  id_t number = 0;
+bool read_number(const std::string& text, id_t& number) {
   const auto [end, status] = std::from_chars(text.data(), text.data() + text.size(), number);
-  if (status != std::errc() || end != text.data() + text.size()) return std::nullopt;
-  if (number == static_cast<id_t>(-1)) return std::nullopt;
-  return number;
+  return status == std::errc() && end == text.data() + text.size() &&
+         number != static_cast<id_t>(-1);
 }
 
 bool find_group(const std::string& group, gid_t& number, std::string& error) {
@@ -23,8 +21,9 @@ bool find_group(const std::string& group, gid_t& number, std::string& error) {
     number = found->gr_gid;
     return true;
   }
-  if (const std::optional<id_t> given = as_number(group)) {
-    number = *given;
+  id_t given = 0;
+  if (read_number(group, given)) {
+    number = given;
     return true;
   }
   error = "there is no group " + group + " on this host; make it (groupadd), or name another one";
@@ -36,9 +35,10 @@ bool find_group(const std::string& group, gid_t& number, std::string& error) {
 bool find_account(const std::string& user, const std::string& group, Account& account,
                   std::string& error) {
   const passwd* found = ::getpwnam(user.c_str());
-  const std::optional<id_t> number = found ? std::nullopt : as_number(user);
-  if (number) found = ::getpwuid(*number);
-  if (!found && !number) {
+  id_t number = 0;
+  const bool by_number = !found && read_number(user, number);
+  if (by_number) found = ::getpwuid(number);
+  if (!found && !by_number) {
     error = "there is no user " + user + " on this host; make it (useradd), or name another one";
     return false;
   }
@@ -46,7 +46,7 @@ bool find_account(const std::string& user, const std::string& group, Account& ac
     error = "the host knows no group of the user " + user + "; name one as well (--group)";
     return false;
   }
-  account = found ? Account{found->pw_uid, found->pw_gid, found->pw_name} : Account{*number, 0, ""};
+  account = found ? Account{found->pw_uid, found->pw_gid, found->pw_name} : Account{number, 0, ""};
   return group.empty() || find_group(group, account.group, error);
 }
 

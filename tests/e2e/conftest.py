@@ -4,6 +4,7 @@ import locale
 import os
 import pathlib
 import sys
+import tempfile
 
 import pytest
 
@@ -46,6 +47,14 @@ def module_instance(tmp_path_factory):
     made = Instance.create(tmp_path_factory.mktemp("shared") / "instance")
     yield made
     _finish(made)
+
+
+@pytest.fixture
+def open_folder():
+    """A folder that other users of the host can pass through: pytest closes those of tmp_path."""
+    with tempfile.TemporaryDirectory(prefix="orv-") as made:
+        os.chmod(made, 0o711)
+        yield pathlib.Path(made)
 
 
 @pytest.fixture(scope="session", autouse=True)

@@ -15,8 +15,8 @@ NO_RIGHTS = ["0" * 16]
 
 
 @pytest.fixture(name="owned")
-def owned_instance(tmp_path):
-    made = users.instance_of(tmp_path / "instance")
+def owned_instance(open_folder):
+    made = users.instance_of(open_folder / "instance")
     yield made
     made.stop()
 
@@ -73,8 +73,8 @@ def test_everything_works_as_that_user(owned):
 
 
 @users.needs_root
-def test_user_of_the_host_gets_its_groups(tmp_path):
-    made = users.instance_of(tmp_path / "instance", "nobody", "nogroup")
+def test_user_of_the_host_gets_its_groups(open_folder):
+    made = users.instance_of(open_folder / "instance", "nobody", "nogroup")
     made.start("--user", "nobody")
     found = users.status_of_threads(made.process.pid)[0]
     made.stop()
@@ -267,8 +267,8 @@ def test_file_that_is_opened_to_others_meanwhile_is_told_of(server):
 # ---- orvcfg init
 
 @users.needs_root
-def test_init_makes_an_instance_for_a_user(tmp_path):
-    made = users.instance_of(tmp_path / "instance")
+def test_init_makes_an_instance_for_a_user(open_folder):
+    made = users.instance_of(open_folder / "instance")
     for path in [made.directory, *made.directory.rglob("*")]:
         status = path.stat()
         assert (status.st_uid, status.st_gid) == (users.USER, users.GROUP)
@@ -284,27 +284,24 @@ def init_refused(folder, *options, wrapper=()):
 
 
 @users.needs_root
-def test_init_takes_no_folder_of_somebody_else(tmp_path):
-    users.open_way_to(tmp_path)
-    folder = tmp_path / "instance"
+def test_init_takes_no_folder_of_somebody_else(open_folder):
+    folder = open_folder / "instance"
     folder.mkdir(mode=0o755)
     assert "belongs to root; give it to" in init_refused(folder, *users.options())
     assert folder.stat().st_uid == 0 and not list(folder.iterdir())
 
 
 @users.needs_root
-def test_init_leaves_nothing_behind_when_the_user_cannot_get_there(tmp_path):
-    closed = tmp_path / "closed"
+def test_init_leaves_nothing_behind_when_the_user_cannot_get_there(open_folder):
+    closed = open_folder / "closed"
     closed.mkdir(mode=0o700)
-    users.open_way_to(tmp_path)
     assert "Permission denied" in init_refused(closed / "instance", *users.options())
     assert not list(closed.iterdir())
 
 
 @users.needs_root
-def test_init_for_another_user_needs_root(tmp_path):
-    users.open_way_to(tmp_path)
-    place = tmp_path / "place"
+def test_init_for_another_user_needs_root(open_folder):
+    place = open_folder / "place"
     place.mkdir()
     users.give(place)
     text = init_refused(place / "instance", "--user", "nobody", wrapper=as_user())

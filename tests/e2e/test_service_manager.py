@@ -118,8 +118,8 @@ def test_local_socket_alone_leaves_the_ports_to_the_configuration(instance, tmp_
 
 
 @users.needs_root
-def test_sockets_are_given_to_another_user(tmp_path):
-    made = users.instance_of(tmp_path / "instance")
+def test_sockets_are_given_to_another_user(open_folder):
+    made = users.instance_of(open_folder / "instance")
     with service.listening() as clear:
         wrapper, numbers = service.handing_over([clear], "ldap")
         made.start(*users.options(), wrapper=wrapper, descriptors=numbers)

@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstring>
 #include <utility>
 
 #include "slapi/account.h"
@@ -25,10 +26,18 @@ bool exists(const std::string& path) noexcept {
   return ::faccessat(AT_FDCWD, path.c_str(), F_OK, AT_EACCESS) == 0;
 }
 
+// Its owner can mend the mode; what belongs to another has to be given away.
+std::string advice(const std::string& path, const std::string& user) {
+  struct stat status {};
+  if (::stat(path.c_str(), &status) == 0 && status.st_uid == ::geteuid())
+    return "chmod u+rwX " + path;
+  return "give it to that user (chown " + user + " " + path + "), its folder too";
+}
+
 std::string complaint(const std::string& path, const char* access, const std::string& purpose) {
   const std::string user = user_name(::geteuid());
   return path + ": the server runs as " + user + ", which may not " + access + " it" + purpose +
-         "; give it to that user (chown " + user + " " + path + "), its folder too";
+         " (" + std::strerror(EACCES) + "); " + advice(path, user);
 }
 
 class Findings {

@@ -83,6 +83,8 @@ void clean_environment() noexcept {
       cfg::wipe(*from, std::strlen(*from));
   }
   if (to) *to = nullptr;
+  // The library that decodes messages would read files of whoever runs a client.
+  ::setenv("LDAPNOINIT", "1", 1);
 }
 
 void settle_process() noexcept {

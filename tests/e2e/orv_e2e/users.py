@@ -20,17 +20,8 @@ def options(user=USER, group=GROUP):
     return ["--user", str(user), "--group", str(group)]
 
 
-def open_way_to(folder):
-    """Lets everybody pass through the folders above, which pytest makes for their owner only."""
-    for parent in [folder, *folder.parents]:
-        status = parent.stat()
-        if status.st_uid == os.geteuid() and not status.st_mode & 0o001:
-            parent.chmod(status.st_mode | 0o011)
-
-
 def instance_of(folder, user=USER, group=GROUP):
-    """A fresh instance that belongs to that user."""
-    open_way_to(pathlib.Path(folder).parent)
+    """A fresh instance that belongs to that user, who has to be able to get there."""
     subprocess.run([programs.orvcfg(), "init", "--dir", folder, *options(user, group)], check=True,
                    stdout=subprocess.PIPE, timeout=programs.DEADLINE)
     return Instance(folder)
