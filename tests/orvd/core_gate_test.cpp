@@ -254,6 +254,7 @@ TEST_F(SharedGate, EachChangeInTurnIsOvertakenByABoundedNumber) {
     gate.leave();
     if (admitted.back() == "change") {
       ++changes;
+      EXPECT_GT(searches_in_between, 0) << "searches go first again before the next one";
       searches_in_between = 0;
     } else {
       ++searches_in_between;
