@@ -183,11 +183,22 @@ class CyrusTest : public ::testing::Test {
     std::string error;
     library = SaslLibrary::open(error).release();
     ASSERT_NE(library, nullptr) << error;
-    ASSERT_EQ(sasl_client_init(nullptr), SASL_OK);
+    // Other plug-ins than these do not give all their memory back.
+    static const sasl_callback_t only_these[] = {
+        {SASL_CB_VERIFYFILE,
+         reinterpret_cast<int (*)()>(reinterpret_cast<void (*)()>(&is_tested_plugin)), nullptr},
+        {SASL_CB_LIST_END, nullptr, nullptr}};
+    ASSERT_EQ(sasl_client_init(only_these), SASL_OK);
   }
   static void TearDownTestSuite() {
     sasl_client_done();
     delete library;
+  }
+  static int is_tested_plugin(void*, const char* file, sasl_verify_type_t) {
+    const std::string_view name(file);
+    const bool tested = name.find("libdigestmd5.") != std::string_view::npos ||
+                        name.find("libscram.") != std::string_view::npos;
+    return tested ? SASL_OK : SASL_CONTINUE;
   }
   CyrusTest() : sasl(*library, people, [this](std::string_view line) { reported = line; }) {
     sasl.add_mechanisms(mechanisms);

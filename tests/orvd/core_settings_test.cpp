@@ -181,6 +181,41 @@ TEST_F(SettingsTest, OfTlsThatAreNoneAreRefusedByName) {
   }
 }
 
+// ---- SASL
+
+TEST_F(SettingsTest, OfSaslAreReadWhereTheyBelong) {
+  const std::string digest =
+      "\ndn: cn=digest,cn=configuration\nobjectClass: orv-slapdDigest\ncn: digest\n"
+      "orv-slapdDigestRealm: The Realm\n";
+  const std::string file = configuration(
+      "", group("orv-slapdSaslMechanisms: external\norv-slapdSaslMechanisms: Digest-MD5\n"
+                "orv-slapdKrbKeytab: /k\n") +
+              digest);
+  ASSERT_TRUE(read_settings(file, "", settings, error)) << error;
+  EXPECT_EQ(settings.sasl, (SaslSettings{{"EXTERNAL", "DIGEST-MD5"}, "The Realm", "/k"}));
+  // Members may write to the entry at the top, which decides nothing.
+  const std::string top = configuration(
+      "orv-slapdSaslMechanisms: none\norv-slapdKrbKeytab: /x\norv-slapdDigestRealm: x\n");
+  ASSERT_TRUE(read_settings(top, "", settings, error)) << error;
+  EXPECT_EQ(settings.sasl, SaslSettings());
+}
+
+TEST_F(SettingsTest, OfSaslThatAreNoneAreRefusedByName) {
+  for (const std::string line : {"orv-slapdSaslMechanisms: PLAIN",
+                                 "orv-slapdSaslMechanisms: ", "orv-slapdKrbKeytab: relative"}) {
+    EXPECT_FALSE(read_settings(configuration("", group(line + "\n")), "", settings, error)) << line;
+    EXPECT_NE(error.find(line.substr(0, line.find(':'))), std::string::npos) << error;
+  }
+  for (const std::string& realm :
+       {std::string("a\"b"), std::string("a\\b"), std::string("\xc3\xa4"), std::string(256, 'x')}) {
+    const std::string digest =
+        "dn: cn=digest,cn=configuration\nobjectClass: orv-slapdDigest\ncn: digest\n"
+        "orv-slapdDigestRealm: ";
+    EXPECT_FALSE(read_settings(configuration("", digest + realm + "\n"), "", settings, error));
+    EXPECT_NE(error.find("orv-slapdDigestRealm"), std::string::npos) << error;
+  }
+}
+
 // ---- logs
 
 TEST_F(SettingsTest, LogsAreOpenedAgainWhenTheirFilesWereMovedAway) {

@@ -10,6 +10,7 @@
 #include <optional>
 #include <utility>
 
+#include "auth/digest_response.h"
 #include "auth/kerberos.h"
 #include "auth/sasl_callbacks.h"
 #include "cfg/secret.h"
@@ -249,6 +250,8 @@ class CyrusExchange final : public SaslExchange {
     if (++steps_ > kMostSteps) return SASL_BADPROT;
     if (credentials && credentials->size() > kLongestCredentials) return SASL_BADPROT;
     if (steps_ == 1 && insists_on_channel_binding(credentials)) return SASL_BADPROT;
+    if (steps_ > 1 && mechanism_ == kDigest && !is_digest_response(credentials.value_or("")))
+      return SASL_BADPROT;
     // Some mechanisms read their input as a text that ends.
     struct Copy {
       ~Copy() { cfg::wipe(text); }
