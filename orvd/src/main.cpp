@@ -427,6 +427,10 @@ void announce_controls() {
   if (g_srvType.load(std::memory_order_relaxed) == kServerWithoutControls) return;
   slapi_register_supported_control(kPersistentSearchOid, kEveryOperation);
   slapi_register_supported_control(kEntryChangeOid, kEveryOperation);
+  slapi_register_supported_control(kPagedResultsOid, kEveryOperation);
+  slapi_register_supported_control(kAssertionOid, kEveryOperation);
+  slapi_register_supported_control(kPreReadOid, kEveryOperation);
+  slapi_register_supported_control(kPostReadOid, kEveryOperation);
 }
 
 // ---- the life of the server
@@ -434,6 +438,7 @@ void announce_controls() {
 Publications publications() {
   ServerFacts facts;
   facts.naming_contexts = {"cn=configuration"};
+  facts.supported_extensions = {kWhoAmIOid, kCancelOid};
   facts.supported_features = {"1.3.6.1.4.1.4203.1.5.1"};  // all operational attributes, RFC 3673
   facts.restart_settings = restart_settings();
   facts.vendor_name = "orv";
@@ -444,6 +449,7 @@ Publications publications() {
   return {[facts](const Offer& offer) {
             ServerFacts shown = facts;
             shown.sasl_mechanisms = offer.sasl_mechanisms;
+            shown.controls_off = offer.controls_off;
             if (offer.start_tls) shown.supported_extensions.emplace_back(kStartTlsOid);
             return std::shared_ptr<const entry>(make_root_dse(shown));
           },

@@ -47,6 +47,8 @@ constexpr SettingRow kRows[] = {
     row("orv-slapdMaxPersistentSearches", &Settings::max_persistent_searches),
     row("orv-slapdMaxPersistentSearchesPerConnection",
         &Settings::max_persistent_searches_per_connection),
+    row("orv-slapdMaxPagedSearches", &Settings::max_paged_searches),
+    row("orv-slapdMaxPagedResultSize", &Settings::max_paged_result_size),
     row("orv-slapdMaxFailedChangeSize", &Settings::max_failed_change_size),
     row("orv-slapdSecurePort", &Settings::secure_port, true),
     row("orv-slapdMaxUnauthenticatedConnections", &Settings::max_unauthenticated_connections),

@@ -92,17 +92,6 @@ def test_unknown_extended_operation_is_refused_with_2(admin):
     assert clients.read(admin, clients.BASE)
 
 
-def test_whoami_is_not_offered_yet(admin):
-    with pytest.raises(ldap.PROTOCOL_ERROR):
-        admin.whoami_s()
-
-
-def test_ldapwhoami_reports_the_refusal(shared):
-    asked = clients.command("ldapwhoami", shared)
-    assert asked.returncode != 0
-    assert b"Protocol error (2)" in asked.stderr
-
-
 def test_refused_operations_are_not_announced(stranger):
     root_dse = stranger.search_s("", ldap.SCOPE_BASE, attrlist=["*", "+"])[0][1]
     assert b"1.3.6.1.4.1.4203.1.11.1" not in root_dse["supportedExtension"]

@@ -573,12 +573,12 @@ TEST_F(PersistentWire, TheBoundsHold) {
   EXPECT_TRUE(taken(three, 11));
 }
 
-TEST_F(PersistentWire, NoneAreAllowedWhenTheyAreSwitchedOff) {
+TEST_F(PersistentWire, AreNotOfferedWhenTheyAreSwitchedOff) {
   settings.max_persistent_searches = 0;
   start();
   WireClient client(port());
   bind_as_root(client);
-  EXPECT_EQ(code_of(client, persistent_search(7)), 53);
+  EXPECT_EQ(code_of(client, persistent_search(7)), 12);
 }
 
 // The listener reads nothing until the end: what waits for it is bounded, and it is told so. The

@@ -205,6 +205,7 @@ std::optional<Reply> WireClient::receive() {
   reply.id = number(id.content);
   reply.tag = operation.tag;
   reply.body = operation.content;
+  reply.controls = whole.content.substr(id.length + operation.length);
   if (reply.tag != 0x64) reply.code = number(element(operation.content).content);
   received_.erase(0, whole.length);
   return reply;

@@ -34,6 +34,7 @@ struct Reply {
   int tag = 0;
   int code = -1;
   std::string body;
+  std::string controls;  // the list of them with its tag; "": none
 };
 
 class WireClient {

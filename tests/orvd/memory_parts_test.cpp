@@ -17,6 +17,8 @@
 #include "auth/sasl_external.h"
 #include "core_bare_session.h"
 #include "ops/canonical.h"
+#include "ops/paged_results.h"
+#include "protocol/control_values.h"
 #include "protocol/decoder.h"
 #include "protocol/encoder.h"
 #include "publish/match.h"
@@ -248,6 +250,35 @@ TEST_F(MemoryOfABind, WantOfItWhileTheFileIsReadIsMadeGoodAfterAPauseAndToldOnce
   EXPECT_EQ(told, 1);
 }
 
+// ---- searches in pages
+
+using MemoryOfPages = WithSchema;
+
+TEST_F(MemoryOfPages, SearchThatCannotBeKeptIsNotCounted) {
+  Answer answer(1, tag::search_done, {});
+  const EntryPtr e = make_entry("cn=configuration");
+  for (int i = 0; i < 3; ++i) answer.entry(*e, nullptr, false, nullptr);
+  answer.result(0, "", "");
+  const std::string messages = answer.bytes();
+  KeptMeter meter;
+  bool kept = false;
+  fail_each([&](bool hit) { EXPECT_EQ(kept, !hit); },
+            [&] {
+              PagedSearches searches(meter);
+              kept = false;
+              try {
+                std::string copy = messages;
+                std::string cookie;
+                kept = searches.keep(std::string(200, 'k'), FoundEntries(copy, 3, 0), {4, 1 << 20},
+                                     cookie) == PagedSearches::Kept::yes;
+              } catch (const std::bad_alloc&) {
+                EXPECT_EQ(searches.size(), 0U);
+                EXPECT_EQ(meter.bytes(), 0U);
+              }
+            });
+  EXPECT_EQ(meter.bytes(), 0U);
+}
+
 // ---- the session
 
 class MemoryOfASession : public test::BareSessionTest,
@@ -257,6 +288,8 @@ class MemoryOfASession : public test::BareSessionTest,
   MemoryOfASession() {
     mechanisms_.push_back(make_external(*this));
     services.mechanisms = &mechanisms_;
+    services.supported_controls = {"2.16.840.1.113730.3.4.2", kPagedResultsOid, kAssertionOid,
+                                   kPreReadOid, kPostReadOid};
   }
   std::shared_ptr<const Identity> primary_administrator() override {
     return std::make_shared<Identity>(Identity{"CN=ROOT", 0x0C, 0, ""});
@@ -285,7 +318,17 @@ class MemoryOfASession : public test::BareSessionTest,
 
 // A client is answered or its connection ends; its socket's side ends it when `handle` throws.
 TEST_P(MemoryOfASession, AnswersOrEnds) {
-  backend.on_search = [](pblock* parameters) { return test::finish_search(parameters, 0, 0); };
+  const EntryPtr found = test::make_test_entry("CN=CONFIGURATION", 400);
+  backend.on_search = [&](pblock* parameters) {
+    int code = 0;
+    for (int i = 0; i < 3 && code == 0; ++i) code = test::send_test_entry(parameters, *found);
+    return test::finish_search(parameters, code, 3);
+  };
+  backend.on_change = [](pblock* parameters) {
+    send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 0, nullptr,
+                     "");
+    return 0;
+  };
   for (const bool bound : {false, true}) {
     for (long n = 1;; ++n) {
       SCOPED_TRACE("allocation " + std::to_string(n) + (bound ? ", bound" : ", anonymous"));
@@ -310,8 +353,32 @@ TEST_P(MemoryOfASession, AnswersOrEnds) {
   }
 }
 
+std::string with_controls(const std::string& request, const std::string& controls) {
+  return test::message(2, operation_in(request), controls);
+}
+
+std::string control(const char* oid, const std::string& value) {
+  return tlv(0x30, tlv(0x04, oid) + tlv(0x01, "\xFF") + tlv(0x04, value));
+}
+
 std::vector<std::string> messages() {
-  return {test::bind(2, test::kRoot, test::kSecret),
+  const std::string asserted = control(
+      kAssertionOid, tlv(0xA3, tlv(0x04, "cn") + tlv(0x04, "a value that is longer than others")));
+  const std::string names = tlv(0x30, tlv(0x04, "a requested attribute name") + tlv(0x04, "*"));
+  const std::string page = control(kPagedResultsOid, tlv(0x30, test::integer(1) + tlv(0x04, "")));
+  const std::string next =
+      control(kPagedResultsOid, tlv(0x30, test::integer(1) + tlv(0x04, "a cookie of nobody's")));
+  return {test::extended(2, kWhoAmIOid),
+          test::message(
+              2, tlv(0x77, tlv(0x80, kCancelOid) + tlv(0x81, tlv(0x30, test::integer(1234567))))),
+          with_controls(test::search(2, test::kTop, 2), page + asserted),
+          with_controls(test::search(2, test::kTop, 2), next),
+          with_controls(test::delete_entry(2, test::kTop), asserted + control(kPreReadOid, names)),
+          with_controls(test::modify(2, test::kTop, "description", "a value that is not short"),
+                        asserted + control(kPreReadOid, names) + control(kPostReadOid, names)),
+          with_controls(test::add_entry(2, "cn=x,cn=configuration", "cn", "x"),
+                        asserted + control(kPostReadOid, names)),
+          test::bind(2, test::kRoot, test::kSecret),
           test::bind(2, "cn=somebody,cn=configuration", "a password that is not short"),
           test::sasl_bind(2, "EXTERNAL", "dn:cn=root"),
           test::sasl_bind(2, "EXTERNAL"),

@@ -48,6 +48,7 @@ enum Code : int {
   no_such_operation = 119,
   too_late = 120,
   cannot_cancel = 121,
+  assertion_failed = 122,  // RFC 4528
 };
 
 }  // namespace orv::result

@@ -48,6 +48,8 @@ inline constexpr SettingRange kSettingRanges[] = {
     {"orv-slapdMessageTimeOut", 1, setting_bounds::seconds},
     {"orv-slapdMaxPersistentSearches", 0, setting_bounds::count},
     {"orv-slapdMaxPersistentSearchesPerConnection", 1, setting_bounds::count},
+    {"orv-slapdMaxPagedSearches", 0, setting_bounds::count},
+    {"orv-slapdMaxPagedResultSize", 1024, setting_bounds::bytes},
     {"orv-slapdSecurePort", 0, 65535},
     {"orv-slapdMaxUnauthenticatedConnections", 1, setting_bounds::count},
     {"orv-slapdUnauthenticatedTimeOut", 0, setting_bounds::seconds},

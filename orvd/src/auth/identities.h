@@ -44,6 +44,7 @@ struct Identity {
   std::string certificate_subject{};  // normal form; of whom a certificate has proved to be it
   std::string user_name{};            // by which a SASL mechanism with passwords has proved it
   std::string principal{};            // in lower case; by which Kerberos has proved it
+  std::string shown_dn{};             // the bind DN as the file spells it; "": as above
 };
 
 // Role bits of a list of orv-slapdAdminRole values; 0 when "NoAdmin" is among them.

@@ -193,7 +193,8 @@ class RecordReader {
     const std::string& entry_dn = record.identity.entry_dn;
     if (bound.empty()) {
       warn(entry_dn, std::string("has no ") + kind.dn_type + " and defines nobody");
-    } else if (!normalize_from_file(bound.c_str(), record.identity.bound_dn)) {
+    } else if (!normalize_from_file(bound.c_str(), record.identity.bound_dn) ||
+               !to_utf8(bound.c_str(), record.identity.shown_dn)) {
       warn(entry_dn, std::string(kind.dn_type) + " is not a DN");
     } else if (!may_be_bound(record.identity.bound_dn)) {
       warn(entry_dn, std::string(kind.dn_type) +

@@ -14,6 +14,7 @@
 #include "cfg/result_codes.h"
 #include "ops/log_text.h"
 #include "ops/wiped_request.h"
+#include "protocol/control_values.h"
 
 namespace orv::server {
 namespace {
@@ -428,21 +429,44 @@ void Client::resume() {
 
 namespace {
 
-// Whether whole messages among `bytes` abandon the operation or end the connection.
-bool gives_up(std::string_view bytes, std::int32_t message_id) {
+// What messages that have not had their turn say about an operation.
+struct Interest {
+  bool lost = false;             // they abandon it, or end the connection
+  std::int32_t canceled_by = 0;  // the message that cancels it; 0: none
+};
+
+bool has_critical(const Message& message) {
+  return std::any_of(message.controls.begin(), message.controls.end(),
+                     [](const Control& control) { return control.critical; });
+}
+
+// Looks at one message; one whose controls may forbid it is left to its turn.
+void look_at(const Message& message, std::int32_t operation, Interest& interest) {
+  if (std::holds_alternative<UnbindRequest>(message.request)) interest.lost = true;
+  if (has_critical(message)) return;
+  if (const auto* const abandon = std::get_if<AbandonRequest>(&message.request))
+    interest.lost = interest.lost || abandon->message_id == operation;
+  const auto* const extended = std::get_if<ExtendedRequest>(&message.request);
+  std::int32_t target = 0;
+  if (extended && extended->oid == kCancelOid && extended->value &&
+      read_cancel(*extended->value, target) == 0 && target == operation &&
+      message.id != operation && interest.canceled_by == 0)
+    interest.canceled_by = message.id;
+}
+
+// Looks at the whole messages among `bytes`, up to the first that settles it.
+Interest interest_in(std::int32_t operation, std::string_view bytes) {
   const DecoderLimits limits;
-  for (;;) {
+  Interest interest;
+  while (!interest.lost && interest.canceled_by == 0) {
     const Frame frame = next_frame(bytes, bytes.size());
-    if (frame.state != FrameState::complete) return false;
+    if (frame.state != FrameState::complete) break;
     WipedMessage message;
     const Decoded decoded = decode(bytes.substr(0, frame.length), limits, message);
-    if (decoded.state == DecodeState::decoded) {
-      const auto* const abandon = std::get_if<AbandonRequest>(&message.request);
-      if (abandon && abandon->message_id == message_id) return true;
-      if (std::holds_alternative<UnbindRequest>(message.request)) return true;
-    }
+    if (decoded.state == DecodeState::decoded) look_at(message, operation, interest);
     bytes.remove_prefix(frame.length);
   }
+  return interest;
 }
 
 }  // namespace
@@ -472,14 +496,15 @@ bool Client::lost_interest(PendingOperation& operation) noexcept {
   const std::int32_t id = operation.answer().message_id();
   try {
     // What came in one packet with the operation's own message was read along with it.
-    if (gives_up(unread(), id) || (length > 0 && gives_up({bytes, length}, id))) {
-      operation.answer().abandon();
-    }
+    Interest interest = interest_in(id, unread());
+    if (!interest.lost && interest.canceled_by == 0) interest = interest_in(id, {bytes, length});
+    if (interest.lost) operation.answer().abandon();
+    if (interest.canceled_by != 0) cancel_ahead(operation, interest.canceled_by);
   } catch (const std::bad_alloc&) {
     // It is handled late, then.
   }
   cfg::wipe(bytes, sizeof bytes);
-  return operation.answer().abandoned();
+  return operation.answer().is_given_up();
 }
 
 // ---- writing

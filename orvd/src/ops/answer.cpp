@@ -29,7 +29,7 @@ bool Answer::append(const orv::entry& e, bool types_only, LDAPControl** controls
 
 int Answer::entry(const orv::entry& e, char** attributes, bool types_only,
                   LDAPControl** controls) noexcept {
-  if (abandoned() || answered_) return result::other;
+  if (is_given_up() || answered_) return result::other;
   if (limits_.entries > 0 && entries_ >= limits_.entries) return result::size_limit_exceeded;
   if (limits_.deadline != Clock::time_point::max() && Clock::now() >= limits_.deadline)
     return result::time_limit_exceeded;
@@ -62,6 +62,7 @@ void Answer::result(const ResultAnswer& answer) noexcept {
     complete.code = result::unavailable;
     complete.text = "server is stopping";
   }
+  if (canceled() && response_tag_ == tag::search_done) replace_by_canceled(complete);
   code_ = complete.code;
   if (open_ && complete.code == result::success) {
     answered_ = true;
@@ -69,6 +70,22 @@ void Answer::result(const ResultAnswer& answer) noexcept {
   }
   // Unanswered when it cannot be encoded: the server then tries again with less.
   answered_ = encode_result(bytes_, complete);
+}
+
+void Answer::replace_by_canceled(ResultAnswer& answer) noexcept {
+  bytes_.clear();
+  entries_ = 0;
+  answer.code = result::canceled;
+  answer.matched_dn = {};
+  answer.text = {};
+}
+
+bool Answer::attach_to_result(const std::vector<Control>& controls) noexcept {
+  if (!answered_ || controls.empty()) return true;
+  std::string with;
+  if (!encode_again(with, bytes_, message_id_, &controls)) return false;
+  bytes_.swap(with);
+  return true;
 }
 
 namespace {

@@ -2,7 +2,8 @@
 // filled by the send operations that a backend calls through the `Connection`.
 //
 // Sending never blocks: it appends here, and the connection drains the buffer later. Threads: the
-// buffer belongs to the thread that runs the operation; only `abandon` may be called from others.
+// buffer belongs to the thread that runs the operation; only `abandon` and `cancel` may be called
+// from others.
 #pragma once
 
 #include <atomic>
@@ -10,6 +11,7 @@
 #include <cstdint>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "ops/gate.h"
 #include "protocol/encoder.h"
@@ -60,6 +62,17 @@ class Answer {
   void abandon() noexcept { abandoned_.store(true, std::memory_order_relaxed); }
   bool abandoned() const noexcept { return abandoned_.load(std::memory_order_relaxed); }
 
+  // The client canceled the operation (RFC 3909) while somebody had it in hand: a search ends with
+  // 118 and shows nothing of what it found; a change does when it has not begun. Any thread.
+  void cancel() noexcept { canceled_.store(true, std::memory_order_relaxed); }
+  bool canceled() const noexcept { return canceled_.load(std::memory_order_relaxed); }
+  // Nobody waits for what is still to be found.
+  bool is_given_up() const noexcept { return abandoned() || canceled(); }
+
+  // Adds controls to the successful result of an operation without entries. False without memory:
+  // it stays as it was.
+  bool attach_to_result(const std::vector<Control>& controls) noexcept;
+
   // The search is cut off because the server stops: its result is then 52, whatever limit the
   // backend took for the cause.
   void cut_off_by_stop() noexcept { cut_off_ = true; }
@@ -78,6 +91,7 @@ class Answer {
  private:
   bool select(char** attributes) noexcept;
   bool append(const orv::entry& e, bool types_only, LDAPControl** controls) noexcept;
+  void replace_by_canceled(ResultAnswer& answer) noexcept;
 
   const std::int32_t message_id_;
   const int response_tag_;
@@ -94,6 +108,7 @@ class Answer {
   char** selected_list_ = nullptr;
   AttributeSelection selection_;
   std::atomic<bool> abandoned_{false};
+  std::atomic<bool> canceled_{false};
 };
 
 // Installs the send operations in a connection. They reach the answer through `Operation::server`,

@@ -91,11 +91,7 @@ Refusal PendingOperation::prepare_search(Services& services, SearchRequest& requ
                                          std::string_view normal_dn) {
   begin(services, parameter::search_function, normal_dn);
   long_running_ = request.scope != 0;
-  // Who may not see an attribute must not learn it by asking for its value.
-  const bool sees_all = operation_.authority == authority::primary_administrator;
-  filter_ = malloc_text(
-      rewrite_filter(services.schema, request.filter,
-                     sees_all ? FilterUse::evaluate : FilterUse::evaluate_for_administrators));
+  filter_ = malloc_text(filter_for(services.schema, request.filter, operation_.authority));
   names_ = canonical_names(services.schema, request.attributes);
   scope_ = request.scope;
   wants_worker_ = long_running_ && services.search_cost.may_be_long(request.filter.size());
@@ -142,6 +138,31 @@ Refusal PendingOperation::prepare(Services& services, const ModifyRequest& reque
   }
   if (!services.guards || form == ListForm::as_sent) return {};
   return guarded_modification(normal_dn, first);
+}
+
+Refusal PendingOperation::prepare_controls(Services& services, const RequestControls& controls) {
+  constexpr const char* kEverything = "(objectClass=*)";
+  const bool may_read = may_search(operation_.authority);
+  const auto search = [&](std::string_view filter, const std::vector<std::string>& attributes) {
+    return std::make_unique<SideSearch>(services, home_->connection(), operation_, dn_.get(),
+                                        filter, attributes, answer_.limits().bytes);
+  };
+  const auto read = [&](const std::optional<ReadWish>& wish, std::unique_ptr<SideSearch>& made) {
+    if (!wish) return true;
+    if (may_read) made = search(kEverything, wish->attributes);
+    return may_read || !wish->critical;
+  };
+  if (controls.assertion && handler_ == parameter::add_function) {
+    // There is no other entry that it could mean.
+    if (!fulfils(services.schema, *entry_, *controls.assertion, operation_.authority))
+      return {result::assertion_failed, ""};
+  } else if (controls.assertion) {
+    if (!may_read) return {result::assertion_failed, ""};
+    assertion_ = search(*controls.assertion, {"1.1"});
+  }
+  if (!read(controls.pre_read, pre_read_) || !read(controls.post_read, post_read_))
+    return {result::unavailable_critical_extension, "the bound identity may not read entries"};
+  return {};
 }
 
 // What all connections may keep bounds each answer. Without room there is no search; a change is
@@ -265,21 +286,59 @@ void PendingOperation::settle_change(Services& services, int code) noexcept {
   take_over(services, code);
 }
 
+bool PendingOperation::may_begin(Services& services) noexcept {
+  if (answer_.abandoned()) return false;
+  if (answer_.canceled()) {
+    answer_.result(result::canceled, "", "");
+    return false;
+  }
+  return rights_hold(services) && take_budget(services) && may_fail(services) && has_reserves();
+}
+
+// Keeps what a search for a copy of the entry has found. False without memory.
+bool PendingOperation::take_copy(SideSearch& search, const char* oid) noexcept {
+  try {
+    copies_.push_back({oid, false, search.shown_entry()});
+    return true;
+  } catch (...) {
+    return false;
+  }
+}
+
+// What is to be known before the operation itself, by the state of the file that it will find: the
+// gate is held from here to its end. A failure is its result.
+bool PendingOperation::conditions_hold(Services& services) noexcept {
+  int code = assertion_ ? assertion_->run(services.backend) : 0;
+  if (code == 0 && assertion_ && !assertion_->found()) code = result::assertion_failed;
+  if (code == 0 && pre_read_) code = pre_read_->run(services.backend);
+  if (code == 0 && pre_read_ && !take_copy(*pre_read_, kPreReadOid)) code = result::no_memory;
+  if (code == 0) return true;
+  answer_.result(code, "", "");
+  return false;
+}
+
+// The change is made, so nothing here can fail it any more: without a copy the result goes alone.
+// Whoever is not any more who they were sees a name and nothing else.
+void PendingOperation::copy_afterwards(Services& services) noexcept {
+  bool good = true;
+  if (post_read_) {
+    const bool same = services.authenticator.generation() == identity_generation ||
+                      (identity_ && services.authenticator.still_valid(*identity_));
+    const int code = same ? post_read_->run(services.backend) : 0;
+    good = code == 0 && take_copy(*post_read_, kPostReadOid);
+  }
+  if (!answer_.attach_to_result(copies_)) good = false;
+  if (!good) services.logs.error("a change was made, but a copy of its entry cannot be shown");
+}
+
 void PendingOperation::run(Services& services, bool on_home_thread) noexcept {
   PersistentSearches::Audience audience;
-  if (!answer_.abandoned() && rights_hold(services) && take_budget(services) &&
-      may_fail(services) && has_reserves()) {
+  if (may_begin(services)) {
     on_home_thread_ = on_home_thread;
     next_look_ = Clock::now() + kLookInterval;
     std::optional<cfg::InterruptScope> scope;
     if (!is_change()) scope.emplace(&PendingOperation::interrupted, this);
-    const int code = call(services);
-    if (is_change()) {
-      settle_change(services, code);
-      audience = changed(services, code);
-    } else {
-      learn_cost(services, code);
-    }
+    if (conditions_hold(services)) audience = perform(services);
     // A search that could not join would miss changes.
     if (persistent && !notice_of && answer_.code() == result::success &&
         !services.persistent_searches.join(persistent))
@@ -289,6 +348,18 @@ void PendingOperation::run(Services& services, bool on_home_thread) noexcept {
   }
   services.backend.leave_gate();
   services.persistent_searches.announce(std::move(audience));
+}
+
+PersistentSearches::Audience PendingOperation::perform(Services& services) noexcept {
+  const int code = call(services);
+  if (!is_change()) {
+    learn_cost(services, code);
+    return {};
+  }
+  settle_change(services, code);
+  PersistentSearches::Audience audience = changed(services, code);
+  if (code == result::success) copy_afterwards(services);
+  return audience;
 }
 
 void PendingOperation::learn_cost(Services& services, int code) noexcept {
@@ -304,7 +375,7 @@ bool PendingOperation::interrupted(void* self) noexcept {
 // Called for each entry that a search looks at.
 bool PendingOperation::must_stop() noexcept {
   ++looked_at_;
-  if (answer_.abandoned()) return true;
+  if (answer_.is_given_up()) return true;
   if (stopping_->load(std::memory_order_relaxed)) {
     answer_.cut_off_by_stop();
     return true;

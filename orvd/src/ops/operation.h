@@ -16,9 +16,11 @@
 #include "ops/answer.h"
 #include "ops/canonical.h"
 #include "ops/consequences.h"
+#include "ops/controls.h"
 #include "ops/gate.h"
 #include "ops/persistent_search.h"
 #include "ops/services.h"
+#include "ops/side_search.h"
 
 namespace orv::server {
 
@@ -66,6 +68,11 @@ class PendingOperation final : public GateWaiter,
   Refusal prepare(Services& services, const DeleteRequest& request, std::string_view normal_dn);
   Refusal prepare(Services& services, const ModifyRequest& request, std::string_view normal_dn);
 
+  // Takes over the controls that have to do with the target's entry: assertion, pre-read and
+  // post-read. After prepare, which it may follow with a refusal: 12 an entry that the client may
+  // not read, 122 an assertion that cannot be true.
+  Refusal prepare_controls(Services& services, const RequestControls& controls);
+
   // Calls the handler and makes sure that there is a result. The caller holds the gate, which is
   // open or passed on afterwards. `on_home_thread`: the connection's thread runs it.
   void run(Services& services, bool on_home_thread) noexcept;
@@ -108,6 +115,14 @@ class PendingOperation final : public GateWaiter,
   ChangePtr notice_of;
   std::optional<EntryChangeControl> change_control;
 
+  // The page that this search is to be answered with, and what all its pages have in common.
+  std::optional<PagedResultsControl> page;
+  std::string page_key;
+
+  // A Cancel operation that waits for the end of this one: its message id, 0 for none.
+  std::int32_t canceled_by = 0;
+  Clock::time_point cancel_received{};
+
   // Bytes of the answer that were added to the connection's output share.
   std::size_t charged() const noexcept { return charged_; }
 
@@ -127,6 +142,11 @@ class PendingOperation final : public GateWaiter,
   bool rights_hold(const Services& services) noexcept;
   bool may_fail(Services& services) noexcept;
   bool has_reserves() noexcept;
+  bool may_begin(Services& services) noexcept;
+  bool conditions_hold(Services& services) noexcept;
+  bool take_copy(SideSearch& search, const char* oid) noexcept;
+  void copy_afterwards(Services& services) noexcept;
+  PersistentSearches::Audience perform(Services& services) noexcept;
   int call(Services& services) noexcept;
   bool was_made(const Services& services, unsigned long made_before) const noexcept;
   void settle_change(Services& services, int code) noexcept;
@@ -156,6 +176,12 @@ class PendingOperation final : public GateWaiter,
   MallocText filter_;
   TextArray names_;
   EntryPtr entry_;
+
+  // What controls ask for; null: nothing. Copies of the entry go with a successful result.
+  std::unique_ptr<SideSearch> assertion_;
+  std::unique_ptr<SideSearch> pre_read_;
+  std::unique_ptr<SideSearch> post_read_;
+  std::vector<Control> copies_;
 
   // For the check of a running search.
   const std::atomic<bool>* stopping_ = nullptr;

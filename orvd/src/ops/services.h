@@ -20,6 +20,7 @@
 #include "ops/failed_changes.h"
 #include "ops/fair_queue.h"
 #include "ops/output_meter.h"
+#include "ops/paged_results.h"
 #include "ops/persistent_search.h"
 #include "ops/search_cost.h"
 #include "slapi/owners.h"
@@ -55,6 +56,7 @@ class Authenticator {
 struct Offer {
   std::vector<std::string> sasl_mechanisms;
   bool start_tls = false;
+  std::vector<std::string> controls_off{};  // known to the server, and switched off
 };
 
 // Entries of the server's own outside every backend; null without memory.
@@ -93,6 +95,7 @@ struct Services {
   unsigned long (*changes_made)() = nullptr;
   FailedChangesByName failed_changes{};
   PersistentSearches persistent_searches{};
+  KeptMeter kept_pages{};
   AuditLog* audit = nullptr;                   // null: changes are not recorded
   const SaslMechanisms* mechanisms = nullptr;  // null: none
   // For binds over Unix sockets, in the place of `verifiers`, so that no stranger keeps out who

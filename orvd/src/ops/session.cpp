@@ -69,16 +69,14 @@ bool has_no_access(unsigned authority) {
   return authority == authority::no_configuration_access;
 }
 
-bool may_search(unsigned authority) {
-  // A server of kind 3 has another rule first, which the backend applies.
-  if (g_srvType.load(std::memory_order_relaxed) == 3) return true;
-  return !has_no_access(authority) && (authority & 3) == 0;
-}
-
 }  // namespace
 
 Session::Session(Services& services, AccessLane& access, std::uint64_t number)
-    : services_(services), access_(access), number_(number), output_(services.output) {
+    : services_(services),
+      access_(access),
+      number_(number),
+      output_(services.output),
+      pages_(services.kept_pages) {
   connection_.aux = &aux_;
   connection_.server = this;
   install_senders(connection_);
@@ -111,16 +109,18 @@ void Session::take(Message& message) {
   Request& request = message.request;
   if (std::holds_alternative<UnbindRequest>(request)) return drop();
   // RFC 4511, 4.1.1.1: answers could not be told apart.
-  if (outstanding(id) || persistent_search(id)) {
+  if (is_in_use(id)) {
     audit_refused(message, result::protocol_error);
     return disconnect(result::protocol_error, "message ID is in use");
   }
-  if (const auto* given_up = std::get_if<AbandonRequest>(&request))
-    return abandon(given_up->message_id);
+  RequestControls controls;
+  Refusal refusal = read_controls(message, controls);
+  if (const auto* given_up = std::get_if<AbandonRequest>(&request)) {
+    if (!refusal) abandon(given_up->message_id);  // it has no answer
+    return;
+  }
   if (!identity_holds()) return audit_refused(message, result::stronger_auth_required);
   const int answer_tag = response_tag(request);
-  PersistentWish wish;
-  Refusal refusal = read_controls(message, wish);
   if (auto* bind = std::get_if<BindRequest>(&request))
     return receive_bind(id, *bind, std::move(refusal));
   // RFC 4511, 4.2.1: nothing may come between the steps of a bind.
@@ -130,18 +130,34 @@ void Session::take(Message& message) {
     audit_refused(message, refusal.code);
     return respond(id, answer_tag, refusal.code, refusal.text, described(request));
   }
-  if (auto* wanted = std::get_if<SearchRequest>(&request)) return search(id, *wanted, wish);
-  if (const auto* wanted = std::get_if<AddRequest>(&request)) return change(id, *wanted);
-  if (const auto* wanted = std::get_if<DeleteRequest>(&request)) return change(id, *wanted);
-  if (const auto* wanted = std::get_if<ModifyRequest>(&request)) return change(id, *wanted);
-  if (const auto* wanted = std::get_if<ExtendedRequest>(&request);
-      wanted && wanted->oid == kStartTlsOid)
-    return begin_tls(id, *wanted);
-  if (std::holds_alternative<ExtendedRequest>(request))
-    return respond(id, answer_tag, result::protocol_error, "extended operation not supported",
-                   described(request));
+  if (auto* wanted = std::get_if<SearchRequest>(&request)) return search(id, *wanted, controls);
+  if (const auto* wanted = std::get_if<AddRequest>(&request)) return change(id, *wanted, controls);
+  if (const auto* wanted = std::get_if<DeleteRequest>(&request))
+    return change(id, *wanted, controls);
+  if (const auto* wanted = std::get_if<ModifyRequest>(&request))
+    return change(id, *wanted, controls);
+  if (const auto* wanted = std::get_if<ExtendedRequest>(&request)) return extended(id, *wanted);
   audit_refused(message, result::unwilling_to_perform);
   respond(id, answer_tag, result::unwilling_to_perform, kNotOffered, described(request));
+}
+
+Refusal Session::read_controls(const Message& message, RequestControls& controls) const {
+  if (message.controls.empty()) return {};
+  std::vector<std::string> offered = services_.supported_controls;
+  std::erase_if(offered, [this](const std::string& oid) { return is_switched_off(oid); });
+  return server::read_controls(message, offered, decoder_limits(settings()), controls);
+}
+
+bool Session::is_switched_off(std::string_view control) const noexcept {
+  if (control == kPagedResultsOid) return settings().max_paged_searches == 0;
+  const bool persistent = control == kPersistentSearchOid || control == kEntryChangeOid;
+  return persistent && settings().max_persistent_searches == 0;
+}
+
+// Also that of a Cancel operation that has not been answered yet.
+bool Session::is_in_use(std::int32_t message_id) const noexcept {
+  return outstanding(message_id) || persistent_search(message_id) ||
+         is_being_canceled_by(message_id);
 }
 
 std::string Session::described(const Request& request) const {
@@ -167,51 +183,79 @@ Session::Target Session::find_target(std::string_view dn, std::string& normal) c
 
 // ---- search
 
-void Session::search(std::int32_t id, SearchRequest& request, const PersistentWish& wish) {
+void Session::search(std::int32_t id, SearchRequest& request, const RequestControls& controls) {
+  const PersistentWish& wish = controls.persistent;
   std::string normal;
   const Target target = find_target(request.base, normal);
   if (wish.critical && (target == Target::root_dse || target == Target::subschema))
     return respond(id, tag::search_done, result::unavailable_critical_extension,
                    "persistent searches are for the configuration", described(request));
   if (target == Target::root_dse && request.scope == 0)
-    return search_published(id, request, services_.publications.root_dse(offer()));
+    return search_published(id, request, controls, services_.publications.root_dse(offer()));
   if (target == Target::subschema)
-    return search_published(id, request, services_.publications.subschema());
+    return search_published(id, request, controls, services_.publications.subschema());
+  if (controls.paged && !controls.paged->cookie.empty() && target == Target::configuration &&
+      may_search(connection_.authority))
+    return next_page(id, request, normal, *controls.paged);
 
   const OperationPtr operation =
       make_operation(id, tag::search_done, stricter(settings().time_limit, request.time_limit),
                      stricter(settings().size_limit, request.size_limit));
   if (services_.logs.access_enabled())
-    operation->log_text = describe_search(services_.schema, request, normal);
+    operation->log_text =
+        describe_search(services_.schema, request, normal) + describe_controls(controls);
   if (target == Target::not_a_dn)
     return submit(operation, {result::invalid_dn_syntax, "the base object is not a DN"});
   if (target != Target::configuration) return submit(operation, {result::no_such_object, ""});
   if (!may_search(connection_.authority))
     return submit(operation, {result::insufficient_access, ""});
-  if (!wish.wanted) return submit(operation, operation->prepare_search(services_, request, normal));
+  if (controls.paged) prepare_pages(*operation, request, normal, *controls.paged);
+  if (!wish.wanted) return submit_search(operation, request, normal, controls);
   if (services_.logs.access_enabled()) operation->log_text += " persistent";
   if (Refusal refusal = begin_persistent(*operation, wish.control, request, normal))
     return submit(operation, refusal);
   SearchRequest first_part = wish.control.changes_only ? probe(request) : request;
-  submit(operation, operation->prepare_search(services_, first_part, normal));
+  submit_search(operation, first_part, normal, controls);
+}
+
+void Session::submit_search(const OperationPtr& operation, SearchRequest& request,
+                            std::string_view normal_base, const RequestControls& controls) {
+  Refusal refusal = operation->prepare_search(services_, request, normal_base);
+  if (!refusal) refusal = operation->prepare_controls(services_, controls);
+  submit(operation, refusal);
 }
 
 void Session::search_published(std::int32_t id, const SearchRequest& request,
+                               const RequestControls& controls,
                                const std::shared_ptr<const entry>& published) {
   Answer answer(id, tag::search_done, {});
   const Clock::time_point started = Clock::now();
   int code = published ? result::success : result::no_memory;
+  // RFC 4528, 3: tested on the base, before anything is looked for.
+  if (published && controls.assertion && !entry_matches(*published, *controls.assertion))
+    code = result::assertion_failed;
+  // One entry never needs a second page, so no cookie was ever given out for it.
+  if (controls.paged && !controls.paged->cookie.empty()) code = result::unwilling_to_perform;
+  const bool shown = !controls.paged || controls.paged->size > 0;
   // It has no children: only the searches that begin with the base itself find something.
-  if (published && request.scope != 1 && entry_matches(*published, request.filter)) {
+  if (code == 0 && shown && request.scope != 1 && entry_matches(*published, request.filter)) {
     const TextArray names = canonical_names(services_.schema, request.attributes);
     code = answer.entry(*published, names.get(), request.types_only, nullptr);
   }
-  answer.result(code, "", "");
+  std::vector<Control> page;
+  if (controls.paged && code == 0)
+    page.push_back(paged_results_answer(static_cast<std::int32_t>(answer.entries()), ""));
+  ResultAnswer result{};
+  result.code = code;
+  result.controls = &page;
+  answer.result(result);
   transmit_answer(answer);
   // Neither of the names that are published holds a password.
   if (services_.logs.access_enabled())
-    log_result(id, describe_search(services_.schema, request, kSubschemaNormalDn), answer.code(),
-               answer.entries(), started);
+    log_result(id,
+               describe_search(services_.schema, request, kSubschemaNormalDn) +
+                   describe_controls(controls),
+               answer.code(), answer.entries(), started);
 }
 
 // ---- changes
@@ -239,11 +283,12 @@ constexpr int tag_of(const ModifyRequest&) {
 }  // namespace
 
 template <typename ChangeRequest>
-void Session::change(std::int32_t id, const ChangeRequest& request) {
+void Session::change(std::int32_t id, const ChangeRequest& request,
+                     const RequestControls& controls) {
   Refusal refusal;
   OperationPtr operation;
   try {
-    operation = prepare_change(id, request, refusal);
+    operation = prepare_change(id, request, controls, refusal);
   } catch (...) {
     audit_attempt(id, request, result::no_memory);
     throw;
@@ -253,17 +298,19 @@ void Session::change(std::int32_t id, const ChangeRequest& request) {
 
 template <typename ChangeRequest>
 Session::OperationPtr Session::prepare_change(std::int32_t id, const ChangeRequest& request,
-                                              Refusal& refusal) {
+                                              const RequestControls& controls, Refusal& refusal) {
   const int answer_tag = tag_of(request);
   const std::string_view name = operation_name(answer_tag);
   std::string normal;
   refusal = refuse_change(find_target(request.dn, normal));
   OperationPtr operation = make_operation(id, answer_tag, 0, 0);
-  if (services_.logs.access_enabled()) operation->log_text = describe_dn(name, request.dn, normal);
+  if (services_.logs.access_enabled())
+    operation->log_text = describe_dn(name, request.dn, normal) + describe_controls(controls);
   prepare_audit(*operation, request);
   outstanding_.reserve(outstanding_.size() + 1);
   if (refusal) return operation;
   refusal = operation->prepare(services_, request, normal);
+  if (!refusal) refusal = operation->prepare_controls(services_, controls);
   if (refusal) tell(services_.logs, describe_dn(name, request.dn, normal), refusal);
   return operation;
 }
@@ -343,7 +390,7 @@ void Session::run_on_worker(const OperationPtr& operation) noexcept {
 
 // On a worker, inside the gate.
 void Session::work(const OperationPtr& operation) noexcept {
-  if (output_.full() && !operation->answer().abandoned()) {
+  if (output_.full() && !operation->answer().is_given_up()) {
     services_.backend.leave_gate();
     return hand_back(operation, Step::hold);
   }
@@ -436,11 +483,11 @@ void Session::complete(const OperationPtr& operation) {
   } const unestablished{services_.persistent_searches, operation->persistent};
   const Answer& answer = operation->answer();
   if (answer.code() == result::operations_error && services_.note_failure) services_.note_failure();
-  const int code = answer.abandoned() ? kAbandoned : answer.code();
-  deliver(*operation);  // what follows is done while the client reads
-  log_result(answer.message_id(), operation->log_text, code, answer.entries(),
+  const Delivered sent = deliver(*operation);  // what follows is done while the client reads
+  log_result(answer.message_id(), operation->log_text, sent.code, sent.entries,
              operation->started());
   if (operation->persistent) first_part_done(*operation);
+  if (operation->canceled_by != 0) finish_cancel(*operation);
   go_on();
 }
 
@@ -451,21 +498,27 @@ void Session::go_on() {
   settle_if_done();
 }
 
-void Session::deliver(PendingOperation& operation) {
+Session::Delivered Session::deliver(PendingOperation& operation) {
   struct Settle {
     ~Settle() { share.settled(bytes); }
     OutputShare& share;
     std::size_t bytes;
   } const settle{output_, operation.charged()};
-  if (gone_ || operation.answer().abandoned()) return;
+  Answer& answer = operation.answer();
+  if (answer.abandoned()) return {kAbandoned, answer.entries()};
+  if (gone_) return {answer.code(), answer.entries()};
+  if (operation.page && answer.answered() && (answer.code() == 0 || answer.entries() > 0))
+    return first_page(operation);
   output_.queued(operation.charged());
-  transmit_answer(operation.answer());
+  transmit_answer(answer);
+  return {answer.code(), answer.entries()};
 }
 
 // ---- waiting for the client to read
 
 void Session::hold(const OperationPtr& operation) {
   if (gone_ || operation->answer().abandoned()) return complete(operation);
+  if (operation->answer().canceled()) return answer_and_complete(operation, result::canceled, "");
   operation->held = true;
   ++held_;
   start_held_later();
@@ -575,6 +628,7 @@ void Session::client_left() noexcept {
   aux_.client_gone.store(1, std::memory_order_relaxed);
   count_as_unauthenticated(false);
   exchange_.reset();
+  pages_.forget_all();
   end_persistent_searches();
   for (std::size_t i = 0; i < outstanding_.size();) {
     const OperationPtr operation = outstanding_[i];
@@ -640,6 +694,8 @@ Offer Session::offer() const {
   if (services_.mechanisms)
     offer.sasl_mechanisms = offered_mechanisms(*services_.mechanisms, transport_);
   offer.start_tls = !transport_.encrypted() && can_start_tls();
+  for (const std::string& oid : services_.supported_controls)
+    if (is_switched_off(oid)) offer.controls_off.push_back(oid);
   return offer;
 }
 

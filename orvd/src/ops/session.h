@@ -18,7 +18,9 @@
 #include <vector>
 
 #include "auth/sasl.h"
+#include "ops/controls.h"
 #include "ops/operation.h"
+#include "ops/paged_results.h"
 #include "ops/services.h"
 #include "protocol/decoder.h"
 #include "protocol/message.h"
@@ -87,6 +89,9 @@ class Session : public OperationHome,
   // What the transport proves; before the first message, and when TLS stands.
   void set_transport(TransportFacts facts) { transport_ = std::move(facts); }
   const TransportFacts& transport() const noexcept { return transport_; }
+  // A search that runs on the connection's thread is canceled by a message that is here and has not
+  // had its turn yet. Throws std::bad_alloc.
+  void cancel_ahead(PendingOperation& operation, std::int32_t canceled_by);
   // Whether a bind in several steps has taken until `now` longer than it may.
   bool bind_is_overdue(Clock::time_point now) const noexcept;
   bool is_unauthenticated() const noexcept { return unauthenticated_; }
@@ -126,6 +131,16 @@ class Session : public OperationHome,
     std::uint64_t generation = 0;            // of the identities, not newer than what was asked
     std::atomic<bool> verified{false};
   };
+  // What became of an operation, for the log.
+  struct Delivered {
+    int code;
+    std::int64_t entries;
+  };
+  // A Cancel operation that took effect before its turn came to be handled.
+  struct CanceledAhead {
+    std::int32_t canceled_by;
+    std::int32_t target;
+  };
   using BindPtr = std::shared_ptr<Bind>;
   using OperationPtr = std::shared_ptr<PendingOperation>;
 
@@ -135,20 +150,21 @@ class Session : public OperationHome,
   std::string described(const Request& request) const;
   void abandon(std::int32_t message_id);
 
-  // A persistent search that a message asks for.
-  struct PersistentWish {
-    bool wanted = false;
-    bool critical = false;
-    PersistentSearchControl control;
-  };
-  Refusal read_controls(const Message& message, PersistentWish& wish) const;
+  // Reads the controls, and which of them are used here and now.
+  Refusal read_controls(const Message& message, RequestControls& controls) const;
+  bool is_switched_off(std::string_view control) const noexcept;
+  bool is_in_use(std::int32_t message_id) const noexcept;
 
-  void search(std::int32_t id, SearchRequest& request, const PersistentWish& wish);
+  void search(std::int32_t id, SearchRequest& request, const RequestControls& controls);
+  void submit_search(const OperationPtr& operation, SearchRequest& request,
+                     std::string_view normal_base, const RequestControls& controls);
   template <typename ChangeRequest>
-  void change(std::int32_t id, const ChangeRequest& request);
+  void change(std::int32_t id, const ChangeRequest& request, const RequestControls& controls);
   template <typename ChangeRequest>
-  OperationPtr prepare_change(std::int32_t id, const ChangeRequest& request, Refusal& refusal);
+  OperationPtr prepare_change(std::int32_t id, const ChangeRequest& request,
+                              const RequestControls& controls, Refusal& refusal);
   void search_published(std::int32_t id, const SearchRequest& request,
+                        const RequestControls& controls,
                         const std::shared_ptr<const entry>& published);
 
   enum class Target { root_dse, subschema, configuration, nothing, not_a_dn };
@@ -168,7 +184,7 @@ class Session : public OperationHome,
   void take_step_or_end(const OperationPtr& operation) noexcept;
   void complete(const OperationPtr& operation);
   void go_on();
-  void deliver(PendingOperation& operation);
+  Delivered deliver(PendingOperation& operation);
   void transmit_answer(Answer& answer);
   bool give_up(const OperationPtr& operation) noexcept;
   void hold(const OperationPtr& operation);
@@ -234,7 +250,23 @@ class Session : public OperationHome,
   void become(std::shared_ptr<const Identity> identity) noexcept;
   void count_as_unauthenticated(bool counted) noexcept;
 
-  // ---- extended operations that concern the connection
+  // ---- paged results, in session_pages.cpp
+  PagedSearches::Limits page_limits() const noexcept;
+  void prepare_pages(PendingOperation& operation, const SearchRequest& request,
+                     std::string_view normal_base, const PagedResultsControl& control);
+  void next_page(std::int32_t id, const SearchRequest& request, std::string_view normal_base,
+                 const PagedResultsControl& control);
+  Delivered first_page(PendingOperation& operation);
+  Delivered make_page(std::int32_t id, std::int64_t size, std::string key, FoundEntries found,
+                      std::string& out);
+
+  // ---- extended operations, in session_extended.cpp
+  void extended(std::int32_t id, const ExtendedRequest& request);
+  void who_am_i(std::int32_t id, const ExtendedRequest& request);
+  void cancel(std::int32_t id, const ExtendedRequest& request);
+  bool is_being_canceled_by(std::int32_t message_id) const noexcept;
+  bool was_canceled_ahead(std::int32_t id, std::int32_t target) noexcept;
+  void finish_cancel(const PendingOperation& operation);
   void begin_tls(std::int32_t id, const ExtendedRequest& request);
   Refusal refuse_tls(const ExtendedRequest& request) const;
   Offer offer() const;
@@ -260,6 +292,8 @@ class Session : public OperationHome,
   OperationPtr notice_;                          // that is being looked up
   bool notice_posted_ = false;
   BindPtr bind_;
+  PagedSearches pages_;
+  std::vector<CanceledAhead> canceled_ahead_;
   TransportFacts transport_;
   bool protected_ = false;                  // a security layer of SASL is in use
   std::unique_ptr<SaslExchange> exchange_;  // between two of its steps

@@ -261,6 +261,7 @@ std::string Session::describe_bind(const Bind& bind, const Identity* identity) {
 }
 
 void Session::become(std::shared_ptr<const Identity> identity) noexcept {
+  pages_.forget_all();  // somebody else's, or found under other rights
   identity_ = std::move(identity);
   connection_.authority = identity_ ? identity_->authority : authority::no_configuration_access;
   connection_.roles = identity_ ? identity_->roles : 0;

@@ -24,28 +24,6 @@ std::string_view reason(int code) {
 
 }  // namespace
 
-// ---- controls
-
-Refusal Session::read_controls(const Message& message, PersistentWish& wish) const {
-  const auto& known = services_.supported_controls;
-  for (const Control& control : message.controls) {
-    const bool supported = std::find(known.begin(), known.end(), control.oid) != known.end();
-    const bool persistent = supported && control.oid == kPersistentSearchOid;
-    const bool fits = !persistent || std::holds_alternative<SearchRequest>(message.request);
-    // The notification is a control of answers.
-    if (!supported || !fits || control.oid == kEntryChangeOid) {
-      if (!control.critical) continue;
-      return {result::unavailable_critical_extension, "critical control not supported"};
-    }
-    if (!persistent) continue;
-    if (wish.wanted || !control.value || !read_persistent_search(*control.value, wish.control))
-      return {result::protocol_error, "the persistent search control is not valid"};
-    wish.wanted = true;
-    wish.critical = control.critical;
-  }
-  return {};
-}
-
 // ---- beginning
 
 // Makes the operation the first part of a persistent search.
@@ -55,15 +33,10 @@ Refusal Session::begin_persistent(PendingOperation& operation,
   const auto first_parts =
       std::count_if(outstanding_.begin(), outstanding_.end(),
                     [](const OperationPtr& other) { return other->persistent != nullptr; });
-  if (settings().max_persistent_searches == 0)
-    return {result::unwilling_to_perform, "persistent searches are switched off"};
   if (static_cast<std::int64_t>(persistent_.size()) + first_parts >=
       settings().max_persistent_searches_per_connection)
     return {result::admin_limit_exceeded, "too many persistent searches on this connection"};
-  const bool sees_all = connection_.authority == authority::primary_administrator;
-  std::string filter =
-      rewrite_filter(services_.schema, request.filter,
-                     sees_all ? FilterUse::evaluate : FilterUse::evaluate_for_administrators);
+  std::string filter = filter_for(services_.schema, request.filter, connection_.authority);
   auto search = std::make_shared<PersistentSearch>(std::weak_ptr<ChangeListener>(weak_from_this()),
                                                    operation.answer().message_id(), control,
                                                    request, normal_base, std::move(filter));

@@ -74,6 +74,9 @@ class Writer {
   }
   void octets(unsigned char tag, std::string_view bytes) noexcept {
     header(tag, bytes.size());
+    copy(bytes);
+  }
+  void copy(std::string_view bytes) noexcept {
     if (bytes.empty()) return;
     std::memcpy(at_, bytes.data(), bytes.size());
     at_ += bytes.size();
@@ -272,6 +275,38 @@ void append_entry(std::string& out, std::int32_t message_id, const entry& e,
   close_envelope(writer, envelope, controls);
 }
 
+// ---- Messages that are encoded already
+
+// Takes the header of an element off the front of `rest`: its tag and the length of its contents,
+// which must be there.
+bool take_header(std::string_view& rest, unsigned char& tag, std::size_t& length) noexcept {
+  if (rest.size() < 2) return false;
+  tag = static_cast<unsigned char>(rest[0]);
+  length = static_cast<unsigned char>(rest[1]);
+  rest.remove_prefix(2);
+  if (length >= 0x80) {
+    const std::size_t octets = length & 0x7FU;
+    if (octets > sizeof length || octets > rest.size()) return false;
+    length = 0;
+    for (const char octet : rest.substr(0, octets))
+      length = length << 8 | static_cast<unsigned char>(octet);
+    rest.remove_prefix(octets);
+  }
+  return length <= rest.size();
+}
+
+void append_again(std::string& out, std::string_view message, std::int32_t message_id,
+                  const std::vector<Control>* controls) {
+  std::string_view contents = operation_in(message);
+  unsigned char tag = 0;
+  std::size_t length = 0;
+  if (!take_header(contents, tag, length)) throw std::bad_alloc();
+  const Envelope envelope{message_id, tag, length, controls_size(controls)};
+  Writer writer = open_envelope(out, envelope);
+  writer.copy(contents);
+  close_envelope(writer, envelope, controls);
+}
+
 // Room is made before the first octet is written, so a failure leaves `out` as it was.
 template <typename Append>
 bool without_memory_is_false(Append append) noexcept {
@@ -294,6 +329,22 @@ bool encode_entry(std::string& out, std::int32_t message_id, const entry& e,
                   LDAPControl** controls) noexcept {
   return without_memory_is_false(
       [&] { append_entry(out, message_id, e, selection, types_only, controls); });
+}
+
+std::string_view operation_in(std::string_view message) noexcept {
+  unsigned char tag = 0;
+  std::size_t length = 0;
+  if (!take_header(message, tag, length) || tag != universal::sequence) return {};
+  if (!take_header(message, tag, length) || tag != universal::integer) return {};
+  message.remove_prefix(length);
+  const std::string_view operation = message;
+  if (!take_header(message, tag, length)) return {};
+  return operation.substr(0, operation.size() - message.size() + length);
+}
+
+bool encode_again(std::string& out, std::string_view message, std::int32_t message_id,
+                  const std::vector<Control>* controls) noexcept {
+  return without_memory_is_false([&] { append_again(out, message, message_id, controls); });
 }
 
 bool encode_notice_of_disconnection(std::string& out, int code, std::string_view text) noexcept {

@@ -59,6 +59,13 @@ bool encode_entry(std::string& out, std::int32_t message_id, const entry& e,
                   const AttributeSelection& selection, bool types_only,
                   LDAPControl** controls) noexcept;
 
+// The element of the operation in one whole message that was encoded here; "" when it is none.
+std::string_view operation_in(std::string_view message) noexcept;
+
+// The same message under another id, with `controls` (null: none) in place of its own.
+bool encode_again(std::string& out, std::string_view message, std::int32_t message_id,
+                  const std::vector<Control>* controls) noexcept;
+
 // Notice of disconnection (RFC 4511, 4.4.1).
 bool encode_notice_of_disconnection(std::string& out, int code, std::string_view text) noexcept;
 

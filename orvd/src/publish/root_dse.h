@@ -23,9 +23,11 @@ struct ServerFacts {
   std::string vendor_name;
   std::string vendor_version;
   std::vector<std::string> restart_settings{};  // that take effect when the server starts
+  std::vector<std::string> controls_off{};      // OIDs of controls that are switched off
 };
 
-// Makes the entry; the supported controls are those registered so far. Null without memory.
+// Makes the entry; the supported controls are those registered so far, without those that are
+// switched off. Null without memory.
 EntryPtr make_root_dse(const ServerFacts& facts) noexcept;
 
 }  // namespace orv::server
