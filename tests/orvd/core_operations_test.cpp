@@ -450,6 +450,33 @@ TEST_F(CancelTest, MayMeetTheEndOfTheConnectionAtAnyTime) {
   EXPECT_TRUE(gone.wait());
 }
 
+// Whoever comes first: both are answered once, and the answers agree.
+TEST_F(CancelTest, RacingTheEndOfItsOperationIsAnsweredByWhatBecameOfIt) {
+  loops = 2;
+  entries = 20;
+  for (int i = 0; i < 300; ++i) {
+    const int scope = i % 3;
+    const bool change = i % 5 == 4;
+    client().send(change ? test::delete_entry(2, kTop) : test::search(2, kTop, scope));
+    if (i % 2 == 0) std::this_thread::yield();
+    client().send(cancel(3, 2));
+    int target = -1;
+    int canceled = -1;
+    while (target < 0 || canceled < 0) {
+      const std::optional<Reply> reply = client().receive();
+      ASSERT_TRUE(reply);
+      if (reply->code < 0) continue;
+      int& code = reply->id == 2 ? target : canceled;
+      ASSERT_EQ(code, -1);
+      code = reply->code;
+    }
+    if (target == 118)
+      EXPECT_EQ(canceled, 0);
+    else
+      EXPECT_TRUE(target == 0 && (canceled == 119 || canceled == 120)) << target << canceled;
+  }
+}
+
 class BlockedOperations : public BlockedServer {
  protected:
   BlockedOperations() { controls = all_controls(); }

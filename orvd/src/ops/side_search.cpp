@@ -20,8 +20,8 @@ AnswerLimits bounded(std::size_t bytes) {
 
 // A value as the file would hold it; nothing for one that the code page lacks, which is refused
 // before it comes to the file.
-void append_line(std::string& record, const char* type, const berval& value) {
-  const std::string text(value.bv_val, value.bv_len);
+void append_line(std::string& record, const char* type, std::string_view value) {
+  const std::string text(value);
   if (local_code_page_is_utf8()) return cfg::append_ldif_line(record, type, text);
   char* converted = nullptr;
   std::size_t length = 0;
@@ -31,13 +31,18 @@ void append_line(std::string& record, const char* type, const berval& value) {
   if (code == 0) cfg::append_ldif_line(record, type, local.get());
 }
 
-std::string record_of(const entry& e) {
+// Of a password it says that there is one: nothing that asks for its value matches, and it is not
+// to lie about in memory.
+std::string record_of(const Schema& schema, const entry& e) {
   std::string record;
-  std::string dn(e.dn ? e.dn : "");
-  append_line(record, "dn", {dn.size(), dn.data()});
-  for (const attr* a = e.attributes; a; a = a->next)
+  append_line(record, "dn", e.dn ? e.dn : "");
+  for (const attr* a = e.attributes; a; a = a->next) {
+    const SchemaAttribute* const type = schema.attribute(a->type);
+    const bool secret = type && type->secret;
     for (berval** value = a->values; value && *value; ++value)
-      append_line(record, a->type, **value);
+      append_line(record, a->type,
+                  secret ? "secret" : std::string_view((*value)->bv_val, (*value)->bv_len));
+  }
   return record;
 }
 
@@ -60,7 +65,7 @@ std::string filter_for(const Schema& schema, std::string_view filter, unsigned a
 bool fulfils(const Schema& schema, const entry& added, std::string_view filter,
              unsigned authority) {
   bool matches = false;
-  const int code = cfg::ldif_record_matches(record_of(added),
+  const int code = cfg::ldif_record_matches(record_of(schema, added),
                                             filter_for(schema, filter, authority).c_str(), matches);
   if (code == result::no_memory) throw std::bad_alloc();
   return code == 0 && matches;
