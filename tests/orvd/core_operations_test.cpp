@@ -8,6 +8,7 @@
 #include <functional>
 #include <mutex>
 #include <optional>
+#include <ostream>
 #include <string>
 #include <string_view>
 #include <thread>
@@ -175,6 +176,10 @@ struct ControlCase {
   int response_tag;  // an operation that it is for
   int other_tag;     // and one that it is not for; 0: there is none
 };
+
+void PrintTo(const ControlCase& tested, std::ostream* out) {
+  *out << tested.name;
+}
 
 std::string request_of(int tag, int id) {
   if (tag == tag::search_done) return test::search(id, kTop);
