@@ -287,6 +287,16 @@ TEST_F(OperationsTest, ManageDsaItIsTakenEverywhere) {
   EXPECT_EQ(code(with(6, extended(6, kWhoAmIOid), manage)), 0);
 }
 
+TEST_F(OperationsTest, OtherControlsAreNotForBindsNorForExtendedOperations) {
+  for (const char* oid : {kAssertionOid, kPreReadOid, kPostReadOid, kPagedResultsOid}) {
+    EXPECT_EQ(code(with(2, extended(2, kWhoAmIOid), ldap_control(oid, true, "x"))), 12);
+    EXPECT_EQ(code(with(3, extended(3, kWhoAmIOid), ldap_control(oid, false, "x"))), 0);
+    EXPECT_EQ(code(with(4, test::bind(4, kRoot, kSecret), ldap_control(oid, false, "x"))), 0);
+    EXPECT_EQ(code(with(5, test::bind(5, kRoot, kSecret), ldap_control(oid, true, "x"))), 12);
+    EXPECT_EQ(code(test::search(6, kTop)), 50);  // a bind that is refused leaves nobody bound
+  }
+}
+
 TEST_F(OperationsTest, NotificationOfChangesIsNoControlOfRequests) {
   EXPECT_EQ(code(with(2, test::search(2, kTop), ldap_control(kEntryChangeOid, true, {}))), 12);
   EXPECT_EQ(code(with(3, test::search(3, kTop), ldap_control(kEntryChangeOid, false, {}))), 0);
