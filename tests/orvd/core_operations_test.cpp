@@ -848,10 +848,10 @@ TEST_F(PagesTest, AreNotKeptOfASearchThatIsCanceled) {
 TEST_F(PagesTest, AreRefusedWhileAllConnectionsKeepTooMuch) {
   settings.max_paged_result_size = 1 << 30;
   backend.on_search = [](pblock* parameters) {
-    const EntryPtr entry = test::make_test_entry("CN=CONFIGURATION", std::size_t{20} << 20);
-    int code = 0;
-    for (int i = 0; i < 2 && code == 0; ++i) code = test::send_test_entry(parameters, *entry);
-    return test::finish_search(parameters, code, 2);
+    const EntryPtr small = test::make_test_entry("CN=CONFIGURATION");
+    const EntryPtr large = test::make_test_entry("CN=X,CN=CONFIGURATION", std::size_t{40} << 20);
+    test::send_test_entry(parameters, *small);
+    return test::finish_search(parameters, test::send_test_entry(parameters, *large), 2);
   };
   settings.max_result_size = 1 << 30;
   const std::optional<Reply> reply = next(1, "");
