@@ -341,7 +341,7 @@ TEST_F(Work, OfASchemaWithThousandsOfNamesIsLinear) {
             EXPECT_TRUE(Schema::parse(text, error)) << error;
           };
         },
-        2000);
+        500);
   }
 }
 
