@@ -42,12 +42,11 @@ std::string base64(const std::string& bytes) {
 
 // A new line, with its end.
 std::string rendered(const std::string& type, const std::string& value, const std::string& end) {
-  const bool odd_ends =
-      !value.empty() && (std::string(" \t:<").find(value.front()) != std::string::npos ||
-                         std::string(" \t").find(value.back()) != std::string::npos);
-  const bool odd_bytes = std::any_of(value.begin(), value.end(), [](char c) {
-    const auto byte = static_cast<unsigned char>(c);
-    return (byte < 0x20 && c != '\t') || byte > 0x7E;
+  const auto blank = [](char c) { return c == ' ' || c == '\t'; };
+  const bool odd_ends = !value.empty() && (blank(value[0]) || value[0] == ':' || value[0] == '<' ||
+                                           blank(value.back()));
+  const bool odd_bytes = std::any_of(value.begin(), value.end(), [](unsigned char c) {
+    return c >= 0x7F || (c < 0x20 && c != '\t');
   });
   std::string line = type + ":";
   if (odd_ends || odd_bytes) {
