@@ -43,7 +43,11 @@ class BareSession final : public Session {
       std::unique_lock lock(mutex_);
       if (posted_.empty()) {
         lock.unlock();
-        tick();
+        try {
+          tick();
+        } catch (const std::bad_alloc&) {
+          // As in an event loop: the next one tries again.
+        }
         std::this_thread::yield();
         continue;
       }

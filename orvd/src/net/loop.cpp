@@ -51,7 +51,9 @@ void Loop::run() {
     try {
       turn();
     } catch (const std::exception& error) {
-      logs_.error(std::string("event loop: ") + error.what());
+      // Apart: what is missing may be the memory to put them together.
+      logs_.error("event loop:");
+      logs_.error(error.what());
     }
   }
 }

@@ -572,12 +572,17 @@ void Session::tick() {
 }
 
 void Session::pick_up_stranded() {
+  if (!stranded_.load()) return;
+  const std::vector<OperationPtr> all = outstanding_;  // without memory for it the next tick tries
   if (!stranded_.exchange(false)) return;
-  const std::vector<OperationPtr> all = outstanding_;
   for (const OperationPtr& operation : all)
     if (operation->stranded.exchange(false)) take_step_or_end(operation);
-  if (bind_ && bind_->verified.load()) verified(bind_);
-  start_held();
+  try {
+    if (bind_ && bind_->verified.load()) verified(bind_);
+    start_held();
+  } catch (...) {
+    end_for_want_of_memory();
+  }
 }
 
 void Session::respond(std::int32_t id, int response_tag, int code, std::string_view text,
