@@ -2,7 +2,6 @@
 
 #include <asio/post.hpp>
 #include <exception>
-#include <string>
 #include <utility>
 
 #include "cfg/result_codes.h"
