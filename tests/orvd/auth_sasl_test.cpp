@@ -548,8 +548,13 @@ TEST_F(CyrusTest, RealmIsThatOfTheSettings) {
 
 // ---- security layers
 
-// Of integrity. The library's client, once it has used a cipher, cannot go back to integrity in the
-// same process: layers with a cipher are tested with clients in processes of their own.
+TEST_F(CyrusTest, DigestHasNoCiphers) {
+  const std::string challenge = *start("DIGEST-MD5")->step(std::nullopt).reply;
+  EXPECT_THAT(challenge, HasSubstr("auth-int"));
+  EXPECT_THAT(challenge, Not(HasSubstr("auth-conf")));
+  EXPECT_THAT(challenge, Not(HasSubstr("cipher")));
+}
+
 class LayerOfDigest : public CyrusTest {
  protected:
   LayerOfDigest() : peer("DIGEST-MD5", {.min_strength = 1, .max_strength = 1}) {

@@ -365,7 +365,7 @@ TEST_F(ModifyServer, SettingsAreNotReadAfterAChangeThatWasRefusedOrConcernsNone)
   code = 65;
   EXPECT_EQ(code_of(client, modify(2, kTop, "description", "a")), 65);
   code = 0;
-  EXPECT_EQ(code_of(client, modify(3, "cn=kerberos,cn=configuration", "description", "a")), 0);
+  EXPECT_EQ(code_of(client, modify(3, "cn=schemas,cn=configuration", "description", "a")), 0);
   EXPECT_EQ(reloads, 0);
   EXPECT_EQ(
       code_of(client, modify(4, "cn=audit,cn=log management,cn=configuration", "description", "a")),

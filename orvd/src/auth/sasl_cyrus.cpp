@@ -100,7 +100,8 @@ struct Opening {
   std::string realm;  // "": the host's name
   sasl_ssf_t external;
   std::shared_ptr<const KerberosAcceptor> acceptor;
-  bool by_password;  // the name that is claimed is a user's, and to be proved with the password
+  sasl_ssf_t strongest;  // layer, where nothing else protects the connection
+  bool by_password;      // the name that is claimed is a user's, and to be proved with the password
 };
 
 // What the library knows of an exchange, and what its callbacks found out. A security layer goes on
@@ -122,7 +123,7 @@ class Exchange final : public SaslClaimant {
     connection_.reset(made);
     // What is protected already needs no layer.
     sasl_security_properties_t wanted{};
-    wanted.max_ssf = external > 0 ? external : kStrongest;
+    wanted.max_ssf = external > 0 ? external : opening_.strongest;
     wanted.maxbufsize = kLongestFrame;
     wanted.security_flags = SASL_SEC_NOANONYMOUS | SASL_SEC_NOPLAINTEXT;
     if (code == SASL_OK) code = sasl_setprop(made, SASL_SSF_EXTERNAL, &external);
@@ -402,8 +403,12 @@ class CyrusMechanism final : public SaslMechanism {
 
   std::unique_ptr<SaslExchange> start(const TransportFacts& transport) const override {
     const auto state = sasl_.state();
-    Opening opening{state->host, "", strength_of(transport), nullptr, name_ != kGssapi};
-    if (name_ == kDigest) opening.realm = state->settings.digest_realm;
+    Opening opening{state->host, "", strength_of(transport), nullptr, kStrongest, name_ != kGssapi};
+    if (name_ == kDigest) {
+      opening.realm = state->settings.digest_realm;
+      // Its ciphers are broken, and the library does not give all their memory back.
+      opening.strongest = kIntegrity;
+    }
     if (name_ == kGssapi) opening.acceptor = state->acceptor;
     return std::make_unique<CyrusExchange>(name_, std::move(opening), sasl_.identities_,
                                            sasl_.report_);

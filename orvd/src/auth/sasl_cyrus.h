@@ -3,8 +3,9 @@
 //
 // GSSAPI proves a Kerberos principal, with the key of the service "ldap" in a keytab; the other two
 // prove a user name with its password, which has to be stored in a way that it can be read back.
-// Without TLS, and not over a Unix socket, a client may negotiate a security layer with GSSAPI and
-// DIGEST-MD5. Channel bindings are not supported: clients that insist on them are refused.
+// Without TLS, and not over a Unix socket, a client may negotiate a security layer: of integrity
+// with DIGEST-MD5, of confidentiality too with GSSAPI. Channel bindings are not supported: clients
+// that insist on them are refused.
 //
 // Whoever fails is told the same, whether the name is nobody's, its password cannot be used, or the
 // proof is wrong, and after the same steps: names of nobody get a password that nobody knows.
