@@ -200,7 +200,11 @@ class CyrusTest : public ::testing::Test {
                         name.find("libscram.") != std::string_view::npos;
     return tested ? SASL_OK : SASL_CONTINUE;
   }
-  CyrusTest() : sasl(*library, people, [this](std::string_view line) { reported = line; }) {
+  CyrusTest()
+      : sasl(*library, people, [this](std::string_view line) {
+          const std::lock_guard lock(people.mutex);
+          reported = line;
+        }) {
     sasl.add_mechanisms(mechanisms);
   }
 
