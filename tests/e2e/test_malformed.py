@@ -132,6 +132,9 @@ def assert_logs_are_bounded(server, count, before):
     assert server.access_log.stat().st_size - before < MOST_ACCESS_LOG * count
     # Of an administrator's changes that the server refuses one line tells; of strangers none does.
     told = [line for line in server.stderr.lines() if " refused with " not in line]
+    # Of each limit that ends connections ten lines a minute tell, and then how many more there were.
+    assert len([line for line in told if ": closed " in line]) < 60, told[:60]
+    told = [line for line in told if ": closed " not in line]
     assert len(told) < 20, told[:20]
     longest = max(server.stderr.lines(), key=len)
     assert len(longest) < MOST_ERROR_LINE, longest
