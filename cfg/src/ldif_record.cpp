@@ -23,7 +23,9 @@ int ldif_record_matches(std::string_view record, const char* filter, bool& match
     if (!index.build(text, fault) || index.size() != 1) return result::operations_error;
     Filter parsed;
     if (!parsed.parse(filter)) return result::protocol_error;
-    matches = parsed.matches(index, 0);
+    const Filter::Match match = parsed.match(index, 0);
+    if (match == Filter::Match::interrupted) return result::time_limit_exceeded;
+    matches = match == Filter::Match::yes;
     return result::success;
   } catch (const std::bad_alloc&) {
     return result::no_memory;

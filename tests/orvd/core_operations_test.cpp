@@ -379,6 +379,19 @@ TEST_F(CancelTest, OfWhatHasEndedFindsNothing) {
   EXPECT_EQ(code(cancel(4, 1)), 119);
 }
 
+TEST_F(CancelTest, OfNoMessageFindsNothing) {
+  Event entered;
+  Event go_on;
+  before_search([&](pblock*) {
+    entered.happen();
+    go_on.wait();
+  });
+  client().send(test::search(2, kTop, 2));
+  ASSERT_TRUE(entered.wait());
+  EXPECT_EQ(code(cancel(3, 0)), 119);
+  go_on.happen();
+}
+
 TEST_F(CancelTest, EndsASearchThatRunsElsewhere) {
   Event entered;
   before_search([&](pblock* parameters) {
@@ -497,6 +510,19 @@ class BlockedOperations : public BlockedServer {
   BlockedOperations() { controls = all_controls(); }
 };
 
+// What takes long must not take the time of the connection's thread.
+TEST_F(BlockedOperations, AssertionOnAnAddedEntryIsTestedInItsTurn) {
+  block();
+  WireClient client(port());
+  bind_as_root(client);
+  client.send(
+      with(2, test::add_entry(2, "cn=x,cn=configuration", "cn", "x"), assertion("cn", "nobody")));
+  EXPECT_TRUE(wait_for_waiters(1));
+  go_on.happen();
+  EXPECT_EQ(client.receive()->code, 122);
+  EXPECT_EQ(backend.calls(parameter::add_function), 0);
+}
+
 TEST_F(BlockedOperations, OperationsThatWaitAreCanceledUnserved) {
   block();
   WireClient client(port());
@@ -549,10 +575,10 @@ TEST_F(BlockedOperations, BindWaitsForWhatIsBeingCanceled) {
   EXPECT_EQ(ids, (std::vector<int>{2, 3, 4}));
 }
 
-// A search in the library that goes on until it is interrupted, on the connection's own thread.
-class CancelAhead : public OperationsTest {
+// A search in the library that goes on until it is interrupted.
+class EndlessSearch : public OperationsTest {
  protected:
-  CancelAhead() {
+  EndlessSearch() {
     char name[] = "/tmp/orv-core-XXXXXX";
     const int fd = mkstemp(name);
     file_ = name;
@@ -574,7 +600,7 @@ class CancelAhead : public OperationsTest {
       return test::finish_search(parameters, code, 0);
     };
   }
-  ~CancelAhead() override {
+  ~EndlessSearch() override {
     stop();
     unlink(file_.c_str());
   }
@@ -590,6 +616,9 @@ class CancelAhead : public OperationsTest {
   Event entered;
   std::atomic<bool> free{false};
 };
+
+// On the connection's own thread.
+using CancelAhead = EndlessSearch;
 
 TEST_F(CancelAhead, ReachesASearchThoughItsThreadIsBusy) {
   client().send(test::search(2, kTop));
@@ -609,9 +638,62 @@ TEST_F(CancelAhead, IsSeenInThePacketOfItsSearch) {
 TEST_F(CancelAhead, ThatMustNotBePerformedIsNotPerformed) {
   client().send(test::search(2, kTop) + with(3, cancel(3, 2), ldap_control(kUnknownOid, true, {})));
   ASSERT_TRUE(entered.wait());
-  std::this_thread::yield();
+  // Long enough for the search to have looked at what its client sends, and more than once.
+  const auto looked = Clock::now() + 100ms;
+  while (Clock::now() < looked) std::this_thread::yield();
   free = true;
   EXPECT_EQ(replies(2), (Pairs{{2, 0}, {3, 12}}));
+}
+
+// The search is that of a control, on a worker.
+using EndlessCondition = EndlessSearch;
+
+TEST_F(EndlessCondition, OfAChangeCanBeCanceledWithTheChangeUnmade) {
+  client().send(with(2, test::delete_entry(2, kTop), assertion("cn", "x")));
+  ASSERT_TRUE(entered.wait());
+  client().send(cancel(3, 2));
+  EXPECT_EQ(replies(2), (Pairs{{2, 118}, {3, 0}}));
+  EXPECT_EQ(backend.calls(parameter::delete_function), 0);
+}
+
+TEST_F(EndlessCondition, OfAChangeThatIsAbandonedEndsWithTheChangeUnmade) {
+  client().send(with(2, test::delete_entry(2, kTop), assertion("cn", "x")));
+  ASSERT_TRUE(entered.wait());
+  client().send(test::abandon(3, 2) + test::delete_entry(4, kTop));
+  EXPECT_EQ(replies(1), (Pairs{{4, 0}}));
+  EXPECT_EQ(backend.calls(parameter::delete_function), 1);
+}
+
+TEST_F(EndlessCondition, OfAChangeHasTheTimeOfASearch) {
+  settings.time_limit = 1;
+  const auto begun = Clock::now();
+  EXPECT_EQ(
+      code(with(2, test::delete_entry(2, kTop), ldap_control(kPreReadOid, true, names({"*"})))), 3);
+  EXPECT_LT(Clock::now() - begun, 8s);
+  EXPECT_EQ(backend.calls(parameter::delete_function), 0);
+}
+
+TEST_F(EndlessCondition, OfAChangeDoesNotKeepTheServerFromStopping) {
+  client().send(with(2, test::delete_entry(2, kTop), assertion("cn", "x")));
+  ASSERT_TRUE(entered.wait());
+  const auto begun = Clock::now();
+  server->stop();
+  EXPECT_EQ(replies(1), (Pairs{{2, 52}}));
+  EXPECT_LT(Clock::now() - begun, 8s);
+  EXPECT_EQ(backend.calls(parameter::delete_function), 0);
+}
+
+TEST_F(EndlessCondition, IsNoneForTheCopyAfterAChangeWhichStaysMade) {
+  client().send(with(2, test::modify(2, kTop, "description", "x"),
+                     ldap_control(kPostReadOid, true, names({"*"}))));
+  ASSERT_TRUE(entered.wait());
+  client().send(cancel(3, 2));
+  const std::optional<Reply> made = client().receive();
+  ASSERT_TRUE(made);
+  EXPECT_EQ(made->id, 2);
+  EXPECT_EQ(made->code, 0);
+  EXPECT_EQ(made->controls, "");
+  EXPECT_EQ(replies(1), (Pairs{{3, 120}}));
 }
 
 // ---- assertion

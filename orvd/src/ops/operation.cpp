@@ -154,8 +154,7 @@ Refusal PendingOperation::prepare_controls(Services& services, const RequestCont
   };
   if (controls.assertion && handler_ == parameter::add_function) {
     // There is no other entry that it could mean.
-    if (!fulfils(services.schema, *entry_, *controls.assertion, operation_.authority))
-      return {result::assertion_failed, ""};
+    assertion_on_added_ = controls.assertion;
   } else if (controls.assertion) {
     if (!may_read) return {result::assertion_failed, ""};
     assertion_ = search(*controls.assertion, {"1.1"});
@@ -165,13 +164,16 @@ Refusal PendingOperation::prepare_controls(Services& services, const RequestCont
   return {};
 }
 
-// What all connections may keep bounds each answer. Without room there is no search; a change is
+// What all connections may keep bounds each answer, and of a change the copies of the entry that go
+// with it, half of the room each. Without room there is nothing of that; a change without copies is
 // let through, since its answer is short.
 bool PendingOperation::take_budget(const Services& services) noexcept {
   AnswerLimits limits = answer_.limits();
   const std::size_t room = services.output.room();
   limits.bytes = std::min(limits.bytes, room);
-  if (handler_ != parameter::search_function) return true;
+  if (pre_read_) pre_read_->bound(room / 2);
+  if (post_read_) post_read_->bound(room / 2);
+  if (handler_ != parameter::search_function && !pre_read_ && !post_read_) return true;
   answer_.set_limits(limits);
   if (room == 0) answer_.result(result::busy, "", "too many answers are unread");
   return room != 0;
@@ -306,29 +308,48 @@ bool PendingOperation::take_copy(SideSearch& search, const char* oid) noexcept {
 }
 
 // What is to be known before the operation itself, by the state of the file that it will find: the
-// gate is held from here to its end. A failure is its result.
+// gate is held from here to its end.
+int PendingOperation::test_conditions(Services& services) noexcept {
+  if (assertion_on_added_) {
+    const int code =
+        test_assertion(services.schema, *entry_, *assertion_on_added_, operation_.authority);
+    if (code != 0) return code;
+  }
+  if (assertion_) {
+    if (const int code = assertion_->run(services.backend)) return code;
+    if (!assertion_->found()) return result::assertion_failed;
+  }
+  if (!pre_read_) return result::success;
+  if (const int code = pre_read_->run(services.backend)) return code;
+  return take_copy(*pre_read_, kPreReadOid) ? result::success : result::no_memory;
+}
+
+// A failure is the operation's result. Nothing is made yet, so also a change can be given up here.
 bool PendingOperation::conditions_hold(Services& services) noexcept {
-  int code = assertion_ ? assertion_->run(services.backend) : 0;
-  if (code == 0 && assertion_ && !assertion_->found()) code = result::assertion_failed;
-  if (code == 0 && pre_read_) code = pre_read_->run(services.backend);
-  if (code == 0 && pre_read_ && !take_copy(*pre_read_, kPreReadOid)) code = result::no_memory;
+  const cfg::InterruptScope scope(&PendingOperation::interrupted, this);
+  int code = test_conditions(services);
+  if (is_change() && answer_.is_given_up()) code = result::canceled;
   if (code == 0) return true;
   answer_.result(code, "", "");
   return false;
 }
 
-// The change is made, so nothing here can fail it any more: without a copy the result goes alone.
-// Whoever is not any more who they were sees a name and nothing else.
+// The change is made, so nothing here can fail it any more: without a copy the result goes alone,
+// also when it would take too long. Whoever is not any more who they were sees a name and nothing
+// else.
 void PendingOperation::copy_afterwards(Services& services) noexcept {
+  if (answer_.abandoned()) return;
   bool good = true;
   if (post_read_) {
     const bool same = services.authenticator.generation() == identity_generation ||
                       (identity_ && services.authenticator.still_valid(*identity_));
+    const cfg::InterruptScope scope(&PendingOperation::interrupted, this);
     const int code = same ? post_read_->run(services.backend) : 0;
     good = code == 0 && take_copy(*post_read_, kPostReadOid);
   }
   if (!answer_.attach_to_result(copies_)) good = false;
-  if (!good) services.logs.error("a change was made, but a copy of its entry cannot be shown");
+  if (!good && !answer_.is_given_up())
+    services.logs.error("a change was made, but a copy of its entry cannot be shown");
 }
 
 void PendingOperation::run(Services& services, bool on_home_thread) noexcept {

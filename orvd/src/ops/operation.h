@@ -69,8 +69,8 @@ class PendingOperation final : public GateWaiter,
   Refusal prepare(Services& services, const ModifyRequest& request, std::string_view normal_dn);
 
   // Takes over the controls that have to do with the target's entry: assertion, pre-read and
-  // post-read. After prepare, which it may follow with a refusal: 12 an entry that the client may
-  // not read, 122 an assertion that cannot be true.
+  // post-read, which are tested and read by run(). After prepare, which it may follow with a
+  // refusal: 12 an entry that the client may not read, 122 an assertion that he may not make.
   Refusal prepare_controls(Services& services, const RequestControls& controls);
 
   // Calls the handler and makes sure that there is a result. The caller holds the gate, which is
@@ -143,6 +143,7 @@ class PendingOperation final : public GateWaiter,
   bool may_fail(Services& services) noexcept;
   bool has_reserves() noexcept;
   bool may_begin(Services& services) noexcept;
+  int test_conditions(Services& services) noexcept;
   bool conditions_hold(Services& services) noexcept;
   bool take_copy(SideSearch& search, const char* oid) noexcept;
   void copy_afterwards(Services& services) noexcept;
@@ -177,8 +178,10 @@ class PendingOperation final : public GateWaiter,
   TextArray names_;
   EntryPtr entry_;
 
-  // What controls ask for; null: nothing. Copies of the entry go with a successful result.
+  // What controls ask for; null or nothing: nothing. Copies of the entry go with a successful
+  // result.
   std::unique_ptr<SideSearch> assertion_;
+  std::optional<std::string> assertion_on_added_;  // the filter as clients send it
   std::unique_ptr<SideSearch> pre_read_;
   std::unique_ptr<SideSearch> post_read_;
   std::vector<Control> copies_;

@@ -303,7 +303,9 @@ Session::OperationPtr Session::prepare_change(std::int32_t id, const ChangeReque
   const std::string_view name = operation_name(answer_tag);
   std::string normal;
   refusal = refuse_change(find_target(request.dn, normal));
-  OperationPtr operation = make_operation(id, answer_tag, 0, 0);
+  // The change itself takes its time; what comes before and after it is bounded as searches are.
+  const bool searches = controls.assertion || controls.pre_read || controls.post_read;
+  OperationPtr operation = make_operation(id, answer_tag, searches ? settings().time_limit : 0, 0);
   if (services_.logs.access_enabled())
     operation->log_text = describe_dn(name, request.dn, normal) + describe_controls(controls);
   prepare_audit(*operation, request);

@@ -77,6 +77,7 @@ void Session::cancel(std::int32_t id, const ExtendedRequest& request) {
 }
 
 bool Session::is_being_canceled_by(std::int32_t message_id) const noexcept {
+  if (message_id == 0) return false;  // that of operations that nobody cancels
   return std::any_of(
       outstanding_.begin(), outstanding_.end(),
       [message_id](const OperationPtr& other) { return other->canceled_by == message_id; });

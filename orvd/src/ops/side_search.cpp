@@ -1,5 +1,6 @@
 #include "ops/side_search.h"
 
+#include <algorithm>
 #include <new>
 
 #include "cfg/ldif.h"
@@ -62,13 +63,17 @@ std::string filter_for(const Schema& schema, std::string_view filter, unsigned a
                         sees_all ? FilterUse::evaluate : FilterUse::evaluate_for_administrators);
 }
 
-bool fulfils(const Schema& schema, const entry& added, std::string_view filter,
-             unsigned authority) {
-  bool matches = false;
-  const int code = cfg::ldif_record_matches(record_of(schema, added),
-                                            filter_for(schema, filter, authority).c_str(), matches);
-  if (code == result::no_memory) throw std::bad_alloc();
-  return code == 0 && matches;
+int test_assertion(const Schema& schema, const entry& added, std::string_view filter,
+                   unsigned authority) noexcept {
+  try {
+    bool matches = false;
+    const int code = cfg::ldif_record_matches(
+        record_of(schema, added), filter_for(schema, filter, authority).c_str(), matches);
+    if (code == result::no_memory || code == result::time_limit_exceeded) return code;
+    return code == 0 && matches ? result::success : result::assertion_failed;
+  } catch (const std::bad_alloc&) {
+    return result::no_memory;
+  }
 }
 
 SideSearch::SideSearch(Services& services, Connection& connection, const Operation& client,
@@ -93,6 +98,12 @@ SideSearch::SideSearch(Services& services, Connection& connection, const Operati
       slapi_pblock_set(block, parameter::search_scope, 0) != 0 ||
       slapi_pblock_set(block, parameter::search_types_only, 0) != 0)
     throw std::bad_alloc();
+}
+
+void SideSearch::bound(std::size_t bytes) noexcept {
+  AnswerLimits limits = answer_.limits();
+  limits.bytes = std::min(limits.bytes, bytes);
+  answer_.set_limits(limits);
 }
 
 int SideSearch::run(BackendHost& backend) noexcept {

@@ -25,6 +25,9 @@ class SideSearch {
   SideSearch(const SideSearch&) = delete;
   SideSearch& operator=(const SideSearch&) = delete;
 
+  // The entry may have no more bytes than this either. Before run().
+  void bound(std::size_t bytes) noexcept;
+
   // The result code of the search. Only inside the gate.
   int run(BackendHost& backend) noexcept;
 
@@ -53,8 +56,11 @@ bool may_search(unsigned authority) noexcept;
 // std::bad_alloc.
 std::string filter_for(const Schema& schema, std::string_view filter, unsigned authority);
 
-// Whether an entry that is to be added, with canonical types and in UTF-8, fulfils an assertion of
-// somebody with these flags. Values of passwords match nothing. Throws std::bad_alloc.
-bool fulfils(const Schema& schema, const entry& added, std::string_view filter, unsigned authority);
+// Tests an assertion of somebody with these flags on an entry that is to be added, with canonical
+// types and in UTF-8: 0 when it is true, 122 when not, 3 interrupted (cfg/interrupt.h), 90. Values
+// of passwords match nothing. It may take as long as the filter's items times the entry's values,
+// so not on a connection's thread.
+int test_assertion(const Schema& schema, const entry& added, std::string_view filter,
+                   unsigned authority) noexcept;
 
 }  // namespace orv::server
