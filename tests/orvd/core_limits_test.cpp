@@ -273,6 +273,34 @@ TEST_F(LimitedServer, ConnectionOnWhichNobodyBindsInTimeIsEnded) {
   EXPECT_EQ(administrator.receive()->tag, kNotice);
 }
 
+TEST_F(LimitedServer, ConnectionOnWhichOneBindFailsAfterTheOtherIsEnded) {
+  settings.unauthenticated_timeout = 1;
+  settings.bind_timeout = 1;
+  // Slower than the client, so that its next bind is always here already.
+  authenticator.meanwhile = [](std::string_view) {
+    const auto end = Clock::now() + 20ms;
+    while (Clock::now() < end) std::this_thread::yield();
+  };
+  start();
+  WireClient stranger(port());
+  int id = 0;
+  const auto send_one = [&] {
+    id = id % 100 + 1;
+    stranger.send(test::bind(id, test::kRoot, "wrong"));
+  };
+  send_one();
+  std::optional<Reply> reply;
+  const auto begun = Clock::now();
+  do {
+    send_one();
+    reply = stranger.receive();
+  } while (reply && reply->tag != kNotice && Clock::now() - begun < 8s);
+  ASSERT_TRUE(reply);
+  EXPECT_EQ(reply->tag, kNotice);
+  EXPECT_NE(reply->body.find("nobody bound for too long"), std::string::npos);
+  EXPECT_GE(Clock::now() - begun, 1500ms);  // a bind that is under way is waited for
+}
+
 // ---- readers
 
 TEST(Pace, ReaderWithoutProgressIsTooSlow) {

@@ -611,6 +611,13 @@ class EndlessSearch : public OperationsTest {
         all.emplace_back(reply->id, reply->code);
     return all;
   }
+  // Ends the search when it has looked at what its client sends, and more than once.
+  void end_when_looked_at() {
+    ASSERT_TRUE(entered.wait());
+    const auto looked = Clock::now() + 100ms;
+    while (Clock::now() < looked) std::this_thread::yield();
+    free = true;
+  }
   using Pairs = std::vector<std::pair<int, int>>;
   std::string file_;
   Event entered;
@@ -637,12 +644,28 @@ TEST_F(CancelAhead, IsSeenInThePacketOfItsSearch) {
 
 TEST_F(CancelAhead, ThatMustNotBePerformedIsNotPerformed) {
   client().send(test::search(2, kTop) + with(3, cancel(3, 2), ldap_control(kUnknownOid, true, {})));
-  ASSERT_TRUE(entered.wait());
-  // Long enough for the search to have looked at what its client sends, and more than once.
-  const auto looked = Clock::now() + 100ms;
-  while (Clock::now() < looked) std::this_thread::yield();
-  free = true;
+  end_when_looked_at();
   EXPECT_EQ(replies(2), (Pairs{{2, 0}, {3, 12}}));
+}
+
+TEST_F(CancelAhead, ThatIsRefusedForAControlIsNotPerformed) {
+  client().send(test::search(2, kTop) +
+                with(3, cancel(3, 2), ldap_control(kManageDsaItOid, false, "x")));
+  end_when_looked_at();
+  EXPECT_EQ(replies(2), (Pairs{{2, 0}, {3, 2}}));
+}
+
+TEST_F(CancelAhead, IsNotSeenInsideAnotherMessage) {
+  const std::string looks_like_one = cancel(3, 2);
+  const std::string message = test::search(5, looks_like_one);
+  const std::size_t half = message.find(looks_like_one);
+  ASSERT_NE(half, std::string::npos);
+  client().send(test::search(2, kTop) + message.substr(0, half));
+  ASSERT_TRUE(entered.wait());
+  client().send(message.substr(half));
+  end_when_looked_at();
+  EXPECT_EQ(replies(1), (Pairs{{2, 0}}));
+  EXPECT_EQ(client().receive()->id, 5);
 }
 
 // The search is that of a control, on a worker.

@@ -435,15 +435,10 @@ struct Interest {
   std::int32_t canceled_by = 0;  // the message that cancels it; 0: none
 };
 
-bool has_critical(const Message& message) {
-  return std::any_of(message.controls.begin(), message.controls.end(),
-                     [](const Control& control) { return control.critical; });
-}
-
 // Looks at one message; one whose controls may forbid it is left to its turn.
 void look_at(const Message& message, std::int32_t operation, Interest& interest) {
   if (std::holds_alternative<UnbindRequest>(message.request)) interest.lost = true;
-  if (has_critical(message)) return;
+  if (!message.controls.empty()) return;
   if (const auto* const abandon = std::get_if<AbandonRequest>(&message.request))
     interest.lost = interest.lost || abandon->message_id == operation;
   const auto* const extended = std::get_if<ExtendedRequest>(&message.request);
@@ -454,8 +449,9 @@ void look_at(const Message& message, std::int32_t operation, Interest& interest)
     interest.canceled_by = message.id;
 }
 
-// Looks at the whole messages among `bytes`, up to the first that settles it.
-Interest interest_in(std::int32_t operation, std::string_view bytes) {
+// Takes the whole messages from the front of `bytes`, which begin with one, up to the first that
+// settles it.
+Interest interest_in(std::int32_t operation, std::string_view& bytes) {
   const DecoderLimits limits;
   Interest interest;
   while (!interest.lost && interest.canceled_by == 0) {
@@ -496,8 +492,11 @@ bool Client::lost_interest(PendingOperation& operation) noexcept {
   const std::int32_t id = operation.answer().message_id();
   try {
     // What came in one packet with the operation's own message was read along with it.
-    Interest interest = interest_in(id, unread());
-    if (!interest.lost && interest.canceled_by == 0) interest = interest_in(id, {bytes, length});
+    std::string_view here = unread();
+    Interest interest = interest_in(id, here);
+    // Behind half a message comes its other half, which may look like anything.
+    std::string_view coming = here.empty() ? std::string_view(bytes, length) : "";
+    if (!interest.lost && interest.canceled_by == 0) interest = interest_in(id, coming);
     if (interest.lost) operation.answer().abandon();
     if (interest.canceled_by != 0) cancel_ahead(operation, interest.canceled_by);
   } catch (const std::bad_alloc&) {
@@ -564,8 +563,14 @@ void Client::write() {
 
 void Client::writable() {
   writing_ = false;
+  write_on();
+}
+
+// Writes what was left over, and goes on with what waited for that.
+void Client::write_on() {
+  if (state_ == State::closed) return;
   const bool was_full = !reads_enough();
-  flush();
+  write();
   watch();
   if (was_full && reads_enough()) resume();
 }
@@ -692,8 +697,7 @@ void Client::look_at_deadlines(Clock::time_point now) {
     cut_off_without_notice(CutOff::output, "does not read its answers");
   } else if (bind_is_overdue(now)) {
     cut_off(CutOff::bind, result::unavailable, "bind not finished in time");
-  } else if (limits.unauthenticated_timeout > 0 && !transport().local && idle() &&
-             without_identity(now) >= std::chrono::seconds(limits.unauthenticated_timeout)) {
+  } else if (has_bound_too_late(now)) {
     cut_off(CutOff::bind, result::unavailable, "nobody bound for too long");
   } else if ((begin_ != end_ || in_pieces_) && may_read()) {
     if (late(message_begun_, limits.message_timeout))
@@ -704,12 +708,20 @@ void Client::look_at_deadlines(Clock::time_point now) {
   }
 }
 
+// A bind under way is waited for, but not one after the other.
+bool Client::has_bound_too_late(Clock::time_point now) const noexcept {
+  const Settings& limits = loop_.settings();
+  if (limits.unauthenticated_timeout <= 0 || transport().local) return false;
+  const std::int64_t more = idle() ? 0 : limits.bind_timeout;
+  return without_identity(now) >= std::chrono::seconds(limits.unauthenticated_timeout + more);
+}
+
 bool Client::does_not_read(Clock::time_point now) {
   const Settings& limits = loop_.settings();
   const auto too_slow = [&] {
     return pace_.too_slow(now, limits.write_timeout, limits.min_read_rate);
   };
-  if (too_slow()) write();  // it may have read just now
+  if (too_slow()) write_on();  // it may have read just now
   return state_ == State::open && backlog() > 0 && too_slow();
 }
 

@@ -122,6 +122,7 @@ class Client final : public Session {
   bool reads_enough() const noexcept;
   void writable();
   void write();
+  void write_on();
   void all_sent();
 
   // ---- waiting
@@ -140,6 +141,7 @@ class Client final : public Session {
   void cut_off_without_notice(CutOff what, const std::string& why);
   void tell_of(CutOff what, std::string_view why) noexcept;
   void look_at_deadlines(Clock::time_point now);
+  bool has_bound_too_late(Clock::time_point now) const noexcept;
   bool does_not_read(Clock::time_point now);
   void part();
   void close(std::string_view why) noexcept;
