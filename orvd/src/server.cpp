@@ -82,6 +82,7 @@ Server::Server(ServerParts parts)
 Server::~Server() {
   stop_workers();
   for (const auto& loop : loops_) loop->stop();
+  services_.binds.clear();  // a loop may have added some until it stopped
 }
 
 void Server::stop_workers() {

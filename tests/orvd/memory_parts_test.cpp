@@ -16,6 +16,7 @@
 #include "auth/identities.h"
 #include "auth/sasl_external.h"
 #include "core_bare_session.h"
+#include "net/limits.h"
 #include "ops/canonical.h"
 #include "ops/paged_results.h"
 #include "protocol/control_values.h"
@@ -54,6 +55,18 @@ void fail_each(const std::function<void(bool hit)>& check, const std::function<v
     if (testing::Test::HasFailure()) return;
   }
   FAIL() << "it never succeeds";
+}
+
+TEST(MemoryOfAConnection, ThatIsNotAdmittedIsNotCounted) {
+  ConnectionCounter counter;
+  const std::string address = "2001:db8:1234:5678::/64";
+  fail_each([&](bool) { EXPECT_EQ(counter.count(), 0); },
+            [&] {
+              try {
+                EXPECT_TRUE(counter.admit(address, 1, 1));
+              } catch (const std::bad_alloc&) {
+              }
+            });
 }
 
 std::vector<std::string> requests() {

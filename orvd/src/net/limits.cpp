@@ -50,13 +50,14 @@ void ConnectionCounter::Ticket::release() noexcept {
 
 ConnectionCounter::Ticket ConnectionCounter::admit(const std::string& address, std::int64_t in_all,
                                                    std::int64_t per_address) {
+  std::string kept(address);  // nothing is counted when there is no memory for it
   const std::lock_guard lock(mutex_);
   if (count_ >= in_all) return {};
   std::int64_t& here = by_address_[address];
   if (here >= per_address) return {};
   ++here;
   ++count_;
-  return Ticket(*this, address);
+  return Ticket(*this, std::move(kept));
 }
 
 void ConnectionCounter::leave(const std::string& address) noexcept {

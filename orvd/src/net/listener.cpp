@@ -189,7 +189,11 @@ void Listeners::accept(Listener& listener) {
 
 // What is lacking will not be there at once.
 void Listeners::cannot_accept(Listener& listener, const asio::error_code& error) {
-  services_.cut_offs.tell(CutOff::descriptors, "cannot accept a connection: " + error.message());
+  try {
+    services_.cut_offs.tell(CutOff::descriptors, "cannot accept a connection: " + error.message());
+  } catch (...) {
+    // Without memory the line is lost.
+  }
   if (no_descriptors_left(error) && listener.kind != Kind::local) turn_away(listener);
   listener.pause.expires_after(kAcceptPause);
   listener.pause.async_wait([this, &listener](const asio::error_code& stopped) {
