@@ -30,6 +30,7 @@ using test::kRoot;
 using test::kSecret;
 using test::kTop;
 using test::Reply;
+using test::tlv;
 using test::WireClient;
 
 class ConnectionTest : public test::BlockedServer {};
@@ -351,9 +352,10 @@ class FullServerTest : public BareSessionTest {
       return test::finish_search(parameters, code, 1);
     };
   }
-  int code_of(int id) {
+  int code_of(int id) { return code_of_request(test::search(id, kTop)); }
+  int code_of_request(const std::string& request) {
     session->sent.clear();
-    session->handle(test::search(id, kTop));
+    session->handle(request);
     EXPECT_TRUE(session->run_until([this] { return session->idle(); }));
     return session->sent.size() > 1000 ? 0 : result_in(session->sent).code;
   }
@@ -370,6 +372,21 @@ TEST_F(FullServerTest, SearchGetsWhatIsLeftOfTheCeilingAndIsRefusedWhenNothingIs
   session->sent.clear();
   session->output_is(0);
   EXPECT_EQ(code_of(5), 0);
+}
+
+TEST_F(FullServerTest, CopiesOfAnEntryGetHalfOfWhatIsLeftEach) {
+  services.supported_controls = {kPreReadOid};
+  bind_as_root();
+  const std::string wish =
+      tlv(0x30, tlv(0x04, kPreReadOid) + tlv(0x01, "\xFF") + tlv(0x04, tlv(0x30, "")));
+  const std::string plain = test::delete_entry(2, kTop);
+  const std::string reading = test::message(2, operation_in(plain), wish);
+  EXPECT_EQ(code_of_request(reading), 11);
+  EXPECT_EQ(backend.calls(parameter::delete_function), 0);
+  OutputShare other(services.output);
+  other.answered(4096);
+  EXPECT_EQ(code_of_request(reading), 51);
+  EXPECT_EQ(code_of_request(plain), 53);  // as the backend answers
 }
 
 }  // namespace

@@ -65,7 +65,6 @@ int take_persistent_search(Reading& reading) {
 
 int take_paged_results(Reading& reading) {
   if (!reading.control.value) return result::protocol_error;
-  reading.controls.paged_critical = reading.control.critical;
   return read_paged_results(*reading.control.value, reading.controls.paged.emplace());
 }
 

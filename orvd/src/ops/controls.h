@@ -39,7 +39,6 @@ struct ReadWish {
 struct RequestControls {
   PersistentWish persistent;
   std::optional<PagedResultsControl> paged;
-  bool paged_critical = false;
   std::optional<std::string> assertion;  // the text of a filter
   std::optional<ReadWish> pre_read;
   std::optional<ReadWish> post_read;
