@@ -24,10 +24,13 @@ class Key {
 
   [[nodiscard]] const unsigned char* data() const noexcept { return bytes_.data(); }
 
-  // In the memory for keys, where the process has set some apart.
+  // In the memory for keys, where the process has set some apart and some is left; in ordinary
+  // memory otherwise. It is wiped in either.
   static void* operator new(std::size_t size, const std::nothrow_t&) noexcept {
-    return OPENSSL_secure_malloc(size);
+    void* const memory = OPENSSL_secure_malloc(size);
+    return memory ? memory : OPENSSL_malloc(size);
   }
+  static void* operator new(std::size_t) = delete;  // nobody waits for an exception
   static void operator delete(void* key) noexcept { OPENSSL_secure_free(key); }
   static void operator delete(void* key, const std::nothrow_t&) noexcept {
     OPENSSL_secure_free(key);

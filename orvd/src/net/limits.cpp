@@ -6,6 +6,8 @@
 #include <limits>
 #include <utility>
 
+#include "process/key_memory.h"
+
 namespace orv::server {
 namespace {
 
@@ -18,6 +20,14 @@ asio::ip::address_v6 network(const asio::ip::address_v6& address) {
   return asio::ip::address_v6(bytes, address.scope_id());
 }
 
+std::int64_t connections_by_descriptors() noexcept {
+  constexpr rlim_t kMost = std::numeric_limits<std::int32_t>::max();
+  rlimit files{};
+  if (::getrlimit(RLIMIT_NOFILE, &files) != 0) return static_cast<std::int64_t>(kMost);
+  const rlim_t all = std::min(files.rlim_cur, kMost);  // RLIM_INFINITY is the largest
+  return all > kOtherDescriptors ? static_cast<std::int64_t>(all - kOtherDescriptors) : 0;
+}
+
 }  // namespace
 
 std::string counted_as(const asio::ip::address& address) {
@@ -25,12 +35,15 @@ std::string counted_as(const asio::ip::address& address) {
   return network(address.to_v6()).to_string() + "/64";
 }
 
+Room room_for_connections() noexcept {
+  const std::int64_t by_files = connections_by_descriptors();
+  const std::int64_t by_keys = connections_with_room_for_keys();
+  if (by_keys < by_files) return {by_keys, "the memory for keys"};
+  return {by_files, "the limit of open files (RLIMIT_NOFILE)"};
+}
+
 std::int64_t connections_that_fit() noexcept {
-  constexpr rlim_t kMost = std::numeric_limits<std::int32_t>::max();
-  rlimit files{};
-  if (::getrlimit(RLIMIT_NOFILE, &files) != 0) return static_cast<std::int64_t>(kMost);
-  const rlim_t all = std::min(files.rlim_cur, kMost);  // RLIM_INFINITY is the largest
-  return all > kOtherDescriptors ? static_cast<std::int64_t>(all - kOtherDescriptors) : 0;
+  return room_for_connections().connections;
 }
 
 ConnectionCounter::Ticket::Ticket(Ticket&& other) noexcept

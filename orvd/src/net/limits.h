@@ -13,9 +13,15 @@ namespace orv::server {
 // has as many addresses as it likes; except on the link, where all hosts share one.
 std::string counted_as(const asio::ip::address& address);
 
-// How many connections from other hosts there may be by the descriptors that the process may open
-// (RLIMIT_NOFILE), so that some are left for files, and for who administers the server on its own
-// host.
+// How many connections from other hosts there may be by what the process has: by the descriptors
+// that it may open (RLIMIT_NOFILE), so that some are left for files, and for who administers the
+// server on its own host; and by the memory for keys. `bound` says for people which of the two it
+// is.
+struct Room {
+  std::int64_t connections = 0;
+  const char* bound = "";
+};
+Room room_for_connections() noexcept;
 std::int64_t connections_that_fit() noexcept;
 
 // Thread-safe; must outlive its tickets.

@@ -164,11 +164,11 @@ bool Listeners::has(Kind kind) const noexcept {
 
 void Listeners::start(std::shared_ptr<const Settings> settings) {
   settings_ = std::move(settings);
-  if (settings_->max_connections > connections_that_fit())
+  const Room room = room_for_connections();
+  if (settings_->max_connections > room.connections)
     services_.logs.warning("orv-slapdMaxConnections is " +
-                           std::to_string(settings_->max_connections) +
-                           ", but the limit of open files (RLIMIT_NOFILE) has room for " +
-                           std::to_string(connections_that_fit()) + " connections");
+                           std::to_string(settings_->max_connections) + ", but " + room.bound +
+                           " has room for " + std::to_string(room.connections) + " connections");
   for (const auto& listener : listeners_) accept(*listener);
 }
 
