@@ -30,7 +30,11 @@ class Key {
     void* const memory = OPENSSL_secure_malloc(size);
     return memory ? memory : OPENSSL_malloc(size);
   }
-  static void* operator new(std::size_t) = delete;  // nobody waits for an exception
+  static void* operator new(std::size_t size) {
+    void* const memory = operator new(size, std::nothrow);
+    if (!memory) throw std::bad_alloc();
+    return memory;
+  }
   static void operator delete(void* key) noexcept { OPENSSL_secure_free(key); }
   static void operator delete(void* key, const std::nothrow_t&) noexcept {
     OPENSSL_secure_free(key);
