@@ -89,6 +89,25 @@ bool option_of(int socket, int option, int& value) noexcept {
   return ::getsockopt(socket, SOL_SOCKET, option, &value, &size) == 0;
 }
 
+// Whoever may write to a Unix socket may connect to it, and what comes over it counts as local: a
+// proof of who somebody is, not bounded as strangers are. A name outside the file system has no
+// rights at all.
+std::string openness_of(int socket) {
+  sockaddr_un address{};
+  socklen_t size = sizeof address;
+  if (::getsockname(socket, reinterpret_cast<sockaddr*>(&address), &size) != 0)
+    return "has no name that can be told: " + std::string(std::strerror(errno));
+  // A path that fills the address has no NUL behind it.
+  const std::string path(address.sun_path, ::strnlen(address.sun_path, sizeof address.sun_path));
+  struct stat status {};
+  if (!path.empty() && ::stat(path.c_str(), &status) != 0)
+    return "is at " + path + ", which cannot be examined: " + std::strerror(errno);
+  if (!path.empty() && (status.st_mode & S_IWOTH) == 0) return "";
+  return "lets every user of the host connect; set SocketMode=0600 and SocketUser= to the user of "
+         "the server in its socket unit" +
+         std::string(path.empty() ? ", and ListenStream= to a path" : "");
+}
+
 // Why it cannot be accepted from; "" when it can.
 std::string defect_of(ListeningSocket& taken, const std::string& name) {
   const int socket = taken.socket.number();
@@ -104,6 +123,8 @@ std::string defect_of(ListeningSocket& taken, const std::string& name) {
       (!local && taken.family != AF_INET && taken.family != AF_INET6))
     return "is not of the family that its name says: ldap and ldaps are IPv4 or IPv6, ldapi is a "
            "Unix socket";
+  if (local)
+    if (std::string openness = openness_of(socket); !openness.empty()) return openness;
   const int flags = ::fcntl(socket, F_GETFL);
   if (flags < 0 || ::fcntl(socket, F_SETFL, flags | O_NONBLOCK) != 0 ||
       ::fcntl(socket, F_SETFD, FD_CLOEXEC) != 0)
@@ -173,7 +194,7 @@ int inherited_count() noexcept {
   const char* const count = std::getenv("LISTEN_FDS");
   if (!process || !count || number_in<pid_t>(process) != ::getpid()) return 0;
   const int number = number_in<int>(count).value_or(0);
-  return number < 0 || number > kMostInherited ? 0 : number;
+  return std::clamp(number, 0, kMostInherited + 1);
 }
 
 bool inherit_sockets(std::vector<ListeningSocket>& sockets, std::string& error) {
@@ -181,6 +202,11 @@ bool inherit_sockets(std::vector<ListeningSocket>& sockets, std::string& error) 
   take_variable("LISTEN_PID");
   take_variable("LISTEN_FDS");
   const std::vector<std::string> names = split(take_variable("LISTEN_FDNAMES"));
+  if (count > kMostInherited) {
+    error = "more than " + std::to_string(kMostInherited) +
+            " sockets are handed over (LISTEN_FDS); list fewer in the socket units";
+    return false;
+  }
   for (int i = 0; i < count; ++i) {
     const int number = kFirstInherited + i;
     const auto place = static_cast<std::size_t>(i);

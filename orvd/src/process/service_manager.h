@@ -43,13 +43,14 @@ class ServiceManager {
 };
 
 // How many descriptors a service manager says to have handed over, from 3 on; 0 when the variables
-// are absent or meant for another process.
+// are absent or meant for another process. Of more than can be taken over, one more than that.
 int inherited_count() noexcept;
 
 // Takes over those sockets, marked to be closed in programs that are started, and takes the
 // variables out of the environment. Each is named (FileDescriptorName=) by what it is for: ldap,
 // ldaps or ldapi. False, with the cause and what to do, when one has another name, is no listening
-// stream socket, or not of the family of its name.
+// stream socket, or not of the family of its name, when every user of the host may connect to one
+// of ldapi, and when there are more than 64.
 bool inherit_sockets(std::vector<ListeningSocket>& sockets, std::string& error);
 
 }  // namespace orv::server
