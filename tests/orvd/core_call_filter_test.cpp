@@ -67,6 +67,10 @@ TEST(CallFilterTest, BecomingAnotherUserEndsTheProcess) {
   EXPECT_EQ(end_of([] { return setgid(1); }), -SIGSYS);
 }
 
+TEST(CallFilterTest, RightsAreNotSetAndTheProcessGoesOn) {
+  EXPECT_EQ(end_of([] { return is_missing(syscall(SYS_capset, nullptr, nullptr)); }), 0);
+}
+
 TEST(CallFilterTest, ThreadsCanBeMadeAndProcessesCannot) {
   EXPECT_EQ(end_of([] {
               std::atomic<int> result{1};

@@ -1,5 +1,6 @@
 #include "process/surroundings.h"
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
@@ -7,6 +8,7 @@
 
 #include <algorithm>
 #include <array>
+#include <charconv>
 #include <climits>
 #include <csignal>
 #include <cstddef>
@@ -22,7 +24,7 @@ namespace {
 // Names, and beginnings of names that end with '*'.
 constexpr std::string_view kKept[] = {
     "LANG", "LANGUAGE", "LC_*", "LOCPATH", "NLSPATH", "CHARSET", "OUTPUT_CHARSET", "GCONV_PATH",
-    "TZ", "TZDIR", "PATH", "TMPDIR", "OPENSSL_*", "SSL_CERT_*", "KRB5*", "SASL_*",
+    "TZ", "TZDIR", "TMPDIR", "OPENSSL_*", "SSL_CERT_*", "KRB5*",
     // of sanitizers, coverage and the allocator
     "ASAN_*", "LSAN_*", "TSAN_*", "UBSAN_*", "GCOV_*", "MALLOC_*", "GLIBC_TUNABLES"};
 
@@ -59,6 +61,19 @@ void raise_descriptor_limit() noexcept {
   ::setrlimit(RLIMIT_NOFILE, &files);
 }
 
+// Closes what the process has open from this descriptor on, one after the other.
+void close_each_from(int first) noexcept {
+  DIR* const open = ::opendir("/proc/self/fd");
+  if (!open) return;
+  while (const dirent* const entry = ::readdir(open)) {
+    const std::string_view name = entry->d_name;
+    int number = -1;
+    std::from_chars(name.data(), name.data() + name.size(), number);
+    if (number >= first && number != ::dirfd(open)) ::close(number);
+  }
+  ::closedir(open);
+}
+
 }  // namespace
 
 void settle_standard_streams() noexcept {
@@ -71,7 +86,9 @@ void settle_standard_streams() noexcept {
 }
 
 void close_inherited_descriptors(int kept) noexcept {
-  ::close_range(static_cast<unsigned>(STDERR_FILENO + 1 + kept), UINT_MAX, 0);
+  const int first = STDERR_FILENO + 1 + kept;
+  // Older kernels do not have it, and filters of containers do not let it through.
+  if (::close_range(static_cast<unsigned>(first), UINT_MAX, 0) != 0) close_each_from(first);
 }
 
 void clean_environment() noexcept {

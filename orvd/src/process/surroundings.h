@@ -17,7 +17,8 @@ void close_inherited_descriptors(int kept) noexcept;
 
 // Takes every variable away that the server or its libraries have no use for, and overwrites what
 // it said: environments hold secrets of those who start programs. Kept are locale and time zone,
-// the settings of OpenSSL, Kerberos and SASL, and what tools for testing look for.
+// the settings of OpenSSL and Kerberos (which TMPDIR is one of), and what tools for testing look
+// for.
 void clean_environment() noexcept;
 
 // No file that is made is anybody else's, no folder is held, no signal is ignored or blocked that
