@@ -1,5 +1,6 @@
 // orvcfg: makes instances, and checks and shows configuration files. See orvcfg(1).
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <CLI/CLI.hpp>
 #include <cstdlib>
@@ -14,6 +15,7 @@
 #include "instance.h"
 #include "show.h"
 #include "slapi/account.h"
+#include "slapi/file_trust.h"
 
 namespace {
 
@@ -97,6 +99,10 @@ int run_init(const Arguments& arguments) {
       !orv::find_account(arguments.user, arguments.group, owner.emplace(), why))
     return fail(why);
   if (!orv::orvcfg::create_instance(arguments.directory, owner, instance, why)) return fail(why);
+  // The server would not start.
+  for (const std::string& problem : orv::distrusted_files(instance.config(), instance.key_stash(),
+                                                          owner ? owner->user : ::geteuid()))
+    std::cerr << "orvcfg: warning: the server will refuse this: " << problem << "\n";
   print_welcome(instance, arguments);
   return finish_output();
 }

@@ -320,6 +320,16 @@ std::vector<std::string> distrusted_files(const Options& options) {
       may_be_anybodys ? owner_of(options.config_file, geteuid()) : geteuid());
 }
 
+// Reports them, and to root also that it need not be the one to serve them.
+bool trusts_files(const Options& options) {
+  if (report_problems(distrusted_files(options))) return true;
+  const uid_t owner = owner_of(options.config_file, 0);
+  if (geteuid() == 0 && owner != 0)
+    std::fprintf(stderr, "orvd: or start with --user %s, to serve as the owner of the file\n",
+                 user_name(owner).c_str());
+  return false;
+}
+
 // Files that nothing may be written to but what belongs there.
 std::vector<std::string> own_files(const Options& options) {
   const std::string& config = options.config_file;  // without symbolic links
@@ -603,7 +613,7 @@ int serve(const Options& options, const Settings& settings, const GuardedFiles& 
 int run(const Options& options, const FileIdentity& standard_error, Inheritance& inherited) {
   if (!become_user(options) ||
       !report_problems(missing_read_access({options.config_file, options.key_stash_file})) ||
-      !report_problems(distrusted_files(options)))
+      !trusts_files(options))
     return 1;
   if (!apply_options(options)) return 1;
   if (cfg::register_attribute_types(builtin_schema().attribute_table()) != 0) return 1;

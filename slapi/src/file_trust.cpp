@@ -41,7 +41,8 @@ bool is_foreign(const struct stat& status, uid_t user) {
 
 std::string owned_by_another(const std::string& what, const struct stat& status, uid_t user) {
   return what + " belongs to " + user_name(status.st_uid) +
-         ", who could put anything there; it must be " + user_name(user) + "'s or root's (chown)";
+         ", who could put anything there; it must be " +
+         (user == 0 ? "root's" : user_name(user) + "'s or root's") + " (chown)";
 }
 
 Problem problem_of_folder(const std::string& folder, uid_t user) {

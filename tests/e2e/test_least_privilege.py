@@ -169,8 +169,25 @@ def test_files_that_the_user_cannot_read_are_named(owned):
 def test_root_does_not_serve_files_of_another_user(owned):
     code, told = owned.start_refused()
     assert code == 1 and "belongs to %d" % users.USER in told
+    assert "it must be root's (chown)" in told
+    assert "or start with --user %d" % users.USER in told
     subprocess.run([*owned.command(), "--check"], check=True, stdout=subprocess.PIPE,
                    timeout=programs.DEADLINE)  # it may look at them
+
+
+@users.needs_root
+def test_instance_that_the_server_would_refuse_is_told_of_when_it_is_made(open_folder):
+    folder = open_folder / "instance"
+    folder.mkdir(mode=0o700)
+    users.give(folder)
+    made = subprocess.run([programs.orvcfg(), "init", "--dir", folder], check=True, text=True,
+                          stdout=subprocess.PIPE, stderr=subprocess.PIPE, timeout=programs.DEADLINE)
+    assert "warning: the server will refuse this: %s: this folder belongs to" % folder in made.stderr
+    other = open_folder / "other"
+    users.give(open_folder, 0, 0)
+    made = subprocess.run([programs.orvcfg(), "init", "--dir", other], check=True, text=True,
+                          stdout=subprocess.PIPE, stderr=subprocess.PIPE, timeout=programs.DEADLINE)
+    assert made.stderr == ""
 
 
 def test_server_that_stays_root_says_so(server):
