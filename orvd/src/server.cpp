@@ -161,7 +161,7 @@ void Server::await_signal() {
     if (number != SIGHUP) return stop();
     await_signal();
     if (parts_.manager) parts_.manager->reloading();
-    reload();
+    renew_settings();  // whatever becomes of it, the manager hears of its end
     tell_ready();
   });
 }
@@ -307,7 +307,7 @@ void Server::reload() {
   asio::post(control_, [this, settings = settings_] { listeners_.renew(settings); });
 }
 
-// After a change over LDAP, which stays whatever becomes of this.
+// After a change over LDAP, which stays whatever becomes of this, and at a signal.
 void Server::renew_settings() noexcept {
   try {
     reload();

@@ -89,6 +89,7 @@ class LoopbackServer : public testing::Test {
                       look_after,
                       changes_made};
     parts.mechanisms = &mechanisms;
+    parts.manager = manager;
     server.emplace(std::move(parts));
     std::string error;
     ASSERT_TRUE(server->listen(addresses, 0, error, more)) << error;
@@ -138,6 +139,7 @@ class LoopbackServer : public testing::Test {
   std::vector<std::string> addresses{"127.0.0.1"};
   MoreListeners more;
   SaslMechanisms mechanisms;
+  const ServiceManager* manager = nullptr;
   unsigned loops = 1;
   std::optional<Server> server;
   std::thread control;

@@ -3,16 +3,24 @@
 
 #include <gtest/gtest.h>
 
+#include <sys/socket.h>
+#include <sys/un.h>
 #include <unistd.h>
 
 #include <atomic>
 #include <csignal>
+#include <cstddef>
 #include <cstdlib>
+#include <cstring>
 #include <optional>
+#include <stdexcept>
+#include <string>
 #include <thread>
 
 #include "cfg/owners.h"
 #include "core_server_fixture.h"
+#include "descriptor.h"
+#include "process/service_manager.h"
 
 namespace orv::server {
 namespace {
@@ -684,6 +692,45 @@ TEST_F(ServerTest, ReloadTakesNewLimitsOverForOpenConnections) {
   int code = 0;
   while (code == 0 && Clock::now() < end) code = code_of(client, test::search(3, kTop));
   EXPECT_EQ(code, 4);
+}
+
+// What a service manager is sent.
+class Notices {
+ public:
+  Notices() : socket_(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0)) {
+    const std::string name = "orv-notices-" + std::to_string(::getpid());
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::memcpy(address.sun_path + 1, name.data(), name.size());
+    const auto size = static_cast<socklen_t>(offsetof(sockaddr_un, sun_path) + 1 + name.size());
+    const timeval patience{10, 0};
+    ::setsockopt(socket_.number(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
+    ::bind(socket_.number(), reinterpret_cast<const sockaddr*>(&address), size);
+    ::setenv("NOTIFY_SOCKET", ("@" + name).c_str(), 1);
+  }
+  std::string next() {
+    char text[512];
+    const ssize_t size = ::recv(socket_.number(), text, sizeof text, 0);
+    return size < 0 ? "nothing" : std::string(text, text + size);
+  }
+
+ private:
+  Descriptor socket_;
+};
+
+TEST_F(ServerTest, ManagerHearsTheEndOfAReloadThatFails) {
+  Notices notices;
+  ServiceManager connected;
+  std::string error;
+  ASSERT_TRUE(connected.connect(error)) << error;
+  manager = &connected;
+  reload = [](Settings&) -> bool { throw std::runtime_error("no memory"); };
+  start();
+  EXPECT_TRUE(notices.next().starts_with("READY=1\n"));
+  std::raise(SIGHUP);
+  EXPECT_TRUE(notices.next().starts_with("RELOADING=1\n"));
+  EXPECT_TRUE(notices.next().starts_with("READY=1\n"));
+  stop();  // before the manager goes
 }
 
 TEST_F(BlockedServerTest, StopFinishesTheOperationInHandAndClosesTheBackend) {
