@@ -73,6 +73,17 @@ TEST_F(LocalSocketTest, IsForItsOwnerAndGoesWithTheServer) {
   EXPECT_FALSE(std::filesystem::exists(path));
 }
 
+TEST_F(LocalSocketTest, IsForItsOwnerWhateverTheUmaskLeaves) {
+  const mode_t before = ::umask(0);
+  LocalSocket local;
+  const Descriptor listening = local.listen(path, error);
+  ::umask(before);
+  ASSERT_TRUE(listening) << error;
+  struct stat status {};
+  ASSERT_EQ(::stat(path.c_str(), &status), 0);
+  EXPECT_EQ(status.st_mode & 0777U, 0600U);
+}
+
 TEST_F(LocalSocketTest, ReplacesOneThatAServerLeftBehind) {
   {
     LocalSocket killed;

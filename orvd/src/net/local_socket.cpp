@@ -50,7 +50,11 @@ bool LocalSocket::bind(int socket, const std::string& path, std::string& error) 
     return false;
   }
   if (is_left_behind(address)) ::unlink(path.c_str());
-  if (::bind(socket, plain(address), sizeof address) == 0) return true;
+  // The name has the rights that the socket has when it is given one: there is no moment in which
+  // it has others, and no file of somebody else's that could get them.
+  if (::fchmod(socket, S_IRUSR | S_IWUSR) == 0 &&
+      ::bind(socket, plain(address), sizeof address) == 0)
+    return true;
   error = failure(path, std::strerror(errno));
   return false;
 }
@@ -65,9 +69,7 @@ Descriptor LocalSocket::listen(const std::string& path, std::string& error) {
     device_ = status.st_dev;
     inode_ = status.st_ino;
   }
-  // Nobody can connect before it listens.
-  if (::chmod(path.c_str(), S_IRUSR | S_IWUSR) == 0 && ::listen(socket.number(), kQueue) == 0)
-    return socket;
+  if (::listen(socket.number(), kQueue) == 0) return socket;
   error = failure(path, std::strerror(errno));
   return Descriptor();
 }
