@@ -593,7 +593,11 @@ int serve(const Options& options, const Settings& settings, const GuardedFiles& 
                    return take_over(consequences, made, identities, options, logs);
                  },
                  options.guards, [&identities] { identities.refresh(); }, cfg_changes_made,
-                 &mechanisms, &inherited.manager});
+                 &mechanisms, &inherited.manager,
+                 [&options](Settings& now) {
+                   std::string error;
+                   return read_settings(options.config_file, options.key_stash_file, now, error);
+                 }});
   if (!server.take(std::move(inherited.sockets), error) ||
       !server.listen({}, 0, error, more_listeners(options, settings))) {
     std::fprintf(stderr, "orvd: %s\n", error.c_str());

@@ -72,6 +72,7 @@ Server::Server(ServerParts parts)
   services_.take_over = parts_.take_over;
   services_.changes_made = parts_.changes_made;
   services_.renew_settings = [this] { renew_settings(); };
+  services_.read_settings = parts_.read_settings;
   services_.mechanisms = parts_.mechanisms;
   services_.local_verifiers = &own_work_;
   services_.tls = &tls_;

@@ -49,9 +49,10 @@ struct ServerParts {
   // Looks after what time may have changed, about once a second and on a worker. Must not throw.
   // May be empty.
   std::function<void()> look_after{};
-  unsigned long (*changes_made)() = nullptr;   // Services::changes_made
-  const SaslMechanisms* mechanisms = nullptr;  // null: none
-  const ServiceManager* manager = nullptr;     // who is told how the server is; null: nobody
+  unsigned long (*changes_made)() = nullptr;       // Services::changes_made
+  const SaslMechanisms* mechanisms = nullptr;      // null: none
+  const ServiceManager* manager = nullptr;         // who is told how the server is; null: nobody
+  std::function<bool(Settings&)> read_settings{};  // Services::read_settings
 };
 
 // Where a server listens, besides its addresses for connections in clear.

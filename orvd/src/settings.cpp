@@ -244,6 +244,26 @@ std::string value_problem(std::string_view name, std::string_view value) {
   return "";
 }
 
+bool apply_tls_file(std::string_view name, std::string_view value, TlsSettings& tls) {
+  if (name == "orv-slapdTlsCertificateFile") {
+    tls.certificate_file = value;
+  } else if (name == "orv-slapdTlsKeyFile") {
+    tls.key_file = value;
+  } else if (name == "orv-slapdTlsCaFile") {
+    tls.ca_file = value;
+  } else if (name == "orv-slapdTlsClientCertificate") {
+    std::size_t word = 0;
+    while (word < std::size(kClientCertificates) &&
+           !cfg::equals_ignore_ascii_case(kClientCertificates[word], value))
+      ++word;
+    tls.client_certificates = static_cast<ClientCertificates>(
+        word < std::size(kClientCertificates) ? word : std::size_t{0});
+  } else {
+    return false;
+  }
+  return true;
+}
+
 bool apply_setting(const SettingRow& row, std::string_view value, Settings& settings,
                    std::string& error) {
   std::int64_t number = 0;

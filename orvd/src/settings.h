@@ -95,6 +95,10 @@ std::string value_problem(std::string_view name, std::string_view value);
 bool apply_setting(const SettingRow& row, std::string_view value, Settings& settings,
                    std::string& error);
 
+// Puts a value into what certificates are loaded by; "" where the setting is gone. False when it is
+// none of those settings, and nothing is done.
+bool apply_tls_file(std::string_view name, std::string_view value, TlsSettings& tls);
+
 // Reads the file (opened with the key stash when one is named; "" for none). False when it cannot
 // be read (`error` then names file, line, column and cause) or when a setting is out of its bounds.
 bool read_settings(const std::string& config_file, const std::string& key_stash_file,

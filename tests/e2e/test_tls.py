@@ -364,6 +364,31 @@ def test_values_that_the_server_would_not_start_with_are_refused(root, name, val
     assert clients.read(root, GROUP) == before
 
 
+@pytest.mark.parametrize("name", ["orv-slapdTlsCertificateFile", "orv-slapdTlsKeyFile"])
+def test_files_that_the_server_would_not_start_with_are_refused(root, tmp_path, name):
+    before = clients.read(root, GROUP)
+    rubbish = tmp_path / "rubbish"
+    rubbish.write_text("no certificate")
+    rubbish.chmod(0o600)
+    for path in (rubbish, tmp_path / "nothing"):
+        with pytest.raises(ldap.UNWILLING_TO_PERFORM) as refusal:
+            set_value(root, GROUP, name, str(path))
+        assert str(path) in refusal.value.args[0]["info"]
+    with pytest.raises(ldap.UNWILLING_TO_PERFORM):  # nobody says who signs them
+        set_value(root, GROUP, "orv-slapdTlsClientCertificate", "required")
+    assert clients.read(root, GROUP) == before
+
+
+def test_certificate_and_key_change_in_one_request(server, root, tmp_path):
+    certificate, key = Authority(tmp_path / "ca").pair("renewed")
+    with pytest.raises(ldap.UNWILLING_TO_PERFORM):
+        set_value(root, GROUP, "orv-slapdTlsKeyFile", str(key))
+    first = presented(server)
+    modify(root, GROUP, (ldap.MOD_REPLACE, "orv-slapdTlsCertificateFile", [str(certificate)]),
+           (ldap.MOD_REPLACE, "orv-slapdTlsKeyFile", [str(key)]))
+    assert presented(server) != first
+
+
 # ---- a new certificate
 
 def test_hangup_takes_the_new_certificate_and_keeps_old_connections(server, tmp_path):

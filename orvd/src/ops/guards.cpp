@@ -4,6 +4,7 @@
 
 #include "cfg/result_codes.h"
 #include "cfg/text.h"
+#include "net/tls.h"
 #include "settings.h"
 #include "slapi/connection.h"
 
@@ -12,6 +13,7 @@ namespace {
 
 constexpr std::string_view kPolicy = "CN=PWDPOLICY ADMIN,CN=CONFIGURATION";
 constexpr std::string_view kPassThrough = "CN=PASSTHROUGH AUTHENTICATION,CN=CONFIGURATION";
+constexpr std::string_view kAdminGroup = "CN=ADMINGROUP,CN=CONFIGURATION";
 constexpr std::string_view kObjectClass = "objectClass";
 
 constexpr Guard kGuards[] = {
@@ -73,6 +75,24 @@ Refusal refuse_values(std::string_view normal_dn, std::string_view type,
   return {};
 }
 
+std::string_view text_of(const berval* value) noexcept {
+  return {value->bv_val, value->bv_len};
+}
+
+// The settings have one value each. What is taken away goes first, as the order of a folded list
+// does not matter. Whether there is anything for them.
+bool apply_tls_changes(const ldapmod* first, TlsSettings& tls) {
+  bool any = false;
+  for (const ldapmod* change = first; change; change = change->mod_next)
+    if (change->operation() != kModAdd) any |= apply_tls_file(change->mod_type, "", tls);
+  for (const ldapmod* change = first; change; change = change->mod_next) {
+    const berval* const* const values = change->mod_vals.modv_bvals;
+    if (change->operation() != kModDelete && values && *values)
+      any |= apply_tls_file(change->mod_type, text_of(*values), tls);
+  }
+  return any;
+}
+
 }  // namespace
 
 std::span<const Guard> entry_guards() noexcept {
@@ -98,6 +118,21 @@ Refusal guarded_modification(std::string_view normal_dn, const ldapmod* first) {
       return refusal;
   }
   return {};
+}
+
+Refusal guarded_tls_files(std::string_view normal_dn, const ldapmod* first, unsigned authority,
+                          const std::function<bool(Settings&)>& read_settings) {
+  TlsSettings scratch;
+  Settings wanted;
+  if (!read_settings || normal_dn != kAdminGroup || !is_primary(authority) ||
+      !apply_tls_changes(first, scratch) || !read_settings(wanted))
+    return {};
+  apply_tls_changes(first, wanted.tls);
+  std::string error;
+  if (wanted.tls.certificate_file.empty() || TlsContext::load(wanted.tls, error)) return {};
+  return {result::unwilling_to_perform,
+          "the server could not start with these files of TLS: " + error +
+              "; change those that belong together in one request"};
 }
 
 }  // namespace orv::server

@@ -5,10 +5,12 @@
 // memory.
 #pragma once
 
+#include <functional>
 #include <span>
 #include <string_view>
 
 #include "ops/canonical.h"
+#include "settings.h"
 #include "slapi/entry.h"
 
 namespace orv::server {
@@ -36,5 +38,13 @@ Refusal guarded(GuardedChange change, std::string_view normal_dn, unsigned autho
 
 // The same for what a modification puts in.
 Refusal guarded_modification(std::string_view normal_dn, const ldapmod* first);
+
+// 53 when the files of TLS that a folded list of modifications leaves at CN=ADMINGROUP cannot be
+// used, with which the server would not start: they are loaded to see. `read_settings` reads what
+// the file says now; where it is empty or fails nothing is refused, and to others than the primary
+// administrator neither: the rules refuse them anyway, and they must not learn what files there
+// are.
+Refusal guarded_tls_files(std::string_view normal_dn, const ldapmod* first, unsigned authority,
+                          const std::function<bool(Settings&)>& read_settings);
 
 }  // namespace orv::server

@@ -137,7 +137,8 @@ Refusal PendingOperation::prepare(Services& services, const ModifyRequest& reque
     return {result::other, ""};
   }
   if (!services.guards || form == ListForm::as_sent) return {};
-  return guarded_modification(normal_dn, first);
+  if (Refusal refusal = guarded_modification(normal_dn, first)) return refusal;
+  return guarded_tls_files(normal_dn, first, operation_.authority, services.read_settings);
 }
 
 Refusal PendingOperation::prepare_controls(Services& services, const RequestControls& controls) {

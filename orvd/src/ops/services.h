@@ -89,6 +89,8 @@ struct Services {
   // Takes the settings of the file over, outside the gate and on a worker. May be empty; must not
   // throw.
   std::function<void()> renew_settings{};
+  // Reads the settings that the file has now, of whoever asks. May be empty.
+  std::function<bool(Settings&)> read_settings{};
   bool guards = true;  // the server's own, in front of the backend
   // How many changes this thread has made to the file, as the library counts them: a backend that
   // reports a change without having made one is not believed. Null: it always is.
