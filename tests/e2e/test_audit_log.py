@@ -152,6 +152,7 @@ def test_a_symbolic_link_is_not_followed(instance):
     root.delete_s(member_dn("alice"))
     assert target.read_bytes() == b"precious"
     assert instance.stderr.wait_for(lambda line: "cannot record changes" in line)
+    instance.stop()
     lost = [line for line in instance.stderr.lines() if "made without record" in line]
     assert len(lost) == 1
 
