@@ -309,7 +309,7 @@ class LdifIndex::Builder {
     const NameFilter special = special_names_;
     const ObjectClassLookup& classes = classes_;
     const auto plain = [&special, &classes](std::string_view type, std::string_view value) {
-      if (!is_ascii_letter(type.front())) return false;
+      if (type.empty() || !is_ascii_letter(type.front())) return false;
       if (!special.may_hold(type)) return true;
       return type == kObjectClass && classes.is_surely_own_name(plain_value(value));
     };

@@ -94,7 +94,7 @@ TEST_F(AddTest, LongLinesAreFoldedAt76Columns) {
   std::istringstream lines(after);
   for (std::string line; std::getline(lines, line);) {
     longest = std::max(longest, line.size());
-    EXPECT_NE(line.back(), ' ') << line;
+    EXPECT_FALSE(line.ends_with(' ')) << line;
   }
   EXPECT_EQ(longest, 76U);
   EXPECT_EQ(search(reopen(), "cn=a,cn=top", 0, nullptr)[0].attributes[1].second, Values{value});

@@ -437,6 +437,7 @@ TEST_F(CancelTest, ThatIsOutstandingCanNeitherBeCanceledNorHaveItsIdUsedAgain) {
   client().send(test::search(3, ""));
   EXPECT_EQ(client().receive()->tag, test::kNotice);
   go_on.happen();
+  stop();  // the search waits for what goes out of scope here
 }
 
 TEST_F(CancelTest, OfASearchThatIsThenAbandonedComesTooLate) {
