@@ -58,6 +58,17 @@ class BareSession final : public Session {
     }
     return done();
   }
+  // Runs what was posted for afterwards: it holds the session.
+  void run_posted() {
+    for (;;) {
+      std::unique_lock lock(mutex_);
+      if (posted_.empty()) return;
+      const auto work = std::move(posted_.front());
+      posted_.pop_front();
+      lock.unlock();
+      work();
+    }
+  }
   void fail_to_post(int times) { failing_ = times; }
   int failed_posts() const { return failed_; }
 

@@ -119,6 +119,7 @@ TEST_P(MemoryOfAnExchange, LeavesNothingBehindWhenItFails) {
     client->output_is(0);
     client->client_left();
     EXPECT_TRUE(client->run_until([&] { return client->idle(); }));
+    client->run_posted();
     EXPECT_TRUE(gate_is_open());
     EXPECT_TRUE(searches_are_gone());
     EXPECT_EQ(services.output.room(), OutputMeter::kDefaultCeiling);
