@@ -4,7 +4,6 @@
 
 #include <algorithm>
 #include <atomic>
-#include <csignal>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -667,9 +666,6 @@ int run(const Options& options, const FileIdentity& standard_error, Inheritance&
         announce_controls();
         status = serve(options, settings, guarded, logs, audit, identities, place, inherited);
         recorded = audit.finish();
-        // The end is asked for already: being told once more must not cut it short.
-        std::signal(SIGTERM, SIG_IGN);
-        std::signal(SIGINT, SIG_IGN);
       }
     }
   }

@@ -38,6 +38,14 @@ constexpr std::chrono::seconds kLockPatience{1};
   std::_Exit(1);
 }
 
+// Asio gives a signal back to the system, for which it is the end of the process, with the last set
+// that holds it. This one stands until the process ends, so that being told to stop once more never
+// cuts the stop short.
+void hold_stop_signals() {
+  static auto& nobody_runs = *new asio::io_context;
+  [[maybe_unused]] static const auto& held = *new asio::signal_set(nobody_runs, SIGTERM, SIGINT);
+}
+
 }  // namespace
 
 Server::Server(ServerParts parts)
@@ -153,6 +161,7 @@ void Server::renew_certificate(Settings& wanted) {
 
 void Server::handle_signals() {
   for (const int number : {SIGTERM, SIGINT, SIGHUP}) signals_.add(number);
+  hold_stop_signals();
   await_signal();
 }
 
