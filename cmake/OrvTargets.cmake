@@ -17,5 +17,10 @@ function(orv_add_test name)
   # Optimising test code takes four times as long as compiling it, and gains nothing: the time of a
   # test is spent in what it tests.
   target_compile_options(${name} PRIVATE -O0 -g1)
-  gtest_discover_tests(${name} DISCOVERY_TIMEOUT 60 PROPERTIES TIMEOUT 120)
+  # Seconds. A test of five runs for two minutes under a sanitizer beside other work.
+  set(patience 120)
+  if(ORV_SANITIZE)
+    set(patience 600)
+  endif()
+  gtest_discover_tests(${name} DISCOVERY_TIMEOUT 60 PROPERTIES TIMEOUT ${patience})
 endfunction()
