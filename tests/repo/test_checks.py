@@ -1,13 +1,16 @@
 """Shows that each check of the repository finds what it is to find."""
 
 import os
+import pathlib
 import sys
 import tempfile
 import unittest
 
-sys.path.insert(0, os.path.dirname(os.path.abspath(__file__)))
+sys.path[:0] = [os.path.dirname(os.path.abspath(__file__)),
+                os.path.dirname(os.path.dirname(os.path.abspath(__file__)))]
 
 import check_arrows  # noqa: E402
+import check_behaviours  # noqa: E402
 import check_configuration_doc  # noqa: E402
 import check_named_tests  # noqa: E402
 import check_readme  # noqa: E402
@@ -149,6 +152,79 @@ class NamedTests(Tree):
         bad = head + "| a | `Suite.Three`, `.Four`, `test_two`, `No.*`, `x/y` |\n| b | |\n"
         self.assertEqual(len(check_named_tests.unkept(self.top, bad)), 6)
         self.assertEqual(len(check_named_tests.unkept(self.top, "no table")), 1)
+
+
+class Behaviours(Tree):
+    def found(self, names, source="", module="", disabled=False, more=""):
+        """Findings of a list of one line, over a C++ test Suite.One and a pytest one."""
+        self.write("tests/x/behaviours.txt", f"# ---- Section\nit works -> {names}\n{more}")
+        self.write("tests/x/a_test.cpp", source)
+        run = self.write("tests/e2e/test_x.py", module)
+        self.write("tests/e2e/test_not_run.py", "def test_one(root):\n    pass\n")
+        listing = {"tests": [
+            {"name": "Suite.One", "command": ["x_test"],
+             "properties": [{"name": "DISABLED", "value": disabled}]},
+            {"name": "All/Cases.Two/First  # GetParam() = 7", "command": ["x_test"]},
+            {"name": "e2e.x", "command": ["python3", run]}]}
+        top = pathlib.Path(self.top)
+        behaviours = list(check_behaviours.all_behaviours(top))
+        self.assertTrue(all(each.section == "Section" for each in behaviours))
+        return [finding.split(": ", 1)[1] for finding in
+                check_behaviours.findings_in(behaviours, check_behaviours.Tests(top, listing))]
+
+    def test_tests_that_run_pass(self):
+        self.assertEqual(
+            self.found("Suite.One All/Cases.Two All/Cases.Two/First test_x.py::test_one "
+                       "test_x.py::Tool::test_two",
+                       source="TEST_F(Suite, One) {\n}\nTEST(Suite, Two) {\n  GTEST_SKIP();\n}\n",
+                       module="def test_one(root):\n    pass\n\n\nclass Tool:\n"
+                              "    def test_two(self):\n        pass\n"), [])
+
+    def test_missing_tests_are_found(self):
+        names = ["Suite.Three", "Suite", "All/Cases", "All/Cases.Two/Second", "test_x.py::test_two",
+                 "test_x.py", "test_not_run.py::test_one", "test_one"]
+        self.assertEqual(self.found(" ".join(names), module="def test_one(root):\n    pass\n"),
+                         [f"there is no test {name}" for name in names])
+
+    def test_lines_without_a_test_and_lines_that_stand_twice_are_found(self):
+        self.assertEqual(self.found(""), ["names no test"])
+        self.assertEqual(self.found("Suite.One Suite.One"), ["names a test twice"])
+        self.assertEqual(self.found("Suite.One", more="it works -> Suite.One\n"),
+                         ["stands in tests/x/behaviours.txt:2 already"])
+        os.remove(self.write("tests/x/behaviours.txt", ""))
+        tests = check_behaviours.Tests(pathlib.Path(self.top), {"tests": []})
+        self.assertEqual(len(check_behaviours.findings_in([], tests)), 1)
+
+    def test_disabled_and_left_out_tests_are_found(self):
+        self.assertEqual(self.found("Suite.One", disabled=True), ["is disabled: Suite.One"])
+        for word in ("DISABLED" + "_One", "GTEST" + "_FLAG_SET", "FLAGS" + "_gtest_filter"):
+            self.assertEqual(self.found("Suite.One", source=f"int {word};\n"),
+                             [f"takes tests out: {word}"])
+
+    def test_cases_that_may_skip_are_found(self):
+        skip = "GTEST" + "_SKIP() << 1;"
+        for source in (f"TEST(Suite, One) {{\n  {skip}\n}}\n",
+                       f"void shared() {{\n  {skip}\n}}\nTEST_P(Suite,\n       One) {{\n}}\n"):
+            self.assertEqual(self.found("Suite.One", source=source),
+                             ["may pass over itself: Suite.One"])
+        self.assertEqual(self.found("All/Cases.Two/First",
+                                    source=f"TEST_P(Cases, Two) {{\n  {skip}\n}}\n"),
+                         ["may pass over itself: All/Cases.Two/First"])
+
+    def test_functions_that_may_skip_are_found(self):
+        test = "def test_one(root):\n    pass\n"
+        for module in (f"@pytest.mark.skip\n{test}", f"@pytest.mark.xfail(reason='x')\n{test}",
+                       f"needs_root = pytest.mark.skipif(True)\n\n\n@needs_root\n{test}",
+                       f"pytestmark = pytest.mark.skipif(True)\n{test}",
+                       "def test_one(root):\n    pytest.skip('x')\n",
+                       f"@pytest.fixture\ndef root():\n    pytest.skip('x')\n\n\n{test}",
+                       "def tool():\n    pytest.importorskip('x')\n\n\n"
+                       "def test_one(root):\n    tool()\n"):
+            self.assertEqual(self.found("test_x.py::test_one", module=module),
+                             ["may pass over itself: test_x.py::test_one"], module)
+        self.write("tests/e2e/helpers/users.py", "needs_root = pytest.mark.skipif(True)\n")
+        found = self.found("test_x.py::test_one", module=f"@users.needs_root\n{test}")
+        self.assertEqual(found, ["may pass over itself: test_x.py::test_one"])
 
 
 class Readme(unittest.TestCase):
