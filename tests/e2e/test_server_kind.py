@@ -38,3 +38,10 @@ def test_server_itself_is_found_by_everybody(kind_3):
 def test_other_kinds_show_it(instance, kind):
     instance.start("--server-type", kind)
     assert code_of_search(clients.bind(instance), ldap.SCOPE_SUBTREE) == 0
+
+
+@pytest.mark.parametrize("kind, announced", [("0", True), ("1", True), ("3", False)])
+def test_control_of_references_is_announced_on_other_kinds_only(instance, kind, announced):
+    client = clients.connect(instance.start("--server-type", kind))
+    [(_, root_dse)] = client.search_s("", ldap.SCOPE_BASE, attrlist=["supportedControl"])
+    assert (b"2.16.840.1.113730.3.4.2" in root_dse.get("supportedControl", [])) == announced
