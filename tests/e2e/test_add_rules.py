@@ -143,6 +143,9 @@ def test_member_without_a_bind_dn_or_of_another_class_is_refused(add):
     del attributes["orv-slapdAdminDN"]
     assert add(dn, attributes) == (65, "")
     assert add(*container("odd", GROUP)) == (65, "")
+    dn, attributes = member("odd")
+    attributes["objectClass"] = ["top", "orv-slapdConfigEntry", "orv-slapdTop"]
+    assert add(dn, attributes) == (65, "")
 
 
 # ---- split proxies
