@@ -138,6 +138,17 @@ def test_identities_are_compared_with_nobody_where_there_is_no_group(server, roo
         "orv-slapdDigestAdminUser": ["root"]}) == (0, "")
 
 
+def test_no_identity_is_added_while_the_administrators_is_in_doubt(instance):
+    instance.config.set(TOP, "orv-slapdAdminDN", "cn=root", "cn=second")
+    root = clients.bind(instance.start())
+    before = instance.config.read()
+    assert answer(root, *member("carol")) == (80, "")
+    assert answer(root, *changes.supplier("near")) == (80, "")
+    assert instance.config.read() == before
+    assert answer(root, *container("anything else")) == (0, "")
+    root.unbind_s()
+
+
 def test_member_without_a_bind_dn_or_of_another_class_is_refused(add):
     dn, attributes = member("odd")
     del attributes["orv-slapdAdminDN"]
@@ -195,3 +206,14 @@ def test_entry_does_not_overlap_with_its_own_subtrees(root, add):
     assert changes.modify(root, dn, changes.replaced("orv-slapdPtaURL", "ldap://other")) == 0
     assert changes.modify(root, dn, added("orv-slapdPtaSubtree", "o=two")) == 0
     assert add(*changes.pass_through("two", "ou=x,o=two")) == (19, "")
+
+
+def test_entry_of_the_file_without_subtrees_is_in_the_way_of_every_other(instance):
+    dn, attributes = changes.pass_through("by hand", "o=none")
+    del attributes["orv-slapdPtaSubtree"]
+    instance.config.add(dn, list(attributes.items()))
+    root = clients.bind(instance.start())
+    assert answer(root, *changes.pass_through("one", "o=one")) == (1, "")
+    assert changes.delete(root, dn) == 0
+    assert answer(root, *changes.pass_through("one", "o=one")) == (0, "")
+    root.unbind_s()

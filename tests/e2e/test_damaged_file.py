@@ -350,3 +350,10 @@ def test_configuration_given_as_a_symbolic_link_is_served(instance, tmp_path):
     client = clients.bind(instance)
     assert search_code(client) == 0
     assert instance.config.path.is_symlink()
+    # Changes go to the target, and the file before them stands beside it.
+    before = target.read_bytes()
+    client.modify_s(clients.BASE, [(ldap.MOD_REPLACE, "description", [b"changed"])])
+    assert instance.config.path.is_symlink()
+    assert target.read_bytes() != before
+    assert (tmp_path / "elsewhere.ldif.save").read_bytes() == before
+    assert not (instance.config.path.parent / (instance.config.path.name + ".save")).exists()
