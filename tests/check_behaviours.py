@@ -6,7 +6,7 @@ usage: check_behaviours.py --source TOP --build TREE [--table [TEXT]]
 The lists lie beside the tests, in tests/*/behaviours.txt. A line is a behaviour, then " -> ", then
 the names of its tests, separated by blanks:
 
-    Suite.Test               of GoogleTest; Group/Suite.Test/Case is a case, Group/Suite.Test are all
+    Suite.Test               of GoogleTest; Group/Suite.Test/Case is one case, Group/Suite.Test all
     test_file.py::test_name  of pytest, whatever its parameters; test_file.py::Class::test_name
 
 "# ---- " begins a section; other lines that begin with # are comments. A test exists when the build
@@ -133,6 +133,13 @@ def python_tests(module, words):
     return tests, skipping
 
 
+def unbuilt(listing):
+    """Programs whose tests ctest does not know yet."""
+    ending = "_NOT_BUILT"
+    return [test["name"].removesuffix(ending) for test in listing["tests"]
+            if test["name"].endswith(ending)]
+
+
 class Tests:
     """The tests of the source tree and of the build."""
 
@@ -217,7 +224,10 @@ def main():
     if options.table is not None:
         signal.signal(signal.SIGPIPE, signal.SIG_DFL)  # of "| head"
         print_table(behaviours, options.table)
-    found = findings_in(behaviours, Tests(options.source, listing_of(options.build)))
+    listing = listing_of(options.build)
+    found = ([f"{options.build}: {program} is not built: its tests cannot be looked for"
+              for program in unbuilt(listing)]
+             or findings_in(behaviours, Tests(options.source, listing)))
     for finding in found:
         print(finding)
     named = {name for each in behaviours for name in each.names}

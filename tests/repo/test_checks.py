@@ -186,6 +186,10 @@ class Behaviours(Tree):
         self.assertEqual(self.found(" ".join(names), module="def test_one(root):\n    pass\n"),
                          [f"there is no test {name}" for name in names])
 
+    def test_programs_that_are_not_built_are_found(self):
+        listing = {"tests": [{"name": "cfg_test_NOT_BUILT"}, {"name": "Suite.One"}]}
+        self.assertEqual(check_behaviours.unbuilt(listing), ["cfg_test"])
+
     def test_lines_without_a_test_and_lines_that_stand_twice_are_found(self):
         self.assertEqual(self.found(""), ["names no test"])
         self.assertEqual(self.found("Suite.One Suite.One"), ["names a test twice"])
