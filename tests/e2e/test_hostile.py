@@ -19,6 +19,12 @@ SCHEMAS = "cn=schemas,cn=configuration"
 PERSISTENT_SEARCH = "2.16.840.1.113730.3.4.3"
 MANAGE_DSA_IT = "2.16.840.1.113730.3.4.2"
 ENTRY_CHANGE = "2.16.840.1.113730.3.4.7"
+ASSERTION = "1.3.6.1.1.12"
+PRE_READ = "1.3.6.1.1.13.1"
+POST_READ = "1.3.6.1.1.13.2"
+PAGED_RESULTS = "1.2.840.113556.1.4.319"
+WHO_AM_I = "1.3.6.1.4.1.4203.1.11.3"
+CANCEL = "1.3.6.1.1.8"
 
 # What no request may take, in seconds of the server's time; sanitizers take several times as long.
 SLOW = 10 if programs.sanitized() else 1
@@ -341,13 +347,51 @@ def test_values_without_octets_are_kept_or_refused(server):
 # ---- every control in every form
 
 GOOD_WISHES = Node(0x30, [number(15), flag(True), flag(True)]).encoded()
-FORMS = {
-    "absent": None, "empty": b"", "truncated": GOOD_WISHES[:-2], "trailing": GOOD_WISHES + b"\0",
-    "another type": number(5).encoded(), "deep": b"\x30\x80" * 300, "huge": b"x" * 100000,
-    "negative": Node(0x30, [Node(0x02, b"\xff"), flag(True), flag(True)]).encoded(),
-    "zero": Node(0x30, [number(0), flag(True), flag(True)]).encoded(),
-    "over-long": Node(0x30, [Node(0x02, b"\0" * 9 + b"\x01"), flag(True), flag(True)]).encoded(),
+EVERYWHERE = set(every_operation())
+CHANGES = {"add", "modify", "delete", "rename"}
+# What each is used for, and a good value, if it has one.
+CONTROLS = {
+    PERSISTENT_SEARCH: ({"search"}, GOOD_WISHES),
+    MANAGE_DSA_IT: (EVERYWHERE, None),
+    ENTRY_CHANGE: (set(), Node(0x30, [number(1, 0x0A)]).encoded()),
+    ASSERTION: (CHANGES | {"search", "compare"}, wire.present("objectClass")),
+    PRE_READ: (CHANGES - {"add"}, Node(0x30, [text("cn"), text("*")]).encoded()),
+    POST_READ: (CHANGES - {"delete"}, Node(0x30, [text("cn"), text("*")]).encoded()),
+    PAGED_RESULTS: ({"search"}, Node(0x30, [number(5), text("")]).encoded()),
+    "1.2.3.4": (set(), b"x"),
 }
+
+
+def wishes(size, last=flag(True)):
+    """Three elements of which the first is the number that is lied about."""
+    return Node(0x30, [Node(0x02, size), flag(True), last]).encoded()
+
+
+def page(size, cookie=text("")):
+    return Node(0x30, [Node(0x02, size), cookie]).encoded()
+
+
+# No form of them is a good value of any control.
+BAD_FORMS = {
+    "absent": lambda good: None, "empty": lambda good: b"", "truncated": lambda good: good[:-1],
+    "cut to its head": lambda good: good[:2], "trailing": lambda good: good + b"\0",
+    "repeated": lambda good: good * 2, "inside a text": lambda good: text(good).encoded(),
+    "a number": lambda good: number(5).encoded(), "a set": lambda good: b"\x31" + good[1:],
+    "deep": lambda good: b"\x30\x80" * 300, "huge": lambda good: b"x" * 100000,
+    "of extreme length": lambda good: good[:1] + b"\x84\xff\xff\xff\xff" + good[2:],
+    "a negative wish": lambda good: wishes(b"\xff"), "no wish": lambda good: wishes(b"\0"),
+    "an over-long wish": lambda good: wishes(b"\0" * 9 + b"\x01"),
+    "page size -1": lambda good: page(b"\xff"), "page size without octets": lambda good: page(b""),
+    "page size -2^31": lambda good: page(b"\x80\0\0\0"),
+    "page size 2^31": lambda good: page(b"\0\x80\0\0\0"),
+    "page without a cookie": lambda good: Node(0x30, [number(5)]).encoded(),
+    "cookie that is a number": lambda good: page(b"\5", number(7)),
+    "names that are sets": lambda good: Node(0x30, [Node(0x30, [])]).encoded(),
+    "unfinished filter": lambda good: Node(0xA3, [text("cn")]).encoded(),
+    "filter of a choice that there is not": lambda good: Node(0xBF, [text("cn")]).encoded(),
+}
+WHO_AM_I_REQUEST = Node(0x77, [text(WHO_AM_I, 0x80)])
+CANCEL_REQUEST = Node(0x77, [text(CANCEL, 0x80), text(Node(0x30, [number(4711)]).encoded(), 0x81)])
 
 
 def control(oid, critical, value):
@@ -359,40 +403,93 @@ def control(oid, critical, value):
     return Node(0x30, parts)
 
 
-@pytest.mark.parametrize("times", [1, 2])
-@pytest.mark.parametrize("critical", [None, False, True])
-@pytest.mark.parametrize("form", FORMS)
-@pytest.mark.parametrize("oid", [PERSISTENT_SEARCH, MANAGE_DSA_IT, ENTRY_CHANGE, "1.2.3.4"])
-def test_control_in_every_form_is_heeded_ignored_or_refused(server, oid, form, critical, times):
-    controls = [control(oid, critical, FORMS[form])] * times
-    unknown = critical and oid in (ENTRY_CHANGE, "1.2.3.4")
+def operations_with_answers():
+    return {kind: operation for kind, operation in every_operation().items()
+            if kind not in ("abandon", "unbind")} | {
+                "who am I": WHO_AM_I_REQUEST, "cancel": CANCEL_REQUEST}
+
+
+def codes_with(server, controls):
+    """What each operation ends with; after binds somebody is bound again."""
+    found = {}
     with wire.Wire(server) as connection:
         assert connection.bind("cn=root", server.password) == 0
-        for position, (kind, operation) in enumerate(every_operation().items(), start=2):
-            if kind in ("bind", "SASL bind", "unbind"):
-                continue
-            connection.send(request(position, operation, controls))
-            if kind == "abandon":
-                continue
+        for position, (kind, operation) in enumerate(operations_with_answers().items(), start=1):
+            connection.send(request(10 * position, operation, controls))
             answer = connection.answer()
-            assert answer.message_id == position
-            if oid == PERSISTENT_SEARCH and kind == "search":
-                assert answer.code == 2, "no form of the value is a good one, and it is not ignored"
-            elif unknown or (critical and oid == PERSISTENT_SEARCH):
-                assert answer.code == 12
-            elif oid == MANAGE_DSA_IT and (form != "absent" or times == 2):
-                assert answer.code == 2, "it has no value, and is given once"
-            else:
-                assert answer.code != 12 and answer.code != 2 or kind == "extended"
-        assert connection.search(99) == (0, 1)
+            assert answer is not None and answer.message_id == 10 * position, kind
+            found[kind] = answer.code
+            if "bind" in kind:
+                assert connection.search(10 * position + 1)[0] == 50, "a failed bind binds nobody"
+                assert connection.bind("cn=root", server.password, 10 * position + 2) == 0
+        assert connection.search(9999) == (0, 1)
+    return found
 
 
-def test_good_control_given_twice_is_refused(root):
-    controls = [control(PERSISTENT_SEARCH, True, GOOD_WISHES)] * 2
-    root.send(request(2, search(), controls))
-    assert answer_or_end(root).code == 2
-    root.send(request(3, search(), [control(MANAGE_DSA_IT, True, None)] * 2))
-    assert answer_or_end(root).code == 2
+@pytest.fixture(scope="module", name="plain_codes")
+def plain_codes_fixture(server):
+    return codes_with(server, None)
+
+
+def expected_codes(plain_codes, oid, critical, is_good):
+    """`is_good`: whether the control is well formed where it is used."""
+    used_for = CONTROLS[oid][0]
+    if oid == MANAGE_DSA_IT:
+        used_for = set(plain_codes)
+    codes = {}
+    for kind, plain in plain_codes.items():
+        if kind not in used_for:
+            codes[kind] = 12 if critical else plain
+        else:
+            codes[kind] = plain if is_good else 2
+    return codes
+
+
+@pytest.mark.parametrize("times", [1, 2])
+@pytest.mark.parametrize("critical", [None, False, True])
+@pytest.mark.parametrize("form", BAD_FORMS)
+@pytest.mark.parametrize("oid", CONTROLS)
+def test_control_in_every_form_is_heeded_ignored_or_refused(
+        server, plain_codes, oid, form, critical, times):
+    good = CONTROLS[oid][1]
+    value = BAD_FORMS[form](good or b"x")
+    is_good = times == 1 and value == good
+    controls = [control(oid, critical, value)] * times
+    before = server.config.read()
+    assert codes_with(server, controls) == expected_codes(plain_codes, oid, critical, is_good)
+    assert server.config.read() == before
+
+
+@pytest.mark.parametrize("critical", [None, False, True])
+@pytest.mark.parametrize("oid", CONTROLS)
+def test_good_control_is_heeded_where_it_means_something_and_once(server, plain_codes, oid, critical):
+    one = control(oid, critical, CONTROLS[oid][1])
+    for times in (1, 2):
+        assert codes_with(server, [one] * times) == expected_codes(
+            plain_codes, oid, critical, times == 1)
+
+
+@pytest.mark.parametrize("oid", CONTROLS)
+def test_good_control_and_a_bad_one_of_its_kind_are_refused_in_either_order(server, plain_codes, oid):
+    good = CONTROLS[oid][1]
+    pair = [control(oid, True, good), control(oid, False, good[:-1] if good else b"x")]
+    for controls in (pair, pair[::-1]):
+        assert codes_with(server, controls) == expected_codes(plain_codes, oid, True, False)
+
+
+# Nobody hears of an unbind or an abandon, so all that can go wrong is that it does harm.
+@pytest.mark.parametrize("oid", CONTROLS)
+def test_unbind_and_abandon_take_any_control_without_an_answer(server, good, oid):
+    for critical in (None, True):
+        for make in BAD_FORMS.values():
+            controls = [control(oid, critical, make(CONTROLS[oid][1] or b"x"))] * 2
+            with wire.Wire(server) as connection:
+                connection.send(request(1, number(77, 0x50), controls)
+                                + request(2, WHO_AM_I_REQUEST)
+                                + request(3, Node(0x42, b""), controls)
+                                + request(4, WHO_AM_I_REQUEST))
+                answers = connection.answers_until_closed()
+                assert [(answer.message_id, answer.code) for answer in answers] == [(2, 0)]
 
 
 # ---- endless loops and numbers

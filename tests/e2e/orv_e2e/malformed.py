@@ -10,10 +10,16 @@ from . import wire
 
 # Nothing a changed request could hit by its own name: the tests look at this folder for nothing.
 TARGET = "cn=malformed,cn=schemas,cn=configuration"
-CONTROLS = ("2.16.840.1.113730.3.4.3", "2.16.840.1.113730.3.4.2", "2.16.840.1.113730.3.4.7",
-            "1.2.840.113556.1.4.319", "1.3.6.1.1.12", "1.2.3.4")
+PERSISTENT_SEARCH, ASSERTION = "2.16.840.1.113730.3.4.3", "1.3.6.1.1.12"
+PRE_READ, POST_READ, PAGED_RESULTS = "1.3.6.1.1.13.1", "1.3.6.1.1.13.2", "1.2.840.113556.1.4.319"
+CONTROLS = (PERSISTENT_SEARCH, "2.16.840.1.113730.3.4.2", "2.16.840.1.113730.3.4.7", ASSERTION,
+            PRE_READ, POST_READ, PAGED_RESULTS, "1.2.3.4")
 LARGEST = 60000
-OIDS = ("1.3.6.1.4.1.1466.20037", "1.3.6.1.4.1.4203.1.11.3", "1.3.6.1.1.8", "1.2.3")
+CANCEL = "1.3.6.1.1.8"
+OIDS = ("1.3.6.1.4.1.1466.20037", "1.3.6.1.4.1.4203.1.11.3", CANCEL, "1.2.3")
+MECHANISMS = ("EXTERNAL", "PLAIN", "DIGEST-MD5", "SCRAM-SHA-256", "GSSAPI")
+FIRST_STEPS = ("", "x", "n,,n=boss,r=aClientsNonce", "c=biws,r=aClientsNonce,p=AAAA", "dn:cn=root",
+               'username="boss",nonce="x",response=0123456789abcdef0123456789abcdef')
 NUMBERS = (b"", b"\x80", b"\xff", b"\x00" * 8 + b"\x01", b"\x7f\xff\xff\xff", b"\x80\x00\x00\x00",
            b"\x00\x80\x00\x00\x00", b"\xff" * 9, b"\x01" * 64)
 TEXTS = (b"", b"\0", b"a\0b", b"\xff\xfe", b"\xc3", b"\xed\xa0\x80", b"*", b"(", b")(cn=*", b"\\",
@@ -95,7 +101,9 @@ def _bind(chance):
     if chance.randrange(2):
         proof = text("x" * chance.randrange(1, 40), 0x80)
     else:
-        proof = Node(0xA3, [text(chance.choice(("EXTERNAL", "PLAIN", "DIGEST-MD5"))), text("x")])
+        proof = Node(0xA3, [text(chance.choice(MECHANISMS))])
+        if chance.randrange(4):
+            proof.content.append(text(chance.choice(FIRST_STEPS)))
     return Node(0x60, [number(3), text("cn=nobody"), proof])
 
 
@@ -125,17 +133,40 @@ def _compare(_):
     return Node(0x6E, [text(TARGET), Node(0x30, [text("cn"), text("malformed")])])
 
 
+# What stands in a value is encoded by itself, but is damaged with the rest.
+def _inside(tag, *parts):
+    return Node(tag, [Node(0x30, list(parts))])
+
+
 def _extended(chance):
-    return Node(0x77, [text(chance.choice(OIDS), 0x80), text("x", 0x81)])
+    name = chance.choice(OIDS)
+    request = Node(0x77, [text(name, 0x80)])
+    if name == CANCEL:
+        request.content.append(_inside(0x81, number(chance.choice((0, 1, 2, 77, 2**31 - 1)))))
+    elif chance.randrange(2):
+        request.content.append(text("x", 0x81))
+    return request
+
+
+def _control_value(chance, name):
+    if name == ASSERTION:
+        return Node(0x04, [_filter(chance)])
+    if name in (PRE_READ, POST_READ):
+        return _inside(0x04, *(text(chance.choice(("cn", "*", "+", "1.1", "orv-slapdAdminPW")))
+                               for _ in range(chance.randrange(4))))
+    if name == PAGED_RESULTS:
+        return _inside(0x04, number(chance.choice((0, 1, 2, 5, 2**31 - 1))),
+                       text(chance.choice(("", "x", "x" * 16))))
+    return _inside(0x04, number(chance.randrange(16)), flag(True), flag(True))
 
 
 def _control(chance):
-    parts = [text(chance.choice(CONTROLS))]
+    name = chance.choice(CONTROLS)
+    parts = [text(name)]
     if chance.randrange(2):
         parts.append(flag(chance.randrange(2)))
-    if chance.randrange(3):
-        wishes = Node(0x30, [number(chance.randrange(16)), flag(True), flag(True)])
-        parts.append(text(wishes.encoded()))
+    if chance.randrange(4):
+        parts.append(_control_value(chance, chance.choice((name, name, name, *CONTROLS))))
     return Node(0x30, parts)
 
 
