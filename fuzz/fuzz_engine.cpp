@@ -111,7 +111,9 @@ class Play {
       const bool again = choices_.rarely(8);
       const std::int32_t id =
           again ? static_cast<std::int32_t>(choices_.below(8)) : client->next_id();
-      bytes += make_message(choices_, id);
+      // Mostly the own cookie, sometimes another connection's.
+      const auto& asked = choices_.rarely(8) ? clients_[choices_.below(clients_.size())] : client;
+      bytes += make_message(choices_, id, asked->cookie());
     } while (choices_.rarely(4));
     client->receive(bytes);
   }

@@ -6,6 +6,7 @@
 
 #include "ops/persistent_search.h"
 #include "protocol/ber_parser.h"
+#include "protocol/control_values.h"
 #include "protocol/encoder.h"
 
 namespace orv::fuzz {
@@ -137,6 +138,22 @@ void FuzzedClient::take_answer(std::string_view message) {
     require(connection().authority == kNobody, "a failed bind leaves nobody bound");
   if (code == kInProgress) require(operation.tag == server::tag::bind_response, "14 is for binds");
   --(owed.answers > 0 ? owed.answers : owed.possible);
+  if (!message.empty()) check_controls(first_of(message).contents);
+}
+
+// Takes a cookie out of them, too.
+void FuzzedClient::check_controls(std::string_view controls) {
+  while (!controls.empty()) {
+    std::string_view parts = first_of(controls).contents;
+    const std::string_view oid = first_of(parts).contents;
+    if (oid == server::kPreReadOid || oid == server::kPostReadOid)
+      require(was_somebody_, "strangers see nothing around a change");
+    if (oid != server::kPagedResultsOid) continue;
+    std::string_view value = first_of(parts).contents;
+    value = first_of(value).contents;
+    first_of(value);
+    cookie_ = first_of(value).contents;
+  }
 }
 
 void FuzzedClient::check_entry(std::string_view operation) const {

@@ -4,7 +4,7 @@
 // What it holds the session to, whatever is sent:
 //   every request that has an answer gets exactly one, unless it was given up or the connection
 //   ended; nothing else is ever answered;
-//   who is not bound sees nothing but the entries that everybody may see;
+//   who is not bound sees nothing but the entries that everybody may see, around changes either;
 //   after a bind that failed the connection is anonymous.
 #pragma once
 
@@ -33,6 +33,8 @@ class FuzzedClient final : public server::Session {
   void stop_reading() { reading_ = false; }
   void go_on_reading();
   std::int32_t next_id() { return ++last_id_; }
+  // What the server gave out last for the next page; used up or not.
+  const std::string& cookie() const { return cookie_; }
 
   // ---- the loop's side
   // Runs the oldest of what was posted; false when there is nothing.
@@ -74,6 +76,7 @@ class FuzzedClient final : public server::Session {
   void expect(std::string_view frame);
   void take_answer(std::string_view message);
   void check_entry(std::string_view operation) const;
+  void check_controls(std::string_view controls);
 
   Round& round_;
   std::string in_;
@@ -85,6 +88,7 @@ class FuzzedClient final : public server::Session {
   bool settled_ = false;
   bool was_somebody_ = false;
   std::int32_t last_id_ = 0;
+  std::string cookie_;
   std::map<std::int32_t, Owed> owed_;
   std::unique_ptr<server::SecurityLayer> layer_;
 

@@ -1,5 +1,12 @@
 #include "messages.h"
 
+#include <cstdint>
+#include <iterator>
+#include <string_view>
+
+#include "ops/controls.h"
+#include "ops/persistent_search.h"
+#include "protocol/control_values.h"
 #include "world.h"
 
 namespace orv::fuzz {
@@ -70,14 +77,16 @@ constexpr const char* kValues[] = {"new",
                                    "abcd1234efgh!?",
                                    "orv-slapdReplication",
                                    "orv-slapdSupplier"};
-constexpr const char* kControlTypes[] = {"2.16.840.1.113730.3.4.3",
-                                         "2.16.840.1.113730.3.4.2",
-                                         "2.16.840.1.113730.3.4.7",
-                                         "1.2.840.113556.1.4.319",
-                                         "1.3.6.1.1.12",
+constexpr const char* kControlTypes[] = {server::kPersistentSearchOid,
+                                         server::kManageDsaItOid,
+                                         server::kEntryChangeOid,
+                                         server::kPagedResultsOid,
+                                         server::kAssertionOid,
                                          "1.2.3",
                                          "",
-                                         "no OID"};
+                                         "no OID",
+                                         server::kPreReadOid,
+                                         server::kPostReadOid};
 constexpr const char* kMechanisms[] = {"EXTERNAL", "question", "QUESTION",
                                        "PLAIN",    "",         "DIGEST-MD5"};
 constexpr const char* kCredentials[] = {"",      kSecret,      "wrong", "layer",
@@ -283,9 +292,20 @@ std::string compare(Choices& choices) {
   return tlv(choices, 0x6E, octets(choices, kEntries) + tlv(choices, 0x30, assertion));
 }
 
+// Mostly of something that may be outstanding.
+std::string cancel_value(Choices& choices) {
+  const std::int32_t target =
+      choices.rarely(8) ? choices.number() : static_cast<std::int32_t>(choices.below(16));
+  return tlv(choices, 0x30, integer(choices, 0x02, target));
+}
+
 std::string extended(Choices& choices) {
-  std::string body = octets(choices, kOids, 0x80);
-  if (choices.rarely(4)) body += octets(choices, kValues, 0x81);
+  const std::string oid = text(choices, kOids);
+  std::string body = tlv(choices, 0x80, oid);
+  if (oid == server::kCancelOid && !choices.rarely(8))
+    body += tlv(choices, 0x81, cancel_value(choices));
+  else if (choices.rarely(4))
+    body += octets(choices, kValues, 0x81);
   return tlv(choices, 0x77, body);
 }
 
@@ -330,18 +350,33 @@ std::string operation(Choices& choices) {
   }
 }
 
-std::string control_value(Choices& choices) {
+std::string page(Choices& choices, const std::string& cookie) {
+  constexpr std::int32_t kSizes[] = {1, 2, 3, 0, 100, -1, INT32_MAX, INT32_MIN};
+  const std::int32_t size = kSizes[choices.below(std::size(kSizes))];
+  const std::string sent = choices.rarely(2) ? cookie : choices.rarely(4) ? choices.raw() : "";
+  return tlv(choices, 0x30, integer(choices, 0x02, size) + tlv(choices, 0x04, sent));
+}
+
+// A value that a control of this name can have, unless it is one of anything.
+std::string control_value(Choices& choices, std::string_view type, const std::string& cookie) {
   if (choices.rarely(8)) return choices.raw();
+  if (choices.rarely(16)) type = choices.pick(kControlTypes);
+  if (type == server::kAssertionOid) return filter(choices, 4);
+  if (type == server::kPagedResultsOid) return page(choices, cookie);
+  if (type == server::kPreReadOid || type == server::kPostReadOid)
+    return tlv(choices, 0x30, some(choices, [&] { return octets(choices, kTypes); }));
   const std::string wishes = integer(choices, 0x02, static_cast<std::int32_t>(choices.below(17))) +
                              boolean(choices) + boolean(choices);
   return tlv(choices, 0x30, wishes);
 }
 
-std::string controls(Choices& choices) {
+std::string controls(Choices& choices, const std::string& cookie) {
   const std::string all = some(choices, [&] {
-    std::string body = octets(choices, kControlTypes);
+    const std::string type = text(choices, kControlTypes);
+    std::string body = tlv(choices, 0x04, type);
     if (choices.rarely(2)) body += boolean(choices);
-    if (!choices.rarely(3)) body += tlv(choices, 0x04, control_value(choices));
+    if (type == server::kManageDsaItOid ? choices.rarely(8) : !choices.rarely(3))
+      body += tlv(choices, 0x04, control_value(choices, type, cookie));
     return tlv(choices, 0x30, body);
   });
   return tlv(choices, 0xA0, all);
@@ -371,11 +406,11 @@ void damage(Choices& choices, std::string& message) {
 
 }  // namespace
 
-std::string make_message(Choices& choices, std::int32_t id) {
+std::string make_message(Choices& choices, std::int32_t id, const std::string& cookie) {
   const unsigned form = choices.byte() % 16;
   if (form == 15) return choices.raw();
   std::string body = integer(choices, 0x02, id) + operation(choices);
-  if (form >= 10) body += controls(choices);
+  if (form >= 10) body += controls(choices, cookie);
   std::string message = tlv(choices, 0x30, body);
   if (form >= 13) damage(choices, message);
   return message;

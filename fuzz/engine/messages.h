@@ -9,7 +9,8 @@
 
 namespace orv::fuzz {
 
-// One message with this id, or what is left of one.
-std::string make_message(Choices& choices, std::int32_t id);
+// One message with this id, or what is left of one. `cookie`: one of paged results that somebody
+// may go on with, or "".
+std::string make_message(Choices& choices, std::int32_t id, const std::string& cookie);
 
 }  // namespace orv::fuzz

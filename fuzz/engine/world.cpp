@@ -16,6 +16,7 @@
 #include "directory_backend.h"
 #include "ops/persistent_search.h"
 #include "plugin/loader.h"
+#include "protocol/control_values.h"
 #include "publish/root_dse.h"
 #include "publish/subschema.h"
 #include "question.h"
@@ -149,8 +150,10 @@ struct Ground {
     backend.private_data = startup;
     require(slapi_pblock_instance_start(backend.handlers)(&backend) == 0, "the backend starts");
     require(register_backend(&backend) == 0, "the backend is registered");
-    slapi_register_supported_control(server::kPersistentSearchOid, kEveryOperation);
-    slapi_register_supported_control(server::kEntryChangeOid, kEveryOperation);
+    for (const char* oid :
+         {server::kPersistentSearchOid, server::kEntryChangeOid, server::kPagedResultsOid,
+          server::kAssertionOid, server::kPreReadOid, server::kPostReadOid})
+      slapi_register_supported_control(oid, kEveryOperation);
   }
 };
 
@@ -166,6 +169,8 @@ server::Settings small_settings() {
   settings.max_result_size = 8192;
   settings.max_persistent_searches = 3;
   settings.max_persistent_searches_per_connection = 2;
+  settings.max_paged_searches = 2;
+  settings.max_paged_result_size = 4096;
   settings.max_failed_change_size = 8192;
   settings.time_limit = 0;
   return settings;
@@ -311,6 +316,7 @@ void Round::check_rest() {
   gate().leave();
   require(services_.unauthenticated.load() == 0, "no connection counts as unauthenticated");
   require(services_.output.room() == kCeiling, "no output is counted as unread");
+  require(services_.kept_pages.bytes() == 0, "no pages are kept");
   server::PersistentSearch one({}, 1, {}, {}, "", "");
   require(services_.persistent_searches.count(one, 1), "no persistent search is counted");
   services_.persistent_searches.leave(one);

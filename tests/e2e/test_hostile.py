@@ -284,6 +284,38 @@ def test_requests_of_the_largest_size_take_no_time(server):
     root.unbind_s()
 
 
+def test_controls_of_the_largest_size_take_no_time(server):
+    dn = "cn=large," + SCHEMAS
+    client = clients.bind(server)
+    client.add_s(dn, [("objectClass", [b"top", b"container"]), ("cn", [b"large"]),
+                      ("description", [b"a" * 480000, b"a" * 480001])])
+    one = Node(0xA4, [text("description"), Node(0x30, [text("a" * 240000 + "b", 0x81)])])
+    pieces = Node(0xA4, [text("description"), Node(0x30, [text("a", 0x81)] * 2000 + [text("b", 0x82)])])
+    wide = Node(0xA1, [Node(0xA3, [text("description"), text("x%d" % i)]) for i in range(4000)])
+    names = Node(0x30, [text("x%d" % i) for i in range(1000)]).encoded()
+    change = modification(dn, (0, "description", ["new"]))
+    conditions = {"part": one, "parts": pieces, "items": wide}
+    with wire.Wire(server) as root:
+        assert root.bind("cn=root", server.password) == 0
+        for position, (name, condition) in enumerate(conditions.items(), start=2):
+            used = Stopwatch(server)
+            root.send(request(position, change, [control(ASSERTION, True, condition.encoded())]))
+            assert root.answer().code == 122, name
+            assert used.seconds() < SLOW, name
+        used = Stopwatch(server)
+        reads = [control(oid, True, names) for oid in (PRE_READ, POST_READ)]
+        root.send(request(20, change, reads))
+        assert root.answer().code in (0, 11)
+        for position in range(30):  # each page asks for all, and the search is forgotten with the next
+            root.send(request(30 + position, search(scope=2, names=("*",)), [
+                control(PAGED_RESULTS, True, page(b"\1"))]))
+            assert answer_or_end(root).code == 0
+        assert used.seconds() < SLOW
+        assert root.search(9999) == (0, 1)
+    client.delete_s(dn)
+    client.unbind_s()
+
+
 # ---- zero-length values everywhere
 
 def emptied(tree, position):
@@ -631,6 +663,10 @@ def secret_requests():
         "modify of a master": modification(dn, (0, "orv-slapdMasterPW", [MARKER])),
         "compare": Node(0x6E, [text(clients.BASE), Node(0x30, [text("orv-slapdAdminPW"), text(MARKER)])]),
         "search": search(search_filter=Node(0xA3, [text("orv-slapdAdminPW"), text(MARKER)])),
+        "SCRAM": sasl_bind("SCRAM-SHA-256", "n,,n=%s,r=x" % MARKER),
+        "DIGEST-MD5": sasl_bind("DIGEST-MD5", 'username="root",response=' + MARKER),
+        "cancel": Node(0x77, [text(CANCEL, 0x80), text(MARKER, 0x81)]),
+        "StartTLS": Node(0x77, [text("1.3.6.1.4.1.1466.20037", 0x80), text(MARKER, 0x81)]),
         "password modify": Node(0x77, [text("1.3.6.1.4.1.4203.1.11.1", 0x80), text(MARKER, 0x81)]),
     }
     for name, operation in wholes.items():
@@ -639,6 +675,14 @@ def secret_requests():
         yield name + ", cut", data[:-3]
         yield name + ", with a critical control", request(
             2, operation, [control("1.2.3", True, MARKER.encode())])
+        # What is asserted of a password, or asked to be read, is as secret.
+        for oid in (ASSERTION, PRE_READ, POST_READ, PAGED_RESULTS, PERSISTENT_SEARCH):
+            for critical in (True, False):
+                for value in (Node(0xA3, [text("orv-slapdAdminPW"), text(MARKER)]).encoded(),
+                              Node(0x30, [text("orv-slapdAdminPW"), text(MARKER)]).encoded(),
+                              page(b"\5", text(MARKER)), MARKER.encode()):
+                    yield "%s, with %s" % (name, oid), request(
+                        2, operation, [control(oid, critical, value)])
         yield name + ", with octets behind it", data + MARKER.encode()
         yield name + ", under another tag", request(2, Node(0x7E, operation.body()))
         yield name + ", in a version to come", request(2, Node(

@@ -15,7 +15,7 @@ import pytest
 from orv_e2e import clients, wire
 from orv_e2e.malformed import Node, flag, number, text
 from orv_e2e.programs import DEADLINE
-from test_hostile import CANCEL, WHO_AM_I, answer_or_end, request, search
+from test_hostile import CANCEL, SLOW, STORED, WHO_AM_I, Stopwatch, answer_or_end, request, search
 
 START_TLS = "1.3.6.1.4.1.1466.20037"
 USER = "boss"
@@ -154,11 +154,11 @@ def test_start_tls_behind_refused_ones_still_works(server):
 
 # ---- SASL: both sides of a bind by password, by hand
 
-def scram_start(_, nonce=b"aClientsNonce"):
-    return b"n,,n=%s,r=%s" % (USER.encode(), nonce)
+def scram_start(user):
+    return b"n,,n=%s,r=aClientsNonce" % user
 
 
-def scram_proof(first, challenge, password):
+def scram_proof(_, first, challenge, password):
     fields = dict(part.split(b"=", 1) for part in challenge.split(b","))
     bare = b"c=biws,r=" + fields[b"r"]
     said = b",".join((first[3:], challenge, bare))
@@ -172,18 +172,18 @@ def digest_start(_):
     return None
 
 
-def digest_proof(_, challenge, password):
+def digest_proof(user, _, challenge, password):
     asked = dict(re.findall(rb'(\w+)="([^"]*)"', challenge))
 
     def md5(data):
         return hashlib.md5(data).digest()
-    secret = md5(b":".join((USER.encode(), asked[b"realm"], password)))
+    secret = md5(b":".join((user, asked[b"realm"], password)))
     a1 = md5(b":".join((secret, asked[b"nonce"], b"aClientsNonce"))).hex().encode()
     a2 = md5(b"AUTHENTICATE:ldap/localhost").hex().encode()
     response = md5(b":".join((a1, asked[b"nonce"], b"00000001", b"aClientsNonce", b"auth", a2))).hex()
     return (b'charset=utf-8,username="%s",realm="%s",nonce="%s",cnonce="aClientsNonce",nc=00000001,'
             b'qop=auth,digest-uri="ldap/localhost",response=%s'
-            % (USER.encode(), asked[b"realm"], asked[b"nonce"], response.encode()))
+            % (user, asked[b"realm"], asked[b"nonce"], response.encode()))
 
 
 BY_PASSWORD = {"SCRAM-SHA-256": (scram_start, scram_proof), "DIGEST-MD5": (digest_start, digest_proof)}
@@ -192,9 +192,10 @@ BY_PASSWORD = {"SCRAM-SHA-256": (scram_start, scram_proof), "DIGEST-MD5": (diges
 class Exchange:
     """A bind by a mechanism with a password, on a connection, step by step."""
 
-    def __init__(self, server, mechanism):
+    def __init__(self, server, mechanism, user=USER, password=None):
         self.connection = wire.Wire(server)
-        self.mechanism, self.password = mechanism, server.password.encode()
+        self.mechanism, self.user = mechanism, user.encode()
+        self.password = (server.password if password is None else password).encode()
         self.start, self.prove = BY_PASSWORD[mechanism]
         self.position = 0
 
@@ -217,10 +218,10 @@ class Exchange:
 
     def begin(self):
         """The first step; gives the good answer to what the server asked."""
-        self.first = self.start(self.mechanism)
+        self.first = self.start(self.user)
         answer = self.step(self.first)
         assert answer.code == 14
-        return self.prove(self.first, credentials_of(answer), self.password)
+        return self.prove(self.user, self.first, credentials_of(answer), self.password)
 
     def is_anonymous(self):
         return self.ask(search()).code == 50
@@ -287,7 +288,7 @@ def test_whatever_comes_between_the_steps_ends_the_exchange(server, mechanism):
 @pytest.mark.parametrize("mechanism", BY_PASSWORD)
 def test_the_same_step_twice_proves_nothing(server, mechanism):
     with Exchange(server, mechanism) as exchange:
-        first = exchange.start(mechanism)
+        first = exchange.start(exchange.user)
         assert exchange.step(first).code == 14
         second = exchange.step(first)
         assert second.code in (14, 49)
@@ -339,11 +340,33 @@ def test_steps_in_one_packet_are_steps_of_one_exchange(server, mechanism):
             return request(position, Node(0x60, [number(3), text(""), Node(0xA3, [
                 text(mechanism), *([text(credentials)] if credentials is not None else [])])]))
         guess = b"c=biws,r=aClientsNonce,p=AAAA"
-        exchange.connection.send(step(1, exchange.start(mechanism)) + step(2, guess)
+        exchange.connection.send(step(1, exchange.start(exchange.user)) + step(2, guess)
                                  + request(3, search()) + request(4, search()))
         answers = [answer_or_end(exchange.connection) for _ in range(4)]
         assert [answer.message_id for answer in answers] == [1, 2, 3, 4]
         assert [answer.code for answer in answers] == [14, 49, 50, 50]
+
+
+@pytest.mark.parametrize("mechanism", BY_PASSWORD)
+def test_malformed_stored_passwords_prove_no_user_name(instance, mechanism):
+    for position, stored in enumerate(STORED):
+        name = "stored%d" % position
+        instance.config.add_member(name, stored, bind_dn="cn=" + name)
+        instance.config.set("cn=%s,cn=admingroup,cn=configuration" % name,
+                            "orv-slapdDigestAdminUser", name)
+    instance.config.set("cn=digest,cn=configuration", "orv-slapdDigestAdminUser", USER)
+    instance.config.set(clients.BASE, "orv-slapdAdminGroupEnabled", "TRUE")
+    instance.config.set("cn=pwdpolicy admin,cn=configuration", "pwdLockout", "FALSE")
+    instance.start()
+    used = Stopwatch(instance)
+    for position, stored in enumerate(STORED):
+        for guess in ("", "x", "*", stored, stored.split("}")[-1]):
+            with Exchange(instance, mechanism, "stored%d" % position, guess) as exchange:
+                assert exchange.bind() == 49, (stored[:30], guess[:30])
+                assert exchange.is_anonymous()
+    assert used.seconds() < 10 * SLOW
+    with Exchange(instance, mechanism) as exchange:
+        assert exchange.bind() == 0
 
 
 # ---- EXTERNAL, over the Unix socket, where it is good without credentials

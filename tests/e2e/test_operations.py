@@ -231,6 +231,35 @@ def test_an_assertion_is_no_oracle_for_a_password(server, root, guess):
             assert code_of(client.search_ext_s, dn, ldap.SCOPE_BASE, serverctrls=asserted) == 122
 
 
+@pytest.mark.parametrize("guess", [PASSWORD, "wrong"])
+def test_a_change_is_no_oracle_for_a_password_by_its_assertion(server, root, guess):
+    bob = bind_member(server, root, "bob")
+    alice = "cn=alice," + GROUP
+    assert add(root, *member("alice")) == 0
+    before = server.config.read()
+    for pattern in ("(orv-slapdAdminPW=%s)", "(!(orv-slapdAdminPW=%s))", "(orv-slapdAdminPW<=%s)",
+                    "(|(orv-slapdAdminPW=%s)(!(orv-slapdAdminPW=%s)))", "(orv-slapdAdminPW~=%s)"):
+        asserted = [AssertionControl(True, pattern.replace("%s", guess))]
+        for client in (root, bob):
+            for dn in (alice, "cn=bob," + GROUP, clients.BASE):
+                codes = {code_of(client.modify_ext_s, dn, describe(b"guessed"), asserted),
+                         code_of(client.delete_ext_s, dn, asserted),
+                         code_of(client.modify_ext_s, dn, [
+                             (ldap.MOD_REPLACE, "orv-slapdAdminPW", [b"Nq5%tr8?Yw2&"])], asserted)}
+                assert codes == {122}, (pattern, dn)
+    assert server.config.read() == before
+
+
+@pytest.mark.parametrize("guess", [PASSWORD, "wrong"])
+def test_the_number_of_pages_is_no_oracle_for_a_password(server, root, guess):
+    bob = bind_member(server, root, "bob")
+    for pattern in ("(orv-slapdAdminPW=%s)", "(!(orv-slapdAdminPW=%s))", "(orv-slapdAdminPW=%s*)",
+                    "(&(objectClass=*)(orv-slapdAdminPW=%s))"):
+        for client in (root, bob):
+            pages = Pages(client, filter_text=pattern % guess)
+            assert pages.next(0) == [] and pages.total == 0
+
+
 def test_an_assertion_tells_a_member_nothing_of_the_administrator(server, root):
     bob = bind_member(server, root, "bob")
     for filter_text in ("(orv-slapdAdminDN=cn=root)", "(!(orv-slapdAdminDN=cn=root))"):
