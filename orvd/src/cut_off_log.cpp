@@ -10,6 +10,7 @@ constexpr const char* kNames[] = {
     "connections for which no descriptor was left",
     "messages that were too big or late",
     "TLS handshakes that were late",
+    "clients whose certificates were no longer good",
     "connections on which nobody bound in time",
     "clients that did not read",
     "modifications refused after too many had failed",

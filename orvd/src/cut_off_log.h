@@ -25,6 +25,7 @@ enum class CutOff {
   descriptors,  // none is left for a connection
   message,      // too big, or not finished in time
   handshake,    // of TLS, not finished in time
+  certificate,  // of the client, not good any more
   bind,         // not finished in time, or nobody bound for too long
   output,       // not read
   changes,      // too many failed

@@ -84,6 +84,7 @@ Server::Server(ServerParts parts)
   services_.mechanisms = parts_.mechanisms;
   services_.local_verifiers = &own_work_;
   services_.tls = &tls_;
+  if (parts_.wall_time) services_.wall_time = parts_.wall_time;
   for (unsigned i = 0; i < std::max(1U, parts_.loops); ++i)
     loops_.push_back(std::make_unique<Loop>(parts_.logs, settings_));
 }

@@ -10,6 +10,7 @@
 #include <asio/signal_set.hpp>
 #include <asio/steady_timer.hpp>
 #include <atomic>
+#include <ctime>
 #include <functional>
 #include <memory>
 #include <mutex>
@@ -53,6 +54,7 @@ struct ServerParts {
   const SaslMechanisms* mechanisms = nullptr;      // null: none
   const ServiceManager* manager = nullptr;         // who is told how the server is; null: nobody
   std::function<bool(Settings&)> read_settings{};  // Services::read_settings
+  std::function<std::time_t()> wall_time{};        // Services::wall_time; empty: the system's clock
 };
 
 // Where a server listens, besides its addresses for connections in clear.

@@ -287,6 +287,31 @@ def test_connection_ends_when_its_map_is_taken_away(trusting):
         bind_external(again)
 
 
+def assert_ended(client):
+    with pytest.raises((ldap.SERVER_DOWN, ldap.STRONG_AUTH_REQUIRED, ldap.INSUFFICIENT_ACCESS,
+                        ldap.UNAVAILABLE)):
+        clients.search(client)
+
+
+@pytest.mark.parametrize("how", ["a setting", "another file", "a hangup"])
+def test_connection_ends_when_its_authority_is_taken_away(trusting, tmp_path, how):
+    server, root, authority, pair = trusting
+    client = connect(server, pair=pair)
+    bind_external(client)
+    other = Authority(tmp_path / "other")
+    if how == "a setting":
+        set_value(root, GROUP, "orv-slapdTlsClientCertificate", "none")
+    elif how == "another file":
+        set_value(root, GROUP, "orv-slapdTlsCaFile", str(other.certificate))
+    else:
+        other.certificate.rename(authority.certificate)
+        server.process.send_signal(signal.SIGHUP)
+    server.stderr.wait_for(lambda line: "no longer good" in line and ": closed 127." in line)
+    assert_ended(client)
+    server.stop()
+    assert "DISCONNECT result=8 reason=" in server.access_log.read_text()
+
+
 def test_required_certificate_keeps_everybody_else_out(trusting):
     server, root, _, pair = trusting
     set_value(root, GROUP, "orv-slapdTlsClientCertificate", "required")

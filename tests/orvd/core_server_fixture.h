@@ -5,6 +5,7 @@
 
 #include <atomic>
 #include <csignal>
+#include <ctime>
 #include <functional>
 #include <optional>
 #include <string>
@@ -90,6 +91,7 @@ class LoopbackServer : public testing::Test {
                       changes_made};
     parts.mechanisms = &mechanisms;
     parts.manager = manager;
+    parts.wall_time = wall_time;
     server.emplace(std::move(parts));
     std::string error;
     ASSERT_TRUE(server->listen(addresses, 0, error, more)) << error;
@@ -140,6 +142,7 @@ class LoopbackServer : public testing::Test {
   MoreListeners more;
   SaslMechanisms mechanisms;
   const ServiceManager* manager = nullptr;
+  std::function<std::time_t()> wall_time;
   unsigned loops = 1;
   std::optional<Server> server;
   std::thread control;

@@ -42,6 +42,7 @@ class Certificates {
   ~Certificates();
 
   Pair self_signed(const std::string& name);
+  Pair self_signed(const Wording& wording) { return make(wording, nullptr); }
   // By an authority that is made with the first of them.
   Pair of_client(const std::string& name);
   Pair of_client(const Wording& wording);

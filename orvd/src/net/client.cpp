@@ -233,6 +233,17 @@ void Client::lose() {
   close(why.empty() ? "connection lost" : "TLS failed: " + why);
 }
 
+// Who was let in by a certificate stays for as long as it would be taken again.
+bool Client::transport_holds() {
+  if (tls_ != Tls::standing || !stream_ || !stream_->shows_certificate()) return true;
+  const std::shared_ptr<const TlsContext> in_force = services().tls->current();
+  const std::string problem = stream_->certificate_problem(in_force.get(), services().wall_time());
+  if (problem.empty()) return true;
+  cut_off(CutOff::certificate, result::stronger_auth_required,
+          "the certificate of the client is no longer good (" + problem + ")");
+  return false;
+}
+
 // The layer protects what follows the bind: what came in clear behind it is nobody's message.
 void Client::protect(std::unique_ptr<SecurityLayer> layer) {
   const std::string rest(layer_ ? std::string_view() : unread());

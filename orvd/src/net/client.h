@@ -66,6 +66,8 @@ class Client final : public Session {
   bool can_start_tls() const noexcept override;
   void start_tls() override;
   bool more_is_here() const noexcept override { return !last_here_; }
+  bool transport_holds() override;
+  std::string transport_trust() const override { return stream_ ? stream_->trust() : ""; }
   void protect(std::unique_ptr<SecurityLayer> layer) override;
 
  private:

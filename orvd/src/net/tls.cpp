@@ -1,6 +1,5 @@
 #include "net/tls.h"
 
-#include <fcntl.h>
 #include <lber.h>
 #include <ldap.h>
 #include <openssl/err.h>
@@ -8,18 +7,12 @@
 #include <openssl/pem.h>
 #include <openssl/ssl.h>
 #include <openssl/x509.h>
-#include <sys/stat.h>
-#include <unistd.h>
 
-#include <algorithm>
-#include <cerrno>
-#include <cstring>
 #include <new>
 #include <utility>
 
 #include "cfg/dn.h"
-#include "cfg/secret.h"
-#include "descriptor.h"
+#include "net/pem.h"
 
 namespace orv::server {
 namespace {
@@ -29,113 +22,12 @@ constexpr const char* kSuites = "ECDHE+AESGCM:ECDHE+CHACHA20";
 constexpr const char* kGroups = "X25519:P-256:P-384";
 // 112 bits at least: RSA from 2048 bits on, no SHA-1 signatures.
 constexpr int kSecurityLevel = 2;
-// Certificates between a client's own and the authority.
-constexpr int kChainDepth = 8;
 // Of the socket, in search of data, before others have their turn: two for each record. Nobody
 // needs more than a few records without data in a row (new keys, padding), and whoever sent them
 // without an end would keep the thread to himself: OpenSSL goes on as long as some come.
 constexpr int kReadsInSearchOfData = 64;
 
-template <auto Release>
-struct Releaser {
-  template <typename T>
-  void operator()(T* object) const noexcept {
-    Release(object);
-  }
-};
 using Context = std::unique_ptr<SSL_CTX, Releaser<SSL_CTX_free>>;
-using Bio = std::unique_ptr<BIO, Releaser<BIO_free>>;
-using Certificate = std::unique_ptr<X509, Releaser<X509_free>>;
-using PrivateKey = std::unique_ptr<EVP_PKEY, Releaser<EVP_PKEY_free>>;
-
-// The first of the queued errors in words; empties the queue.
-std::string queued_error() {
-  const unsigned long code = ERR_peek_error();
-  const char* const reason = code != 0 ? ERR_reason_error_string(code) : nullptr;
-  std::string text = reason ? reason : "";
-  if (code != 0 && !reason) {
-    char buffer[160];
-    ERR_error_string_n(code, buffer, sizeof buffer);
-    text = buffer;
-  }
-  ERR_clear_error();
-  return text;
-}
-
-bool fail(std::string& error, const std::string& file, const std::string& what) {
-  const std::string why = queued_error();
-  error = file + ": " + what + (why.empty() ? "" : ": " + why);
-  return false;
-}
-
-// OpenSSL would report a file that cannot be opened as one more of its own errors, and wait for
-// ever at a pipe that nobody writes to.
-bool can_read(const std::string& file, std::string& error) {
-  const Descriptor opened(::open(file.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
-  struct stat status {};
-  if (!opened || ::fstat(opened.number(), &status) != 0) {
-    error = file + ": " + std::strerror(errno);
-    return false;
-  }
-  if (S_ISREG(status.st_mode)) return true;
-  error = file + ": not a regular file";
-  return false;
-}
-
-// What a file says that may hold a key. Read without the buffers of the C library, which keep it.
-class Text {
- public:
-  Text() = default;
-  ~Text() { cfg::wipe(text_); }
-  Text(const Text&) = delete;
-  Text& operator=(const Text&) = delete;
-
-  // False with the cause: it cannot be read, it is too large, or others may read it who must not.
-  bool read(const std::string& file, bool is_key, std::string& error) {
-    const Descriptor opened(::open(file.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
-    struct stat status {};
-    if (!opened || ::fstat(opened.number(), &status) != 0) {
-      error = file + ": " + std::strerror(errno);
-      return false;
-    }
-    error = refuse(file, status, is_key);
-    return error.empty() && fill(opened.number(), file, error);
-  }
-
-  Bio bio() const { return Bio(BIO_new_mem_buf(text_.data(), static_cast<int>(text_.size()))); }
-
- private:
-  static constexpr off_t kMost = off_t{1} << 20;
-
-  static std::string refuse(const std::string& file, const struct stat& status, bool is_key) {
-    if (!S_ISREG(status.st_mode)) return file + ": not a regular file";
-    if (status.st_size > kMost) return file + ": too large";
-    if (!is_key || (status.st_mode & (S_IRWXO | S_IWGRP)) == 0) return "";
-    return file +
-           ": others may read the private key, or change it; take these rights away "
-           "(chmod 600)";
-  }
-
-  bool fill(int file, const std::string& name, std::string& error) {
-    text_.resize(static_cast<std::size_t>(kMost));
-    std::size_t length = 0;
-    while (length < text_.size()) {
-      const ssize_t read = ::read(file, text_.data() + length, text_.size() - length);
-      if (read < 0 && errno == EINTR) continue;
-      if (read < 0) error = name + ": " + std::strerror(errno);
-      if (read <= 0) break;
-      length += static_cast<std::size_t>(read);
-    }
-    text_.resize(length);
-    return error.empty();
-  }
-
-  std::string text_;
-};
-
-int no_passphrase(char*, int, int, void*) {
-  return -1;  // there is nobody to ask
-}
 
 void set_rules(SSL_CTX* context, const TlsSettings& settings) {
   SSL_CTX_set_security_level(context, kSecurityLevel);
@@ -168,9 +60,12 @@ bool use_certificates(SSL_CTX* context, BIO* from) {
 bool load_own(SSL_CTX* context, const TlsSettings& settings, std::string& error) {
   const std::string& certificate = settings.certificate_file;
   const std::string& key = settings.key_file.empty() ? certificate : settings.key_file;
-  Text certificates;
-  Text keys;
-  if (!certificates.read(certificate, false, error) || !keys.read(key, true, error)) return false;
+  PemText certificates;
+  PemText keys;
+  if (!certificates.read(certificate, PemText::Holds::certificates, PemText::kMostOfCertificates,
+                         error) ||
+      !keys.read(key, PemText::Holds::key, PemText::kMostOfCertificates, error))
+    return false;
   const Bio of_certificates = certificates.bio();
   if (!of_certificates || !use_certificates(context, of_certificates.get()))
     return fail(error, certificate, "no usable certificate");
@@ -180,27 +75,6 @@ bool load_own(SSL_CTX* context, const TlsSettings& settings, std::string& error)
   if (!used) return fail(error, key, "no usable private key");
   if (SSL_CTX_use_PrivateKey(context, used.get()) != 1 || SSL_CTX_check_private_key(context) != 1)
     return fail(error, key, "not the key of the certificate in " + certificate);
-  return true;
-}
-
-bool load_authorities(SSL_CTX* context, const TlsSettings& settings, std::string& error) {
-  if (settings.client_certificates == ClientCertificates::none) return true;
-  const std::string& file = settings.ca_file;
-  if (file.empty()) {
-    error =
-        "clients' certificates are asked for, but orv-slapdTlsCaFile does not say who signs them";
-    return false;
-  }
-  if (!can_read(file, error)) return false;
-  if (SSL_CTX_load_verify_file(context, file.c_str()) != 1)
-    return fail(error, file, "no usable certificates");
-  STACK_OF(X509_NAME)* const names = SSL_load_client_CA_file(file.c_str());
-  if (!names) return fail(error, file, "no usable certificates");
-  SSL_CTX_set_client_CA_list(context, names);
-  const bool required = settings.client_certificates == ClientCertificates::required;
-  SSL_CTX_set_verify(context, SSL_VERIFY_PEER | (required ? SSL_VERIFY_FAIL_IF_NO_PEER_CERT : 0),
-                     nullptr);
-  SSL_CTX_set_verify_depth(context, kChainDepth);
   return true;
 }
 
@@ -266,9 +140,11 @@ std::shared_ptr<const TlsContext> TlsContext::load(const TlsSettings& settings,
     error = "OpenSSL does not know the suites: " + queued_error();
     return nullptr;
   }
-  if (!load_own(made.get(), settings, error) || !load_authorities(made.get(), settings, error))
+  std::string trust;
+  if (!load_own(made.get(), settings, error) || !load_trust(made.get(), settings, trust, error))
     return nullptr;
   const std::shared_ptr<TlsContext> context(new TlsContext(made.release()));
+  context->trust_ = std::move(trust);
   const X509* const certificate = SSL_CTX_get0_certificate(context->context_);
   context->end_point_ = end_point_of(certificate);
   context->description_ = ldap_name(X509_get_subject_name(certificate)) + ", good until " +
@@ -330,7 +206,27 @@ Flow TlsStream::outcome(int returned) {
 
 Flow TlsStream::shake_hands() {
   ERR_clear_error();
-  return outcome(SSL_do_handshake(ssl_));
+  const Flow flow = outcome(SSL_do_handshake(ssl_));
+  if (flow == Flow::moved && shows_certificate()) {
+    trust_ = context_->trust();
+    judgement_ = judged_in_handshake(ssl_);
+  }
+  return flow;
+}
+
+bool TlsStream::shows_certificate() const noexcept {
+  return SSL_get0_peer_certificate(ssl_) != nullptr;
+}
+
+std::string TlsStream::certificate_problem(const TlsContext* in_force, std::time_t now) {
+  if (!shows_certificate()) return "";
+  if (!in_force || in_force->trust().empty()) return "certificates are not asked for any more";
+  if (trust_ != in_force->trust()) {
+    judgement_ = judge_client(in_force->get(), ssl_, now);
+    trust_ = in_force->trust();
+  }
+  if (!judgement_.problem.empty()) return judgement_.problem;
+  return now > judgement_.good_until ? "certificate has expired" : "";
 }
 
 Flow TlsStream::read(char* to, std::size_t room, std::size_t& length) {

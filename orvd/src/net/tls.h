@@ -11,12 +11,14 @@
 #include <openssl/types.h>
 
 #include <cstddef>
+#include <ctime>
 #include <memory>
 #include <mutex>
 #include <string>
 #include <string_view>
 
 #include "auth/sasl.h"
+#include "net/trust.h"
 #include "settings.h"
 
 namespace orv::server {
@@ -37,12 +39,15 @@ class TlsContext {
   // For the log: subject and end of the server's certificate.
   const std::string& description() const noexcept { return description_; }
   bool has_expired() const noexcept { return expired_; }
+  // Names which certificates of clients are believed (load_trust).
+  const std::string& trust() const noexcept { return trust_; }
 
  private:
   explicit TlsContext(ssl_ctx_st* context) noexcept : context_(context) {}
   ssl_ctx_st* const context_;
   std::string end_point_;
   std::string description_;
+  std::string trust_;
   bool expired_ = false;
 };
 
@@ -98,6 +103,13 @@ class TlsStream {
   // After the handshake: version, cipher, and the subject of the client's certificate. Throws
   // std::bad_alloc.
   void describe(TransportFacts& facts) const;
+  // The same: whether the client has shown a certificate, which was good then; and why it is not at
+  // `now` (seconds of the epoch) by what is believed now. "" when it is, or none was shown. Throws
+  // std::bad_alloc.
+  bool shows_certificate() const noexcept;
+  std::string certificate_problem(const TlsContext* in_force, std::time_t now);
+  // By what it was judged last; "" when none was shown.
+  const std::string& trust() const noexcept { return trust_; }
   // Why it failed, mostly in OpenSSL's words; "" for a connection that was lost.
   const std::string& failure() const noexcept { return failure_; }
 
@@ -111,6 +123,8 @@ class TlsStream {
   bool broken_ = false;  // nothing more can be said
   int reads_left_ = 0;   // of the socket, for the call under way
   std::string failure_;
+  std::string trust_;  // by which the client's certificate was judged
+  Judgement judgement_;
 };
 
 }  // namespace orv::server

@@ -8,6 +8,7 @@
 
 #include "cfg/dn.h"
 #include "cfg/result_codes.h"
+#include "net/tls.h"
 #include "ops/guards.h"
 #include "ops/log_text.h"
 #include "slapi/administrators.h"
@@ -180,6 +181,16 @@ bool PendingOperation::take_budget(const Services& services) noexcept {
   return room != 0;
 }
 
+// Other certificates may be believed than when the operation began to wait; whether that of its
+// client is, the connection's own thread finds out.
+bool PendingOperation::trust_holds(const Services& services) noexcept {
+  if (trust.empty()) return true;
+  const auto in_force = services.tls ? services.tls->current() : nullptr;
+  if (in_force && in_force->trust() == trust) return true;
+  answer_.result(result::busy, "", "other certificates are believed from now on, try again");
+  return false;
+}
+
 // Who lost rights while the operation waited has them no more.
 bool PendingOperation::rights_hold(const Services& services) noexcept {
   if (!identity_ || services.authenticator.generation() == identity_generation ||
@@ -295,7 +306,8 @@ bool PendingOperation::may_begin(Services& services) noexcept {
     answer_.result(result::canceled, "", "");
     return false;
   }
-  return rights_hold(services) && take_budget(services) && may_fail(services) && has_reserves();
+  return trust_holds(services) && rights_hold(services) && take_budget(services) &&
+         may_fail(services) && has_reserves();
 }
 
 // Keeps what a search for a copy of the entry has found. False without memory.

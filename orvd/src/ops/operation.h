@@ -101,6 +101,9 @@ class PendingOperation final : public GateWaiter,
   // Which reading of the identities the bound one was good by.
   std::uint64_t identity_generation = 0;
 
+  // By what the certificate of the client was believed; "": it has none.
+  std::string trust;
+
   // The limit of what changes that fail may cost, in bytes.
   std::int64_t failure_limit = 0;
 
@@ -139,6 +142,7 @@ class PendingOperation final : public GateWaiter,
   static bool interrupted(void* self) noexcept;
   bool must_stop() noexcept;
   bool take_budget(const Services& services) noexcept;
+  bool trust_holds(const Services& services) noexcept;
   bool rights_hold(const Services& services) noexcept;
   bool may_fail(Services& services) noexcept;
   bool has_reserves() noexcept;

@@ -5,6 +5,7 @@
 #include <asio/thread_pool.hpp>
 #include <atomic>
 #include <cstdint>
+#include <ctime>
 #include <functional>
 #include <memory>
 #include <string>
@@ -107,6 +108,8 @@ struct Services {
   std::atomic<std::int64_t> unauthenticated{0};  // connections on which nobody is bound
   CutOffLog cut_offs{logs};
   FairQueue binds{verifiers};
+  // Seconds of the epoch, for what ends at a date.
+  std::function<std::time_t()> wall_time = [] { return std::time(nullptr); };
 };
 
 }  // namespace orv::server

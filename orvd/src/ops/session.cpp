@@ -328,6 +328,7 @@ Session::OperationPtr Session::make_operation(std::int32_t id, int response_tag,
   auto operation =
       std::make_shared<PendingOperation>(shared_from_this(), identity_, id, response_tag, limits);
   operation->identity_generation = identity_checked_;
+  operation->trust = transport_trust();
   operation->failure_limit = settings().max_failed_change_size;
   lend_storage(operation->answer().bytes());
   return operation;
@@ -712,8 +713,10 @@ bool Session::awaits_change() const noexcept {
   });
 }
 
-// Ends the connection when the identities were read anew and the bound one is not what it was.
+// Ends the connection when the identities were read anew and the bound one is not what it was, or
+// when what the transport proves is not good any more.
 bool Session::identity_holds() {
+  if (!transport_holds()) return false;
   if (!identity_) return true;
   const std::uint64_t generation = services_.authenticator.generation();
   if (generation == identity_checked_) return true;

@@ -68,6 +68,11 @@ class Session : public OperationHome,
   virtual void start_tls() {}
   // Whether bytes are here that the client sent behind the message at hand.
   virtual bool more_is_here() const noexcept { return false; }
+  // Whether what the transport proves of the client still holds; ends the connection when it does
+  // not. To be asked before anything is done for the client.
+  virtual bool transport_holds() { return true; }
+  // By what the certificate of the client was believed (TlsContext::trust); "" when it has none.
+  virtual std::string transport_trust() const { return ""; }
   // From what is queued next on, and for what comes in from now on, `layer` is used.
   virtual void protect(std::unique_ptr<SecurityLayer> layer);
 

@@ -1,0 +1,131 @@
+#include "net/trust.h"
+
+#include <openssl/err.h>
+#include <openssl/evp.h>
+#include <openssl/pem.h>
+#include <openssl/ssl.h>
+#include <openssl/x509.h>
+#include <openssl/x509_vfy.h>
+
+#include <algorithm>
+#include <limits>
+#include <memory>
+#include <new>
+#include <string_view>
+
+#include "net/pem.h"
+
+namespace orv::server {
+namespace {
+
+// Certificates between a client's own and the authority.
+constexpr int kChainDepth = 8;
+
+struct InfosReleaser {
+  void operator()(STACK_OF(X509_INFO) * infos) const noexcept {
+    sk_X509_INFO_pop_free(infos, X509_INFO_free);
+  }
+};
+using Infos = std::unique_ptr<STACK_OF(X509_INFO), InfosReleaser>;
+using Verification = std::unique_ptr<X509_STORE_CTX, Releaser<X509_STORE_CTX_free>>;
+
+std::string hash_of(std::string_view text) {
+  unsigned char hash[EVP_MAX_MD_SIZE];
+  unsigned int size = 0;
+  if (EVP_Digest(text.data(), text.size(), hash, &size, EVP_sha256(), nullptr) != 1)
+    throw std::bad_alloc();
+  return {reinterpret_cast<const char*>(hash), size};
+}
+
+// Also names them to clients. False when there is none, or something that is damaged.
+bool add_authorities(SSL_CTX* context, BIO* from) {
+  const Infos infos(PEM_X509_INFO_read_bio(from, nullptr, no_passphrase, nullptr));
+  if (!infos) return false;
+  int added = 0;
+  for (int i = 0; i < sk_X509_INFO_num(infos.get()); ++i) {
+    X509* const authority = sk_X509_INFO_value(infos.get(), i)->x509;
+    if (!authority) continue;
+    if (X509_STORE_add_cert(SSL_CTX_get_cert_store(context), authority) != 1 ||
+        SSL_CTX_add_client_CA(context, authority) != 1)
+      return false;
+    ++added;
+  }
+  return added > 0;
+}
+
+bool load_authorities(SSL_CTX* context, const std::string& file, std::string& trust,
+                      std::string& error) {
+  PemText text;
+  if (!text.read(file, PemText::Holds::certificates, PemText::kMostOfAuthorities, error))
+    return false;
+  const Bio bio = text.bio();
+  if (!bio || !add_authorities(context, bio.get()))
+    return fail(error, file, "no usable certificates");
+  trust += hash_of(text.text());
+  return true;
+}
+
+std::time_t seconds_of(const ASN1_TIME* time) {
+  std::tm parts{};
+  // What cannot be read has passed.
+  return ASN1_TIME_to_tm(time, &parts) == 1 ? ::timegm(&parts) : 0;
+}
+
+std::time_t first_end(const STACK_OF(X509) * chain) {
+  std::time_t end = std::numeric_limits<std::time_t>::max();
+  for (int i = 0; i < sk_X509_num(chain); ++i)
+    end = std::min(end, seconds_of(X509_get0_notAfter(sk_X509_value(chain, i))));
+  return end;
+}
+
+}  // namespace
+
+bool load_trust(SSL_CTX* context, const TlsSettings& settings, std::string& trust,
+                std::string& error) {
+  trust.clear();
+  if (settings.client_certificates == ClientCertificates::none) return true;
+  if (settings.ca_file.empty()) {
+    error =
+        "clients' certificates are asked for, but orv-slapdTlsCaFile does not say who signs them";
+    return false;
+  }
+  if (!load_authorities(context, settings.ca_file, trust, error)) return false;
+  const bool required = settings.client_certificates == ClientCertificates::required;
+  SSL_CTX_set_verify(context, SSL_VERIFY_PEER | (required ? SSL_VERIFY_FAIL_IF_NO_PEER_CERT : 0),
+                     nullptr);
+  SSL_CTX_set_verify_depth(context, kChainDepth);
+  return true;
+}
+
+// Follows what OpenSSL does in a handshake.
+Judgement judge_client(SSL_CTX* context, SSL* connection, std::time_t now) {
+  const Certificate shown(SSL_get1_peer_certificate(connection));
+  const Verification verification(X509_STORE_CTX_new());
+  if (!shown || !verification ||
+      X509_STORE_CTX_init(verification.get(), SSL_CTX_get_cert_store(context), shown.get(),
+                          SSL_get_peer_cert_chain(connection)) != 1)
+    throw std::bad_alloc();
+  X509_VERIFY_PARAM* const rules = X509_STORE_CTX_get0_param(verification.get());
+  X509_VERIFY_PARAM_set_auth_level(rules, SSL_CTX_get_security_level(context));
+  X509_STORE_CTX_set_default(verification.get(), "ssl_client");
+  X509_VERIFY_PARAM_set1(rules, SSL_CTX_get0_param(context));
+  X509_VERIFY_PARAM_set_time(rules, now);
+  const bool good = X509_verify_cert(verification.get()) == 1;
+  ERR_clear_error();
+  const int why = X509_STORE_CTX_get_error(verification.get());
+  if (!good && why == X509_V_ERR_OUT_OF_MEM) throw std::bad_alloc();
+  Judgement judgement;
+  if (good)
+    judgement.good_until = first_end(X509_STORE_CTX_get0_chain(verification.get()));
+  else
+    judgement.problem = X509_verify_cert_error_string(why);
+  return judgement;
+}
+
+Judgement judged_in_handshake(const SSL* connection) {
+  Judgement judgement;
+  judgement.good_until = first_end(SSL_get0_verified_chain(connection));
+  return judgement;
+}
+
+}  // namespace orv::server

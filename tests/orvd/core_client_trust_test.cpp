@@ -1,0 +1,249 @@
+// Clients that show a certificate, once it is not believed any more: its authority is gone, its
+// time has passed, or nobody asks for certificates.
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <ctime>
+#include <fstream>
+#include <sstream>
+
+#include "auth/sasl_external.h"
+#include "cfg/result_codes.h"
+#include "core_server_fixture.h"
+#include "core_tls_client.h"
+
+namespace orv::server {
+namespace {
+
+using test::Certificates;
+using test::kNotice;
+using test::kTop;
+using test::NamePart;
+using test::Pair;
+using test::Reply;
+using test::TlsClient;
+using test::WireClient;
+using test::Wording;
+
+// Whoever shows a certificate is the primary administrator by it. The authorities stand in a file
+// that tests write anew.
+class ClientTrust : public test::BlockedServer, public ExternalIdentities {
+ protected:
+  ClientTrust() {
+    own = certificates.self_signed("localhost");
+    alice = certificates.of_client("alice");
+    other = authority_pair("Other");
+    settings.tls = {own.certificate, own.key, certificates.path("ca"), ClientCertificates::optional,
+                    true};
+    believe({certificates.authority()});
+    settings.error_log = certificates.path("error.log");
+    settings.error_log_level = "info";
+    more.secure_port = 0;
+    mechanisms.push_back(make_external(*this));
+    reload = [this](Settings& wanted) {
+      wanted = settings;
+      return true;
+    };
+    wall_time = [this] { return std::time(nullptr) + later.load(); };
+    backend.on_change = [](pblock* parameters) {
+      send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 53, nullptr,
+                       "");
+      return 53;
+    };
+  }
+  ~ClientTrust() override {
+    go_on.happen();
+    stop();
+  }
+
+  std::shared_ptr<const Identity> primary_administrator() override { return nullptr; }
+  std::shared_ptr<const Identity> of_certificate(std::string_view subject) override {
+    auto identity = std::make_shared<Identity>(Identity{"CN=ROOT", 0x0C, 0, ""});
+    identity->certificate_subject = subject;
+    return identity;
+  }
+
+  static Wording named(const char* name) {
+    Wording wording;
+    wording.subject = {{"CN", V_ASN1_UTF8STRING, name}};
+    return wording;
+  }
+  Pair authority_pair(const char* name, long ends = 3600) {
+    Wording wording = named(name);
+    wording.constraint = "critical,CA:TRUE";
+    wording.ends = ends;
+    return certificates.self_signed(wording);
+  }
+  // Writes the authorities; in force after the next reload.
+  void believe(const std::vector<std::string>& authorities) {
+    std::ofstream file(certificates.path("ca"), std::ios::trunc);
+    for (const std::string& authority : authorities) file << std::ifstream(authority).rdbuf();
+  }
+  // A client that shows a certificate; and one that is bound by that of alice.
+  std::unique_ptr<TlsClient> connect(const Pair& shown) {
+    auto client = std::make_unique<TlsClient>(server->secure_port());
+    EXPECT_TRUE(client->shake_hands({TLS1_2_VERSION, TLS1_3_VERSION, &shown}));
+    return client;
+  }
+  std::unique_ptr<TlsClient> bound() {
+    auto client = connect(alice);
+    EXPECT_EQ(code_of(*client, test::sasl_bind(1, "EXTERNAL", "")), 0);
+    EXPECT_EQ(code_of(*client, test::delete_entry(2, kTop)), 53);
+    return client;
+  }
+  // The client is told, without having asked for anything, and loses the connection.
+  static void expect_end(WireClient& client) {
+    const std::optional<Reply> notice = client.receive();
+    ASSERT_TRUE(notice);
+    EXPECT_EQ(notice->id, 0);
+    EXPECT_EQ(notice->tag, kNotice);
+    EXPECT_EQ(notice->code, result::stronger_auth_required);
+    EXPECT_TRUE(client.closed());
+  }
+  // Its requests are executed.
+  static void expect_served(WireClient& client, int id = 3) {
+    EXPECT_EQ(code_of(client, test::delete_entry(id, kTop)), 53);
+  }
+  std::string stop_and_read_log() {
+    stop();
+    std::stringstream text;
+    text << std::ifstream(settings.error_log).rdbuf();
+    return text.str();
+  }
+  // The clock is moved on by so many seconds.
+  void let_time_pass(std::time_t seconds) { later += seconds; }
+
+  std::atomic<std::time_t> later{0};
+  Certificates certificates;
+  Pair own;
+  Pair alice;
+  Pair other;
+};
+
+TEST_F(ClientTrust, WhoseAuthorityIsReplacedLosesTheConnectionWithANoticeAndALine) {
+  start();
+  const auto client = bound();
+  believe({other.certificate});
+  server->reload();
+  expect_end(*client);
+  const std::string log = stop_and_read_log();
+  EXPECT_NE(log.find("the certificate of the client is no longer good (unable to get local issuer "
+                     "certificate): closed 127.0.0.1:"),
+            std::string::npos)
+      << log;
+}
+
+TEST_F(ClientTrust, WhatIsAskedAfterTheAuthorityIsGoneIsNotDone) {
+  start();
+  const auto client = bound();
+  const int before = backend.calls(parameter::delete_function);
+  believe({other.certificate});
+  server->reload();
+  client->send(test::delete_entry(3, kTop));
+  expect_end(*client);
+  EXPECT_EQ(backend.calls(parameter::delete_function), before);
+}
+
+TEST_F(ClientTrust, WhatWaitedForItsTurnWhenTheAuthorityWentIsNotDone) {
+  block();
+  const auto client = connect(alice);
+  EXPECT_EQ(code_of(*client, test::sasl_bind(1, "EXTERNAL", "")), 0);
+  client->send(test::delete_entry(2, kTop));
+  ASSERT_TRUE(wait_for_waiters(1));
+  believe({other.certificate});
+  server->reload();
+  go_on.happen();
+  const std::optional<Reply> reply = client->receive();
+  ASSERT_TRUE(reply);
+  EXPECT_EQ(reply->id, 2);
+  EXPECT_EQ(reply->code, result::busy);
+  expect_end(*client);
+  EXPECT_EQ(backend.calls(parameter::delete_function), 1);  // that of the client before
+}
+
+TEST_F(ClientTrust, WhoseAuthorityStaysBesideANewOneStays) {
+  start();
+  const auto client = bound();
+  believe({other.certificate, certificates.authority()});
+  server->reload();
+  expect_served(*client);
+}
+
+TEST_F(ClientTrust, WhoHasNotBoundYetDoesNotBindByACertificateThatIsNotBelievedAnyMore) {
+  start();
+  const auto client = connect(alice);
+  EXPECT_EQ(code_of(*client, test::search(1, "")), 0);
+  believe({other.certificate});
+  server->reload();
+  client->send(test::sasl_bind(2, "EXTERNAL", ""));
+  expect_end(*client);
+}
+
+TEST_F(ClientTrust, NobodyIsKeptWhenCertificatesAreNotAskedForAnyMore) {
+  start();
+  const auto client = bound();
+  TlsClient without(server->secure_port());
+  ASSERT_TRUE(without.shake_hands());
+  bind_as_root(without);
+  settings.tls.client_certificates = ClientCertificates::none;
+  server->reload();
+  expect_end(*client);
+  expect_served(without);
+}
+
+TEST_F(ClientTrust, StaysWhenRenewalFails) {
+  start();
+  const auto client = bound();
+  for (const char* const text : {"", "nonsense"}) {
+    std::ofstream(certificates.path("ca"), std::ios::trunc) << text;
+    server->reload();
+    expect_served(*client);
+  }
+  EXPECT_NE(stop_and_read_log().find("TLS stays as it was: " + certificates.path("ca")),
+            std::string::npos);
+}
+
+TEST_F(ClientTrust, StaysWhenTheServersOwnCertificateIsRenewed) {
+  start();
+  const auto client = bound();
+  const Pair renewed = certificates.self_signed("renewed");
+  settings.tls.certificate_file = renewed.certificate;
+  settings.tls.key_file = renewed.key;
+  settings.tls.client_certificates = ClientCertificates::required;
+  server->reload();
+  expect_served(*client);
+}
+
+TEST_F(ClientTrust, WhoseCertificateExpiresLosesTheConnection) {
+  start();
+  const auto client = bound();
+  let_time_pass(3000);
+  expect_served(*client);
+  let_time_pass(1000);
+  expect_end(*client);
+  EXPECT_NE(stop_and_read_log().find("(certificate has expired): closed"), std::string::npos);
+}
+
+TEST_F(ClientTrust, WhoseAuthorityExpiresLosesTheConnection) {
+  const Pair brief = authority_pair("Brief", 1800);
+  alice = certificates.signed_by(brief, named("alice"));
+  believe({brief.certificate});
+  start();
+  const auto client = bound();
+  let_time_pass(2000);
+  expect_end(*client);
+}
+
+// What was judged anew ends with its time, too.
+TEST_F(ClientTrust, WhoseCertificateExpiresAfterARenewalLosesTheConnection) {
+  start();
+  const auto client = bound();
+  believe({other.certificate, certificates.authority()});
+  server->reload();
+  expect_served(*client);
+  let_time_pass(4000);
+  expect_end(*client);
+}
+
+}  // namespace
+}  // namespace orv::server
