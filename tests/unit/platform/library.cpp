@@ -113,18 +113,27 @@ const char* cfg_dump_exception(_CFG* session) {
   return "line 7, column 3: not an attribute";
 }
 
+namespace {
+
+const scripted::Answer& answer_of_file(const char* base, const char* filter) {
+  static const scripted::Answer kMissing{{}, 32};
+  auto answer = platform().file.find(std::string(base) + "?" + filter);
+  if (answer == platform().file.end()) answer = platform().file.find(base);
+  return answer == platform().file.end() ? kMissing : answer->second;
+}
+
+}  // namespace
+
 int cfg_search_s(_CFG* session, const char* base, int scope, const char* filter, char** attributes,
                  int types_only, _CFGMessage** chain) {
   const Call call("cfg_search_s", session, base, scope, filter, attributes, types_only);
   *chain = nullptr;
   if (const auto failure = call.failure_or_no_memory()) return done(*failure);
-  auto answer = platform().file.find(std::string(base) + "?" + filter);
-  if (answer == platform().file.end()) answer = platform().file.find(base);
-  if (answer == platform().file.end()) return done(32);
-  if (answer->second.code == 0 || !answer->second.entries.empty()) {
-    *chain = make_chain(answer->second);
-  }
-  return done(answer->second.code);
+  const scripted::Answer& answer =
+      platform().search ? platform().search(base, scope, filter, attributes, types_only)
+                        : answer_of_file(base, filter);
+  if (answer.code == 0 || !answer.entries.empty()) *chain = make_chain(answer);
+  return done(answer.code);
 }
 
 int cfg_count_entries(_CFG* session, _CFGMessage* chain) {

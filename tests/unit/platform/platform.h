@@ -132,6 +132,10 @@ class Platform {
 
   // By base DN, or by "base?filter", which comes first; others answer 32.
   std::map<std::string, Answer> file;
+  // Answers each search in place of `file`. What it gives stays until the chain is released.
+  std::function<const Answer&(const char* base, int scope, const char* filter, char** attributes,
+                              int types_only)>
+      search;
   std::string link_target;  // what readlink finds
   int link_errno = 0;       // or why it fails
   std::map<std::string, std::string> environment;
