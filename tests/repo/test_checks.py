@@ -12,6 +12,7 @@ sys.path[:0] = [os.path.dirname(os.path.abspath(__file__)),
 import check_arrows  # noqa: E402
 import check_behaviours  # noqa: E402
 import check_configuration_doc  # noqa: E402
+import check_fault_lists  # noqa: E402
 import check_named_tests  # noqa: E402
 import check_readme  # noqa: E402
 import check_schema  # noqa: E402
@@ -229,6 +230,27 @@ class Behaviours(Tree):
         self.write("tests/e2e/helpers/users.py", "needs_root = pytest.mark.skipif(True)\n")
         found = self.found("test_x.py::test_one", module=f"@users.needs_root\n{test}")
         self.assertEqual(found, ["may pass over itself: test_x.py::test_one"])
+
+
+class FaultLists(Tree):
+    def found(self, faults):
+        self.write("cfg/a.cpp", "one();\ntwo();\none();\n")
+        self.write("tests/mutation/cfg.faults", faults)
+        return check_fault_lists.misfits(self.top)
+
+    def test_faults_that_fit_pass(self):
+        faults = "# why\n== cfg/a.cpp\n- two();\n+ \n\n- two();\n- one();\n+\n"
+        self.assertEqual(self.found(faults), [])
+
+    def test_faults_that_do_not_fit_are_found(self):
+        self.assertEqual(self.found("== cfg/a.cpp\n- one();\n+\n\n- three();\n+\n\n+ four();\n"),
+                         ["tests/mutation/cfg.faults:2: stands 2 times in cfg/a.cpp: one();",
+                          "tests/mutation/cfg.faults:5: stands 0 times in cfg/a.cpp: three();",
+                          "tests/mutation/cfg.faults:8: stands 0 times in cfg/a.cpp: "
+                          "nothing to replace"])
+
+    def test_faults_of_no_file_are_found(self):
+        self.assertEqual(len(self.found("- one();\n+\n\n== cfg/b.cpp\n- one();\n+\n")), 2)
 
 
 class Readme(unittest.TestCase):
