@@ -692,7 +692,8 @@ struct Refusal {
   std::string dn = kEntry;
   Attributes attributes = {};
   std::vector<std::string> in_file = {};
-  std::string failing = {};  // a function of the platform that gives the code
+  std::string failing = {};        // a function of the platform that gives the code
+  std::string administrator = {};  // the primary administrator's bind DN
 };
 
 class AddRefused : public Add, public testing::WithParamInterface<Refusal> {};
@@ -704,6 +705,10 @@ TEST_P(AddRefused, IsAnsweredWithTheCodeAndNoLaterRuleIsAsked) {
   const Refusal& refusal = GetParam();
   make(refusal.dn, refusal.attributes);
   for (const std::string& dn : refusal.in_file) exists(dn);
+  if (!refusal.administrator.empty()) {
+    platform.file[kConfiguration] = {
+        {{kConfiguration, {{"orv-slapdAdminDN", {refusal.administrator}}}}}};
+  }
   platform.admin_policy = true;
   if (!refusal.failing.empty()) platform.fail(refusal.failing, 1, refusal.code);
   trcEvents = kTraceEntry;
@@ -741,6 +746,16 @@ INSTANTIATE_TEST_SUITE_P(
                 "cn=m,cn=admingroup,cn=configuration",
                 {{"orv-slapdAdminRole", {"NoAdmin"}}},
                 {"CN=ADMINGROUP,CN=CONFIGURATION"}},
+        Refusal{"MemberWhoseBindDnIsTaken",
+                68,
+                "group",
+                "cn=m,cn=admingroup,cn=configuration",
+                {{"objectClass", {"top", "orv-slapdConfigEntry", "orv-slapdAdminGroupMember"}},
+                 {"orv-slapdAdminRole", {"NoAdmin"}},
+                 {"orv-slapdAdminDN", {"CN = Root"}}},
+                {"CN=ADMINGROUP,CN=CONFIGURATION"},
+                {},
+                "cn=root"},
         Refusal{"Supplier",
                 80,
                 "supplier",

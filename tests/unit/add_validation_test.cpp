@@ -223,6 +223,7 @@ TEST_F(AddRules, GroupIsForThePrimaryAdministratorAlone) {
       adding(inside, {});
       EXPECT_EQ(group(), 50) << flags << inside;
       EXPECT_THAT(asked(), IsEmpty());
+      EXPECT_THAT(platform.debug_lines(), IsEmpty());
     }
   }
 }
@@ -241,14 +242,18 @@ TEST_F(AddRules, ContainerNeedsTopAndThenContainer) {
   EXPECT_THAT(asked(), ElementsAre("value_find(\"objectClass\", \"top\", 0, 1)",
                                    "value_find(\"objectClass\", \"container\", 0, 1)"));
   EXPECT_EQ(searches(), 0);
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
   adding(kGroup, {{"objectClass", {"top"}}});
   EXPECT_EQ(group(), 65);
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
   adding(kGroup, {{"objectClass", {"container"}}});
   EXPECT_EQ(group(), 65);
   EXPECT_EQ(asked().size(), 1U);
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
   adding(kGroup, {{"cn", {"x"}}});
   EXPECT_EQ(group(), 65);
   EXPECT_THAT(asked(), IsEmpty());
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
 }
 
 TEST_F(AddRules, OnlyTheContainersOwnDnIsTheContainer) {
@@ -268,6 +273,28 @@ TEST_F(AddRules, ClassesMatchWhereTheServerSaysSo) {
   EXPECT_EQ(
       platform.run([&] { return checkIfAdminGroupEntry(dn, e.get(), &connection, &operation); }),
       0);
+}
+
+TEST_F(AddRules, ClassesAreAbsentWhateverElseTheServerSays) {
+  const std::vector<std::string> both = {"orv-slapdReplication", "orv-slapdSupplier"};
+  const auto answered = [&](std::uint32_t identifier, auto rule) {
+    platform.forget();
+    platform.fail("value_find", 0, -1);
+    return traced(identifier, rule);
+  };
+  adding(kGroup, {{"objectClass", {"top", "container"}}});
+  EXPECT_EQ(answered(function_id::check_if_admin_group_entry,
+                     [&] { return checkIfAdminGroupEntry(dn, e.get(), &connection, &operation); }),
+            65);
+  adding(kElsewhere, {{"objectClass", both}, {"orv-slapdMasterDN", {"cn=taken"}}});
+  EXPECT_EQ(answered(function_id::check_if_repl_supplier_entry,
+                     [&] { return checkIfReplSupplierEntry(dn, e.get(), &connection); }),
+            68);
+  adding(kElsewhere, {{"objectClass", both}, {"orv-slapdMasterPW", {"new"}}});
+  EXPECT_EQ(answered(function_id::check_admin_policy_entry,
+                     [&] { return checkAdminPolicyEntry(dn, e.get(), &connection, &operation); }),
+            0);
+  EXPECT_EQ(platform.count("verify_admin_password"), 1);
 }
 
 TEST_F(AddRules, ClassesAreThoseOfTheDirectReference) {
@@ -478,13 +505,15 @@ TEST_F(AddRules, KerberosAndDigestAreForThePrimaryAdministratorAlone) {
 }
 
 TEST_F(AddRules, KerberosEntryNeedsItsClassAndItsIdentity) {
-  adding(kKerberos, {{"orv-slapdKrbAdminDN", {"orv-kn=x"}}});
-  EXPECT_EQ(kerberos(), 65);
-  adding(kKerberos, {{"objectClass", {"top"}}, {"orv-slapdKrbAdminDN", {"orv-kn=x"}}});
-  EXPECT_EQ(kerberos(), 65);
-  adding(kKerberos, {{"objectClass", {"orv-slapdKerberos"}}});
-  EXPECT_EQ(kerberos(), 65);
-  EXPECT_EQ(searches(), 0);
+  for (const Attributes& attributes :
+       {Attributes{{"orv-slapdKrbAdminDN", {"orv-kn=x"}}},
+        {{"objectClass", {"top"}}, {"orv-slapdKrbAdminDN", {"orv-kn=x"}}},
+        {{"objectClass", {"orv-slapdKerberos"}}}}) {
+    adding(kKerberos, attributes);
+    EXPECT_EQ(kerberos(), 65);
+    EXPECT_EQ(searches(), 0);
+    EXPECT_THAT(platform.debug_lines(), IsEmpty());
+  }
   adding(kKerberos,
          {{"objectClass", {"orv-slapdKerberos"}}, {"orv-slapdKrbAdminDN", {"orv-kn=x"}}});
   EXPECT_EQ(kerberos(), 0);
@@ -523,13 +552,15 @@ TEST_F(AddRules, DigestRuleIsForItsEntryAlone) {
 }
 
 TEST_F(AddRules, DigestEntryNeedsItsClassButNoUser) {
-  adding(kDigest, {});
-  EXPECT_EQ(digest(), 65);
-  adding(kDigest, {{"objectClass", {"top"}}});
-  EXPECT_EQ(digest(), 65);
+  for (const Attributes& attributes : {Attributes{}, {{"objectClass", {"top"}}}}) {
+    adding(kDigest, attributes);
+    EXPECT_EQ(digest(), 65);
+    EXPECT_THAT(platform.debug_lines(), IsEmpty());
+  }
   adding(kDigest, {{"objectClass", {"orv-slapdDigest"}}});
   EXPECT_EQ(digest(), 0);
   EXPECT_EQ(searches(), 0);
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
   adding(kDigest,
          {{"objectClass", {"orv-slapdDigest"}}, {"orv-slapdDigestAdminUser", {"Taken", "taken"}}});
   EXPECT_EQ(digest(), 0);
@@ -554,6 +585,7 @@ TEST_F(AddRules, SplitNameMustBeAlphanumericBeforeAnySearch) {
     EXPECT_EQ(proxy(), 21) << bad;
     EXPECT_EQ(searches(), 0);
     EXPECT_EQ(platform.count("PrintMessage"), 0);
+    EXPECT_THAT(platform.debug_lines(), IsEmpty());
   }
 }
 
@@ -681,6 +713,9 @@ TEST_F(AddRules, NothingIsTracedWhenNotDebugging) {
   debug_off();
   adding_member({{"orv-slapdKrbAdminDN", {"x"}}});
   EXPECT_EQ(group(), 80);
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
+  adding(kKerberos, {{"objectClass", {"orv-slapdKerberos"}}, {"orv-slapdKrbAdminDN", {"x"}}});
+  EXPECT_EQ(kerberos(), 80);
   EXPECT_THAT(platform.debug_lines(), IsEmpty());
 }
 

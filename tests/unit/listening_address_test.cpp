@@ -143,6 +143,17 @@ TEST_F(ListeningAddress, TextThatCannotBeMadeLeavesTheRefusalWithoutOne) {
   EXPECT_THAT(platform.leaks(), IsEmpty());  // here the copy goes
 }
 
+TEST_F(ListeningAddress, CopyIsReleasedAfterItWasSaidThatTheTextCannotBeMade) {
+  top_entry({"10.0.0.1"});
+  platform.fail("kel_asprintf", 1, -1);
+  platform.name_allocation(1, "copy");
+  EXPECT_EQ(check(), 19);
+  const auto story = platform.story({"free"});
+  ASSERT_GT(story.size(), 1U);
+  EXPECT_THAT(story[story.size() - 2], testing::StartsWith("debug: kel_asprintf failedin"));
+  EXPECT_EQ(story.back(), "free(copy)");
+}
+
 TEST_F(ListeningAddress, NoMemoryForTheCopyLeavesTheRefusalWithoutAText) {
   top_entry({"10.0.0.1"});
   platform.fail_allocation(1);

@@ -197,10 +197,21 @@ TEST_F(Modify, FailedBindGives1AnsweredAndKeepsHandleAndLock) {
   close_session();
 }
 
+TEST_F(Modify, ExceptionOfTheLibraryGives1AnsweredWithNothingHeld) {
+  platform.at("cfg_init", 1, [] { throw 42; });
+  EXPECT_EQ(modify(), 1);
+  BackendTest::expect_answered(1);
+  EXPECT_FALSE(locked());
+  EXPECT_EQ(connection.config_session, nullptr);
+  EXPECT_EQ(platform.count("pthread_mutex_unlock"), 1);
+  EXPECT_EQ(platform.count("cfg_unbind"), 0);
+  EXPECT_TRUE(list_is_gone());
+}
+
 TEST_F(Modify, NoHandleGives90AnsweredAndKeepsTheLock) {
   platform.fail("cfg_init", 1, 0);
   EXPECT_EQ(modify(), 90);
-  EXPECT_EQ(platform.count("send_ldap_result"), 1);
+  BackendTest::expect_answered(90);
   EXPECT_TRUE(list_is_gone());
   EXPECT_TRUE(locked());
 }
@@ -367,8 +378,9 @@ TEST_F(LastRole, IsForgivenToEveryCallerButRefusedByAuthorityWhereThatRefuses) {
 TEST_F(LastRole, ForgivenessSkipsNoWalkOverASuppliersSuffixes) {
   as(kServerSupplier);
   platform.fail("ldcf_api_schema_check", 1, 65);
-  EXPECT_EQ(modify(roles_), 50);
-  EXPECT_THAT(platform.calls({"checkMasterSrvDn"}), ElementsAre("checkMasterSrvDn(null, \"\")"));
+  EXPECT_EQ(modify({roles_[0], {kAdd, kSuffix, {{"O=A"}}}}), 50);
+  EXPECT_THAT(platform.calls({"checkMasterSrvDn"}),
+              ElementsAre("checkMasterSrvDn(null, \"\")", "checkMasterSrvDn(\"O=A\", \"\")"));
 }
 
 TEST_F(LastRole, RefusalOfTheRolesEndsBeforeTheSecondCheck) {
@@ -618,6 +630,15 @@ TEST_F(ModifyBySupplier, RefusalOfTheSchemaSkipsTheWalkButNotTheFirstQuestion) {
   EXPECT_EQ(modify(add_a_), 21);
 }
 
+TEST_F(ModifyBySupplier, RefusalOfTheSchemaSkipsTheWalkOverSuffixesOfItsOwn) {
+  platform.fail("ldcf_api_schema_check", 1, 65);
+  EXPECT_EQ(modify(add_a_), 65);
+  expect_answered(65);
+  EXPECT_THAT(platform.calls({"checkMasterSrvDn"}),
+              ElementsAre("checkMasterSrvDn(null, \"CN=S\")"));
+  EXPECT_EQ(operation.master_server_result, 0);
+}
+
 TEST_F(ModifyBySupplier, RefusalOfTheSchemaNotesTheFirstAnswerNevertheless) {
   platform.supplied[""] = 4;
   platform.fail("ldcf_api_schema_check", 1, 65);
@@ -748,13 +769,14 @@ class ModifyByMember : public Modify {
   ModifyByMember() { as(kMember, "CN=ONE"); }
 
   // Which of all sets of role bits let a member change an entry.
-  void expect_roles(const std::function<bool(unsigned)>& allowed) {
+  void expect_roles(const std::function<bool(unsigned)>& allowed,
+                    const Modifications& list = kAnything) {
     for (unsigned roles = 0; roles < 0x80; ++roles) {
       platform.forget();
       operation.roles = roles;
       connection.roles = roles;
       const int expected = allowed(roles) ? 0 : 50;
-      EXPECT_EQ(modify(), expected) << roles;
+      EXPECT_EQ(modify(list), expected) << roles;
       if (expected == 50) platform.release_leaks();
     }
   }
@@ -865,6 +887,12 @@ TEST_F(ModifyByMember, SupplierNeedsThreeRolesTogetherUnderAnyDnAndInAnyLetterCa
   expect_roles([](unsigned roles) { return (roles & 0x20) != 0; });
 }
 
+TEST_F(ModifyByMember, SupplierInsideOfTheGroupNeedsThreeRolesAlsoForItsOwnPassword) {
+  target(kOne, {"orv-slapdSupplier"}, {{"orv-slapdAdminDN", {"cn=one"}}});
+  expect_roles([](unsigned roles) { return (roles & 0x34) == 0x34; },
+               {{kReplace, "orv-slapdAdminPW", {{"new"}}}});
+}
+
 TEST_F(ModifyByMember, SupplierUnderAProtectedDnHasToPassBothRules) {
   target(kAudit, {"orv-slapdSupplier"});
   expect_roles([](unsigned roles) { return (roles & 0x36) == 0x36; });
@@ -890,6 +918,9 @@ TEST_F(ModifyByMember, WithoutRolesIsRefusedBeforeTheEntryIsRead) {
   EXPECT_EQ(modify(), 50);
   expect_answered(50);
   EXPECT_EQ(platform.count("cfg_search_s"), 1);  // that of the schema check
+  for (const DebugLine& line : platform.debug_lines()) {
+    EXPECT_NE(line.category, error("").category) << line.text;
+  }
   expect_copy_left();
 }
 
@@ -977,8 +1008,24 @@ TEST_F(ModifyByMember, ObjectClassesAreReadAndReleased) {
   EXPECT_THAT(platform.calls({"cfg_search_s"}),
               Contains("cfg_search_s(session, \"CN=X,CN=CONFIGURATION\", 0, \"(objectclass=*)\", "
                        "[OBJECTCLASS], 0)"));
-  EXPECT_THAT(platform.calls({"cfg_get_values"}),
-              Contains("cfg_get_values(session, record 1, \"OBJECTCLASS\")"));
+  EXPECT_THAT(platform.calls({"cfg_get_values", "cfg_msgfree", "cfg_value_free"}),
+              ElementsAre("cfg_msgfree(chain)",  // of the schema check
+                          "cfg_get_values(session, record 1, \"OBJECTCLASS\")",
+                          "cfg_msgfree(chain)", "cfg_value_free()"));
+}
+
+TEST_F(ModifyByMember, ObjectClassesGoAfterTheirChainAndBeforeTheGroupsOwnRuleReads) {
+  target(kOne, {"top"}, {{"orv-slapdAdminDN", {"cn=one"}}});
+  EXPECT_EQ(modify({{kReplace, "orv-slapdAdminPW", {{"new"}}}}), 0);
+  const auto calls =
+      platform.calls({"cfg_get_values", "cfg_msgfree", "cfg_value_free", "cfg_search_s"});
+  const auto read =
+      std::find(calls.begin(), calls.end(), "cfg_get_values(session, record 1, \"OBJECTCLASS\")");
+  ASSERT_GT(calls.end() - read, 3);
+  EXPECT_THAT(std::vector<std::string>(read + 1, read + 4),
+              ElementsAre("cfg_msgfree(chain)", "cfg_value_free()",
+                          "cfg_search_s(session, \"CN=ONE,CN=ADMINGROUP,CN=CONFIGURATION\", 0, "
+                          "\"objectclass=*\", null, 0)"));
 }
 
 TEST_F(ModifyByMember, EntryThatGoesMeanwhileGives32AndItsLine) {
@@ -1048,6 +1095,8 @@ TEST_P(ModifyRefused, IsAnsweredWithTheCodeAndNoLaterRuleIsAsked) {
   refusal.script(platform);
   EXPECT_EQ(modify(refusal.list), refusal.code);
   EXPECT_EQ(steps(), refusal.steps);
+  EXPECT_THAT(platform.calls({"xlate_utf8_to_localcp"}),
+              Not(Contains("xlate_utf8_to_localcp(\"" + std::string(refusal.dn) + "\")")));
   EXPECT_EQ(written(), "");
   expect_answered(refusal.code, refusal.text);
   expect_copy_left();
@@ -1104,6 +1153,18 @@ INSTANTIATE_TEST_SUITE_P(
                             21,
                             {"schema 0", "addmodifyop 0", "supplier 0", "kerberos 0", "audit log 0",
                              "digest 0", "password 0", "proxy name 21"}},
+                    Refusal{"ProxyNameThatIsTaken",
+                            kEntry,
+                            {{kReplace, "orv-slapdProxySplitName", {{"taken"}}}},
+                            [](Platform& p) {
+                              p.file
+                                  ["CN=PROXYDB,CN=PROXY BACKENDS,CN=ORV DIRECTORY,CN=SCHEMAS,"
+                                   "CN=CONFIGURATION"] = {
+                                  {{"cn=split", {{"orv-slapdProxySplitName", {"taken"}}}}}};
+                            },
+                            68,
+                            {"schema 0", "addmodifyop 0", "supplier 0", "kerberos 0", "audit log 0",
+                             "digest 0", "password 0", "proxy name 68"}},
                     Refusal{"Encryption",
                             kTop,
                             {{kReplace, "orv-slapdPwEncryption", {{"rot13"}}}},

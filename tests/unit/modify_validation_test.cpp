@@ -559,6 +559,23 @@ TEST_F(RolesModify, EntryWithoutRolesGives16) {
   EXPECT_THAT(platform.debug_lines(), IsEmpty());
 }
 
+TEST_F(RolesModify, RolesAreReadBeforeTheNewOnesAreHeldAgainstTheVocabulary) {
+  const Script unknown = {{kAdd, kType, {{"Wizard"}}}};
+  platform.file.erase(kMember);
+  EXPECT_EQ(root(kMember, unknown), 32);
+  file(kMember, {{"cn", {"me"}}});
+  EXPECT_EQ(root(kMember, unknown), 16);
+  platform.forget();
+  platform.file[kMember].code = 9;
+  EXPECT_EQ(root(kMember, unknown), 80);
+  EXPECT_THAT(platform.debug_lines(),
+              ElementsAre(error("Error - checkRootAdminModify: cfg_search_s failed with rc =9 for "
+                                "CN=ME,CN=ADMINGROUP,CN=CONFIGURATION.\n")));
+  platform.forget();
+  platform.fail_allocation(1);
+  EXPECT_EQ(root(kMember, unknown), 90);
+}
+
 TEST_F(RolesModify, NoMemoryForTheNameGives90WithItsLine) {
   for (const int nth : {1, 2}) {
     platform.forget();
@@ -637,6 +654,12 @@ TEST_F(RolesModify, DeletingAllRolesByValueStoresNoAdmin) {
   EXPECT_EQ(modifications->mod_vals.modv_bvals[0]->bv_len, 7U);
   EXPECT_EQ(modifications->mod_vals.modv_bvals[1], nullptr);
   EXPECT_THAT(platform.debug_lines(), IsEmpty());
+}
+
+TEST_F(RolesModify, RoleThatIsMissingLeavesTheListAsItWasAlsoWhereTheNumbersAreEqual) {
+  EXPECT_EQ(root(kMember, {{kDelete, kType, {{"SchemaAdmin", "AuditAdmin", "PasswordAdmin"}}}}),
+            16);
+  EXPECT_EQ(list(), "0x81 orv-slapdAdminRole=SchemaAdmin,AuditAdmin,PasswordAdmin");
 }
 
 TEST_F(RolesModify, NumbersOfValuesDecideNotWhichTheyAre) {
@@ -857,6 +880,11 @@ TEST_F(SupplierModify, MembersNeedAReplicationBitOfTheConnectionForTheMasterServ
       EXPECT_EQ(supplier(dn, script), 0);
     }
   }
+  for (const unsigned flags : {0x15U, 0x1CU, 0x34U}) {  // also those
+    connection.authority = flags;
+    EXPECT_EQ(supplier(kMasterServer, script), 50) << flags;
+  }
+  connection.authority = 0x14;
   for (const unsigned roles : {0x04U, 0x08U}) {
     connection.roles = roles;
     EXPECT_EQ(supplier(kMasterServer, script), 0);

@@ -706,11 +706,15 @@ TEST_F(PasswordMethod, ThatIsNotAllowedGives53AndItsText) {
 
 TEST_F(PasswordMethod, ThatIsNotAllowedIsToldByAnyAnswerBut0) {
   for (const int answer : {-1, 2, 16, 90}) {
-    platform.forget();
-    platform.fail("convertPWEncryptionMethod", 1, answer);
-    EXPECT_EQ(replace("known"),
-              "53 requested orv-slapdPwEncryption value is not allowed by current configuration.");
+    for (const char* method : {"known", "rot13"}) {  // whatever came of the conversion
+      platform.forget();
+      platform.fail("convertPWEncryptionMethod", 1, answer);
+      EXPECT_EQ(
+          replace(method),
+          "53 requested orv-slapdPwEncryption value is not allowed by current configuration.");
+    }
   }
+  EXPECT_THAT(g_staged, IsEmpty());
 }
 
 TEST_F(PasswordMethod, ThatIsUnknownGives21AndItsText) {
@@ -798,8 +802,9 @@ TEST_F(PasswordMethod, IsNotHandedOnWhenSafeModeBeginsMeanwhile) {
 }
 
 TEST_F(PasswordMethod, PassesWhereNobodyTakesIt) {
-  platform.fail("getAllPluginFuncs", 1, 80);
+  platform.fail("getAllPluginFuncs", 1, 80);  // which hands a list out all the same
   EXPECT_EQ(replace("known"), "0");
+  EXPECT_THAT(g_staged, IsEmpty());
   platform.plugin_functions = nullptr;
   EXPECT_EQ(replace("known"), "0");
   functions[0] = nullptr;

@@ -87,6 +87,7 @@ TEST_F(Roles, GroupIsForThePrimaryAdministratorAloneTheContainerToo) {
       adding(inside, {{"orv-slapdAdminRole", {"Wizard"}}});
       EXPECT_EQ(process(), 50) << flags;
       EXPECT_EQ(platform.count("attr_find"), 0);
+      EXPECT_THAT(platform.debug_lines(), IsEmpty());
     }
   }
   as(0x1C);
@@ -163,6 +164,13 @@ TEST_F(Roles, UnknownRoleGives21AndItsLineAndChangesNothing) {
                                   std::string(bad) + "\n")));
     EXPECT_THAT(platform.calls({"kel_strlcpy", "attr_merge"}), IsEmpty());
   }
+}
+
+TEST_F(Roles, UnknownRoleGives21WithoutTheTraceToo) {
+  debug_off();
+  adding_with({"SchemaAdmin", "Wizard"});
+  EXPECT_EQ(process(), 21);
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
 }
 
 TEST_F(Roles, NoAdminLeavesItselfAlone) {

@@ -249,6 +249,36 @@ TEST_F(Uniqueness, DnsAreReleasedWithWhatTheyWereComparedIn) {
                           "free(copy)", "free(administrator's DN)"));
 }
 
+TEST_F(Uniqueness, AdministratorsNamesAreReleasedAfterTheMembersOfTheGroup) {
+  found(kGroup, {{{"cn", {"x"}}}});
+  found(kKerberos, {{{"orv-slapdKrbAdminDN", {"orv-kn=admin"}}}});
+  found(kDigest, {{{"orv-slapdDigestAdminUser", {"admin"}}}});
+  const auto releases = [&](Check check) {
+    EXPECT_EQ(run(check, "x"), 0);
+    return platform.calls({"cfg_msgfree", "free"});
+  };
+  // The light form is made first, and then the copy of it that is compared.
+  platform.at("dn_normalize_light_esc", 1,
+              [&] { platform.name_allocation(platform.allocations() + 2, "administrator's"); });
+  EXPECT_THAT(releases(doesKerberosIDExist),
+              ElementsAre("cfg_msgfree(chain)", "cfg_msgfree(chain)", "free(administrator's)"));
+  platform.forget();
+  platform.at("xlate_localcp_to_utf8", 1,
+              [&] { platform.name_allocation(platform.allocations() + 1, "administrator's"); });
+  EXPECT_THAT(releases(doesDigestUserNameExist),
+              ElementsAre("cfg_msgfree(chain)", "cfg_msgfree(chain)", "free(administrator's)"));
+}
+
+TEST_F(Uniqueness, CopyOfASuppliersDnIsReleasedAfterBothSearches) {
+  found(kReplicationSearch, {{}});
+  found(kSupplierSearch, {{}});
+  platform.at("replace_DN", 1,
+              [&] { platform.name_allocation(platform.allocations() + 1, "copy"); });
+  EXPECT_EQ(supplier_dn("cn=one"), 0);
+  EXPECT_THAT(platform.calls({"cfg_msgfree", "free"}),
+              ElementsAre("cfg_msgfree(chain)", "cfg_msgfree(chain)", "free(copy)"));
+}
+
 TEST_F(Uniqueness, StoredValuesAreConvertedFromTheLocalCodePage) {
   found(kGroup, {{{"orv-slapdAdminDN", {"CN=K\xE4SE"}},
                   {"orv-slapdKrbAdminDN", {"orv-kn=K\xE4se"}},
@@ -540,6 +570,8 @@ class EachUniqueness : public Uniqueness, public testing::WithParamInterface<Cas
   // Two holders, whose DNs cannot be mistaken for the candidate.
   EachUniqueness() {
     administrator({{"orv-slapdAdminDN", {"cn=root"}}});
+    found(kKerberos, {{{"orv-slapdKrbAdminDN", {"orv-kn=root"}}}});
+    found(kDigest, {{{"orv-slapdDigestAdminUser", {"root"}}}});
     found(kReplicationSearch, {});
     found(kSupplierSearch, {});
     found(GetParam().base, {});
@@ -580,12 +612,14 @@ TEST_P(EachUniqueness, OtherFailureOfTheSearchIsTheCode) {
   platform.file[GetParam().base].code = 3;
   EXPECT_EQ(run("one"), 3);
   EXPECT_EQ(platform.count("cfg_get_dn"), before["cfg_get_dn"]);
+  EXPECT_THAT(errors(), IsEmpty());
 }
 
 TEST_P(EachUniqueness, EntryWhoseDnCannotBeReadGives90) {
   fail("cfg_get_dn", 1, 0);
   EXPECT_EQ(run("two"), 90);
   EXPECT_EQ(platform.count("cfg_first_attribute"), before["cfg_first_attribute"]);
+  EXPECT_THAT(errors(), IsEmpty());
 }
 
 // Where one entry is examined there is no second.
@@ -629,6 +663,16 @@ TEST_P(EachUniqueness, ErrorAtTheValuesGives1AndEndsTheSearch) {
 TEST_P(EachUniqueness, FailedConversionIsTheCode) {
   fail("xlate_localcp_to_utf8", 1, 21);
   EXPECT_EQ(run("two"), 21);
+}
+
+TEST_P(EachUniqueness, ErrorsOfReadingGive1WithoutTheTraceToo) {
+  debug_off();
+  for (const char* function : {"cfg_first_attribute", "cfg_next_attribute", "cfg_get_values"}) {
+    platform.forget();
+    fail(function, 1, 80);
+    EXPECT_EQ(run("two"), 1) << function;
+    EXPECT_THAT(platform.debug_lines(), IsEmpty());
+  }
 }
 
 TEST_P(EachUniqueness, NothingIsTracedWhenNotDebugging) {

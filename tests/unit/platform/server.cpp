@@ -668,9 +668,8 @@ int unformat_password(const char* stored, char** clear, const void* key, int res
 
 int convertPWEncryptionMethod(const char* name, int* method) {
   const Call call("convertPWEncryptionMethod", name, *method);
-  if (call.failure()) return *call.failure();
-  if (name != nullptr && std::string(name) == "known") *method = 3;
-  return 0;
+  if (name != nullptr && std::string(name) == "known") *method = 3;  // also with a failure
+  return call.failure().value_or(0);
 }
 
 Backend* select_backend_opt(const char* dn) {
@@ -680,9 +679,8 @@ Backend* select_backend_opt(const char* dn) {
 
 int getAllPluginFuncs(Backend* backend, int number, PluginFunction** list) {
   const Call call("getAllPluginFuncs", backend, number);
-  if (call.failure()) return *call.failure();
-  *list = platform().plugin_functions;
-  return 0;
+  *list = platform().plugin_functions;  // also where the code says that there are none
+  return call.failure().value_or(0);
 }
 
 // A supplier of the suffixes that the script names; null for the server as a whole.
