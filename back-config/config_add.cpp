@@ -283,8 +283,8 @@ struct Holders {
   int examined = kEveryEntry;
 };
 
-// The identity in the entry of a holder. Unlike a look-up it is not announced, and of several
-// values the first counts.
+// The identity in the entry of a holder. Of several values the first counts, as in most look-ups;
+// but the second is told, and the attributes are not announced.
 constexpr Identity held_as(const char* attribute, Take take,
                            const char* value_text = trace::name_and_value) {
   return {attribute, take, SecondValue::told, nullptr, false, value_text};
@@ -916,6 +916,8 @@ int checkIfPassthruSubtreeEntry(entry* e, Connection* connection, Backend* backe
 
   if (!has_class(*e, config_names::top_class)) return trace.exit(result::object_class_violation);
   if (is(dn, config_names::passthrough_dn)) {
+    // Never on an add: the parent has refused the container already. Kept on purpose, for whenever
+    // that test is another.
     const bool container = has_class(*e, config_names::container_class);
     return trace.exit(container ? result::success : result::object_class_violation);
   }

@@ -32,8 +32,9 @@ char* getAdminGroupMemberDn(Connection* connection, const char* target_dn);
 // ---- Whether an identity (UTF-8) is already in the configuration file. Every stored one counts,
 // also that of an entry that is just being changed.
 //   0 it is free (also when nothing in the file could hold it); 68 it is taken
-//   80 a null candidate; 90 no memory; 1 an entry cannot be read; or the code of whatever else
-//   failed (search, code page, normalisation)
+//   80 a null candidate; 90 no memory, or an entry of the file cannot be taken or has no DN; 1 its
+//   attributes or values cannot be read; or the code of whatever else failed (search, code page,
+//   normalisation)
 
 // A bind DN, among those of the primary administrator and of the members of the group. 80 also when
 // the administrator's cannot be read.

@@ -91,7 +91,8 @@ const char* address_text_of(int kind) {
   }
 }
 
-// The value with a NUL behind it, whether it has one or not; null without memory.
+// The value with a NUL behind it, whether it has one or not; null without memory. One byte would do
+// for that; the second is never read.
 char* terminated_copy(const berval& value) {
   auto* const copy = static_cast<char*>(std::malloc(value.bv_len + 2));
   if (copy == nullptr) return nullptr;
@@ -472,7 +473,8 @@ bool is_among(const char* value, char** roles) {
   return false;
 }
 
-// Only the last value has to be there: the library refuses the others.
+// Only the last value decides. The others were looked for in the copy of the schema check; of a
+// list that is rewritten nobody looks again.
 int check_deleted_roles(const ldapmod& m, char** roles) {
   bool found = true;
   berval** const values = m.mod_vals.modv_bvals;
@@ -830,11 +832,11 @@ bool takes_audit_log_file(const ldtr_function_local& trace, const char* audit_fi
   }
   const char* const value = value_text(modification, 0);
   if (value == nullptr) return false;  // nothing to compare
-  // A path that does not resolve is no file: it is let pass.
+  // A path that cannot be resolved, for whatever reason, also want of memory, is let pass.
   const MallocText resolved(resolve_path(value));
   if (resolved == nullptr) return false;
   trace.debug(trace::detail, kAuditCompared, audit_file, resolved.get(), modification.mod_type);
-  // In any letter case, so that no file system can make two names one file.
+  // In any letter case, so that a file system without letter case makes no second name.
   if (kel_strcasecmp(resolved.get(), audit_file) != 0) return false;
   trace.debug(trace::error, kAuditFileTaken, audit_file, modification.mod_type);
   return true;
@@ -943,6 +945,7 @@ struct PasswordHolder {
   const char* filter;
   const char* second_filter;  // asked when the first one finds nothing; or null
 };
+// The filter is the bare name of the attribute: whether it is present.
 constexpr PasswordHolder kAdministrator = {config_names::admin_password, config_names::admin_dn,
                                            config_names::admin_password, nullptr};
 constexpr PasswordHolder kSupplier = {config_names::master_password, config_names::master_dn,
@@ -950,14 +953,15 @@ constexpr PasswordHolder kSupplier = {config_names::master_password, config_name
                                       config_names::supplier_entries};
 
 // Told by the entry's DN, not by the attribute that is changed. Both tests are on bytes: any other
-// spelling of the administrator's DN is looked for among the suppliers, and not found there.
+// spelling of the administrator's DN is looked for among the suppliers, and only found there if it
+// is one.
 const PasswordHolder& holder_of(const char* normalized_dn) {
   const bool administrator = is(normalized_dn, config_names::configuration_dn) ||
                              contains(normalized_dn, config_names::admin_group_dn);
   return administrator ? kAdministrator : kSupplier;
 }
 
-// 0 something was found; 32, or the code of the search.
+// 0 something was found; 32, or the code of a search: the first that fails ends it.
 int find_holder(_CFG* session, const char* dn, const PasswordHolder& holder, CfgResult& chain) {
   char* attributes[] = {const_cast<char*>(holder.password), const_cast<char*>(holder.dn), nullptr};
   for (const char* filter : {holder.filter, holder.second_filter}) {
@@ -1076,6 +1080,7 @@ constexpr const char* kNoSuchMethod =
 constexpr int kNothingConverted = 16;  // no method has this number
 constexpr int kStageMethodFunction = -159;
 
+// Any value but 0, on purpose: the review of pass-through entries asks for exactly 1.
 bool in_safe_mode() {
   return g_safe_mode.load(std::memory_order_relaxed) != 0;
 }
@@ -1269,6 +1274,7 @@ int copy_modifications(const ldapmod* first, ldapmod**& copy) {
 int read_supplier_mark(const ldtr_function_local& trace, const ModifyRequest& request,
                        bool& supplier) {
   _CFG* const session = request.session();
+  CfgValues values;  // independent of the chain, which goes first
   _CFGMessage* found = nullptr;
   int rc = cfg_read_cfg_entry(session, request.dn, kTargetClasses, kScopeBase, &found);
   const CfgResult chain(found);
@@ -1278,7 +1284,7 @@ int read_supplier_mark(const ldtr_function_local& trace, const ModifyRequest& re
     trace.debug(trace::error, kTargetMissing, request.dn);
     return result::no_such_object;
   }
-  const CfgValues values(cfg_get_values(session, record, kTargetClasses));
+  values.reset(cfg_get_values(session, record, kTargetClasses));
   rc = cfg_get_errno(session);
   if (values == nullptr) return result::no_such_attribute;
   for (char** value = values.get(); *value != nullptr; ++value) {
@@ -1479,6 +1485,8 @@ int config_back_modify(pblock* pb) {
   // 11. What was made for that goes.
   if (rc == 0 && copy != nullptr) ldap_mods_free(copy, 1);
   local_dn.reset();
+  // The library's own code, from whichever step under the session it comes: on purpose, while an add
+  // translates that of its write only.
   if (rc == result::no_such_record) rc = result::no_such_object;
 
   // 12. Back to rest.

@@ -114,7 +114,7 @@ int checkAdminPolicyModify(Operation* operation, _CFG* session, const char* norm
 // A new method of storing passwords, which is also handed to the directory backend. 0, also for
 // everything on a server in safe mode; 80 a null argument; 53 the configuration does not allow the
 // method, 21 there is none of that name, both with `*text`; or what the directory backend answers.
-// `*text` is stored to on a refusal only, and may stay null for want of memory.
+// `*text` is stored to on a refusal only: without memory null, whatever stood there.
 int checkPwEncryptionModify(Operation* operation, _CFG* session, const char* normalized_dn,
                             ldapmod* modifications, char** text);
 

@@ -82,9 +82,8 @@ const char* cfg_dump_exception(_CFG* session);
 // Searches below `base` (a DN in the file's code page, in any spelling).
 //   scope       0 the entry itself, 1 its direct children, 2 the whole subtree with the base first
 //   filter      RFC 4515, with or without the outer parentheses; a bare attribute name is a
-//   presence
-//               test; null means every entry. Comparison follows the attribute's matching rule.
-//               An assertion on the value of a secret attribute is Undefined.
+//               presence test; null means every entry. Comparison follows the attribute's matching
+//               rule. An assertion on the value of a secret attribute is Undefined.
 //   attributes  null-terminated list of names, null for all; "*" all, "1.1" none. An entry that
 //               matches is returned even if it has none of them.
 //   types_only  non-zero: value arrays come back empty, and not null
