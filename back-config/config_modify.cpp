@@ -1472,7 +1472,7 @@ int config_back_modify(pblock* pb) {
   // 6. and 7. May this caller change this entry? The primary administrator's list may be rewritten.
   if (rc == 0) rc = check_authority(trace, request);
 
-  // 8. Then what was forgiven or rewritten is checked and copied again.
+  // 8. Then what was forgiven or rewritten is checked and copied again; the first copy goes.
   if (rc == 0 && begins_with_roles_of_member(request)) rc = check_and_copy_again(request, copy);
 
   // 9. What must hold, whoever asks.
@@ -1485,8 +1485,8 @@ int config_back_modify(pblock* pb) {
   // 11. What was made for that goes.
   if (rc == 0 && copy != nullptr) ldap_mods_free(copy, 1);
   local_dn.reset();
-  // The library's own code, from whichever step under the session it comes: on purpose, while an add
-  // translates that of its write only.
+  // The library's own code, from whichever step under the session it comes: on purpose, while an
+  // add translates that of its write only.
   if (rc == result::no_such_record) rc = result::no_such_object;
 
   // 12. Back to rest.

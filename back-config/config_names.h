@@ -80,8 +80,8 @@ inline constexpr const char* kAdminRoles[] = {"AuditAdmin",           "DirDataAd
                                               "SchemaAdmin",          "ServerConfigGroupMember",
                                               "ServerStartStopAdmin", "PasswordAdmin"};
 
-// The roles of a member that is added without any. Without inline on purpose: each source file has a
-// copy of its own.
+// The roles of a member that is added without any. Without inline on purpose: each source file has
+// a copy of its own.
 constexpr const char* DEFAULT_ADMIN_ROLES[] = {"DirDataAdmin",         "PasswordAdmin",
                                                "SchemaAdmin",          "ServerConfigGroupMember",
                                                "ServerStartStopAdmin", nullptr};
