@@ -124,7 +124,9 @@ TEST_P(MemoryOfAnExchange, LeavesNothingBehindWhenItFails) {
     EXPECT_TRUE(searches_are_gone());
     EXPECT_EQ(services.output.room(), OutputMeter::kDefaultCeiling);
     session.reset();
+    const std::weak_ptr<BareSession> left = client;
     client.reset();
+    EXPECT_TRUE(left.expired()) << "something holds the connection for ever";
     EXPECT_EQ(services.unauthenticated.load(), 0);
     if (!hit || HasFailure()) break;
   }

@@ -373,10 +373,17 @@ void Session::run_here(const OperationPtr& operation) {
     if (operation->long_running()) flush();
   } catch (...) {
     services_.backend.leave_gate();
+    forget(operation);
     throw;
   }
   operation->run(services_, true);
   complete(operation);
+}
+
+// Nobody will complete it.
+void Session::forget(const OperationPtr& operation) noexcept {
+  std::erase(outstanding_, operation);
+  if (notice_ == operation) notice_.reset();
 }
 
 void Session::run_on_worker(const OperationPtr& operation) noexcept {

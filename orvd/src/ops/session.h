@@ -182,6 +182,7 @@ class Session : public OperationHome,
   void start(const OperationPtr& operation);
   void answer_and_complete(const OperationPtr& operation, int code, std::string_view text);
   void run_here(const OperationPtr& operation);
+  void forget(const OperationPtr& operation) noexcept;
   void run_on_worker(const OperationPtr& operation) noexcept;
   void work(const OperationPtr& operation) noexcept;
   void hand_back(const OperationPtr& operation, Step step) noexcept;

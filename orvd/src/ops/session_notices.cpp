@@ -145,8 +145,7 @@ void Session::search_for_notice(const PersistentSearchPtr& search, const ChangeP
   SearchRequest request = search->request;
   request.scope = 0;
   const Refusal refusal = operation->prepare_search(services_, request, change->dn);
-  // The operation holds its session: were there no place among the outstanding ones, nobody would
-  // part the two again.
+  // It holds the connection: once it is noted here, nothing may keep it from being completed.
   outstanding_.reserve(outstanding_.size() + 1);
   notice_ = operation;
   submit(operation, refusal);
