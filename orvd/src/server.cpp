@@ -5,6 +5,7 @@
 #include <asio/post.hpp>
 #include <csignal>
 #include <cstdlib>
+#include <new>
 #include <thread>
 #include <utility>
 
@@ -23,6 +24,8 @@ constexpr std::size_t kOwnThreads = 1;
 constexpr std::chrono::milliseconds kGateInterval{100};
 // How often the files are looked at that nobody says have changed.
 constexpr std::chrono::milliseconds kFileInterval{1000};
+// How long the control thread rests when there is no memory to go on.
+constexpr std::chrono::milliseconds kPause{20};
 // How long a stopping server waits for the operation in hand, and for clients to leave.
 constexpr std::chrono::seconds kPatience{30};
 constexpr std::chrono::seconds kFarewell{3};
@@ -163,18 +166,19 @@ void Server::renew_certificate(Settings& wanted) {
 void Server::handle_signals() {
   for (const int number : {SIGTERM, SIGINT, SIGHUP}) signals_.add(number);
   hold_stop_signals();
+  takes_signals_ = true;
   await_signal();
 }
 
 void Server::await_signal() {
-  signals_.async_wait([this](const asio::error_code& error, int number) {
+  signals_.async_wait(signal_watch_.keep([this](const asio::error_code& error, int number) {
     if (error) return;
     if (number != SIGHUP) return stop();
     await_signal();
     if (parts_.manager) parts_.manager->reloading();
     renew_settings();  // whatever becomes of it, the manager hears of its end
     tell_ready();
-  });
+  }));
 }
 
 // The administrator of a port at which nobody answers should not have to guess.
@@ -209,8 +213,25 @@ void Server::control() {
       control_.run();
       return;
     } catch (const std::exception& error) {
-      parts_.logs.error(std::string("not done: ") + error.what());
+      // Apart: what is missing may be the memory to put them together.
+      parts_.logs.error("not done:");
+      parts_.logs.error(error.what());
+      while (!control_.stopped() && !go_on()) std::this_thread::sleep_for(kPause);
     }
+}
+
+// A failure ends what it happens in, also what is to be waited for again and again.
+bool Server::go_on() noexcept {
+  try {
+    if (takes_signals_ && !signal_watch_.under_way()) await_signal();
+    if (!gate_watch_.under_way()) watch_gate();
+    if (!file_watch_.under_way()) watch_files();
+    if (!loop_watch_.under_way()) watch_loops();
+    listeners_.go_on();
+    return true;
+  } catch (...) {
+    return false;  // there will be memory again
+  }
 }
 
 void Server::stop() {
@@ -219,20 +240,20 @@ void Server::stop() {
 
 void Server::watch_gate() {
   gate_timer_.expires_after(kGateInterval);
-  gate_timer_.async_wait([this](const asio::error_code& error) {
+  gate_timer_.async_wait(gate_watch_.keep([this](const asio::error_code& error) {
     if (error) return;
     watch_gate();
     const Clock::time_point now = Clock::now();
     backend_.gate().expire(now);
     services_.cut_offs.tick(now);
-  });
+  }));
 }
 
 // Reading may take long: workers do it, one at a time.
 void Server::watch_files() {
   if (!parts_.look_after) return;
   file_timer_.expires_after(kFileInterval);
-  file_timer_.async_wait([this](const asio::error_code& error) {
+  file_timer_.async_wait(file_watch_.keep([this](const asio::error_code& error) {
     if (error) return;
     watch_files();
     if (looking_.exchange(true)) return;
@@ -245,21 +266,25 @@ void Server::watch_files() {
       looking_.store(false);
       throw;
     }
-  });
+  }));
 }
 
 // Tells the manager that the server lives, for as long as every loop turns.
 void Server::watch_loops() {
   if (!parts_.manager || parts_.manager->watchdog_interval().count() <= 0) return;
   loop_timer_.expires_after(parts_.manager->watchdog_interval());
-  loop_timer_.async_wait([this](const asio::error_code& error) {
+  loop_timer_.async_wait(loop_watch_.keep([this](const asio::error_code& error) {
     if (error) return;
     watch_loops();
     if (turning_.load() < loops_.size()) return;
     parts_.manager->alive();
     turning_.store(0);
-    for (const auto& loop : loops_) loop->post([this] { ++turning_; });
-  });
+    for (const auto& loop : loops_) try {
+        loop->post([this] { ++turning_; });
+      } catch (const std::bad_alloc&) {
+        ++turning_;  // it could not be asked, and may well turn
+      }
+  }));
 }
 
 void Server::tell_ready() noexcept try {

@@ -21,6 +21,7 @@
 #include "net/limits.h"
 #include "net/listener.h"
 #include "net/loop.h"
+#include "net/standing.h"
 #include "net/tls.h"
 #include "ops/services.h"
 #include "process/service_manager.h"
@@ -109,6 +110,7 @@ class Server {
   void renew_certificate(Settings& wanted);
   void tell_what_is_missing();
   void control();
+  bool go_on() noexcept;
   void watch_gate();
   void watch_files();
   void watch_loops();
@@ -123,6 +125,11 @@ class Server {
   asio::steady_timer gate_timer_;
   asio::steady_timer file_timer_;
   asio::steady_timer loop_timer_;
+  Standing signal_watch_;
+  Standing gate_watch_;
+  Standing file_watch_;
+  Standing loop_watch_;
+  bool takes_signals_ = false;
   std::atomic<bool> looking_{false};     // a worker is at it, or will be
   std::atomic<std::size_t> turning_{0};  // loops that have answered since they were asked
   BackendHost backend_;

@@ -173,18 +173,24 @@ void Listeners::start(std::shared_ptr<const Settings> settings) {
 }
 
 void Listeners::accept(Listener& listener) {
-  listener.acceptor.async_accept([this, &listener](const asio::error_code& error, Socket socket) {
-    if (error == asio::error::operation_aborted) return;
-    if (!error) {
-      try {
-        accepted(listener, std::move(socket));
-      } catch (const std::exception& failure) {
-        services_.logs.error("a new connection is lost: " + std::string(failure.what()));
-      }
-      return accept(listener);
-    }
-    cannot_accept(listener, error);
-  });
+  listener.acceptor.async_accept(
+      listener.waiting.keep([this, &listener](const asio::error_code& error, Socket socket) {
+        if (error == asio::error::operation_aborted) return;
+        if (error) return cannot_accept(listener, error);
+        try {
+          accepted(listener, std::move(socket));
+        } catch (const std::exception& failure) {
+          // Apart: what is missing may be the memory to put them together.
+          services_.logs.error("a new connection is lost:");
+          services_.logs.error(failure.what());
+        }
+        accept(listener);
+      }));
+}
+
+void Listeners::go_on() {
+  for (const auto& listener : listeners_)
+    if (listener->acceptor.is_open() && !listener->waiting.under_way()) accept(*listener);
 }
 
 // What is lacking will not be there at once.
@@ -196,9 +202,10 @@ void Listeners::cannot_accept(Listener& listener, const asio::error_code& error)
   }
   if (no_descriptors_left(error) && listener.kind != Kind::local) turn_away(listener);
   listener.pause.expires_after(kAcceptPause);
-  listener.pause.async_wait([this, &listener](const asio::error_code& stopped) {
-    if (!stopped) accept(listener);
-  });
+  listener.pause.async_wait(
+      listener.waiting.keep([this, &listener](const asio::error_code& stopped) {
+        if (!stopped) accept(listener);
+      }));
 }
 
 // Who has connected already would wait for an answer otherwise. At the Unix socket that is better:

@@ -17,6 +17,7 @@
 #include "net/listening_socket.h"
 #include "net/local_socket.h"
 #include "net/loop.h"
+#include "net/standing.h"
 #include "ops/services.h"
 
 namespace orv::server {
@@ -43,6 +44,9 @@ class Listeners {
   void start(std::shared_ptr<const Settings> settings);
   void renew(std::shared_ptr<const Settings> settings) { settings_ = std::move(settings); }
 
+  // Begins again where a failure has ended it. Throws std::bad_alloc.
+  void go_on();
+
   void close() noexcept;
 
   // "ldap://ADDRESS:PORT" of the first listener for connections in clear; of the first one of all
@@ -63,6 +67,7 @@ class Listeners {
     const Kind kind;
     Acceptor acceptor;
     asio::steady_timer pause;
+    Standing waiting;  // for a client, or for the end of the pause
   };
 
   void accept(Listener& listener);
