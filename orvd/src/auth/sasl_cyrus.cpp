@@ -13,6 +13,7 @@
 #include "auth/digest_response.h"
 #include "auth/kerberos.h"
 #include "auth/sasl_callbacks.h"
+#include "auth/sasl_memory.h"
 #include "cfg/secret.h"
 
 namespace orv::server {
@@ -202,9 +203,10 @@ class CyrusLayer final : public SecurityLayer {
       const std::string_view part = from.substr(0, longest_);
       const char* converted = nullptr;
       unsigned length = 0;
+      sasl_lacked_memory();
       const int code = function(exchange_->connection(), part.data(),
                                 static_cast<unsigned>(part.size()), &converted, &length);
-      if (code == SASL_NOMEM) throw std::bad_alloc();
+      if (code == SASL_NOMEM || sasl_lacked_memory()) throw std::bad_alloc();
       if (code != SASL_OK) return false;
       if (length > 0) to.append(converted, length);
       from.remove_prefix(part.size());
@@ -231,10 +233,11 @@ class CyrusExchange final : public SaslExchange {
     SaslOutcome outcome;
     const char* reply = nullptr;
     unsigned length = 0;
+    sasl_lacked_memory();
     const int code = take(credentials, reply, length);
     exchange_->forget_password();
     outcome.name = exchange_->name();
-    if (code == SASL_NOMEM) throw std::bad_alloc();
+    if (code == SASL_NOMEM || sasl_lacked_memory()) throw std::bad_alloc();
     if (code == SASL_OK || code == SASL_CONTINUE) {
       if (reply) outcome.reply.emplace(reply, length);
       outcome.state = SaslOutcome::State::go_on;

@@ -1,51 +1,27 @@
 #include "auth/sasl_library.h"
 
-#include <malloc.h>
 #include <sasl/sasl.h>
 #include <sasl/saslplug.h>
 
 #include <algorithm>
 #include <array>
-#include <cstdlib>
 #include <cstring>
+#include <memory>
 #include <mutex>
 #include <new>
 #include <utility>
 
 #include "auth/sasl_callbacks.h"
-#include "cfg/secret.h"
+#include "auth/sasl_memory.h"
 
 namespace orv::server {
 namespace {
 
-// ---- Memory, wiped when it is released: there are passwords and keys in it
-
-void* allocate(std::size_t size) {
-  return std::malloc(size);
-}
-
-void* allocate_zeroed(std::size_t count, std::size_t size) {
-  return std::calloc(count, size);
-}
-
-void release(void* memory) {
-  if (memory == nullptr) return;
-  cfg::wipe(memory, malloc_usable_size(memory));
-  std::free(memory);
-}
-
-void* reallocate(void* memory, std::size_t size) {
-  void* const moved = std::malloc(size);
-  if (moved == nullptr || memory == nullptr) return moved;
-  std::memcpy(moved, memory, std::min(size, malloc_usable_size(memory)));
-  release(memory);
-  return moved;
-}
-
 // ---- Mutexes
 
 void* make_mutex() {
-  return new (std::nothrow) std::mutex;
+  void* const memory = allocate_for_sasl(sizeof(std::mutex));
+  return memory == nullptr ? nullptr : new (memory) std::mutex;
 }
 
 int lock_mutex(void* mutex) {
@@ -59,7 +35,9 @@ int unlock_mutex(void* mutex) {
 }
 
 void free_mutex(void* mutex) {
-  delete static_cast<std::mutex*>(mutex);
+  if (mutex == nullptr) return;
+  std::destroy_at(static_cast<std::mutex*>(mutex));
+  release_of_sasl(mutex);
 }
 
 // ---- Options, instead of a configuration file
@@ -95,7 +73,7 @@ int get_plugin_folder(void*, const char** path) {
 }
 
 int get_configuration_folder(void*, char** path) {
-  *path = static_cast<char*>(allocate_zeroed(1, 1));
+  *path = static_cast<char*>(allocate_zeroed_for_sasl(1, 1));
   return *path == nullptr ? SASL_NOMEM : SASL_OK;
 }
 
@@ -131,7 +109,7 @@ const sasl_callback_t* callbacks() {
 }  // namespace
 
 std::unique_ptr<SaslLibrary> SaslLibrary::open(std::string& error) {
-  sasl_set_alloc(allocate, allocate_zeroed, reallocate, release);
+  sasl_set_alloc(allocate_for_sasl, allocate_zeroed_for_sasl, reallocate_for_sasl, release_of_sasl);
   sasl_set_mutex(make_mutex, lock_mutex, unlock_mutex, free_mutex);
   int code = sasl_server_init(callbacks(), nullptr);
   // From here on its destructor ends what was begun.
