@@ -67,7 +67,7 @@ struct TlsWish {
 };
 
 // A connection in clear until it shakes hands. It trusts every server.
-class TlsClient final : public WireClient {
+class TlsClient : public WireClient {
  public:
   explicit TlsClient(std::uint16_t port) : WireClient(port) {}
   ~TlsClient() override;

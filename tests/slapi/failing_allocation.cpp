@@ -2,6 +2,7 @@
 
 #include <dlfcn.h>
 
+#include <atomic>
 #include <cerrno>
 #include <cstddef>
 #include <cstdlib>
@@ -20,7 +21,31 @@ struct State {
 // A type without a constructor: the first access comes before any constructor of the program.
 thread_local State state;
 
+// What is armed for all threads but one. Constant from the start, as the above.
+struct Elsewhere {
+  std::atomic<bool> armed{false};
+  std::atomic<long> fail_at{0};
+  std::atomic<long> times{0};
+  std::atomic<long> allocations{0};
+  std::atomic<bool> hit{false};
+};
+constinit Elsewhere elsewhere;
+thread_local bool exempt;
+
+bool fails_elsewhere() noexcept {
+  if (exempt || !elsewhere.armed.load(std::memory_order_acquire)) return false;
+  const long number = elsewhere.allocations.fetch_add(1, std::memory_order_relaxed) + 1;
+  const long first = elsewhere.fail_at.load(std::memory_order_relaxed);
+  if (first == 0 || number < first ||
+      number - first >= elsewhere.times.load(std::memory_order_relaxed))
+    return false;
+  elsewhere.hit.store(true, std::memory_order_relaxed);
+  errno = ENOMEM;
+  return true;
+}
+
 bool fails() noexcept {
+  if (fails_elsewhere()) return true;
   if (!state.armed || ++state.allocations != state.fail_at) return false;
   state.hit = true;
   errno = ENOMEM;
@@ -174,6 +199,28 @@ long AllocationFault::allocations() const noexcept {
 }
 long AllocationFault::balance() const noexcept {
   return state.balance;
+}
+
+AllocationFaultElsewhere::AllocationFaultElsewhere(long fail_at, long times) noexcept {
+  exempt = true;
+  elsewhere.fail_at = fail_at;
+  elsewhere.times = times;
+  elsewhere.allocations = 0;
+  elsewhere.hit = false;
+  elsewhere.armed.store(true, std::memory_order_release);
+}
+AllocationFaultElsewhere::~AllocationFaultElsewhere() {
+  disarm();
+}
+void AllocationFaultElsewhere::disarm() noexcept {
+  elsewhere.armed.store(false, std::memory_order_release);
+  exempt = false;
+}
+bool AllocationFaultElsewhere::hit() const noexcept {
+  return elsewhere.hit;
+}
+long AllocationFaultElsewhere::allocations() const noexcept {
+  return elsewhere.allocations;
 }
 
 }  // namespace orv::test

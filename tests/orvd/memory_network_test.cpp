@@ -1,0 +1,442 @@
+// Allocations of a whole server fail while a client has a session with it: sockets, TLS, SASL with
+// the real library, and what is around them on all threads. The process lives on, each request is
+// answered or the connection ends, nobody is left waiting, and the next client is served.
+//
+// There are too many allocations to let each of them fail: a sample of them does, another in each
+// run. ORV_FAILING_ALLOCATIONS is how many of each session (0: all), ORV_SEED repeats a run.
+#include <gtest/gtest.h>
+#include <sasl/sasl.h>
+
+#include <algorithm>
+#include <array>
+#include <chrono>
+#include <cstdlib>
+#include <filesystem>
+#include <memory>
+#include <optional>
+#include <random>
+#include <string>
+#include <vector>
+
+#include "../slapi/failing_allocation.h"
+#include "auth/sasl_cyrus.h"
+#include "core_server_fixture.h"
+#include "core_tls_client.h"
+#include "net/tls.h"
+#include "protocol/control_values.h"
+
+namespace orv::server::test {
+namespace {
+
+using namespace std::chrono_literals;
+using orv::test::AllocationFault;
+using orv::test::AllocationFaultElsewhere;
+
+constexpr const char* kUser = "boss";
+constexpr auto kPatience = 5s;  // less than what the client waits for bytes
+constexpr const char* kBox = "cn=box,cn=configuration";
+
+long number_from_environment(const char* name, long otherwise) {
+  const char* const text = std::getenv(name);
+  return text ? std::strtol(text, nullptr, 10) : otherwise;
+}
+
+class Boss final : public SaslIdentities {
+ public:
+  std::shared_ptr<const Identity> of_user(std::string_view name, std::string& password) override {
+    if (name != kUser) return nullptr;
+    password = kSecret;
+    auto identity = std::make_shared<Identity>(Identity{"CN=ROOT", 0x0C, 0, ""});
+    identity->user_name = name;
+    return identity;
+  }
+  std::shared_ptr<const Identity> of_principal(std::string_view) override { return nullptr; }
+  bool settle(const Identity&, bool proved) noexcept override { return proved; }
+  bool has_users() const noexcept override { return true; }
+  bool has_principals() const noexcept override { return false; }
+};
+
+// The client's side of a SASL bind, by the library's own client.
+class Peer {
+ public:
+  Peer(const char* mechanism, unsigned strength) : mechanism_(mechanism) {
+    secret_.resize(sizeof(sasl_secret_t) + std::string_view(kSecret).size());
+    auto* const secret = reinterpret_cast<sasl_secret_t*>(secret_.data());
+    secret->len = std::string_view(kSecret).size();
+    std::copy_n(kSecret, secret->len, secret->data);
+    callbacks_ = {row(SASL_CB_USER, tell_nothing),
+                  row(SASL_CB_AUTHNAME, tell_user),
+                  row(SASL_CB_PASS, tell_password),
+                  {SASL_CB_LIST_END, nullptr, nullptr}};
+    EXPECT_EQ(sasl_client_new("ldap", "localhost", nullptr, nullptr, callbacks_.data(),
+                              SASL_SUCCESS_DATA, &connection_),
+              SASL_OK);
+    sasl_security_properties_t wanted{};
+    wanted.min_ssf = strength;
+    wanted.max_ssf = strength;
+    wanted.maxbufsize = 65536;
+    sasl_setprop(connection_, SASL_SEC_PROPS, &wanted);
+  }
+  ~Peer() { sasl_dispose(&connection_); }
+  Peer(const Peer&) = delete;
+  Peer& operator=(const Peer&) = delete;
+
+  const char* mechanism() const { return mechanism_; }
+  std::optional<std::string> begin() {
+    const char* chosen = nullptr;
+    const char* out = nullptr;
+    unsigned length = 0;
+    sasl_client_start(connection_, mechanism_, nullptr, &out, &length, &chosen);
+    return out ? std::optional(std::string(out, length)) : std::nullopt;
+  }
+  std::string answer(const std::string& challenge) {
+    const char* out = nullptr;
+    unsigned length = 0;
+    sasl_client_step(connection_, challenge.data(), static_cast<unsigned>(challenge.size()),
+                     nullptr, &out, &length);
+    return out ? std::string(out, length) : std::string();
+  }
+  // Through the security layer of this side.
+  std::string wrap(std::string_view clear) { return convert(sasl_encode, clear); }
+  std::string unwrap(std::string_view wire) { return convert(sasl_decode, wire); }
+
+ private:
+  template <typename Function>
+  std::string convert(Function function, std::string_view from) {
+    const char* out = nullptr;
+    unsigned length = 0;
+    function(connection_, from.data(), static_cast<unsigned>(from.size()), &out, &length);
+    return out ? std::string(out, length) : std::string();
+  }
+  template <typename Function>
+  sasl_callback_t row(unsigned long id, Function* function) {
+    return {id, reinterpret_cast<int (*)()>(reinterpret_cast<void (*)()>(function)), this};
+  }
+  static int tell(std::string_view text, const char** out, unsigned* length) {
+    *out = text.data();
+    if (length) *length = static_cast<unsigned>(text.size());
+    return SASL_OK;
+  }
+  static int tell_user(void*, int, const char** out, unsigned* length) {
+    return tell(kUser, out, length);
+  }
+  static int tell_nothing(void*, int, const char** out, unsigned* length) {
+    return tell("", out, length);
+  }
+  static int tell_password(sasl_conn_t*, void* context, int, sasl_secret_t** secret) {
+    *secret = reinterpret_cast<sasl_secret_t*>(static_cast<Peer*>(context)->secret_.data());
+    return SASL_OK;
+  }
+
+  const char* const mechanism_;
+  std::vector<char> secret_;
+  std::array<sasl_callback_t, 4> callbacks_{};
+  sasl_conn_t* connection_ = nullptr;
+};
+
+// A client with TLS, and with a security layer once it is given one.
+class SaslClient final : public TlsClient {
+ public:
+  explicit SaslClient(std::uint16_t port) : TlsClient(port) {}
+
+  void put_layer(Peer& peer) { layer_ = &peer; }
+  void send(std::string_view bytes) override {
+    TlsClient::send(layer_ ? layer_->wrap(bytes) : bytes);
+  }
+
+ protected:
+  bool fill() override {
+    if (!layer_) return TlsClient::fill();
+    const std::string before = std::exchange(received_, {});
+    const bool more = TlsClient::fill();
+    received_ = before + (more ? layer_->unwrap(received_) : std::string());
+    return more;
+  }
+
+ private:
+  Peer* layer_ = nullptr;
+};
+
+// What a client does, step by step, until the server ends the connection.
+class Conversation {
+ public:
+  explicit Conversation(std::uint16_t port) : client_(port) {}
+
+  // The result code, or -1 when the server has ended the connection.
+  int ask(const std::string& request, int id) { return reply_to(request, id).code; }
+
+  Reply reply_to(const std::string& request, int id) {
+    if (over_) return {};
+    const auto begun = Clock::now();
+    client_.send(request);
+    const std::vector<Reply> replies = client_.receive_result();
+    EXPECT_LT(Clock::now() - begun, kPatience) << "left waiting for an answer to request " << id;
+    over_ = replies.empty() || replies.back().id == 0 || replies.back().code < 0;
+    if (over_) return {};
+    EXPECT_EQ(replies.back().id, id);
+    return replies.back();
+  }
+
+  bool start_tls(int id) {
+    if (ask(extended(id, kStartTlsOid), id) != 0) return false;
+    return shake_hands();
+  }
+  bool shake_hands() {
+    const auto begun = Clock::now();
+    const bool done = client_.shake_hands();
+    EXPECT_LT(Clock::now() - begun, kPatience) << "left waiting in a handshake";
+    over_ = over_ || !done;
+    return done;
+  }
+
+  // As SASL does it, until the server says how it ends.
+  int bind(Peer& peer, int& id, bool with_layer) {
+    std::optional<std::string> credentials = peer.begin();
+    for (;;) {
+      const Reply reply = reply_to(sasl_bind(id, peer.mechanism(), credentials), id);
+      ++id;
+      const std::string challenge = challenge_in(reply);
+      if (reply.code == 0 && !challenge.empty()) peer.answer(challenge);
+      if (reply.code == 0 && with_layer) client_.put_layer(peer);
+      if (reply.code != 14) return reply.code;
+      credentials = peer.answer(challenge);
+    }
+  }
+
+  void leave(int id) {
+    if (!over_) client_.send(unbind(id));
+    client_.close();
+  }
+  bool over() const { return over_; }
+
+ private:
+  // serverSaslCreds, the last element of a bind's answer; all elements are short.
+  static std::string challenge_in(const Reply& reply) {
+    std::size_t at = 0;
+    while (at + 2 <= reply.body.size()) {
+      std::size_t length = static_cast<unsigned char>(reply.body[at + 1]);
+      std::size_t head = 2;
+      if (length == 0x81) {
+        length = static_cast<unsigned char>(reply.body.at(at + 2));
+        head = 3;
+      }
+      if (reply.body[at] == '\x87') return reply.body.substr(at + head, length);
+      at += head + length;
+    }
+    return "";
+  }
+
+  SaslClient client_;
+  bool over_ = false;
+};
+
+// What was answered to each request, as far as it came.
+using Codes = std::vector<int>;
+
+class MemoryOfAServer : public LoopbackServer {
+ protected:
+  static void SetUpTestSuite() {
+    LoopbackServer::SetUpTestSuite();
+    std::string error;
+    library = SaslLibrary::open(error).release();
+    ASSERT_NE(library, nullptr) << error;
+    static const sasl_callback_t only_these[] = {
+        {SASL_CB_VERIFYFILE,
+         reinterpret_cast<int (*)()>(reinterpret_cast<void (*)()>(&is_tested_plugin)), nullptr},
+        {SASL_CB_LIST_END, nullptr, nullptr}};
+    ASSERT_EQ(sasl_client_init(only_these), SASL_OK);
+  }
+  static void TearDownTestSuite() {
+    sasl_client_done();
+    delete std::exchange(library, nullptr);
+  }
+  // Others do not give all their memory back.
+  static int is_tested_plugin(void*, const char* file, sasl_verify_type_t) {
+    const std::string_view name(file);
+    return name.find("libdigestmd5.") != std::string_view::npos ||
+                   name.find("libscram.") != std::string_view::npos
+               ? SASL_OK
+               : SASL_CONTINUE;
+  }
+
+  MemoryOfAServer() : sasl(*library, boss, [](std::string_view) {}) {
+    const Pair own = certificates.self_signed("localhost");
+    settings.tls.certificate_file = own.certificate;
+    settings.tls.key_file = own.key;
+    settings.access_log = certificates.path("access.log");
+    settings.access_log_level = "info";
+    settings.error_log = certificates.path("error.log");
+    settings.error_log_level = "error";
+    more.secure_port = 0;
+    sasl.add_mechanisms(mechanisms);
+    backend.on_search = [this](pblock* parameters) {
+      const int code = send_test_entry(parameters, *found_);
+      return finish_search(parameters, code, code == 0 ? 1 : 0);
+    };
+    backend.on_change = [](pblock* parameters) {
+      send_ldap_result(connection_of(parameters), operation_of(parameters), 0, nullptr, "");
+      return 0;
+    };
+  }
+  // What the mechanisms refer to goes with this class.
+  ~MemoryOfAServer() override { stop(); }
+
+  static void work(Conversation& talk, int& id, Codes& codes) {
+    const auto ask = [&](std::string (*make)(int)) {
+      codes.push_back(talk.ask(make(id), id));
+      ++id;
+    };
+    ask([](int n) { return search(n, kTop, 2); });
+    ask([](int n) { return add_entry(n, kBox, "cn", "box"); });
+    ask([](int n) { return modify(n, kBox, "description", "a value that is not short at all"); });
+    ask([](int n) { return delete_entry(n, kBox); });
+    ask([](int n) { return extended(n, kWhoAmIOid); });
+  }
+
+  Codes over_tls(bool from_the_start) {
+    Codes codes;
+    int id = 1;
+    Conversation talk(from_the_start ? server->secure_port() : port());
+    if (from_the_start ? talk.shake_hands() : talk.start_tls(id++)) {
+      codes.push_back(talk.ask(bind(id, kRoot, kSecret), id));
+      ++id;
+      work(talk, id, codes);
+      Peer peer("SCRAM-SHA-256", 0);
+      codes.push_back(talk.bind(peer, id, false));
+      codes.push_back(talk.ask(search(id, kTop), id));
+      ++id;
+    }
+    talk.leave(id);
+    return codes;
+  }
+  Codes with_a_layer() {
+    Codes codes;
+    int id = 1;
+    Conversation talk(port());
+    Peer peer("DIGEST-MD5", 1);
+    codes.push_back(talk.bind(peer, id, true));
+    if (codes.back() == 0) work(talk, id, codes);
+    talk.leave(id);
+    return codes;
+  }
+
+  void expect_the_next_client_is_served() {
+    Conversation talk(port());
+    EXPECT_EQ(talk.ask(bind(1, kRoot, kSecret), 1), 0);
+    EXPECT_EQ(talk.ask(search(2, kTop), 2), 0);
+    talk.leave(3);
+  }
+  bool everybody_has_gone() {
+    const auto end = Clock::now() + 10s;
+    while (server->connections() > 0 && Clock::now() < end) std::this_thread::yield();
+    return server->connections() == 0;
+  }
+
+  void fail_in(const std::function<Codes()>& session) {
+    start();
+    const Codes undisturbed = session();  // what is made at the first use only
+    for (const int code : undisturbed) ASSERT_EQ(code, 0) << "it works when there is memory";
+    AllocationFaultElsewhere none(0);
+    ASSERT_EQ(session(), undisturbed);
+    ASSERT_TRUE(everybody_has_gone());
+    none.disarm();
+    const long in_all = none.allocations();
+    ASSERT_GT(in_all, 100);
+
+    const long seed = number_from_environment("ORV_SEED", std::random_device()() & 0xFFFFFFL);
+    RecordProperty("ORV_SEED", std::to_string(seed));
+    SCOPED_TRACE("ORV_SEED=" + std::to_string(seed));
+    std::mt19937 chance(static_cast<unsigned>(seed));
+    const long wanted = number_from_environment("ORV_FAILING_ALLOCATIONS", 60);
+    const long step = wanted > 0 ? std::max(1L, in_all / wanted) : 1;
+    long disturbed = 0;
+    for (long n = 1; n <= in_all && !HasFailure(); n += step) {
+      const long which = n + std::uniform_int_distribution<long>(0, step - 1)(chance);
+      // Want of memory seldom is for one moment only.
+      const long times = n / step % 3 == 2 ? 30 : 1;
+      SCOPED_TRACE(std::to_string(times) + " from allocation " + std::to_string(which) + " on");
+      AllocationFaultElsewhere fault(which, times);
+      const Codes codes = session();
+      fault.disarm();
+      disturbed += codes != undisturbed;
+      expect_the_next_client_is_served();
+    }
+    EXPECT_GT(disturbed, 20) << "nothing of what failed mattered";
+    EXPECT_EQ(session(), undisturbed);
+    EXPECT_TRUE(everybody_has_gone());
+  }
+
+  static SaslLibrary* library;
+  Certificates certificates;
+  Boss boss;
+  CyrusSasl sasl;
+  const EntryPtr found_ = make_test_entry("CN=X,CN=CONFIGURATION");
+};
+
+SaslLibrary* MemoryOfAServer::library = nullptr;
+
+// What the library allocates, each in its turn: on this thread, so that none is missed.
+class MemoryOfAMechanism : public MemoryOfAServer, public testing::WithParamInterface<const char*> {
+ protected:
+  // Whether the n-th allocation was reached; what the exchange ended with, if it did.
+  bool fails(long n, std::optional<SaslOutcome>& last) {
+    Peer peer(GetParam(), 0);
+    const auto exchange = find_mechanism(mechanisms, GetParam(), {})->start({});
+    std::optional<std::string> sent = peer.begin();
+    bool hit = false;
+    for (;;) {
+      last.reset();
+      AllocationFault fault(n);
+      try {
+        last = sent ? exchange->step(std::string_view(*sent)) : exchange->step(std::nullopt);
+      } catch (const std::bad_alloc&) {
+      }
+      fault.disarm();
+      hit = hit || fault.hit();
+      n = fault.hit() ? 0 : n - fault.allocations();
+      if (!last || last->state != SaslOutcome::State::go_on) return hit;
+      sent = peer.answer(last->reply.value_or(""));
+    }
+  }
+};
+
+TEST_P(MemoryOfAMechanism, ThatFailsProvesNothingThatIsWrongAndHarmsNobody) {
+  ASSERT_NE(find_mechanism(mechanisms, GetParam(), {}), nullptr);
+  int refused = 0;
+  // The thousands of rounds in which a password is hashed are all the same.
+  for (long n = 1;; n += n < 100 ? 1 : n / 3) {
+    SCOPED_TRACE("allocation " + std::to_string(n));
+    std::optional<SaslOutcome> last;
+    const bool hit = fails(n, last);
+    const bool done = last && last->state == SaslOutcome::State::done;
+    EXPECT_TRUE(done || hit);
+    EXPECT_EQ(last && last->identity, done);
+    if (done) {
+      EXPECT_EQ(last->identity->user_name, kUser);
+    }
+    refused += !done;
+    if (!hit || HasFailure()) break;
+  }
+  EXPECT_GT(refused, 10);
+}
+
+INSTANTIATE_TEST_SUITE_P(Each, MemoryOfAMechanism, testing::Values("DIGEST-MD5", "SCRAM-SHA-256"),
+                         [](const auto& info) {
+                           return std::string(info.param).substr(0, 5) == "SCRAM" ? "Scram"
+                                                                                  : "Digest";
+                         });
+
+TEST_F(MemoryOfAServer, ThatFailsUnderStartTlsEndsAtMostThatConnection) {
+  fail_in([this] { return over_tls(false); });
+}
+
+TEST_F(MemoryOfAServer, ThatFailsWhereTlsComesFirstEndsAtMostThatConnection) {
+  fail_in([this] { return over_tls(true); });
+}
+
+TEST_F(MemoryOfAServer, ThatFailsUnderASecurityLayerEndsAtMostThatConnection) {
+  fail_in([this] { return with_a_layer(); });
+}
+
+}  // namespace
+}  // namespace orv::server::test
