@@ -50,6 +50,7 @@ constexpr SettingRow kRows[] = {
     row("orv-slapdMaxPagedSearches", &Settings::max_paged_searches),
     row("orv-slapdMaxPagedResultSize", &Settings::max_paged_result_size),
     row("orv-slapdMaxFailedChangeSize", &Settings::max_failed_change_size),
+    row("orv-slapdMaxFailedChangeTotalSize", &Settings::max_failed_change_total_size),
     row("orv-slapdSecurePort", &Settings::secure_port, true),
     row("orv-slapdMaxUnauthenticatedConnections", &Settings::max_unauthenticated_connections),
     row("orv-slapdUnauthenticatedTimeOut", &Settings::unauthenticated_timeout),

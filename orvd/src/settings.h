@@ -49,16 +49,17 @@ struct Settings {
   std::int64_t message_timeout = 30;          // seconds to finish a message once begun
   std::int64_t max_persistent_searches = 64;  // in all, 0: there are none
   std::int64_t max_persistent_searches_per_connection = 8;
-  std::int64_t max_paged_searches = 8;                  // of one connection, 0: there are none
-  std::int64_t max_paged_result_size = 16777216;        // bytes that they keep
-  std::int64_t max_failed_change_size = 16777216;       // bytes of one identity within a day
-  std::int64_t secure_port = 0;                         // of ldaps; 0: none
-  std::int64_t max_unauthenticated_connections = 3072;  // on which nobody is bound
-  std::int64_t unauthenticated_timeout = 300;           // seconds with nobody bound, 0 no limit
-  std::int64_t bind_timeout = 30;                       // seconds to finish a bind in several steps
-  std::int64_t handshake_timeout = 10;                  // seconds to finish a handshake of TLS
-  std::vector<std::string> addresses;                   // empty: every address
-  std::string local_socket;                             // path; empty: none
+  std::int64_t max_paged_searches = 8;                   // of one connection, 0: there are none
+  std::int64_t max_paged_result_size = 16777216;         // bytes that they keep
+  std::int64_t max_failed_change_size = 16777216;        // bytes of one identity within a day
+  std::int64_t max_failed_change_total_size = 67108864;  // the same of all but the primary one
+  std::int64_t secure_port = 0;                          // of ldaps; 0: none
+  std::int64_t max_unauthenticated_connections = 3072;   // on which nobody is bound
+  std::int64_t unauthenticated_timeout = 300;            // seconds with nobody bound, 0 no limit
+  std::int64_t bind_timeout = 30;       // seconds to finish a bind in several steps
+  std::int64_t handshake_timeout = 10;  // seconds to finish a handshake of TLS
+  std::vector<std::string> addresses;   // empty: every address
+  std::string local_socket;             // path; empty: none
 
   TlsSettings tls;
   SaslSettings sasl;

@@ -69,6 +69,28 @@ def test_others_and_other_requests_are_served_meanwhile(instance):
     clients.bind(server, "cn=carol", "Qm4&wt8?Lb6%")
 
 
+def test_many_members_do_not_add_up_and_keep_nobody_else_out(instance):
+    instance.config.set(clients.BASE, "orv-slapdMaxFailedChangeTotalSize", str(LIMIT))
+    instance.start()
+    root = clients.bind(instance)
+    names = ["carol", "dave", "erin"]
+    for name in names:
+        assert add(root, *member(name, roles=["NoAdmin"])) == 0
+    first, second, third = (clients.bind(instance, "cn=" + name, PASSWORD) for name in names)
+    admitted = 0
+    for _ in range(1000):
+        if fail(first) != 50 or fail(second) != 50:
+            break
+        admitted += 2
+    assert LIMIT / 2 < admitted * len(VALUE) < 2 * LIMIT
+    assert fail(third) == 51
+    assert instance.stderr.wait_for(re.compile(
+        r'modify by "CN=[A-Z]*" refused with 51: too many modifications of all').search)
+    assert clients.read(third, clients.BASE)
+    assert modify(root, clients.BASE, (ldap.MOD_REPLACE, "description", ["x"])) == 0
+    assert modify(root, clients.BASE, (ldap.MOD_REPLACE, "orv-slapdPort", [VALUE])) not in (0, 51)
+
+
 def test_limit_is_a_setting_that_is_in_force_at_once(instance):
     server = limited(instance)
     for _ in range(6):

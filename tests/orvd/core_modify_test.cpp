@@ -300,6 +300,35 @@ TEST_F(FailingModifies, CountManySmallValuesByWhatTheyTake) {
   EXPECT_EQ(code_of(client, modify_with(3, kTop, {many})), 51);
 }
 
+// Many identities do not add up, and nobody keeps the primary administrator out.
+TEST_F(FailingModifies, OfAllTogetherAreRefusedExceptThoseOfThePrimaryAdministrator) {
+  settings.max_failed_change_size = 64 * kLimit;
+  settings.max_failed_change_total_size = kLimit;
+  start();
+  WireClient root(port());
+  bind_as_root(root);
+  for (int i = 0; i < 40; ++i) EXPECT_EQ(code_of(root, large(10 + i)), 50);
+  WireClient member(port());
+  bind_as(member, kMember);
+  const int admitted = until_refused(member);
+  EXPECT_GE(admitted, 15);
+  EXPECT_LE(admitted, 18);
+  EXPECT_EQ(code_of(root, large(100)), 50);
+  EXPECT_EQ(modifies(), 41 + admitted);
+}
+
+TEST(FailedChanges, OfAllNamesAddUpAndComeBackWithinADay) {
+  using std::chrono::hours;
+  constexpr std::int64_t kLimit = 1000;
+  const Clock::time_point start = Clock::now();
+  FailedChangesByName owed;
+  for (int i = 0; i < 100; ++i) owed.charge_all(11, kLimit, start);
+  EXPECT_TRUE(owed.all_used_up(kLimit, start));
+  EXPECT_FALSE(owed.used_up("cn=1", kLimit, start));
+  EXPECT_TRUE(owed.all_used_up(kLimit, start + hours(1)));
+  EXPECT_FALSE(owed.all_used_up(kLimit, start + hours(4)));
+}
+
 TEST(FailedChanges, ComeBackWithinADay) {
   using std::chrono::hours;
   constexpr std::int64_t kLimit = 1000;

@@ -57,6 +57,7 @@ inline constexpr SettingRange kSettingRanges[] = {
     {"orv-slapdTlsHandshakeTimeOut", 1, setting_bounds::seconds},
     // A client must be able to fail now and then whatever it sends.
     {"orv-slapdMaxFailedChangeSize", 65536, setting_bounds::bytes / 4},
+    {"orv-slapdMaxFailedChangeTotalSize", 65536, setting_bounds::bytes},
     {"pwdMinLength", 0, setting_bounds::policy_length},
     {"passwordMinAlphaChars", 0, setting_bounds::policy_length},
     {"passwordMinOtherChars", 0, setting_bounds::policy_length},

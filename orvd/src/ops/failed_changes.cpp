@@ -54,6 +54,17 @@ void FailedChangesByName::charge(std::string_view name, std::int64_t bytes, std:
   }
 }
 
+bool FailedChangesByName::all_used_up(std::int64_t limit, Clock::time_point now) noexcept {
+  const std::lock_guard lock(mutex_);
+  return of_all_.used_up(limit, now);
+}
+
+void FailedChangesByName::charge_all(std::int64_t bytes, std::int64_t limit,
+                                     Clock::time_point now) noexcept {
+  const std::lock_guard lock(mutex_);
+  of_all_.charge(bytes, limit, now);
+}
+
 void FailedChangesByName::forget_settled(std::int64_t limit, Clock::time_point now) noexcept {
   for (auto name = owed_.begin(); name != owed_.end();)
     name = name->second.settled(limit, now) ? owed_.erase(name) : std::next(name);

@@ -7,6 +7,10 @@
 // overdraws it is let through, however large it is; those after it wait until what was overdrawn
 // has come back, for a day at most.
 //
+// All identities together have a larger one, so that many of them do not add up. The primary
+// administrator is outside of it: members could use it up on purpose to keep him from mending what
+// they do.
+//
 // Threads: `FailedChanges` belongs to one thread at a time, `FailedChangesByName` is thread-safe.
 #pragma once
 
@@ -46,6 +50,10 @@ class FailedChangesByName {
               Clock::time_point now) noexcept;
   std::size_t names() const noexcept;
 
+  // That of all together.
+  bool all_used_up(std::int64_t limit, Clock::time_point now) noexcept;
+  void charge_all(std::int64_t bytes, std::int64_t limit, Clock::time_point now) noexcept;
+
  private:
   // Names are forgotten again beyond so many, when they owe nothing.
   static constexpr std::size_t kMostNames = 1024;
@@ -54,6 +62,7 @@ class FailedChangesByName {
 
   mutable std::mutex mutex_;
   std::map<std::string, FailedChanges, std::less<>> owed_;  // under the mutex
+  FailedChanges of_all_;                                    // the same
 };
 
 // A connection may use up so much of its identity's allowance.

@@ -200,20 +200,33 @@ bool PendingOperation::rights_hold(const Services& services) noexcept {
   return false;
 }
 
-// A modify waits while those of its client that failed have cost too much.
+bool PendingOperation::is_primary() const noexcept {
+  return operation_.authority == authority::primary_administrator;
+}
+
+// Which allowance is used up; "" when none is.
+std::string_view PendingOperation::why_not_fail(Services& services) noexcept {
+  const Clock::time_point now = Clock::now();
+  FailedChangesByName& all = services.failed_changes;
+  if (home_->failed_changes().used_up(share_of_connection(failure_limit), now) ||
+      all.used_up(bound_dn(), failure_limit, now))
+    return "too many modifications failed, try again later";
+  if (!is_primary() && all.all_used_up(failure_limit_of_all, now))
+    return "too many modifications of all identities failed, try again later";
+  return "";
+}
+
+// A modify waits while those that failed have cost too much.
 bool PendingOperation::may_fail(Services& services) noexcept {
   if (cost_of_failure_ == 0) return true;
-  const Clock::time_point now = Clock::now();
-  if (!home_->failed_changes().used_up(share_of_connection(failure_limit), now) &&
-      !services.failed_changes.used_up(bound_dn(), failure_limit, now))
-    return true;
-  constexpr std::string_view kReason = "too many modifications failed, try again later";
-  answer_.result(result::busy, "", kReason);
+  const std::string_view reason = why_not_fail(services);
+  if (reason.empty()) return true;
+  answer_.result(result::busy, "", reason);
   try {
     std::string line = "modify by ";
     append_client_text(line, bound_dn());
     line += " refused with 51: ";
-    line += kReason;
+    line += reason;
     services.cut_offs.tell(CutOff::changes, line);
   } catch (...) {
     // Without memory the line is lost.
@@ -296,6 +309,8 @@ void PendingOperation::settle_change(Services& services, int code) noexcept {
     const Clock::time_point now = Clock::now();
     home_->failed_changes().charge(cost_of_failure_, share_of_connection(failure_limit), now);
     services.failed_changes.charge(bound_dn(), cost_of_failure_, failure_limit, now);
+    if (!is_primary())
+      services.failed_changes.charge_all(cost_of_failure_, failure_limit_of_all, now);
   }
   take_over(services, code);
 }

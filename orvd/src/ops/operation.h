@@ -106,6 +106,7 @@ class PendingOperation final : public GateWaiter,
 
   // The limit of what changes that fail may cost, in bytes.
   std::int64_t failure_limit = 0;
+  std::int64_t failure_limit_of_all = 0;  // of all identities together
 
   std::string log_text;  // what the access log says of the request; empty when it is off
 
@@ -144,6 +145,8 @@ class PendingOperation final : public GateWaiter,
   bool take_budget(const Services& services) noexcept;
   bool trust_holds(const Services& services) noexcept;
   bool rights_hold(const Services& services) noexcept;
+  bool is_primary() const noexcept;
+  std::string_view why_not_fail(Services& services) noexcept;
   bool may_fail(Services& services) noexcept;
   bool has_reserves() noexcept;
   bool may_begin(Services& services) noexcept;

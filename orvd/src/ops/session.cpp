@@ -330,6 +330,7 @@ Session::OperationPtr Session::make_operation(std::int32_t id, int response_tag,
   operation->identity_generation = identity_checked_;
   operation->trust = transport_trust();
   operation->failure_limit = settings().max_failed_change_size;
+  operation->failure_limit_of_all = settings().max_failed_change_total_size;
   lend_storage(operation->answer().bytes());
   return operation;
 }
