@@ -12,6 +12,7 @@
 #include "change.h"
 #include "characters.h"
 #include "dn_text.h"
+#include "entry_size.h"
 #include "local_text.h"
 
 namespace orv::cfg {
@@ -20,16 +21,19 @@ namespace {
 
 // ---- The new entry's lines ----
 
+std::string folded_name(const ModType& type) {
+  std::string name(type.name);
+  for (char& c : name) c = ascii_lower(c);
+  return name;
+}
+
 // The values of an entry that were seen, to find one that is given twice.
 class SeenValues {
  public:
   // False when an equal value of the attribute was seen before. Of passwords no copy is made.
   bool add(const ModType& type, std::string_view value) {
     if (type.is_secret()) return secrets_.emplace(type.known, value).second;
-    std::string key(type.name);
-    for (char& c : key) c = ascii_lower(c);
-    key += '\0';
-    return seen_.insert(key + value_key(type, value)).second;
+    return seen_.insert(folded_name(type) + '\0' + value_key(type, value)).second;
   }
 
  private:
@@ -50,7 +54,7 @@ class RecordWriter {
       Outcome outcome = write_attribute(**mods);
       if (outcome.refused()) return outcome;
     }
-    return {};
+    return check_growth({}, {names_.size(), values_});
   }
 
   std::string take() noexcept { return std::move(record_); }
@@ -64,8 +68,10 @@ class RecordWriter {
     if (!outcome.refused()) outcome = read_values(mod, type, values);
     if (outcome.refused()) return outcome;
     if (values.empty()) return {result::protocol_error, {}};
+    names_.insert(folded_name(type));
     for (const std::string_view value : values) {
       if (!seen_.add(type, value)) return given_twice(type);
+      ++values_;
       outcome = write_value(type, value);
       if (outcome.refused()) return outcome;
     }
@@ -92,6 +98,8 @@ class RecordWriter {
   std::string_view normal_dn_;
   std::string_view line_end_;
   SeenValues seen_;
+  std::unordered_set<std::string> names_;
+  std::size_t values_ = 0;
   std::string record_;
 };
 

@@ -15,6 +15,7 @@
 #include "change.h"
 #include "characters.h"
 #include "dn_text.h"
+#include "entry_size.h"
 #include "local_text.h"
 #include "secret_key.h"
 
@@ -61,6 +62,15 @@ class EntryEditor {
       if (!item.gone) return false;
     }
     return true;
+  }
+
+  [[nodiscard]] EntrySize size() const noexcept {
+    EntrySize size;
+    for (const auto& [name, attribute] : attributes_) {
+      size.attributes += attribute.by_key.empty() ? 0 : 1;
+      size.values += attribute.by_key.size();
+    }
+    return size;
   }
 
   [[nodiscard]] std::vector<Edit> edits() const {
@@ -272,6 +282,7 @@ Outcome modify(Session& session, std::string_view dn, ldapmod** mods) {
   const std::uint32_t entry = session.snapshot->index.find(normal);
   if (entry == LdifIndex::kNone) return {result::no_such_record, {}};
   EntryEditor editor(session, entry, normal);
+  const EntrySize before = editor.size();
   for (; mods != nullptr && *mods != nullptr; ++mods) {
     Outcome outcome = editor.apply(**mods);
     if (outcome.refused()) return outcome;
@@ -279,6 +290,7 @@ Outcome modify(Session& session, std::string_view dn, ldapmod** mods) {
   if (editor.is_empty()) {
     return {result::object_class_violation, "an entry without attributes cannot be stored"};
   }
+  if (Outcome outcome = check_growth(before, editor.size()); outcome.refused()) return outcome;
   const std::vector<Edit> edits = editor.edits();
   return edits.empty() ? Outcome{} : commit(session, edits);
 }

@@ -10,6 +10,7 @@
 #include <utility>
 
 #include "audit/log.h"
+#include "cfg/entry_limits.h"
 #include "slapi/globals.h"
 #include "standard_error.h"
 #include "stop_watchdog.h"
@@ -47,6 +48,12 @@ constexpr std::chrono::seconds kLockPatience{1};
 void hold_stop_signals() {
   static auto& nobody_runs = *new asio::io_context;
   [[maybe_unused]] static const auto& held = *new asio::signal_set(nobody_runs, SIGTERM, SIGINT);
+}
+
+// What bounds a message bounds what becomes of an entry by many.
+void bound_entries(const Settings& settings) noexcept {
+  cfg::set_entry_limits({static_cast<std::size_t>(settings.max_attributes),
+                         static_cast<std::size_t>(settings.max_values)});
 }
 
 }  // namespace
@@ -87,6 +94,7 @@ Server::Server(ServerParts parts)
   services_.mechanisms = parts_.mechanisms;
   services_.local_verifiers = &own_work_;
   services_.tls = &tls_;
+  bound_entries(*settings_);
   if (parts_.wall_time) services_.wall_time = parts_.wall_time;
   for (unsigned i = 0; i < std::max(1U, parts_.loops); ++i)
     loops_.push_back(std::make_unique<Loop>(parts_.logs, settings_));
@@ -339,6 +347,7 @@ void Server::reload() {
   wanted.local_socket = settings_->local_socket;
   renew_certificate(wanted);
   settings_ = std::make_shared<const Settings>(std::move(wanted));
+  bound_entries(*settings_);
   for (const auto& loop : loops_) loop->renew(settings_);
   asio::post(control_, [this, settings = settings_] { listeners_.renew(settings); });
 }

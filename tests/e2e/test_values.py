@@ -53,6 +53,30 @@ def test_same_type_under_two_names_is_refused(server, root):
     assert add(root, dn, changes.encoded(attributes) + [("CN", [b"other"])]) == 20
 
 
+def test_entry_grows_up_to_its_limits_and_the_connection_goes_on(instance):
+    instance.config.set(clients.BASE, "orv-slapdMaxValues", "40")
+    instance.config.set(clients.BASE, "orv-slapdMaxAttributes", "5")
+    instance.start()
+    root = clients.bind(instance)
+    words = ["%d" % number for number in range(60)]
+    dn, attributes = container("big", description=words[:20])
+    assert add(root, dn, attributes) == 0
+    assert changes.modify(root, dn, (ldap.MOD_ADD, "description", words[20:30])) == 0
+    before = instance.config.read()
+    assert changes.modify(root, dn, (ldap.MOD_ADD, "description", words[30:40])) == 11
+    assert instance.config.read() == before
+    assert instance.stderr.wait_for(lambda line: "more than 40 values" in line)
+    assert changes.modify(root, dn, (ldap.MOD_DELETE, "description", words[:10]),
+                          (ldap.MOD_ADD, "description", words[30:40])) == 0
+    dn, attributes = container("huge", description=words)
+    assert add(root, dn, attributes) == 11
+    dn, attributes = changes.member("alice")  # five
+    assert add(root, dn, attributes) == 0
+    assert changes.modify(root, dn, (ldap.MOD_ADD, "orv-slapdDigestAdminUser", ["alice"])) == 11
+    assert instance.stderr.wait_for(lambda line: "more than 5 attributes" in line)
+    assert clients.bind(instance, "cn=alice", changes.PASSWORD)
+
+
 def test_value_of_almost_a_megabyte_is_stored_exactly(server, root):
     value = base64.b64encode(os.urandom(760_000))
     dn, attributes = container("large", description=[value])

@@ -168,9 +168,10 @@ void cfg_perror(_CFG* session, const char* text);
 // are known are written under their canonical names. Passwords are protected here (cfg/secret.h).
 // 0; 68 the entry exists; 9 its parent does not; 2 no attributes, one without values, a record that
 // is no add; 17 an attribute type that is not well formed (options are refused) or has a meaning of
-// its own in the format; 19 a password that looks like a stored one; 20 a value given twice, by the
-// type's equality rule; 21 a value with a null text, with a NUL byte, or an empty password; 64 a
-// password attribute in the DN.
+// its own in the format; 11 more attributes or values than cfg/entry_limits.h lets an entry have;
+// 19 a password that looks like a stored one; 20 a value given twice, by the type's equality rule;
+// 21 a value with a null text, with a NUL byte, or an empty password; 64 a password attribute in
+// the DN.
 int cfg_add_s(_CFG* session, const char* dn, ldapmod** mods);
 
 // Removes a leaf: its lines, comments between them, and one blank line that separated it. Comments
@@ -186,7 +187,7 @@ int cfg_delete_s(_CFG* session, const char* dn);
 // too, but protects a password that stands there in clear. 0, also for a null or empty list and
 // when nothing changes, without writing; 9 the entry is missing; 16 a value or an attribute to
 // delete is; 20 a value to add exists, or is given twice; 2 add without values, or an unknown code;
-// 17, 19 and 21 as in cfg_add_s; 65 no attribute would be left.
+// 11, 17, 19 and 21 as in cfg_add_s; 65 no attribute would be left.
 int cfg_modify_s(_CFG* session, const char* dn, ldapmod** mods);
 
 // How many calls of the three above this thread has had answered with 0. Whoever stands behind
