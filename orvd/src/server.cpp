@@ -83,7 +83,7 @@ Server::Server(ServerParts parts)
       changes_(kChangeThreads),
       verifiers_(kVerifierThreads),
       own_work_(kOwnThreads),
-      listeners_(control_, services_, counter_, loops_) {
+      listeners_(control_, services_, counter_, local_counter_, loops_) {
   services_.note_failure = parts_.note_failure;
   services_.audit = parts_.audit;
   services_.guards = parts_.guards;
@@ -327,7 +327,7 @@ void Server::wind_up() {
   if (parts_.audit) parts_.audit->settle();
   for (const auto& loop : loops_) loop->disconnect_all();
   const Clock::time_point end = Clock::now() + kFarewell;
-  while (!backend_.failed() && counter_.count() > 0 && Clock::now() < end)
+  while (!backend_.failed() && connections() > 0 && Clock::now() < end)
     std::this_thread::sleep_for(std::chrono::milliseconds(5));
   stop_workers();
   for (const auto& loop : loops_) loop->stop();

@@ -102,7 +102,7 @@ class Server {
   void reload();
 
   BackendHost& backend() noexcept { return backend_; }
-  std::int64_t connections() const { return counter_.count(); }
+  std::int64_t connections() const { return counter_.count() + local_counter_.count(); }
 
  private:
   void renew_settings() noexcept;
@@ -135,7 +135,8 @@ class Server {
   BackendHost backend_;
   TlsHolder tls_;
   Services services_;
-  ConnectionCounter counter_;
+  ConnectionCounter counter_;        // over TCP
+  ConnectionCounter local_counter_;  // over the Unix socket
   std::mutex reloading_;
   std::shared_ptr<const Settings> settings_;  // guarded by `reloading_` once the server serves
   std::vector<std::unique_ptr<Loop>> loops_;

@@ -208,6 +208,42 @@ TEST_F(LocalServer, IsReachedHoweverManyStrangersAreConnected) {
   EXPECT_EQ(external(client, 1).code, 0);
 }
 
+TEST_F(LocalServer, TakesNoPlaceOfThoseFromElsewhere) {
+  settings.max_connections = 2;
+  settings.max_unauthenticated_connections = 2;
+  start();
+  std::vector<std::unique_ptr<LocalClient>> locals;
+  for (int i = 0; i < 4; ++i) {
+    locals.push_back(std::make_unique<LocalClient>(folder.socket()));
+    EXPECT_EQ(code_of(*locals.back(), test::search(1, "")), 0);
+  }
+  EXPECT_EQ(external(*locals.front(), 2).code, 0);
+  WireClient first(port());
+  WireClient second(port());
+  EXPECT_EQ(code_of(first, test::search(1, "")), 0);
+  EXPECT_EQ(code_of(second, test::search(1, "")), 0);
+  EXPECT_EQ(server->connections(), 6);
+  // Those who leave make no place that there is not.
+  locals.clear();
+  const auto end = Clock::now() + 10s;
+  while (server->connections() > 2 && Clock::now() < end) std::this_thread::yield();
+  WireClient third(port());
+  EXPECT_EQ(code_of(third, test::search(1, "")), 51);
+}
+
+TEST_F(LocalServer, IsItselfLimited) {
+  settings.max_connections_per_address = 2;
+  start();
+  LocalClient first(folder.socket());
+  LocalClient second(folder.socket());
+  EXPECT_EQ(code_of(first, test::search(1, "")), 0);
+  EXPECT_EQ(code_of(second, test::search(1, "")), 0);
+  LocalClient third(folder.socket());
+  EXPECT_EQ(code_of(third, test::search(1, "")), 51);
+  WireClient other(port());
+  EXPECT_EQ(code_of(other, test::search(1, "")), 0);
+}
+
 // Checks of passwords cost time by intention, and strangers may ask for as many as they have
 // connections.
 TEST_F(LocalServer, BindsWhileStrangersHavePasswordsChecked) {

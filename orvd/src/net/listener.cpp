@@ -10,7 +10,6 @@
 #include <cerrno>
 #include <cstring>
 #include <exception>
-#include <limits>
 #include <utility>
 
 #include "cfg/result_codes.h"
@@ -121,10 +120,11 @@ bool describe_local(Socket& socket, TransportFacts& facts, Peer& peer) {
 }  // namespace
 
 Listeners::Listeners(asio::io_context& context, Services& services, ConnectionCounter& counter,
-                     std::vector<std::unique_ptr<Loop>>& loops)
+                     ConnectionCounter& local_counter, std::vector<std::unique_ptr<Loop>>& loops)
     : context_(context),
       services_(services),
       counter_(counter),
+      local_counter_(local_counter),
       loops_(loops),
       reserve_(open_reserve()) {}
 
@@ -239,18 +239,23 @@ Loop& Listeners::next_loop() noexcept {
 }
 
 // Why one more connection cannot be; "" when it can. Strangers must not be able to keep out who
-// administers the server on its own host.
+// administers the server on its own host, nor does that one take their places: the two are counted
+// apart.
 std::string Listeners::admit(Arrival& arrival, const std::string& counted) {
-  constexpr std::int64_t kAny = std::numeric_limits<std::int64_t>::max();
+  constexpr const char* kTooMany = "too many connections";
   const Settings& limits = *settings_;
-  const bool local = arrival.facts.local;
-  if (!local && services_.unauthenticated.load(std::memory_order_relaxed) >=
-                    limits.max_unauthenticated_connections)
+  const std::int64_t of_one = limits.max_connections_per_address;
+  if (arrival.facts.local) {
+    arrival.ticket = local_counter_.admit(counted, of_one, of_one);
+    return arrival.ticket ? "" : kTooMany;
+  }
+  if (services_.unauthenticated.load(std::memory_order_relaxed) >=
+      limits.max_unauthenticated_connections)
     return "too many connections on which nobody is bound";
-  const std::int64_t in_all = std::min(limits.max_connections, connections_that_fit());
-  arrival.ticket =
-      counter_.admit(counted, local ? kAny : in_all, limits.max_connections_per_address);
-  return arrival.ticket ? "" : "too many connections";
+  // What the process has, both kinds share.
+  const std::int64_t room = connections_that_fit() - local_counter_.count();
+  arrival.ticket = counter_.admit(counted, std::min(limits.max_connections, room), of_one);
+  return arrival.ticket ? "" : kTooMany;
 }
 
 void Listeners::accepted(const Listener& listener, Socket socket) {

@@ -24,8 +24,9 @@ namespace orv::server {
 
 class Listeners {
  public:
+  // `counter` is for connections over TCP, `local_counter` for those over Unix sockets.
   Listeners(asio::io_context& context, Services& services, ConnectionCounter& counter,
-            std::vector<std::unique_ptr<Loop>>& loops);
+            ConnectionCounter& local_counter, std::vector<std::unique_ptr<Loop>>& loops);
 
   // Opens a socket on each address (literal IPv4 or IPv6; none: every address of the host), for
   // connections that begin in clear or with TLS. With port 0 the first one's port, which the kernel
@@ -81,6 +82,7 @@ class Listeners {
   asio::io_context& context_;
   Services& services_;
   ConnectionCounter& counter_;
+  ConnectionCounter& local_counter_;
   std::vector<std::unique_ptr<Loop>>& loops_;
   std::vector<std::unique_ptr<Listener>> listeners_;
   LocalSocket local_;

@@ -105,7 +105,7 @@ struct Services {
   // administers the server on its own host. Null: there is none.
   asio::thread_pool* local_verifiers = nullptr;
   TlsHolder* tls = nullptr;                      // null: TLS is not offered
-  std::atomic<std::int64_t> unauthenticated{0};  // connections on which nobody is bound
+  std::atomic<std::int64_t> unauthenticated{0};  // TCP, nobody bound
   CutOffLog cut_offs{logs};
   FairQueue binds{verifiers};
   // Seconds of the epoch, for what ends at a date.

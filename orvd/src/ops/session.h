@@ -92,7 +92,10 @@ class Session : public OperationHome,
   // As whom the client takes turns with others where work queues.
   void set_counted_as(std::string_view address) { counted_as_ = address; }
   // What the transport proves; before the first message, and when TLS stands.
-  void set_transport(TransportFacts facts) { transport_ = std::move(facts); }
+  void set_transport(TransportFacts facts) {
+    transport_ = std::move(facts);
+    count_in_total();
+  }
   const TransportFacts& transport() const noexcept { return transport_; }
   // A search that runs on the connection's thread is canceled by a message that is here and has not
   // had its turn yet. Throws std::bad_alloc.
@@ -255,6 +258,7 @@ class Session : public OperationHome,
   void finish_bind(int code, std::string_view text, std::shared_ptr<const Identity> identity);
   void become(std::shared_ptr<const Identity> identity) noexcept;
   void count_as_unauthenticated(bool counted) noexcept;
+  void count_in_total() noexcept;
 
   // ---- paged results, in session_pages.cpp
   PagedSearches::Limits page_limits() const noexcept;
@@ -306,7 +310,8 @@ class Session : public OperationHome,
   std::string mechanism_;                   // of the exchange
   Clock::time_point exchange_begun_{};
   std::uint64_t exchange_generation_ = 0;  // of the identities when it began
-  bool unauthenticated_ = false;           // counted as such
+  bool unauthenticated_ = false;           // nobody is bound on the connection, and it is there
+  bool in_total_ = false;                  // and counts among those over TCP
   Clock::time_point unauthenticated_since_{};
   bool gone_ = false;
   bool starting_held_ = false;

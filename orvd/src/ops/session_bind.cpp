@@ -271,7 +271,13 @@ void Session::become(std::shared_ptr<const Identity> identity) noexcept {
 void Session::count_as_unauthenticated(bool counted) noexcept {
   if (std::exchange(unauthenticated_, counted) == counted) return;
   unauthenticated_since_ = Clock::now();
-  services_.unauthenticated.fetch_add(counted ? 1 : -1, std::memory_order_relaxed);
+  count_in_total();
+}
+
+void Session::count_in_total() noexcept {
+  const bool counts = unauthenticated_ && !transport_.local;
+  if (std::exchange(in_total_, counts) == counts) return;
+  services_.unauthenticated.fetch_add(counts ? 1 : -1, std::memory_order_relaxed);
 }
 
 }  // namespace orv::server
