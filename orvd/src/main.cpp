@@ -499,7 +499,7 @@ std::vector<FileInUse> files_of_keys(const Settings& settings) {
   const TlsSettings& tls = settings.tls;
   std::vector<FileInUse> files;
   for (const std::string& path :
-       {tls.certificate_file, tls.key_file, tls.ca_file, settings.sasl.keytab})
+       {tls.certificate_file, tls.key_file, tls.ca_file, tls.crl_file, settings.sasl.keytab})
     if (const FileIdentity file = file_at(path)) files.push_back({file, path});
   return files;
 }

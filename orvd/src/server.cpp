@@ -151,7 +151,6 @@ bool Server::load_certificate(const TlsSettings& settings, std::string& error) {
     const std::shared_ptr<const TlsContext> before = tls_.current();
     if (!before || before->description() != context->description())
       parts_.logs.info("certificate for TLS: " + context->description());
-    if (context->has_expired()) parts_.logs.warning("the certificate for TLS has expired");
   }
   tls_.put(std::move(context));
   return true;

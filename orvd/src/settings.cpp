@@ -179,6 +179,7 @@ bool read_tls(_CFG* session, Settings& settings, std::string& error) {
   if (!read_path(group, "orv-slapdTlsCertificateFile", tls.certificate_file, error) ||
       !read_path(group, "orv-slapdTlsKeyFile", tls.key_file, error) ||
       !read_path(group, "orv-slapdTlsCaFile", tls.ca_file, error) ||
+      !read_path(group, "orv-slapdTlsCrlFile", tls.crl_file, error) ||
       !read_word(group, "orv-slapdTlsMinimumVersion", kTlsVersions, version, error) ||
       !read_word(group, "orv-slapdTlsClientCertificate", kClientCertificates, clients, error))
     return false;
@@ -252,6 +253,8 @@ bool apply_tls_file(std::string_view name, std::string_view value, TlsSettings& 
     tls.key_file = value;
   } else if (name == "orv-slapdTlsCaFile") {
     tls.ca_file = value;
+  } else if (name == "orv-slapdTlsCrlFile") {
+    tls.crl_file = value;
   } else if (name == "orv-slapdTlsClientCertificate") {
     std::size_t word = 0;
     while (word < std::size(kClientCertificates) &&

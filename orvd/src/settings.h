@@ -23,7 +23,8 @@ struct TlsSettings {
   std::string key_file;          // PEM; "": the key is in the certificate file
   std::string ca_file;           // PEM: who may sign clients' certificates
   ClientCertificates client_certificates = ClientCertificates::none;
-  bool tls_1_2 = true;  // besides 1.3
+  bool tls_1_2 = true;     // besides 1.3
+  std::string crl_file{};  // PEM: what these have revoked; "": nothing is looked up
   bool operator==(const TlsSettings&) const = default;
 };
 

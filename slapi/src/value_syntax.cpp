@@ -243,6 +243,7 @@ constexpr TypeTest kTypeTests[] = {
     {"orv-slapdTlsCertificateFile", test_absolute_path},
     {"orv-slapdTlsKeyFile", test_absolute_path},
     {"orv-slapdTlsCaFile", test_absolute_path},
+    {"orv-slapdTlsCrlFile", test_absolute_path},
     {"orv-slapdKrbKeytab", test_absolute_path},
     {"orv-slapdLog", test_ascii_in_other_code_pages},
     {"orv-slapdPtaSubtree", test_ascii_in_other_code_pages},

@@ -312,6 +312,33 @@ def test_connection_ends_when_its_authority_is_taken_away(trusting, tmp_path, ho
     assert "DISCONNECT result=8 reason=" in server.access_log.read_text()
 
 
+def test_revoked_certificate_is_refused_and_its_connection_ends(trusting):
+    server, root, authority, pair = trusting
+    bob = authority.pair("bob")
+    modify(root, GROUP,
+           (ldap.MOD_ADD, "orv-slapdTlsCrlFile", [str(authority.revocations())]),
+           (ldap.MOD_ADD, "orv-slapdCertificateMap", ["cn=bob, o=Orv Tests => cn=root"]))
+    alice, other = connect(server, pair=pair), connect(server, pair=bob)
+    bind_external(alice)
+    bind_external(other)
+    authority.revocations(pair[0])
+    server.process.send_signal(signal.SIGHUP)
+    server.stderr.wait_for(lambda line: "(certificate revoked): closed" in line)
+    assert_ended(alice)
+    assert sees_passwords(other)
+    with pytest.raises(ldap.LDAPError):
+        bind_external(connect(server, pair=pair))
+    bind_external(connect(server, pair=bob))
+
+
+def test_list_of_revoked_certificates_that_is_none_is_refused(trusting, tmp_path):
+    _, root, _, pair = trusting
+    for path in (pair[0], tmp_path / "nothing"):
+        with pytest.raises(ldap.UNWILLING_TO_PERFORM) as refusal:
+            set_value(root, GROUP, "orv-slapdTlsCrlFile", str(path))
+        assert str(path) in refusal.value.args[0]["info"]
+
+
 def test_required_certificate_keeps_everybody_else_out(trusting):
     server, root, _, pair = trusting
     set_value(root, GROUP, "orv-slapdTlsClientCertificate", "required")
@@ -324,7 +351,8 @@ def test_required_certificate_keeps_everybody_else_out(trusting):
 # ---- who may change what is trusted
 
 SETTINGS = [("orv-slapdTlsCertificateFile", "/tmp/x"), ("orv-slapdTlsKeyFile", "/tmp/x"),
-            ("orv-slapdTlsCaFile", "/tmp/x"), ("orv-slapdTlsClientCertificate", "optional"),
+            ("orv-slapdTlsCaFile", "/tmp/x"), ("orv-slapdTlsCrlFile", "/tmp/x"),
+            ("orv-slapdTlsClientCertificate", "optional"),
             ("orv-slapdTlsMinimumVersion", "1.2"), ("orv-slapdTlsForPasswords", "FALSE"),
             ("orv-slapdTlsForLocalPasswords", "FALSE"),
             ("orv-slapdCertificateMap", "cn=x => cn=root")]

@@ -4,6 +4,7 @@
 
 #include <atomic>
 #include <ctime>
+#include <filesystem>
 #include <fstream>
 #include <sstream>
 
@@ -11,6 +12,7 @@
 #include "cfg/result_codes.h"
 #include "core_server_fixture.h"
 #include "core_tls_client.h"
+#include "net/tls.h"
 
 namespace orv::server {
 namespace {
@@ -243,6 +245,128 @@ TEST_F(ClientTrust, WhoseCertificateExpiresAfterARenewalLosesTheConnection) {
   expect_served(*client);
   let_time_pass(4000);
   expect_end(*client);
+}
+
+// ---- what authorities have revoked
+
+class Revoked : public ClientTrust {
+ protected:
+  Revoked() {
+    issuer = authority_pair("Issuer");
+    alice = certificates.signed_by(issuer, named("alice"));
+    bob = certificates.signed_by(issuer, named("bob"));
+    believe({issuer.certificate});
+    settings.tls.crl_file = certificates.path("crl");
+    publish(certificates.revoked_by(issuer, {}));
+  }
+  // In force after the next reload.
+  void publish(const std::string& lists) {
+    std::ofstream(settings.tls.crl_file, std::ios::trunc) << lists;
+  }
+  // Whether the server talks to a client that shows it, in either version of TLS.
+  bool accepted(const Pair& pair) {
+    int accepted = 0;
+    for (const int version : {TLS1_2_VERSION, TLS1_3_VERSION}) {
+      TlsClient client(server->secure_port());
+      client.shake_hands({version, version, &pair});
+      accepted += code_of(client, test::search(1, "")) == 0 ? 1 : 0;
+    }
+    EXPECT_NE(accepted, 1);
+    return accepted == 2;
+  }
+  // Why the server would not start.
+  std::string refusal() const {
+    std::string error;
+    return TlsContext::load(settings.tls, error) ? "" : error;
+  }
+
+  Pair issuer;
+  Pair bob;
+};
+
+TEST_F(Revoked, CertificateIsRefusedAndOthersOfItsAuthorityAreNot) {
+  publish(certificates.revoked_by(issuer, {bob}));
+  start();
+  EXPECT_FALSE(accepted(bob));
+  EXPECT_TRUE(accepted(alice));
+}
+
+TEST_F(Revoked, WhoIsThatLosesTheConnectionWhenTheListIsRead) {
+  start();
+  const auto client = bound();
+  const auto other_one = connect(bob);
+  bind_as_root(*other_one);
+  publish(certificates.revoked_by(issuer, {alice}));
+  server->reload();
+  expect_end(*client);
+  expect_served(*other_one);
+  EXPECT_NE(stop_and_read_log().find("(certificate revoked): closed"), std::string::npos);
+}
+
+TEST_F(Revoked, AuthoritiesBetweenAndTheirListsCountToo) {
+  Wording between = named("Between");
+  between.constraint = "critical,CA:TRUE";
+  const Pair middle = certificates.signed_by(issuer, between);
+  const Pair carol = certificates.signed_by(middle, named("carol"));
+  believe({issuer.certificate, middle.certificate});
+  const std::string of_middle = certificates.revoked_by(middle, {});
+  publish(certificates.revoked_by(issuer, {}) + of_middle);
+  start();
+  EXPECT_TRUE(accepted(carol));
+  publish(certificates.revoked_by(issuer, {middle}) + of_middle);
+  server->reload();
+  EXPECT_FALSE(accepted(carol));
+  EXPECT_TRUE(accepted(alice));
+}
+
+TEST_F(Revoked, AuthorityWithoutAListLetsNobodyIn) {
+  believe({issuer.certificate, other.certificate});
+  const Pair dave = certificates.signed_by(other, named("dave"));
+  start();
+  EXPECT_TRUE(accepted(alice));
+  EXPECT_FALSE(accepted(dave));
+  publish(certificates.revoked_by(issuer, {}) + certificates.revoked_by(other, {}));
+  server->reload();
+  EXPECT_TRUE(accepted(dave));
+}
+
+TEST_F(Revoked, ListThatIsTooOldLetsNobodyIn) {
+  publish(certificates.revoked_by(issuer, {}, -3600));
+  start();
+  EXPECT_FALSE(accepted(alice));
+}
+
+TEST_F(Revoked, ListThatCannotBeUsedDoesNotReplaceTheOneInForce) {
+  publish(certificates.revoked_by(issuer, {bob}));
+  start();
+  const auto client = bound();
+  const std::string good = certificates.revoked_by(issuer, {});
+  const std::string file = settings.tls.crl_file;
+  // Of another authority with the same name.
+  const std::string forged = certificates.revoked_by(authority_pair("Issuer"), {});
+  for (const std::string& bad :
+       {std::string(), std::string("nonsense"), good.substr(0, good.size() / 2),
+        good + good.substr(0, 100), forged}) {
+    publish(bad);
+    EXPECT_EQ(refusal().find(file + ": "), 0U) << bad;
+    server->reload();
+    expect_served(*client);
+    EXPECT_FALSE(accepted(bob));
+  }
+  std::filesystem::remove(file);
+  EXPECT_EQ(refusal(), file + ": No such file or directory");
+  server->reload();
+  expect_served(*client);
+  EXPECT_FALSE(accepted(bob));
+  const std::string log = stop_and_read_log();
+  EXPECT_NE(log.find("TLS stays as it was: " + file + ": no usable list"), std::string::npos);
+  EXPECT_NE(log.find("is not signed by its authority"), std::string::npos) << log;
+}
+
+TEST_F(Revoked, ListsAreNotReadWhereNobodyIsAskedForACertificate) {
+  settings.tls.client_certificates = ClientCertificates::none;
+  std::filesystem::remove(settings.tls.crl_file);
+  EXPECT_EQ(refusal(), "");
 }
 
 }  // namespace

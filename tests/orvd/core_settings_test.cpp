@@ -152,12 +152,14 @@ TEST_F(SettingsTest, OfTlsAreReadFromTheContainerOfTheGroup) {
   const std::string file = configuration(
       "orv-slapdSecurePort: 1636\norv-slapdLocalSocket: /run/orv/ldapi\n",
       group("orv-slapdTlsCertificateFile: /c\norv-slapdTlsKeyFile: /k\norv-slapdTlsCaFile: /a\n"
+            "orv-slapdTlsCrlFile: /r\n"
             "orv-slapdTlsClientCertificate: Required\norv-slapdTlsMinimumVersion: 1.3\n"
             "orv-slapdTlsForPasswords: FALSE\norv-slapdTlsForLocalPasswords: TRUE\n"));
   ASSERT_TRUE(read_settings(file, "", settings, error)) << error;
   EXPECT_EQ(settings.secure_port, 1636);
   EXPECT_EQ(settings.local_socket, "/run/orv/ldapi");
-  EXPECT_EQ(settings.tls, (TlsSettings{"/c", "/k", "/a", ClientCertificates::required, false}));
+  EXPECT_EQ(settings.tls,
+            (TlsSettings{"/c", "/k", "/a", ClientCertificates::required, false, "/r"}));
   EXPECT_FALSE(settings.tls_for_passwords);
   EXPECT_TRUE(settings.tls_for_local_passwords);
 }
@@ -173,8 +175,9 @@ TEST_F(SettingsTest, OfTlsAreOfNoEffectAnywhereElse) {
 }
 
 TEST_F(SettingsTest, OfTlsThatAreNoneAreRefusedByName) {
-  for (const std::string name : {"orv-slapdTlsClientCertificate", "orv-slapdTlsMinimumVersion",
-                                 "orv-slapdTlsCaFile", "orv-slapdTlsKeyFile"}) {
+  for (const std::string name :
+       {"orv-slapdTlsClientCertificate", "orv-slapdTlsMinimumVersion", "orv-slapdTlsCaFile",
+        "orv-slapdTlsKeyFile", "orv-slapdTlsCrlFile"}) {
     const std::string file = configuration("", group(name + ": 1.1\n"));
     EXPECT_FALSE(read_settings(file, "", settings, error));
     EXPECT_NE(error.find(name), std::string::npos) << error;

@@ -10,8 +10,11 @@
 #include <sys/stat.h>
 #include <sys/time.h>
 
+#include <algorithm>
 #include <cstdio>
 #include <filesystem>
+#include <fstream>
+#include <sstream>
 #include <stdexcept>
 
 namespace orv::server::test {
@@ -118,6 +121,38 @@ Pair Certificates::of_client(const Wording& wording) {
 
 Pair Certificates::signed_by(const Pair& issuer, const Wording& wording) {
   return make(wording, &issuer);
+}
+
+std::string Certificates::revoked_by(const Pair& issuer, const std::vector<Pair>& revoked,
+                                     long ends) {
+  X509* const parent = read_certificate(issuer.certificate);
+  EVP_PKEY* const key = read_key(issuer.key);
+  X509_CRL* const list = X509_CRL_new();
+  ASN1_TIME* const now = X509_gmtime_adj(nullptr, std::min(ends, 0L) - 60);
+  ASN1_TIME* const next = X509_gmtime_adj(nullptr, ends);
+  must(parent && key && list && now && next);
+  must(X509_CRL_set_version(list, X509_CRL_VERSION_2) == 1 &&
+       X509_CRL_set_issuer_name(list, X509_get_subject_name(parent)) == 1 &&
+       X509_CRL_set1_lastUpdate(list, now) == 1 && X509_CRL_set1_nextUpdate(list, next) == 1);
+  for (const Pair& pair : revoked) {
+    X509* const certificate = read_certificate(pair.certificate);
+    X509_REVOKED* const entry = X509_REVOKED_new();
+    must(X509_REVOKED_set_serialNumber(entry, X509_get_serialNumber(certificate)) == 1 &&
+         X509_REVOKED_set_revocationDate(entry, now) == 1 &&
+         X509_CRL_add0_revoked(list, entry) == 1);
+    X509_free(certificate);
+  }
+  must(X509_CRL_sort(list) == 1 && X509_CRL_sign(list, key, EVP_sha256()) > 0);
+  const std::string file = path("list" + std::to_string(++made_));
+  must(PEM_write_X509_CRL(open_file(file, "w").get(), list) == 1);
+  ASN1_TIME_free(now);
+  ASN1_TIME_free(next);
+  X509_CRL_free(list);
+  EVP_PKEY_free(key);
+  X509_free(parent);
+  std::stringstream text;
+  text << std::ifstream(file).rdbuf();
+  return text.str();
 }
 
 // ---- the client

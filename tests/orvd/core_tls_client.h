@@ -47,6 +47,8 @@ class Certificates {
   Pair of_client(const std::string& name);
   Pair of_client(const Wording& wording);
   Pair signed_by(const Pair& issuer, const Wording& wording);
+  // A list in PEM of what an authority has revoked, which a newer one follows in so many seconds.
+  std::string revoked_by(const Pair& issuer, const std::vector<Pair>& revoked, long ends = 3600);
   const std::string& authority();
   std::string path(const std::string& name) const { return folder_ + "/" + name; }
 

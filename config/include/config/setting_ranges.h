@@ -88,7 +88,8 @@ constexpr bool is_digest_realm(std::string_view value) noexcept {
 // Settings whose values are absolute paths of files.
 inline constexpr std::string_view kPathSettings[] = {
     "orv-slapdLog",        "orv-slapdLocalSocket", "orv-slapdTlsCertificateFile",
-    "orv-slapdTlsKeyFile", "orv-slapdTlsCaFile",   "orv-slapdKrbKeytab",
+    "orv-slapdTlsKeyFile", "orv-slapdTlsCaFile",   "orv-slapdTlsCrlFile",
+    "orv-slapdKrbKeytab",
 };
 
 // Values of orv-slapdLogLevel, in any letter case.

@@ -31,6 +31,11 @@ bool fail(std::string& error, const std::string& file, const std::string& what) 
   return false;
 }
 
+std::time_t seconds_of(const ASN1_TIME* time) noexcept {
+  std::tm parts{};
+  return ASN1_TIME_to_tm(time, &parts) == 1 ? ::timegm(&parts) : 0;
+}
+
 int no_passphrase(char*, int, int, void*) {
   return -1;
 }

@@ -8,6 +8,7 @@
 #include <openssl/x509.h>
 #include <sys/stat.h>
 
+#include <ctime>
 #include <memory>
 #include <string>
 
@@ -29,6 +30,9 @@ std::string queued_error();
 
 // Puts the file, what is wrong with it and the queued error into `error`; false.
 bool fail(std::string& error, const std::string& file, const std::string& what);
+
+// Seconds of the epoch; 0 for a time that cannot be read, which has passed then.
+std::time_t seconds_of(const ASN1_TIME* time) noexcept;
 
 // For OpenSSL, in the place of somebody who could be asked for a passphrase.
 int no_passphrase(char* to, int size, int writing, void* data);

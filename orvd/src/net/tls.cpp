@@ -140,7 +140,7 @@ std::shared_ptr<const TlsContext> TlsContext::load(const TlsSettings& settings,
     error = "OpenSSL does not know the suites: " + queued_error();
     return nullptr;
   }
-  std::string trust;
+  Trust trust;
   if (!load_own(made.get(), settings, error) || !load_trust(made.get(), settings, trust, error))
     return nullptr;
   const std::shared_ptr<TlsContext> context(new TlsContext(made.release()));
@@ -149,7 +149,7 @@ std::shared_ptr<const TlsContext> TlsContext::load(const TlsSettings& settings,
   context->end_point_ = end_point_of(certificate);
   context->description_ = ldap_name(X509_get_subject_name(certificate)) + ", good until " +
                           time_text(X509_get0_notAfter(certificate));
-  context->expired_ = X509_cmp_current_time(X509_get0_notAfter(certificate)) < 0;
+  context->good_until_ = seconds_of(X509_get0_notAfter(certificate));
   ERR_clear_error();
   return context;
 }

@@ -38,17 +38,20 @@ class TlsContext {
   const std::string& end_point() const noexcept { return end_point_; }
   // For the log: subject and end of the server's certificate.
   const std::string& description() const noexcept { return description_; }
-  bool has_expired() const noexcept { return expired_; }
+  // When that ends, in seconds of the epoch.
+  std::time_t good_until() const noexcept { return good_until_; }
   // Names which certificates of clients are believed (load_trust).
-  const std::string& trust() const noexcept { return trust_; }
+  const std::string& trust() const noexcept { return trust_.name; }
+  // When lists of revoked certificates are too old (Trust).
+  std::time_t revocations_good_until() const noexcept { return trust_.revocations_good_until; }
 
  private:
   explicit TlsContext(ssl_ctx_st* context) noexcept : context_(context) {}
   ssl_ctx_st* const context_;
   std::string end_point_;
   std::string description_;
-  std::string trust_;
-  bool expired_ = false;
+  Trust trust_;
+  std::time_t good_until_ = 0;
 };
 
 // The context for connections that begin TLS from now on.

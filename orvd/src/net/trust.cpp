@@ -26,6 +26,11 @@ struct InfosReleaser {
     sk_X509_INFO_pop_free(infos, X509_INFO_free);
   }
 };
+struct ObjectsReleaser {
+  void operator()(STACK_OF(X509) * objects) const noexcept { sk_X509_pop_free(objects, X509_free); }
+};
+using Objects = std::unique_ptr<STACK_OF(X509), ObjectsReleaser>;
+using RevocationList = std::unique_ptr<X509_CRL, Releaser<X509_CRL_free>>;
 using Infos = std::unique_ptr<STACK_OF(X509_INFO), InfosReleaser>;
 using Verification = std::unique_ptr<X509_STORE_CTX, Releaser<X509_STORE_CTX_free>>;
 
@@ -53,22 +58,70 @@ bool add_authorities(SSL_CTX* context, BIO* from) {
   return added > 0;
 }
 
-bool load_authorities(SSL_CTX* context, const std::string& file, std::string& trust,
-                      std::string& error) {
+// A list that bears the name of an authority of the file is signed by it; others may be of
+// authorities that clients send along, and are looked at when they do.
+bool is_plausible(SSL_CTX* context, X509_CRL* list) {
+  const Objects known(X509_STORE_get1_all_certs(SSL_CTX_get_cert_store(context)));
+  bool named = false;
+  for (int i = 0; i < sk_X509_num(known.get()); ++i) {
+    X509* const authority = sk_X509_value(known.get(), i);
+    if (X509_NAME_cmp(X509_get_subject_name(authority), X509_CRL_get_issuer(list)) != 0) continue;
+    named = true;
+    if (X509_CRL_verify(list, X509_get0_pubkey(authority)) == 1) return true;
+  }
+  ERR_clear_error();
+  return !named;
+}
+
+// What happened to the lists of a file.
+enum class Lists { added, damaged, forged };
+
+Lists add_revocations(SSL_CTX* context, BIO* from, std::time_t& good_until) {
+  int added = 0;
+  for (;; ++added) {
+    const RevocationList list(PEM_read_bio_X509_CRL(from, nullptr, no_passphrase, nullptr));
+    if (!list) break;
+    if (!is_plausible(context, list.get())) return Lists::forged;
+    if (X509_STORE_add_crl(SSL_CTX_get_cert_store(context), list.get()) != 1) return Lists::damaged;
+    if (const ASN1_TIME* const next = X509_CRL_get0_nextUpdate(list.get()))
+      good_until = std::min(good_until, seconds_of(next));
+  }
+  if (added == 0 || ERR_GET_REASON(ERR_peek_last_error()) != PEM_R_NO_START_LINE)
+    return Lists::damaged;
+  ERR_clear_error();  // that is how the end of the file is told
+  return Lists::added;
+}
+
+// From now on each authority up to the root must have said what it has revoked.
+bool load_revocations(SSL_CTX* context, const std::string& file, Trust& trust, std::string& error) {
+  PemText text;
+  if (!text.read(file, PemText::Holds::certificates, PemText::kMostOfRevocations, error))
+    return false;
+  const Bio bio = text.bio();
+  if (!bio) throw std::bad_alloc();
+  switch (add_revocations(context, bio.get(), trust.revocations_good_until)) {
+    case Lists::damaged:
+      return fail(error, file, "no usable list of revoked certificates");
+    case Lists::forged:
+      return fail(error, file, "a list of revoked certificates is not signed by its authority");
+    case Lists::added:
+      break;
+  }
+  X509_VERIFY_PARAM_set_flags(SSL_CTX_get0_param(context),
+                              X509_V_FLAG_CRL_CHECK | X509_V_FLAG_CRL_CHECK_ALL);
+  trust.name += hash_of(text.text());
+  return true;
+}
+
+bool load_authorities(SSL_CTX* context, const std::string& file, Trust& trust, std::string& error) {
   PemText text;
   if (!text.read(file, PemText::Holds::certificates, PemText::kMostOfAuthorities, error))
     return false;
   const Bio bio = text.bio();
   if (!bio || !add_authorities(context, bio.get()))
     return fail(error, file, "no usable certificates");
-  trust += hash_of(text.text());
+  trust.name += hash_of(text.text());
   return true;
-}
-
-std::time_t seconds_of(const ASN1_TIME* time) {
-  std::tm parts{};
-  // What cannot be read has passed.
-  return ASN1_TIME_to_tm(time, &parts) == 1 ? ::timegm(&parts) : 0;
 }
 
 std::time_t first_end(const STACK_OF(X509) * chain) {
@@ -80,9 +133,7 @@ std::time_t first_end(const STACK_OF(X509) * chain) {
 
 }  // namespace
 
-bool load_trust(SSL_CTX* context, const TlsSettings& settings, std::string& trust,
-                std::string& error) {
-  trust.clear();
+bool load_trust(SSL_CTX* context, const TlsSettings& settings, Trust& trust, std::string& error) {
   if (settings.client_certificates == ClientCertificates::none) return true;
   if (settings.ca_file.empty()) {
     error =
@@ -90,6 +141,8 @@ bool load_trust(SSL_CTX* context, const TlsSettings& settings, std::string& trus
     return false;
   }
   if (!load_authorities(context, settings.ca_file, trust, error)) return false;
+  if (!settings.crl_file.empty() && !load_revocations(context, settings.crl_file, trust, error))
+    return false;
   const bool required = settings.client_certificates == ClientCertificates::required;
   SSL_CTX_set_verify(context, SSL_VERIFY_PEER | (required ? SSL_VERIFY_FAIL_IF_NO_PEER_CERT : 0),
                      nullptr);

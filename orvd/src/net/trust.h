@@ -6,18 +6,28 @@
 #include <openssl/types.h>
 
 #include <ctime>
+#include <limits>
 #include <string>
 
 #include "settings.h"
 
 namespace orv::server {
 
+// What is believed.
+struct Trust {
+  static constexpr std::time_t kForEver = std::numeric_limits<std::time_t>::max();
+  // Equal names, equal judgements, but for time; "" when nobody is asked for a certificate.
+  std::string name{};
+  // When a newer one should have come for one of the lists of revoked certificates, in seconds of
+  // the epoch: from then on certificates of its authority are refused.
+  std::time_t revocations_good_until = kForEver;
+};
+
 // Has `context` ask clients for certificates as the settings say, and believe those that the
-// authorities of the file have signed. `trust` names what is believed: equal texts, equal
-// judgements, but for time; "" when nobody is asked. False with the cause and the file in `error`.
+// authorities of the file have signed and not revoked; where there is a file for that, each
+// authority up to the root must have a list there. False with the cause and the file in `error`.
 // Throws std::bad_alloc.
-bool load_trust(ssl_ctx_st* context, const TlsSettings& settings, std::string& trust,
-                std::string& error);
+bool load_trust(ssl_ctx_st* context, const TlsSettings& settings, Trust& trust, std::string& error);
 
 // What there is to say about the certificate that a client has shown.
 struct Judgement {

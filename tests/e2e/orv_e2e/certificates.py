@@ -35,3 +35,15 @@ class Authority:
                  "-CAcreateserial", "-days", str(days), "-extfile", extensions, "-out", certificate)
         key.chmod(0o600)
         return certificate, key
+
+    def revocations(self, *certificates):
+        """The path of the list of these and of all that were revoked before, in PEM."""
+        database, rules, result = (self.folder / name for name in ("index", "rules", "ca.crl"))
+        database.touch()
+        rules.write_text("[ca]\ndefault_ca=own\n[own]\ndatabase=%s\ndefault_md=sha256\n"
+                         "default_crl_days=1\n" % database)
+        own = ["ca", "-config", rules, "-cert", self.certificate, "-keyfile", self.key]
+        for certificate in certificates:
+            _openssl(*own, "-revoke", certificate)
+        _openssl(*own, "-gencrl", "-out", result)
+        return result
