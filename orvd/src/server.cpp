@@ -253,7 +253,24 @@ void Server::watch_gate() {
     const Clock::time_point now = Clock::now();
     backend_.gate().expire(now);
     services_.cut_offs.tick(now);
+    remind_of_expiry();
   }));
+}
+
+void Server::remind_of_expiry() {
+  using Due = ExpiryReminder::Due;
+  const std::shared_ptr<const TlsContext> tls = tls_.current();
+  if (!tls) return;
+  const std::time_t now = services_.wall_time();
+  const Due own = certificate_end_.due(tls->end_point(), tls->good_until(), now);
+  if (own == Due::has_ended)
+    parts_.logs.warning("the certificate for TLS has expired: " + tls->description());
+  if (own == Due::ends_soon)
+    parts_.logs.warning("the certificate for TLS expires within 30 days: " + tls->description());
+  if (revocations_end_.due(tls->trust(), tls->revocations_good_until(), now) == Due::has_ended)
+    parts_.logs.warning(
+        "a list in orv-slapdTlsCrlFile is too old: nobody with a certificate of its authority is "
+        "let in");
 }
 
 // Reading may take long: workers do it, one at a time.

@@ -18,6 +18,7 @@
 #include <string>
 #include <vector>
 
+#include "net/expiry.h"
 #include "net/limits.h"
 #include "net/listener.h"
 #include "net/loop.h"
@@ -109,6 +110,7 @@ class Server {
   bool load_certificate(const TlsSettings& settings, std::string& error);
   void renew_certificate(Settings& wanted);
   void tell_what_is_missing();
+  void remind_of_expiry();
   void control();
   bool go_on() noexcept;
   void watch_gate();
@@ -134,6 +136,9 @@ class Server {
   std::atomic<std::size_t> turning_{0};  // loops that have answered since they were asked
   BackendHost backend_;
   TlsHolder tls_;
+  // Used by the control thread.
+  ExpiryReminder certificate_end_{30 * ExpiryReminder::kDay};
+  ExpiryReminder revocations_end_{0};
   Services services_;
   ConnectionCounter counter_;        // over TCP
   ConnectionCounter local_counter_;  // over the Unix socket
