@@ -3,6 +3,8 @@
 import os
 import re
 import signal
+import socket
+import ssl
 import string
 import subprocess
 import sys
@@ -229,6 +231,31 @@ def test_keys_are_only_in_memory_that_no_core_dump_shows(request, tmp_path):
     assert next(places_of(pid, stash), None) and next(places_of(pid, private[::-1]), None)
     line = (server.directory / "tls.key").read_text().splitlines()[1].encode()
     assert not holds(pid, line[8:-8]) and not holds(pid, stash.hex().encode())
+
+
+@pytest.mark.parametrize("secure", [False, True])
+def test_passwords_on_their_way_are_only_in_memory_that_no_core_dump_shows(request, tmp_path,
+                                                                           secure):
+    server = reader(request, tmp_path)
+    if server is None:
+        return
+    password = b"Vb6$" + b"kXr2&uDe" * 600  # more than one reading
+    bind = wire.bind_request(1, "cn=root", password)
+    client = socket.create_connection((server.host, server.secure_port if secure else server.port),
+                                      programs.DEADLINE)
+    if secure:
+        context = ssl.SSLContext(ssl.PROTOCOL_TLS_CLIENT)
+        context.check_hostname = False
+        context.verify_mode = ssl.CERT_NONE
+        client = context.wrap_socket(client)
+    with client:
+        client.sendall(bind[:-1])
+        until = time.monotonic() + programs.DEADLINE
+        while not holds(server.process.pid, password[:-1]):  # all of it has been read
+            assert time.monotonic() < until
+        for part in (password[:24], password[-24:-1]):
+            places = list(places_of(server.process.pid, part))
+            assert places and all("dd" in flags for flags in places), places
 
 
 def test_no_core_dump_is_written(instance):

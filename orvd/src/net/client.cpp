@@ -323,7 +323,7 @@ bool Client::unwrap(std::string_view wire) {
   std::memmove(in_.data(), in_.data() + begin_, end_ - begin_);
   end_ -= std::exchange(begin_, 0);
   if (end_ == 0) make_room();
-  if (in_.size() - end_ < clear.size()) in_.resize(end_ + clear.size());
+  if (in_.size() - end_ < clear.size()) in_.resize(end_ + clear.size(), end_);
   std::memcpy(in_.data() + end_, clear.data(), clear.size());
   end_ += clear.size();
   cfg::wipe(clear);
@@ -335,7 +335,7 @@ bool Client::unwrap(std::string_view wire) {
 void Client::make_room() {
   if (begin_ == end_) {
     begin_ = end_ = 0;
-    if (in_.size() > kReadBytes) std::vector<char>(kReadBytes).swap(in_);
+    if (in_.size() > kReadBytes) in_.resize(kReadBytes, 0);
   }
   if (end_ < in_.size()) return;
   // What moves leaves no password behind.
@@ -345,10 +345,7 @@ void Client::make_room() {
     cfg::wipe(in_.data() + end_, end - end_);
     begin_ = 0;
   } else {
-    std::vector<char> larger(in_.size() * 2);
-    std::copy(in_.begin(), in_.end(), larger.begin());
-    in_.swap(larger);
-    cfg::wipe(larger.data(), larger.size());
+    in_.resize(in_.size() * 2, end_);
   }
 }
 

@@ -19,12 +19,12 @@
 #include <memory>
 #include <string>
 #include <string_view>
-#include <vector>
 
 #include "descriptor.h"
 #include "net/limits.h"
 #include "net/loop.h"
 #include "net/pace.h"
+#include "net/receive_buffer.h"
 #include "net/tls.h"
 #include "ops/session.h"
 
@@ -158,7 +158,7 @@ class Client final : public Session {
   std::unique_ptr<TlsStream> stream_;     // once its handshake has begun
   std::unique_ptr<SecurityLayer> layer_;  // null: none
 
-  std::vector<char> in_;  // bytes [begin_, end_) are received and not handled yet
+  ReceiveBuffer in_;  // bytes [begin_, end_) are received and not handled yet
   std::size_t begin_ = 0;
   std::size_t end_ = 0;
   bool processing_ = false;
