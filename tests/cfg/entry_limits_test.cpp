@@ -1,6 +1,8 @@
 // How large changes may make an entry.
 #include "cfg/entry_limits.h"
 
+#include <utility>
+
 #include "change_fixture.h"
 
 namespace orv::cfg_test {
@@ -15,8 +17,8 @@ class EntryLimitsTest : public ChangeTest {
   int change(const NewEntry& list) {
     const CfgSession session = open_for_change(content_);
     const int rc = modify(session, "cn=a,cn=top", list);
-    if (rc != 0) EXPECT_EQ(read_file(path_), content_);
-    content_ = read_file(path_);
+    const std::string before = std::exchange(content_, read_file(path_));
+    EXPECT_EQ(content_ == before, rc != 0);
     return rc;
   }
   int add_entry(const NewEntry& list) {

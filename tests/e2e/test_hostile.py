@@ -279,6 +279,8 @@ def test_requests_of_the_largest_size_take_no_time(server):
             call(*arguments)
         except (ldap.TYPE_OR_VALUE_EXISTS, ldap.NO_SUCH_ATTRIBUTE):
             pass
+        except ldap.ADMINLIMIT_EXCEEDED:  # more values than an entry may have
+            assert name == "values added"
         assert used.seconds() < SLOW, name
     root.delete_s(dn)
     root.unbind_s()
