@@ -229,10 +229,12 @@ def test_other_descriptors_are_closed_and_standard_input_is_empty(instance, tmp_
 @users.needs_root
 def test_environment_of_whoever_started_it_is_gone(instance, notices):
     marker = "Marker-5c1e-environment"
-    instance.start(environment={"ORV_TEST_TOKEN": marker, "NOTIFY_SOCKET": notices.path, "TZ": "UTC"})
+    instance.start(environment={"ORV_TEST_TOKEN": marker, "NOTIFY_SOCKET": notices.path, "TZ": "UTC",
+                                "AUTOLOCKTYPE": "REGULARLOCK"})
     environment = pathlib.Path("/proc/%d/environ" % instance.process.pid).read_bytes()
     assert marker.encode() not in environment
     assert b"TZ=UTC" in environment
+    assert b"AUTOLOCKTYPE=REGULARLOCK" in environment
 
 
 def test_blocked_and_ignored_signals_of_whoever_started_it_do_not_matter(instance):

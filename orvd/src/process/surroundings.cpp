@@ -25,6 +25,7 @@ namespace {
 constexpr std::string_view kKept[] = {
     "LANG", "LANGUAGE", "LC_*", "LOCPATH", "NLSPATH", "CHARSET", "OUTPUT_CHARSET", "GCONV_PATH",
     "TZ", "TZDIR", "TMPDIR", "OPENSSL_*", "SSL_CERT_*", "KRB5*",
+    "AUTOLOCKTYPE",  // how plug-ins wait for their locks
     // of sanitizers, coverage and the allocator
     "ASAN_*", "LSAN_*", "TSAN_*", "UBSAN_*", "GCOV_*", "MALLOC_*", "GLIBC_TUNABLES"};
 
