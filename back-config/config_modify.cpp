@@ -1041,7 +1041,8 @@ int check_new_password(const ldtr_function_local& trace, Operation* operation, _
   rc = verify_admin_password(password.get(), old.text, operation);
   if (rc != 0) return rc;
 
-  // The server looks at the mark; whether lockout is on is asked without use, as it always was.
+  // The server looks at the mark. Whether lockout is on is asked without use; kept as it is: the
+  // server may count on being asked.
   static_cast<void>(pwdIsAdminPasswordLockoutOn());
   AdminPasswordRecord* const failures = findAdminPWDPAttrib(dn.get());
   if (failures != nullptr) failures->changed = 1;
@@ -1464,8 +1465,9 @@ int config_back_modify(pblock* pb) {
   // 4. Who is kept out and what a supplier may do, then what the schema has against it.
   rc = check_flags(request);
 
-  // 5. What is to be written. Released in step 11 after a success only: on every other way it is
-  // left, as it always was. Who may get here, and how often, is bounded by the server.
+  // 5. What is to be written. Released in step 8 for its successor, and in step 11 after a success;
+  // on every other way it is left. Kept as it is: who may get here, and how often, is bounded by
+  // the server.
   ldapmod** copy = nullptr;
   if (rc == 0) rc = copy_modifications(request.modifications, copy);
 

@@ -515,8 +515,8 @@ TEST_F(Add, WritesTheTranslatedEntryUnderTheClientsDn) {
   make("cn=K\xC3\xA4se , cn=Configuration",
        {{"objectClass", {"top", "x"}}, {"cn", {"K\xC3\xA4se"}}});
   EXPECT_EQ(add(), 0);
-  EXPECT_THAT(platform.calls({"ldcf_api_schema_check", "cfg_add_s"}),
-              ElementsAre("ldcf_api_schema_check(entry, 0, 0)",
+  EXPECT_THAT(platform.calls({"ldcf_api_schema_check", "checkReferral", "cfg_add_s"}),
+              ElementsAre("ldcf_api_schema_check(entry, 0, 0)", "checkReferral(entry)",
                           "cfg_add_s(session, \"cn=K\xE4se , cn=Configuration\", "
                           "\"0 objectClass=top,x|0 cn=K\xE4se\")"));
 }
@@ -676,6 +676,16 @@ TEST_F(Add, NoHandleGives90AnsweredAndKeepsTheLock) {
   EXPECT_TRUE(locked());
 }
 
+TEST_F(Add, ExceptionOfTheLibraryGives1AnsweredAndLeavesNothing) {
+  platform.at("cfg_init", 1, [] { throw 42; });
+  EXPECT_EQ(add(), 1);
+  expect_answered(1);
+  EXPECT_FALSE(locked());
+  EXPECT_EQ(platform.count("pthread_mutex_unlock"), 1);
+  EXPECT_EQ(platform.count("cfg_unbind"), 0);
+  EXPECT_EQ(connection.config_session, nullptr);
+}
+
 TEST_F(Add, LockThatCannotBeTakenGives80Answered) {
   platform.fail("pthread_mutex_lock", 1, 22);
   EXPECT_EQ(add(), 80);
@@ -778,6 +788,17 @@ INSTANTIATE_TEST_SUITE_P(
                 {},
                 "verify_admin_password"}),
     [](const testing::TestParamInfo<Refusal>& refusal) { return refusal.param.name; });
+
+TEST_F(Add, MemberWhoseDnIsTakenIsAnsweredWith68AndAnEmptyText) {
+  make("cn=m,cn=admingroup,cn=configuration",
+       {{"objectClass", {"top", "orv-slapdConfigEntry", "orv-slapdAdminGroupMember"}},
+        {"orv-slapdAdminDN", {"cn=root"}}});
+  exists(kGroup);
+  platform.file[kConfiguration] = {{{kConfiguration, {{"orv-slapdAdminDN", {"CN=ROOT"}}}}}};
+  EXPECT_EQ(add(), 68);
+  expect_answered(68);
+  expect_at_rest();
+}
 
 TEST_F(Add, PasswordIsNotLookedAtWhileThePolicyIsOff) {
   make(kEntry, {{"objectClass", {"top"}}, {"orv-slapdMasterPW", {"weak"}}});

@@ -392,6 +392,16 @@ TEST_F(Delete, NoHandleGives90UnansweredAndKeepsTheLock) {
   EXPECT_TRUE(locked());
 }
 
+TEST_F(Delete, ExceptionOfTheLibraryGives1UnansweredAndLeavesNothing) {
+  platform.at("cfg_init", 1, [] { throw 42; });
+  EXPECT_EQ(remove(), 1);
+  EXPECT_EQ(platform.count("send_ldap_result"), 0);
+  EXPECT_FALSE(locked());
+  EXPECT_EQ(platform.count("pthread_mutex_unlock"), 1);
+  EXPECT_EQ(platform.count("cfg_unbind"), 0);
+  EXPECT_EQ(connection.config_session, nullptr);
+}
+
 TEST_F(Delete, LockThatCannotBeTakenGives80Unanswered) {
   platform.fail("pthread_mutex_lock", 1, 22);
   EXPECT_EQ(remove(), 80);
@@ -414,6 +424,23 @@ TEST_F(Delete, MissingEntryIsAnsweredWith32ByTheAuthorityCheck) {
   expect_answered(32);
   expect_at_rest();
   EXPECT_EQ(platform.count("cfg_delete_s"), 0);
+}
+
+TEST_F(Delete, EntryIsReadBeforeItIsAskedWhetherItIsForThePrimaryAdministrator) {
+  as(kGroupMember);
+  operation.roles = 0x3E;
+  for (const char* dn : {kGroup, kMember, kKerberos, kDigest}) {
+    SCOPED_TRACE(dn);
+    target(dn);
+    platform.file.clear();
+    platform.forget();
+    EXPECT_EQ(remove(), 32);
+    expect_answered(32);
+    platform.file[dn] = {{{dn, {}}}};
+    platform.forget();
+    EXPECT_EQ(remove(), 16);
+    expect_answered(16);
+  }
 }
 
 TEST_F(Delete, EntryWithoutObjectClassesIsAnsweredWith16) {

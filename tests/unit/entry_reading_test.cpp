@@ -57,7 +57,7 @@ TEST_F(Reading, ConverterCodesComeBackUnchangedAndTraced) {
 class ReadOneAttribute : public Reading {
  protected:
   int read(const char* dn = "CN=X") {
-    return platform.run([&] { return cfg_read_cfg_entry(session, dn, "cn", 2, &chain); });
+    return traced(0x01050300, [&] { return cfg_read_cfg_entry(session, dn, "cn", 2, &chain); });
   }
   _CFGMessage* chain = nullptr;
 };
@@ -137,7 +137,10 @@ class ConvertRecord : public Reading {
     Reading::TearDown();
   }
   std::string convert() {
-    made = platform.run([&] { return CFGMessage2EntryTrans(session, record); });
+    traced(0x01050400, [&] {
+      made = CFGMessage2EntryTrans(session, record);
+      return made == nullptr ? 90 : 0;
+    });
     return made == nullptr ? "null" : scripted::text_of(*made);
   }
 
@@ -177,6 +180,21 @@ TEST_F(ConvertRecord, ValueWithoutConversionKeepsLengthZero) {
   EXPECT_EQ(convert(), "CN=X|cn=");
   EXPECT_EQ(platform.calls({"attr_merge"}).front(), "attr_merge(\"cn\", \"<null 0>\", 1, 1, null)");
   EXPECT_EQ(made->attributes->values[0]->bv_len, 0U);
+}
+
+TEST_F(ConvertRecord, ConversionThatTouchesNoResultLeavesAnEmptyValue) {
+  of({"CN=X", {{"cn", {"a", "bad"}}}});
+  platform.results_left_alone = true;
+  platform.fail("xlate_localcp_to_utf8", 3, 21);
+  EXPECT_EQ(convert(), "CN=X|cn=a,");
+  EXPECT_EQ(platform.calls({"attr_merge"}).front(),
+            "attr_merge(\"cn\", \"a,<null 0>\", 1, 1, null)");
+}
+
+TEST_F(ConvertRecord, ArraysHaveRoomForTheirLastNull) {
+  of({"CN=X", {{"cn", {"a", "b"}}}});
+  convert();
+  EXPECT_THAT(platform.sizes, ElementsAre(sizeof(entry), 3 * sizeof(berval*), 3 * sizeof(berval)));
 }
 
 TEST_F(ConvertRecord, WalksAndReleasesInOrder) {
@@ -242,8 +260,8 @@ TEST_F(ConvertRecord, ErrorAtTheFirstAttributeGivesTheEntryWithItsDnOnly) {
   of({"CN=X", {{"cn", {"a"}}}});
   platform.fail("cfg_first_attribute", 1, 1);
   EXPECT_EQ(convert(), "CN=X");
-  EXPECT_THAT(platform.calls({"cfg_perror", "cfg_ber_free", "cfg_get_values"}),
-              Contains("cfg_perror(session, \"cfg_first_attribute\")"));
+  EXPECT_THAT(platform.calls({"cfg_perror"}),
+              ElementsAre("cfg_perror(session, \"cfg_first_attribute\")"));
   EXPECT_EQ(platform.count("cfg_get_values"), 0);
 }
 
@@ -251,7 +269,8 @@ TEST_F(ConvertRecord, ErrorNumberAfterTheFirstAttributeReleasesTheCursor) {
   of({"CN=X", {{"cn", {"a"}}}});
   platform.fail("cfg_get_errno", 2, 1);
   EXPECT_EQ(convert(), "CN=X");
-  EXPECT_EQ(platform.calls({"cfg_ber_free"}), std::vector<std::string>{"cfg_ber_free(cursor)"});
+  EXPECT_THAT(platform.calls({"cfg_perror", "cfg_ber_free", "cfg_get_values"}),
+              ElementsAre("cfg_perror(session, \"cfg_first_attribute\")", "cfg_ber_free(cursor)"));
 }
 
 TEST_F(ConvertRecord, ErrorAtValuesSkipsThatAttributeOnly) {
@@ -295,6 +314,23 @@ TEST_F(ConvertRecord, ErrorAtTheNextAttributeEndsTheWalk) {
   EXPECT_THAT(platform.calls({"cfg_perror"}),
               ElementsAre("cfg_perror(session, \"cfg_next_attribute\")"));
   EXPECT_EQ(platform.count("cfg_ber_free"), 1);
+}
+
+// Error numbers asked for: after the DN, the first attribute, its values, the next attribute.
+TEST_F(ConvertRecord, FailedCallsAreReportedAlsoWithoutTheDebugBit) {
+  debug_off();
+  of({"CN=X", {{"cn", {"a"}}}});
+  int nth = 0;
+  for (const char* call :
+       {"cfg_get_dn", "cfg_first_attribute", "cfg_get_values", "cfg_next_attribute"}) {
+    platform.forget();
+    platform.fail("cfg_get_errno", ++nth, 1);
+    convert();
+    EXPECT_THAT(platform.calls({"cfg_perror"}),
+                ElementsAre("cfg_perror(session, \"" + std::string(call) + "\")"));
+    entry_free(made);
+    made = nullptr;
+  }
 }
 
 TEST_F(ConvertRecord, TypesWithoutValuesBecomeAttributesWithoutValues) {
@@ -369,7 +405,7 @@ class RetrieveEntry : public Reading {
  protected:
   int retrieve(const char* dn = "CN=X") {
     found = reinterpret_cast<entry*>(this);
-    const int rc = platform.run([&] { return retrieve_entry(session, dn, &found); });
+    const int rc = traced(0x01050500, [&] { return retrieve_entry(session, dn, &found); });
     EXPECT_EQ(found == nullptr, rc != 0);
     return rc;
   }
@@ -421,6 +457,15 @@ TEST_F(RetrieveEntry, ErrorNumberAtTheFirstRecordComesBackUnchanged) {
               ElementsAre("cfg_perror(session, \"retrieve_entry: cfg_first_entry\")",
                           "cfg_msgfree(chain)"));
   EXPECT_THAT(platform.debug_lines(), IsEmpty());
+}
+
+TEST_F(RetrieveEntry, ErrorNumberAtTheFirstRecordIsReportedAlsoWithoutTheDebugBit) {
+  debug_off();
+  platform.file["CN=X"] = {{{"CN=X", {}}}};
+  platform.fail("cfg_first_entry", 1, 53);
+  EXPECT_EQ(retrieve(), 53);
+  EXPECT_THAT(platform.calls({"cfg_perror"}),
+              ElementsAre("cfg_perror(session, \"retrieve_entry: cfg_first_entry\")"));
 }
 
 TEST_F(RetrieveEntry, RecordThatComesWithAnErrorNumberIsNotConverted) {

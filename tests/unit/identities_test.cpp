@@ -80,6 +80,16 @@ TEST_F(Identities, KerberosIdentityIsReadFromKerberosInTheLightForm) {
   expect_released_and_free_of_locks();
 }
 
+TEST_F(Identities, KerberosIdentityIsCopiedBetweenTheReleasesOfItsRawAndLightForms) {
+  file(kKerberos, {{"orv-slapdKrbAdminDN", {"orv-kn = admin@REALM"}}});
+  platform.at("xlate_localcp_to_utf8", 1,
+              [&] { platform.name_allocation(platform.allocations() + 1, "raw"); });
+  EXPECT_EQ(kerberos_id(), "orv-kn=admin@REALM");
+  EXPECT_THAT(platform.calls({"dn_normalize_light_esc", "free", "free_ldap_escDN"}),
+              ElementsAre("dn_normalize_light_esc(\"orv-kn = admin@REALM\")", "free(raw)",
+                          "free_ldap_escDN(escaped DN)"));
+}
+
 TEST_F(Identities, DigestUserIsReadFromDigestAsStored) {
   file(kDigest, {{"orv-slapdDigestAdminUser", {" Admin "}}});
   EXPECT_EQ(digest_user(), " Admin ");
@@ -133,7 +143,7 @@ TEST_F(Identities, ValuesAreReleasedAfterTheWalkHasAdvanced) {
   EXPECT_THAT(platform.calls({"cfg_get_values", "cfg_memfree", "cfg_next_attribute", "free"}),
               ElementsAre("cfg_get_values(session, record 1, \"orv-slapdAdminDN\")",
                           "cfg_memfree(\"orv-slapdAdminDN\")",
-                          "cfg_next_attribute(session, record 1, cursor)", "free(values)",
+                          "cfg_next_attribute(session, record 1, cursor)", "free(one of values)",
                           "free(values)", "cfg_memfree(\"CN=CONFIGURATION\")"));
 }
 
@@ -436,6 +446,24 @@ TEST_F(Identities, ExitRecordsCarryTheStatus) {
 }
 
 // ---- Members
+
+TEST_F(Identities, MembersCursorIsReleasedBeforeItsChain) {
+  file(kMember, {{"orv-slapdAdminDN", {"CN=M"}}});
+  EXPECT_EQ(member_dn(), "CN=M");
+  EXPECT_THAT(platform.calls({"cfg_ber_free", "cfg_msgfree"}),
+              ElementsAre("cfg_ber_free(cursor)", "cfg_msgfree(chain)"));
+}
+
+TEST_F(Identities, ExitRecordsOfAMemberCarryTheCodesOfLaterFailures) {
+  trcEvents = 0x00020000;
+  file(kMember, {{"orv-slapdAdminDN", {"CN=M"}}});
+  for (const char* function : {"cfg_first_entry", "cfg_get_values", "cfg_first_attribute"}) {
+    platform.forget();
+    platform.fail(function, 1, 7);
+    EXPECT_EQ(member_dn(), "null");
+    EXPECT_EQ(last_record(), "exit 01020500 1") << function;
+  }
+}
 
 TEST_F(Identities, MemberSearchMustFindExactlyOneEntry) {
   EXPECT_EQ(member_dn(), "null");

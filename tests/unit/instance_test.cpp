@@ -16,7 +16,7 @@ class Instance : public BackendTest {
     *startup = {config_file, key_stash};
     platform.name(startup, "startup record");
     backend.private_data = startup;
-    return platform.run([&] { return config_back_init(&backend); });
+    return traced(0x01010200, [&] { return config_back_init(&backend); });
   }
 
   // Releases what a successful start keeps for ever.
@@ -93,8 +93,10 @@ TEST_F(Instance, StateHoldsTheConfiguredPathFromItsBeginning) {
     const auto* state_made = reinterpret_cast<const ConfigBackendPrivate*>(
         made_mutex - offsetof(ConfigBackendPrivate, configMutex));
     at_first = state_made->config_file;
+    EXPECT_EQ(state_made->save_file, nullptr);
+    EXPECT_EQ(state_made->key_stash_file, nullptr);
   });
-  EXPECT_EQ(start("/b"), 0);
+  EXPECT_EQ(start("/b", "/key"), 0);
   EXPECT_EQ(at_first, "/b");
   release_state();
 }
@@ -264,7 +266,7 @@ TEST_F(Instance, StartAndStopLeaveExitRecordsWithTheirCodes) {
 class Closing : public BackendTest {
  protected:
   int close() {
-    return platform.run([&] { return config_back_close(&pb); });
+    return traced(0x01010300, [&] { return config_back_close(&pb); });
   }
 };
 

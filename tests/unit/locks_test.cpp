@@ -105,6 +105,20 @@ TEST_F(Locks, EveryErrorButBusyCountsAsAcquired) {
   EXPECT_EQ(platform.count("pthread_mutex_unlock"), 1);
 }
 
+TEST_F(Locks, PlainLockThatFailsCountsAsAcquired) {
+  for (const bool timed : {false, true}) {
+    SCOPED_TRACE(timed);
+    platform.forget();
+    al_configfile_counter = 0;
+    platform.environment["AUTOLOCKTYPE"] = "REGULARLOCK";
+    platform.fail("pthread_mutex_lock", 1, EINVAL);
+    EXPECT_NO_THROW(lock_and_release(&mutex, timed));
+    EXPECT_FALSE(held_inside);
+    EXPECT_THAT(platform.calls({"pthread_mutex_lock", "pthread_mutex_unlock"}),
+                ElementsAre("pthread_mutex_lock(mutex)", "pthread_mutex_unlock(mutex)"));
+  }
+}
+
 TEST_F(Locks, EndsTryingAsSoonAsItIsAcquired) {
   busy_for(2);
   lock_and_release(&mutex, true);

@@ -133,20 +133,20 @@ TEST_F(ListForTheFile, CodeOfTheConversionComesBackAndTheRecordStays) {
 TEST_F(ListForTheFile, EachAllocationOfANewRecordFailsWithItsText) {
   const struct {
     std::vector<DebugLine> told;
-    std::vector<std::string> left;
+    std::vector<std::string> left;  // the code too, which is set before the type is copied
   } cases[] = {
       {{error("addmodifyop: safe_realloc returns NULL \n")}, {}},
       {{error("addmodifyop: calloc returns NULL \n")}, {}},
-      {{error("addmodifyop: strdup returns NULL \n")}, {"0 <null>"}},
-      {{error("addmodifyop: safe_realloc returns NULL \n")}, {"0 cn"}},
-      {{}, {"0 cn="}},  // the conversion
+      {{error("addmodifyop: strdup returns NULL \n")}, {"2 <null>"}},
+      {{error("addmodifyop: safe_realloc returns NULL \n")}, {"2 cn"}},
+      {{}, {"2 cn="}},  // the conversion
   };
   int nth = 0;
   for (const auto& expected : cases) {
     SCOPED_TRACE(++nth);
     platform.forget();
     platform.fail_allocation(nth);
-    EXPECT_EQ(add(0, "cn", "a"), 90);
+    EXPECT_EQ(add(2, "cn", "a"), 90);
     EXPECT_EQ(platform.debug_lines(), expected.told);
     EXPECT_EQ(records(), expected.left);
     EXPECT_EQ(list == nullptr, nth == 1);  // what was stored stays
@@ -155,7 +155,7 @@ TEST_F(ListForTheFile, EachAllocationOfANewRecordFailsWithItsText) {
   }
   platform.forget();
   platform.fail_allocation(nth + 1);
-  EXPECT_EQ(add(0, "cn", "a"), 0);
+  EXPECT_EQ(add(2, "cn", "a"), 0);
 }
 
 TEST_F(ListForTheFile, ArraysThatCannotGrowStayAsTheyWere) {
@@ -242,6 +242,15 @@ TEST_F(ChangedEntry, TakesEachModificationInItsOrder) {
 TEST_F(ChangedEntry, EmptyListChangesNothing) {
   EXPECT_EQ(apply({}), 0);
   EXPECT_EQ(text(), "cn=x|cn=a,b");
+}
+
+TEST_F(ChangedEntry, ModificationsInEitherFormOfTheirCodeAreTheSame) {
+  EXPECT_EQ(apply({{kModDelete, "cn", std::nullopt}}), 0);
+  EXPECT_EQ(text(), "cn=x");
+  EXPECT_EQ(apply({{kModReplace, "sn", std::nullopt}}), 0);
+  EXPECT_EQ(apply({{kModAdd, "sn", std::nullopt}}), 0);
+  EXPECT_THAT(platform.calls({"attr_merge", "attr_delete", "delete_values_from_entry"}),
+              ElementsAre("delete_values_from_entry(\"cn\", \"\")", "attr_delete(\"sn\", null)"));
 }
 
 TEST_F(ChangedEntry, ReplaceWithoutValuesRemovesTheAttribute) {
@@ -543,6 +552,16 @@ TEST_F(ChangeCheck, PassThroughSettingsComeLastAndUnderTheDnOfTheTarget) {
   set({{"objectClass", {"top"}}, {"orv-slapdPtaURL", {"bad"}}});
   platform.fail("ldap_url_parse", 0, 3);
   EXPECT_EQ(check({}), 0);  // no pass-through entry
+}
+
+TEST_F(ChangeCheck, AddressesAreLookedAtBeforePassThroughSettings) {
+  platform.addresses = {};
+  set({{"objectClass", {"orv-slapdTop"}}, {"orv-slapdIpAddress", {"10.0.0.1"}}}, 0, kPassthrough);
+  platform.fail("ldap_url_parse", 0, 3);
+  platform.fail("kel_asprintf", 1, -1);
+  EXPECT_EQ(check({{kReplace, "orv-slapdPtaURL", {{"bad"}}}}, kPassthrough), 19);
+  EXPECT_EQ(platform.count("isValidIPAddressOnSystem"), 1);
+  EXPECT_EQ(platform.count("ldap_url_parse"), 0);
 }
 
 TEST_F(ChangeCheck, LeavesExitRecords) {

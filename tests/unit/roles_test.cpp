@@ -77,6 +77,17 @@ TEST_F(Roles, EntriesOutsideTheGroupAreLeftAlone) {
   }
 }
 
+TEST_F(Roles, CodesDoNotDependOnTheDebugBit) {
+  debug_off();
+  adding_with({"SchemaAdmin", "Wizard"});
+  EXPECT_EQ(process(), 21);
+  EXPECT_EQ(roles(), "SchemaAdmin,Wizard");
+  adding(kMember);
+  EXPECT_EQ(process(), 0);
+  EXPECT_EQ(roles(), kDefaults);
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
+}
+
 TEST_F(Roles, GroupIsForThePrimaryAdministratorAloneTheContainerToo) {
   for (const unsigned flags : {0x00U, 0x04U, 0x08U, 0x14U, 0x24U, 0x01U}) {
     as(flags);

@@ -25,7 +25,7 @@ class SearchAuthority : public BackendTest {
  protected:
   int authority_of(unsigned flags) {
     as(flags);
-    return platform.run([&] { return has_search_authority(&connection, &operation); });
+    return traced(0x01040200, [&] { return has_search_authority(&connection, &operation); });
   }
 };
 
@@ -91,7 +91,7 @@ class Sending : public BackendTest {
   int send(int full_view = 1) {
     cfg_search_s(session, "CN=FOUND", 2, "f", nullptr, 0, &chain);
     // Only what the code under test does is of interest from here on.
-    return platform.run([&] {
+    return traced(0x01040300, [&] {
       return sendCFGSearchResults(session, chain, &connection, &operation, &backend, attributes,
                                   types_only, full_view, response_control);
     });
@@ -653,7 +653,7 @@ class Search : public BackendTest {
   }
 
   int search() {
-    return platform.run([&] { return config_back_search(&pb); });
+    return traced(0x01040100, [&] { return config_back_search(&pb); });
   }
 
   // What every search past its silent end leaves behind.
@@ -698,6 +698,20 @@ TEST_F(Search, RunsTheSameSearchOnTheFileInItsCodePage) {
                           "xlate_utf8_to_localcp(\"(cn=k\xC3\xA4se)\")",
                           "cfg_search_s(session, \"CN=K\xE4SE\", 2, \"(cn=k\xE4se)\", [cn], 1)"));
   expect_rest();
+}
+
+TEST_F(Search, ReleasesTheConvertedTextsAfterTheLock) {
+  platform.at("xlate_utf8_to_localcp", 1,
+              [&] { platform.name_allocation(platform.allocations() + 1, "base"); });
+  platform.at("xlate_utf8_to_localcp", 2,
+              [&] { platform.name_allocation(platform.allocations() + 1, "filter"); });
+  EXPECT_EQ(search(), 0);
+  const auto calls = platform.calls({"cfg_unbind", "pthread_mutex_unlock", "free"});
+  ASSERT_GE(calls.size(), 4U);
+  EXPECT_THAT(std::vector<std::string>(std::prev(calls.end(), 4), calls.end()),
+              ElementsAre("cfg_unbind(session)", "pthread_mutex_unlock(configMutex)",
+                          testing::AnyOf("free(base)", "free(filter)"),
+                          testing::AnyOf("free(base)", "free(filter)")));
 }
 
 TEST_F(Search, AsksForEverythingAtTheBaseWhenTheClientDoes) {

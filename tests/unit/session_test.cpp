@@ -11,7 +11,7 @@ namespace {
 class Session : public BackendTest {
  protected:
   int open() {
-    return platform.run([&] { return init_cfg_ld(&connection, &state); });
+    return traced(0x01010400, [&] { return init_cfg_ld(&connection, &state); });
   }
   void end() {
     platform.run([&] { config_end(&state); });
@@ -61,6 +61,49 @@ TEST_F(Session, UnsetFilesAreNotNamed) {
   EXPECT_EQ(platform.count("cfg_set_option"), 0);
   EXPECT_THAT(platform.debug_lines(),
               ElementsAre(detail("Initing config32 handle \n"), detail("Binding to cfg32 \n")));
+  rest();
+}
+
+TEST_F(Session, EachFileIsNamedWhetherTheOthersAreSetOrNot) {
+  state.key_stash_file = nullptr;
+  EXPECT_EQ(open(), 0);
+  EXPECT_THAT(platform.story({"cfg_set_option"}),
+              ElementsAre("debug: Initing config32 handle \n",
+                          "debug: Setting cfg file name to /etc/orv/config.ldif\n",
+                          "cfg_set_option(session, 1005, \"/etc/orv/config.ldif\")",
+                          "debug: Setting cfg file name to /etc/orv/config.ldif.save\n",
+                          "cfg_set_option(session, 1006, \"/etc/orv/config.ldif.save\")",
+                          "debug: Setting cfg file name to /etc/orv/config.ldif.save\n",
+                          "cfg_set_option(session, 1006, \"/etc/orv/config.ldif.save\")",
+                          "debug: Binding to cfg32 \n"));
+  rest();
+
+  platform.forget();
+  state = {nullptr, nullptr, "/etc/orv/key.stash", {}};
+  EXPECT_EQ(open(), 0);
+  EXPECT_THAT(platform.story({"cfg_set_option"}),
+              ElementsAre("debug: Initing config32 handle \n",
+                          "debug: Setting in-memory config key stash file\n",
+                          "cfg_set_option(session, 1007, \"/etc/orv/key.stash\")",
+                          "debug: Binding to cfg32 \n"));
+  rest();
+
+  platform.forget();
+  state = {"/etc/orv/config.ldif", nullptr, nullptr, {}};
+  EXPECT_EQ(open(), 0);
+  EXPECT_THAT(platform.story({"cfg_set_option"}),
+              ElementsAre("debug: Initing config32 handle \n",
+                          "debug: Setting cfg file name to /etc/orv/config.ldif\n",
+                          "cfg_set_option(session, 1005, \"/etc/orv/config.ldif\")",
+                          "debug: Binding to cfg32 \n"));
+  rest();
+
+  platform.forget();
+  state = {nullptr, "/etc/orv/config.ldif.save", nullptr, {}};
+  EXPECT_EQ(open(), 0);
+  EXPECT_THAT(platform.calls({"cfg_set_option"}),
+              ElementsAre("cfg_set_option(session, 1006, \"/etc/orv/config.ldif.save\")",
+                          "cfg_set_option(session, 1006, \"/etc/orv/config.ldif.save\")"));
   rest();
 }
 
@@ -238,10 +281,10 @@ TEST_F(Session, ExitRecordsCarryTheCodeOfEachFailure) {
 class BindAndUnbind : public BackendTest {
  protected:
   int bind() {
-    return platform.run([&] { return config_back_bind(&pb); });
+    return traced(0x01010600, [&] { return config_back_bind(&pb); });
   }
   int unbind() {
-    return platform.run([&] { return config_back_unbind(&pb); });
+    return traced(0x01010700, [&] { return config_back_unbind(&pb); });
   }
 };
 
@@ -259,6 +302,22 @@ TEST_F(BindAndUnbind, BindIsToldBeforeItIsAnswered) {
               ElementsAre("slapi_pblock_get(130)", "slapi_pblock_get(131)", "slapi_pblock_get(132)",
                           "debug: entering config_back_bind...\n",
                           "send_ldap_result(connection, operation, 49, null, null)"));
+}
+
+TEST_F(BindAndUnbind, BindIsRefusedWith49WhateverCannotBeRead) {
+  const char* const answers[] = {"send_ldap_result(connection, operation, 49, null, null)",
+                                 "send_ldap_result(null, operation, 49, null, null)",
+                                 "send_ldap_result(connection, null, 49, null, null)"};
+  int nth = 0;
+  for (const char* answer : answers) {
+    SCOPED_TRACE(++nth);
+    platform.forget();
+    platform.fail("slapi_pblock_get", nth, -1);
+    EXPECT_EQ(bind(), 49);
+    EXPECT_THAT(platform.calls(), ElementsAre("slapi_pblock_get(130)", "slapi_pblock_get(131)",
+                                              "slapi_pblock_get(132)", answer));
+    EXPECT_THAT(platform.debug_lines(), ElementsAre(info("entering config_back_bind...\n")));
+  }
 }
 
 TEST_F(BindAndUnbind, ConnectionThatNeverUsedTheBackendTakesNoLock) {

@@ -286,7 +286,8 @@ char* Platform::give_text(Owned kind, const std::string& text) {
 void Platform::note(void* block, Owned kind) {
   blocks_[block] = kind;
   const auto named = allocation_names_.find(allocations_);
-  if (named != allocation_names_.end()) names_[block] = named->second;
+  if (named == allocation_names_.end()) return;
+  names_[block] = (kind == Owned::cfg_value ? "one of " : "") + named->second;
 }
 
 std::optional<Owned> Platform::owner(const void* block) const {

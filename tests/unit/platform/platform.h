@@ -145,6 +145,7 @@ class Platform {
   bool empty_lists_are_null = false;  // entries have a null list where there are no values
   bool keeps_letter_case = false;     // replace_DN does not fold
   bool failed_text_is_left = false;   // a conversion that fails by the script gives a text as well
+  bool results_left_alone = false;    // such a conversion does not touch its results
   bool real_mutexes = false;          // mutexes are taken, and not only modelled
   bool admin_policy = false;          // pwdIsAdminPolicyOn()
   bool password_is_overwritten = false;  // verify_admin_password leaves nothing of a new one
@@ -175,7 +176,8 @@ class Platform {
   [[nodiscard]] int allocations() const { return allocations_; }
   // What malloc and calloc were asked for by the code under test, in bytes and in order.
   std::vector<std::size_t> sizes;
-  // What the n-th allocation gives is known by that name; its release with free is then a call.
+  // What the n-th allocation gives is known by that name; its release with free is then a call. Of
+  // an array of values each value is known as "one of" it.
   void name_allocation(int nth, const std::string& name) { allocation_names_[nth] = name; }
   // Forgets calls and script of failures, and starts counting again. What is owned and locked
   // stays.
