@@ -34,6 +34,8 @@ namespace {
 
 constexpr const char* kRetrieving = "Retrieving values for attribute %s ! \n";
 constexpr const char* kProblems = "Problems retrieving values for %s ! \n";
+// Kept as they are, by which readers of traces know them: the first also for a failed step to the
+// next attribute, the second with its blank at the end and without a newline.
 constexpr const char* kWalkFailed = "cfg_first_attribute error ! \n";
 constexpr const char* kSecondAdminDn = "Error: more then one admin DN ";
 constexpr const char* kFailed = "Retrieving %s FAILED rc = %d\n";
@@ -206,6 +208,7 @@ char* getAdminGroupMemberDn(Connection* connection, const char* target_dn) {
 
   CfgResult chain;
   int rc = search_entry(session, target_dn, chain);
+  // Ends here, where the look-ups above walk over no record at all.
   if (trace.exit(rc) != 0 || cfg_count_entries(session, chain.get()) != 1) return nullptr;
   _CFGMessage* const record = cfg_first_entry(session, chain.get());
   if (cfg_get_errno(session) != 0 || record == nullptr) {
@@ -686,7 +689,7 @@ constexpr int kMessageReservedSubtree = 174;
 constexpr int kMessageBadUrl = 179;
 
 constexpr int kReviewingServer = 1;  // kind of server
-constexpr int kSafeMode = 1;
+constexpr int kSafeMode = 1;         // exactly; the rule of password methods asks for any but 0
 
 // Suffixes of the server's own: nobody who has an entry there is verified by another server.
 constexpr const char* kReservedSuffixes[] = {

@@ -39,7 +39,8 @@ int config_back_close(pblock* pb) {
     return trace.exit(kNothingToClose);
   }
 
-  // 2. The lock. The state and its texts stay: whoever still reads them reads something valid.
+  // 2. The lock. The state and its texts stay: whoever still reads them reads something valid. That
+  // the lock is busy is not looked at: nothing could be done about it, and no operation may come.
   pthread_mutex_destroy(&static_cast<ConfigBackendPrivate*>(backend->private_data)->configMutex);
   return trace.exit(result::success);
 }

@@ -28,7 +28,7 @@ constexpr const char* kMonitorNotLocked = "Failed to acquire lock on monitor mut
 constexpr const char* kMonitorNotUnlocked = "Failed to release lock on monitor mutex, rc=%d.\n";
 
 constexpr const char* kObjectClass = "OBJECTCLASS";
-// The backend's own entry, as whoever wrote the rule spelled it: compared without regard to case.
+// The backend's own entry, in mixed case; compared without regard to case.
 constexpr const char* kOwnBackendDn =
     "cn=ConfigDB,cn=Config Backends,cn=ORV Directory,cn=Schemas,cn=Configuration";
 constexpr int kPersistentSearchesOn = 1;
@@ -68,7 +68,7 @@ int read_object_classes(const ldtr_function_local& trace, _CFG* session, const c
   }
   values.reset(cfg_get_values(session, record, kObjectClass));
   rc = cfg_get_errno(session);
-  if (values == nullptr) return result::no_such_attribute;
+  if (values == nullptr) return result::no_such_attribute;  // whatever the error number
   supplier = is_supplier(values.get());
   return rc;
 }
@@ -92,6 +92,8 @@ int check_delete_authority(Connection* connection, Operation* operation, entry* 
 
 namespace {
 
+// Kept as it is: the group anywhere in the DN, so with everything below it, but the other two as
+// whole DNs, and all three byte for byte, unlike the rule before, which ignores case.
 bool is_for_primary_administrator(const char* dn) {
   return std::strstr(dn, config_names::admin_group_dn) != nullptr ||
          std::strcmp(dn, config_names::kerberos_dn) == 0 ||

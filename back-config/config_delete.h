@@ -10,8 +10,8 @@ namespace orv {
 //   0   yes, as far as roles tell
 //   50  suppliers, callers without configuration access (neither makes the file be read), and
 //       members of the administrative group whose roles do not cover the entry
-//   32  no such entry; 16 it has no object classes; 80, 90 or the session's error number when it
-//       cannot be read
+//   32  no such entry; 16 its object classes are missing or cannot be read; 80 or 90 when the entry
+//       cannot be read; the session's error number when that came beside the classes
 int check_delete_authority(Connection* connection, Operation* operation, entry* e, const char* dn);
 
 }  // namespace orv

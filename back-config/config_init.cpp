@@ -37,11 +37,13 @@ constexpr const char* kSaveFile = "Save file name: %s\n";
 
 using StatePtr = std::unique_ptr<ConfigBackendPrivate, FreeDeleter>;
 
+// A start that fails releases the state without destroying its mutex: nobody has locked it, and
+// such a mutex holds nothing.
 StatePtr make_state(const BackendStartup& startup) {
   StatePtr state(static_cast<ConfigBackendPrivate*>(std::calloc(1, sizeof(ConfigBackendPrivate))));
   if (state == nullptr) return state;
   pthread_mutex_init(&state->configMutex, nullptr);
-  state->config_file = startup.config_file;
+  state->config_file = startup.config_file;  // borrowed until the resolved path takes its place
   return state;
 }
 

@@ -1,5 +1,6 @@
 // What the backend keeps between operations: where the configuration file is, and the lock that
-// serialises all work on it. Nothing else survives a call.
+// serialises all work on it. Beside it only a mark outlives a call: that this process has reviewed
+// the pass-through entries of the file (`verifyPassthroughServerEntry`).
 #pragma once
 
 #include <pthread.h>

@@ -101,6 +101,8 @@ AutoLock::AutoLock(pthread_mutex_t* mutex, bool timed) : mutex_(mutex) {
   }
 }
 
+// Unlocks also what could not be locked, and does not look at the result: a destructor has nobody
+// to tell.
 AutoLock::~AutoLock() {
   const ldtr_function_local trace(function_id::auto_lock_release);
   if (mutex_ != nullptr) pthread_mutex_unlock(mutex_);
@@ -265,7 +267,8 @@ int send_chain(_CFG* session, _CFGMessage* found, Sending& sending) {
   _CFGMessage* const first = cfg_first_entry(session, chain.get());
   if (cfg_get_errno(session) != 0) {
     cfg_perror(session, "cfg_first_entry");
-    // Kept: the session releases it when it is unbound.
+    // Kept: the session releases it when it is unbound. And no failure: the client gets a success
+    // without entries.
     static_cast<void>(chain.release());
     return result::success;
   }
@@ -278,7 +281,7 @@ ControlList response_controls(const Connection& connection, LDAPControl* control
   LDAPControl** list = nullptr;
   if (connection.aux != nullptr && connection.aux->attach_response_control != 0 &&
       control != nullptr) {
-    ldap_insert_control(control, &list);
+    ldap_insert_control(control, &list);  // without memory entries come without the control
   }
   return ControlList(list);
 }

@@ -18,8 +18,9 @@ int has_search_authority(const Connection* connection, const Operation* operatio
 //   full_view         1: every entry, without the credentials that the caller may not see.
 //                     Any other value: only the entry of the directory backend
 //   response_control  attached to each entry when the connection asks for it; or null
-// 0; 90 no memory; 16 a credential could not be taken out; 80 whose credentials an entry holds
-// cannot be told; the code with which the sender ended the search.
+// 0, also when the first record cannot be taken: then no entry is sent; 90 no memory; 16 a
+// credential could not be taken out; 80 whose credentials an entry holds cannot be told; 34, or
+// what else `replace_DN` makes of an entry's DN; the code with which the sender ended the search.
 int sendCFGSearchResults(_CFG* session, _CFGMessage* chain, Connection* connection,
                          Operation* operation, Backend* backend, char** attributes, int types_only,
                          int full_view, LDAPControl* response_control);

@@ -1,9 +1,11 @@
 // What the server calls: the entry point of the plug-in and the handlers that it registers.
 //
-// Handlers are called from the server's worker threads, one call for each client operation. Each
-// reads its arguments from the parameter block, sends its own result to the client, and returns the
-// LDAP code of the operation. Search, add, delete, modify and unbind take `configMutex` for as long
-// as they work with a session, and only then; the other handlers take no lock.
+// Handlers are called from the server's worker threads: start and close once for each instance,
+// unbind once for each connection, the others once for each operation. An operation's handler reads
+// its arguments from the parameter block, sends its own result to the client, and returns the LDAP
+// code of the operation; start, close and unbind send nothing, and where others send nothing is
+// said below. Search, add, delete, modify and unbind take `configMutex` for as long as they work
+// with a session, and keep it only where that is said below; the other handlers take no lock.
 #pragma once
 
 #include "slapi/pblock.h"
