@@ -181,24 +181,30 @@ int member_dn(Connection* connection, const attr* named, const char* normalized_
 }
 
 // An entry inside the administrative group: its password is for the member and the primary
-// administrator only.
+// administrator only. `member` receives its normalised DN.
 int restrict_member_entry(Connection* connection, const Operation& operation,
-                          const char* normalized_dn, entry& e, bool& send) {
+                          const char* normalized_dn, MallocText& member, entry& e, bool& send) {
   const attr* named = attr_find(&e, config_names::admin_dn, 0, 0);
   if (named == nullptr && attr_find(&e, config_names::admin_password, 0, 0) == nullptr) {
     return result::success;
   }
-  MallocText member;
   const int rc = member_dn(connection, named, normalized_dn, member);
   if (rc != 0) return rc;
   const bool own = member != nullptr && std::strcmp(member.get(), operation.bound_dn) == 0;
   return own ? static_cast<int>(result::success) : hide_password_of_another(e, send);
 }
 
+// What is compared to decide about an entry. It goes when the entry has been sent.
+struct Compared {
+  MallocText member;
+  MallocText dn;
+};
+
 // Takes out of the entry what the caller may not see; clears `send` when nothing is to be sent. The
 // first rule that applies decides.
-int restrict_to_caller(Connection* connection, const Operation& operation, entry& e, bool& send) {
-  MallocText dn;
+int restrict_to_caller(Connection* connection, const Operation& operation, Compared& compared,
+                       entry& e, bool& send) {
+  MallocText& dn = compared.dn;
   const int rc = normalized_copy(e.dn, dn);
   if (rc != 0) return rc;
   if (is_primary_administrator(operation)) return result::success;
@@ -207,7 +213,7 @@ int restrict_to_caller(Connection* connection, const Operation& operation, entry
     const bool root = std::strcmp(dn.get(), config_names::configuration_dn) == 0;
     return root ? hide_administrator(e) : static_cast<int>(result::success);
   }
-  return restrict_member_entry(connection, operation, dn.get(), e, send);
+  return restrict_member_entry(connection, operation, dn.get(), compared.member, e, send);
 }
 
 // What is the same for all entries of one result.
@@ -242,10 +248,11 @@ int send_entry(Sending& sending, entry& e) {
 int send_record(_CFG* session, _CFGMessage* record, Sending& sending) {
   const EntryPtr e(CFGMessage2EntryTrans(session, record));
   if (e == nullptr) return result::no_memory;
+  Compared compared;
   bool send = true;
-  const int rc = sending.full_view
-                     ? restrict_to_caller(sending.connection, *sending.operation, *e, send)
-                     : restrict_to_directory_backend(sending, *e, send);
+  const int rc = sending.full_view ? restrict_to_caller(sending.connection, *sending.operation,
+                                                        compared, *e, send)
+                                   : restrict_to_directory_backend(sending, *e, send);
   if (rc != 0 || !send) return rc;
   return send_entry(sending, *e);
 }
@@ -322,8 +329,8 @@ struct SearchRequest {
   char** searched_attributes = nullptr;  // valid from step 4
   int full_view = 0;
 
-  MallocText local_base;  // valid from step 6
-  MallocText local_filter;
+  MallocText local_filter;  // valid from step 6
+  MallocText local_base;    // goes first
 };
 
 void read_parties(pblock* pb, SearchRequest& request) {
