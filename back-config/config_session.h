@@ -41,9 +41,9 @@ class OperationSession {
   void close();
 
   // The same, also when `open` failed or was never called. A caller that holds no lock so releases
-  // the lock of whoever does: the server therefore admits one operation at a time. In return a
-  // handle or a lock that a failed operation left behind is cleaned away by the next search, even
-  // one that is refused.
+  // the lock of whoever does: the server therefore admits one operation at a time. In return what a
+  // failed operation left behind is cleaned away by a search that is refused: the lock by any, the
+  // handle by one on its connection. One that is let in would wait for that lock for ever.
   void release_without_taking() { close(); }
 
  private:
