@@ -741,6 +741,12 @@ TEST_F(Modify, CopyHasEveryValueInTheLocalCodePageUnderItsCodeWithoutTheFlag) {
   EXPECT_EQ(written(), "2 description=K\xE4se,b|1 seeAlso|0 sn=c");
 }
 
+TEST_F(Modify, ModificationWithoutValuesNeedsNoFlagOfCountedOnes) {
+  target(kEntry, {"top"}, {{"seeAlso", {"a", "b"}}});
+  EXPECT_EQ(modify({{kModDelete, "seeAlso", std::nullopt}}), 0);
+  EXPECT_EQ(written(), "1 seeAlso");
+}
+
 TEST_F(Modify, EmptyArrayIsLeftOutOfWhatIsWrittenAndStillChecked) {
   trcEvents = kTraceExit;
   EXPECT_EQ(modify({{kReplace, "seeAlso", {{}}}, {kReplace, "description", {{"x"}}}}), 0);

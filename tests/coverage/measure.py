@@ -1,0 +1,250 @@
+"""Measures how much of the sources the tests reach, and fails where it is less than it must be.
+
+usage: measure.py [--build DIR] [--jobs N] [--no-build] [--no-run] [--uncovered]
+
+Builds with the counters of the compiler in a folder of its own (build/coverage, or DIR), runs two test
+programs, and prints lines and branches for each file:
+
+    back-config/  by backend_unit_tests, on the scripted platform:  every line, every branch
+    cfg/          by cfg_test:                                      95 % of the branches
+
+Branches that the compiler makes for exceptions are left out: nearly every call has one, and they lead
+to the release of what was held. Headers count for the folder that they lie in, as they are compiled
+there. Of a template or a lambda, a branch counts as taken when one of its uses took it.
+
+unreachable.txt, beside this file, names the lines that no test can reach, each with its reason. They
+are left out of the figures of back-config/, and of cfg/ they count as not reached. An entry that fits
+no line any more, or whose line is reached after all, is a failure.
+
+Needs nothing that the tests do not need: gcov comes with the compiler. Building takes some minutes;
+therefore neither ./test nor .ci/run does this.
+"""
+import argparse
+import collections
+import itertools
+import json
+import os
+import pathlib
+import subprocess
+import sys
+
+ROOT = pathlib.Path(__file__).resolve().parents[2]
+LIST = pathlib.Path(__file__).with_name("unreachable.txt")
+
+# Of a folder: its objects in the build tree, the program that is to reach it, and what it must reach.
+Folder = collections.namedtuple("Folder", "name program least_lines least_branches excuses")
+FOLDERS = (
+    Folder("back-config", "backend_unit_tests", 100.0, 100.0, True),
+    Folder("cfg", "cfg_test", 0.0, 95.0, False),
+)
+
+
+class Line:
+    """Counts of one source line: how often it ran, and how often each of its branches was taken."""
+
+    def __init__(self):
+        self.count = 0
+        self.branches = []
+
+    def add_use(self, count, branches):
+        """The same code once more: another use of a template, or of a header."""
+        self.count += count
+        pairs = itertools.zip_longest(self.branches, branches, fillvalue=0)
+        self.branches = [before + more for before, more in pairs]
+
+    def add_function(self, other):
+        """Code of another function on the same line: that of a lambda."""
+        self.count += other.count
+        self.branches += other.branches
+
+
+# ---- Building and running
+
+
+def build(folder, jobs):
+    subprocess.run(["cmake", "--preset", "coverage", "-S", ROOT, "-B", folder], check=True, cwd=ROOT,
+                   stdout=subprocess.DEVNULL)
+    subprocess.run(["ninja", "-C", folder, f"-j{jobs}", *(f.program for f in FOLDERS)], check=True)
+
+
+def run_tests(folder):
+    for counters in folder.rglob("*.gcda"):
+        counters.unlink()
+    for program in [f.program for f in FOLDERS]:
+        log = folder / f"{program}.log"
+        with open(log, "wb") as output:
+            code = subprocess.run([folder / "bin" / program], cwd=folder, stdin=subprocess.DEVNULL,
+                                  stdout=output, stderr=subprocess.STDOUT).returncode
+        if code != 0:
+            sys.exit(f"{program} ended with {code}: see {log}")
+
+
+# ---- Reading
+
+
+def gcov_reports(objects):
+    """What gcov says about each object file of a folder, in its JSON form."""
+    notes = sorted(str(path) for path in objects.rglob("*.gcno"))
+    if not notes:
+        sys.exit(f"nothing was built in {objects}")
+    text = subprocess.run(["gcov", "--json-format", "--stdout", "--branch-probabilities", *notes],
+                          check=True, capture_output=True, text=True, cwd=objects).stdout
+    return [json.loads(report) for report in text.splitlines() if report.strip()]
+
+
+def taken(branches):
+    return [branch["count"] for branch in branches if not branch["throw"]]
+
+
+def lines_of(folder, build_folder):
+    """Line by (path, number), for the sources of a folder."""
+    functions = collections.defaultdict(Line)  # by place of the line and place of its function
+    for report in gcov_reports(build_folder / folder.name):
+        top = report["current_working_directory"]
+        for file in report["files"]:
+            path = os.path.relpath(os.path.join(top, file["file"]), ROOT)
+            if not path.startswith(folder.name + "/"):
+                continue
+            starts = {f["name"]: (f["start_line"], f["start_column"]) for f in file["functions"]}
+            for line in file["lines"]:
+                start = starts.get(line.get("function_name"), (0, 0))
+                functions[path, line["line_number"], start].add_use(line["count"],
+                                                                    taken(line["branches"]))
+    lines = collections.defaultdict(Line)
+    for (path, number, _), function in sorted(functions.items()):
+        lines[path, number].add_function(function)
+    return lines
+
+
+# ---- The list of what cannot be reached
+
+
+def excuses():
+    """(path, text of the line) with the reason and the place in the list."""
+    found, path = {}, None
+    for number, text in enumerate(LIST.read_text(encoding="utf-8").splitlines(), 1):
+        if text.startswith("== "):
+            path = text[3:].strip()
+        elif text.strip() and not text.startswith("#"):
+            line, _, reason = text.partition(" -> ")
+            if not path or not reason.strip():
+                sys.exit(f"{LIST.name}:{number}: not \"text of a line -> reason\" below a file")
+            found[path, line.strip()] = (reason.strip(), number)
+    return found
+
+
+def excused_lines(listed, lines):
+    """The listed lines by (path, number), and what is wrong with the list."""
+    excused, wrong = {}, []
+    for (path, text), (reason, number) in listed.items():
+        source = (ROOT / path).read_text(encoding="utf-8").splitlines()
+        places = [i for i, line in enumerate(source, 1) if text in line]
+        if len(places) != 1:
+            wrong.append(f"{LIST.name}:{number}: stands {len(places)} times in {path}: {text}")
+        elif (path, places[0]) not in lines:
+            wrong.append(f"{LIST.name}:{number}: is no code in {path}: {text}")
+        elif complete(lines[path, places[0]]):
+            wrong.append(f"{LIST.name}:{number}: is reached: {path}:{places[0]}: {text}")
+        else:
+            excused[path, places[0]] = reason
+    return excused, wrong
+
+
+# ---- Figures
+
+
+def complete(line):
+    return line.count > 0 and all(line.branches)
+
+
+def per_cent(part, whole):
+    return 100.0 * part / whole if whole else 100.0
+
+
+class Figures:
+    def __init__(self):
+        self.lines = self.lines_reached = self.branches = self.branches_taken = 0
+
+    def add(self, line):
+        self.lines += 1
+        self.lines_reached += line.count > 0
+        self.branches += len(line.branches)
+        self.branches_taken += sum(count > 0 for count in line.branches)
+
+    def shares(self):
+        return per_cent(self.lines_reached, self.lines), per_cent(self.branches_taken, self.branches)
+
+    def text(self):
+        lines, branches = self.shares()
+        return (f"{self.lines_reached:5}/{self.lines:<5}{lines:6.2f} %   "
+                f"{self.branches_taken:5}/{self.branches:<5}{branches:6.2f} %")
+
+
+def report(folder, lines, excused):
+    """Prints the table of a folder; gives its figures."""
+    files, total = collections.defaultdict(Figures), Figures()
+    left_out = set(excused) if folder.excuses else set()
+    for place in sorted(set(lines) - left_out):
+        files[place[0]].add(lines[place])
+        total.add(lines[place])
+    print(f"\n{folder.name}/ by {folder.program}"
+          f"{'':14}lines              branches (none of exceptions)")
+    for path, figures in sorted(files.items()):
+        print(f"  {path:38}{figures.text()}")
+    print(f"  {'all':38}{total.text()}")
+    for place in sorted(excused):
+        if place[0].startswith(folder.name + "/"):
+            left = "left out" if folder.excuses else "counted as not reached"
+            print(f"  {left}: {place[0]}:{place[1]}: {excused[place]}")
+    return total
+
+
+def print_uncovered(lines, excused):
+    for (path, number), line in sorted(lines.items()):
+        if complete(line) or (path, number) in excused:
+            continue
+        text = (ROOT / path).read_text(encoding="utf-8").splitlines()[number - 1].strip()
+        what = "never" if line.count == 0 else f"branches {line.branches}"
+        print(f"  {path}:{number}: {what}: {text}")
+
+
+def arguments():
+    parser = argparse.ArgumentParser(description=__doc__.splitlines()[0])
+    parser.add_argument("--build", type=pathlib.Path, default=ROOT / "build" / "coverage")
+    parser.add_argument("--jobs", type=int, default=os.cpu_count())
+    parser.add_argument("--no-build", action="store_true", help="the programs are built already")
+    parser.add_argument("--no-run", action="store_true", help="... and have run already")
+    parser.add_argument("--uncovered", action="store_true", help="print what is not reached")
+    return parser.parse_args()
+
+
+def main():
+    options = arguments()
+    build_folder = options.build.resolve()
+    if not options.no_build and not options.no_run:
+        build(build_folder, options.jobs)
+    if not options.no_run:
+        run_tests(build_folder)
+
+    wrong, all_lines = [], {}
+    by_folder = {folder: lines_of(folder, build_folder) for folder in FOLDERS}
+    for lines in by_folder.values():
+        all_lines.update(lines)
+    excused, wrong = excused_lines(excuses(), all_lines)
+    for folder, lines in by_folder.items():
+        line_share, branch_share = report(folder, lines, excused).shares()
+        if options.uncovered:
+            print_uncovered(lines, excused)
+        if line_share < folder.least_lines:
+            wrong.append(f"{folder.name}/: {line_share:.2f} % of the lines, not {folder.least_lines} %")
+        if branch_share < folder.least_branches:
+            wrong.append(f"{folder.name}/: {branch_share:.2f} % of the branches, not "
+                         f"{folder.least_branches} %")
+    print()
+    for finding in wrong:
+        print(finding)
+    sys.exit(1 if wrong else 0)
+
+
+if __name__ == "__main__":
+    main()
