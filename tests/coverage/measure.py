@@ -119,25 +119,25 @@ def lines_of(folder, build_folder):
 # ---- The list of what cannot be reached
 
 
-def excuses():
+def excuses(text):
     """(path, text of the line) with the reason and the place in the list."""
     found, path = {}, None
-    for number, text in enumerate(LIST.read_text(encoding="utf-8").splitlines(), 1):
-        if text.startswith("== "):
-            path = text[3:].strip()
-        elif text.strip() and not text.startswith("#"):
-            line, _, reason = text.partition(" -> ")
+    for number, entry in enumerate(text.splitlines(), 1):
+        if entry.startswith("== "):
+            path = entry[3:].strip()
+        elif entry.strip() and not entry.startswith("#"):
+            line, _, reason = entry.partition(" -> ")
             if not path or not reason.strip():
                 sys.exit(f"{LIST.name}:{number}: not \"text of a line -> reason\" below a file")
             found[path, line.strip()] = (reason.strip(), number)
     return found
 
 
-def excused_lines(listed, lines):
+def excused_lines(listed, lines, root=ROOT):
     """The listed lines by (path, number), and what is wrong with the list."""
     excused, wrong = {}, []
     for (path, text), (reason, number) in listed.items():
-        source = (ROOT / path).read_text(encoding="utf-8").splitlines()
+        source = pathlib.Path(root, path).read_text(encoding="utf-8").splitlines()
         places = [i for i, line in enumerate(source, 1) if text in line]
         if len(places) != 1:
             wrong.append(f"{LIST.name}:{number}: stands {len(places)} times in {path}: {text}")
@@ -180,13 +180,30 @@ class Figures:
                 f"{self.branches_taken:5}/{self.branches:<5}{branches:6.2f} %")
 
 
-def report(folder, lines, excused):
-    """Prints the table of a folder; gives its figures."""
+def figures_of(folder, lines, excused):
+    """Figures by path, and those of all files together."""
     files, total = collections.defaultdict(Figures), Figures()
     left_out = set(excused) if folder.excuses else set()
     for place in sorted(set(lines) - left_out):
         files[place[0]].add(lines[place])
         total.add(lines[place])
+    return files, total
+
+
+def shortfalls(folder, total):
+    line_share, branch_share = total.shares()
+    found = []
+    if line_share < folder.least_lines:
+        found.append(f"{folder.name}/: {line_share:.2f} % of the lines, not {folder.least_lines} %")
+    if branch_share < folder.least_branches:
+        found.append(f"{folder.name}/: {branch_share:.2f} % of the branches, not "
+                     f"{folder.least_branches} %")
+    return found
+
+
+def report(folder, lines, excused):
+    """Prints the table of a folder; gives its figures."""
+    files, total = figures_of(folder, lines, excused)
     print(f"\n{folder.name}/ by {folder.program}"
           f"{'':14}lines              branches (none of exceptions)")
     for path, figures in sorted(files.items()):
@@ -226,20 +243,13 @@ def main():
     if not options.no_run:
         run_tests(build_folder)
 
-    wrong, all_lines = [], {}
     by_folder = {folder: lines_of(folder, build_folder) for folder in FOLDERS}
-    for lines in by_folder.values():
-        all_lines.update(lines)
-    excused, wrong = excused_lines(excuses(), all_lines)
+    all_lines = {place: line for lines in by_folder.values() for place, line in lines.items()}
+    excused, wrong = excused_lines(excuses(LIST.read_text(encoding="utf-8")), all_lines)
     for folder, lines in by_folder.items():
-        line_share, branch_share = report(folder, lines, excused).shares()
+        wrong += shortfalls(folder, report(folder, lines, excused))
         if options.uncovered:
             print_uncovered(lines, excused)
-        if line_share < folder.least_lines:
-            wrong.append(f"{folder.name}/: {line_share:.2f} % of the lines, not {folder.least_lines} %")
-        if branch_share < folder.least_branches:
-            wrong.append(f"{folder.name}/: {branch_share:.2f} % of the branches, not "
-                         f"{folder.least_branches} %")
     print()
     for finding in wrong:
         print(finding)

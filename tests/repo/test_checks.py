@@ -7,7 +7,8 @@ import tempfile
 import unittest
 
 sys.path[:0] = [os.path.dirname(os.path.abspath(__file__)),
-                os.path.dirname(os.path.dirname(os.path.abspath(__file__)))]
+                os.path.dirname(os.path.dirname(os.path.abspath(__file__))),
+                os.path.join(os.path.dirname(os.path.dirname(os.path.abspath(__file__))), "coverage")]
 
 import check_arrows  # noqa: E402
 import check_behaviours  # noqa: E402
@@ -19,6 +20,7 @@ import check_schema  # noqa: E402
 import check_tests_built  # noqa: E402
 import check_words  # noqa: E402
 import findings  # noqa: E402
+import measure  # noqa: E402
 
 
 class Tree(unittest.TestCase):
@@ -251,6 +253,59 @@ class FaultLists(Tree):
 
     def test_faults_of_no_file_are_found(self):
         self.assertEqual(len(self.found("- one();\n+\n\n== cfg/b.cpp\n- one();\n+\n")), 2)
+
+
+class Coverage(Tree):
+    FOLDER = measure.Folder("a", "a_test", 100.0, 75.0, True)
+
+    def setUp(self):
+        super().setUp()
+        self.write("a/a.cpp", "one();\ntwo();\ntwo();\nthree();\nfour();\n")
+        self.lines = {}
+        for number, count, branches in ((1, 5, [5, 0]), (2, 1, [1, 2]), (4, 0, []), (5, 1, [])):
+            line = measure.Line()
+            line.add_use(count, branches)
+            self.lines["a/a.cpp", number] = line
+
+    def excused(self, text):
+        return measure.excused_lines(measure.excuses(text), self.lines, self.top)
+
+    def shortfalls(self, excused=()):
+        return measure.shortfalls(self.FOLDER,
+                                  measure.figures_of(self.FOLDER, self.lines, excused)[1])
+
+    def test_uses_of_a_template_count_together_and_lambdas_apart(self):
+        line, other = measure.Line(), measure.Line()
+        line.add_use(1, [1, 0])
+        line.add_use(2, [0, 2, 0])
+        self.assertEqual((line.count, line.branches), (3, [1, 2, 0]))
+        other.add_use(0, [0, 0])
+        line.add_function(other)
+        self.assertEqual((line.count, line.branches), (3, [1, 2, 0, 0, 0]))
+
+    def test_branches_of_exceptions_are_left_out(self):
+        self.assertEqual(measure.taken([{"count": 0, "throw": True}, {"count": 3, "throw": False}]),
+                         [3])
+
+    def test_less_than_must_be_is_found(self):
+        self.assertEqual(self.shortfalls(), ["a/: 75.00 % of the lines, not 100.0 %"])
+        self.lines["a/a.cpp", 5].add_use(0, [0])
+        self.assertEqual(len(self.shortfalls()), 2)
+
+    def test_listed_lines_are_left_out(self):
+        excused, wrong = self.excused("# why\n== a/a.cpp\nthree(); -> because\n")
+        self.assertEqual((excused, wrong), ({("a/a.cpp", 4): "because"}, []))
+        self.assertEqual(self.shortfalls(excused), [])
+
+    def test_entries_that_fit_no_line_or_one_that_is_reached_are_found(self):
+        _, wrong = self.excused("== a/a.cpp\ntwo(); -> a\nsix(); -> b\nfour(); -> c\n")
+        self.assertEqual(wrong, ["unreachable.txt:2: stands 2 times in a/a.cpp: two();",
+                                 "unreachable.txt:3: stands 0 times in a/a.cpp: six();",
+                                 "unreachable.txt:4: is reached: a/a.cpp:5: four();"])
+
+    def test_an_entry_without_a_reason_ends_the_program(self):
+        with self.assertRaises(SystemExit):
+            measure.excuses("== a/a.cpp\nthree();\n")
 
 
 class Readme(unittest.TestCase):
