@@ -256,7 +256,7 @@ class FaultLists(Tree):
 
 
 class Coverage(Tree):
-    FOLDER = measure.Folder("a", "a_test", 100.0, 75.0, True)
+    FOLDER = measure.Folder("a", ("a_test",), 100.0, 75.0, True)
 
     def setUp(self):
         super().setUp()
@@ -282,6 +282,10 @@ class Coverage(Tree):
         other.add_use(0, [0, 0])
         line.add_function(other)
         self.assertEqual((line.count, line.branches), (3, [1, 2, 0, 0, 0]))
+
+    def test_only_lines_of_brackets_are_without_code(self):
+        self.assertEqual([text for text in ("}", "  });", "} else {", "}();", "", "f();", "x}")
+                          if measure.without_code(text)], ["}", "  });", "}();"])
 
     def test_branches_of_exceptions_are_left_out(self):
         self.assertEqual(measure.taken([{"count": 0, "throw": True}, {"count": 3, "throw": False}]),
