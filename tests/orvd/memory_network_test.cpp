@@ -404,7 +404,7 @@ TEST_P(MemoryOfAMechanism, ThatFailsProvesNothingThatIsWrongAndHarmsNobody) {
   ASSERT_NE(find_mechanism(mechanisms, GetParam(), {}), nullptr);
   int refused = 0;
   // The thousands of rounds in which a password is hashed are all the same.
-  for (long n = 1;; n += n < 100 ? 1 : n / 3) {
+  for (long n = 1;; n += n < 40 ? 1 : n / 2) {
     SCOPED_TRACE("allocation " + std::to_string(n));
     std::optional<SaslOutcome> last;
     const bool hit = fails(n, last);
