@@ -342,10 +342,9 @@ class Filter::Evaluation {
     return present || node.type.known != nullptr ? Truth::no : Truth::undefined;
   }
 
+  // Of the kinds for which it matters what the value is.
   static bool value_matches(const Node& node, std::string_view value) {
     switch (node.kind) {
-      case Kind::presence:
-        return true;
       case Kind::substrings:
         return node.parts->matches(value);
       case Kind::at_least:
