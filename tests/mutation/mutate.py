@@ -3,7 +3,8 @@
 usage: mutate.py [--list FILE]... [--only TEXT] [--work DIR] [--keep]
 
 Works in a copy of the sources; the tree itself is not touched. The name of a list says which tests
-run: those of the backend, or of the configuration-file library. A list has blocks like
+run: those of the backend, the authority matrix by itself, or those of the configuration-file library.
+A list has blocks like
 
     == back-config/config_bind.cpp
     - what the source says
@@ -30,6 +31,11 @@ SUITES = {
         "needed": ("back-config", "slapi/include", "tests/unit", "tests/check_behaviours.py"),
         "folders": ("back-config", "tests/unit"),
         "target": "backend_unit_tests",
+        "arguments": []},
+    "authority": {
+        "needed": ("back-config", "slapi/include", "tests/unit", "tests/check_behaviours.py"),
+        "folders": ("back-config", "tests/unit"),
+        "target": "backend_authority_tests",
         "arguments": []},
     "cfg": {
         "needed": ("cfg/src", "cfg/CMakeLists.txt", "tests/cfg"),

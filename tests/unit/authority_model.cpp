@@ -591,9 +591,11 @@ const std::string* first_value(const Modification* m) {
 
 // ---- ... of the administrator's own identities and the roles of members
 
+// Each value is judged by the one at its place in the first modification of roles.
 int roles_are_known(const Modification& m, const Modification& first) {
   for (std::size_t i = 0; i < m.values->size(); ++i) {
-    if (i >= first.values->size() || !is_role(first.values->at(i))) return kOther;
+    const bool has_place = first.values && i < first.values->size();
+    if (!is_role(has_place ? first.values->at(i) : m.values->at(i))) return kOther;
   }
   return 0;
 }
@@ -957,7 +959,7 @@ Outcome modifying(const Server& server, const Caller& caller, const std::string&
 
 View searching(const Server& server, const Caller& caller,
                const std::optional<std::vector<Entry>>& found) {
-  if (server.kind == 3 && !server.caller_is_marked) return {kMissing, {}};
+  if (server.kind == 3 && server.caller_mark != 1) return {kMissing, {}};
   if (is_master_server(caller) || is_stranger(caller)) return {kRefused, {}};
   if (!found) return {kMissing, {}};
   View view;

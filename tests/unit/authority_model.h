@@ -78,7 +78,7 @@ struct Caller {
 struct Server {
   const File* file = nullptr;
   int kind = 0;
-  bool caller_is_marked = false;  // for searches on a server of kind 3
+  int caller_mark = 0;  // 1 lets it search a server of kind 3
   bool safe_mode = false;
   bool password_policy = false;
   int password = 0;           // what the policy says of a new password
