@@ -99,7 +99,9 @@ int config_back_init(Backend* backend) {
   // 1. What the server left for the start.
   auto* startup = static_cast<BackendStartup*>(backend->private_data);
 
-  // 2. The state, with its lock.
+  // 2. The state, with its lock. A start that fails releases the path, the state and the name of
+  // the save file: the reverse of the order in which they are declared.
+  MallocText save;
   StatePtr state = make_state(*startup);
   if (state == nullptr) {
     // The one failure after which the start-up record is gone.
@@ -113,10 +115,10 @@ int config_back_init(Backend* backend) {
   if (path == nullptr) return trace.exit(result::no_memory);
   std::size_t length = 0;
   int rc = resolve_link(trace, startup->config_file, path.get(), length);
+  if (rc == result::other) state.reset();  // no file: here alone the state goes before the path
   if (rc != 0) return trace.exit(rc);
 
   // 4. The save file beside it.
-  MallocText save;
   rc = derive_save_name(trace, path.get(), length, save);
   if (rc != 0) return trace.exit(rc);
 

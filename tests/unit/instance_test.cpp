@@ -244,6 +244,53 @@ TEST_F(Instance, WithoutMemoryForTheSaveNameTheStartupRecordIsKept) {
   expect_startup_kept();
 }
 
+// A start that fails releases what it has made, each failure in an order of its own.
+class FailedStart : public Instance {
+ protected:
+  FailedStart() {
+    platform.link_target = "/a";
+    platform.name_allocation(1, "state");
+    platform.name_allocation(2, "path");
+    platform.name_allocation(3, "save name");
+  }
+  void TearDown() override {
+    std::free(startup);
+    Instance::TearDown();
+  }
+};
+
+TEST_F(FailedStart, AtTheLinkReleasesTheStateBeforeThePath) {
+  platform.link_errno = ENOENT;
+  EXPECT_EQ(start("/nowhere"), 80);
+  EXPECT_THAT(platform.calls({"free"}), ElementsAre("free(state)", "free(path)"));
+}
+
+TEST_F(FailedStart, AtTheCopyOfThePathReleasesThePathBeforeTheState) {
+  platform.link_errno = EINVAL;
+  EXPECT_EQ(start(std::string(4096, 'p').c_str()), 1);
+  EXPECT_THAT(platform.calls({"free"}), ElementsAre("free(path)", "free(state)"));
+}
+
+TEST_F(FailedStart, WithoutMemoryForTheSaveNameReleasesThePathBeforeTheState) {
+  platform.fail_allocation(3);
+  EXPECT_EQ(start("/b"), 90);
+  EXPECT_THAT(platform.calls({"free"}), ElementsAre("free(path)", "free(state)"));
+}
+
+TEST_F(FailedStart, AtTheCopyIntoTheSaveNameReleasesThatLast) {
+  platform.fail("kel_strlcpy", 1, 8);
+  EXPECT_EQ(start("/b"), 1);
+  EXPECT_THAT(platform.calls({"free"}),
+              ElementsAre("free(path)", "free(state)", "free(save name)"));
+}
+
+TEST_F(FailedStart, AtTheAppendToTheSaveNameReleasesThatLast) {
+  platform.fail("kel_strlcat", 1, 8);
+  EXPECT_EQ(start("/b"), 1);
+  EXPECT_THAT(platform.calls({"free"}),
+              ElementsAre("free(path)", "free(state)", "free(save name)"));
+}
+
 TEST_F(Instance, NothingIsTracedWhenNotDebugging) {
   debug_off();
   platform.link_errno = ENOENT;
