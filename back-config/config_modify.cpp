@@ -976,75 +976,76 @@ int find_holder(_CFG* session, const char* dn, const PasswordHolder& holder, Cfg
   return result::no_such_object;
 }
 
-// The password that the entry has. `text` is null where it has none, and otherwise borrowed from
-// one of the other two.
-struct OldPassword {
-  CfgValues values;
-  ClearText clear;
-  char* text = nullptr;
+// What a check holds until its end. It is then released from the last member to the first: the
+// values, the copies, the clear text, the result.
+struct PasswordCheck {
+  CfgResult chain;
+  ClearText clear;      // the old password, where it was sealed
+  ClearText password;   // a copy of the new one
+  MallocText dn;        // a copy; null where the attribute has no value
+  CfgValues dn_values;  // kept, though `dn` is a copy of the first
+  CfgValues old_values;
+  char* old_password = nullptr;  // in `clear` or in `old_values`; null where there is none
 };
 
 int read_old_password(const ldtr_function_local& trace, _CFG* session, _CFGMessage* record,
-                      const char* type, bool adding, OldPassword& old) {
-  old.values.reset(cfg_get_values(session, record, type));
+                      const char* type, bool adding, PasswordCheck& check) {
+  check.old_values.reset(cfg_get_values(session, record, type));
   const int rc = cfg_get_errno(session);
   if (rc != 0) {
     trace.debug(trace::error, kNoPassword);
     // Who adds a password need not have had one; who replaces one must.
     return rc == result::no_such_attribute && adding ? static_cast<int>(result::success) : rc;
   }
-  if (old.values == nullptr || old.values.get()[0] == nullptr) return result::success;
-  char* const stored = old.values.get()[0];
+  if (check.old_values == nullptr || check.old_values.get()[0] == nullptr) return result::success;
+  char* const stored = check.old_values.get()[0];
   char* clear = nullptr;
   if (unformat_password(stored, &clear, session->key, 0) == 1) {
-    old.clear.reset(clear);
-    old.text = clear;
+    check.clear.reset(clear);
+    check.old_password = clear;
   } else {
     trace.debug(trace::detail, kNotSealed);
-    old.text = stored;
+    check.old_password = stored;
   }
   return result::success;
 }
 
-// `dn` stays null where the attribute has no value.
 int read_identity_dn(const ldtr_function_local& trace, _CFG* session, _CFGMessage* record,
-                     const char* type, MallocText& dn) {
-  const CfgValues values(cfg_get_values(session, record, type));
+                     const char* type, PasswordCheck& check) {
+  check.dn_values.reset(cfg_get_values(session, record, type));
   const int rc = cfg_get_errno(session);
   if (rc != 0) {
     trace.debug(trace::error, kNoDn);
     return rc;
   }
-  if (values == nullptr || values.get()[0] == nullptr) return result::success;
-  dn.reset(slapi_ch_strdup(values.get()[0]));
-  return dn != nullptr ? result::success : result::no_memory;
+  if (check.dn_values == nullptr || check.dn_values.get()[0] == nullptr) return result::success;
+  check.dn.reset(slapi_ch_strdup(check.dn_values.get()[0]));
+  return check.dn != nullptr ? result::success : result::no_memory;
 }
 
 int check_new_password(const ldtr_function_local& trace, Operation* operation, _CFG* session,
                        const char* normalized_dn, const ldapmod& modification) {
   const PasswordHolder& holder = holder_of(normalized_dn);
-  CfgResult chain;
-  int rc = find_holder(session, normalized_dn, holder, chain);
+  PasswordCheck check;
+  int rc = find_holder(session, normalized_dn, holder, check.chain);
   if (rc != 0) return rc;
-  _CFGMessage* const record = cfg_first_entry(session, chain.get());
+  _CFGMessage* const record = cfg_first_entry(session, check.chain.get());
 
-  OldPassword old;
   const bool adding = modification.operation() == kModAdd;
-  rc = read_old_password(trace, session, record, holder.password, adding, old);
+  rc = read_old_password(trace, session, record, holder.password, adding, check);
   if (rc != 0) return rc;
-  MallocText dn;
-  rc = read_identity_dn(trace, session, record, holder.dn, dn);
-  if (rc != 0) return rc;
-
-  const ClearText password(slapi_ch_strdup(value_text(modification, 0)));
-  if (password == nullptr) return result::no_memory;  // also for a replace by nothing
-  rc = verify_admin_password(password.get(), old.text, operation);
+  rc = read_identity_dn(trace, session, record, holder.dn, check);
   if (rc != 0) return rc;
 
-  // The server looks at the mark. Whether lockout is on is asked without use; kept as it is: the
-  // server may count on being asked.
+  check.password.reset(slapi_ch_strdup(value_text(modification, 0)));
+  if (check.password == nullptr) return result::no_memory;  // also for a replace by nothing
+  rc = verify_admin_password(check.password.get(), check.old_password, operation);
+  if (rc != 0) return rc;
+
+  // Whether lockout is on is asked for the call's own sake: the answer decides nothing. The server
+  // looks at the mark.
   static_cast<void>(pwdIsAdminPasswordLockoutOn());
-  AdminPasswordRecord* const failures = findAdminPWDPAttrib(dn.get());
+  AdminPasswordRecord* const failures = findAdminPWDPAttrib(check.dn.get());
   if (failures != nullptr) failures->changed = 1;
   return result::success;
 }

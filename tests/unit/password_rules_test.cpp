@@ -1,4 +1,6 @@
 // Passwords of administrators: changes of the policy, new passwords, how passwords are stored.
+#include <algorithm>
+
 #include "backend_test.h"
 #include "config_modify.h"
 #include "slapi/services.h"
@@ -617,6 +619,60 @@ TEST_F(NewPassword, EachFailingAllocationIsAnsweredAndLeaksNothing) {
     EXPECT_EQ(rc, 0);
     EXPECT_EQ(nth, 8);  // two searches, values, clear text, values, DN, password; then none
   }
+}
+
+// What was read for a check is released at its end.
+class NewPasswordRelease : public NewPassword {
+ protected:
+  NewPasswordRelease() {
+    entry(kTop, {{kAdminPassword, {"{sealed}old"}}, {"orv-slapdAdminDN", {"cn=root"}}});
+    platform.name_allocation(3, "clear text");  // after the result and the values of the password
+    platform.name_allocation(5, "copy of the DN");
+    platform.name_allocation(6, "copy of the password");
+  }
+  // Every release, and what is asked of the server.
+  [[nodiscard]] std::vector<std::string> releases() const {
+    return platform.calls(
+        {"verify_admin_password", "findAdminPWDPAttrib", "cfg_value_free", "free", "cfg_msgfree"});
+  }
+};
+
+TEST_F(NewPasswordRelease, ComesLastAndTakesValuesCopiesClearTextAndResult) {
+  EXPECT_EQ(replace(kTop), 0);
+  EXPECT_THAT(releases(),
+              ElementsAre("verify_admin_password(\"new\", \"old\", operation)",
+                          "findAdminPWDPAttrib(\"cn=root\")", "cfg_value_free()",
+                          "cfg_value_free()", "free(copy of the DN)", "free(copy of the password)",
+                          "free(clear text)", "cfg_msgfree(chain)"));
+}
+
+TEST_F(NewPasswordRelease, OfThePasswordsValuesComesBeforeThatOfTheDns) {
+  std::vector<std::vector<std::string>> left;
+  platform.at("cfg_value_free", 0, [&] { left.push_back(platform.leaks()); });
+  entry(kTop, {{kAdminPassword, {"{sealed}old", "x", "y"}}, {"orv-slapdAdminDN", {"cn=root"}}});
+  EXPECT_EQ(replace(kTop), 0);
+  ASSERT_EQ(left.size(), 2U);
+  const auto values = [](const std::vector<std::string>& kinds) {
+    return std::count(kinds.begin(), kinds.end(), "cfg_value");
+  };
+  EXPECT_EQ(values(left[0]), 4);
+  EXPECT_EQ(values(left[1]), 1);
+}
+
+TEST_F(NewPasswordRelease, ComesInTheSameOrderAfterARefusal) {
+  platform.fail("verify_admin_password", 1, 19);
+  EXPECT_EQ(replace(kTop), 19);
+  EXPECT_THAT(releases(),
+              ElementsAre("verify_admin_password(\"new\", \"old\", operation)", "cfg_value_free()",
+                          "cfg_value_free()", "free(copy of the DN)", "free(copy of the password)",
+                          "free(clear text)", "cfg_msgfree(chain)"));
+}
+
+TEST_F(NewPasswordRelease, ComesInTheSameOrderWhereTheDnCannotBeRead) {
+  platform.fail("cfg_get_errno", 2, 80);  // with its values
+  EXPECT_EQ(replace(kTop), 80);
+  EXPECT_THAT(releases(), ElementsAre("cfg_value_free()", "cfg_value_free()", "free(clear text)",
+                                      "cfg_msgfree(chain)"));
 }
 
 TEST_F(NewPassword, LeavesAnExitRecord) {
