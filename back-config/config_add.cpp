@@ -781,27 +781,39 @@ int compare_with_values(const ldtr_function_local& trace, _CFG* session, _CFGMes
   return rc;
 }
 
+// The DN of a record, as the file has it and in its normal form. The latter is released first.
+struct RecordDn {
+  CfgText local;
+  MallocText normal;
+
+  void release() noexcept {
+    normal.reset();
+    local.reset();
+  }
+};
+
 // An entry is not compared with itself, so that it can be modified.
 int compare_with_record(const ldtr_function_local& trace, _CFG* session, _CFGMessage* record,
-                        const char* local_dn, const char* dn, char** subtrees) {
-  MallocText record_dn;
-  const int rc = normal_form(local_dn, record_dn);
-  if (rc != 0) return rc;
-  if (kel_strcasecmp(record_dn.get(), dn) == 0) return result::success;
-  return compare_with_values(trace, session, record, record_dn.get(), subtrees);
+                        const char* record_dn, const char* dn, char** subtrees) {
+  if (kel_strcasecmp(record_dn, dn) == 0) return result::success;
+  return compare_with_values(trace, session, record, record_dn, subtrees);
 }
 
+// Whatever ends the walk, the DN goes with its record, but for one that has no normal form: that is
+// left in `record_dn`.
 int compare_with_chain(const ldtr_function_local& trace, _CFG* session, _CFGMessage* chain,
-                       const char* dn, char** subtrees) {
+                       const char* dn, char** subtrees, RecordDn& record_dn) {
   _CFGMessage* record = cfg_first_entry(session, chain);
-  CfgText record_dn(cfg_get_dn(session, record));
-  if (record_dn == nullptr) return result::no_memory;
-  while (record_dn != nullptr) {
-    const int rc = compare_with_record(trace, session, record, record_dn.get(), dn, subtrees);
+  record_dn.local.reset(cfg_get_dn(session, record));
+  if (record_dn.local == nullptr) return result::no_memory;
+  while (record_dn.local != nullptr) {
+    int rc = normal_form(record_dn.local.get(), record_dn.normal);
     if (rc != 0) return rc;
-    record_dn.reset();
+    rc = compare_with_record(trace, session, record, record_dn.normal.get(), dn, subtrees);
+    record_dn.release();
+    if (rc != 0) return rc;
     record = cfg_next_entry(session, record);
-    record_dn.reset(record == nullptr ? nullptr : cfg_get_dn(session, record));
+    record_dn.local.reset(record == nullptr ? nullptr : cfg_get_dn(session, record));
   }
   return result::success;
 }
@@ -810,6 +822,7 @@ int compare_with_chain(const ldtr_function_local& trace, _CFG* session, _CFGMess
 // entry of the file than `dn`: 0, 19; 1, 90, or the code of the search.
 int doesConflictingPTAsubtreeExists(_CFG* session, const char* dn, char** subtrees) {
   ldtr_function_local trace(function_id::does_conflicting_pta_subtree_exist);
+  RecordDn record_dn;  // what is left in it goes after the result
   CfgResult chain;
   const int rc = search_passthrough_entries(session, chain);
   if (rc != 0) {
@@ -821,7 +834,7 @@ int doesConflictingPTAsubtreeExists(_CFG* session, const char* dn, char** subtre
     trace.debug(trace::detail, kNothingToConflict);
     return trace.exit(result::success);
   }
-  return trace.exit(compare_with_chain(trace, session, chain.get(), dn, subtrees));
+  return trace.exit(compare_with_chain(trace, session, chain.get(), dn, subtrees, record_dn));
 }
 
 // ---- The settings of an entry

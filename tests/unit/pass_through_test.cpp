@@ -499,6 +499,46 @@ TEST_F(PassThrough, DnOfAnotherEntryThatCannotBeConvertedGives1) {
   expect_only_the_session_left();
 }
 
+TEST_F(PassThrough, DnThatCannotBeConvertedIsReleasedAfterTheResult) {
+  make_with_subtrees({"o=a"});
+  file({{kOther, {{"orv-slapdPtaSubtree", {"o=b"}}}}});
+  const std::string dn_released = "cfg_memfree(\"" + std::string(kOther) + "\")";
+  platform.fail("xlate_localcp_to_utf8", 2, 21);
+  EXPECT_EQ(verify(), 1);
+  EXPECT_THAT(platform.calls({"free", "cfg_memfree", "cfg_msgfree"}),
+              ElementsAre("cfg_msgfree(chain)", dn_released));
+  platform.forget();
+  platform.at("xlate_localcp_to_utf8", 2,
+              [&] { platform.name_allocation(platform.allocations() + 1, "converted DN"); });
+  platform.fail("replace_DN", 2, 34);
+  EXPECT_EQ(verify(), 1);
+  EXPECT_THAT(platform.calls({"free", "cfg_memfree", "cfg_msgfree"}),
+              ElementsAre("cfg_msgfree(chain)", "free(converted DN)", dn_released));
+}
+
+TEST_F(PassThrough, ValuesThenDnThenResultAreReleasedWhereTheWalkEndsAtAnEntry) {
+  const auto expect_values_dn_result = [&](int code, const std::string& existing) {
+    file({{kOther, {{"orv-slapdPtaSubtree", {"o=b", existing}}}}});
+    platform.at("cfg_memfree", 1, [&] {
+      EXPECT_THAT(platform.leaks(), Not(Contains("cfg_value")));
+      EXPECT_THAT(platform.leaks(), Not(Contains("cfg_values")));
+    });
+    EXPECT_EQ(verify(), code);
+    EXPECT_THAT(platform.calls({"cfg_memfree", "cfg_msgfree"}),
+                ElementsAre("cfg_memfree(\"" + std::string(kOther) + "\")", "cfg_msgfree(chain)"));
+  };
+  make_with_subtrees({"o=a"});
+  expect_values_dn_result(19, "o=a");  // a conflict
+  platform.forget();
+  platform.fail("cfg_get_errno", 1, 53);  // values that came with an error
+  expect_values_dn_result(1, "o=c");
+  platform.forget();
+  platform.fail("replace_DN", 4, 34);  // a value that has no normal form
+  expect_values_dn_result(1, "o=c");
+  platform.forget();
+  expect_values_dn_result(0, "o=c");
+}
+
 TEST_F(PassThrough, ValuesThatCannotBeReadGive1WithTheEntrysDn) {
   make_with_subtrees({"o=a"});
   file({{kOther, {{"cn", {"x"}}}}});
