@@ -139,8 +139,15 @@ void take_dn(_CFG* session, _CFGMessage* record, entry& e) {
   cfg_xlate_localcp_to_utf8(dn.get(), &e.dn, &length);
 }
 
-// Adds one attribute to the entry. False when there is no memory for it; what the library cannot
-// read is only left out.
+// Without memory for a record's values, the record goes with the entry. It is taken out of its
+// chain first, so that the owner of the chain can still release that.
+void release_record_of_caller(_CFG* session, _CFGMessage* record) {
+  cfg_msg_unlink(session, record);
+  std::free(record);
+}
+
+// Adds one attribute to the entry. False when there is no memory for it, and then the record is
+// gone; what the library cannot read is only left out.
 bool take_attribute(_CFG* session, _CFGMessage* record, const char* name, entry& e) {
   CfgValues values(cfg_get_values(session, record, name));
   if (failed_in(session, "cfg_get_values") || values == nullptr) return true;
@@ -149,17 +156,11 @@ bool take_attribute(_CFG* session, _CFGMessage* record, const char* name, entry&
     // Kept on purpose, like the walk's cursor: whoever runs out of memory here gives up the record
     // and everything that was being read from it.
     static_cast<void>(values.release());
+    release_record_of_caller(session, record);  // before the array that there may be
     return false;
   }
   attr_merge(&e, name, converted.get(), 1, 1, nullptr);
   return true;
-}
-
-// Without memory for a record's values, the record goes with the entry. It is taken out of its
-// chain first, so that the owner of the chain can still release that.
-void release_record_of_caller(_CFG* session, _CFGMessage* record) {
-  cfg_msg_unlink(session, record);
-  std::free(record);
 }
 
 }  // namespace
@@ -182,7 +183,6 @@ entry* CFGMessage2EntryTrans(_CFG* session, _CFGMessage* record) {
   while (name != nullptr) {
     if (!take_attribute(session, record, name.get(), *e)) {
       static_cast<void>(cursor.release());  // kept on purpose, see take_attribute
-      release_record_of_caller(session, record);
       trace.exit(result::no_memory);
       return nullptr;
     }

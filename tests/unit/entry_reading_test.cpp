@@ -359,10 +359,16 @@ class NoMemoryForValueArrays : public ConvertRecord, public testing::WithParamIn
 
 TEST_P(NoMemoryForValueArrays, ReleasesRecordArraysAndEntryButNotCursorAndValues) {
   of({"CN=X", {{"cn", {"a", "b"}}}});
+  // The one of the two arrays that there is.
+  platform.name_allocation(6, "array");
+  platform.name_allocation(7, "array");
   platform.fail_allocation(GetParam());
   EXPECT_EQ(convert(), "null");
-  EXPECT_THAT(platform.calls({"cfg_msg_unlink", "free", "cfg_value_free", "cfg_ber_free"}),
-              ElementsAre("cfg_msg_unlink(session, record 1)", "free(record 1)"));
+  EXPECT_THAT(
+      platform.calls({"cfg_msg_unlink", "free", "cfg_value_free", "cfg_ber_free", "cfg_memfree",
+                      "entry_free"}),
+      ElementsAre("cfg_memfree(\"CN=X\")", "cfg_msg_unlink(session, record 1)", "free(record 1)",
+                  "free(array)", "cfg_memfree(\"cn\")", "entry_free(\"entry\")"));
   EXPECT_THAT(platform.leaks(),
               ElementsAre("cfg_value", "cfg_value", "cfg_values", "chain", "cursor", "session"));
   cfg_msgfree(chain);
