@@ -659,6 +659,7 @@ int processRolesIfAdminGroupEntry(const char* normalized_dn, entry* e, Operation
   if (normalized_dn == nullptr || e == nullptr || operation == nullptr) {
     return trace.exit(refuse_null(trace, kNullToRoles));
   }
+  // Letter case counts here, and not where the container is told from its members: both are meant.
   if (!contains(normalized_dn, config_names::admin_group_dn)) return trace.exit(result::success);
   // Also for the container itself.
   if (!is_primary_administrator(*operation)) return trace.exit(result::insufficient_access);

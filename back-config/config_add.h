@@ -12,7 +12,7 @@ namespace orv {
 
 // ---- Identities under which administrators bind, read straight from the configuration file. The
 // texts are UTF-8 and released with free; null when the identity cannot be read, for whatever
-// reason (the trace tells it).
+// reason. The trace tells it for the three of the primary administrator.
 
 // Bind DN of the primary administrator, normalised. Null also when the file names two.
 char* getAdminDN(_CFG* session);
@@ -57,7 +57,9 @@ int doesProxySplitNameExist(_CFG* session, const char* candidate);
 // missing; 80 not a Kerberos identity. And the entries of the audit logs: 50.
 int checkIfAdminGroupEntry(const char* normalized_dn, entry* e, Connection* connection,
                            Operation* operation);
-// Any entry with a bind DN of a supplier, which must be no administrator's.
+// Any entry with a bind DN of a supplier, which must be no administrator's. An entry that has both
+// classes, the replication entry's and a supplier's, is let pass, and so is one without an object
+// class attribute.
 int checkIfReplSupplierEntry(const char* normalized_dn, entry* e, Connection* connection);
 // The Kerberos identity of the primary administrator: 50, 65, or 80 for anything else.
 int checkIfKerberosEntry(const char* normalized_dn, entry* e, Connection* connection,

@@ -37,7 +37,8 @@ void set_file_option(const ldtr_function_local& trace, _CFG* handle, int option,
 
 void name_files(const ldtr_function_local& trace, _CFG* handle, const ConfigBackendPrivate& state) {
   set_file_option(trace, handle, kCfgOptConfigFile, state.config_file);
-  // Twice, with the same value: the library and readers of its trace see both.
+  // Under the text of the configuration file's name, and twice with the same value: the library and
+  // readers of the trace see it so.
   set_file_option(trace, handle, kCfgOptSaveFile, state.save_file);
   set_file_option(trace, handle, kCfgOptSaveFile, state.save_file);
   if (state.key_stash_file != nullptr) {
@@ -79,6 +80,7 @@ int init_cfg_ld(Connection* connection, ConfigBackendPrivate* state) {
   try {
     connection->config_session = cfg_init(nullptr, 0);
   } catch (...) {
+    // Unlocked without `config_end`: no record is left, and a failure is not told.
     trace.debug(trace::error, kLibraryThrew);
     pthread_mutex_unlock(&state->configMutex);
     return trace.exit(result::operations_error);

@@ -850,7 +850,8 @@ int checkAuditLog(_CFG* session, const char* normalized_dn, ldapmod* modificatio
     trace.debug(trace::error, kAuditNoDn);
     return trace.exit(result::other);
   }
-  // The audit log may change its own file: asked before the list, which so may be null.
+  // The audit log may change its own file: asked before the list, which so may be null. Byte for
+  // byte on purpose: any other spelling is examined like every other entry.
   if (is(normalized_dn, config_names::audit_log_dn)) {
     trace.debug(trace::detail, kAuditItself, normalized_dn);
     return trace.exit(result::success);
@@ -1466,9 +1467,9 @@ int config_back_modify(pblock* pb) {
   // 4. Who is kept out and what a supplier may do, then what the schema has against it.
   rc = check_flags(request);
 
-  // 5. What is to be written. Released in step 8 for its successor, and in step 11 after a success;
-  // on every other way it is left. Kept as it is: who may get here, and how often, is bounded by
-  // the server.
+  // 5. What is to be written. Released in step 11 after a success, the first one in step 8. On
+  // every other way it is left, on purpose: who may get here, and how often, is bounded by the
+  // server.
   ldapmod** copy = nullptr;
   if (rc == 0) rc = copy_modifications(request.modifications, copy);
 

@@ -21,7 +21,9 @@ namespace orv {
 int addmodifyop(ldapmod*** list, int operation, const char* type, const char* value);
 
 // Applies the modifications to `e`, in their order. The result is that of the last one that was
-// looked at: a delete or a replace overwrites the failure of one before it.
+// looked at: a delete, a replace or an unknown code overwrites the failure of one before it. 80 an
+// unknown code; 1 where `attr_delete` or `attr_merge` gives -1; or what the server's functions
+// give.
 int mod_entry(entry* e, ldapmod** modifications);
 
 // Whether the entry `dn` may be what the modifications would make of it: schema, referral,

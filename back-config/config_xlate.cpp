@@ -121,6 +121,7 @@ class ConvertedValues {
   void convert(char** values) {
     for (std::size_t i = 0; i < count_; ++i) {
       berval& value = counted_.get()[i];
+      // Its code is not looked at: what it refuses is merged as an empty value.
       cfg_xlate_localcp_to_utf8(values[i], &value.bv_val, &value.bv_len);
       if (value.bv_len != 0) --value.bv_len;  // converters count the NUL, entries do not
       pointers_.get()[i] = &value;
@@ -136,6 +137,7 @@ void take_dn(_CFG* session, _CFGMessage* record, entry& e) {
   const CfgText dn(cfg_get_dn(session, record));
   if (failed_in(session, "cfg_get_dn") || dn == nullptr) return;
   std::size_t length = 0;
+  // Its code is not looked at: an entry whose DN it refuses goes on without one.
   cfg_xlate_localcp_to_utf8(dn.get(), &e.dn, &length);
 }
 
@@ -159,6 +161,7 @@ bool take_attribute(_CFG* session, _CFGMessage* record, const char* name, entry&
     release_record_of_caller(session, record);  // before the array that there may be
     return false;
   }
+  // Its result is not looked at: an attribute that is not merged is only left out.
   attr_merge(&e, name, converted.get(), 1, 1, nullptr);
   return true;
 }

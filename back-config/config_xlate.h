@@ -26,15 +26,18 @@ int convert(CodePageDirection& direction, const char* text, MallocText& owner);
 // code of `replace_DN`, with `copy` as `dn` was.
 int normalized_copy(const char* dn, MallocText& copy);
 
-// Searches at `dn` (local code page) for "(objectclass=*)", asking for one attribute. 0 with the
-// result in `*chain`, for `cfg_msgfree`; 32 no such entry; 90 no memory; 80 any other failure.
+// Searches at `dn` for "(objectclass=*)", asking for one attribute. `dn` goes to the library as it
+// is: the callers give it in UTF-8, unconverted. 0 with the result in `*chain`, for `cfg_msgfree`;
+// 32 no such entry; 90 no memory; 80 any other failure.
 int cfg_read_cfg_entry(_CFG* session, const char* dn, const char* attribute, int scope,
                        _CFGMessage** chain);
 
 // Makes a server entry of a record, in UTF-8. What the library cannot read (the DN, an attribute)
-// is left out and reported with `cfg_perror`. The entry is released with `entry_free`. Null without
-// memory. **The record itself may then have been released**, and taken out of its chain: the caller
-// must not touch it again, not even to find the one after it.
+// is left out and reported with `cfg_perror`. What the converter refuses is not reported: a DN is
+// left out, a value becomes an empty one; nor is the result of `attr_merge` looked at. The entry is
+// released with `entry_free`. Null without memory. **The record itself may then have been
+// released**, and taken out of its chain: the caller must not touch it again, not even to find the
+// one after it.
 entry* CFGMessage2EntryTrans(_CFG* session, _CFGMessage* record);
 
 // Fetches the entry `dn` as the file has it, without conversion, and notes `dn` in `requested_dn`.

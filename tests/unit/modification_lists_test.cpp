@@ -564,6 +564,18 @@ TEST_F(ChangeCheck, AddressesAreLookedAtBeforePassThroughSettings) {
   EXPECT_EQ(platform.count("ldap_url_parse"), 0);
 }
 
+TEST_F(ChangeCheck, PassThroughSubtreesAreLookedForOnTheSessionOfTheConnection) {
+  set({{"objectClass", {"top"}}, {"orv-slapdPtaSubtree", {"o=a"}}}, 0, kPassthrough);
+  platform.fail("cfg_search_s", 2, 53);
+  EXPECT_EQ(check({}, kPassthrough), 53);
+  EXPECT_THAT(
+      platform.calls({"cfg_search_s"}),
+      ElementsAre("cfg_search_s(session, \"" + std::string(kPassthrough) +
+                      "\", 0, \"objectclass=*\", null, 0)",
+                  "cfg_search_s(session, \"CN=PASSTHROUGH AUTHENTICATION,CN=CONFIGURATION\", 1, "
+                  "\"objectclass=orv-slapdPta\", null, 0)"));
+}
+
 TEST_F(ChangeCheck, LeavesExitRecords) {
   trcEvents = kTraceExit & ~kTraceEntry;
   check({}, "CN=MISSING");
