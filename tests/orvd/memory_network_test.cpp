@@ -2,8 +2,8 @@
 // the real library, and what is around them on all threads. The process lives on, each request is
 // answered or the connection ends, nobody is left waiting, and the next client is served.
 //
-// There are too many allocations to let each of them fail: a sample of them does, another in each
-// run. ORV_FAILING_ALLOCATIONS is how many of each session (0: all), ORV_SEED repeats a run.
+// There are too many allocations to let each of them fail: a sample of them does, the same in each
+// run. ORV_FAILING_ALLOCATIONS is how many of each session (0: all), ORV_SEED draws another sample.
 #include <gtest/gtest.h>
 #include <sasl/sasl.h>
 
@@ -27,6 +27,8 @@
 
 namespace orv::server::test {
 namespace {
+
+constexpr long kSeed = 1;
 
 using namespace std::chrono_literals;
 using orv::test::AllocationFault;
@@ -343,7 +345,7 @@ class MemoryOfAServer : public LoopbackServer {
     const long in_all = none.allocations();
     ASSERT_GT(in_all, 100);
 
-    const long seed = number_from_environment("ORV_SEED", std::random_device()() & 0xFFFFFFL);
+    const long seed = number_from_environment("ORV_SEED", kSeed);
     RecordProperty("ORV_SEED", std::to_string(seed));
     SCOPED_TRACE("ORV_SEED=" + std::to_string(seed));
     std::mt19937 chance(static_cast<unsigned>(seed));
