@@ -12,6 +12,7 @@
 
 #include "check.h"
 #include "config/default_config.h"
+#include "config/local_url.h"
 #include "instance.h"
 #include "show.h"
 #include "slapi/account.h"
@@ -54,22 +55,6 @@ std::string shell_word(const std::string& text) {
   return quoted + "'";
 }
 
-// A path inside a URL (RFC 3986, 2.1).
-std::string url_text(const std::string& path) {
-  constexpr std::string_view kPlain =
-      "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789-._~";
-  constexpr char kHex[] = "0123456789ABCDEF";
-  std::string text;
-  for (const char c : path) {
-    const auto byte = static_cast<unsigned char>(c);
-    if (kPlain.find(c) != std::string_view::npos)
-      text += c;
-    else
-      text.append(1, '%').append(1, kHex[byte >> 4]).append(1, kHex[byte & 15]);
-  }
-  return text;
-}
-
 void print_welcome(const Instance& instance, const Arguments& arguments) {
   const std::string port = arguments.port == 0 ? "PORT" : std::to_string(arguments.port);
   std::cout << "A new instance was made in " << instance.directory << ":\n"
@@ -87,7 +72,7 @@ void print_welcome(const Instance& instance, const Arguments& arguments) {
             << shell_word(arguments.directory + "/admin.pw") << " -b cn=configuration\n"
             << "and as root or the user of the server without a password\n"
             << "  ldapsearch -Q -Y EXTERNAL -H "
-            << shell_word("ldapi://" + url_text(instance.directory + "/ldapi"))
+            << shell_word(orv::local_url(instance.directory + "/ldapi"))
             << " -b cn=configuration\n";
 }
 

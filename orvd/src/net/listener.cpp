@@ -13,6 +13,7 @@
 #include <utility>
 
 #include "cfg/result_codes.h"
+#include "config/local_url.h"
 
 namespace orv::server {
 namespace {
@@ -61,22 +62,6 @@ asio::ip::address plain_address(const asio::ip::address& address) {
   if (address.is_v6() && address.to_v6().is_v4_mapped())
     return asio::ip::make_address_v4(asio::ip::v4_mapped, address.to_v6());
   return address;
-}
-
-// A path inside a URL (RFC 3986, 2.1).
-std::string url_text(const std::string& path) {
-  constexpr std::string_view kPlain =
-      "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789-._~";
-  constexpr char kHex[] = "0123456789ABCDEF";
-  std::string text;
-  for (const char c : path) {
-    const auto byte = static_cast<unsigned char>(c);
-    if (kPlain.find(c) != std::string_view::npos)
-      text += c;
-    else
-      text.append(1, '%').append(1, kHex[byte >> 4]).append(1, kHex[byte & 15]);
-  }
-  return text;
 }
 
 // Where a Unix socket is; "" for one without a name in the file system.
@@ -302,7 +287,7 @@ std::uint16_t Listeners::port(bool secure) const {
 std::string Listeners::url(const Listener& listener) const {
   asio::error_code ignored;
   if (listener.kind == Kind::local)
-    return "ldapi://" + url_text(local_path(listener.acceptor.local_endpoint(ignored)));
+    return local_url(local_path(listener.acceptor.local_endpoint(ignored)));
   return (listener.kind == Kind::secure ? "ldaps://" : "ldap://") +
          endpoint_text(tcp_endpoint(listener.acceptor.local_endpoint(ignored)));
 }
