@@ -76,7 +76,9 @@ class Editor(threading.Thread):
                     DAMAGES[self.damages % len(DAMAGES)](config, good)
                 time.sleep(source.uniform(0.0, 0.05))
                 with Locked(self.instance):
-                    source.choice([replaced, written_in_place])(config, good)
+                    # Not in place: of a good file that is being written, a reader may see a half
+                    # that is good as well.
+                    replaced(config, good)
                     config.path.chmod(0o600)
                 self.damages += 1
                 time.sleep(source.uniform(0.0, 0.1))
