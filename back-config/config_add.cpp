@@ -714,8 +714,8 @@ int normalize_subtrees(const attr& a, ValueList& subtrees) {
   for (std::size_t i = 0; i < count; ++i) {
     MallocText dn;
     const int rc = normal_form(a.values[i]->bv_val, dn);
+    subtrees.get()[i] = dn.release();  // also one without a normal form: it goes with the others
     if (rc != 0) return rc;
-    subtrees.get()[i] = dn.release();
   }
   return result::success;
 }
@@ -872,21 +872,23 @@ int check_mapping(const entry& e) {
 
 // ---- The review of all entries
 
-// False when the walk ends here.
-bool review(_CFGMessage* record, Connection* connection, MallocText& dn) {
+// False when the walk ends here. `dn` comes with the DN of the record before, and keeps the one of
+// this.
+bool review(_CFGMessage* record, Connection* connection, RecordDn& dn) {
   _CFG* const session = connection->config_session;
-  const CfgText local_dn(cfg_get_dn(session, record));
-  if (local_dn == nullptr || normal_form(local_dn.get(), dn) != 0) return false;
+  dn.release();
+  dn.local.reset(cfg_get_dn(session, record));
+  if (dn.local == nullptr || normal_form(dn.local.get(), dn.normal) != 0) return false;
   const EntryPtr e(CFGMessage2Entry(session, record));
   if (e == nullptr) return false;
-  verifyPassthroughServerEntry(dn.get(), e.get(), connection);  // which tells what is wrong
+  verifyPassthroughServerEntry(dn.normal.get(), e.get(), connection);  // which tells what is wrong
   return true;
 }
 
 void checkAllPTAEntries(Connection* connection) {
   ldtr_function_local trace(function_id::check_all_pta_entries);
   _CFG* const session = connection->config_session;
-  MallocText dn;
+  RecordDn dn;  // the last one goes after the result
   CfgResult chain;
   const int rc = search_passthrough_entries(session, chain);
   if (rc != 0) {

@@ -278,6 +278,18 @@ TEST_F(PassThrough, SubtreeThatCannotBeConvertedOrNormalisedGives1AndStops) {
   expect_only_the_session_left();
 }
 
+TEST_F(PassThrough, SubtreeThatHasNoNormalFormIsReleasedWithTheOthersBeforeTheArray) {
+  make_with_subtrees({"o=a", "o=b", "o=c"});
+  platform.name_allocation(1, "array");
+  platform.at("replace_DN", 1,
+              [&] { platform.name_allocation(platform.allocations() + 1, "first"); });
+  platform.at("xlate_localcp_to_utf8", 2,
+              [&] { platform.name_allocation(platform.allocations() + 1, "second"); });
+  platform.fail("replace_DN", 2, 34);
+  EXPECT_EQ(verify(), 1);
+  EXPECT_THAT(platform.calls({"free"}), ElementsAre("free(first)", "free(second)", "free(array)"));
+}
+
 TEST_F(PassThrough, NoMemoryForTheSubtreesGives90) {
   make_with_subtrees({"o=a"});
   platform.fail_allocation(1);
@@ -686,6 +698,9 @@ TEST_F(PassThrough, ExitRecordsCarryTheCodes) {
 
 class Review : public PassThrough {
  protected:
+  const std::string kFirstDnReleased = "cfg_memfree(\"cn=one," + std::string(kContainer) + "\")";
+  const std::string kSecondDnReleased = "cfg_memfree(\"cn=two," + std::string(kContainer) + "\")";
+
   // Runs `test` in a child process, which fails when the test does.
   template <typename Test>
   void in_a_fresh_process(Test test) {
@@ -871,9 +886,34 @@ TEST_F(Review, LastDnIsReleasedAfterTheResult) {
     platform.at("replace_DN", 0,
                 [&] { platform.name_allocation(platform.allocations() + 1, "DN"); });
     EXPECT_EQ(verify(), 0);
-    EXPECT_THAT(platform.calls({"cfg_msgfree", "free"}),
-                ElementsAre("free(DN)", "cfg_msgfree(chain)", "free(DN)"));
+    EXPECT_THAT(platform.calls({"cfg_get_dn", "cfg_memfree", "cfg_msgfree", "free"}),
+                ElementsAre("cfg_get_dn(session, record 1)", "free(DN)", kFirstDnReleased,
+                            "cfg_get_dn(session, record 2)", "cfg_msgfree(chain)", "free(DN)",
+                            kSecondDnReleased));
   });
+}
+
+TEST_F(Review, DnThatEndsTheWalkIsReleasedAfterTheResult) {
+  const auto expect_released = [&](const std::string& failing,
+                                   const std::vector<std::string>& last) {
+    in_a_fresh_process([&] {
+      g_safe_mode = 1;
+      two_entries();
+      make(kEntry, {});
+      platform.at("replace_DN", 1,
+                  [&] { platform.name_allocation(platform.allocations() + 1, "first DN"); });
+      platform.at("xlate_localcp_to_utf8", 2,
+                  [&] { platform.name_allocation(platform.allocations() + 1, "second DN"); });
+      platform.fail(failing, 2, 21);
+      EXPECT_EQ(verify(), 0);
+      std::vector<std::string> expected = {"free(first DN)", kFirstDnReleased,
+                                           "cfg_msgfree(chain)"};
+      expected.insert(expected.end(), last.begin(), last.end());
+      EXPECT_EQ(platform.calls({"free", "cfg_memfree", "cfg_msgfree"}), expected) << failing;
+    });
+  };
+  expect_released("xlate_localcp_to_utf8", {kSecondDnReleased});
+  expect_released("replace_DN", {"free(second DN)", kSecondDnReleased});
 }
 
 TEST_F(Review, RecordsAreWalkedUnderTheirNormalisedDns) {
