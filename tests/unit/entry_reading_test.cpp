@@ -486,7 +486,8 @@ TEST_F(RetrieveEntry, NoFirstRecordGives1) {
   platform.fail("cfg_first_entry", 1, 0);
   EXPECT_EQ(retrieve(), 1);
   EXPECT_THAT(platform.debug_lines(), ElementsAre(error("retrieve_entry: no c_entry\n")));
-  EXPECT_EQ(platform.count("cfg_msgfree"), 1);
+  EXPECT_THAT(platform.story({"cfg_msgfree"}),
+              ElementsAre("debug: retrieve_entry: no c_entry\n", "cfg_msgfree(chain)"));
 }
 
 TEST_F(RetrieveEntry, FailedConversionGives1) {

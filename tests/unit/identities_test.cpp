@@ -147,6 +147,21 @@ TEST_F(Identities, ValuesAreReleasedAfterTheWalkHasAdvanced) {
                           "free(values)", "cfg_memfree(\"CN=CONFIGURATION\")"));
 }
 
+TEST_F(Identities, IdentityThatIsDiscardedIsReleasedAfterItsLine) {
+  file(kConfiguration, {{"orv-slapdAdminDN", {"CN=A"}}, {"cn", {"x"}}});
+  platform.at("replace_DN", 1,
+              [&] { platform.name_allocation(platform.allocations() + 1, "made"); });
+  platform.fail("cfg_next_attribute", 1, 80);
+  EXPECT_EQ(admin_dn(), "null");
+  const std::vector<std::string> story =
+      platform.story({"cfg_ber_free", "cfg_msgfree", "cfg_memfree", "free"});
+  ASSERT_GT(story.size(), 5U);
+  EXPECT_THAT(
+      std::vector<std::string>(story.end() - 5, story.end()),
+      ElementsAre("cfg_ber_free(cursor)", "cfg_msgfree(chain)", "cfg_memfree(\"CN=CONFIGURATION\")",
+                  "debug: Retrieving orv-slapdAdminDN FAILED rc = 1\n", "free(made)"));
+}
+
 // ---- Several values, no value
 
 TEST_F(Identities, SecondAdminDnFailsTheLookup) {
@@ -514,6 +529,16 @@ TEST_F(Identities, MemberFoundIsDiscardedByALaterError) {
   EXPECT_EQ(member_dn(), "null");
   EXPECT_EQ(last_line(), error("cfg_first_attribute error ! \n"));
   expect_released_and_free_of_locks();
+}
+
+TEST_F(Identities, MemberThatIsDiscardedIsReleasedBeforeItsChain) {
+  file(kMember, {{"orv-slapdAdminDN", {"CN=M"}}, {"cn", {"x"}}});
+  platform.at("replace_DN", 1,
+              [&] { platform.name_allocation(platform.allocations() + 1, "made"); });
+  platform.fail("cfg_get_values", 2, 1);
+  EXPECT_EQ(member_dn(), "null");
+  EXPECT_THAT(platform.calls({"free", "cfg_msgfree"}),
+              ElementsAre("free(made)", "cfg_msgfree(chain)"));
 }
 
 TEST_F(Identities, MemberDnThatCannotBeMadeGivesNullAfterTheWholeWalk) {

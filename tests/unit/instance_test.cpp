@@ -101,6 +101,19 @@ TEST_F(Instance, StateHoldsTheConfiguredPathFromItsBeginning) {
   release_state();
 }
 
+TEST_F(Instance, StateIsWholeAndInItsPlaceBeforeTheCodePageIsSetUp) {
+  platform.link_target = "/a";
+  platform.at("initIconvHandle", 1, [&] {
+    ASSERT_NE(backend.private_data, startup);
+    EXPECT_STREQ(made().config_file, "/a");
+    EXPECT_STREQ(made().save_file, "/a.save");
+    EXPECT_STREQ(made().key_stash_file, "/key");
+  });
+  EXPECT_EQ(start("/b", "/key"), 0);
+  EXPECT_EQ(platform.count("initIconvHandle"), 1);
+  release_state();
+}
+
 TEST_F(Instance, LinesComeBetweenTheSteps) {
   platform.link_errno = EINVAL;
   EXPECT_EQ(start("/b"), 0);

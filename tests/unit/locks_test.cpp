@@ -239,6 +239,14 @@ TEST_F(LockPolicy, IsReadOnceForEachReload) {
   EXPECT_EQ(platform.calls(), std::vector<std::string>{"ldap_getenv(\"AUTOLOCKTYPE\")"});
 }
 
+TEST_F(LockPolicy, ReloadIsNotedBeforeThePolicyIsRead) {
+  al_configfile_counter = 4;
+  configfile_read = 6;
+  platform.at("ldap_getenv", 1, [] { EXPECT_EQ(al_configfile_counter, 6); });
+  EXPECT_EQ(policy(0), 1);
+  EXPECT_EQ(platform.count("ldap_getenv"), 1);
+}
+
 TEST_F(LockPolicy, ExitRecordsCarryThePolicyThatStayed) {
   trcEvents = 0x00020000;
   al_configfile_counter = 1;

@@ -707,6 +707,19 @@ TEST_F(Uniqueness, CandidatesNormalisationKeepsACodeOf32) {
   EXPECT_EQ(supplier_dn("cn=one"), 32);
 }
 
+TEST_F(Uniqueness, NormalisationOfAStoredDnThatGives32CountsAsAMissingEntry) {
+  found(kGroup, {{{"orv-slapdAdminDN", {"cn=one"}}}});
+  platform.fail("replace_DN", 3, 32);  // after the administrator's and the candidate's
+  EXPECT_EQ(member_dn("cn=one"), 0);
+  EXPECT_EQ(platform.count("replace_DN"), 3);
+  platform.forget();
+  found(kReplicationSearch, {{{"orv-slapdMasterDN", {"cn=one"}}}});
+  found(kSupplierSearch, {{{"orv-slapdMasterDN", {"cn=two"}}}});
+  platform.fail("replace_DN", 2, 32);
+  EXPECT_EQ(supplier_dn("cn=two"), 68);
+  EXPECT_EQ(searches().size(), 2U);
+}
+
 TEST_F(Uniqueness, CandidateThatCannotBeCopiedGives90) {
   platform.fail("slapi_ch_strdup", 1, 90);
   EXPECT_EQ(member_dn("cn=one"), 90);
