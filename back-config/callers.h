@@ -33,4 +33,8 @@ inline bool is_admin_group_member(const Operation& operation) {
   return has_all(operation.authority, authority::admin_group_member);
 }
 
+// The entries of the master server and of suppliers let others write all data: these role bits are
+// asked for together. Of the two bits of replication only 0x04.
+inline constexpr unsigned kAllForSuppliers = 0x04 | role::schema | role::server_config;
+
 }  // namespace orv

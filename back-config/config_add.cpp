@@ -228,6 +228,7 @@ char* getAdminGroupMemberDn(Connection* connection, const char* target_dn) {
 
 namespace {
 
+// Wording and blanks are kept as they are: readers of traces know them.
 constexpr const char* kNullSplitName =
     "doesProxySplitNameExist::Invalid NULL pointer passed through.\n";
 constexpr const char* kDnOfAdministrator =
@@ -417,6 +418,7 @@ int doesProxySplitNameExist(_CFG* session, const char* candidate) {
 
 namespace {
 
+// Wording and blanks are kept as they are: readers of traces know them.
 constexpr const char* kNullSplitContainer =
     "CheckIfProxySplitContainer::Invalid NULL pointer passed through.\n";
 
@@ -699,7 +701,8 @@ constexpr const char* kReservedSuffixes[] = {
 // 1 until this process has reviewed the pass-through entries of the file; never set back.
 std::atomic<int> firstTime{1};
 
-// The normal form of a DN that is in the file's code page. 0, or 1 when it has none.
+// The normal form of a DN that is in the file's code page. 0, or 1 when none can be made, for
+// whatever reason, also want of memory.
 int normal_form(const char* local_dn, MallocText& dn) {
   const int rc = take_normalized_dn(local_dn, dn);
   return rc == 0 && dn != nullptr ? result::success : result::operations_error;
@@ -979,10 +982,6 @@ constexpr ProtectedEntry kProtectedEntries[] = {
     {config_names::replication_dn, role::replication | role::server_config},
     {config_names::master_server_dn, role::any_configuration, true},
 };
-
-// The entries of the master server and of suppliers let others write all data: these bits are asked
-// for together.
-constexpr unsigned kAllForSuppliers = 0x04 | role::schema | role::server_config;
 
 const ProtectedEntry* find_protected(const char* dn) {
   const auto* const found =

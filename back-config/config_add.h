@@ -25,8 +25,8 @@ char* getAdminKerberosID(_CFG* session);
 // several.
 char* getAdminDigestUserName(_CFG* session);
 
-// Bind DN of the member of the administrative group whose entry is `target_dn`, normalised. Uses
-// the session in the connection's slot.
+// Bind DN of the member of the administrative group whose entry is `target_dn`, normalised; the
+// first value if there are several. Uses the session in the connection's slot.
 char* getAdminGroupMemberDn(Connection* connection, const char* target_dn);
 
 // ---- Whether an identity (UTF-8) is already in the configuration file. Every stored one counts,
@@ -54,7 +54,7 @@ int doesProxySplitNameExist(_CFG* session, const char* candidate);
 // functions above return is passed on. Of attributes only the first value counts.
 
 // The administrative group and its members: 50 the caller may not; 65 a class or the bind DN is
-// missing; 80 not a Kerberos identity. And the entries of the audit logs: 50.
+// missing; 80 not a Kerberos identity. And three entries of log management: 50.
 int checkIfAdminGroupEntry(const char* normalized_dn, entry* e, Connection* connection,
                            Operation* operation);
 // Any entry with a bind DN of a supplier, which must be no administrator's. An entry that has both
@@ -88,6 +88,8 @@ int processRolesIfAdminGroupEntry(const char* normalized_dn, entry* e, Operation
 // An entry that is to be added below the container of pass-through authentication. 0, also for
 // every other entry; 50 the caller may not; 53 it is not directly below the container; 65 a class
 // is missing; 80 a null argument (the operation must not be null); and what the next one returns.
+// The role bit 0x20 lets add whatever the authority flags are. An entry whose parent cannot be told
+// gives 0 before its classes and settings are looked at.
 int checkIfPassthruSubtreeEntry(entry* e, Connection* connection, Backend* backend,
                                 Operation* operation);
 

@@ -60,6 +60,7 @@ bool adds_or_replaces(const ldapmod& modification) {
 
 namespace {
 
+// Wording, blanks and the missing newline are kept as they are: readers of traces know them.
 constexpr const char* kNoClasses = "checkIPaddrs: entry has no ocs.\n";
 constexpr const char* kTopEntry = "checkIPaddrs: entry is orv-slapdTop.\n";
 constexpr const char* kEveryAddress = "checkIPaddrs: server is configured to use all addrs.\n";
@@ -402,6 +403,7 @@ int checkIfAdminGroupCanModify(Connection* connection, const char* normalized_dn
 
 namespace {
 
+// Wording and blanks are kept as they are: readers of traces know them.
 constexpr const char* kNoRoleList = "Error - checkRootAdminModify: rc = %d\n";
 constexpr const char* kNoEntry = "Error - checkRootAdminModify: entry %s does not exist!\n";
 constexpr const char* kRoleSearchFailed =
@@ -448,6 +450,8 @@ struct RoleChanges {
   std::size_t added = 0;    // replaced ones are not counted
 };
 
+// The server's lists always hold counted values.
+//
 // Each value is checked on the one at its place in the first modification of roles, which is the
 // modification itself when there is only one; where that is shorter, on itself.
 int check_role_values(const ldtr_function_local& trace, berval** first, const ldapmod& m,
@@ -584,6 +588,7 @@ int checkRootAdminModify(_CFG* session, const char* normalized_dn, ldapmod* modi
 
 namespace {
 
+// Wording and blanks are kept as they are: readers of traces know them.
 constexpr const char* kNoValueForDn = "Missing value for dn.\n";
 constexpr const char* kNullToProxyName =
     "checkProxynameModify::Invalid NULL pointer passed through.\n";
@@ -673,6 +678,7 @@ constexpr const char* kPathNotResolved =
     "Error - resolve_path: realpath failed for file name=[%s] errno=%d\n";
 constexpr const char* kPathResolved = "resolve_path: input file=[%s] resolved file=[%s]\n";
 
+// Wording and blanks are kept as they are: readers of traces know them.
 constexpr const char* kNoAuditSession =
     "Error - get_audit_log_filename: invalid configuration session handel\n";
 constexpr const char* kAuditSearch =
@@ -874,11 +880,13 @@ int checkAuditLog(_CFG* session, const char* normalized_dn, ldapmod* modificatio
 
 namespace {
 
+// Wording and blanks are kept as they are: readers of traces know them.
 constexpr const char* kUnknownSetting = "checkAdminPolicyEntryModify:invalid mod_type!\n";
 constexpr const char* kSettingsRefused =
     "checkAdminPolicyEntryModify:validate_new_setting failed, rc=%d!\n";
 constexpr const char* kNoPassword = "Error - no password value\n";
 constexpr const char* kNoDn = "Error - no dn value\n";
+// Written for every answer but 1, not only for 0.
 constexpr const char* kNotSealed = "unformat_password returns 0 for clear text password\n";
 
 // ---- A change of the policy
@@ -1289,7 +1297,7 @@ int read_supplier_mark(const ldtr_function_local& trace, const ModifyRequest& re
   }
   values.reset(cfg_get_values(session, record, kTargetClasses));
   rc = cfg_get_errno(session);
-  if (values == nullptr) return result::no_such_attribute;
+  if (values == nullptr) return result::no_such_attribute;  // whatever the error number
   for (char** value = values.get(); *value != nullptr; ++value) {
     if (kel_strcasecmp(*value, config_names::supplier_class) == 0) supplier = true;
   }
@@ -1337,7 +1345,7 @@ constexpr RoleRule kRoleRules[] = {
     {[](const Target& t) { return contains(t.dn, config_names::passthrough_dn); },
      role::server_config},
     {[](const Target& t) { return t.is(config_names::master_server_dn) || t.supplier; },
-     0x04 | role::schema | role::server_config, true},
+     kAllForSuppliers, true},
 };
 
 bool satisfies(unsigned roles, const RoleRule& rule) {

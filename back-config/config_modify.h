@@ -54,12 +54,13 @@ int checkIfAdminGroupCanModify(Connection* connection, const char* normalized_dn
                                const char* bound_dn, ldapmod* modifications);
 
 // What the primary administrator makes of administrators, in the top entry and in the group: bind
-// DN, roles, Kerberos identity, Digest-MD5 user, in this order. Rewrites the list where it would
-// leave a member without roles: the first delete in it, whatever it deletes, then stores "NoAdmin".
+// DN, roles, Kerberos identity, Digest-MD5 user, in this order. Rewrites the list where its values
+// delete as many roles as the member has and it adds: the first delete in it, whatever it deletes,
+// then stores "NoAdmin". A refusal of a later identity leaves it rewritten.
 //   16  the member has no roles, or not the last one that is deleted
 //   32  no such entry
 //   80  a value is no role or no Kerberos identity, or the roles cannot be read
-//   90  no memory; the list is as it was
+//   90  no memory; the list is as it was where the roles are concerned
 int checkRootAdminModify(_CFG* session, const char* normalized_dn, ldapmod* modifications);
 
 // The identities of the primary administrator in their own entries: 50 for everybody else, also to

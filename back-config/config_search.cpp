@@ -49,6 +49,7 @@ constexpr useconds_t kShortPause = 100'000;  // microseconds
 constexpr int kLongAttempts = 570;
 constexpr useconds_t kLongPause = 1'000'000;
 
+// The line has a place for an int: of a longer identifier the lower part is shown.
 int calling_thread() {
   return static_cast<int>(pthread_self());
 }

@@ -155,8 +155,8 @@ bool take_attribute(_CFG* session, _CFGMessage* record, const char* name, entry&
   if (failed_in(session, "cfg_get_values") || values == nullptr) return true;
   const ConvertedValues converted(values.get());
   if (!converted.complete()) {
-    // Kept on purpose, like the walk's cursor: whoever runs out of memory here gives up the record
-    // and everything that was being read from it.
+    // Kept on purpose, like the walk's cursor: whoever runs out of memory here gives up the record,
+    // its walk and the values just read.
     static_cast<void>(values.release());
     release_record_of_caller(session, record);  // before the array that there may be
     return false;

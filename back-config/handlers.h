@@ -43,8 +43,9 @@ int config_back_bind(pblock* pb);
 // result of `cfg_unbind`.
 int config_back_unbind(pblock* pb);
 
-// Answers a search from the configuration file (see config_search.h). Releases `configMutex` on
-// every path but that of a client who is gone, even when it was never taken.
+// Answers a search from the configuration file (see config_search.h); to a client who is gone
+// nothing is sent and the result is 0. Releases `configMutex` on every other path, even when it was
+// never taken.
 int config_back_search(pblock* pb);
 
 // Adds the entry in `pb` to the configuration file (see config_add.h for the rules). Rewrites the
@@ -56,7 +57,8 @@ int config_back_add(pblock* pb);
 // Removes an entry from the configuration file (see config_delete.h for who may). While persistent
 // searches run, the entry as it was is stored as parameter -157 in the operation's block, also when
 // the delete then fails; it is the server's to release. When the session cannot be opened
-// **nothing is sent**, and slot and lock stay as in `config_back_add`.
+// **nothing is sent**, and slot and lock stay as in `config_back_add`. Otherwise answers when
+// connection and operation are known.
 int config_back_delete(pblock* pb);
 
 // Changes an entry of the configuration file (see config_modify.h for the rules). Takes the list of
