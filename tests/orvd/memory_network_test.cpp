@@ -12,6 +12,7 @@
 #include <chrono>
 #include <cstdlib>
 #include <filesystem>
+#include <limits>
 #include <memory>
 #include <optional>
 #include <random>
@@ -20,6 +21,7 @@
 
 #include "../slapi/failing_allocation.h"
 #include "auth/sasl_cyrus.h"
+#include "auth/sasl_memory.h"
 #include "core_server_fixture.h"
 #include "core_tls_client.h"
 #include "net/tls.h"
@@ -438,6 +440,14 @@ TEST_F(MemoryOfAServer, ThatFailsWhereTlsComesFirstEndsAtMostThatConnection) {
 
 TEST_F(MemoryOfAServer, ThatFailsUnderASecurityLayerEndsAtMostThatConnection) {
   fail_in([this] { return with_a_layer(); });
+}
+
+TEST(ReserveOfTheSaslLibrary, GivesNothingWhereThereIsNotSoMuch) {
+  AllocationFault fault(1);
+  void* const none = allocate_for_sasl(std::numeric_limits<std::size_t>::max() - 10);
+  fault.disarm();
+  EXPECT_EQ(none, nullptr);
+  EXPECT_TRUE(sasl_lacked_memory());
 }
 
 }  // namespace

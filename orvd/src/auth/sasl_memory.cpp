@@ -24,6 +24,7 @@ constexpr std::size_t kBlocks = 384;
 class Reserve {
  public:
   void* allocate(std::size_t size) noexcept {
+    if (size > memory_.size()) return nullptr;
     const std::size_t wanted = std::max<std::size_t>(1, (size + kBlock - 1) / kBlock);
     const std::lock_guard lock(mutex_);
     std::size_t run = 0;
