@@ -183,6 +183,12 @@ TEST_F(AddPassThrough, ContainerItselfWouldNeedTheContainerClass) {
   EXPECT_EQ(check(), 65);
 }
 
+TEST_F(AddPassThrough, ClassTopIsAskedForBeforeTheContainersOwn) {
+  make(kContainer, {{"objectClass", {"container"}}});
+  platform.fail("kel_strcasecmp", 1, 0);
+  EXPECT_EQ(check(), 65);
+}
+
 TEST_F(AddPassThrough, SettingsAreVerifiedLast) {
   make(kEntry, {{"objectClass", {"top", "orv-slapdConfigEntry", "orv-slapdPta"}},
                 {"orv-slapdPtaURL", {"nonsense"}}});
@@ -257,6 +263,7 @@ TEST_F(PassThrough, SubtreesAreConvertedAndNormalisedInOrder) {
       platform.calls({"xlate_localcp_to_utf8", "replace_DN"}),
       ElementsAre("xlate_localcp_to_utf8(\"o = k\xE4se\")", "replace_DN(\"o = k\xC3\xA4se\", 1)",
                   "xlate_localcp_to_utf8(\"o=b\")", "replace_DN(\"o=b\", 1)"));
+  EXPECT_EQ(platform.sizes.front(), 3 * sizeof(char*));  // a null after the two
   expect_only_the_session_left();
 }
 
@@ -349,6 +356,16 @@ TEST_F(PassThrough, ReservedSuffixIsToldBeforeANestedSubtree) {
                           "AUTHENTICATION,CN=CONFIGURATION\", \"CN=SCHEMA\")"));
 }
 
+TEST_F(PassThrough, FirstReservedSuffixThatOverlapsEndsTheCheck) {
+  make_with_subtrees({"o=a", "o=b"});
+  platform.fail("are_nested_dn", 0, 1);  // each
+  EXPECT_EQ(verify(), 19);
+  EXPECT_THAT(platform.calls({"are_nested_dn", "PrintMessage", "cfg_search_s"}),
+              ElementsAre("are_nested_dn(\"O=A\", \"CN=CONFIGURATION\")",
+                          "PrintMessage(0, 8, 174, \"" + std::string(kEntry) +
+                              "\", \"CN=CONFIGURATION\")"));
+}
+
 TEST_F(PassThrough, SubtreesNestedWithinTheEntryGive19TracedAndLogged) {
   make_with_subtrees({"o=x", "o=y", "ou=people,o=y"});
   EXPECT_EQ(verify(), 19);
@@ -414,7 +431,7 @@ TEST_F(PassThrough, SubtreesOfAnotherEntryMayNotOverlap) {
   expect_only_the_session_left();
 }
 
-TEST_F(PassThrough, AncestorOfAnothersSubtreeOverlapsToo) {
+TEST_F(PassThrough, SubtreeBelowAnothersOverlapsToo) {
   make_with_subtrees({"o=b"});
   file({{kOther, {{"orv-slapdPtaSubtree", {"o=b"}}}}});
   EXPECT_EQ(verify(), 19);
@@ -430,6 +447,36 @@ TEST_F(PassThrough, NewSubtreesAreTheOuterLoopAndTheFirstPairEndsIt) {
   EXPECT_EQ(verify(), 19);
   EXPECT_THAT(platform.calls({"PrintMessage"}),
               ElementsAre("PrintMessage(0, 8, 167, \"O=A\", \"O=A\")"));
+}
+
+TEST_F(PassThrough, PairThatFailedIsTheOnlyOneToldAndTheLastOneCompared) {
+  make_with_subtrees({"o=a"});
+  file({{kOther, {{"orv-slapdPtaSubtree", {"o=a", "ou=x,o=a"}}}}});
+  EXPECT_EQ(verify(), 19);
+  EXPECT_THAT(platform.story({"PrintMessage"}),
+              ElementsAre("debug: doesConflictingPTAsubtreeExists: Nested PTA Subtrees found "
+                          "'O=A', 'O=A'\n",
+                          "PrintMessage(0, 8, 167, \"O=A\", \"O=A\")"));
+  platform.forget();
+  make_with_subtrees({"o=y", "ou=a,o=y", "ou=b,o=y"});
+  EXPECT_EQ(verify(), 19);
+  EXPECT_THAT(platform.story({"PrintMessage"}),
+              ElementsAre("debug: doesConflictingPTAsubtreeExists: Nested PTA Subtrees found "
+                          "'O=Y', 'OU=A,O=Y'\n",
+                          "PrintMessage(0, 8, 167, \"O=Y\", \"OU=A,O=Y\")"));
+}
+
+TEST_F(PassThrough, EachNewSubtreeMeetsTheExistingOnesInTheirOrder) {
+  make_with_subtrees({"o=a", "o=b"});
+  file({{kOther, {{"orv-slapdPtaSubtree", {"o=c", "o=d"}}}}});
+  std::size_t own = 0;
+  platform.at("cfg_get_values", 1, [&] { own = platform.calls({"are_nested_dn"}).size(); });
+  EXPECT_EQ(verify(), 0);
+  std::vector<std::string> pairs = platform.calls({"are_nested_dn"});
+  pairs.erase(pairs.begin(), pairs.begin() + static_cast<std::ptrdiff_t>(own));
+  EXPECT_THAT(pairs,
+              ElementsAre("are_nested_dn(\"O=A\", \"O=C\")", "are_nested_dn(\"O=A\", \"O=D\")",
+                          "are_nested_dn(\"O=B\", \"O=C\")", "are_nested_dn(\"O=B\", \"O=D\")"));
 }
 
 TEST_F(PassThrough, FirstConflictEndsTheWalk) {
@@ -587,6 +634,16 @@ TEST_F(PassThrough, ValueOfAnotherEntryThatCannotBeConvertedGives1) {
   platform.forget();
   platform.fail("replace_DN", 3, 34);
   EXPECT_EQ(verify(), 1);
+  expect_only_the_session_left();
+}
+
+TEST_F(PassThrough, AllValuesOfAnotherEntryAreConvertedBeforeTheFirstIsCompared) {
+  make_with_subtrees({"o=a"});
+  file({{kOther, {{"orv-slapdPtaSubtree", {"o=a", "o=c"}}}}});
+  platform.fail("replace_DN", 4, 34);  // own, DN, first, second
+  EXPECT_EQ(verify(), 1);
+  EXPECT_EQ(platform.count("PrintMessage"), 0);
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
   expect_only_the_session_left();
 }
 
@@ -853,10 +910,27 @@ TEST_F(Review, EndsWhereADnOrAnEntryCannotBeMade) {
       EXPECT_EQ(verify(), 0);
       EXPECT_EQ(platform.count("cfg_next_entry"), 0) << failing;
       EXPECT_EQ(platform.count("ldap_url_parse"), 0) << failing;
+      const bool dn_made = failing == std::string("CFGMessage2Entry");
+      EXPECT_EQ(platform.count("CFGMessage2Entry"), dn_made ? 1 : 0) << failing;
       EXPECT_EQ(platform.count("cfg_msgfree"), 1) << failing;
       expect_only_the_session_left();
     });
   }
+}
+
+TEST_F(Review, EntryIsBuiltWhenItsDnIsNormalised) {
+  in_a_fresh_process([&] {
+    g_safe_mode = 1;
+    file({{kOther, {{"orv-slapdPtaURL", {"ldap://a"}}}}});
+    make(kEntry, {});
+    EXPECT_EQ(verify(), 0);
+    EXPECT_THAT(platform.calls({"cfg_get_dn", "xlate_localcp_to_utf8", "replace_DN",
+                                "CFGMessage2Entry", "entry_free"}),
+                ElementsAre("cfg_get_dn(session, record 1)",
+                            "xlate_localcp_to_utf8(\"" + std::string(kOther) + "\")",
+                            "replace_DN(\"" + std::string(kOther) + "\", 1)",
+                            "CFGMessage2Entry(session, record 1)", "entry_free(\"entry\")"));
+  });
 }
 
 TEST_F(Review, FailingAllocationOnlyEndsTheReviewOrAnEntrysPartOfIt) {
@@ -914,6 +988,23 @@ TEST_F(Review, DnThatEndsTheWalkIsReleasedAfterTheResult) {
   };
   expect_released("xlate_localcp_to_utf8", {kSecondDnReleased});
   expect_released("replace_DN", {"free(second DN)", kSecondDnReleased});
+}
+
+TEST_F(Review, DnOfAnEntryThatCannotBeBuiltIsReleasedAfterTheResult) {
+  in_a_fresh_process([&] {
+    g_safe_mode = 1;
+    two_entries();
+    make(kEntry, {});
+    platform.at("replace_DN", 1,
+                [&] { platform.name_allocation(platform.allocations() + 1, "first DN"); });
+    platform.at("replace_DN", 2,
+                [&] { platform.name_allocation(platform.allocations() + 1, "second DN"); });
+    platform.fail("CFGMessage2Entry", 2, 90);
+    EXPECT_EQ(verify(), 0);
+    EXPECT_THAT(platform.calls({"free", "cfg_memfree", "cfg_msgfree"}),
+                ElementsAre("free(first DN)", kFirstDnReleased, "cfg_msgfree(chain)",
+                            "free(second DN)", kSecondDnReleased));
+  });
 }
 
 TEST_F(Review, RecordsAreWalkedUnderTheirNormalisedDns) {
