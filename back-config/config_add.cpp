@@ -698,7 +698,8 @@ constexpr int kSafeMode = 1;         // exactly; the rule of password methods as
 constexpr const char* kReservedSuffixes[] = {
     "CN=CONFIGURATION", "CN=SCHEMA", "CN=PWDPOLICY,CN=ORVPOLICIES", "CN=CHANGELOG", "CN=LOCALHOST"};
 
-// 1 until this process has reviewed the pass-through entries of the file; never set back.
+// 1 until this process has reviewed the pass-through entries of the file; never set back. A review
+// that could not search or that ended early counts as well: it is not repeated.
 std::atomic<int> firstTime{1};
 
 // The normal form of a DN that is in the file's code page. 0, or 1 when none can be made, for
@@ -770,6 +771,8 @@ int normalize_in_place(char** local_dns) {
   return result::success;
 }
 
+// An entry of the file without the attribute is an error here (16 of the library, 1 as the result),
+// and so it stands in the way of every other entry that has subtrees.
 int compare_with_values(const ldtr_function_local& trace, _CFG* session, _CFGMessage* record,
                         const char* record_dn, char** subtrees) {
   const ValueList values(cfg_get_values(session, record, config_names::passthrough_subtree));
@@ -867,6 +870,7 @@ int check_subtrees(const ldtr_function_local& trace, const char* dn, const entry
   return rc;
 }
 
+// An attribute without a value is judged too, as null; check_url lets one pass.
 int check_mapping(const entry& e) {
   const attr* const setting = find(e, config_names::passthrough_mapping);
   if (setting == nullptr) return result::success;
@@ -923,6 +927,8 @@ int checkIfPassthruSubtreeEntry(entry* e, Connection* connection, Backend* backe
   if (e == nullptr || connection == nullptr || backend == nullptr) {
     return trace.exit(refuse_null(trace));
   }
+  // The container is found here with regard to letter case, and compared with the parent below
+  // without. Both are meant.
   const char* const dn = e->normalized_dn;
   if (!contains(dn, config_names::passthrough_dn)) return trace.exit(result::success);
   if (!is_primary_administrator(*operation) && (operation->roles & role::server_config) == 0) {

@@ -93,13 +93,15 @@ int processRolesIfAdminGroupEntry(const char* normalized_dn, entry* e, Operation
 int checkIfPassthruSubtreeEntry(entry* e, Connection* connection, Backend* backend,
                                 Operation* operation);
 
-// The settings of a pass-through entry, as it is to be in the file: 21 its URL is none; 19 one of
-// its subtrees overlaps another of them, a suffix of the server's own, or a subtree of another
-// entry of the file (the server log tells which); 1 a value cannot be converted or read; 90; or the
-// code of the search or of the attribute mapping.
+// The settings of a pass-through entry, as it is to be in the file. 0, also for every entry whose
+// DN does not contain that of the container; 21 its URL is none; 19 one of its subtrees overlaps
+// another of them, a suffix of the server's own, or a subtree of another entry of the file (the
+// server log tells which); 1 a value cannot be converted or read; 90; or the code of the search or
+// of the attribute mapping. Entry and connection must not be null.
 //
-// On a server in safe mode or of kind 1 the first call in a process also looks at all such entries
-// of the file. What it finds is told in the server log and changes no result.
+// On a server in safe mode or of kind 1 the first call in a process for an entry below the
+// container also looks at all such entries of the file. What it finds is told in the server log and
+// changes no result.
 int verifyPassthroughServerEntry(const char* normalized_dn, entry* e, Connection* connection);
 
 // ---- Adding
