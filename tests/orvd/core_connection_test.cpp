@@ -343,6 +343,38 @@ TEST_F(BareSessionTest, AdmissionThatCannotBePostedKeepsTheGateAndIsPickedUpLate
   EXPECT_TRUE(host.gate().close_and_wait_until_empty(1s));
 }
 
+// Some clients throw away what they have not read when they find the connection ended.
+TEST_F(BareSessionTest, WhoChangedTheirOwnRightsHaveTimeToReadTheAnswerAndNothingElse) {
+  bind_as_root();
+  backend.on_change = [this](pblock* parameters) {
+    send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 0, nullptr,
+                     "");
+    authenticator.change(false);
+    return 0;
+  };
+  session->handle(test::modify(2, kTop, "description", "x"));
+  ASSERT_TRUE(session->run_until([this] { return session->idle(); }));
+  EXPECT_EQ(result_in(session->sent).code, 0);
+  session->tick();
+  EXPECT_FALSE(session->ended);
+  const auto calls = backend.calls(parameter::search_function);
+  session->handle(test::search(3, kTop));
+  EXPECT_TRUE(session->ended);
+  EXPECT_EQ(backend.calls(parameter::search_function), calls);
+}
+
+TEST_F(BareSessionTest, WhoChangedTheirOwnRightsAreDisconnectedAMomentLater) {
+  bind_as_root();
+  backend.on_change = [this](pblock* parameters) {
+    send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 0, nullptr,
+                     "");
+    authenticator.change(false);
+    return 0;
+  };
+  session->handle(test::modify(2, kTop, "description", "x"));
+  EXPECT_TRUE(session->run_until([this] { return session->ended; }));
+}
+
 class FullServerTest : public BareSessionTest {
  protected:
   FullServerTest() : BareSessionTest(4096) {

@@ -21,6 +21,8 @@ namespace {
 constexpr std::string_view kSuffix = "CN=CONFIGURATION";
 constexpr std::string_view kNotOffered = "operation not supported";
 constexpr std::string_view kStopping = "server is stopping";
+// For the answer to a change, before the connection of somebody who is no longer the same ends.
+constexpr std::chrono::seconds kTimeToRead{1};
 
 // The tag of the answer to a request, 0 for requests without one.
 int response_tag(const Request& request) {
@@ -495,6 +497,7 @@ void Session::complete(const OperationPtr& operation) {
   const Answer& answer = operation->answer();
   if (answer.code() == result::operations_error && services_.note_failure) services_.note_failure();
   const Delivered sent = deliver(*operation);  // what follows is done while the client reads
+  if (operation->is_change()) change_told_ = Clock::now();
   log_result(answer.message_id(), operation->log_text, sent.code, sent.entries,
              operation->started());
   if (operation->persistent) first_part_done(*operation);
@@ -577,8 +580,11 @@ void Session::output_is(std::size_t unwritten) noexcept {
 
 void Session::tick() {
   pick_up_stranded();
-  // Whoever changed a password of their own, or their own roles, hears of it first.
-  if (!gone_ && !awaits_change()) identity_holds();
+  // Whoever changed a password of their own, or their own roles, hears of it first, and has a
+  // moment to read it: some clients throw away what they have not read when they find the
+  // connection ended. A further request does not get through meanwhile.
+  const bool reads = Clock::now() - change_told_ < kTimeToRead;
+  if (!gone_ && !awaits_change() && !reads) identity_holds();
   if (!gone_ && listens()) look_after_persistent_searches();
 }
 

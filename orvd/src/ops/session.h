@@ -291,6 +291,7 @@ class Session : public OperationHome,
   ConnectionAux aux_;
   std::shared_ptr<const Identity> identity_;  // null: anonymous
   std::uint64_t identity_checked_ = 0;        // the generation by which it was good
+  Clock::time_point change_told_{};           // when the last change was answered
   OutputShare output_;
   GateUser gate_user_;
   FailedChanges failed_changes_;
