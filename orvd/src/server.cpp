@@ -190,6 +190,7 @@ void Server::await_signal() {
 
 // The administrator of a port at which nobody answers should not have to guess.
 void Server::tell_what_is_missing() {
+  const std::lock_guard lock(reloading_);
   if (settings_->secure_port > 0 && !tls_.current())
     parts_.logs.warning(
         "nobody listens at orv-slapdSecurePort, because TLS needs a certificate: name one in "
