@@ -68,6 +68,9 @@ include(GoogleTest)
 """
 
 
+TIMEOUT = 300  # seconds for tests that need some ten: a busy machine must not look like a fault
+
+
 def faults_of(path):
     fault, source = None, None
     for number, line in enumerate(path.read_text(encoding="utf-8").splitlines() + [""], 1):
@@ -105,18 +108,19 @@ def build(work, suite):
 
 
 def red(work, suite, file=None):
-    """Whether the tests fail: by a failure, a crash, or by never coming back."""
+    """How the tests fail, by "a failure" (a crash too) or by "never coming back", or None."""
     arguments = suite.get("arguments_of", {}).get(file, suite["arguments"])
     try:
         done = subprocess.run([work / "build/bin" / suite["target"], "--gtest_brief=1",
                                "--gtest_fail_fast", *arguments],
-                              capture_output=True, timeout=180)
+                              capture_output=True, timeout=TIMEOUT)
     except subprocess.TimeoutExpired:
-        return True
-    return done.returncode != 0
+        return "never coming back"
+    return "a failure" if done.returncode != 0 else None
 
 
 def try_fault(work, suite, fault):
+    """What is wrong with the fault or the tests; None when these notice it."""
     path = work / fault["file"]
     text = path.read_text(encoding="utf-8")
     old, new = "\n".join(fault["-"]), "\n".join(fault["+"])
@@ -127,7 +131,10 @@ def try_fault(work, suite, fault):
         built, _ = build(work, suite)
         if not built:
             return "does not compile"
-        return None if red(work, suite, fault["file"]) else "SURVIVED"
+        how = red(work, suite, fault["file"])
+        if how == "never coming back":
+            print(f"{fault['line']} {fault['file']}: noticed by {how}", flush=True)
+        return None if how else "SURVIVED"
     finally:
         path.write_text(text, encoding="utf-8")
 

@@ -1,12 +1,7 @@
 // Searches that take long, and answers that nobody reads: who else is served meanwhile.
 #include <gtest/gtest.h>
 
-#include <unistd.h>
-
-#include <cstdlib>
-#include <fstream>
-
-#include "cfg/owners.h"
+#include "core_searched_file.h"
 #include "core_server_fixture.h"
 #include "ops/output_meter.h"
 #include "ops/search_cost.h"
@@ -123,35 +118,16 @@ TEST_F(HeavySearch, IsAbandonedByItsClientWhileItRuns) {
 class FileSearch : public test::LoopbackServer {
  protected:
   FileSearch() {
-    char name[] = "/tmp/orv-core-XXXXXX";
-    ::close(mkstemp(name));
-    file_ = name;
-    std::ofstream out(file_);
-    out << "dn: cn=configuration\ncn: configuration\n";
-    for (const char* n : {"a", "b", "c"})
-      out << "\ndn: cn=" << n << ",cn=configuration\ncn: " << n << "\n";
-    out.close();
     backend.on_search = [this](pblock* parameters) {
       if (before_search) before_search();
-      const int code = search_once();
+      const int code = file.search();
       threads.push_back(std::this_thread::get_id());
       return test::finish_search(parameters, code, 0);
     };
   }
-  ~FileSearch() override {
-    stop();
-    unlink(file_.c_str());
-  }
-  int search_once() {
-    const CfgSession session(cfg_init(nullptr, 0));
-    cfg_set_option(session.get(), kCfgOptConfigFile, file_.c_str());
-    EXPECT_EQ(cfg_bind_s(session.get(), nullptr, nullptr, 128), 0);
-    _CFGMessage* chain = nullptr;
-    const int code = cfg_search_s(session.get(), kTop, 2, "(cn=nobody)", nullptr, 0, &chain);
-    cfg_msgfree(chain);
-    return code;
-  }
-  std::string file_;
+  ~FileSearch() override { stop(); }
+
+  test::SearchedFile file{3};
   std::function<void()> before_search;
   std::vector<std::thread::id> threads;  // of each search
 };
@@ -183,13 +159,9 @@ TEST_F(FileSearch, TimeLimitIsLookedAtForEveryEntry) {
 
 TEST_F(FileSearch, CutOffByTheStopOfTheServerIsAnsweredUnavailable) {
   Event entered;
-  before_search = [&] { entered.happen(); };
   backend.on_search = [&](pblock* parameters) {
     entered.happen();
-    int code = 0;
-    const auto end = Clock::now() + 10s;
-    while (code == 0 && Clock::now() < end) code = search_once();
-    return test::finish_search(parameters, code, 0);
+    return test::finish_search(parameters, file.search_until_interrupted(), 0);
   };
   start();
   WireClient client(port());

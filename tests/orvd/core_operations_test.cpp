@@ -1,10 +1,8 @@
 // Extended operations and controls: what each accepts and refuses, what reaches the backend and in
 // which order, and what becomes of operations that are canceled.
 #include <gtest/gtest.h>
-#include <unistd.h>
 
 #include <atomic>
-#include <cstdlib>
 #include <functional>
 #include <mutex>
 #include <optional>
@@ -15,8 +13,7 @@
 #include <utility>
 #include <vector>
 
-#include "cfg/owners.h"
-#include "cfg/session.h"
+#include "core_searched_file.h"
 #include "core_server_fixture.h"
 #include "ops/controls.h"
 #include "protocol/control_values.h"
@@ -106,6 +103,10 @@ class OperationsTest : public LoopbackServer {
       return find(parameters);
     };
   }
+  ~OperationsTest() override {
+    go_on.happen();
+    stop();
+  }
   static int finish_change(pblock* parameters, int code) {
     send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), code, nullptr,
                      "");
@@ -123,6 +124,24 @@ class OperationsTest : public LoopbackServer {
   void before_search(std::function<void(pblock*)> what) {
     const std::lock_guard lock(mutex_);
     before_search_ = std::move(what);
+  }
+  // The client's search 2 stays inside the backend until `go_on`; later ones do not.
+  void park_search() {
+    before_search([this](pblock*) {
+      entered.happen();
+      go_on.wait();
+    });
+    client().send(test::search(2, kTop, 2));
+    ASSERT_TRUE(entered.wait());
+    before_search(nullptr);
+  }
+  void searches_last_until_given_up() {
+    before_search([this](pblock* parameters) {
+      entered.happen();
+      const auto* const answer = static_cast<Answer*>(test::operation_of(parameters)->server);
+      const auto end = Clock::now() + 10s;
+      while (!answer->is_given_up() && Clock::now() < end) std::this_thread::yield();
+    });
   }
   // As many entries as there are; with a filter for a name, none of another.
   int find(pblock* parameters) {
@@ -158,6 +177,8 @@ class OperationsTest : public LoopbackServer {
   std::atomic<int> entries{1};
   std::atomic<int> search_code{0};
   std::atomic<int> change_code{0};
+  Event entered;
+  Event go_on;
   int found = 0;
   std::optional<WireClient> client_;
 
@@ -311,15 +332,7 @@ TEST_F(OperationsTest, CombinationsWithoutAMeaningAreRefused) {
 }
 
 TEST_F(OperationsTest, AbandonWithAnUnknownCriticalControlIsNotPerformed) {
-  Event entered;
-  Event go_on;
-  before_search([&](pblock*) {
-    entered.happen();
-    go_on.wait();
-  });
-  client().send(test::search(2, kTop, 2));
-  ASSERT_TRUE(entered.wait());
-  before_search(nullptr);
+  park_search();
   client().send(with(3, test::abandon(3, 2), ldap_control(kUnknownOid, true, {})));
   client().send(test::search(4, ""));
   EXPECT_EQ(client().receive_result().back().id, 4);
@@ -380,26 +393,13 @@ TEST_F(CancelTest, OfWhatHasEndedFindsNothing) {
 }
 
 TEST_F(CancelTest, OfNoMessageFindsNothing) {
-  Event entered;
-  Event go_on;
-  before_search([&](pblock*) {
-    entered.happen();
-    go_on.wait();
-  });
-  client().send(test::search(2, kTop, 2));
-  ASSERT_TRUE(entered.wait());
+  park_search();
   EXPECT_EQ(code(cancel(3, 0)), 119);
   go_on.happen();
 }
 
 TEST_F(CancelTest, EndsASearchThatRunsElsewhere) {
-  Event entered;
-  before_search([&](pblock* parameters) {
-    entered.happen();
-    const auto* const answer = static_cast<Answer*>(test::operation_of(parameters)->server);
-    const auto end = Clock::now() + 10s;
-    while (!answer->is_given_up() && Clock::now() < end) std::this_thread::yield();
-  });
+  searches_last_until_given_up();
   client().send(test::search(2, kTop, 2));
   ASSERT_TRUE(entered.wait());
   client().send(cancel(3, 2));
@@ -417,14 +417,7 @@ TEST_F(CancelTest, EndsASearchThatRunsElsewhere) {
 }
 
 TEST_F(CancelTest, ThatIsOutstandingCanNeitherBeCanceledNorHaveItsIdUsedAgain) {
-  Event entered;
-  Event go_on;
-  before_search([&](pblock*) {
-    entered.happen();
-    go_on.wait();
-  });
-  client().send(test::search(2, kTop, 2));
-  ASSERT_TRUE(entered.wait());
+  park_search();
   client().send(cancel(3, 2) + cancel(4, 3) + cancel(5, 2));
   std::optional<Reply> reply = client().receive();
   ASSERT_TRUE(reply);
@@ -437,18 +430,10 @@ TEST_F(CancelTest, ThatIsOutstandingCanNeitherBeCanceledNorHaveItsIdUsedAgain) {
   client().send(test::search(3, ""));
   EXPECT_EQ(client().receive()->tag, test::kNotice);
   go_on.happen();
-  stop();  // the search waits for what goes out of scope here
 }
 
 TEST_F(CancelTest, OfASearchThatIsThenAbandonedComesTooLate) {
-  Event entered;
-  Event go_on;
-  before_search([&](pblock*) {
-    entered.happen();
-    go_on.wait();
-  });
-  client().send(test::search(2, kTop, 2));
-  ASSERT_TRUE(entered.wait());
+  park_search();
   client().send(cancel(3, 2) + test::abandon(4, 2));
   client().send(test::search(5, ""));
   EXPECT_EQ(client().receive_result().back().id, 5);
@@ -460,23 +445,15 @@ TEST_F(CancelTest, OfASearchThatIsThenAbandonedComesTooLate) {
 }
 
 TEST_F(CancelTest, MayMeetTheEndOfTheConnectionAtAnyTime) {
-  Event entered;
-  Event go_on;
-  Event gone;
-  backend.on_unbind = [&](pblock*) {
-    gone.happen();
+  backend.on_unbind = [this](pblock*) {
+    unbound.happen();
     return 0;
   };
-  before_search([&](pblock*) {
-    entered.happen();
-    go_on.wait();
-  });
-  client().send(test::search(2, kTop, 2));
-  ASSERT_TRUE(entered.wait());
+  park_search();
   client().send(cancel(3, 2) + test::unbind(4));
   EXPECT_TRUE(client().closed());
   go_on.happen();
-  EXPECT_TRUE(gone.wait());
+  EXPECT_TRUE(unbound.wait());
 }
 
 // Whoever comes first: both are answered once, and the answers agree.
@@ -580,31 +557,13 @@ TEST_F(BlockedOperations, BindWaitsForWhatIsBeingCanceled) {
 class EndlessSearch : public OperationsTest {
  protected:
   EndlessSearch() {
-    char name[] = "/tmp/orv-core-XXXXXX";
-    const int fd = mkstemp(name);
-    file_ = name;
-    constexpr std::string_view kText = "dn: cn=configuration\ncn: configuration\n";
-    EXPECT_EQ(::write(fd, kText.data(), kText.size()), static_cast<ssize_t>(kText.size()));
-    ::close(fd);
     backend.on_search = [this](pblock* parameters) {
-      const CfgSession session(cfg_init(nullptr, 0));
-      cfg_set_option(session.get(), kCfgOptConfigFile, file_.c_str());
-      EXPECT_EQ(cfg_bind_s(session.get(), nullptr, nullptr, 128), 0);
       entered.happen();
-      const auto end = Clock::now() + 10s;
-      int code = 0;
-      while (code == 0 && !free && Clock::now() < end) {
-        _CFGMessage* chain = nullptr;
-        code = cfg_search_s(session.get(), kTop, 2, "(cn=nobody)", nullptr, 0, &chain);
-        cfg_msgfree(chain);
-      }
+      const int code = file.search_until([this] { return free.load(); });
       return test::finish_search(parameters, code, 0);
     };
   }
-  ~EndlessSearch() override {
-    stop();
-    unlink(file_.c_str());
-  }
+  ~EndlessSearch() override { stop(); }
   std::vector<std::pair<int, int>> replies(int count) {
     std::vector<std::pair<int, int>> all;
     for (int i = 0; i < count; ++i)
@@ -620,8 +579,7 @@ class EndlessSearch : public OperationsTest {
     free = true;
   }
   using Pairs = std::vector<std::pair<int, int>>;
-  std::string file_;
-  Event entered;
+  test::SearchedFile file;
   std::atomic<bool> free{false};
 };
 
@@ -935,13 +893,7 @@ TEST_F(PagesTest, SearchThatFindsNothingHasOnePageAndARefusedOneNone) {
 }
 
 TEST_F(PagesTest, AreNotKeptOfASearchThatIsCanceled) {
-  Event entered;
-  before_search([&](pblock* parameters) {
-    entered.happen();
-    const auto* const answer = static_cast<Answer*>(test::operation_of(parameters)->server);
-    const auto end = Clock::now() + 10s;
-    while (!answer->is_given_up() && Clock::now() < end) std::this_thread::yield();
-  });
+  searches_last_until_given_up();
   client().send(with(2, test::search(2, kTop, 2), page(2)));
   ASSERT_TRUE(entered.wait());
   client().send(cancel(3, 2));

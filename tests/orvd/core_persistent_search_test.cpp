@@ -334,6 +334,7 @@ class PersistentWire : public LoopbackServer {
       return 0;
     };
   }
+  ~PersistentWire() override { stop(); }
 
   static std::string persistent_search(int id, bool changes_only = true,
                                        std::string_view base = test::kTop) {
@@ -551,6 +552,7 @@ TEST_F(PersistentWire, ABindEndsItAlsoWhileANoticeWaitsForItsTurn) {
   EXPECT_EQ(code_of(listener, test::bind(9, "", "")), 0);
   second_goes_on.happen();
   EXPECT_TRUE(taken(listener, 10));
+  stop();  // what the handler refers to goes out of scope here
 }
 
 TEST_F(PersistentWire, TheBoundsHold) {

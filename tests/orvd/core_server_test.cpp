@@ -5,19 +5,17 @@
 
 #include <sys/socket.h>
 #include <sys/un.h>
-#include <unistd.h>
 
 #include <atomic>
 #include <csignal>
 #include <cstddef>
-#include <cstdlib>
 #include <cstring>
 #include <optional>
 #include <stdexcept>
 #include <string>
 #include <thread>
 
-#include "cfg/owners.h"
+#include "core_searched_file.h"
 #include "core_server_fixture.h"
 #include "descriptor.h"
 #include "process/service_manager.h"
@@ -355,38 +353,15 @@ TEST_F(ServerTest, UnbindHandlerIsCalledOnceForEachConnection) {
 class LongSearchTest : public ServerTest {
  protected:
   LongSearchTest() {
-    char name[] = "/tmp/orv-core-XXXXXX";
-    const int fd = mkstemp(name);
-    file_ = name;
-    std::string text = "dn: cn=configuration\ncn: configuration\n";
-    for (int i = 0; i < 200; ++i) {
-      const std::string n = std::to_string(i);
-      text += "\ndn: cn=" + n + ",cn=configuration\ncn: " + n + "\n";
-    }
-    EXPECT_EQ(::write(fd, text.data(), text.size()), static_cast<ssize_t>(text.size()));
-    ::close(fd);
     backend.on_search = [this](pblock* parameters) {
-      const CfgSession session(cfg_init(nullptr, 0));
-      cfg_set_option(session.get(), kCfgOptConfigFile, file_.c_str());
-      EXPECT_EQ(cfg_bind_s(session.get(), nullptr, nullptr, 128), 0);
       entered.happen();
-      const auto end = Clock::now() + 10s;
-      int code = 0;
-      while (code == 0 && Clock::now() < end) {
-        _CFGMessage* chain = nullptr;
-        code = cfg_search_s(session.get(), kTop, 2, "(cn=nobody)", nullptr, 0, &chain);
-        cfg_msgfree(chain);
-      }
-      ended_with = code;
-      return test::finish_search(parameters, code, 0);
+      ended_with = file.search_until_interrupted();
+      return test::finish_search(parameters, ended_with, 0);
     };
   }
-  ~LongSearchTest() override {
-    stop();
-    unlink(file_.c_str());
-  }
+  ~LongSearchTest() override { stop(); }
 
-  std::string file_;
+  test::SearchedFile file{200};
   Event entered;
   std::atomic<int> ended_with{-1};
 };

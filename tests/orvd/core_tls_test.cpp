@@ -9,7 +9,7 @@
 #include <sstream>
 
 #include "auth/certificate_map.h"
-#include "cfg/owners.h"
+#include "core_searched_file.h"
 #include "core_server_fixture.h"
 #include "core_tls_client.h"
 #include "net/tls.h"
@@ -550,21 +550,10 @@ TEST_F(TlsTest, ServerStopsInTheMiddleOfHandshakes) {
 
 // An abandon that comes while the loop itself runs the search is found inside TLS as well.
 TEST_F(TlsTest, AbandonIsFoundWhileASearchRunsOnTheLoop) {
-  const std::string file = certificates.path("config.ldif");
-  std::ofstream(file) << "dn: cn=configuration\ncn: configuration\n";
-  const auto search_once = [&] {
-    const CfgSession session(cfg_init(nullptr, 0));
-    cfg_set_option(session.get(), kCfgOptConfigFile, file.c_str());
-    EXPECT_EQ(cfg_bind_s(session.get(), nullptr, nullptr, 128), 0);
-    _CFGMessage* chain = nullptr;
-    const int code = cfg_search_s(session.get(), kTop, 2, "(cn=nobody)", nullptr, 0, &chain);
-    const CfgResult owned(chain);
-    return code;
-  };
+  const test::SearchedFile file;
   std::atomic<bool> stopped{false};
   backend.on_search = [&](pblock* parameters) {
-    const auto end = Clock::now() + 10s;
-    while (!stopped && Clock::now() < end) stopped = search_once() == 3;
+    stopped = file.search_until_interrupted() == 3;
     return test::finish_search(parameters, 3, 0);
   };
   start();
