@@ -191,11 +191,15 @@ bool PendingOperation::trust_holds(const Services& services) noexcept {
   return false;
 }
 
+// Whether who asked is still the same; who is not bound always is.
+bool PendingOperation::identity_holds(const Services& services) const noexcept {
+  return !identity_ || services.authenticator.generation() == identity_generation ||
+         services.authenticator.still_valid(*identity_);
+}
+
 // Who lost rights while the operation waited has them no more.
 bool PendingOperation::rights_hold(const Services& services) noexcept {
-  if (!identity_ || services.authenticator.generation() == identity_generation ||
-      services.authenticator.still_valid(*identity_))
-    return true;
+  if (identity_holds(services)) return true;
   answer_.result(result::insufficient_access, "", "the bound identity has changed or is gone");
   return false;
 }
@@ -369,10 +373,8 @@ void PendingOperation::copy_afterwards(Services& services) noexcept {
   if (answer_.abandoned()) return;
   bool good = true;
   if (post_read_) {
-    const bool same = services.authenticator.generation() == identity_generation ||
-                      (identity_ && services.authenticator.still_valid(*identity_));
     const cfg::InterruptScope scope(&PendingOperation::interrupted, this);
-    const int code = same ? post_read_->run(services.backend) : 0;
+    const int code = identity_holds(services) ? post_read_->run(services.backend) : 0;
     good = code == 0 && take_copy(*post_read_, kPostReadOid);
   }
   if (!answer_.attach_to_result(copies_)) good = false;

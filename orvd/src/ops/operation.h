@@ -144,6 +144,7 @@ class PendingOperation final : public GateWaiter,
   bool must_stop() noexcept;
   bool take_budget(const Services& services) noexcept;
   bool trust_holds(const Services& services) noexcept;
+  bool identity_holds(const Services& services) const noexcept;
   bool rights_hold(const Services& services) noexcept;
   bool is_primary() const noexcept;
   std::string_view why_not_fail(Services& services) noexcept;
