@@ -76,6 +76,30 @@ def test_entry_without_authority_is_refused_whether_it_exists_or_not(server, roo
     clerk.unbind_s()
 
 
+@pytest.mark.parametrize("spelled", ["name", "number", "type by number", "another letter case"])
+def test_object_class_in_a_name_counts_like_one_in_the_list(server, root, add, spelled):
+    def named_by(object_class, parent, attributes):
+        number = changes.numbers_of_classes()[object_class]
+        rdn = {"name": "objectClass=" + object_class, "number": "objectClass=" + number,
+               "type by number": "2.5.4.0=" + number,
+               "another letter case": "OBJECTCLASS=" + object_class.upper()}[spelled]
+        rest = [each for each in attributes["objectClass"] if each != object_class]
+        return f"{rdn},{parent}", dict(attributes, objectClass=rest)
+
+    helper = bound_member(server, root, "helper", "ServerConfigGroupMember")
+    assert answer(helper, *container("ordinary")) == (0, "")
+    place = "cn=replication," + TOP
+    supplier = named_by("orv-slapdSupplier", place, changes.supplier("evil")[1])
+    assert answer(helper, *supplier) == (50, "")
+    helper.unbind_s()
+    replication = changes.supplier("evil", kind="orv-slapdReplication")[1]
+    assert add(*named_by("orv-slapdReplication", place, replication))[0] == 53
+    context = container("x", objectClass=["top", "container", "orv-replicationContext"])[1]
+    assert add(*named_by("orv-replicationContext", TOP, context)) == (92, "")
+    assert add(*supplier) == (0, "")
+    assert clients.bind_code(server, "cn=evil supplier", PASSWORD) == 0
+
+
 # ---- roles
 
 def test_unknown_role_is_told_before_everything_else(server, root, add):

@@ -97,6 +97,21 @@ TEST_F(Canonical, ValueOfTheRdnIsLookedForByTheEqualityOfItsType) {
             (std::vector<std::string>{"x", "X"}));
 }
 
+TEST_F(Canonical, ObjectClassInTheRdnTakesItsNameAndStandsFirst) {
+  for (const char* const type : {"objectClass", "2.5.4.0"}) {
+    const std::string rdn = std::string(type) + "=2.5.6.0";
+    EntryPtr made;
+    ASSERT_EQ(make_entry(schema, {rdn + "+cn=x,cn=y", {{"objectClass", {"container"}}}}, made).code,
+              0);
+    EXPECT_EQ(values_of(made->object_classes), (std::vector<std::string>{"container", "top"}));
+    ASSERT_EQ(make_entry(schema, {rdn + ",cn=y", {{"objectClass", {"TOP"}}}}, made).code, 0);
+    EXPECT_EQ(values_of(made->object_classes), std::vector<std::string>{"top"});
+    ASSERT_EQ(make_entry(schema, {rdn + ",cn=y", {{"cn", {"x"}}}}, made).code, 0);
+    EXPECT_STREQ(made->attributes->type, "objectClass");
+    EXPECT_EQ(values_of(made->object_classes), std::vector<std::string>{"top"});
+  }
+}
+
 TEST_F(Canonical, PasswordInTheRdnIsRefused) {
   const std::vector<Attribute> classes{{"objectClass", {"container"}}};
   EXPECT_EQ(add_code({"orv-slapdAdminPW=x,cn=configuration", classes}), 64);

@@ -196,10 +196,13 @@ Refusal canonical_attributes(const Schema& schema, const AddRequest& request,
         return refuse(result::attribute_or_value_exists, "the same attribute twice", made.type);
     attributes.push_back(std::move(made));
   }
-  // Rules of the backend look at the first attribute for the object classes.
+  return {};
+}
+
+// Rules of the backend look at the first attribute for the object classes.
+void put_object_classes_first(std::vector<CanonicalAttribute>& attributes) {
   std::stable_partition(attributes.begin(), attributes.end(),
                         [](const CanonicalAttribute& a) { return a.type == kObjectClass; });
-  return {};
 }
 
 bool holds_rdn_value(const Schema& schema, const CanonicalAttribute& attribute,
@@ -233,7 +236,8 @@ Refusal complete_rdn(const Schema& schema, const std::string& dn,
     auto found = std::find_if(attributes.begin(), attributes.end(),
                               [&](const CanonicalAttribute& a) { return a.type == type; });
     if (found == attributes.end()) found = attributes.insert(found, {type, {}});
-    if (!holds_rdn_value(schema, *found, ava.value)) found->values.push_back(ava.value);
+    std::string value = canonical_value(schema, type, ava.value);
+    if (!holds_rdn_value(schema, *found, value)) found->values.push_back(std::move(value));
   }
   return {};
 }
@@ -436,6 +440,7 @@ Refusal make_entry(const Schema& schema, const AddRequest& request, EntryPtr& ma
   const Wiped<std::vector<CanonicalAttribute>> wiped{attributes};
   if (Refusal refusal = canonical_attributes(schema, request, attributes)) return refusal;
   if (Refusal refusal = complete_rdn(schema, request.dn, attributes)) return refusal;
+  put_object_classes_first(attributes);
   made = build_entry(dn, normal, attributes);
   return {};
 }
