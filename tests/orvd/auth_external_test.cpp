@@ -1,14 +1,10 @@
 // Who is somebody without a password: by the socket or by a certificate.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
-#include <unistd.h>
-
-#include <filesystem>
-#include <fstream>
 
 #include "auth/certificate_map.h"
-#include "auth/identities.h"
 #include "auth/sasl_external.h"
+#include "auth_identities_fixture.h"
 #include "slapi/connection.h"
 
 namespace orv::server {
@@ -18,46 +14,7 @@ using ::testing::Contains;
 using ::testing::HasSubstr;
 using ::testing::IsEmpty;
 
-std::string top_with(const std::string& stored_password) {
-  return "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\n"
-         "orv-slapdAdminDN: cn=root\norv-slapdAdminPW: " +
-         stored_password + "\n";
-}
-
-const std::string kTop = top_with("rootpw");
-const std::string kGroup =
-    "\ndn: cn=AdminGroup,cn=configuration\n"
-    "objectClass: container\n"
-    "cn: AdminGroup\n";
-
-std::string member(const std::string& name, const std::string& dn, const std::string& password,
-                   const std::string& more = "orv-slapdAdminRole: AuditAdmin\n") {
-  return "\ndn: cn=" + name + ",cn=AdminGroup,cn=configuration\n" +
-         "objectClass: orv-slapdAdminGroupMember\ncn: " + name + "\norv-slapdAdminDN: " + dn +
-         "\norv-slapdAdminPW: " + password + "\n" + more;
-}
-
-class ExternalIdentitiesOfAFile : public ::testing::Test {
- protected:
-  void SetUp() override {
-    std::string pattern = ::testing::TempDir() + "/orv-auth-XXXXXX";
-    ASSERT_NE(mkdtemp(pattern.data()), nullptr);
-    folder_ = pattern;
-  }
-  void TearDown() override { std::filesystem::remove_all(folder_); }
-
-  std::shared_ptr<const Identities> read(const std::string& text) {
-    const std::string config = folder_ + "/config.ldif";
-    std::ofstream(config, std::ios::trunc) << text;
-    error_.clear();
-    warnings_.clear();
-    return Identities::read(config.c_str(), "", error_, warnings_);
-  }
-
-  std::string folder_;
-  std::string error_;
-  std::vector<std::string> warnings_;
-};
+class ExternalIdentitiesOfAFile : public IdentitiesOfAFile {};
 
 // ---- Without a password: the Unix socket, and certificates
 
@@ -120,10 +77,7 @@ TEST_F(ExternalIdentitiesOfAFile, CertificatesStandForSomebodyWhoCanBind) {
 }
 
 TEST_F(ExternalIdentitiesOfAFile, CertificateNeedsNoPassword) {
-  const std::string top =
-      "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\n"
-      "orv-slapdAdminDN: cn=root\n";
-  const auto identities = read(top + group_with_map(mapped("cn=r => cn=root")));
+  const auto identities = read(kTopWithoutPassword + group_with_map(mapped("cn=r => cn=root")));
   ASSERT_TRUE(identities) << error_;
   const auto root = identities->of_certificate("CN=R");
   ASSERT_TRUE(root);
@@ -158,8 +112,7 @@ TEST_F(ExternalIdentitiesOfAFile, SubjectThatIsMappedTwiceProvesNothing) {
 TEST_F(ExternalIdentitiesOfAFile, MapAnywhereElseMapsNobody) {
   const auto identities =
       read(kTop + mapped("cn=t => cn=root") + kGroup +
-           member("alice", "cn=alice", "alicepw",
-                  "orv-slapdAdminRole: AuditAdmin\n" + mapped("cn=m => cn=root")));
+           member("alice", "cn=alice", "alicepw", kAuditRole + mapped("cn=m => cn=root")));
   ASSERT_TRUE(identities) << error_;
   EXPECT_EQ(identities->of_certificate("CN=T"), nullptr);
   EXPECT_EQ(identities->of_certificate("CN=M"), nullptr);

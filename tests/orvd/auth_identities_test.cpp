@@ -7,10 +7,9 @@
 
 #include <atomic>
 #include <filesystem>
-#include <fstream>
 #include <thread>
 
-#include "auth/identities.h"
+#include "auth_identities_fixture.h"
 #include "cfg/dn.h"
 #include "slapi/codepage.h"
 #include "slapi/connection.h"
@@ -35,79 +34,11 @@ class SchemaRegistration : public ::testing::Environment {
 };
 const auto* const kRegistration = ::testing::AddGlobalTestEnvironment(new SchemaRegistration);
 
-std::string top_with(const std::string& stored_password) {
-  return "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\n"
-         "orv-slapdAdminDN: cn=root\norv-slapdAdminPW: " +
-         stored_password + "\n";
-}
-
-const std::string kTop = top_with("rootpw");
-const std::string kGroup =
-    "\ndn: cn=AdminGroup,cn=configuration\n"
-    "objectClass: container\n"
-    "cn: AdminGroup\n";
-
-std::string member(const std::string& name, const std::string& dn, const std::string& password,
-                   const std::string& more = "orv-slapdAdminRole: AuditAdmin\n") {
-  return "\ndn: cn=" + name + ",cn=AdminGroup,cn=configuration\n" +
-         "objectClass: orv-slapdAdminGroupMember\ncn: " + name + "\norv-slapdAdminDN: " + dn +
-         "\norv-slapdAdminPW: " + password + "\n" + more;
-}
-
 std::string supplier(const std::string& name, const std::string& object_class,
                      const std::string& dn, const std::string& password) {
   return "\ndn: cn=" + name + ",cn=configuration\nobjectClass: " + object_class + "\ncn: " + name +
          "\norv-slapdMasterDN: " + dn + "\norv-slapdMasterPW: " + password + "\n";
 }
-
-class IdentitiesOfAFile : public ::testing::Test {
- protected:
-  void SetUp() override {
-    std::string pattern = ::testing::TempDir() + "/orv-auth-XXXXXX";
-    ASSERT_NE(mkdtemp(pattern.data()), nullptr);
-    folder_ = pattern;
-  }
-  void TearDown() override { std::filesystem::remove_all(folder_); }
-
-  std::string config() const { return folder_ + "/config.ldif"; }
-  std::string stash() const { return folder_ + "/key.stash"; }
-
-  void write(const std::string& text) { std::ofstream(config(), std::ios::trunc) << text; }
-
-  // As every writer of ours does it: a new file put in the old one's place.
-  void replace(const std::string& text) {
-    std::ofstream(config() + ".new", std::ios::trunc) << text;
-    std::filesystem::rename(config() + ".new", config());
-  }
-
-  std::shared_ptr<const Identities> read(const std::string& text) {
-    write(text);
-    error_.clear();
-    warnings_.clear();
-    return Identities::read(config().c_str(), use_stash_ ? stash().c_str() : "", error_, warnings_);
-  }
-
-  cfg::KeyPtr make_key() {
-    std::string why;
-    EXPECT_EQ(cfg::create_key_stash(stash().c_str(), why), 0) << why;
-    use_stash_ = true;
-    cfg::KeyPtr key;
-    EXPECT_EQ(cfg::load_key_stash(stash().c_str(), key, why), 0) << why;
-    return key;
-  }
-
-  static std::string sealed(const cfg::Key& key, const char* type, const char* entry_dn,
-                            const char* clear) {
-    std::string stored;
-    EXPECT_EQ(cfg::seal_secret(key, {type, entry_dn}, clear, stored), 0);
-    return stored;
-  }
-
-  std::string folder_;
-  std::string error_;
-  std::vector<std::string> warnings_;
-  bool use_stash_ = false;
-};
 
 void expect_identity(const Identity* identity, const char* bound_dn, unsigned flags, unsigned roles,
                      const char* entry_dn) {
@@ -178,8 +109,7 @@ TEST_F(IdentitiesOfAFile, GroupMemberWithRoles) {
 
 TEST_F(IdentitiesOfAFile, MemberWithNoAdminBindsWithoutRoles) {
   const auto identities = read(
-      kTop + kGroup +
-      member("m", "cn=m", "mpw", "orv-slapdAdminRole: NoAdmin\norv-slapdAdminRole: AuditAdmin\n"));
+      kTop + kGroup + member("m", "cn=m", "mpw", "orv-slapdAdminRole: NoAdmin\n" + kAuditRole));
   ASSERT_TRUE(identities) << error_;
   expect_identity(identities->authenticate("cn=m", "mpw"), "CN=M", 0x14, 0,
                   "CN=M,CN=ADMINGROUP,CN=CONFIGURATION");
@@ -283,10 +213,8 @@ TEST_F(IdentitiesOfAFile, WrongPasswordsAndNamesProveNothing) {
 }
 
 TEST_F(IdentitiesOfAFile, EmptyPasswordNeverMatches) {
-  const auto identities = read(
-      "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\n"
-      "orv-slapdAdminDN: cn=root\norv-slapdAdminPW:\n" +
-      supplier("s", "orv-slapdSupplier", "cn=s", "pw"));
+  const auto identities = read(kTopWithoutPassword + "orv-slapdAdminPW:\n" +
+                               supplier("s", "orv-slapdSupplier", "cn=s", "pw"));
   if (identities) {
     EXPECT_EQ(identities->authenticate("cn=root", ""), nullptr);
     EXPECT_EQ(identities->authenticate("cn=s", ""), nullptr);
@@ -297,9 +225,7 @@ TEST_F(IdentitiesOfAFile, EmptyPasswordNeverMatches) {
 }
 
 TEST_F(IdentitiesOfAFile, IdentityWithoutPasswordCannotBind) {
-  const auto identities = read(
-      "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\norv-slapdAdminDN: "
-      "cn=root\n");
+  const auto identities = read(kTopWithoutPassword);
   ASSERT_TRUE(identities) << error_;
   EXPECT_EQ(identities->authenticate("cn=root", "x"), nullptr);
   EXPECT_EQ(identities->authenticate("cn=root", ""), nullptr);

@@ -1,13 +1,8 @@
 // The further names of identities: of users, for SASL mechanisms with passwords, and of Kerberos.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
-#include <sys/stat.h>
 
-#include <filesystem>
-#include <fstream>
-
-#include "auth/identities.h"
-#include "cfg/secret.h"
+#include "auth_identities_fixture.h"
 #include "slapi/codepage.h"
 #include "slapi/connection.h"
 
@@ -17,12 +12,6 @@ namespace {
 using ::testing::Contains;
 using ::testing::HasSubstr;
 using ::testing::IsEmpty;
-
-std::string top_with(const std::string& stored_password) {
-  return "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\n"
-         "orv-slapdAdminDN: cn=root\norv-slapdAdminPW: " +
-         stored_password + "\n";
-}
 
 std::string digest(const std::string& values) {
   return "\ndn: cn=digest,cn=configuration\nobjectClass: orv-slapdDigest\ncn: digest\n" + values;
@@ -34,15 +23,9 @@ std::string kerberos(const std::string& name) {
          name + "\n";
 }
 
-const std::string kTop = top_with("rootpw");
-const std::string kGroup =
-    "\ndn: cn=AdminGroup,cn=configuration\nobjectClass: container\ncn: AdminGroup\n";
-
-std::string member(const std::string& name, const std::string& more,
-                   const std::string& password = "alicepw") {
-  return "\ndn: cn=" + name + ",cn=AdminGroup,cn=configuration\n" +
-         "objectClass: orv-slapdAdminGroupMember\ncn: " + name + "\norv-slapdAdminDN: cn=" + name +
-         "\norv-slapdAdminPW: " + password + "\norv-slapdAdminRole: AuditAdmin\n" + more;
+std::string named_member(const std::string& name, const std::string& more,
+                         const std::string& password = "alicepw") {
+  return member(name, "cn=" + name, password, kAuditRole + more);
 }
 
 std::string user(const std::string& name) {
@@ -53,25 +36,16 @@ std::string principal(const std::string& name) {
   return "orv-slapdKrbAdminDN: " + name + "\n";
 }
 
-class NamesOfAFile : public ::testing::Test {
+class NamesOfAFile : public IdentitiesOfAFile {
  protected:
-  void SetUp() override {
-    std::string pattern = ::testing::TempDir() + "/orv-auth-XXXXXX";
-    ASSERT_NE(mkdtemp(pattern.data()), nullptr);
-    folder_ = pattern;
-  }
   void TearDown() override {
     set_local_code_page("UTF-8");
     initIconvHandle();
-    std::filesystem::remove_all(folder_);
+    IdentitiesOfAFile::TearDown();
   }
 
   std::shared_ptr<const Identities> read(const std::string& text) {
-    const std::string config = folder_ + "/config.ldif";
-    std::ofstream(config, std::ios::trunc) << text;
-    error_.clear();
-    warnings_.clear();
-    auto identities = Identities::read(config.c_str(), stash_.c_str(), error_, warnings_);
+    auto identities = IdentitiesOfAFile::read(text);
     EXPECT_TRUE(identities) << error_;
     return identities;
   }
@@ -84,10 +58,6 @@ class NamesOfAFile : public ::testing::Test {
     return identity ? identity->entry_dn : "";
   }
 
-  std::string folder_;
-  std::string stash_;
-  std::string error_;
-  std::vector<std::string> warnings_;
   std::string password_;
   std::string unreadable_;
 };
@@ -96,7 +66,7 @@ class NamesOfAFile : public ::testing::Test {
 
 TEST_F(NamesOfAFile, UserNamesOfThePrimaryAdministratorAndOfMembersBind) {
   const auto identities =
-      read(kTop + digest(user("boss")) + kGroup + member("alice", user("alice@work")));
+      read(kTop + digest(user("boss")) + kGroup + named_member("alice", user("alice@work")));
   EXPECT_EQ(found(*identities, "boss"), "CN=CONFIGURATION");
   EXPECT_EQ(password_, "rootpw");
   EXPECT_EQ(found(*identities, "alice@work"), "CN=ALICE,CN=ADMINGROUP,CN=CONFIGURATION");
@@ -134,7 +104,7 @@ TEST_F(NamesOfAFile, UserNamesElsewhereAreNobodys) {
 
 TEST_F(NamesOfAFile, UserNameThatTwoClaimBindsAsNeither) {
   const auto identities =
-      read(kTop + digest(user("same")) + kGroup + member("alice", user("same")));
+      read(kTop + digest(user("same")) + kGroup + named_member("alice", user("same")));
   EXPECT_EQ(found(*identities, "same"), "");
   EXPECT_FALSE(identities->has_users());
   EXPECT_THAT(warnings_, Contains(HasSubstr("has the same orv-slapdDigestAdminUser")));
@@ -143,7 +113,7 @@ TEST_F(NamesOfAFile, UserNameThatTwoClaimBindsAsNeither) {
 TEST_F(NamesOfAFile, MembersOfAGroupThatIsSwitchedOffBindByNoName) {
   const auto identities =
       read(kTop + "orv-slapdAdminGroupEnabled: FALSE\n" + kGroup +
-           member("alice", user("alice") + principal("orv-kn=alice@EXAMPLE.COM")));
+           named_member("alice", user("alice") + principal("orv-kn=alice@EXAMPLE.COM")));
   EXPECT_EQ(found(*identities, "alice"), "");
   EXPECT_EQ(unreadable_, "");
   EXPECT_EQ(identities->of_principal("alice@EXAMPLE.COM"), nullptr);
@@ -157,7 +127,7 @@ TEST_F(NamesOfAFile, PasswordsThatCannotBeReadBackServeNobody) {
   for (const std::string& stored :
        {hashed, std::string("*"), std::string("{AES256}AAAA"), std::string("{NONE}alicepw"),
         std::string("{CRYPT}$6$x$y"), std::string("{SSHA}"), "{NO}" + std::string(512, 'x')}) {
-    const auto identities = read(kTop + kGroup + member("alice", user("alice"), stored));
+    const auto identities = read(kTop + kGroup + named_member("alice", user("alice"), stored));
     EXPECT_EQ(found(*identities, "alice"), "") << stored;
     EXPECT_EQ(unreadable_, "CN=ALICE,CN=ADMINGROUP,CN=CONFIGURATION");
     EXPECT_EQ(password_, "");
@@ -166,25 +136,17 @@ TEST_F(NamesOfAFile, PasswordsThatCannotBeReadBackServeNobody) {
 }
 
 TEST_F(NamesOfAFile, IdentityWithoutPasswordHasNoUserName) {
-  const auto identities = read(
-      "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\n"
-      "orv-slapdAdminDN: cn=root\n" +
-      digest(user("boss")));
+  const auto identities = read(kTopWithoutPassword + digest(user("boss")));
   EXPECT_EQ(found(*identities, "boss"), "");
   EXPECT_FALSE(identities->has_users());
 }
 
 TEST_F(NamesOfAFile, SealedPasswordsAreOpenedWhereTheyBelong) {
-  stash_ = folder_ + "/stash";
-  std::string why;
-  ASSERT_EQ(cfg::create_key_stash(stash_.c_str(), why), 0) << why;
-  cfg::KeyPtr key;
-  ASSERT_EQ(cfg::load_key_stash(stash_.c_str(), key, why), 0);
-  std::string stored;
-  ASSERT_EQ(cfg::seal_secret(*key, {"orv-slapdAdminPW", "CN=CONFIGURATION"}, "sealed pw", stored),
-            0);
+  const cfg::KeyPtr key = make_key();
+  ASSERT_TRUE(key);
+  const std::string stored = sealed(*key, "orv-slapdAdminPW", "CN=CONFIGURATION", "sealed pw");
   const auto identities = read(top_with(stored) + digest(user("boss")) + kGroup +
-                               member("alice", user("alice"), stored));
+                               named_member("alice", user("alice"), stored));
   EXPECT_EQ(found(*identities, "boss"), "CN=CONFIGURATION");
   EXPECT_EQ(password_, "sealed pw");
   // Copied from another entry.
@@ -195,10 +157,8 @@ TEST_F(NamesOfAFile, SealedPasswordsAreOpenedWhereTheyBelong) {
 TEST_F(NamesOfAFile, NamesAndPasswordsOfAnotherCodePageAreHandedOverInUtf8) {
   set_local_code_page("ISO-8859-1");
   ASSERT_EQ(initIconvHandle(), 0);
-  const auto identities = read(
-      "dn: cn=configuration\nobjectClass: orv-slapdTop\ncn: configuration\n"
-      "orv-slapdAdminDN: cn=root\norv-slapdAdminPW:: Z3L832U=\n" +
-      digest("orv-slapdDigestAdminUser:: avZyZw==\n"));
+  const auto identities = read(kTopWithoutPassword + "orv-slapdAdminPW:: Z3L832U=\n" +
+                               digest("orv-slapdDigestAdminUser:: avZyZw==\n"));
   EXPECT_EQ(found(*identities, "j\u00f6rg"), "CN=CONFIGURATION");
   EXPECT_EQ(password_, "gr\u00fc\u00dfe");
 }
@@ -242,8 +202,9 @@ TEST_F(NamesOfAFile, PrincipalsAreComparedWhole) {
 }
 
 TEST_F(NamesOfAFile, PrincipalThatTwoClaimBindsAsNeither) {
-  const auto identities = read(kTop + kerberos("orv-kn=same@EXAMPLE.COM") + kGroup +
-                               member("alice", principal("orv-kerberosName=SAME@example.com")));
+  const auto identities =
+      read(kTop + kerberos("orv-kn=same@EXAMPLE.COM") + kGroup +
+           named_member("alice", principal("orv-kerberosName=SAME@example.com")));
   EXPECT_EQ(identities->of_principal("same@EXAMPLE.COM"), nullptr);
   EXPECT_FALSE(identities->has_principals());
   EXPECT_THAT(warnings_, Contains(HasSubstr("has the same orv-slapdKrbAdminDN")));
@@ -269,7 +230,7 @@ TEST_F(NamesOfAFile, KerberosNeedsNoPasswordAndGivesTheRoles) {
   EXPECT_EQ(bob->authority, authority::admin_group_member);
   EXPECT_EQ(bob->roles, role::audit);
   EXPECT_TRUE(identities->still_valid(*bob));
-  EXPECT_FALSE(read(kTop + kGroup + member("bob", ""))->still_valid(*bob));
+  EXPECT_FALSE(read(kTop + kGroup + named_member("bob", ""))->still_valid(*bob));
 }
 
 }  // namespace
