@@ -2,10 +2,8 @@
 // say what it would not.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
-#include <sasl/sasl.h>
 
 #include <algorithm>
-#include <array>
 #include <atomic>
 #include <map>
 #include <mutex>
@@ -15,6 +13,7 @@
 #include <thread>
 
 #include "auth/sasl_cyrus.h"
+#include "sasl_peer.h"
 
 namespace orv::server {
 namespace {
@@ -25,8 +24,6 @@ using ::testing::IsEmpty;
 using ::testing::Not;
 using State = SaslOutcome::State;
 
-constexpr const char* kUser = "boss";
-constexpr const char* kPassword = "Vx7#kq9!Zp3$";
 const std::string kMechanisms[] = {"DIGEST-MD5", "SCRAM-SHA-256"};
 
 // ---- who there is
@@ -64,144 +61,15 @@ class People final : public SaslIdentities {
   std::atomic<int> wrong{0};
 };
 
-// ---- the other side
-
-struct Login {
-  std::string user = kUser;
-  std::string password = kPassword;
-  std::string authorization_id{};
-  unsigned min_strength = 0;
-  unsigned max_strength = 0;
-  unsigned longest_frame = 65536;
-};
-
-class Peer {
- public:
-  Peer(std::string mechanism, Login login) : mechanism_(std::move(mechanism)), login_(login) {
-    secret_.resize(sizeof(sasl_secret_t) + login_.password.size());
-    auto* const secret = reinterpret_cast<sasl_secret_t*>(secret_.data());
-    secret->len = login_.password.size();
-    std::copy(login_.password.begin(), login_.password.end(), secret->data);
-    callbacks_ = {row(SASL_CB_USER, tell_authorization),
-                  row(SASL_CB_AUTHNAME, tell_user),
-                  row(SASL_CB_PASS, tell_password),
-                  {SASL_CB_LIST_END, nullptr, nullptr}};
-    EXPECT_EQ(sasl_client_new("ldap", "localhost", nullptr, nullptr, callbacks_.data(),
-                              SASL_SUCCESS_DATA, &connection_),
-              SASL_OK);
-    sasl_security_properties_t wanted{};
-    wanted.min_ssf = login_.min_strength;
-    wanted.max_ssf = login_.max_strength;
-    wanted.maxbufsize = login_.longest_frame;
-    EXPECT_EQ(sasl_setprop(connection_, SASL_SEC_PROPS, &wanted), SASL_OK);
-  }
-  ~Peer() { sasl_dispose(&connection_); }
-  Peer(const Peer&) = delete;
-  Peer& operator=(const Peer&) = delete;
-
-  // The first credentials, if the mechanism has some.
-  std::optional<std::string> begin() {
-    const char* out = nullptr;
-    unsigned length = 0;
-    const char* chosen = nullptr;
-    code_ = sasl_client_start(connection_, mechanism_.c_str(), nullptr, &out, &length, &chosen);
-    EXPECT_TRUE(code_ == SASL_CONTINUE || code_ == SASL_OK) << sasl_errdetail(connection_);
-    if (out == nullptr) return std::nullopt;
-    return std::string(out, length);
-  }
-
-  std::string answer(const std::string& challenge) {
-    const char* out = nullptr;
-    unsigned length = 0;
-    code_ = sasl_client_step(connection_, challenge.data(), static_cast<unsigned>(challenge.size()),
-                             nullptr, &out, &length);
-    return out ? std::string(out, length) : std::string();
-  }
-
-  // Whether the server proved itself, too.
-  bool done() const { return code_ == SASL_OK; }
-
-  // Through the layer of this side; nothing when it is damaged.
-  std::optional<std::string> decode(const std::string& wire) {
-    std::string clear;
-    for (std::size_t at = 0; at < wire.size(); at += 60000)
-      if (!convert(sasl_decode, wire.substr(at, 60000), clear)) return std::nullopt;
-    return clear;
-  }
-  std::string encode(const std::string& clear) {
-    std::string wire;
-    for (std::size_t at = 0; at < clear.size(); at += 1000)
-      EXPECT_TRUE(convert(sasl_encode, clear.substr(at, 1000), wire));
-    return wire;
-  }
-
- private:
-  template <typename Function>
-  bool convert(Function function, const std::string& from, std::string& to) {
-    const char* out = nullptr;
-    unsigned length = 0;
-    if (function(connection_, from.data(), static_cast<unsigned>(from.size()), &out, &length) !=
-        SASL_OK)
-      return false;
-    if (length > 0) to.append(out, length);
-    return true;
-  }
-
-  template <typename Function>
-  sasl_callback_t row(unsigned long id, Function* function) {
-    return {id, reinterpret_cast<int (*)()>(reinterpret_cast<void (*)()>(function)), this};
-  }
-  static int tell(const std::string& text, const char** out, unsigned* length) {
-    *out = text.c_str();
-    if (length) *length = static_cast<unsigned>(text.size());
-    return SASL_OK;
-  }
-  static int tell_user(void* context, int, const char** out, unsigned* length) {
-    return tell(static_cast<Peer*>(context)->login_.user, out, length);
-  }
-  static int tell_authorization(void* context, int, const char** out, unsigned* length) {
-    return tell(static_cast<Peer*>(context)->login_.authorization_id, out, length);
-  }
-  static int tell_password(sasl_conn_t*, void* context, int, sasl_secret_t** secret) {
-    *secret = reinterpret_cast<sasl_secret_t*>(static_cast<Peer*>(context)->secret_.data());
-    return SASL_OK;
-  }
-
-  const std::string mechanism_;
-  const Login login_;
-  std::vector<char> secret_;
-  std::array<sasl_callback_t, 4> callbacks_{};
-  sasl_conn_t* connection_ = nullptr;
-  int code_ = SASL_CONTINUE;
-};
-
-// ---- both
+// ---- both sides
 
 class CyrusTest : public ::testing::Test {
  protected:
-  static void SetUpTestSuite() {
-    std::string error;
-    library = SaslLibrary::open(error).release();
-    ASSERT_NE(library, nullptr) << error;
-    // Other plug-ins than these do not give all their memory back.
-    static const sasl_callback_t only_these[] = {
-        {SASL_CB_VERIFYFILE,
-         reinterpret_cast<int (*)()>(reinterpret_cast<void (*)()>(&is_tested_plugin)), nullptr},
-        {SASL_CB_LIST_END, nullptr, nullptr}};
-    ASSERT_EQ(sasl_client_init(only_these), SASL_OK);
-  }
-  static void TearDownTestSuite() {
-    sasl_client_done();
-    delete library;
-  }
-  static int is_tested_plugin(void*, const char* file, sasl_verify_type_t) {
-    const std::string_view name(file);
-    const bool tested = name.find("libdigestmd5.") != std::string_view::npos ||
-                        name.find("libscram.") != std::string_view::npos;
-    return tested ? SASL_OK : SASL_CONTINUE;
-  }
+  static void SetUpTestSuite() { tested = std::make_unique<TestedSasl>(); }
+  static void TearDownTestSuite() { tested.reset(); }
+
   CyrusTest()
-      : sasl(*library, people, [this](std::string_view line) {
+      : sasl(tested->server(), people, [this](std::string_view line) {
           const std::lock_guard lock(people.mutex);
           reported = line;
         }) {
@@ -222,7 +90,7 @@ class CyrusTest : public ::testing::Test {
   };
 
   // Lets the peer go on until the server says how it ends.
-  Meeting meet(const std::string& mechanism, Peer& peer) {
+  Meeting meet(const std::string& mechanism, SaslPeer& peer) {
     const auto exchange = start(mechanism);
     Meeting meeting;
     meeting.sent.push_back(peer.begin());
@@ -238,8 +106,8 @@ class CyrusTest : public ::testing::Test {
     if (meeting.outcome.reply) peer.answer(*meeting.outcome.reply);
     return meeting;
   }
-  Meeting meet(const std::string& mechanism, const Login& login) {
-    Peer peer(mechanism, login);
+  Meeting meet(const std::string& mechanism, const SaslLogin& login) {
+    SaslPeer peer(mechanism, login);
     return meet(mechanism, peer);
   }
 
@@ -252,15 +120,13 @@ class CyrusTest : public ::testing::Test {
     EXPECT_EQ(meeting.outcome.layer, nullptr);
   }
 
-  static SaslLibrary* library;
+  static inline std::unique_ptr<TestedSasl> tested;
   People people;
   std::string reported;
   TransportFacts transport;
   CyrusSasl sasl;
   SaslMechanisms mechanisms;
 };
-
-SaslLibrary* CyrusTest::library = nullptr;
 
 class ByPassword : public CyrusTest, public ::testing::WithParamInterface<std::string> {};
 INSTANTIATE_TEST_SUITE_P(Mechanisms, ByPassword, ::testing::ValuesIn(kMechanisms),
@@ -291,7 +157,7 @@ std::string joined(const std::vector<std::string>& pieces) {
 // ---- who gets in
 
 TEST_P(ByPassword, PasswordProvesAUserNameAndTheServerProvesItselfToo) {
-  Peer peer(GetParam(), {});
+  SaslPeer peer(GetParam(), {});
   const Meeting meeting = meet(GetParam(), peer);
   ASSERT_EQ(meeting.outcome.state, State::done) << reported;
   EXPECT_EQ(meeting.outcome.identity->bound_dn, "CN=ROOT");
@@ -372,7 +238,7 @@ TEST_P(ByPassword, NobodyActsAsAnybodyElse) {
 
 TEST_P(ByPassword, WantOfMemoryIsNoWrongPassword) {
   people.out_of_memory = true;
-  Peer peer(GetParam(), {});
+  SaslPeer peer(GetParam(), {});
   EXPECT_THROW(meet(GetParam(), peer), std::bad_alloc);
   EXPECT_EQ(people.wrong, 0);
 }
@@ -390,7 +256,7 @@ TEST_P(ByPassword, RecordedBindIsNotBelievedAgain) {
 }
 
 TEST_P(ByPassword, AnswerToAnotherConnectionsChallengeIsNotBelieved) {
-  Peer peer(GetParam(), {});
+  SaslPeer peer(GetParam(), {});
   const auto first = start(GetParam());
   const auto second = start(GetParam());
   const std::optional<std::string> begun = peer.begin();
@@ -418,7 +284,7 @@ TEST_P(ByPassword, EveryPartOfAProofIsRefused) {
   // The other one takes a while to compute.
   const std::size_t stride = GetParam() == "DIGEST-MD5" ? 1 : 7;
   for (std::size_t cut = 0; cut < length; cut += stride) {
-    Peer peer(GetParam(), {});
+    SaslPeer peer(GetParam(), {});
     const auto exchange = start(GetParam());
     const std::optional<std::string> begun = peer.begin();
     const SaslOutcome asked =
@@ -438,7 +304,7 @@ TEST_P(ByPassword, EveryPartOfAProofIsRefused) {
 TEST_F(CyrusTest, OctetsOfTheProofOfScramCount) {
   std::size_t length = 3;
   for (std::size_t at = 0; at + 2 < length; at += 5) {
-    Peer peer("SCRAM-SHA-256", {});
+    SaslPeer peer("SCRAM-SHA-256", {});
     const auto exchange = start("SCRAM-SHA-256");
     std::string answer = peer.answer(*exchange->step(std::string_view(*peer.begin())).reply);
     length = answer.size();
@@ -500,7 +366,7 @@ TEST_P(ByPassword, AnswersWithOtherPartsAreNoProof) {
   std::size_t parts = 1;
   for (std::size_t part = 0; part < parts; ++part)
     for (const std::string& value : instead) {
-      Peer peer(GetParam(), {});
+      SaslPeer peer(GetParam(), {});
       const auto exchange = start(GetParam());
       const std::optional<std::string> begun = peer.begin();
       const SaslOutcome asked =
@@ -568,7 +434,7 @@ class LayerOfDigest : public CyrusTest {
   }
   void SetUp() override { ASSERT_NE(layer, nullptr); }
 
-  Peer peer;
+  SaslPeer peer;
   std::unique_ptr<SecurityLayer> layer;
 };
 
@@ -588,7 +454,7 @@ TEST_F(LayerOfDigest, CarriesTextsOfAnyLengthToTheClient) {
 
 TEST_F(LayerOfDigest, TakesFramesFromTheClientHoweverTheyAreCut) {
   const std::string text = long_text();
-  const std::string wire = peer.encode(text);
+  const std::string wire = peer.encode(text).value();
   std::string clear;
   std::size_t size = 1;
   for (std::size_t at = 0; at < wire.size(); at += size, size = size % 70000 * 3 + 1)
@@ -597,14 +463,14 @@ TEST_F(LayerOfDigest, TakesFramesFromTheClientHoweverTheyAreCut) {
 }
 
 TEST_F(LayerOfDigest, RefusesWhatIsDamaged) {
-  std::string wire = peer.encode("some text");
+  std::string wire = peer.encode("some text").value();
   wire[wire.size() / 2] = static_cast<char>(wire[wire.size() / 2] ^ 1);
   std::string clear;
   EXPECT_FALSE(layer->unwrap(wire, clear));
 }
 
 TEST_F(LayerOfDigest, RefusesWhatIsPlayedAgain) {
-  const std::string wire = peer.encode("some text");
+  const std::string wire = peer.encode("some text").value();
   std::string clear;
   EXPECT_TRUE(layer->unwrap(wire, clear));
   EXPECT_FALSE(layer->unwrap(wire, clear));
@@ -615,7 +481,7 @@ TEST_F(LayerOfDigest, RefusesFramesOfALengthThatIsNone) {
   using namespace std::string_literals;
   for (const std::string& head : {"\xff\xff\xff\xff"s, "\x7f\xff\xff\xff"s, "\x80\0\0\0"s,
                                   "\0\x02\0\0"s, "\0\x01\0\x01"s, "\0\0\0\x0f"s, "\0\0\0\x01"s}) {
-    Peer other("DIGEST-MD5", {.min_strength = 1, .max_strength = 1});
+    SaslPeer other("DIGEST-MD5", {.min_strength = 1, .max_strength = 1});
     SaslOutcome outcome = meet("DIGEST-MD5", other).outcome;
     ASSERT_NE(outcome.layer, nullptr);
     std::string clear;
@@ -654,7 +520,7 @@ TEST_F(CyrusTest, NoLayerIsOfferedWhereTheTransportProtectsAlready) {
 }
 
 TEST_F(CyrusTest, LayerOutlivesTheExchange) {
-  Peer peer("DIGEST-MD5", {.min_strength = 1, .max_strength = 1});
+  SaslPeer peer("DIGEST-MD5", {.min_strength = 1, .max_strength = 1});
   std::unique_ptr<SecurityLayer> layer = meet("DIGEST-MD5", peer).outcome.layer;
   std::string wire;
   ASSERT_TRUE(layer->wrap("after all", wire));
@@ -690,7 +556,7 @@ TEST_F(CyrusTest, KerberosNeedsAKeytab) {
 TEST_F(CyrusTest, PluginsThatTheServerDoesNotKnowAreNotLoaded) {
   for (const char* const name : {"PLAIN", "LOGIN", "CRAM-MD5", "NTLM", "ANONYMOUS"}) {
     EXPECT_EQ(find_mechanism(mechanisms, name, transport), nullptr) << name;
-    EXPECT_FALSE(library->has(name)) << name;
+    EXPECT_FALSE(tested->server().has(name)) << name;
   }
   EXPECT_EQ(find_mechanism(mechanisms, "SCRAM-SHA-1", transport), nullptr);
 }
@@ -704,7 +570,7 @@ TEST_F(CyrusTest, ExchangesOfManyThreadsDoNotMeet) {
     threads.emplace_back([&, t] {
       for (int i = 0; i < 5; ++i) {
         const std::string& mechanism = kMechanisms[static_cast<std::size_t>(t + i) % 2];
-        Peer peer(mechanism, {.password = i == 3 ? "wrong" : kPassword});
+        SaslPeer peer(mechanism, {.password = i == 3 ? "wrong" : kPassword});
         const auto exchange = find_mechanism(mechanisms, mechanism, transport)->start(transport);
         const std::optional<std::string> begun = peer.begin();
         const SaslOutcome asked =

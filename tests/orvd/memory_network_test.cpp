@@ -5,10 +5,8 @@
 // There are too many allocations to let each of them fail: a sample of them does, the same in each
 // run. ORV_FAILING_ALLOCATIONS is how many of each session (0: all), ORV_SEED draws another sample.
 #include <gtest/gtest.h>
-#include <sasl/sasl.h>
 
 #include <algorithm>
-#include <array>
 #include <chrono>
 #include <cstdlib>
 #include <filesystem>
@@ -26,6 +24,7 @@
 #include "core_tls_client.h"
 #include "net/tls.h"
 #include "protocol/control_values.h"
+#include "sasl_peer.h"
 
 namespace orv::server::test {
 namespace {
@@ -36,7 +35,6 @@ using namespace std::chrono_literals;
 using orv::test::AllocationFault;
 using orv::test::AllocationFaultElsewhere;
 
-constexpr const char* kUser = "boss";
 constexpr auto kPatience = 9s;  // less than what the client waits for bytes
 constexpr const char* kBox = "cn=box,cn=configuration";
 
@@ -60,92 +58,18 @@ class Boss final : public SaslIdentities {
   bool has_principals() const noexcept override { return false; }
 };
 
-// The client's side of a SASL bind, by the library's own client.
-class Peer {
- public:
-  Peer(const char* mechanism, unsigned strength) : mechanism_(mechanism) {
-    secret_.resize(sizeof(sasl_secret_t) + std::string_view(kSecret).size());
-    auto* const secret = reinterpret_cast<sasl_secret_t*>(secret_.data());
-    secret->len = std::string_view(kSecret).size();
-    std::copy_n(kSecret, secret->len, secret->data);
-    callbacks_ = {row(SASL_CB_USER, tell_nothing),
-                  row(SASL_CB_AUTHNAME, tell_user),
-                  row(SASL_CB_PASS, tell_password),
-                  {SASL_CB_LIST_END, nullptr, nullptr}};
-    EXPECT_EQ(sasl_client_new("ldap", "localhost", nullptr, nullptr, callbacks_.data(),
-                              SASL_SUCCESS_DATA, &connection_),
-              SASL_OK);
-    sasl_security_properties_t wanted{};
-    wanted.min_ssf = strength;
-    wanted.max_ssf = strength;
-    wanted.maxbufsize = 65536;
-    sasl_setprop(connection_, SASL_SEC_PROPS, &wanted);
-  }
-  ~Peer() { sasl_dispose(&connection_); }
-  Peer(const Peer&) = delete;
-  Peer& operator=(const Peer&) = delete;
-
-  const char* mechanism() const { return mechanism_; }
-  std::optional<std::string> begin() {
-    const char* chosen = nullptr;
-    const char* out = nullptr;
-    unsigned length = 0;
-    sasl_client_start(connection_, mechanism_, nullptr, &out, &length, &chosen);
-    return out ? std::optional(std::string(out, length)) : std::nullopt;
-  }
-  std::string answer(const std::string& challenge) {
-    const char* out = nullptr;
-    unsigned length = 0;
-    sasl_client_step(connection_, challenge.data(), static_cast<unsigned>(challenge.size()),
-                     nullptr, &out, &length);
-    return out ? std::string(out, length) : std::string();
-  }
-  // Through the security layer of this side.
-  std::string wrap(std::string_view clear) { return convert(sasl_encode, clear); }
-  std::string unwrap(std::string_view wire) { return convert(sasl_decode, wire); }
-
- private:
-  template <typename Function>
-  std::string convert(Function function, std::string_view from) {
-    const char* out = nullptr;
-    unsigned length = 0;
-    function(connection_, from.data(), static_cast<unsigned>(from.size()), &out, &length);
-    return out ? std::string(out, length) : std::string();
-  }
-  template <typename Function>
-  sasl_callback_t row(unsigned long id, Function* function) {
-    return {id, reinterpret_cast<int (*)()>(reinterpret_cast<void (*)()>(function)), this};
-  }
-  static int tell(std::string_view text, const char** out, unsigned* length) {
-    *out = text.data();
-    if (length) *length = static_cast<unsigned>(text.size());
-    return SASL_OK;
-  }
-  static int tell_user(void*, int, const char** out, unsigned* length) {
-    return tell(kUser, out, length);
-  }
-  static int tell_nothing(void*, int, const char** out, unsigned* length) {
-    return tell("", out, length);
-  }
-  static int tell_password(sasl_conn_t*, void* context, int, sasl_secret_t** secret) {
-    *secret = reinterpret_cast<sasl_secret_t*>(static_cast<Peer*>(context)->secret_.data());
-    return SASL_OK;
-  }
-
-  const char* const mechanism_;
-  std::vector<char> secret_;
-  std::array<sasl_callback_t, 4> callbacks_{};
-  sasl_conn_t* connection_ = nullptr;
-};
+SaslLogin login(unsigned strength = 0) {
+  return {.password = kSecret, .min_strength = strength, .max_strength = strength};
+}
 
 // A client with TLS, and with a security layer once it is given one.
 class SaslClient final : public TlsClient {
  public:
   explicit SaslClient(std::uint16_t port) : TlsClient(port) {}
 
-  void put_layer(Peer& peer) { layer_ = &peer; }
+  void put_layer(SaslPeer& peer) { layer_ = &peer; }
   void send(std::string_view bytes) override {
-    TlsClient::send(layer_ ? layer_->wrap(bytes) : bytes);
+    TlsClient::send(layer_ ? layer_->encode(bytes).value_or("") : std::string(bytes));
   }
 
  protected:
@@ -153,12 +77,12 @@ class SaslClient final : public TlsClient {
     if (!layer_) return TlsClient::fill();
     const std::string before = std::exchange(received_, {});
     const bool more = TlsClient::fill();
-    received_ = before + (more ? layer_->unwrap(received_) : std::string());
+    received_ = before + (more ? layer_->decode(received_).value_or("") : "");
     return more;
   }
 
  private:
-  Peer* layer_ = nullptr;
+  SaslPeer* layer_ = nullptr;
 };
 
 // What a client does, step by step, until the server ends the connection.
@@ -194,7 +118,7 @@ class Conversation {
   }
 
   // As SASL does it, until the server says how it ends.
-  int bind(Peer& peer, int& id, bool with_layer) {
+  int bind(SaslPeer& peer, int& id, bool with_layer) {
     std::optional<std::string> credentials = peer.begin();
     for (;;) {
       const Reply reply = reply_to(sasl_bind(id, peer.mechanism(), credentials), id);
@@ -241,29 +165,11 @@ class MemoryOfAServer : public LoopbackServer {
  protected:
   static void SetUpTestSuite() {
     LoopbackServer::SetUpTestSuite();
-    std::string error;
-    library = SaslLibrary::open(error).release();
-    ASSERT_NE(library, nullptr) << error;
-    static const sasl_callback_t only_these[] = {
-        {SASL_CB_VERIFYFILE,
-         reinterpret_cast<int (*)()>(reinterpret_cast<void (*)()>(&is_tested_plugin)), nullptr},
-        {SASL_CB_LIST_END, nullptr, nullptr}};
-    ASSERT_EQ(sasl_client_init(only_these), SASL_OK);
+    tested = std::make_unique<TestedSasl>();
   }
-  static void TearDownTestSuite() {
-    sasl_client_done();
-    delete std::exchange(library, nullptr);
-  }
-  // Others do not give all their memory back.
-  static int is_tested_plugin(void*, const char* file, sasl_verify_type_t) {
-    const std::string_view name(file);
-    return name.find("libdigestmd5.") != std::string_view::npos ||
-                   name.find("libscram.") != std::string_view::npos
-               ? SASL_OK
-               : SASL_CONTINUE;
-  }
+  static void TearDownTestSuite() { tested.reset(); }
 
-  MemoryOfAServer() : sasl(*library, boss, [](std::string_view) {}) {
+  MemoryOfAServer() : sasl(tested->server(), boss, [](std::string_view) {}) {
     const Pair own = certificates.self_signed("localhost");
     settings.tls.certificate_file = own.certificate;
     settings.tls.key_file = own.key;
@@ -305,7 +211,7 @@ class MemoryOfAServer : public LoopbackServer {
       codes.push_back(talk.ask(bind(id, kRoot, kSecret), id));
       ++id;
       work(talk, id, codes);
-      Peer peer("DIGEST-MD5", 0);  // SCRAM hashes so often that nothing else would fail
+      SaslPeer peer("DIGEST-MD5", login());  // SCRAM hashes so often that nothing else would fail
       codes.push_back(talk.bind(peer, id, false));
       codes.push_back(talk.ask(search(id, kTop), id));
       ++id;
@@ -317,7 +223,7 @@ class MemoryOfAServer : public LoopbackServer {
     Codes codes;
     int id = 1;
     Conversation talk(port());
-    Peer peer("DIGEST-MD5", 1);
+    SaslPeer peer("DIGEST-MD5", login(1));
     codes.push_back(talk.bind(peer, id, true));
     if (codes.back() == 0) work(talk, id, codes);
     talk.leave(id);
@@ -370,21 +276,19 @@ class MemoryOfAServer : public LoopbackServer {
     EXPECT_TRUE(everybody_has_gone());
   }
 
-  static SaslLibrary* library;
+  static inline std::unique_ptr<TestedSasl> tested;
   Certificates certificates;
   Boss boss;
   CyrusSasl sasl;
   const EntryPtr found_ = make_test_entry("CN=X,CN=CONFIGURATION");
 };
 
-SaslLibrary* MemoryOfAServer::library = nullptr;
-
 // What the library allocates, each in its turn: on this thread, so that none is missed.
 class MemoryOfAMechanism : public MemoryOfAServer, public testing::WithParamInterface<const char*> {
  protected:
   // Whether the n-th allocation was reached; what the exchange ended with, if it did.
   bool fails(long n, std::optional<SaslOutcome>& last) {
-    Peer peer(GetParam(), 0);
+    SaslPeer peer(GetParam(), login());
     const auto exchange = find_mechanism(mechanisms, GetParam(), {})->start({});
     std::optional<std::string> sent = peer.begin();
     bool hit = false;
