@@ -522,10 +522,8 @@ TEST_F(Add, WritesTheTranslatedEntryUnderTheClientsDn) {
 }
 
 TEST_F(Add, ReleasesListThenRecordsThenSessionThenDnBeforeItAnswers) {
-  platform.at("xlate_utf8_to_localcp", 3,
-              [&] { platform.name_allocation(platform.allocations() + 1, "local DN"); });
-  platform.at("xlate_utf8_to_localcp", 1,
-              [&] { platform.name_allocation(platform.allocations() + 1, "first value"); });
+  platform.name_allocation_in("xlate_utf8_to_localcp", 3, "local DN");
+  platform.name_allocation_in("xlate_utf8_to_localcp", 1, "first value");
   EXPECT_EQ(add(), 0);
   EXPECT_THAT(
       platform.calls({"cfg_add_s", "free_ldmll", "free", "cfg_unbind", "pthread_mutex_unlock",

@@ -519,8 +519,7 @@ TEST_F(AuditLogGuard, DefaultThatCannotBeCopiedGives90) {
 }
 
 TEST_F(AuditLogGuard, ReleasesTheNameOfTheFileBeforeItLooksAtTheValues) {
-  platform.at("slapi_ch_strdup", 1,
-              [&] { platform.name_allocation(platform.allocations() + 1, "file name"); });
+  platform.name_allocation_in("slapi_ch_strdup", 1, "file name");
   log_to("/log/other");
   EXPECT_THAT(
       platform.calls({"free", "realpath"}),
@@ -529,8 +528,7 @@ TEST_F(AuditLogGuard, ReleasesTheNameOfTheFileBeforeItLooksAtTheValues) {
 
 TEST_F(AuditLogGuard, ReleasesTheNameOfTheFileBeforeItSaysThatItDoesNotResolve) {
   platform.path_errors["/log/audit"] = EACCES;
-  platform.at("slapi_ch_strdup", 1,
-              [&] { platform.name_allocation(platform.allocations() + 1, "file name"); });
+  platform.name_allocation_in("slapi_ch_strdup", 1, "file name");
   EXPECT_EQ(log_to("/log/other"), 80);
   const auto story = platform.story({"free"});
   ASSERT_GT(story.size(), 2U);

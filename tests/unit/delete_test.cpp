@@ -347,8 +347,7 @@ TEST_F(Delete, GoesThroughItsStepsInOrder) {
 }
 
 TEST_F(Delete, ReleasesTheConvertedDnBeforeTheSessionEnds) {
-  platform.at("xlate_utf8_to_localcp", 1,
-              [&] { platform.name_allocation(platform.allocations() + 1, "converted DN"); });
+  platform.name_allocation_in("xlate_utf8_to_localcp", 1, "converted DN");
   EXPECT_EQ(remove(), 0);
   EXPECT_THAT(platform.calls({"cfg_delete_s", "free", "entry_free"}),
               ElementsAre("cfg_delete_s(session, \"CN=X,CN=CONFIGURATION\")", "free(converted DN)",

@@ -82,8 +82,7 @@ TEST_F(Identities, KerberosIdentityIsReadFromKerberosInTheLightForm) {
 
 TEST_F(Identities, KerberosIdentityIsCopiedBetweenTheReleasesOfItsRawAndLightForms) {
   file(kKerberos, {{"orv-slapdKrbAdminDN", {"orv-kn = admin@REALM"}}});
-  platform.at("xlate_localcp_to_utf8", 1,
-              [&] { platform.name_allocation(platform.allocations() + 1, "raw"); });
+  platform.name_allocation_in("xlate_localcp_to_utf8", 1, "raw");
   EXPECT_EQ(kerberos_id(), "orv-kn=admin@REALM");
   EXPECT_THAT(platform.calls({"dn_normalize_light_esc", "free", "free_ldap_escDN"}),
               ElementsAre("dn_normalize_light_esc(\"orv-kn = admin@REALM\")", "free(raw)",
@@ -149,8 +148,7 @@ TEST_F(Identities, ValuesAreReleasedAfterTheWalkHasAdvanced) {
 
 TEST_F(Identities, IdentityThatIsDiscardedIsReleasedAfterItsLine) {
   file(kConfiguration, {{"orv-slapdAdminDN", {"CN=A"}}, {"cn", {"x"}}});
-  platform.at("replace_DN", 1,
-              [&] { platform.name_allocation(platform.allocations() + 1, "made"); });
+  platform.name_allocation_in("replace_DN", 1, "made");
   platform.fail("cfg_next_attribute", 1, 80);
   EXPECT_EQ(admin_dn(), "null");
   const std::vector<std::string> story =
@@ -533,8 +531,7 @@ TEST_F(Identities, MemberFoundIsDiscardedByALaterError) {
 
 TEST_F(Identities, MemberThatIsDiscardedIsReleasedBeforeItsChain) {
   file(kMember, {{"orv-slapdAdminDN", {"CN=M"}}, {"cn", {"x"}}});
-  platform.at("replace_DN", 1,
-              [&] { platform.name_allocation(platform.allocations() + 1, "made"); });
+  platform.name_allocation_in("replace_DN", 1, "made");
   platform.fail("cfg_get_values", 2, 1);
   EXPECT_EQ(member_dn(), "null");
   EXPECT_THAT(platform.calls({"free", "cfg_msgfree"}),

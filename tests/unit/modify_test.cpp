@@ -1326,8 +1326,7 @@ TEST_F(Modify, TextOfTheAddressCheckIsSentAlsoAlongWith50) {
 
 TEST_F(Modify, TextIsReleasedAfterTheAnswer) {
   target(kTop);
-  platform.at("slapi_ch_strdup", 2,
-              [&] { platform.name_allocation(platform.allocations() + 1, "text"); });
+  platform.name_allocation_in("slapi_ch_strdup", 2, "text");
   EXPECT_EQ(modify({{kReplace, "orv-slapdPwEncryption", {{"rot13"}}}}), 21);
   EXPECT_THAT(platform.calls({"send_ldap_result", "free", "free_ldmll"}),
               ElementsAre("send_ldap_result(connection, operation, 21, null, "
@@ -1395,8 +1394,7 @@ TEST_F(Modify, OtherCodesOfTheLibraryAreAnsweredUnchangedAndLeaveTheCopy) {
 }
 
 TEST_F(Modify, TranslatedDnGoesAfterTheListAndBeforeTheSession) {
-  platform.at("xlate_utf8_to_localcp", 2,
-              [&] { platform.name_allocation(platform.allocations() + 1, "converted DN"); });
+  platform.name_allocation_in("xlate_utf8_to_localcp", 2, "converted DN");
   EXPECT_EQ(modify(), 0);
   EXPECT_THAT(
       platform.calls({"ldap_mods_free", "free", "cfg_unbind"}),

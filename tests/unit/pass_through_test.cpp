@@ -288,10 +288,8 @@ TEST_F(PassThrough, SubtreeThatCannotBeConvertedOrNormalisedGives1AndStops) {
 TEST_F(PassThrough, SubtreeThatHasNoNormalFormIsReleasedWithTheOthersBeforeTheArray) {
   make_with_subtrees({"o=a", "o=b", "o=c"});
   platform.name_allocation(1, "array");
-  platform.at("replace_DN", 1,
-              [&] { platform.name_allocation(platform.allocations() + 1, "first"); });
-  platform.at("xlate_localcp_to_utf8", 2,
-              [&] { platform.name_allocation(platform.allocations() + 1, "second"); });
+  platform.name_allocation_in("replace_DN", 1, "first");
+  platform.name_allocation_in("xlate_localcp_to_utf8", 2, "second");
   platform.fail("replace_DN", 2, 34);
   EXPECT_EQ(verify(), 1);
   EXPECT_THAT(platform.calls({"free"}), ElementsAre("free(first)", "free(second)", "free(array)"));
@@ -567,8 +565,7 @@ TEST_F(PassThrough, DnThatCannotBeConvertedIsReleasedAfterTheResult) {
   EXPECT_THAT(platform.calls({"free", "cfg_memfree", "cfg_msgfree"}),
               ElementsAre("cfg_msgfree(chain)", dn_released));
   platform.forget();
-  platform.at("xlate_localcp_to_utf8", 2,
-              [&] { platform.name_allocation(platform.allocations() + 1, "converted DN"); });
+  platform.name_allocation_in("xlate_localcp_to_utf8", 2, "converted DN");
   platform.fail("replace_DN", 2, 34);
   EXPECT_EQ(verify(), 1);
   EXPECT_THAT(platform.calls({"free", "cfg_memfree", "cfg_msgfree"}),
@@ -783,6 +780,25 @@ class Review : public PassThrough {
     file({{"cn=one," + std::string(kContainer), {{"orv-slapdPtaURL", {"ldap://a"}}}},
           {"cn=two," + std::string(kContainer), {{"orv-slapdPtaURL", {"nonsense"}}}}});
   }
+
+  // What a review of both releases in the end when `failing` fails for the second of them: the
+  // first one's DN, the result, and `last`. The second one's DN is what `maker` allocated.
+  void expect_released(const std::string& failing, const std::string& maker,
+                       const std::vector<std::string>& last) {
+    in_a_fresh_process([&] {
+      g_safe_mode = 1;
+      two_entries();
+      make(kEntry, {});
+      platform.name_allocation_in("replace_DN", 1, "first DN");
+      platform.name_allocation_in(maker, 2, "second DN");
+      platform.fail(failing, 2, 90);
+      EXPECT_EQ(verify(), 0);
+      std::vector<std::string> expected = {"free(first DN)", kFirstDnReleased,
+                                           "cfg_msgfree(chain)"};
+      expected.insert(expected.end(), last.begin(), last.end());
+      EXPECT_EQ(platform.calls({"free", "cfg_memfree", "cfg_msgfree"}), expected) << failing;
+    });
+  }
 };
 
 TEST_F(Review, HappensInSafeModeOnceAndChangesNoResult) {
@@ -957,8 +973,7 @@ TEST_F(Review, LastDnIsReleasedAfterTheResult) {
     g_safe_mode = 1;
     two_entries();
     make(kEntry, {});
-    platform.at("replace_DN", 0,
-                [&] { platform.name_allocation(platform.allocations() + 1, "DN"); });
+    platform.name_allocation_in("replace_DN", 0, "DN");
     EXPECT_EQ(verify(), 0);
     EXPECT_THAT(platform.calls({"cfg_get_dn", "cfg_memfree", "cfg_msgfree", "free"}),
                 ElementsAre("cfg_get_dn(session, record 1)", "free(DN)", kFirstDnReleased,
@@ -968,43 +983,12 @@ TEST_F(Review, LastDnIsReleasedAfterTheResult) {
 }
 
 TEST_F(Review, DnThatEndsTheWalkIsReleasedAfterTheResult) {
-  const auto expect_released = [&](const std::string& failing,
-                                   const std::vector<std::string>& last) {
-    in_a_fresh_process([&] {
-      g_safe_mode = 1;
-      two_entries();
-      make(kEntry, {});
-      platform.at("replace_DN", 1,
-                  [&] { platform.name_allocation(platform.allocations() + 1, "first DN"); });
-      platform.at("xlate_localcp_to_utf8", 2,
-                  [&] { platform.name_allocation(platform.allocations() + 1, "second DN"); });
-      platform.fail(failing, 2, 21);
-      EXPECT_EQ(verify(), 0);
-      std::vector<std::string> expected = {"free(first DN)", kFirstDnReleased,
-                                           "cfg_msgfree(chain)"};
-      expected.insert(expected.end(), last.begin(), last.end());
-      EXPECT_EQ(platform.calls({"free", "cfg_memfree", "cfg_msgfree"}), expected) << failing;
-    });
-  };
-  expect_released("xlate_localcp_to_utf8", {kSecondDnReleased});
-  expect_released("replace_DN", {"free(second DN)", kSecondDnReleased});
+  expect_released("xlate_localcp_to_utf8", "xlate_localcp_to_utf8", {kSecondDnReleased});
+  expect_released("replace_DN", "xlate_localcp_to_utf8", {"free(second DN)", kSecondDnReleased});
 }
 
 TEST_F(Review, DnOfAnEntryThatCannotBeBuiltIsReleasedAfterTheResult) {
-  in_a_fresh_process([&] {
-    g_safe_mode = 1;
-    two_entries();
-    make(kEntry, {});
-    platform.at("replace_DN", 1,
-                [&] { platform.name_allocation(platform.allocations() + 1, "first DN"); });
-    platform.at("replace_DN", 2,
-                [&] { platform.name_allocation(platform.allocations() + 1, "second DN"); });
-    platform.fail("CFGMessage2Entry", 2, 90);
-    EXPECT_EQ(verify(), 0);
-    EXPECT_THAT(platform.calls({"free", "cfg_memfree", "cfg_msgfree"}),
-                ElementsAre("free(first DN)", kFirstDnReleased, "cfg_msgfree(chain)",
-                            "free(second DN)", kSecondDnReleased));
-  });
+  expect_released("CFGMessage2Entry", "replace_DN", {"free(second DN)", kSecondDnReleased});
 }
 
 TEST_F(Review, RecordsAreWalkedUnderTheirNormalisedDns) {

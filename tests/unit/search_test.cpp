@@ -165,9 +165,8 @@ TEST_F(Sending, ReleasesEachEntryBeforeTheNextIsTaken) {
 TEST_F(Sending, ReleasesWhatItComparedWhenTheEntryIsSentAndBeforeTheEntry) {
   found({{"cn=a,cn=admingroup,cn=configuration",
           {{"orv-slapdAdminDN", {"cn=me"}}, {"orv-slapdAdminPW", {"p"}}}}});
-  platform.at("replace_DN", 1, [&] { platform.name_allocation(platform.allocations() + 1, "dn"); });
-  platform.at("replace_DN", 2,
-              [&] { platform.name_allocation(platform.allocations() + 1, "member"); });
+  platform.name_allocation_in("replace_DN", 1, "dn");
+  platform.name_allocation_in("replace_DN", 2, "member");
   EXPECT_EQ(send(), 0);
   const auto calls = platform.calls({"send_search_entry", "free", "entry_free", "cfg_next_entry"});
   ASSERT_EQ(calls.size(), 5U);
@@ -716,10 +715,8 @@ TEST_F(Search, RunsTheSameSearchOnTheFileInItsCodePage) {
 }
 
 TEST_F(Search, ReleasesTheConvertedTextsAfterTheLock) {
-  platform.at("xlate_utf8_to_localcp", 1,
-              [&] { platform.name_allocation(platform.allocations() + 1, "base"); });
-  platform.at("xlate_utf8_to_localcp", 2,
-              [&] { platform.name_allocation(platform.allocations() + 1, "filter"); });
+  platform.name_allocation_in("xlate_utf8_to_localcp", 1, "base");
+  platform.name_allocation_in("xlate_utf8_to_localcp", 2, "filter");
   EXPECT_EQ(search(), 0);
   const auto calls = platform.calls({"cfg_unbind", "pthread_mutex_unlock", "free"});
   ASSERT_GE(calls.size(), 4U);

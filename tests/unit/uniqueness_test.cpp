@@ -263,8 +263,7 @@ TEST_F(Uniqueness, AdministratorsNamesAreReleasedAfterTheMembersOfTheGroup) {
   EXPECT_THAT(releases(doesKerberosIDExist),
               ElementsAre("cfg_msgfree(chain)", "cfg_msgfree(chain)", "free(administrator's)"));
   platform.forget();
-  platform.at("xlate_localcp_to_utf8", 1,
-              [&] { platform.name_allocation(platform.allocations() + 1, "administrator's"); });
+  platform.name_allocation_in("xlate_localcp_to_utf8", 1, "administrator's");
   EXPECT_THAT(releases(doesDigestUserNameExist),
               ElementsAre("cfg_msgfree(chain)", "cfg_msgfree(chain)", "free(administrator's)"));
 }
@@ -272,8 +271,7 @@ TEST_F(Uniqueness, AdministratorsNamesAreReleasedAfterTheMembersOfTheGroup) {
 TEST_F(Uniqueness, CopyOfASuppliersDnIsReleasedAfterBothSearches) {
   found(kReplicationSearch, {{}});
   found(kSupplierSearch, {{}});
-  platform.at("replace_DN", 1,
-              [&] { platform.name_allocation(platform.allocations() + 1, "copy"); });
+  platform.name_allocation_in("replace_DN", 1, "copy");
   EXPECT_EQ(supplier_dn("cn=one"), 0);
   EXPECT_THAT(platform.calls({"cfg_msgfree", "free"}),
               ElementsAre("cfg_msgfree(chain)", "cfg_msgfree(chain)", "free(copy)"));

@@ -125,6 +125,10 @@ void Platform::at(const std::string& function, int nth, std::function<void()> ac
   actions_.push_back({function, nth, std::move(action)});
 }
 
+void Platform::name_allocation_in(const std::string& function, int nth, const std::string& name) {
+  at(function, nth, [this, name] { name_allocation(allocations_ + 1, name); });
+}
+
 void Platform::forget() {
   events_.clear();
   counts_.clear();

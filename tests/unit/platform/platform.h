@@ -179,6 +179,8 @@ class Platform {
   // What the n-th allocation gives is known by that name; its release with free is then a call. Of
   // an array of values each value is known as "one of" it.
   void name_allocation(int nth, const std::string& name) { allocation_names_[nth] = name; }
+  // The same for the first allocation of the n-th call of a function (from 1; 0 for each).
+  void name_allocation_in(const std::string& function, int nth, const std::string& name);
   // Forgets calls and script of failures, and starts counting again. What is owned and locked
   // stays.
   void forget();
