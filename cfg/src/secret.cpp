@@ -17,6 +17,7 @@
 #include <new>
 #include <utility>
 
+#include "cfg/openssl_owners.h"
 #include "cfg/result_codes.h"
 #include "cfg/text.h"
 #include "characters.h"
@@ -74,10 +75,7 @@ constexpr std::string_view kSealedScheme = "AES256";
 
 // ---- Digests ----
 
-struct DigestDeleter {
-  void operator()(EVP_MD_CTX* context) const noexcept { EVP_MD_CTX_free(context); }
-};
-using DigestContext = std::unique_ptr<EVP_MD_CTX, DigestDeleter>;
+using DigestContext = std::unique_ptr<EVP_MD_CTX, Releaser<EVP_MD_CTX_free>>;
 
 struct Digest {
   std::array<unsigned char, EVP_MAX_MD_SIZE> bytes{};
@@ -120,10 +118,7 @@ constexpr std::size_t kNonceLength = 12;
 constexpr std::size_t kTagLength = 16;
 constexpr std::size_t kMinSealedLength = kHeaderLength + kNonceLength + kTagLength;
 
-struct CipherDeleter {
-  void operator()(EVP_CIPHER_CTX* context) const noexcept { EVP_CIPHER_CTX_free(context); }
-};
-using CipherContext = std::unique_ptr<EVP_CIPHER_CTX, CipherDeleter>;
+using CipherContext = std::unique_ptr<EVP_CIPHER_CTX, Releaser<EVP_CIPHER_CTX_free>>;
 
 // The header of a value sealed for `place`.
 bool make_header(SecretPlace place, std::array<unsigned char, kHeaderLength>& header) {

@@ -11,6 +11,7 @@
 #include <algorithm>
 #include <memory>
 
+#include "cfg/openssl_owners.h"
 #include "cfg/secret.h"
 
 namespace orv::orvcfg {
@@ -21,18 +22,8 @@ constexpr long kSecondsOfADay = 86400;
 constexpr long kDays = 3650;
 constexpr int kSerialBytes = 16;
 
-template <auto Release>
-struct Releaser {
-  template <typename T>
-  void operator()(T* object) const noexcept {
-    Release(object);
-  }
-};
-using Key = std::unique_ptr<EVP_PKEY, Releaser<EVP_PKEY_free>>;
-using Certificate = std::unique_ptr<X509, Releaser<X509_free>>;
 using Extension = std::unique_ptr<X509_EXTENSION, Releaser<X509_EXTENSION_free>>;
 using Number = std::unique_ptr<BIGNUM, Releaser<BN_free>>;
-using Memory = std::unique_ptr<BIO, Releaser<BIO_free_all>>;
 
 // "localhost" when the host has no name that may stand in a certificate.
 std::string host_name() {
@@ -96,10 +87,10 @@ std::string take_text(BIO* memory) {
 }  // namespace
 
 bool make_self_signed(SelfSigned& made, std::string& why) {
-  const Key key(EVP_EC_gen("P-256"));
+  const PrivateKey key(EVP_EC_gen("P-256"));
   const Certificate certificate(X509_new());
-  const Memory key_text(BIO_new(BIO_s_secmem()));
-  const Memory certificate_text(BIO_new(BIO_s_mem()));
+  const Bio key_text(BIO_new(BIO_s_secmem()));
+  const Bio certificate_text(BIO_new(BIO_s_mem()));
   if (key && certificate && key_text && certificate_text && fill(certificate.get(), key.get()) &&
       PEM_write_bio_PKCS8PrivateKey(key_text.get(), key.get(), nullptr, nullptr, 0, nullptr,
                                     nullptr) == 1 &&

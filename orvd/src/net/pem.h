@@ -1,29 +1,18 @@
-// Files in PEM, and owners of what OpenSSL makes of them.
+// Files in PEM.
 //
 // Threads: functions are thread-safe; the queue of errors is each thread's own.
 #pragma once
 
+#include <openssl/asn1.h>
 #include <openssl/bio.h>
-#include <openssl/evp.h>
-#include <openssl/x509.h>
 #include <sys/stat.h>
 
 #include <ctime>
-#include <memory>
 #include <string>
 
-namespace orv::server {
+#include "cfg/openssl_owners.h"
 
-template <auto Release>
-struct Releaser {
-  template <typename T>
-  void operator()(T* object) const noexcept {
-    Release(object);
-  }
-};
-using Bio = std::unique_ptr<BIO, Releaser<BIO_free>>;
-using Certificate = std::unique_ptr<X509, Releaser<X509_free>>;
-using PrivateKey = std::unique_ptr<EVP_PKEY, Releaser<EVP_PKEY_free>>;
+namespace orv::server {
 
 // The first of the queued errors of this thread in words, "" when there is none; empties the queue.
 std::string queued_error();

@@ -12,6 +12,7 @@
 #include <utility>
 
 #include "cfg/dn.h"
+#include "cfg/openssl_owners.h"
 #include "net/pem.h"
 
 namespace orv::server {

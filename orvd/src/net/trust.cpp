@@ -13,6 +13,7 @@
 #include <new>
 #include <string_view>
 
+#include "cfg/openssl_owners.h"
 #include "net/pem.h"
 
 namespace orv::server {
