@@ -13,6 +13,7 @@
 #include <utility>
 #include <vector>
 
+#include "../temporary_directory.h"
 #include "cfg/attribute_table.h"
 #include "cfg/owners.h"
 #include "cfg/result_codes.h"
@@ -20,25 +21,7 @@
 
 namespace orv::cfg_test {
 
-// A directory that goes with the object.
-class TemporaryDirectory {
- public:
-  explicit TemporaryDirectory(const std::string& parent = "/tmp")
-      : path_(parent + "/orv-cfg-XXXXXX") {
-    if (::mkdtemp(path_.data()) == nullptr) std::abort();
-  }
-  ~TemporaryDirectory() { static_cast<void>(std::system(("rm -rf " + path_).c_str())); }
-  TemporaryDirectory(const TemporaryDirectory&) = delete;
-  TemporaryDirectory& operator=(const TemporaryDirectory&) = delete;
-
-  // Lets other users reach files whose names they know.
-  void let_everyone_pass() const { ASSERT_EQ(::chmod(path_.c_str(), 0711), 0); }
-
-  [[nodiscard]] std::string file(const std::string& name) const { return path_ + "/" + name; }
-
- private:
-  std::string path_;
-};
+using test::TemporaryDirectory;
 
 inline void write_file(const std::string& path, std::string_view content) {
   std::ofstream(path, std::ios::binary | std::ios::trunc)

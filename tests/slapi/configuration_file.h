@@ -5,8 +5,8 @@
 
 #include <string>
 
+#include "../temporary_directory.h"
 #include "cfg/owners.h"
-#include "temporary_directory.h"
 
 namespace orv::test {
 

@@ -8,6 +8,7 @@
 #include <string>
 #include <thread>
 
+#include "../temporary_directory.h"
 #include "cfg/secret.h"
 #include "configuration_file.h"
 #include "entries.h"
@@ -26,7 +27,6 @@
 #include "slapi/strings.h"
 #include "slapi/trace.h"
 #include "slapi/value_syntax.h"
-#include "temporary_directory.h"
 #include "values.h"
 
 namespace orv {

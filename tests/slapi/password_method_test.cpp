@@ -1,6 +1,7 @@
 // How passwords are stored: names, what the configuration forbids, staging, and opening.
 
 #include "slapi/password_method.h"
+#include "../temporary_directory.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -13,7 +14,6 @@
 #include "messages.h"
 #include "slapi/owners.h"
 #include "slapi/services.h"
-#include "temporary_directory.h"
 
 namespace orv {
 namespace {

@@ -1,4 +1,5 @@
 #include "slapi/trace.h"
+#include "../temporary_directory.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -13,7 +14,6 @@
 
 #include "cfg/attribute_table.h"
 #include "slapi/schema.h"
-#include "temporary_directory.h"
 
 namespace orv {
 namespace {

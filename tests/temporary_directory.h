@@ -1,6 +1,7 @@
 // A directory that goes away with the object, and files in it.
 #pragma once
 
+#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <sstream>
@@ -9,12 +10,18 @@
 
 namespace orv::test {
 
+// All that a file holds, "" where there is none.
+inline std::string content_of(const std::string& path) {
+  std::ostringstream text;
+  text << std::ifstream(path, std::ios::binary).rdbuf();
+  return text.str();
+}
+
 class TemporaryDirectory {
  public:
-  TemporaryDirectory() {
-    std::string pattern = (std::filesystem::temp_directory_path() / "orv-slapi-XXXXXX").string();
-    if (mkdtemp(pattern.data()) == nullptr) throw std::runtime_error("mkdtemp");
-    path_ = pattern;
+  explicit TemporaryDirectory(const std::string& parent = std::filesystem::temp_directory_path())
+      : path_(parent + "/orv-test-XXXXXX") {
+    if (mkdtemp(path_.data()) == nullptr) throw std::runtime_error("mkdtemp");
   }
   ~TemporaryDirectory() {
     std::error_code ignored;
@@ -23,18 +30,16 @@ class TemporaryDirectory {
   TemporaryDirectory(const TemporaryDirectory&) = delete;
   TemporaryDirectory& operator=(const TemporaryDirectory&) = delete;
 
+  [[nodiscard]] const std::string& path() const noexcept { return path_; }
   [[nodiscard]] std::string file(const std::string& name) const { return path_ + "/" + name; }
 
+  // The path of the file, with this text in place of any other.
   [[nodiscard]] std::string write(const std::string& name, const std::string& text) const {
     std::ofstream(file(name), std::ios::binary) << text;
     return file(name);
   }
 
-  [[nodiscard]] std::string read(const std::string& name) const {
-    std::ostringstream text;
-    text << std::ifstream(file(name), std::ios::binary).rdbuf();
-    return text.str();
-  }
+  [[nodiscard]] std::string read(const std::string& name) const { return content_of(file(name)); }
 
  private:
   std::string path_;
