@@ -3,13 +3,13 @@
 
 #include <gtest/gtest.h>
 
-#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <memory>
 #include <string>
 #include <vector>
 
+#include "../temporary_directory.h"
 #include "auth/identities.h"
 #include "cfg/secret.h"
 
@@ -44,15 +44,8 @@ inline std::string member(const std::string& name, const std::string& dn,
 
 class IdentitiesOfAFile : public ::testing::Test {
  protected:
-  void SetUp() override {
-    std::string pattern = ::testing::TempDir() + "/orv-auth-XXXXXX";
-    ASSERT_NE(mkdtemp(pattern.data()), nullptr);
-    folder_ = pattern;
-  }
-  void TearDown() override { std::filesystem::remove_all(folder_); }
-
-  std::string config() const { return folder_ + "/config.ldif"; }
-  std::string stash() const { return folder_ + "/key.stash"; }
+  std::string config() const { return folder_.file("config.ldif"); }
+  std::string stash() const { return folder_.file("key.stash"); }
 
   void write(const std::string& text) { std::ofstream(config(), std::ios::trunc) << text; }
 
@@ -86,7 +79,7 @@ class IdentitiesOfAFile : public ::testing::Test {
     return stored;
   }
 
-  std::string folder_;
+  const orv::test::TemporaryDirectory folder_;
   std::string error_;
   std::vector<std::string> warnings_;
   bool use_stash_ = false;

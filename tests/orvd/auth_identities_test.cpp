@@ -420,7 +420,7 @@ TEST_F(IdentitiesOfAFile, FileInAnotherCodePageIsUnderstood) {
 
 TEST_F(IdentitiesOfAFile, MissingOrDamagedFileIsAFailureWithItsCause) {
   std::string error;
-  EXPECT_FALSE(Identities::read((folder_ + "/none").c_str(), nullptr, error, warnings_));
+  EXPECT_FALSE(Identities::read(folder_.file("none").c_str(), nullptr, error, warnings_));
   EXPECT_THAT(error, HasSubstr("none"));
   EXPECT_FALSE(read("this is no LDIF\n"));
   EXPECT_FALSE(error_.empty());

@@ -41,7 +41,6 @@ class NamesOfAFile : public IdentitiesOfAFile {
   void TearDown() override {
     set_local_code_page("UTF-8");
     initIconvHandle();
-    IdentitiesOfAFile::TearDown();
   }
 
   std::shared_ptr<const Identities> read(const std::string& text) {

@@ -4,14 +4,12 @@
 
 #include <atomic>
 #include <cstdlib>
-#include <filesystem>
-#include <fstream>
 #include <memory>
 #include <optional>
-#include <sstream>
 #include <string>
 #include <thread>
 
+#include "../temporary_directory.h"
 #include "audit/log.h"
 #include "core_bare_session.h"
 #include "core_fake_backend.h"
@@ -28,25 +26,19 @@ using test::WireClient;
 class AuditedServer : public test::LoopbackServer {
  protected:
   AuditedServer() {
-    char name[] = "/tmp/orv-audited-XXXXXX";
-    folder = mkdtemp(name);
-    EXPECT_EQ(log.open(folder + "/audit.log", {}), "");
+    EXPECT_EQ(log.open(folder.file("audit.log"), {}), "");
     audit = &log;
   }
   ~AuditedServer() override {
     stop();
     server.reset();  // before the log that it writes to
-    std::filesystem::remove_all(folder);
   }
 
   // Everything that was recorded, once the server has stopped.
   std::string records() {
     stop();
     EXPECT_TRUE(log.finish());
-    std::ifstream in(folder + "/audit.log");
-    std::ostringstream text;
-    text << in.rdbuf();
-    return text.str();
+    return folder.read("audit.log");
   }
 
   // Each change waits inside the backend until `let_go` happens.
@@ -60,7 +52,7 @@ class AuditedServer : public test::LoopbackServer {
 
   Event entered;
   Event let_go;
-  std::string folder;
+  const orv::test::TemporaryDirectory folder;
   AuditLog log{[](std::string_view) {}};
 };
 
@@ -145,14 +137,11 @@ TEST_F(AuditedServer, RecordsAnAttemptToRename) {
 class AuditedSession : public test::BareSessionTest {
  protected:
   AuditedSession() {
-    char name[] = "/tmp/orv-audited-XXXXXX";
-    folder = mkdtemp(name);
-    EXPECT_EQ(log.open(folder + "/audit.log", {}), "");
+    EXPECT_EQ(log.open(folder.file("audit.log"), {}), "");
     services.audit = &log;
   }
-  ~AuditedSession() override { std::filesystem::remove_all(folder); }
 
-  std::string folder;
+  const orv::test::TemporaryDirectory folder;
   AuditLog log{[](std::string_view) {}};
 };
 
@@ -169,13 +158,12 @@ TEST_F(AuditedSession, RecordsAChangeOnAConnectionWhoseIdentityWasRevokedMeanwhi
     authenticator.change(true);
   }
   ASSERT_TRUE(log.finish());
-  std::ostringstream text;
-  text << std::ifstream(folder + "/audit.log").rdbuf();
+  const std::string text = folder.read("audit.log");
   for (const char* operation : {"add", "delete", "modify", "rename"})
-    EXPECT_NE(text.str().find(std::string("# message-id: 2\n# operation: ") + operation +
-                              "\n# result: 8\ndn: cn=x,cn=configuration\n"),
+    EXPECT_NE(text.find(std::string("# message-id: 2\n# operation: ") + operation +
+                        "\n# result: 8\ndn: cn=x,cn=configuration\n"),
               std::string::npos)
-        << text.str();
+        << text;
 }
 
 TEST_F(AuditedServer, RecordsAChangeWithAMessageIdThatIsInUse) {
@@ -213,7 +201,7 @@ TEST_F(AuditedServer, RecordThatADiskHoldsUpHoldsUpItsOwnClientOnly) {
   bind_as_root(first);
   WireClient second(port());
   bind_as_root(second);
-  test::HungDisk hung(folder + "/audit.log");
+  test::HungDisk hung(folder.file("audit.log"));
   first.send(delete_and_add(2));
   ASSERT_TRUE(first_entered.wait());
   second.send(delete_and_add(2));
@@ -224,7 +212,7 @@ TEST_F(AuditedServer, RecordThatADiskHoldsUpHoldsUpItsOwnClientOnly) {
   EXPECT_EQ(second.receive_result().back().code, 0);
   hung.release();
   records();
-  const std::string text = test::HungDisk::written(folder + "/audit.log");
+  const std::string text = test::HungDisk::written(folder.file("audit.log"));
   EXPECT_NE(text.find("# connection: 2\n# message-id: 2\n# operation: modify\n# result: 0\n"),
             std::string::npos);
 }
@@ -238,7 +226,7 @@ TEST_F(AuditedServer, StopDoesNotLoseTheAnswerThatWaitsForItsRecord) {
   start();
   WireClient client(port());
   bind_as_root(client);
-  test::HungDisk hung(folder + "/audit.log");
+  test::HungDisk hung(folder.file("audit.log"));
   client.send(delete_and_add(2));
   ASSERT_TRUE(entered.wait());
   stop();

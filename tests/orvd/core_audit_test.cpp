@@ -11,16 +11,15 @@
 #include <chrono>
 #include <csignal>
 #include <cstdlib>
-#include <filesystem>
 #include <fstream>
 #include <memory>
 #include <mutex>
 #include <optional>
-#include <sstream>
 #include <string>
 #include <thread>
 #include <vector>
 
+#include "../temporary_directory.h"
 #include "audit/log.h"
 #include "audit/record.h"
 #include "audit/record_file.h"
@@ -32,6 +31,8 @@
 
 namespace orv::server {
 namespace {
+
+using orv::test::content_of;
 
 constexpr const char* kSecret = "open-sesame";
 
@@ -228,12 +229,6 @@ TEST_F(AuditRecord, TellsWhoWhenFromWhereAndWithWhatResult) {
 
 // ---- the file
 
-std::string content(const std::string& file) {
-  std::ostringstream text;
-  text << std::ifstream(file, std::ios::binary).rdbuf();
-  return text.str();
-}
-
 // Files written by this process can be no longer than `bytes`, as on a full disk: a write is cut
 // short, then refused.
 class FullDisk {
@@ -252,13 +247,6 @@ class FullDisk {
 
 class AuditFile : public testing::Test {
  protected:
-  AuditFile() {
-    char name[] = "/tmp/orv-audit-XXXXXX";
-    folder = mkdtemp(name);
-    path = folder + "/audit.log";
-  }
-  ~AuditFile() override { std::filesystem::remove_all(folder); }
-
   std::vector<std::string> told() {
     const std::lock_guard lock(mutex);
     return complaints;
@@ -269,8 +257,8 @@ class AuditFile : public testing::Test {
     EXPECT_TRUE(written.wait());
   }
 
-  std::string folder;
-  std::string path;
+  const orv::test::TemporaryDirectory folder;
+  const std::string path = folder.file("audit.log");
   std::mutex mutex;
   std::vector<std::string> complaints;
   std::optional<AuditLog> log{std::in_place, [this](std::string_view line) {
@@ -291,21 +279,21 @@ TEST_F(AuditFile, IsMadeForItsOwnerOnly) {
 TEST_F(AuditFile, HoldsARecordWhenTheWaitForItIsOver) {
   ASSERT_EQ(log->open(path, {}), "");
   write_and_wait("dn: cn=a\nchangetype: delete\n\n");
-  EXPECT_EQ(content(path), "version: 1\n\ndn: cn=a\nchangetype: delete\n\n");
+  EXPECT_EQ(content_of(path), "version: 1\n\ndn: cn=a\nchangetype: delete\n\n");
 }
 
 TEST_F(AuditFile, KeepsWhatItHeld) {
   std::ofstream(path) << "dn: cn=old\nchangetype: delete\n";
   ASSERT_EQ(log->open(path, {}), "");
   write_and_wait("dn: cn=a\nchangetype: delete\n\n");
-  EXPECT_EQ(content(path), "dn: cn=old\nchangetype: delete\n\ndn: cn=a\nchangetype: delete\n\n");
+  EXPECT_EQ(content_of(path), "dn: cn=old\nchangetype: delete\n\ndn: cn=a\nchangetype: delete\n\n");
 }
 
 TEST_F(AuditFile, BeginsANewLineBehindWhatWasCutOff) {
   std::ofstream(path) << "dn: cn=old\nchangety";
   ASSERT_EQ(log->open(path, {}), "");
   write_and_wait("dn: cn=a\n\n");
-  EXPECT_EQ(content(path), "dn: cn=old\nchangety\n\ndn: cn=a\n\n");
+  EXPECT_EQ(content_of(path), "dn: cn=old\nchangety\n\ndn: cn=a\n\n");
 }
 
 TEST_F(AuditFile, IsMadeAnewWhenItWasMovedAway) {
@@ -314,27 +302,27 @@ TEST_F(AuditFile, IsMadeAnewWhenItWasMovedAway) {
   ASSERT_EQ(rename(path.c_str(), (path + ".1").c_str()), 0);
   ASSERT_EQ(log->open(path, {}), "");
   write_and_wait("dn: cn=b\n\n");
-  EXPECT_EQ(content(path + ".1"), "version: 1\n\ndn: cn=a\n\n");
-  EXPECT_EQ(content(path), "version: 1\n\ndn: cn=b\n\n");
+  EXPECT_EQ(content_of(path + ".1"), "version: 1\n\ndn: cn=a\n\n");
+  EXPECT_EQ(content_of(path), "version: 1\n\ndn: cn=b\n\n");
 }
 
 TEST_F(AuditFile, IsNotASymbolicLink) {
-  std::ofstream(folder + "/target") << "precious\n";
-  ASSERT_EQ(symlink((folder + "/target").c_str(), path.c_str()), 0);
+  std::ofstream(folder.file("target")) << "precious\n";
+  ASSERT_EQ(symlink(folder.file("target").c_str(), path.c_str()), 0);
   EXPECT_EQ(log->open(path, {}), "a symbolic link");
   write_and_wait("dn: cn=a\n\n");
-  EXPECT_EQ(content(folder + "/target"), "precious\n");
+  EXPECT_EQ(content_of(folder.file("target")), "precious\n");
 }
 
 TEST_F(AuditFile, IsARegularFile) {
   ASSERT_EQ(mkfifo(path.c_str(), 0600), 0);
   EXPECT_EQ(log->open(path, {}), "not a regular file");
-  EXPECT_NE(log->open(folder, {}), "");
+  EXPECT_NE(log->open(folder.path(), {}), "");
   EXPECT_EQ(log->open("audit.log", {}), "not an absolute path");
 }
 
 TEST_F(AuditFile, IsNoGuardedFileUnderAnotherName) {
-  const std::string guarded = folder + "/config.ldif";
+  const std::string guarded = folder.file("config.ldif");
   std::ofstream(guarded) << "dn: cn=configuration\n";
   ASSERT_EQ(link(guarded.c_str(), path.c_str()), 0);
   EXPECT_EQ(log->open(path, {{guarded}, {}}), "the same file as " + guarded);
@@ -342,13 +330,13 @@ TEST_F(AuditFile, IsNoGuardedFileUnderAnotherName) {
 
 TEST_F(AuditFile, StaysWhereItWasWhenTheNewPlaceIsRefused) {
   ASSERT_EQ(log->open(path, {}), "");
-  EXPECT_NE(log->open(folder + "/missing/audit.log", {}), "");
+  EXPECT_NE(log->open(folder.file("missing/audit.log"), {}), "");
   write_and_wait("dn: cn=a\n\n");
-  EXPECT_EQ(content(path), "version: 1\n\ndn: cn=a\n\n");
+  EXPECT_EQ(content_of(path), "version: 1\n\ndn: cn=a\n\n");
 }
 
 TEST_F(AuditFile, WithoutAFileRecordsAreMissedOutLoud) {
-  EXPECT_NE(log->open(folder + "/missing/audit.log", {}), "");
+  EXPECT_NE(log->open(folder.file("missing/audit.log"), {}), "");
   EXPECT_TRUE(log->enabled());
   write_and_wait("dn: cn=a\n\n");
   write_and_wait("dn: cn=b\n\n");
@@ -357,7 +345,7 @@ TEST_F(AuditFile, WithoutAFileRecordsAreMissedOutLoud) {
   write_and_wait("dn: cn=c\n\n");
   ASSERT_TRUE(log->finish());
   EXPECT_EQ(told().back(), "the audit log is written again; records lost: 2");
-  EXPECT_EQ(content(path), "version: 1\n\ndn: cn=c\n\n");
+  EXPECT_EQ(content_of(path), "version: 1\n\ndn: cn=c\n\n");
 }
 
 TEST_F(AuditFile, CanBeSwitchedOff) {
@@ -370,7 +358,7 @@ TEST_F(AuditFile, IsWrittenToTheEndBeforeTheProcessEnds) {
   ASSERT_EQ(log->open(path, {}), "");
   for (int i = 0; i < 100; ++i) log->write("dn: cn=" + std::to_string(i) + "\n\n");
   ASSERT_TRUE(log->finish());
-  const std::string text = content(path);
+  const std::string text = content_of(path);
   EXPECT_NE(text.find("dn: cn=0\n"), std::string::npos);
   EXPECT_NE(text.find("dn: cn=99\n"), std::string::npos);
 }
@@ -378,21 +366,21 @@ TEST_F(AuditFile, IsWrittenToTheEndBeforeTheProcessEnds) {
 TEST_F(AuditFile, KeepsNoPartOfARecordThatDoesNotFit) {
   ASSERT_EQ(log->open(path, {}), "");
   write_and_wait("dn: cn=a\n\n");
-  const std::string before = content(path);
+  const std::string before = content_of(path);
   {
     const FullDisk full(before.size() + 10);
     write_and_wait("dn: cn=" + std::string(100, 'b') + "\n\n");
   }
-  EXPECT_EQ(content(path), before);
+  EXPECT_EQ(content_of(path), before);
   EXPECT_EQ(told().size(), 1U);
   write_and_wait("dn: cn=c\n\n");
-  EXPECT_EQ(content(path), before + "dn: cn=c\n\n");
+  EXPECT_EQ(content_of(path), before + "dn: cn=c\n\n");
 }
 
 TEST_F(AuditFile, TellsWhichFileItHasOpen) {
   EXPECT_TRUE(log->files_in_use().empty());
   ASSERT_EQ(log->open(path, {}), "");
-  ASSERT_NE(log->open(folder, {}), "");
+  ASSERT_NE(log->open(folder.path(), {}), "");
   struct stat status {};
   ASSERT_EQ(stat(path.c_str(), &status), 0);
   ASSERT_EQ(log->files_in_use().size(), 1U);
@@ -425,7 +413,7 @@ TEST(RecordFile, BeginsBehindAnEmptyLineWhenAPartCouldNotBeTakenBack) {
   }
   ASSERT_EQ(file.append("dn: cn=c\n\n"), 0);
   ASSERT_EQ(file.append("dn: cn=d\n\n"), 0);
-  EXPECT_EQ(content("/proc/self/fd/" + std::to_string(number)),
+  EXPECT_EQ(content_of("/proc/self/fd/" + std::to_string(number)),
             first + "dn: cn=bbb\n\ndn: cn=c\n\ndn: cn=d\n\n");
 }
 
@@ -438,9 +426,9 @@ TEST(RecordFile, SaysItsVersionAgainWhenThatCouldNotBeWritten) {
     const FullDisk full(4);
     EXPECT_EQ(file.append("dn: cn=a\n\n"), EFBIG);
   }
-  EXPECT_EQ(content(name), "");
+  EXPECT_EQ(content_of(name), "");
   ASSERT_EQ(file.append("dn: cn=b\n\n"), 0);
-  EXPECT_EQ(content(name), "version: 1\n\ndn: cn=b\n\n");
+  EXPECT_EQ(content_of(name), "version: 1\n\ndn: cn=b\n\n");
   unlink(name);
 }
 

@@ -2,11 +2,11 @@
 // that shrank while an operation waited.
 #include <algorithm>
 #include <atomic>
-#include <fstream>
 #include <iterator>
 #include <mutex>
 #include <utility>
 
+#include "../temporary_directory.h"
 #include "core_server_fixture.h"
 #include "ops/canonical.h"
 #include "ops/consequences.h"
@@ -65,8 +65,7 @@ TEST(Guards, NoOtherEntryIsGuarded) {
 }
 
 TEST(Guards, EveryGuardIsInTheDocumentation) {
-  std::ifstream file(ORV_SOURCE_DIR "/docs/guards.md");
-  const std::string text{std::istreambuf_iterator<char>(file), {}};
+  const std::string text = orv::test::content_of(ORV_SOURCE_DIR "/docs/guards.md");
   for (const Guard& guard : entry_guards()) {
     const std::string row =
         std::string("| ") + (guard.change == GuardedChange::add ? "add" : "delete") + " | `" +

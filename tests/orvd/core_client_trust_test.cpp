@@ -6,8 +6,8 @@
 #include <ctime>
 #include <filesystem>
 #include <fstream>
-#include <sstream>
 
+#include "../temporary_directory.h"
 #include "auth/sasl_external.h"
 #include "cfg/result_codes.h"
 #include "core_server_fixture.h"
@@ -79,7 +79,7 @@ class ClientTrust : public test::BlockedServer, public ExternalIdentities {
   // Writes the authorities; in force after the next reload.
   void believe(const std::vector<std::string>& authorities) {
     std::ofstream file(certificates.path("ca"), std::ios::trunc);
-    for (const std::string& authority : authorities) file << std::ifstream(authority).rdbuf();
+    for (const std::string& authority : authorities) file << orv::test::content_of(authority);
   }
   // A client that shows a certificate; and one that is bound by that of alice.
   std::unique_ptr<TlsClient> connect(const Pair& shown) {
@@ -108,9 +108,7 @@ class ClientTrust : public test::BlockedServer, public ExternalIdentities {
   }
   std::string stop_and_read_log() {
     stop();
-    std::stringstream text;
-    text << std::ifstream(settings.error_log).rdbuf();
-    return text.str();
+    return orv::test::content_of(settings.error_log);
   }
   // The clock is moved on by so many seconds.
   void let_time_pass(std::time_t seconds) { later += seconds; }

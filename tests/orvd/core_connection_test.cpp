@@ -7,12 +7,11 @@
 
 #include <cstdlib>
 #include <deque>
-#include <fstream>
 #include <mutex>
 #include <new>
 #include <semaphore>
-#include <sstream>
 
+#include "../temporary_directory.h"
 #include "cfg/owners.h"
 #include "core_bare_session.h"
 #include "core_server_fixture.h"
@@ -150,23 +149,20 @@ TEST(ClientText, IsCutWithAMarkBetweenCharacters) {
 class AccessLogTest : public ConnectionTest {
  protected:
   AccessLogTest() {
-    char name[] = "/tmp/orv-core-XXXXXX";
-    ::close(mkstemp(name));
-    settings.access_log = name;
+    settings.access_log = folder.file("access.log");
     settings.access_log_level = "info";
   }
   ~AccessLogTest() override {
     go_on.happen();
     stop();
-    unlink(settings.access_log.c_str());
   }
   std::string written() {
     go_on.happen();
     stop();
-    std::ostringstream text;
-    text << std::ifstream(settings.access_log).rdbuf();
-    return text.str();
+    return folder.read("access.log");
   }
+
+  const orv::test::TemporaryDirectory folder;
 };
 
 TEST_F(AccessLogTest, LongTextsOfStrangersMakeShortLines) {

@@ -5,12 +5,12 @@
 #include <gtest/gtest.h>
 
 #include <cstdlib>
-#include <filesystem>
 #include <fstream>
 #include <optional>
 #include <stdexcept>
 #include <string>
 
+#include "../temporary_directory.h"
 #include "cfg/attribute_table.h"
 #include "cfg/secret.h"
 #include "settings.h"
@@ -28,23 +28,17 @@ class DirectoryBackendTest : public testing::Test {
  protected:
   void SetUp() override {
     ASSERT_EQ(cfg::register_attribute_types(builtin_schema().attribute_table()), 0);
-    std::string pattern = testing::TempDir() + "/orv-directory-XXXXXX";
-    ASSERT_NE(mkdtemp(pattern.data()), nullptr);
-    folder_ = pattern;
     std::string why;
     ASSERT_EQ(cfg::create_key_stash(stash().c_str(), why), 0) << why;
     ASSERT_EQ(read("AES256"), 0);
   }
-  void TearDown() override {
-    read("AES256");
-    std::filesystem::remove_all(folder_);
-  }
+  void TearDown() override { read("AES256"); }
 
-  std::string stash() const { return folder_ + "/key.stash"; }
+  std::string stash() const { return folder_.file("key.stash"); }
 
   // The server reads a file that says this.
   int read(const std::string& method, const std::string& group = "") {
-    const std::string file = folder_ + "/config.ldif";
+    const std::string file = folder_.file("config.ldif");
     std::ofstream(file, std::ios::trunc)
         << "dn: CN=CONFIGURATION\nobjectClass: orv-slapdTop\ncn: Configuration\n"
            "orv-slapdAdminDN: cn=root\norv-slapdPwEncryption: "
@@ -71,7 +65,7 @@ class DirectoryBackendTest : public testing::Test {
     return code;
   }
 
-  std::string folder_;
+  const orv::test::TemporaryDirectory folder_;
   std::string reason_;
 };
 

@@ -3,8 +3,8 @@
 
 #include <atomic>
 #include <fstream>
-#include <sstream>
 
+#include "../temporary_directory.h"
 #include "core_server_fixture.h"
 #include "core_tls_client.h"
 #include "net/expiry.h"
@@ -79,9 +79,7 @@ class ExpiringServer : public test::LoopbackServer {
     settings.tls.key_file = own.key;
   }
   int lines(const std::string& part) const {
-    std::stringstream all;
-    all << std::ifstream(settings.error_log).rdbuf();
-    const std::string text = all.str();
+    const std::string text = orv::test::content_of(settings.error_log);
     int found = 0;
     for (auto at = text.find(part); at != std::string::npos; at = text.find(part, at + 1)) ++found;
     return found;

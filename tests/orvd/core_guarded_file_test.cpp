@@ -9,39 +9,30 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
-#include <sstream>
 #include <string>
+
+#include "../temporary_directory.h"
 
 namespace orv::server {
 namespace {
 
+using orv::test::content_of;
+
 class GuardedFile : public testing::TestWithParam<int> {
  protected:
-  GuardedFile() {
-    char name[] = "/tmp/orv-guarded-XXXXXX";
-    folder = mkdtemp(name);
-    path = folder + "/log";
-  }
-  ~GuardedFile() override { std::filesystem::remove_all(folder); }
-
   std::string open(const GuardedFiles& guarded = {}) {
     return open_to_append(path, GetParam(), guarded, file);
   }
   bool follows_links() const { return (GetParam() & O_NOFOLLOW) == 0; }
   static void fill(const std::string& name, const char* text) { std::ofstream(name) << text; }
-  static std::string content(const std::string& name) {
-    std::ostringstream text;
-    text << std::ifstream(name).rdbuf();
-    return text.str();
-  }
   static FileIdentity identity(const std::string& name) {
     struct stat status {};
     EXPECT_EQ(stat(name.c_str(), &status), 0);
     return {status.st_dev, status.st_ino};
   }
 
-  std::string folder;
-  std::string path;
+  const orv::test::TemporaryDirectory folder;
+  std::string path = folder.file("log");
   AppendedFile file;
 };
 
@@ -62,7 +53,7 @@ TEST_P(GuardedFile, IsAppendedTo) {
   EXPECT_EQ(file.size, 7);
   ASSERT_EQ(lseek(file.descriptor.number(), 0, SEEK_SET), 0);
   ASSERT_EQ(write(file.descriptor.number(), "after", 5), 5);
-  EXPECT_EQ(content(path), "before after");
+  EXPECT_EQ(content_of(path), "before after");
 }
 
 TEST_P(GuardedFile, IsNotHandedOnToProgramsThatAreStarted) {
@@ -71,9 +62,9 @@ TEST_P(GuardedFile, IsNotHandedOnToProgramsThatAreStarted) {
 }
 
 TEST_P(GuardedFile, ThatCannotBeOpenedSaysWhy) {
-  path = folder + "/missing/log";
+  path = folder.file("missing/log");
   EXPECT_EQ(open(), "No such file or directory");
-  path = folder;
+  path = folder.path();
   EXPECT_EQ(open(), "Is a directory");
   EXPECT_EQ(file.descriptor.number(), -1);
 }
@@ -93,17 +84,17 @@ TEST_P(GuardedFile, DoesNotWaitForTheReaderOfAPipe) {
 }
 
 TEST_P(GuardedFile, IsNoGuardedFileUnderAnotherName) {
-  const std::string other = folder + "/config.ldif";
+  const std::string other = folder.file("config.ldif");
   fill(other, "precious");
   ASSERT_EQ(link(other.c_str(), path.c_str()), 0);
-  EXPECT_EQ(open({{"", folder + "/missing", other}, {}}), "the same file as " + other);
-  EXPECT_EQ(content(other), "precious");
+  EXPECT_EQ(open({{"", folder.file("missing"), other}, {}}), "the same file as " + other);
+  EXPECT_EQ(content_of(other), "precious");
 }
 
 TEST_P(GuardedFile, IsNoFileInUseEvenWithoutItsName) {
   fill(path, "");
   const FileIdentity used = identity(path);
-  const std::string moved = folder + "/moved";
+  const std::string moved = folder.file("moved");
   ASSERT_EQ(rename(path.c_str(), moved.c_str()), 0);
   path = moved;
   EXPECT_EQ(open({{}, {{used, "the audit log"}}}), "the same file as the audit log");
@@ -118,7 +109,7 @@ TEST_P(GuardedFile, IsGoneAgainWhenItWasMadeToBeRefused) {
 TEST_P(GuardedFile, StaysWhenItWasThereAndIsRefused) {
   fill(path, "precious");
   EXPECT_NE(open({{path}, {}}), "");
-  EXPECT_EQ(content(path), "precious");
+  EXPECT_EQ(content_of(path), "precious");
 }
 
 TEST_P(GuardedFile, LeavesWhatWasOpenWhenItIsRefused) {
@@ -131,7 +122,7 @@ TEST_P(GuardedFile, LeavesWhatWasOpenWhenItIsRefused) {
 }
 
 TEST_P(GuardedFile, FollowsASymbolicLinkOnlyWhereThatIsWanted) {
-  const std::string target = folder + "/target";
+  const std::string target = folder.file("target");
   fill(target, "x");
   ASSERT_EQ(symlink(target.c_str(), path.c_str()), 0);
   EXPECT_EQ(open(), follows_links() ? "" : "a symbolic link");
@@ -139,7 +130,7 @@ TEST_P(GuardedFile, FollowsASymbolicLinkOnlyWhereThatIsWanted) {
 }
 
 TEST_P(GuardedFile, FollowsALinkThatLeadsNowhereYet) {
-  const std::string target = folder + "/target";
+  const std::string target = folder.file("target");
   ASSERT_EQ(symlink(target.c_str(), path.c_str()), 0);
   EXPECT_EQ(open(), follows_links() ? "" : "a symbolic link");
   EXPECT_EQ(std::filesystem::exists(target), follows_links());
@@ -151,7 +142,7 @@ TEST_P(GuardedFile, OfALinkToItselfIsRefused) {
 }
 
 TEST_P(GuardedFile, IsNoGuardedFileThroughALink) {
-  const std::string other = folder + "/config.ldif";
+  const std::string other = folder.file("config.ldif");
   fill(other, "precious");
   ASSERT_EQ(symlink(other.c_str(), path.c_str()), 0);
   EXPECT_EQ(open({{other}, {}}), follows_links() ? "the same file as " + other : "a symbolic link");

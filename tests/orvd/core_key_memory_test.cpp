@@ -7,11 +7,11 @@
 
 #include <cstdint>
 #include <cstdlib>
-#include <filesystem>
 #include <functional>
 #include <limits>
 #include <string>
 
+#include "../temporary_directory.h"
 #include "cfg/secret.h"
 #include "net/limits.h"
 #include "process/key_memory.h"
@@ -76,9 +76,8 @@ TEST(KeyMemory, IsNotTheBoundWhereDescriptorsAre) {
 }
 
 TEST(KeyMemory, ThatIsFullLeavesTheKeyOfTheStashToOrdinaryMemory) {
-  char folder[] = "/tmp/orv-keys-XXXXXX";
-  ASSERT_TRUE(mkdtemp(folder));
-  const std::string path = std::string(folder) + "/key.stash";
+  const orv::test::TemporaryDirectory folder;
+  const std::string path = folder.file("key.stash");
   std::string why;
   ASSERT_EQ(cfg::create_key_stash(path.c_str(), why), 0) << why;
   EXPECT_TRUE(holds([&] {
@@ -87,7 +86,6 @@ TEST(KeyMemory, ThatIsFullLeavesTheKeyOfTheStashToOrdinaryMemory) {
     return cfg::load_key_stash(path.c_str(), key, why) == 0 && key &&
            !CRYPTO_secure_allocated(key.get());
   }));
-  std::filesystem::remove_all(folder);
 }
 
 }  // namespace

@@ -8,13 +8,11 @@
 #include <algorithm>
 #include <cstdlib>
 #include <cstring>
-#include <filesystem>
-#include <fstream>
 #include <limits>
 #include <memory>
-#include <sstream>
 #include <vector>
 
+#include "../temporary_directory.h"
 #include "core_server_fixture.h"
 #include "cut_off_log.h"
 #include "descriptor.h"
@@ -25,29 +23,11 @@ namespace orv::server {
 namespace {
 
 using namespace std::chrono_literals;
+using orv::test::TemporaryDirectory;
 using test::kNotice;
 using test::kTop;
 using test::Reply;
 using test::WireClient;
-
-// A folder for a log of errors.
-class LogFolder {
- public:
-  LogFolder() {
-    char name[] = "/tmp/orv-limits-XXXXXX";
-    path_ = mkdtemp(name);
-  }
-  ~LogFolder() { std::filesystem::remove_all(path_); }
-  std::string file() const { return path_ + "/error.log"; }
-  std::string text() const {
-    std::ostringstream all;
-    all << std::ifstream(file()).rdbuf();
-    return all.str();
-  }
-
- private:
-  std::string path_;
-};
 
 int count(const std::string& text, const std::string& part) {
   int found = 0;
@@ -58,7 +38,7 @@ int count(const std::string& text, const std::string& part) {
 class LimitedServer : public test::LoopbackServer {
  protected:
   LimitedServer() {
-    settings.error_log = folder.file();
+    settings.error_log = folder.file("error.log");
     settings.error_log_level = "info";
   }
   ~LimitedServer() override { stop(); }
@@ -66,10 +46,10 @@ class LimitedServer : public test::LoopbackServer {
   // What the error log holds once the server has stopped.
   std::string log() {
     stop();
-    return folder.text();
+    return folder.read("error.log");
   }
 
-  LogFolder folder;
+  const TemporaryDirectory folder{"/tmp"};  // the path of a socket is short
 };
 
 // ---- what is in force whoever the client is
@@ -512,7 +492,7 @@ class LocalLateClient final : public WireClient {
 };
 
 TEST_F(LimitedServer, ClientOfTheUnixSocketWaitsForADescriptor) {
-  more.local_socket = folder.file() + ".ldapi";
+  more.local_socket = folder.file("ldapi");
   start();
   WireClient first(port());
   ASSERT_EQ(code_of(first, test::search(1, "")), 0);  // it accepts
@@ -534,15 +514,15 @@ class CutOffLines : public testing::Test {
  protected:
   CutOffLines() {
     Settings settings;
-    settings.error_log = folder.file();
+    settings.error_log = folder.file("error.log");
     logs.open(settings);
   }
   std::string text() {
     logs.finish();
-    return folder.text();
+    return folder.read("error.log");
   }
 
-  LogFolder folder;
+  const TemporaryDirectory folder;
   Logs logs;
   CutOffLog lines{logs};
   const Clock::time_point start = Clock::time_point{} + 1h;

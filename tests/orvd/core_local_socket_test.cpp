@@ -11,6 +11,7 @@
 #include <filesystem>
 #include <fstream>
 
+#include "../temporary_directory.h"
 #include "auth/sasl_external.h"
 #include "core_server_fixture.h"
 #include "net/local_socket.h"
@@ -36,17 +37,9 @@ class LocalClient final : public WireClient {
   bool connected = false;
 };
 
-class Folder {
- public:
-  Folder() {
-    char name[] = "/tmp/orv-local-XXXXXX";
-    path_ = mkdtemp(name);
-  }
-  ~Folder() { std::filesystem::remove_all(path_); }
-  std::string socket() const { return path_ + "/ldapi"; }
-
- private:
-  std::string path_;
+struct Folder : orv::test::TemporaryDirectory {
+  Folder() : TemporaryDirectory("/tmp") {}  // the path of a socket is short
+  std::string socket() const { return file("ldapi"); }
 };
 
 class LocalSocketTest : public testing::Test {

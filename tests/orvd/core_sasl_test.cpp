@@ -4,9 +4,9 @@
 
 #include <sys/socket.h>
 
-#include <fstream>
 #include <sstream>
 
+#include "../temporary_directory.h"
 #include "core_bare_session.h"
 #include "core_server_fixture.h"
 
@@ -263,9 +263,8 @@ TEST_F(SaslTest, IdentityThatChangedDuringTheExchangeIsNotKept) {
 }
 
 TEST_F(SaslTest, AccessLogNamesMechanismClaimAndIdentityButNoCredentials) {
-  char name[] = "/tmp/orv-sasl-XXXXXX";
-  ::close(mkstemp(name));
-  settings.access_log = name;
+  const orv::test::TemporaryDirectory folder;
+  settings.access_log = folder.file("access.log");
   settings.access_log_level = "info";
   start();
   {
@@ -283,9 +282,7 @@ TEST_F(SaslTest, AccessLogNamesMechanismClaimAndIdentityButNoCredentials) {
     EXPECT_EQ(client.receive()->code, 2);
   }
   stop();
-  std::ifstream file(name);
-  const std::string text{std::istreambuf_iterator<char>(file), {}};
-  unlink(name);
+  const std::string text = folder.read("access.log");
   EXPECT_NE(text.find("sasl mechanism=\"QUESTION\" name=\"asker\" result=14"), std::string::npos)
       << text;
   EXPECT_NE(text.find("sasl mechanism=\"QUESTION\" name=\"asker\" as=\"CN=ROOT\" result=0"),

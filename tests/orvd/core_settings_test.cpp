@@ -6,40 +6,15 @@
 #include <unistd.h>
 
 #include <cstdlib>
-#include <fstream>
 #include <set>
-#include <sstream>
 
+#include "../temporary_directory.h"
 #include "cfg/attribute_table.h"
 #include "logs.h"
 #include "slapi/schema.h"
 
 namespace orv::server {
 namespace {
-
-class TemporaryDirectory {
- public:
-  TemporaryDirectory() {
-    char name[] = "/tmp/orv-core-XXXXXX";
-    path_ = mkdtemp(name);
-  }
-  ~TemporaryDirectory() {
-    [[maybe_unused]] const int rc = std::system(("rm -rf " + path_).c_str());
-  }
-  std::string file(const std::string& name) const { return path_ + "/" + name; }
-  std::string write(const std::string& name, const std::string& content) const {
-    std::ofstream(file(name), std::ios::binary) << content;
-    return file(name);
-  }
-  std::string read(const std::string& name) const {
-    std::ostringstream all;
-    all << std::ifstream(file(name), std::ios::binary).rdbuf();
-    return all.str();
-  }
-
- private:
-  std::string path_;
-};
 
 class SettingsTest : public testing::Test {
  protected:
@@ -52,7 +27,7 @@ class SettingsTest : public testing::Test {
                            "cn: configuration\norv-slapdAdminDN: cn=root\n" +
                                more + "\n" + entries);
   }
-  TemporaryDirectory directory;
+  const orv::test::TemporaryDirectory directory;
   Settings settings;
   std::string error;
 };

@@ -16,6 +16,7 @@
 #include <utility>
 #include <vector>
 
+#include "../temporary_directory.h"
 #include "cfg/text.h"
 #include "logs.h"
 #include "standard_error.h"
@@ -24,6 +25,7 @@
 namespace orv::server {
 namespace {
 
+using orv::test::content_of;
 using std::chrono::milliseconds;
 using std::chrono::steady_clock;
 
@@ -194,22 +196,13 @@ TEST(StopWatchdogTest, DoesNothingOnceTheStopIsDone) {
 class LogFiles : public testing::Test {
  protected:
   void SetUp() override {
-    char name[] = "/tmp/orv-logs-XXXXXX";
-    ASSERT_NE(mkdtemp(name), nullptr);
-    folder_ = name;
     settings_.error_log = file("error.log");
     settings_.access_log = file("access.log");
     settings_.access_log_level = "info";
   }
-  void TearDown() override { std::filesystem::remove_all(folder_); }
-  std::string file(const std::string& name) const { return folder_ + "/" + name; }
-  std::string content(const std::string& path) const {
-    std::ostringstream all;
-    all << std::ifstream(path).rdbuf();
-    return all.str();
-  }
+  std::string file(const std::string& name) const { return folder_.file(name); }
 
-  std::string folder_;
+  const orv::test::TemporaryDirectory folder_;
   Settings settings_;
 };
 
@@ -232,20 +225,20 @@ TEST_F(LogFiles, MayChangePlaces) {
   logs.error("an error");
   logs.write_access("an access\n");
   logs.finish();
-  EXPECT_NE(content(settings_.error_log).find("an error"), std::string::npos);
-  EXPECT_NE(content(settings_.access_log).find("an access"), std::string::npos);
+  EXPECT_NE(content_of(settings_.error_log).find("an error"), std::string::npos);
+  EXPECT_NE(content_of(settings_.access_log).find("an access"), std::string::npos);
 }
 
 TEST_F(LogFiles, DoNotTakeWhatTheOtherOneKeeps) {
   Logs logs;
   ASSERT_TRUE(logs.open(settings_).empty());
   settings_.error_log = settings_.access_log;
-  settings_.access_log = folder_;  // refused, so that the access log stays where it is
+  settings_.access_log = folder_.path();  // refused, so that the access log stays where it is
   EXPECT_EQ(logs.open(settings_).size(), 2U);
   logs.error("an error");
   logs.finish();
-  EXPECT_NE(content(file("error.log")).find("an error"), std::string::npos);
-  EXPECT_EQ(content(file("access.log")), "");
+  EXPECT_NE(content_of(file("error.log")).find("an error"), std::string::npos);
+  EXPECT_EQ(content_of(file("access.log")), "");
 }
 
 TEST_F(LogFiles, AreNoFileThatAnotherLogHasOpenUnderWhateverName) {
@@ -265,9 +258,9 @@ TEST_F(LogFiles, AreNoFileThatAnotherLogHasOpenUnderWhateverName) {
   logs.error("an error");
   logs.write_access("an access\n");
   logs.finish();
-  EXPECT_EQ(content(file("moved")), "dn: cn=a\n");
-  EXPECT_NE(content(before.error_log).find("an error"), std::string::npos);
-  EXPECT_NE(content(before.access_log).find("an access"), std::string::npos);
+  EXPECT_EQ(content_of(file("moved")), "dn: cn=a\n");
+  EXPECT_NE(content_of(before.error_log).find("an error"), std::string::npos);
+  EXPECT_NE(content_of(before.access_log).find("an access"), std::string::npos);
 }
 
 TEST_F(LogFiles, AreToldWithWhatTheyAreUsedFor) {

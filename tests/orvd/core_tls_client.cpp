@@ -12,9 +12,6 @@
 
 #include <algorithm>
 #include <cstdio>
-#include <filesystem>
-#include <fstream>
-#include <sstream>
 #include <stdexcept>
 
 namespace orv::server::test {
@@ -56,15 +53,6 @@ Wording named(const std::string& name, const char* constraint = "CA:FALSE") {
 }
 
 }  // namespace
-
-Certificates::Certificates() {
-  folder_ = std::filesystem::temp_directory_path() / "orv-tls-XXXXXX";
-  must(mkdtemp(folder_.data()) != nullptr);
-}
-
-Certificates::~Certificates() {
-  std::filesystem::remove_all(folder_);
-}
 
 Pair Certificates::make(const Wording& wording, const Pair* issuer) {
   EVP_PKEY* const key = EVP_EC_gen("P-256");
@@ -150,9 +138,7 @@ std::string Certificates::revoked_by(const Pair& issuer, const std::vector<Pair>
   X509_CRL_free(list);
   EVP_PKEY_free(key);
   X509_free(parent);
-  std::stringstream text;
-  text << std::ifstream(file).rdbuf();
-  return text.str();
+  return orv::test::content_of(file);
 }
 
 // ---- the client

@@ -8,6 +8,7 @@
 #include <string_view>
 #include <vector>
 
+#include "../temporary_directory.h"
 #include "core_wire.h"
 
 namespace orv::server::test {
@@ -38,9 +39,6 @@ struct Wording {
 // Makes pairs in a folder of its own, which goes with it.
 class Certificates {
  public:
-  Certificates();
-  ~Certificates();
-
   Pair self_signed(const std::string& name);
   Pair self_signed(const Wording& wording) { return make(wording, nullptr); }
   // By an authority that is made with the first of them.
@@ -50,11 +48,11 @@ class Certificates {
   // A list in PEM of what an authority has revoked, which a newer one follows in so many seconds.
   std::string revoked_by(const Pair& issuer, const std::vector<Pair>& revoked, long ends = 3600);
   const std::string& authority();
-  std::string path(const std::string& name) const { return folder_ + "/" + name; }
+  std::string path(const std::string& name) const { return folder_.file(name); }
 
  private:
   Pair make(const Wording& wording, const Pair* issuer);
-  std::string folder_;
+  const orv::test::TemporaryDirectory folder_;
   Pair authority_;
   int made_ = 0;
 };

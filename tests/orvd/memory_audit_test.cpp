@@ -3,15 +3,13 @@
 #include <gtest/gtest.h>
 
 #include <cstdlib>
-#include <filesystem>
-#include <fstream>
 #include <memory>
-#include <sstream>
 #include <string>
 #include <thread>
 #include <utility>
 
 #include "../slapi/failing_allocation.h"
+#include "../temporary_directory.h"
 #include "audit/log.h"
 #include "core_bare_session.h"
 
@@ -24,19 +22,10 @@ class MemoryOfAnAttempt : public test::BareSessionTest,
                           public testing::WithParamInterface<std::string> {
  protected:
   MemoryOfAnAttempt() {
-    char name[] = "/tmp/orv-attempt-XXXXXX";
-    folder = mkdtemp(name);
-    settings.error_log = folder + "/error.log";
+    settings.error_log = folder.file("error.log");
     settings.error_log_level = "error";
     EXPECT_TRUE(logs.open(settings).empty());
     backend.on_change = [](pblock*) { return 32; };
-  }
-  ~MemoryOfAnAttempt() override { std::filesystem::remove_all(folder); }
-
-  std::string content(const std::string& name) const {
-    std::ostringstream text;
-    text << std::ifstream(folder + "/" + name).rdbuf();
-    return text.str();
   }
   static bool fails_to_decode(long allocation) {
     Message message;
@@ -50,7 +39,7 @@ class MemoryOfAnAttempt : public test::BareSessionTest,
     while (logs.queued_bytes() > 0) std::this_thread::yield();
     logs.error("end of attempt");
     std::string text;
-    do text = content("error.log");
+    do text = folder.read("error.log");
     while (count(text, "end of attempt") == ends_);
     ++ends_;
     const int said = count(text, "no memory for a record of the audit log");
@@ -62,7 +51,7 @@ class MemoryOfAnAttempt : public test::BareSessionTest,
     return found;
   }
 
-  std::string folder;
+  const orv::test::TemporaryDirectory folder;
   int ends_ = 0;
   int said_ = 0;
 };
@@ -75,7 +64,7 @@ TEST_P(MemoryOfAnAttempt, IsRecordedOnceOrSaidToBeMissing) {
       int complaints = 0;
       AuditLog log([&complaints](std::string_view) { ++complaints; });
       const std::string file = "audit." + std::to_string(n) + (bound ? "b" : "a");
-      ASSERT_EQ(log.open(folder + "/" + file, {}), "");
+      ASSERT_EQ(log.open(folder.file(file), {}), "");
       services.audit = &log;
       session = std::make_shared<test::BareSession>(services, lane, settings);
       if (bound) bind_as_root();
@@ -94,9 +83,9 @@ TEST_P(MemoryOfAnAttempt, IsRecordedOnceOrSaidToBeMissing) {
       EXPECT_TRUE(session->run_until([this] { return session->idle(); }));
       ASSERT_TRUE(log.finish());
       services.audit = nullptr;
-      const int records = count(content(file), "# message-id: 2\n");
+      const int records = count(folder.read(file), "# message-id: 2\n");
       const bool said = complaints > 0 || a_record_is_said_to_be_missing();
-      EXPECT_LE(records + (said ? 1 : 0), 1) << content(file);
+      EXPECT_LE(records + (said ? 1 : 0), 1) << folder.read(file);
       EXPECT_TRUE(records == 1 || said || fails_to_decode(n));
       EXPECT_TRUE(hit || records == 1);
       if (!hit || HasFailure()) break;

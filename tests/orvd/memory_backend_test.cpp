@@ -11,6 +11,7 @@
 #include <string>
 
 #include "../slapi/failing_allocation.h"
+#include "../temporary_directory.h"
 #include "cfg/object_class_table.h"
 #include "cfg/session.h"
 #include "core_bare_session.h"
@@ -104,10 +105,7 @@ class MemoryOfTheBackend : public testing::Test {
     verifiers.join();
   }
 
-  static std::string content() {
-    std::ifstream file(StartedBackend::instance().config);
-    return {std::istreambuf_iterator<char>(file), {}};
-  }
+  static std::string content() { return orv::test::content_of(StartedBackend::instance().config); }
   static void put_back() {
     const std::string& config = StartedBackend::instance().config;
     std::ofstream(config + ".edit", std::ios::trunc) << kFile;

@@ -13,6 +13,7 @@
 #include <vector>
 
 #include "../slapi/failing_allocation.h"
+#include "../temporary_directory.h"
 #include "auth/identities.h"
 #include "auth/sasl_external.h"
 #include "core_bare_session.h"
@@ -204,17 +205,13 @@ TEST_F(MemoryOfARequest, FilterOnAnEntryOfTheServersOwnIsDecidedOrMemoryIsSaidTo
 class MemoryOfABind : public MemoryOfARequest {
  protected:
   void SetUp() override {
-    std::string pattern = testing::TempDir() + "/orv-memory-XXXXXX";
-    ASSERT_NE(mkdtemp(pattern.data()), nullptr);
-    folder_ = pattern;
     std::ofstream(config()) << "dn: cn=configuration\nobjectClass: orv-slapdTop\n"
                                "cn: configuration\norv-slapdAdminDN: cn=a name that is not short\n"
                                "orv-slapdAdminPW: a password that is not short\n";
   }
-  void TearDown() override { std::filesystem::remove_all(folder_); }
-  std::string config() const { return folder_ + "/config.ldif"; }
+  std::string config() const { return folder_.file("config.ldif"); }
 
-  std::string folder_;
+  const orv::test::TemporaryDirectory folder_;
   std::string error_;
   std::vector<std::string> warnings_;
 };
