@@ -192,9 +192,7 @@ TEST_F(AuditedServer, RecordThatADiskHoldsUpHoldsUpItsOwnClientOnly) {
   std::atomic<int> entered{0};
   backend.on_change = [&](pblock* parameters) {
     (++entered == 1 ? first_entered : second_entered).happen();
-    send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 0, nullptr,
-                     "");
-    return 0;
+    return test::finish_change(parameters, 0);
   };
   start();
   WireClient first(port());
@@ -249,11 +247,7 @@ TEST_F(AuditedServer, RecordsModificationsAsTheClientSentThem) {
 }
 
 TEST_F(AuditedServer, ChangeThatEndsTheLogIsStillRecordedInIt) {
-  backend.on_change = [](pblock* parameters) {
-    send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 0, nullptr,
-                     "");
-    return 0;
-  };
+  backend.on_change = [](pblock* parameters) { return test::finish_change(parameters, 0); };
   reload = [this](Settings&) {
     log.open("", {});
     return false;

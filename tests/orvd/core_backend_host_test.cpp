@@ -16,11 +16,6 @@ namespace {
 using namespace std::chrono_literals;
 using test::FakeBackend;
 
-class NoWaiter final : public GateWaiter {
- public:
-  void gate_decided(Verdict) noexcept override {}
-};
-
 struct Caller {
   explicit Caller(BackendHost& host)
       : host(host), parameters(make_parameters(host.backend(), connection, operation)) {
@@ -28,17 +23,10 @@ struct Caller {
     operation.server = &answer;
   }
   int call(int handler, bool leaves_slot) {
-    EXPECT_EQ(host.gate().enter(std::make_shared<NoWaiter>(), Clock::time_point::max()),
-              Gate::Entry::inside);
+    EXPECT_EQ(test::enter_at_once(host.gate()), Gate::Entry::inside);
     return host.call_inside_gate(handler, parameters.get(), connection, leaves_slot);
   }
-  bool gate_is_open() {
-    if (host.gate().enter(std::make_shared<NoWaiter>(), Clock::time_point::max()) !=
-        Gate::Entry::inside)
-      return false;
-    host.gate().leave();
-    return true;
-  }
+  bool gate_is_open() { return test::is_open(host.gate()); }
 
   BackendHost& host;
   Connection connection;
@@ -96,8 +84,7 @@ TEST(BackendHost, AfterAHandlerThatThrewNothingIsAdmitted) {
   EXPECT_EQ(caller.call(parameter::search_function, false), 52);
   EXPECT_EQ(why, "lost");
   EXPECT_TRUE(host.failed());
-  EXPECT_EQ(host.gate().enter(std::make_shared<NoWaiter>(), Clock::time_point::max()),
-            Gate::Entry::closed);
+  EXPECT_EQ(test::enter_at_once(host.gate()), Gate::Entry::closed);
   EXPECT_FALSE(host.close(1ms));
   EXPECT_EQ(backend.closed(), 0);
 }
@@ -115,7 +102,7 @@ TEST(BackendHost, TextThrownAsAPointerIsReported) {
 TEST(BackendHost, CloseRunsTheCloseHandlerOnceTheGateIsEmpty) {
   FakeBackend backend;
   BackendHost host(backend.record(), [](std::string_view) {});
-  host.gate().enter(std::make_shared<NoWaiter>(), Clock::time_point::max());
+  test::enter_at_once(host.gate());
   EXPECT_FALSE(host.close(1ms));
   EXPECT_EQ(backend.closed(), 0);
   host.gate().leave();

@@ -180,8 +180,7 @@ class ReportedChanges : public LoopbackServer {
     backend.on_change = [this](pblock* parameters) {
       if (writes) ++library_changes();
       const int rc = code;
-      send_ldap_result(connection_of(parameters), operation_of(parameters), rc, nullptr, "");
-      return rc;
+      return finish_change(parameters, rc);
     };
     take_over = [this](const Consequences& consequences, bool made) {
       const std::lock_guard lock(mutex);

@@ -47,11 +47,6 @@ class ClientTrust : public test::BlockedServer, public ExternalIdentities {
       return true;
     };
     wall_time = [this] { return std::time(nullptr) + later.load(); };
-    backend.on_change = [](pblock* parameters) {
-      send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 53, nullptr,
-                       "");
-      return 53;
-    };
   }
   ~ClientTrust() override {
     go_on.happen();

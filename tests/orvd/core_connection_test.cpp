@@ -324,11 +324,7 @@ TEST_F(BareSessionTest, OperationWhoseEndCannotBePostedIsPickedUpLater) {
 
 TEST_F(BareSessionTest, AdmissionThatCannotBePostedKeepsTheGateAndIsPickedUpLater) {
   bind_as_root();
-  class NoWaiter final : public GateWaiter {
-    void gate_decided(Verdict) noexcept override {}
-  };
-  ASSERT_EQ(host.gate().enter(std::make_shared<NoWaiter>(), Clock::time_point::max()),
-            Gate::Entry::inside);
+  ASSERT_EQ(test::enter_at_once(host.gate()), Gate::Entry::inside);
   session->handle(test::search(2, kTop));
   EXPECT_FALSE(session->idle());
   session->fail_to_post(1);
@@ -343,10 +339,9 @@ TEST_F(BareSessionTest, AdmissionThatCannotBePostedKeepsTheGateAndIsPickedUpLate
 TEST_F(BareSessionTest, WhoChangedTheirOwnRightsHaveTimeToReadTheAnswerAndNothingElse) {
   bind_as_root();
   backend.on_change = [this](pblock* parameters) {
-    send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 0, nullptr,
-                     "");
+    const int code = test::finish_change(parameters, 0);
     authenticator.change(false);
-    return 0;
+    return code;
   };
   session->handle(test::modify(2, kTop, "description", "x"));
   ASSERT_TRUE(session->run_until([this] { return session->idle(); }));
@@ -362,10 +357,9 @@ TEST_F(BareSessionTest, WhoChangedTheirOwnRightsHaveTimeToReadTheAnswerAndNothin
 TEST_F(BareSessionTest, WhoChangedTheirOwnRightsAreDisconnectedAMomentLater) {
   bind_as_root();
   backend.on_change = [this](pblock* parameters) {
-    send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 0, nullptr,
-                     "");
+    const int code = test::finish_change(parameters, 0);
     authenticator.change(false);
-    return 0;
+    return code;
   };
   session->handle(test::modify(2, kTop, "description", "x"));
   EXPECT_TRUE(session->run_until([this] { return session->ended; }));

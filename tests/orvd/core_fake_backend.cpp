@@ -4,6 +4,7 @@
 #include <chrono>
 #include <cstdlib>
 #include <cstring>
+#include <memory>
 
 namespace orv::server::test {
 namespace {
@@ -31,10 +32,7 @@ FakeBackend::FakeBackend() : handlers_(slapi_pblock_new()) {
   record_.suffixes = suffixes_;
   record_.handlers = handlers_.get();
   on_search = [](pblock* parameters) { return finish_search(parameters, 0, 0); };
-  on_change = [](pblock* parameters) {
-    send_ldap_result(connection_of(parameters), operation_of(parameters), 53, nullptr, "");
-    return 53;
-  };
+  on_change = [](pblock* parameters) { return finish_change(parameters, 53); };
   on_bind = [](pblock*) { return 49; };
   on_unbind = [](pblock*) { return 0; };
 }
@@ -117,6 +115,24 @@ int finish_search(pblock* parameters, int code, int entries) {
   connection->send_search_result(connection, operation_of(parameters), code, nullptr, nullptr,
                                  entries);
   return code;
+}
+
+int finish_change(pblock* parameters, int code) {
+  send_ldap_result(connection_of(parameters), operation_of(parameters), code, nullptr, "");
+  return code;
+}
+
+Gate::Entry enter_at_once(Gate& gate) {
+  class NoWaiter final : public GateWaiter {
+    void gate_decided(Verdict) noexcept override {}
+  };
+  return gate.enter(std::make_shared<NoWaiter>(), Clock::time_point::max());
+}
+
+bool is_open(Gate& gate) {
+  const bool open = enter_at_once(gate) == Gate::Entry::inside;
+  if (open) gate.leave();
+  return open;
 }
 
 void Event::happen() {

@@ -8,6 +8,7 @@
 #include <string>
 #include <vector>
 
+#include "ops/gate.h"
 #include "slapi/owners.h"
 #include "slapi/pblock.h"
 
@@ -21,7 +22,8 @@ class FakeBackend {
 
   Backend& record() { return record_; }
 
-  // What the handlers do; each returns the handler's result. Called on the handler's thread.
+  // What the handlers do; each returns the handler's result. Called on the handler's thread. Unless
+  // a test says otherwise a search finds nothing, a change is refused with 53 and a bind with 49.
   std::function<int(pblock*)> on_search;
   std::function<int(pblock*)> on_change;  // add, delete and modify
   std::function<int(pblock*)> on_bind;
@@ -58,8 +60,13 @@ EntryPtr make_test_entry(const std::string& dn, std::size_t value_bytes = 8);
 
 // Sends one entry as a search handler does.
 int send_test_entry(pblock* parameters, entry& e);
-// Sends the final result of a search.
+// Sends the final result of a search, or of another operation; the code.
 int finish_search(pblock* parameters, int code, int entries);
+int finish_change(pblock* parameters, int code);
+
+// At the gate in front of the backend, somebody who would not wait; and whether he would get in.
+Gate::Entry enter_at_once(Gate& gate);
+bool is_open(Gate& gate);
 
 // Something that happens once, and that others wait for.
 class Event {

@@ -129,11 +129,6 @@ class LocalServer : public test::LoopbackServer, public ExternalIdentities {
   LocalServer() {
     more.local_socket = folder.socket();
     mechanisms.push_back(make_external(*this));
-    backend.on_change = [](pblock* parameters) {
-      send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 53, nullptr,
-                       "");
-      return 53;
-    };
   }
   ~LocalServer() override { stop(); }
 

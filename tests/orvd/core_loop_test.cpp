@@ -25,11 +25,7 @@ class LoopTest : public test::LoopbackServer {
     go_on.happen();
     stop();
   }
-  static int refused(pblock* parameters) {
-    send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 53, nullptr,
-                     "");
-    return 53;
-  }
+  static int refused(pblock* parameters) { return test::finish_change(parameters, 53); }
   // The next call of a handler stays inside the backend until `go_on`.
   int stay(pblock* parameters) {
     entered.happen();

@@ -56,8 +56,7 @@ class ModifyServer : public LoopbackServer {
         handed_over = text_of(parameters);
       }
       if (in_handler) in_handler();
-      send_ldap_result(connection_of(parameters), operation_of(parameters), code, nullptr, "");
-      return code;
+      return finish_change(parameters, code);
     };
   }
   ~ModifyServer() override { stop(); }

@@ -328,11 +328,7 @@ class PersistentWire : public LoopbackServer {
       const int code = test::send_test_entry(parameters, *found);
       return test::finish_search(parameters, code, 1);
     };
-    backend.on_change = [](pblock* parameters) {
-      send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 0, nullptr,
-                       "");
-      return 0;
-    };
+    backend.on_change = [](pblock* parameters) { return test::finish_change(parameters, 0); };
   }
   ~PersistentWire() override { stop(); }
 
@@ -463,11 +459,7 @@ TEST_F(PersistentWire, ARefusedChangeIsNotTold) {
   bind_as_root(changer);
   listener.send(persistent_search(7));
   ASSERT_TRUE(taken(listener, 8));
-  backend.on_change = [](pblock* parameters) {
-    send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 68, nullptr,
-                     "");
-    return 68;
-  };
+  backend.on_change = [](pblock* parameters) { return test::finish_change(parameters, 68); };
   ASSERT_EQ(add(changer, 2), 68);
   EXPECT_TRUE(taken(listener, 9));
   EXPECT_EQ(backend.calls(parameter::search_function), 1);
@@ -489,9 +481,7 @@ TEST_F(PersistentWire, ADeletedEntryIsToldWithoutASearch) {
     attr_merge(before.get(), "objectClass", values, 1, 1, nullptr);
     slapi_pblock_set(parameters, parameter::entry_before_delete,
                      static_cast<void*>(before.release()));
-    send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 0, nullptr,
-                     "");
-    return 0;
+    return test::finish_change(parameters, 0);
   };
   ASSERT_EQ(remove(changer, 2), 0);
   const auto notice = listener.receive();
@@ -530,9 +520,7 @@ TEST_F(PersistentWire, ABindEndsItAlsoWhileANoticeWaitsForItsTurn) {
   std::atomic<int> changes{0};
   backend.on_change = [&](pblock* parameters) {
     (changes.fetch_add(1) == 0 ? first_goes_on : second_goes_on).wait();
-    send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 0, nullptr,
-                     "");
-    return 0;
+    return test::finish_change(parameters, 0);
   };
   start();
   WireClient listener(port());

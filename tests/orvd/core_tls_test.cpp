@@ -61,11 +61,7 @@ class TlsTest : public test::BlockedServer {
     return code_of(client, test::delete_entry(id, kTop));
   }
   void count_changes() {
-    backend.on_change = [](pblock* parameters) {
-      send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 53, nullptr,
-                       "");
-      return 53;
-    };
+    backend.on_change = [](pblock* parameters) { return test::finish_change(parameters, 53); };
   }
   int changes() const { return backend.calls(parameter::delete_function); }
 

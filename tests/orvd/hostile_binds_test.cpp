@@ -135,10 +135,7 @@ TEST_F(BindAfterBind, CarriesNothingOver) {
 
 // Between the two, requests that fail, each in a way of its own.
 TEST_F(BindAfterBind, CarriesNothingOverAFailedRequestOfAnyKind) {
-  backend.on_change = [](pblock* parameters) {
-    send_ldap_result(connection_of(parameters), operation_of(parameters), 53, nullptr, "");
-    return 53;
-  };
+  backend.on_change = [](pblock* parameters) { return finish_change(parameters, 53); };
   backend.on_search = [](pblock* parameters) { return finish_search(parameters, 32, 0); };
   const std::vector<std::string> failing = {search(2, kTop),
                                             search(2, "no DN,,"),

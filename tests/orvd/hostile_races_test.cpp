@@ -32,10 +32,7 @@ class Races : public LoopbackServer {
       for (int code = 0; sent < 20 && code == 0; ++sent) code = send_test_entry(parameters, *found);
       return finish_search(parameters, 0, sent);
     };
-    backend.on_change = [](pblock* parameters) {
-      send_ldap_result(connection_of(parameters), operation_of(parameters), 0, nullptr, "");
-      return 0;
-    };
+    backend.on_change = [](pblock* parameters) { return finish_change(parameters, 0); };
   }
   ~Races() override { stop(); }
 

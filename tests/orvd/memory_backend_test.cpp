@@ -112,10 +112,6 @@ class MemoryOfTheBackend : public testing::Test {
     std::filesystem::rename(config + ".edit", config);
   }
 
-  class NoWaiter final : public GateWaiter {
-    void gate_decided(Verdict) noexcept override {}
-  };
-
   // The result of one change, of which the n-th allocation fails.
   template <typename Request>
   int change(const Request& request, int tag, const char* normal_dn, long n, bool& hit) {
@@ -124,9 +120,7 @@ class MemoryOfTheBackend : public testing::Test {
     const auto operation = std::make_shared<PendingOperation>(home, root, 1, tag, AnswerLimits{});
     operation->failure_limit = std::int64_t{1} << 40;
     EXPECT_EQ(operation->prepare(services, request, normal_dn).code, 0);
-    EXPECT_EQ(host.gate().enter(std::make_shared<NoWaiter>(), Clock::time_point::max()),
-              Gate::Entry::inside)
-        << "the gate is open again";
+    EXPECT_EQ(enter_at_once(host.gate()), Gate::Entry::inside) << "the gate is open again";
     AllocationFault fault(n);
     operation->run(services, true);
     fault.disarm();
@@ -196,9 +190,7 @@ TEST_F(MemoryOfTheBackend, SearchHasAResultAndTheNextOneFindsEverything) {
     const auto operation =
         std::make_shared<PendingOperation>(home, root, 1, tag::search_done, AnswerLimits{});
     EXPECT_EQ(operation->prepare_search(services, request, "CN=CONFIGURATION").code, 0);
-    EXPECT_EQ(host.gate().enter(std::make_shared<NoWaiter>(), Clock::time_point::max()),
-              Gate::Entry::inside)
-        << "the gate is open again";
+    EXPECT_EQ(enter_at_once(host.gate()), Gate::Entry::inside) << "the gate is open again";
     AllocationFault fault(n);
     operation->run(services, true);
     fault.disarm();

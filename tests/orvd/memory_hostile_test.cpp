@@ -68,20 +68,7 @@ class MemoryOfAnExchange : public BareSessionTest, public testing::WithParamInte
       const int code = send_test_entry(parameters, *found_);
       return finish_search(parameters, code, code == 0 ? 1 : 0);
     };
-    backend.on_change = [](pblock* parameters) {
-      send_ldap_result(connection_of(parameters), operation_of(parameters), 0, nullptr, "");
-      return 0;
-    };
-  }
-
-  bool gate_is_open() {
-    class NoWaiter final : public GateWaiter {
-      void gate_decided(Verdict) noexcept override {}
-    };
-    const bool open = host.gate().enter(std::make_shared<NoWaiter>(), Clock::time_point::max()) ==
-                      Gate::Entry::inside;
-    if (open) host.gate().leave();
-    return open;
+    backend.on_change = [](pblock* parameters) { return finish_change(parameters, 0); };
   }
 
   // As a connection does: no request is handled while one has to wait, and want of memory ends it.
@@ -122,7 +109,7 @@ TEST_P(MemoryOfAnExchange, LeavesNothingBehindWhenItFails) {
     client->client_left();
     EXPECT_TRUE(client->run_until([&] { return client->idle(); }));
     client->run_posted();
-    EXPECT_TRUE(gate_is_open());
+    EXPECT_TRUE(is_open(host.gate()));
     EXPECT_TRUE(searches_are_gone());
     EXPECT_EQ(services.output.room(), OutputMeter::kDefaultCeiling);
     session.reset();

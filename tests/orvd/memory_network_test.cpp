@@ -183,10 +183,7 @@ class MemoryOfAServer : public LoopbackServer {
       const int code = send_test_entry(parameters, *found_);
       return finish_search(parameters, code, code == 0 ? 1 : 0);
     };
-    backend.on_change = [](pblock* parameters) {
-      send_ldap_result(connection_of(parameters), operation_of(parameters), 0, nullptr, "");
-      return 0;
-    };
+    backend.on_change = [](pblock* parameters) { return finish_change(parameters, 0); };
   }
   // What the mechanisms refer to goes with this class.
   ~MemoryOfAServer() override { stop(); }

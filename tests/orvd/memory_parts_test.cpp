@@ -305,15 +305,6 @@ class MemoryOfASession : public test::BareSessionTest,
     return std::make_shared<Identity>(Identity{"CN=ROOT", 0x0C, 0, ""});
   }
   std::shared_ptr<const Identity> of_certificate(std::string_view) override { return nullptr; }
-  bool gate_is_open() {
-    class NoWaiter final : public GateWaiter {
-      void gate_decided(Verdict) noexcept override {}
-    };
-    const bool open = host.gate().enter(std::make_shared<NoWaiter>(), Clock::time_point::max()) ==
-                      Gate::Entry::inside;
-    if (open) host.gate().leave();
-    return open;
-  }
   std::shared_ptr<test::BareSession> fresh_session(bool bound) {
     session = std::make_shared<test::BareSession>(services, lane, settings);
     TransportFacts facts;
@@ -334,11 +325,7 @@ TEST_P(MemoryOfASession, AnswersOrEnds) {
     for (int i = 0; i < 3 && code == 0; ++i) code = test::send_test_entry(parameters, *found);
     return test::finish_search(parameters, code, 3);
   };
-  backend.on_change = [](pblock* parameters) {
-    send_ldap_result(test::connection_of(parameters), test::operation_of(parameters), 0, nullptr,
-                     "");
-    return 0;
-  };
+  backend.on_change = [](pblock* parameters) { return test::finish_change(parameters, 0); };
   for (const bool bound : {false, true}) {
     for (long n = 1;; ++n) {
       SCOPED_TRACE("allocation " + std::to_string(n) + (bound ? ", bound" : ", anonymous"));
@@ -357,7 +344,7 @@ TEST_P(MemoryOfASession, AnswersOrEnds) {
       EXPECT_TRUE(hit || !threw);
       tried->client_left();
       EXPECT_TRUE(tried->run_until([&] { return tried->idle(); }));
-      EXPECT_TRUE(gate_is_open());
+      EXPECT_TRUE(test::is_open(host.gate()));
       if (!hit || HasFailure()) break;
     }
   }
