@@ -1,7 +1,6 @@
 """What no added entry may be, whoever sends it: each rule with its code, the text that the client
 gets, and a file that stays as it was."""
 
-import ldap
 import pytest
 
 from orv_e2e import changes, clients
@@ -15,11 +14,7 @@ BAD_ROLE = (80, "Invalid administrative role value")
 
 def answer(client, dn, attributes):
     """The code and the text of an add."""
-    try:
-        client.add_s(dn, encoded(attributes))
-        return 0, ""
-    except ldap.LDAPError as error:
-        return error.args[0]["result"], error.args[0].get("info", "")
+    return clients.answer_of(client.add_s, dn, encoded(attributes))
 
 
 @pytest.fixture(name="add")

@@ -7,11 +7,7 @@ from orv_e2e.config_file import record
 
 
 def search_code(client):
-    try:
-        clients.search(client, scope=ldap.SCOPE_BASE)
-        return 0
-    except ldap.LDAPError as error:
-        return error.args[0]["result"]
+    return clients.code_of(clients.search, client, scope=ldap.SCOPE_BASE)
 
 
 def causes(server):

@@ -201,11 +201,7 @@ def test_start_refuses_an_unusable_setting_and_names_it(instance):
 # While it runs.
 
 def search_code(client):
-    try:
-        clients.search(client, scope=ldap.SCOPE_BASE)
-        return 0
-    except ldap.LDAPError as error:
-        return error.args[0]["result"]
+    return clients.code_of(clients.search, client, scope=ldap.SCOPE_BASE)
 
 
 def put_folder(instance):

@@ -13,11 +13,7 @@ def nested(levels):
 
 
 def code_of_search(client, levels):
-    try:
-        client.search_s(clients.BASE, ldap.SCOPE_BASE, nested(levels), ["1.1"])
-        return 0
-    except ldap.LDAPError as error:
-        return error.args[0]["result"]
+    return clients.code_of(client.search_s, clients.BASE, ldap.SCOPE_BASE, nested(levels), ["1.1"])
 
 
 def test_largest_depth_is_served_and_one_more_is_answered_11(instance):

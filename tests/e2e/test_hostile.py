@@ -40,16 +40,14 @@ def server_fixture(module_instance):
 @pytest.fixture(name="good")
 def good_fixture(server):
     """Somebody else, who has to be served whatever happens."""
-    with wire.Wire(server) as connection:
-        assert connection.bind("cn=root", server.password) == 0
+    with wire.bound(server) as connection:
         yield connection
         assert connection.search(9999) == (0, 1), "somebody else is not served any more"
 
 
 @pytest.fixture(name="root")
 def root_fixture(server):
-    with wire.Wire(server) as connection:
-        assert connection.bind("cn=root", server.password) == 0
+    with wire.bound(server) as connection:
         yield connection
 
 
@@ -299,8 +297,7 @@ def test_controls_of_the_largest_size_take_no_time(server):
     names = Node(0x30, [text("x%d" % i) for i in range(1000)]).encoded()
     change = modification(dn, (0, "description", ["new"]))
     conditions = {"part": one, "parts": pieces, "items": wide}
-    with wire.Wire(server) as root:
-        assert root.bind("cn=root", server.password) == 0
+    with wire.bound(server) as root:
         for position, (name, condition) in enumerate(conditions.items(), start=2):
             used = Stopwatch(server)
             root.send(request(position, change, [control(ASSERTION, True, condition.encoded())]))
@@ -448,8 +445,7 @@ def operations_with_answers():
 def codes_with(server, controls):
     """What each operation ends with; after binds somebody is bound again."""
     found = {}
-    with wire.Wire(server) as connection:
-        assert connection.bind("cn=root", server.password) == 0
+    with wire.bound(server) as connection:
         for position, (kind, operation) in enumerate(operations_with_answers().items(), start=1):
             connection.send(request(10 * position, operation, controls))
             answer = connection.answer()
@@ -628,8 +624,7 @@ def test_malformed_stored_passwords_never_match_and_take_no_time(instance):
                 code = connection.bind("cn=stored%d" % position, guess, number_of_guess)
                 assert code == (53 if not guess else 49), (stored[:30], guess[:30])
     assert used.seconds() < 10 * SLOW
-    with wire.Wire(instance) as connection:
-        assert connection.bind("cn=root", instance.password) == 0
+    wire.bound(instance).close()
 
 
 # ---- secrets

@@ -32,8 +32,7 @@ def server_fixture(module_instance):
 
 @pytest.fixture(name="root")
 def root_fixture(server):
-    with wire.Wire(server) as connection:
-        assert connection.bind("cn=root", server.password) == 0
+    with wire.bound(server) as connection:
         yield connection
         assert connection.search(9999) == (0, 1)
 
@@ -107,8 +106,7 @@ def test_request_of_another_form_is_no_such_request(server, oid):
     name, value = text(oid, 0x80), text(GOOD_CANCEL, 0x81)
     for parts in ([], [value], [value, name], [text(oid, 0x04)], [Node(0xA0, [text(oid)])],
                   [text("x", 0x04), name], [name, value, value]):
-        with wire.Wire(server) as connection:
-            assert connection.bind("cn=root", server.password) == 0
+        with wire.bound(server) as connection:
             connection.send(request(2, Node(0x77, parts)))
             answer = answer_or_end(connection)
             assert answer is None or answer.code != 0

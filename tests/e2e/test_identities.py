@@ -74,10 +74,7 @@ def search_code(instance, who, password):
     if who is not None:
         client.simple_bind_s(who, password)
     try:
-        clients.read(client, clients.BASE)
-        return 0
-    except ldap.LDAPError as error:
-        return error.args[0]["result"]
+        return clients.code_of(clients.read, client, clients.BASE)
     finally:
         client.unbind_s()
 

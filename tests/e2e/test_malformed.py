@@ -110,8 +110,7 @@ def batches(messages, size):
 def throw_at(server, messages, connect):
     """Every other sender is bound as the administrator, whose requests go further."""
     before = wire.bind_request(1, "cn=root", server.password)
-    with wire.Wire(server) as administrator:
-        assert administrator.bind("cn=root", server.password) == 0
+    with wire.bound(server) as administrator:
         number = 1
         for batch in batches(messages, AT_ONCE):
             senders = [Sender(connect(server), way, data) for way, data in batch]

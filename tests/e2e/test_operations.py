@@ -12,6 +12,7 @@ from ldap.extop import ExtendedRequest
 
 from orv_e2e import clients, wire
 from orv_e2e.changes import GROUP, PASSWORD, PLACE, add, container, member, supplier
+from orv_e2e.clients import code_of
 from orv_e2e.config_file import record
 from orv_e2e.persistent import Listener
 from orv_e2e.programs import DEADLINE
@@ -20,14 +21,6 @@ from test_audit_log import Records, log_of
 ASSERTION, PRE_READ, POST_READ = "1.3.6.1.1.12", "1.3.6.1.1.13.1", "1.3.6.1.1.13.2"
 PAGED, CANCEL, WHO_AM_I = "1.2.840.113556.1.4.319", "1.3.6.1.1.8", "1.3.6.1.4.1.4203.1.11.3"
 SORT = "1.2.840.113556.1.4.473"
-
-
-def code_of(operation, *arguments, **more):
-    try:
-        operation(*arguments, **more)
-        return 0
-    except ldap.LDAPError as error:
-        return error.args[0]["result"]
 
 
 def bind_member(server, root, name, roles=("ServerConfigGroupMember",)):
@@ -162,8 +155,7 @@ def test_a_long_search_is_canceled_while_it_runs(instance):
     instance.config.append(b"\n".join(entries))
     instance.start()
     slow = wire.any_of(*[wire.equal("description", "nothing%d" % i) for i in range(2000)])
-    with wire.Wire(instance) as client:
-        assert client.bind("cn=root", instance.password) == 0
+    with wire.bound(instance) as client:
         client.send(wire.search_request(2, scope=2, search_filter=slow))
         client.send(wire.message(3, wire.tlv(0x77, wire.octets(CANCEL, 0x80) + wire.octets(
             wire.tlv(0x30, wire.number(2)), 0x81))))

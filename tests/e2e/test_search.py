@@ -197,8 +197,7 @@ def test_missing_base_is_answered_32(admin, base, scope):
                                   b"cn=a\x00b,cn=configuration", b"cn=\xff,cn=configuration",
                                   b"cn=\"a\",cn=configuration\"", b",cn=configuration"])
 def test_base_that_is_no_dn_is_answered_34(shelf, base):
-    with wire.Wire(shelf) as connection:
-        assert connection.bind("cn=root", shelf.password) == 0
+    with wire.bound(shelf) as connection:
         assert connection.search(2, base=base) == (34, 0)
         assert connection.search(3) == (0, 1)
 
@@ -242,8 +241,7 @@ def big_instance(instance, entries=20000):
 
 def test_time_limit_of_the_client_ends_the_search_with_3(instance):
     big_instance(instance).start()
-    with wire.Wire(instance) as connection:
-        assert connection.bind("cn=root", instance.password) == 0
+    with wire.bound(instance) as connection:
         assert connection.search(2, scope=2, search_filter=slow_filter(1000),
                                  time_limit=1) == (3, 0)
         assert connection.search(3) == (0, 1)
@@ -252,8 +250,7 @@ def test_time_limit_of_the_client_ends_the_search_with_3(instance):
 def test_time_limit_of_the_server_ends_the_search_with_3(instance):
     instance.config.set(clients.BASE, "orv-slapdTimeLimit", "1")
     big_instance(instance).start()
-    with wire.Wire(instance) as connection:
-        assert connection.bind("cn=root", instance.password) == 0
+    with wire.bound(instance) as connection:
         assert connection.search(2, scope=2, search_filter=slow_filter(1000)) == (3, 0)
 
 
@@ -278,17 +275,14 @@ def test_abandoned_search_leaves_the_connection_usable(admin):
 
 
 def test_abandon_of_an_operation_that_never_was_is_ignored(shelf):
-    with wire.Wire(shelf) as connection:
-        assert connection.bind("cn=root", shelf.password) == 0
+    with wire.bound(shelf) as connection:
         connection.send(wire.abandon_request(2, 77))
         assert connection.search(3) == (0, 1)
 
 
 def test_abandon_ends_a_running_search_without_an_answer(instance):
     big_instance(instance).start()
-    with wire.Wire(instance) as connection, wire.Wire(instance) as other:
-        assert connection.bind("cn=root", instance.password) == 0
-        assert other.bind("cn=root", instance.password) == 0
+    with wire.bound(instance) as connection, wire.bound(instance) as other:
         connection.send(wire.search_request(2, scope=2, search_filter=slow_filter(1300)))
         connection.send(wire.abandon_request(3, 2) + wire.search_request(4))
         assert connection.search_result(4) == (0, 1)
@@ -297,16 +291,13 @@ def test_abandon_ends_a_running_search_without_an_answer(instance):
 
 def test_search_of_a_client_that_leaves_ends(instance):
     big_instance(instance).start()
-    with wire.Wire(instance) as leaving, wire.Wire(instance) as other:
-        assert leaving.bind("cn=root", instance.password) == 0
-        assert other.bind("cn=root", instance.password) == 0
+    with wire.bound(instance) as leaving, wire.bound(instance) as other:
         leaving.send(wire.search_request(2, scope=2, search_filter=slow_filter(1300)))
         leaving.close()
         assert other.search(2) == (0, 1)
 
 
 def test_filter_with_too_many_items_is_refused_with_11(shelf):
-    with wire.Wire(shelf) as connection:
-        assert connection.bind("cn=root", shelf.password) == 0
+    with wire.bound(shelf) as connection:
         assert connection.search(2, search_filter=slow_filter(3000)) == (11, 0)
         assert connection.search(3) == (0, 1)

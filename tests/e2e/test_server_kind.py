@@ -13,11 +13,7 @@ def kind_3_fixture(instance):
 
 
 def code_of_search(client, scope):
-    try:
-        clients.search(client, scope=scope)
-        return 0
-    except ldap.LDAPError as error:
-        return error.args[0]["result"]
+    return clients.code_of(clients.search, client, scope=scope)
 
 
 @pytest.mark.parametrize("scope", [ldap.SCOPE_BASE, ldap.SCOPE_ONELEVEL, ldap.SCOPE_SUBTREE])

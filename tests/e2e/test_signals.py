@@ -34,8 +34,7 @@ def test_idle_server_ends_with_0_after(server, number):
 
 
 def test_stop_closes_connections_of_idle_clients(server):
-    with wire.Wire(server) as idle:
-        assert idle.bind("cn=root", server.password) == 0
+    with wire.bound(server) as idle:
         server.stop()
         assert all(answer.is_notice for answer in idle.answers_until_closed())
 
@@ -52,9 +51,7 @@ def test_stop_with_operations_in_flight_ends_with_0(instance):
                        ("description", "x" * 200)]) for i in range(5000)]
     instance.config.append(b"\n".join(entries))
     instance.start()
-    busy = [wire.Wire(instance) for _ in range(16)]
-    for connection in busy:
-        assert connection.bind("cn=root", instance.password) == 0
+    busy = [wire.bound(instance) for _ in range(16)]
     for connection in busy:
         connection.send(b"".join(wire.search_request(number, scope=2, attributes=())
                                  for number in range(2, 12)))

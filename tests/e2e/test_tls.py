@@ -520,13 +520,11 @@ def test_passwords_in_clear_are_refused_where_the_settings_say_so(server, root):
 def test_what_is_sent_behind_start_tls_is_never_executed(server, root):
     delete = wire.message(3, wire.tlv(0x4A, b"cn=digest,cn=configuration"))
     request = wire.message(2, wire.tlv(0x77, wire.octets(START_TLS, 0x80)))
-    with wire.Wire(server) as client:
-        assert client.bind("cn=root", server.password) == 0
+    with wire.bound(server) as client:
         client.send(request + delete)
         answers = client.answers_until_closed()
         assert [answer.is_notice for answer in answers] == [True]
-    with wire.Wire(server) as client:
-        assert client.bind("cn=root", server.password) == 0
+    with wire.bound(server) as client:
         client.send(request)
         assert client.answer().code == 0
         client.send(delete)

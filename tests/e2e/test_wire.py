@@ -21,16 +21,14 @@ def server_fixture(module_instance):
 @pytest.fixture(name="bad")
 def bad_fixture(server):
     """The connection that misbehaves, bound as the primary administrator."""
-    with wire.Wire(server) as connection:
-        assert connection.bind("cn=root", server.password) == 0
+    with wire.bound(server) as connection:
         yield connection
 
 
 @pytest.fixture(name="good")
 def good_fixture(server):
     """A connection of somebody else, who has to be served whatever the other does."""
-    with wire.Wire(server) as connection:
-        assert connection.bind("cn=root", server.password) == 0
+    with wire.bound(server) as connection:
         yield connection
         assert connection.search(9999) == (0, 1), "somebody else is not served any more"
 
@@ -275,12 +273,6 @@ def limited(instance, **settings):
     return instance.start()
 
 
-def bound(instance, **arguments):
-    connection = wire.Wire(instance, **arguments)
-    assert connection.bind("cn=root", instance.password) == 0
-    return connection
-
-
 def add_large_entries(instance, count=200, size=100000):
     entries = [record("cn=e%d,cn=schemas,cn=configuration" % i,
                       [("objectClass", ["top", "container"]), ("cn", "e%d" % i),
@@ -292,7 +284,7 @@ def add_large_entries(instance, count=200, size=100000):
 def test_slow_reader_does_not_stall_others_and_gets_everything(instance):
     count = add_large_entries(instance)
     instance.start()
-    with bound(instance, receive_buffer=4096) as slow, bound(instance) as other:
+    with wire.bound(instance, receive_buffer=4096) as slow, wire.bound(instance) as other:
         slow.send(wire.search_request(2, "cn=schemas,cn=configuration", scope=1, attributes=(),
                                       search_filter=wire.present("description")))
         for number in range(2, 22):
@@ -303,7 +295,7 @@ def test_slow_reader_does_not_stall_others_and_gets_everything(instance):
 def test_reader_that_makes_no_progress_is_dropped(instance):
     add_large_entries(instance)
     limited(instance, WriteTimeOut=1)
-    with bound(instance, receive_buffer=4096) as stuck, bound(instance) as other:
+    with wire.bound(instance, receive_buffer=4096) as stuck, wire.bound(instance) as other:
         stuck.send(wire.search_request(2, "cn=schemas,cn=configuration", scope=1, attributes=()))
         stuck.socket.setblocking(True)
         limit = time.monotonic() + DEADLINE
@@ -328,7 +320,7 @@ def was_reset(connection):
 def test_answer_beyond_its_budget_ends_with_11(instance):
     add_large_entries(instance, 20)
     limited(instance, MaxResultSize=1000000)
-    with bound(instance) as connection:
+    with wire.bound(instance) as connection:
         connection.send(wire.search_request(2, scope=2, attributes=()))
         code, entries = connection.search_result(2)
         assert code == 11
@@ -338,7 +330,7 @@ def test_answer_beyond_its_budget_ends_with_11(instance):
 
 def test_idle_connection_is_closed(instance):
     limited(instance, IdleTimeOut=1)
-    with bound(instance) as idle:
+    with wire.bound(instance) as idle:
         assert all(answer.is_notice for answer in idle.answers_until_closed())
 
 
@@ -350,14 +342,14 @@ def test_connection_that_never_says_anything_is_closed(instance):
 
 def test_sender_that_does_not_finish_its_message_is_closed(instance):
     limited(instance, MessageTimeOut=1)
-    with bound(instance) as slow:
+    with wire.bound(instance) as slow:
         slow.send(SEARCH[:10])
         assert all(answer.is_notice for answer in slow.answers_until_closed())
 
 
 def test_connections_beyond_the_number_for_one_address_are_closed(instance):
     limited(instance, MaxConnectionsPerAddress=5)
-    kept = [bound(instance) for _ in range(5)]
+    kept = [wire.bound(instance) for _ in range(5)]
     with wire.Wire(instance) as surplus:
         assert all(answer.is_notice for answer in surplus.answers_until_closed())
     assert kept[0].search(2) == (0, 1)
@@ -368,7 +360,7 @@ def test_connections_beyond_the_number_for_one_address_are_closed(instance):
 def test_place_of_a_closed_connection_is_free_again(instance):
     limited(instance, MaxConnections=3)
     for _ in range(20):
-        bound(instance).close()
+        wire.bound(instance).close()
     limit = time.monotonic() + DEADLINE
     while True:
         with wire.Wire(instance) as connection:
@@ -382,11 +374,11 @@ def test_place_of_a_closed_connection_is_free_again(instance):
 
 def test_controls_beyond_their_number_are_refused(instance):
     limited(instance, MaxControls=4)
-    with bound(instance) as connection:
+    with wire.bound(instance) as connection:
         operation = wire.split(wire.search_request(2))[1]
         control = wire.tlv(0x30, wire.octets("1.2.3"))
         connection.send(wire.tlv(0x30, operation + wire.tlv(0xA0, control * 5)))
         assert_refused(connection, 2, (2, 11, 53))
-    with bound(instance) as connection:
+    with wire.bound(instance) as connection:
         connection.send(wire.tlv(0x30, operation + wire.tlv(0xA0, control * 4)))
         assert connection.search_result(2) == (0, 1)

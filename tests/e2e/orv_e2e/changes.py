@@ -7,6 +7,7 @@ import ldap
 import ldap.modlist
 
 from . import programs
+from .clients import answer_of, code_of
 
 PASSWORD = "Vx7#kq9!Zp3$"  # passes the policy of the default configuration
 
@@ -53,22 +54,14 @@ def encoded(attributes):
             for name, values in attributes.items()]
 
 
-def _code(operation, *arguments):
-    try:
-        operation(*arguments)
-        return 0
-    except ldap.LDAPError as error:
-        return error.args[0]["result"]
-
-
 def add(client, dn, attributes):
     """The result code of an add. `attributes` is a dictionary, or a list of (name, values)."""
     pairs = attributes if isinstance(attributes, list) else encoded(attributes)
-    return _code(client.add_s, dn, pairs)
+    return code_of(client.add_s, dn, pairs)
 
 
 def delete(client, dn):
-    return _code(client.delete_s, dn)
+    return code_of(client.delete_s, dn)
 
 
 def modify(client, dn, *modifications):
@@ -81,11 +74,7 @@ def refusal(client, dn, *modifications):
     as_bytes = [(operation, name, values and [
         value if isinstance(value, bytes) else value.encode() for value in values])
         for operation, name, values in modifications]
-    try:
-        client.modify_s(dn, as_bytes)
-        return 0, ""
-    except ldap.LDAPError as error:
-        return error.args[0]["result"], error.args[0].get("info", "")
+    return answer_of(client.modify_s, dn, as_bytes)
 
 
 def added(name, *values):

@@ -34,14 +34,24 @@ def bind(instance, who=ADMINISTRATOR, password=None):
     return client
 
 
+def answer_of(operation, *arguments, **more):
+    """The code and the text of an operation's result as python3-ldap reports them; 0 and "" for
+    success."""
+    try:
+        operation(*arguments, **more)
+        return 0, ""
+    except ldap.LDAPError as error:
+        return error.args[0]["result"], error.args[0].get("info", "")
+
+
+def code_of(operation, *arguments, **more):
+    return answer_of(operation, *arguments, **more)[0]
+
+
 def bind_code(instance, who, password):
-    """The result of a bind as python3-ldap reports it; 0 for success."""
     client = connect(instance)
     try:
-        client.simple_bind_s(who, password)
-        return 0
-    except ldap.LDAPError as error:
-        return error.args[0]["result"]
+        return code_of(client.simple_bind_s, who, password)
     finally:
         client.unbind_s()
 

@@ -119,6 +119,13 @@ class Answer:
                 and (0x8A, NOTICE_OF_DISCONNECTION) in elements(self.content))
 
 
+def bound(instance, **arguments):
+    """A connection bound as the primary administrator."""
+    connection = Wire(instance, **arguments)
+    assert connection.bind("cn=root", instance.password) == 0
+    return connection
+
+
 class Wire:
     """A plain TCP connection to an instance."""
 
