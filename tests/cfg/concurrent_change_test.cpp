@@ -57,6 +57,13 @@ class ConcurrentChangeTest : public ChangeTest {
     ASSERT_EQ(std::rename(draft.c_str(), path_.c_str()), 0);
   }
 
+  // Somebody else's lock, until the descriptor is closed.
+  static int take_lock(const std::string& name) {
+    const int lock = ::open(name.c_str(), O_RDWR | O_CREAT, 0600);
+    EXPECT_EQ(::flock(lock, LOCK_EX), 0);
+    return lock;
+  }
+
   int add_with(cfg::FileCalls& files) {
     const CfgSession session = reopen();
     write_through(session, files);
@@ -145,8 +152,7 @@ TEST_F(ConcurrentChangeTest, ThreadsThatWriteLoseNothing) {
 
 TEST_F(ConcurrentChangeTest, ALockThatIsNotGivenUpIsNotWaitedForForEver) {
   write_file(path_, kBefore);
-  const int lock = ::open((path_ + ".lock").c_str(), O_RDWR | O_CREAT, 0600);
-  ASSERT_EQ(::flock(lock, LOCK_EX), 0);
+  const int lock = take_lock(path_ + ".lock");
   FaultyFiles files;  // its pauses take no time
   EXPECT_EQ(add_with(files), 51);
   EXPECT_EQ(read_file(path_), kBefore);
@@ -156,8 +162,7 @@ TEST_F(ConcurrentChangeTest, ALockThatIsNotGivenUpIsNotWaitedForForEver) {
 
 TEST_F(ConcurrentChangeTest, ALockThatIsGivenUpIsTaken) {
   write_file(path_, kBefore);
-  int lock = ::open((path_ + ".lock").c_str(), O_RDWR | O_CREAT, 0600);
-  ASSERT_EQ(::flock(lock, LOCK_EX), 0);
+  const int lock = take_lock(path_ + ".lock");
   InterposedFiles files("pause", 3, [&] { ::close(lock); });
   EXPECT_EQ(add_with(files), 0);
   EXPECT_EQ(read_file(path_), kAfter);
@@ -177,8 +182,7 @@ TEST_F(ConcurrentChangeTest, ALockFileThatIsReplacedMeanwhileIsNotTheLock) {
   int others = -1;
   InterposedFiles files("lock", 0, [&] {
     ::unlink(name.c_str());
-    others = ::open(name.c_str(), O_RDWR | O_CREAT, 0600);
-    ASSERT_EQ(::flock(others, LOCK_EX), 0);
+    others = take_lock(name);
   });
   EXPECT_EQ(add_with(files), 51);
   EXPECT_EQ(read_file(path_), kBefore);

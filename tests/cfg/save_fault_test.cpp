@@ -76,6 +76,25 @@ class SaveFaultTest : public ChangeTest {
     return files.calls();
   }
 
+  // The last flush.
+  static std::size_t flush_of_names(const std::vector<FaultyFiles::Call>& calls) {
+    std::size_t number = calls.size();
+    while (calls[--number].name != "flush") {
+    }
+    return number;
+  }
+
+  // The result of an add whose flush of the names fails once.
+  int add_with_names_not_flushed(int error) {
+    const std::size_t number = flush_of_names(undisturbed({}, false));
+    set_up_files(false);
+    FaultyFiles files;
+    files.fail_at(number, error, Lasting::once);
+    const CfgSession session = reopen();
+    write_through(session, files);
+    return add(session, "cn=a,cn=top", {{"cn", {"a"}}});
+  }
+
   // Whether a change may succeed although this call fails: nothing depends on its answer.
   static bool may_fail(const FaultyFiles::Call& call, std::size_t number, std::size_t commit) {
     if (call.name == "close" || call.name == "pause" || number > commit) return true;
@@ -140,9 +159,7 @@ class SaveFaultTest : public ChangeTest {
 
   void try_every_fault(Abilities abilities, bool leftovers) {
     const auto calls = undisturbed(abilities, leftovers);
-    std::size_t commit = calls.size();  // the last flush: that of the names
-    while (calls[--commit].name != "flush") {
-    }
+    const std::size_t commit = flush_of_names(calls);
     for (std::size_t number = 0; number < calls.size(); ++number) {
       for (const int error : {EIO, ENOSPC, EDQUOT, EROFS, EACCES, EINTR}) {
         for (const Lasting lasting : {Lasting::once, Lasting::kind, Lasting::all}) {
@@ -334,33 +351,13 @@ TEST_F(SaveFaultTest, AFailedFlushIsNotTriedAgain) {
 }
 
 TEST_F(SaveFaultTest, AFailedFlushOfTheNamesTakesTheChangeBack) {
-  set_up_files(false);
-  const auto calls = undisturbed({}, false);
-  std::size_t number = calls.size();
-  while (calls[--number].name != "flush") {
-  }
-  set_up_files(false);
-  FaultyFiles files;
-  files.fail_at(number, EIO, Lasting::once);
-  const CfgSession session = reopen();
-  write_through(session, files);
-  EXPECT_EQ(add(session, "cn=a,cn=top", {{"cn", {"a"}}}), 80);
+  EXPECT_EQ(add_with_names_not_flushed(EIO), 80);
   EXPECT_EQ(read_file(path_), kBefore);
   EXPECT_EQ(names(), kTidy);
 }
 
 TEST_F(SaveFaultTest, AFileSystemWhoseNamesNeedNoFlushIsGoodEnough) {
-  set_up_files(false);
-  const auto calls = undisturbed({}, false);
-  std::size_t number = calls.size();
-  while (calls[--number].name != "flush") {
-  }
-  set_up_files(false);
-  FaultyFiles files;
-  files.fail_at(number, EINVAL, Lasting::once);
-  const CfgSession session = reopen();
-  write_through(session, files);
-  EXPECT_EQ(add(session, "cn=a,cn=top", {{"cn", {"a"}}}), 0);
+  EXPECT_EQ(add_with_names_not_flushed(EINVAL), 0);
 }
 
 }  // namespace
