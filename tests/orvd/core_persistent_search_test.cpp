@@ -350,6 +350,12 @@ class PersistentWire : public LoopbackServer {
     const auto reply = client.receive();
     return reply && reply->id == id;
   }
+  // Binds, and asks for all changes under the message id 7; the next one is 9.
+  void listen(WireClient& client) {
+    bind_as_root(client);
+    client.send(persistent_search(7));
+    EXPECT_TRUE(taken(client, 8));
+  }
   int add(WireClient& client, int id, const std::string& dn = kMember) {
     return code_of(client, test::add_entry(id, dn, "cn", "x"));
   }
@@ -366,10 +372,8 @@ TEST_F(PersistentWire, TellsChangesOfAllKindsUnderItsMessageId) {
   start();
   WireClient listener(port());
   WireClient changer(port());
-  bind_as_root(listener);
+  listen(listener);
   bind_as_root(changer);
-  listener.send(persistent_search(7));
-  ASSERT_TRUE(taken(listener, 8));
   ASSERT_EQ(add(changer, 2), 0);
   ASSERT_EQ(code_of(changer, test::modify(3, kMember, "description", "y")), 0);
   for (int i = 0; i < 2; ++i) {
@@ -407,9 +411,7 @@ TEST_F(PersistentWire, AFailedFirstPartIsItsResult) {
 TEST_F(PersistentWire, AMessageIdOfARunningSearchIsInUse) {
   start();
   WireClient listener(port());
-  bind_as_root(listener);
-  listener.send(persistent_search(7));
-  ASSERT_TRUE(taken(listener, 8));
+  listen(listener);
   listener.send(test::search(7, test::kTop));
   const auto notice = listener.receive();
   ASSERT_TRUE(notice);
@@ -420,10 +422,8 @@ TEST_F(PersistentWire, EndsWithTheCodeOfASearchThatFails) {
   start();
   WireClient listener(port());
   WireClient changer(port());
-  bind_as_root(listener);
+  listen(listener);
   bind_as_root(changer);
-  listener.send(persistent_search(7));
-  ASSERT_TRUE(taken(listener, 8));
   search_code = 1;
   ASSERT_EQ(add(changer, 2), 0);
   const auto end = listener.receive();
@@ -437,10 +437,8 @@ TEST_F(PersistentWire, AnEntryThatIsGoneAgainIsNotTold) {
   start();
   WireClient listener(port());
   WireClient changer(port());
-  bind_as_root(listener);
+  listen(listener);
   bind_as_root(changer);
-  listener.send(persistent_search(7));
-  ASSERT_TRUE(taken(listener, 8));
   search_code = 32;
   ASSERT_EQ(add(changer, 2), 0);
   while (backend.calls(parameter::search_function) < 2) std::this_thread::yield();
@@ -455,10 +453,8 @@ TEST_F(PersistentWire, ARefusedChangeIsNotTold) {
   start();
   WireClient listener(port());
   WireClient changer(port());
-  bind_as_root(listener);
+  listen(listener);
   bind_as_root(changer);
-  listener.send(persistent_search(7));
-  ASSERT_TRUE(taken(listener, 8));
   backend.on_change = [](pblock* parameters) { return test::finish_change(parameters, 68); };
   ASSERT_EQ(add(changer, 2), 68);
   EXPECT_TRUE(taken(listener, 9));
@@ -469,10 +465,8 @@ TEST_F(PersistentWire, ADeletedEntryIsToldWithoutASearch) {
   start();
   WireClient listener(port());
   WireClient changer(port());
-  bind_as_root(listener);
+  listen(listener);
   bind_as_root(changer);
-  listener.send(persistent_search(7));
-  ASSERT_TRUE(taken(listener, 8));
   backend.on_change = [](pblock* parameters) {
     EntryPtr before = test::make_test_entry(test::target_of(parameters));
     std::string text = "container";
@@ -493,9 +487,7 @@ TEST_F(PersistentWire, ADeletedEntryIsToldWithoutASearch) {
 TEST_F(PersistentWire, WhoIsNobodyAnyMoreHearsNothingMore) {
   start();
   WireClient listener(port());
-  bind_as_root(listener);
-  listener.send(persistent_search(7));
-  ASSERT_TRUE(taken(listener, 8));
+  listen(listener);
   authenticator.change(false);
   const auto notice = listener.receive();
   ASSERT_TRUE(notice);
@@ -505,9 +497,7 @@ TEST_F(PersistentWire, WhoIsNobodyAnyMoreHearsNothingMore) {
 TEST_F(PersistentWire, ABindEndsItAndIsAnswered) {
   start();
   WireClient listener(port());
-  bind_as_root(listener);
-  listener.send(persistent_search(7));
-  ASSERT_TRUE(taken(listener, 8));
+  listen(listener);
   EXPECT_EQ(code_of(listener, test::bind(9, test::kRoot, test::kSecret)), 0);
   listener.send(test::search(7, test::kTop));
   EXPECT_EQ(listener.receive_result().back().code, 0) << "its message id is free again";
@@ -580,10 +570,8 @@ TEST_F(PersistentWire, WhoDoesNotReadIsEndedWithAResult) {
   value_bytes = 300000;
   WireClient listener(port());
   WireClient changer(port());
-  bind_as_root(listener);
+  listen(listener);
   bind_as_root(changer);
-  listener.send(persistent_search(7));
-  ASSERT_TRUE(taken(listener, 8));
   const int most = static_cast<int>(PersistentSearch::kMostWaiting) + 200;
   for (int i = 0; i < most; ++i) ASSERT_EQ(add(changer, i + 2), 0);
   const std::vector<Reply> replies = listener.receive_result();
@@ -596,9 +584,7 @@ TEST_F(PersistentWire, WhoDoesNotReadIsEndedWithAResult) {
 TEST_F(PersistentWire, TheServerStopsWhileSomebodyListens) {
   start();
   WireClient listener(port());
-  bind_as_root(listener);
-  listener.send(persistent_search(7));
-  ASSERT_TRUE(taken(listener, 8));
+  listen(listener);
   stop();
   EXPECT_EQ(status, 0);
   const auto notice = listener.receive();
