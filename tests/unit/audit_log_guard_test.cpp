@@ -11,9 +11,6 @@ namespace {
 constexpr const char* kAudit = "CN=AUDIT,CN=LOG MANAGEMENT,CN=CONFIGURATION";
 constexpr const char* kOtherLog = "CN=DEFAULT,CN=LOG MANAGEMENT,CN=CONFIGURATION";
 constexpr const char* kDefaultFile = "/var/ldap/V6.0/audit.log";
-constexpr int kAdd = kModAdd | kModBvalues;
-constexpr int kDelete = kModDelete | kModBvalues;
-constexpr int kReplace = kModReplace | kModBvalues;
 
 class AuditLogTest : public BackendTest {
  protected:

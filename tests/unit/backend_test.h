@@ -10,6 +10,7 @@
 #include <string>
 #include <vector>
 
+#include "cfg/ldapmod.h"
 #include "config_private.h"
 #include "handlers.h"
 #include "platform/platform.h"
@@ -26,6 +27,11 @@ using testing::Contains;
 using testing::ElementsAre;
 using testing::IsEmpty;
 using testing::Not;
+
+// Modifications as handlers get them, with counted values.
+inline constexpr int kAdd = kModAdd | kModBvalues;
+inline constexpr int kDelete = kModDelete | kModBvalues;
+inline constexpr int kReplace = kModReplace | kModBvalues;
 
 class BackendTest : public testing::Test {
  protected:

@@ -9,10 +9,6 @@ namespace {
 using Attributes = std::vector<scripted::ScriptedAttribute>;
 using Script = std::vector<scripted::ScriptedModification>;
 
-constexpr int kAdd = kModAdd | kModBvalues;
-constexpr int kDelete = kModDelete | kModBvalues;
-constexpr int kReplace = kModReplace | kModBvalues;
-
 // ======== The list for the file
 
 class ListForTheFile : public BackendTest {

@@ -15,9 +15,6 @@ constexpr unsigned kPrimary = 0x0C;
 constexpr unsigned kMember = 0x14;
 constexpr unsigned kServerSupplier = 0x01;
 constexpr unsigned kSuffixSupplier = 0x02;
-constexpr int kAdd = kModAdd | kModBvalues;
-constexpr int kDelete = kModDelete | kModBvalues;
-constexpr int kReplace = kModReplace | kModBvalues;
 
 constexpr const char* kEntry = "CN=X,CN=CONFIGURATION";
 constexpr const char* kTop = "CN=CONFIGURATION";

@@ -9,10 +9,6 @@ using Attributes = std::vector<scripted::ScriptedAttribute>;
 using Script = std::vector<scripted::ScriptedModification>;
 using Values = std::optional<std::vector<std::string>>;
 
-constexpr int kAdd = kModAdd | kModBvalues;
-constexpr int kDelete = kModDelete | kModBvalues;
-constexpr int kReplace = kModReplace | kModBvalues;
-
 constexpr const char* kConfiguration = "CN=CONFIGURATION";
 constexpr const char* kGroup = "CN=ADMINGROUP,CN=CONFIGURATION";
 constexpr const char* kMember = "CN=ME,CN=ADMINGROUP,CN=CONFIGURATION";

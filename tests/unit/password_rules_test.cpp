@@ -15,9 +15,6 @@ constexpr const char* kSupplierEntry = "CN=S,CN=REPLICATION,CN=CONFIGURATION";
 constexpr const char* kAdminPassword = "orv-slapdAdminPW";
 constexpr const char* kMasterPassword = "orv-slapdMasterPW";
 constexpr const char* kEncryption = "orv-slapdPwEncryption";
-constexpr int kAdd = kModAdd | kModBvalues;
-constexpr int kDelete = kModDelete | kModBvalues;
-constexpr int kReplace = kModReplace | kModBvalues;
 
 using Modifications = std::vector<scripted::ScriptedModification>;
 
