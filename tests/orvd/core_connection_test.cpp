@@ -161,6 +161,13 @@ class AccessLogTest : public ConnectionTest {
     stop();
     return folder.read("access.log");
   }
+  // The rest of the first line with this part, from there on.
+  std::string line_of(const std::string& part) {
+    const std::string log = written();
+    const std::size_t at = log.find(part);
+    EXPECT_NE(at, std::string::npos) << log;
+    return at == std::string::npos ? "" : log.substr(at, log.find('\n', at) - at);
+  }
 
   const orv::test::TemporaryDirectory folder;
 };
@@ -203,10 +210,7 @@ TEST_F(AccessLogTest, AbandonedOperationsAreLoggedAsAbandoned) {
   ASSERT_TRUE(wait_for_waiters(1));
   client.send(test::abandon(8, 7) + test::search(9, ""));
   EXPECT_EQ(client.receive_result().back().id, 9);
-  const std::string log = written();
-  const std::size_t at = log.find("op=7 ");
-  ASSERT_NE(at, std::string::npos) << log;
-  const std::string line = log.substr(at, log.find('\n', at) - at);
+  const std::string line = line_of("op=7 ");
   EXPECT_NE(line.find(" abandoned "), std::string::npos) << line;
   EXPECT_EQ(line.find("result="), std::string::npos) << line;
 }
@@ -220,10 +224,7 @@ TEST_F(AccessLogTest, OperationsOfAClientThatLeftAreLoggedAsAbandoned) {
     ASSERT_TRUE(wait_for_waiters(1));
   }
   ASSERT_TRUE(wait_for_waiters(0));
-  const std::string log = written();
-  const std::size_t at = log.find("op=7 ");
-  ASSERT_NE(at, std::string::npos) << log;
-  EXPECT_NE(log.substr(at, log.find('\n', at) - at).find(" abandoned "), std::string::npos);
+  EXPECT_NE(line_of("op=7 ").find(" abandoned "), std::string::npos);
 }
 
 // ---- identities
