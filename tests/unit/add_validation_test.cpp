@@ -498,8 +498,10 @@ TEST_F(AddRules, KerberosAndDigestAreForThePrimaryAdministratorAlone) {
     operation.roles = 0x3E;
     adding(kKerberos, {});
     EXPECT_EQ(kerberos(), 50) << flags;
+    EXPECT_THAT(platform.debug_lines(), IsEmpty()) << flags;
     adding(kDigest, {});
     EXPECT_EQ(digest(), 50) << flags;
+    EXPECT_THAT(platform.debug_lines(), IsEmpty()) << flags;
     EXPECT_THAT(asked(), IsEmpty());
   }
 }

@@ -213,6 +213,15 @@ TEST_F(AuditLogFile, OfAnEntryOfAnotherClassIsNoneWithoutAnError) {
   EXPECT_EQ(platform.count("cfg_first_attribute"), 0);
 }
 
+TEST_F(AuditLogFile, OfNoEntryIsNoneWithoutAnErrorWhateverTheErrorNumber) {
+  audit_entry({{"orv-slapdLog", {"/log/audit"}}});
+  platform.fail("cfg_first_entry", 1, 7);
+  EXPECT_EQ(file_name(), "NULL");
+  EXPECT_THAT(platform.debug_lines(), ElementsAre(search_line));
+  EXPECT_EQ(platform.count("cfg_perror"), 0);
+  EXPECT_EQ(platform.count("cfg_first_attribute"), 0);
+}
+
 TEST_F(AuditLogFile, OfAnAttributeThatCannotBeReachedIsNoneAndTold) {
   audit_entry({{"orv-slapdLog", {"/log/audit"}}});
   platform.fail("cfg_get_errno", 1, 7);  // the name is there nevertheless, and released
@@ -237,6 +246,28 @@ TEST_F(AuditLogFile, OfValuesThatCannotBeReadIsNoneAndToldAfterEverythingIsRelea
   EXPECT_THAT(platform.calls({"cfg_memfree", "cfg_ber_free", "cfg_msgfree", "cfg_perror"}),
               ElementsAre("cfg_memfree(\"orv-slapdLog\")", "cfg_ber_free(cursor)",
                           "cfg_msgfree(chain)", "cfg_perror(session, null)"));
+}
+
+TEST_F(AuditLogFile, OfWhatTheLibraryDoesNotGiveIsNoneAndTold) {
+  audit_entry({{"orv-slapdLog", {"/log/audit"}}});
+  platform.fail("cfg_first_attribute", 1, 7);
+  EXPECT_EQ(file_name(7), "NULL");
+  EXPECT_THAT(
+      platform.debug_lines(),
+      ElementsAre(search_line,
+                  error("Error - get_audit_log_filename: failed to retrieve attribute, rc=7\n"),
+                  not_read(7)));
+  EXPECT_EQ(platform.count("cfg_get_values"), 0);
+  EXPECT_EQ(platform.count("cfg_perror"), 1);
+  platform.forget();
+  platform.fail("cfg_get_values", 1, 8);
+  EXPECT_EQ(file_name(8), "NULL");
+  EXPECT_THAT(platform.debug_lines(),
+              ElementsAre(search_line,
+                          error("Error - get_audit_log_filename: failed to retrieve values for "
+                                "orv-slapdLog, rc=8\n"),
+                          not_read(8)));
+  EXPECT_EQ(platform.count("cfg_perror"), 1);
 }
 
 TEST_F(AuditLogFile, IsLookedForInTheFirstAttributeOnly) {

@@ -81,6 +81,15 @@ class Modify : public BackendTest {
     return text.substr(text.find("\", \"") + 4);
   }
 
+  // Lines of the handler itself, in order.
+  [[nodiscard]] std::vector<DebugLine> lines_of_the_handler() const {
+    std::vector<DebugLine> lines;
+    for (const DebugLine& line : platform.debug_lines()) {
+      if (line.text.starts_with("Error - config_back_modify")) lines.push_back(line);
+    }
+    return lines;
+  }
+
   // Exit records of the functions of this kind of operation, as "name code", in order.
   std::vector<std::string> steps() {
     static const std::map<std::string, std::string> kNames = {
@@ -304,6 +313,7 @@ TEST_F(Modify, MissingEntryIsAnsweredWith32) {
   platform.file.clear();
   EXPECT_EQ(modify(), 32);
   expect_answered(32);
+  EXPECT_THAT(lines_of_the_handler(), IsEmpty());
 }
 
 class LastRole : public Modify {
@@ -460,6 +470,20 @@ TEST_F(LastRole, ListIsCopiedAgainAfterItWasRewritten) {
   EXPECT_EQ(platform.count("ldap_mods_free"), 2);  // the first copy, and the one that was written
 }
 
+TEST_F(LastRole, FirstCopyGoesBeforeTheSecondIsMade) {
+  EXPECT_EQ(modify(roles_), 0);
+  EXPECT_THAT(platform.calls({"ldcf_api_schema_check", "xlate_utf8_to_localcp", "ldap_mods_free",
+                              "cfg_modify_s"}),
+              ElementsAre(testing::StartsWith("ldcf_api_schema_check("),
+                          "xlate_utf8_to_localcp(\"AuditAdmin\")",
+                          testing::StartsWith("ldcf_api_schema_check("),
+                          "ldap_mods_free(\"list\", 1)", "xlate_utf8_to_localcp(\"AuditAdmin\")",
+                          "xlate_utf8_to_localcp(\"CN=ONE,CN=ADMINGROUP,CN=CONFIGURATION\")",
+                          "cfg_modify_s(session, \"CN=ONE,CN=ADMINGROUP,CN=CONFIGURATION\", \"2 "
+                          "orv-slapdAdminRole=AuditAdmin\")",
+                          "ldap_mods_free(\"list\", 1)"));
+}
+
 TEST_F(LastRole, FailedSecondCopyIsAnswered) {
   platform.fail("xlate_utf8_to_localcp", 2, 21);
   EXPECT_EQ(modify(roles_), 21);
@@ -474,10 +498,12 @@ TEST_F(Modify, CallerWithoutAccessIsAnsweredWith50WhateverTheSchemaSays) {
   as(0x24);
   EXPECT_EQ(modify(), 50);
   expect_answered(50);
+  EXPECT_THAT(lines_of_the_handler(), IsEmpty());
   platform.forget();
   platform.fail("ldcf_api_schema_check", 1, 65);
   EXPECT_EQ(modify(), 50);
   expect_answered(50);
+  EXPECT_THAT(lines_of_the_handler(), IsEmpty());
   EXPECT_EQ(platform.count("ldcf_api_schema_check"), 1);
 }
 
@@ -613,6 +639,7 @@ TEST_F(ModifyBySupplier, OtherEntriesAreRefused) {
     target(dn);
     EXPECT_EQ(modify(add_a_), 50) << dn;
     expect_answered(50);
+    EXPECT_THAT(lines_of_the_handler(), IsEmpty()) << dn;
   }
 }
 
@@ -973,6 +1000,7 @@ TEST_F(ModifyByMember, ObjectClassesAreReleasedAlsoAfterARefusal) {
   EXPECT_THAT(
       platform.calls({"cfg_get_values", "cfg_value_free"}),
       ElementsAre("cfg_get_values(session, record 1, \"OBJECTCLASS\")", "cfg_value_free()"));
+  EXPECT_THAT(lines_of_the_handler(), IsEmpty());
   expect_copy_left();
 }
 
@@ -1017,6 +1045,18 @@ TEST_F(ModifyByMember, ObjectClassesAreReadAndReleased) {
                           "cfg_msgfree(chain)", "cfg_value_free()"));
 }
 
+TEST_F(ModifyByMember, EntryIsReadUnderTheDnOfTheClient) {
+  operation.roles = 0x20;
+  target("CN=K\xC3\xA4SE,CN=CONFIGURATION");
+  EXPECT_EQ(modify(), 0);
+  EXPECT_THAT(platform.calls({"cfg_search_s"}),
+              Contains("cfg_search_s(session, \"CN=K\xC3\xA4SE,CN=CONFIGURATION\", 0, "
+                       "\"(objectclass=*)\", [OBJECTCLASS], 0)"));
+  EXPECT_THAT(platform.calls({"cfg_modify_s"}),
+              ElementsAre("cfg_modify_s(session, \"CN=K\xE4SE,CN=CONFIGURATION\", \"2 "
+                          "description=text\")"));
+}
+
 TEST_F(ModifyByMember, ObjectClassesGoAfterTheirChainAndBeforeTheGroupsOwnRuleReads) {
   target(kOne, {"top"}, {{"orv-slapdAdminDN", {"cn=one"}}});
   EXPECT_EQ(modify({{kReplace, "orv-slapdAdminPW", {{"new"}}}}), 0);
@@ -1036,15 +1076,16 @@ TEST_F(ModifyByMember, EntryThatGoesMeanwhileGives32AndItsLine) {
   platform.file[std::string(kEntry) + "?(objectclass=*)"] = {};
   EXPECT_EQ(modify(), 32);
   expect_answered(32);
-  EXPECT_THAT(platform.debug_lines(),
-              Contains(error("Error - config_back_modify: entry CN=X,CN=CONFIGURATION does not "
-                             "exist!\n")));
+  EXPECT_THAT(lines_of_the_handler(),
+              ElementsAre(error("Error - config_back_modify: entry CN=X,CN=CONFIGURATION does not "
+                                "exist!\n")));
   expect_copy_left();
 }
 
 TEST_F(ModifyByMember, CodeOfTheReaderIsAnswered) {
   operation.roles = 0x20;
-  platform.file[std::string(kEntry) + "?(objectclass=*)"] = {{}, 7};
+  // With a result all the same, which is released.
+  platform.file[std::string(kEntry) + "?(objectclass=*)"] = {{{kEntry, {{"cn", {"x"}}}}}, 7};
   EXPECT_EQ(modify(), 80);
   expect_answered(80);
   expect_copy_left();
@@ -1371,6 +1412,7 @@ TEST_F(Modify, LibrarysNineBecomes32) {
   platform.fail("cfg_modify_s", 1, 9);
   EXPECT_EQ(modify(), 32);
   expect_answered(32);
+  EXPECT_THAT(lines_of_the_handler(), IsEmpty());
   expect_copy_left();
 }
 

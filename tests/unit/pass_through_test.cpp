@@ -142,6 +142,15 @@ TEST_F(AddPassThrough, ParentIsAskedOfTheBackendAndReleased) {
   expect_only_the_session_left();
 }
 
+TEST_F(AddPassThrough, ParentIsThatOfTheNormalisedDn) {
+  make("cn = new, cn = passthrough authentication, cn=configuration",
+       {{"objectClass", {"top", "orv-slapdConfigEntry", "orv-slapdPta"}}});
+  EXPECT_EQ(check(), 0);
+  EXPECT_THAT(platform.calls({"dn_parent_norm"}),
+              ElementsAre("dn_parent_norm(backend, \"CN=NEW,CN=PASSTHROUGH "
+                          "AUTHENTICATION,CN=CONFIGURATION\")"));
+}
+
 TEST_F(AddPassThrough, ParentMatchesInAnyLetterCase) {
   make("CN=NEW,CN=PASSTHROUGH AUTHENTICATION,CN=CONFIGURATION",
        {{"objectClass", {"top", "orv-slapdConfigEntry", "orv-slapdPta"}}});
@@ -242,11 +251,14 @@ TEST_F(PassThrough, UrlIsParsedAndItsDescriptionFreedAtOnce) {
 
 TEST_F(PassThrough, UrlThatDoesNotParseGives21WithMessage179BeforeAnySubtree) {
   make(kEntry, {{"orv-slapdPtaURL", {"nonsense"}}, {"orv-slapdPtaSubtree", {"CN=SCHEMA"}}});
-  platform.fail("ldap_url_parse", 1, 3);
-  EXPECT_EQ(verify(), 21);
-  EXPECT_THAT(platform.calls({"PrintMessage", "xlate_localcp_to_utf8", "ldap_free_urldesc"}),
-              ElementsAre("PrintMessage(0, 8, 179, \"nonsense\")"));
-  EXPECT_THAT(platform.debug_lines(), IsEmpty());
+  for (const int answer : {-1, 1, 3}) {
+    platform.forget();
+    platform.fail("ldap_url_parse", 1, answer);
+    EXPECT_EQ(verify(), 21) << answer;
+    EXPECT_THAT(platform.calls({"PrintMessage", "xlate_localcp_to_utf8", "ldap_free_urldesc"}),
+                ElementsAre("PrintMessage(0, 8, 179, \"nonsense\")"));
+    EXPECT_THAT(platform.debug_lines(), IsEmpty());
+  }
 }
 
 TEST_F(PassThrough, UrlWithoutAValueIsNotParsed) {
@@ -688,6 +700,15 @@ TEST_F(PassThrough, MappingsFirstValueIsVerifiedLast) {
               ElementsAre("ldap_url_parse(\"ldap://a\")", kSearch,
                           "verifyAttributeMapping(\"a=b\", null, null)"));
   EXPECT_EQ(verify(), 0);
+}
+
+TEST_F(PassThrough, CodeOfTheMappingIsReturnedWhateverItIs) {
+  make_with("orv-slapdPtaAttrMapping", {"a=b"});
+  for (const int code : {-1, 1, 53, 80, 90}) {
+    platform.forget();
+    platform.fail("verifyAttributeMapping", 1, code);
+    EXPECT_EQ(verify(), code);
+  }
 }
 
 TEST_F(PassThrough, SubtreesAreReleasedAfterTheMapping) {

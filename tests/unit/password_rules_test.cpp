@@ -407,6 +407,18 @@ TEST_F(NewPassword, WithoutAnEntryGives32) {
   EXPECT_EQ(platform.count("verify_admin_password"), 0);
 }
 
+TEST_F(NewPassword, ResultThatCannotBeCountedHoldsNoEntry) {
+  platform.fail("cfg_count_entries", 1, -1);
+  EXPECT_EQ(replace(kTop), 32);
+  EXPECT_EQ(platform.count("cfg_get_values"), 0);
+  supplier({{kMasterPassword, {"old"}}, {"orv-slapdMasterDN", {"cn=s"}}});
+  platform.forget();
+  platform.fail("cfg_count_entries", 0, -1);
+  EXPECT_EQ(replace(kSupplierEntry, kMasterPassword), 32);
+  EXPECT_EQ(platform.count("cfg_search_s"), 2);
+  EXPECT_EQ(platform.count("cfg_get_values"), 0);
+}
+
 TEST_F(NewPassword, SearchThatFailsGivesItsCode) {
   platform.file[kTop].code = 3;  // with its entry
   EXPECT_EQ(replace(kTop), 3);
@@ -483,6 +495,14 @@ TEST_F(NewPassword, CopiesThatCannotBeMadeGive90) {
 TEST_F(NewPassword, ReplaceByNothingGives90) {
   EXPECT_EQ(check(kTop, {{kReplace, kAdminPassword, std::nullopt}}), 90);
   EXPECT_EQ(check(kTop, {{kReplace, kAdminPassword, {{}}}}), 90);
+}
+
+TEST_F(NewPassword, EmptyOneIsVerifiedLikeAnyOther) {
+  platform.fail("verify_admin_password", 1, 19);
+  EXPECT_EQ(check(kTop, {{kReplace, kAdminPassword, {{""}}}}), 19);
+  EXPECT_THAT(platform.calls({"verify_admin_password"}),
+              ElementsAre("verify_admin_password(\"\", \"old\", operation)"));
+  EXPECT_EQ(record.changed, 0);
 }
 
 TEST_F(NewPassword, OnlyTheFirstValueIsUsedInEitherForm) {
@@ -791,6 +811,30 @@ TEST_F(PasswordMethod, TextThatCannotBeMadeLeavesTheCodeAlone) {
   EXPECT_EQ(replace("known"), "53");
 }
 
+TEST_F(PasswordMethod, TextIsLeftAloneWithoutARefusal) {
+  char before[] = "before";
+  const auto expect_left_alone = [&](int code, const char* dn) {
+    ldapmod* const mods = scripted::make_modifications({{code, kEncryption, {{"known"}}}});
+    char* text = before;
+    EXPECT_EQ(traced(0x01031400,
+                     [&] {
+                       return checkPwEncryptionModify(&operation, connection.config_session, dn,
+                                                      mods, &text);
+                     }),
+              0);
+    EXPECT_EQ(text, before);
+    free_ldmll(mods);
+  };
+  expect_left_alone(kReplace, "CN=X,CN=CONFIGURATION");
+  expect_left_alone(kDelete, kTop);
+  expect_left_alone(kReplace, kTop);  // the directory backend has nothing to say
+  platform.localhost_backend = nullptr;
+  expect_left_alone(kReplace, kTop);
+  g_safe_mode = 1;
+  expect_left_alone(kReplace, kTop);
+  EXPECT_EQ(g_staged.size(), 1U);
+}
+
 TEST_F(PasswordMethod, NullArgumentsGive80) {
   ldapmod* const mods = scripted::make_modifications({{kReplace, kEncryption, {{"known"}}}});
   _CFG* const session = connection.config_session;
@@ -855,9 +899,12 @@ TEST_F(PasswordMethod, IsNotHandedOnWhenSafeModeBeginsMeanwhile) {
 }
 
 TEST_F(PasswordMethod, PassesWhereNobodyTakesIt) {
-  platform.fail("getAllPluginFuncs", 1, 80);  // which hands a list out all the same
-  EXPECT_EQ(replace("known"), "0");
-  EXPECT_THAT(g_staged, IsEmpty());
+  for (const int answer : {-1, 80}) {
+    platform.forget();
+    platform.fail("getAllPluginFuncs", 1, answer);  // which hands a list out all the same
+    EXPECT_EQ(replace("known"), "0") << answer;
+    EXPECT_THAT(g_staged, IsEmpty()) << answer;
+  }
   platform.plugin_functions = nullptr;
   EXPECT_EQ(replace("known"), "0");
   functions[0] = nullptr;
