@@ -711,6 +711,8 @@ int normal_form(const char* local_dn, MallocText& dn) {
 
 // ---- The subtrees of an entry
 
+// Taken to be in the file's code page, though those of an added entry are UTF-8: where the two
+// differ the server lets only ASCII pass for this type.
 int normalize_subtrees(const attr& a, ValueList& subtrees) {
   const std::size_t count = count_values(a);
   subtrees.reset(static_cast<char**>(std::calloc(count + 1, sizeof(char*))));

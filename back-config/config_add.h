@@ -2,8 +2,8 @@
 //
 // All functions are called inside an operation; those that read the configuration file use its
 // session and take no lock. DNs named "normalized" are in the normal form and are compared byte for
-// byte. Results are 0 to go on, or the code that ends the operation; the reason of a refusal is
-// told in the trace only.
+// byte. Results are 0 to go on, or the code that ends the operation; the client is told no reason
+// by these functions, and the trace or the server log has it where a rule gives one.
 #pragma once
 
 #include "slapi/connection.h"

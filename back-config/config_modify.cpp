@@ -453,7 +453,8 @@ struct RoleChanges {
 // The server's lists always hold counted values.
 //
 // Each value is checked on the one at its place in the first modification of roles, which is the
-// modification itself when there is only one; where that is shorter, on itself.
+// modification itself when there is only one; where that is shorter, on itself. A value that is no
+// role gives 80 without a text; on an add it is 21, of which the handler makes 80 with a text.
 int check_role_values(const ldtr_function_local& trace, berval** first, const ldapmod& m,
                       RoleChanges& changes) {
   const std::size_t length = count_of(first);

@@ -4,8 +4,9 @@
 // "normalized" are in the normal form. Lists of modifications are the server's: linked through
 // `mod_next`, with the flag kModBvalues masked off wherever a code is looked at. Of several values
 // only the first counts, unless a function says otherwise. Results are 0 to go on, or the code that
-// ends the operation; the reason of a refusal is told in the trace only, but for those texts that a
-// function hands out (malloc family, released by the caller).
+// ends the operation; the client is told no reason but those texts that a function hands out
+// (malloc family, released by the caller), and the trace or the server log has it where a rule
+// gives one.
 #pragma once
 
 #include "slapi/connection.h"
@@ -64,7 +65,10 @@ int checkIfAdminGroupCanModify(Connection* connection, const char* normalized_dn
 int checkRootAdminModify(_CFG* session, const char* normalized_dn, ldapmod* modifications);
 
 // The identities of the primary administrator in their own entries: 50 for everybody else, also to
-// delete them; 80 not a Kerberos identity, or no value. A delete is not looked at any further.
+// delete them; 80 not a Kerberos identity, or no value. A delete is not looked at any further. Only
+// the first modification of the type counts, whatever its code, so that a delete in front hides an
+// add behind it; the server hands over only lists on which this makes no difference
+// (docs/guards.md).
 int checkKerberosModify(Operation* operation, _CFG* session, const char* normalized_dn,
                         ldapmod* modifications);
 int checkDigestModify(Operation* operation, _CFG* session, const char* normalized_dn,
@@ -76,8 +80,8 @@ int checkDigestModify(Operation* operation, _CFG* session, const char* normalize
 int checkReplSupplierModify(Connection* connection, _CFG* session, const char* normalized_dn,
                             ldapmod* modifications);
 
-// The name of a proxy split: 21 not alphanumeric; 68, which is also told in the server log. The DN
-// is not used, but must not be null.
+// The name of a proxy split: 21 not alphanumeric; 68, which is also told in the server log. Only
+// the first modification of the type counts, as above. The DN is not used, but must not be null.
 int checkProxyNameModify(_CFG* session, const char* normalized_dn, ldapmod* modifications);
 
 // Whether some modification is of that type, in any letter case: 1 or 0. And the first of them, or

@@ -73,6 +73,7 @@ inline bool begins_with(const char* value, const char* prefix) {
   return value != nullptr && strncasecmp(value, prefix, std::strlen(prefix)) == 0;
 }
 
+// 80 for a wrong form. Not the code of a bad syntax: clients know this one.
 inline int check_kerberos_identity(const ldtr_function_local& trace, _CFG* session,
                                    const char* value, const char* bad_form) {
   if (begins_with(value, config_names::kerberos_prefix) ||
