@@ -156,6 +156,13 @@ TEST_F(AddAuthority, NormalisedDnIsComparedWithoutRegardToLetterCase) {
   EXPECT_EQ(authority(), 0);
 }
 
+TEST_F(AddAuthority, DnThatOnlyBeginsWithAProtectedOneIsOrdinary) {
+  for (const char* dn : {"CN=AUDIT,CN=LOG MANAGEMENT,CN=CONFIGURATION,O=X",
+                         "CN=MASTER SERVER,CN=CONFIGURATION,O=X"}) {
+    expect_roles(dn, {"top"}, [](unsigned roles) { return (roles & 0x20) != 0; });
+  }
+}
+
 TEST_F(AddAuthority, LeavesAnExitRecord) {
   make(kEntry, {});
   trcEvents = kTraceExit;
@@ -364,6 +371,17 @@ TEST_F(Translation, LastValueThatFailsGivesItsCodeWithTheWholeList) {
   platform.fail("xlate_utf8_to_localcp", 2, 21);
   EXPECT_EQ(translate(), 21);
   EXPECT_EQ(text(), "<null>|cn=a" + std::string(1, '\0') + "|sn=<null 0>");
+  clean();
+}
+
+TEST_F(Translation, ConversionThatTouchesNoResultLeavesNullAndLengthZero) {
+  make(kEntry, {{"cn", {"a", "b"}}});
+  platform.results_left_alone = true;
+  platform.fail("xlate_utf8_to_localcp", 1, 21);
+  EXPECT_EQ(translate(), 0);
+  EXPECT_EQ(list->values[0]->bv_val, nullptr);
+  EXPECT_EQ(list->values[0]->bv_len, 0U);
+  EXPECT_STREQ(list->values[1]->bv_val, "b");
   clean();
 }
 

@@ -118,6 +118,15 @@ TEST_F(DeleteAuthority, FoundWithoutARecordGives32AndItsLine) {
   EXPECT_EQ(platform.count("cfg_msgfree"), 1);
 }
 
+TEST_F(DeleteAuthority, FoundWithoutARecordGives32WithoutTheTraceToo) {
+  debug_off();
+  platform.file[kEntry] = {};
+  EXPECT_EQ(authority_over(kEntry), 32);
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
+  EXPECT_EQ(platform.count("cfg_get_values"), 0);
+  EXPECT_EQ(platform.count("cfg_msgfree"), 1);
+}
+
 TEST_F(DeleteAuthority, EntryWithoutObjectClassesGives16) {
   platform.file[kEntry] = {{{kEntry, {{"cn", {"x"}}}}}};
   EXPECT_EQ(authority_over(kEntry), 16);
@@ -214,6 +223,14 @@ TEST_F(DeleteAuthority, EntriesBelowANamedOneAreOrdinary) {
   expect_roles(dn, [](unsigned roles) { return (roles & 0x20) != 0; });
 }
 
+TEST_F(DeleteAuthority, DnThatOnlyBeginsWithANamedOneIsOrdinary) {
+  for (const char* dn : {"CN=AUDIT,CN=LOG MANAGEMENT,CN=CONFIGURATION,O=X",
+                         "CN=MASTER SERVER,CN=CONFIGURATION,O=X"}) {
+    entry_of_file(dn);
+    expect_roles(dn, [](unsigned roles) { return (roles & 0x20) != 0; });
+  }
+}
+
 TEST_F(DeleteAuthority, MemberWithServerConfigurationOnlyMayDeleteReplicationButNotTheMaster) {
   entry_of_file(kReplication);
   entry_of_file(kMaster);
@@ -266,6 +283,15 @@ TEST_F(Monitor, WithoutItsMutexIsSilentWithALine) {
   EXPECT_EQ(ask(), 0);
   EXPECT_THAT(platform.debug_lines(),
               ElementsAre(error("Failed to acquire lock on monitor mutex, rc=22.\n")));
+  EXPECT_EQ(platform.count("pthread_mutex_unlock"), 0);
+}
+
+TEST_F(Monitor, WithoutItsMutexIsSilentWithoutTheTraceToo) {
+  debug_off();
+  monitor.begin(9);
+  platform.fail("pthread_mutex_lock", 1, 22);
+  EXPECT_EQ(ask(), 0);
+  EXPECT_THAT(platform.debug_lines(), IsEmpty());
   EXPECT_EQ(platform.count("pthread_mutex_unlock"), 0);
 }
 
@@ -471,8 +497,11 @@ TEST_F(Delete, AuthorityOverTheOwnBackendComesBeforeItsRule) {
 }
 
 TEST_F(Delete, EntriesBesideTheOwnBackendMayGo) {
-  target("CN=X,CN=CONFIGDB,CN=CONFIG BACKENDS,CN=ORV DIRECTORY,CN=SCHEMAS,CN=CONFIGURATION");
-  EXPECT_EQ(remove(), 0);
+  for (const std::string& dn :
+       {std::string("CN=X,") + kOwnBackend, std::string(kOwnBackend) + ",O=X"}) {
+    target(dn.c_str());
+    EXPECT_EQ(remove(), 0) << dn;
+  }
 }
 
 TEST_F(Delete, AdministratorsAreForThePrimaryAdministratorOnly) {
@@ -500,10 +529,10 @@ TEST_F(Delete, AdministratorsAreForThePrimaryAdministratorOnly) {
 TEST_F(Delete, KerberosAndDigestAreRecognisedAsWholeDnsAndByteForByte) {
   as(kGroupMember);
   operation.roles = 0x20;
-  for (const char* dn :
-       {"cn=kerberos,cn=configuration", "CN=KERBEROS,CN=CONFIGURATION,O=X",
-        "CN=X,CN=KERBEROS,CN=CONFIGURATION", "cn=digest,cn=configuration",
-        "CN=X,CN=DIGEST,CN=CONFIGURATION", "CN=A,cn=admingroup,CN=CONFIGURATION"}) {
+  for (const char* dn : {"cn=kerberos,cn=configuration", "CN=KERBEROS,CN=CONFIGURATION,O=X",
+                         "CN=X,CN=KERBEROS,CN=CONFIGURATION", "cn=digest,cn=configuration",
+                         "CN=DIGEST,CN=CONFIGURATION,O=X", "CN=X,CN=DIGEST,CN=CONFIGURATION",
+                         "CN=A,cn=admingroup,CN=CONFIGURATION"}) {
     target(dn);
     EXPECT_EQ(remove(), 0) << dn;
   }
@@ -570,6 +599,14 @@ TEST_F(Delete, EntryIsReadAndKeptBeforeItGoesWhileSomebodyListens) {
                           "pthread_mutex_unlock(configMutex)"));
   ASSERT_NE(kept(), nullptr);
   EXPECT_STREQ(kept()->requested_dn, kEntry);
+  entry_free(kept());
+}
+
+TEST_F(Delete, EntryIsKeptHoweverManyListen) {
+  somebody_listens();
+  monitor.begin(9);
+  EXPECT_EQ(remove(), 0);
+  ASSERT_NE(kept(), nullptr);
   entry_free(kept());
 }
 

@@ -457,12 +457,15 @@ TEST_F(RetrieveEntry, CodeOfTheSearchIsNotLookedAtWhenThereIsAnEntry) {
 
 TEST_F(RetrieveEntry, ErrorNumberAtTheFirstRecordComesBackUnchanged) {
   platform.file["CN=X"] = {{{"CN=X", {}}}};
-  platform.fail("cfg_first_entry", 1, 53);
-  EXPECT_EQ(retrieve(), 53);
-  EXPECT_THAT(platform.calls({"cfg_perror", "cfg_msgfree"}),
-              ElementsAre("cfg_perror(session, \"retrieve_entry: cfg_first_entry\")",
-                          "cfg_msgfree(chain)"));
-  EXPECT_THAT(platform.debug_lines(), IsEmpty());
+  for (const int number : {53, -1}) {
+    platform.forget();
+    platform.fail("cfg_first_entry", 1, number);
+    EXPECT_EQ(retrieve(), number);
+    EXPECT_THAT(platform.calls({"cfg_perror", "cfg_msgfree"}),
+                ElementsAre("cfg_perror(session, \"retrieve_entry: cfg_first_entry\")",
+                            "cfg_msgfree(chain)"));
+    EXPECT_THAT(platform.debug_lines(), IsEmpty());
+  }
 }
 
 TEST_F(RetrieveEntry, ErrorNumberAtTheFirstRecordIsReportedAlsoWithoutTheDebugBit) {

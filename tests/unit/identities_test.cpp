@@ -116,6 +116,26 @@ TEST_F(Identities, AttributeNamesMatchInAnyLetterCase) {
   EXPECT_EQ(admin_dn() + kerberos_id() + digest_user() + member_dn(), "CN=ACN=BCCN=D");
 }
 
+TEST_F(Identities, AttributeNamesMatchAsAWhole) {
+  file(kConfiguration, {{"orv-slapdAdminDNX", {"CN=X", "CN=Z"}},
+                        {"orv-slapdAdminD", {"CN=Y"}},
+                        {"orv-slapdAdminPWX", {"shown"}},
+                        {"orv-slapdAdminP", {"this too"}}});
+  file(kKerberos, {{"orv-slapdKrbAdminDNX", {"CN=X"}}, {"orv-slapdKrbAdminD", {"CN=Y"}}});
+  file(kDigest, {{"orv-slapdDigestAdminUserX", {"x"}}, {"orv-slapdDigestAdminUse", {"y"}}});
+  file(kMember, {{"orv-slapdAdminDNX", {"CN=X"}}, {"orv-slapdAdminD", {"CN=Y"}}});
+  EXPECT_EQ(admin_dn(), "null");
+  EXPECT_EQ(last_line(), error("Retrieving orv-slapdAdminDN FAILED rc = 0\n"));
+  EXPECT_THAT(platform.debug_lines(), Not(Contains(error("Error: more then one admin DN "))));
+  EXPECT_THAT(platform.debug_lines(), Contains(detail("orv-slapdAdminPWX: shown\n")));
+  EXPECT_THAT(platform.debug_lines(), Contains(detail("orv-slapdAdminP: this too\n")));
+  EXPECT_EQ(kerberos_id(), "null");
+  EXPECT_EQ(last_line(), error("Retrieving orv-slapdKrbAdminDN FAILED rc = 0\n"));
+  EXPECT_EQ(digest_user(), "null");
+  EXPECT_EQ(last_line(), error("Retrieving orv-slapdDigestAdminUser FAILED rc = 0\n"));
+  EXPECT_EQ(member_dn(), "null");
+}
+
 TEST_F(Identities, WalkReadsAndReleasesInOrder) {
   file(kConfiguration, {{"cn", {"x"}}, {"orv-slapdAdminDN", {"CN=A"}}, {"sn", {"y"}}});
   EXPECT_EQ(admin_dn(), "CN=A");
@@ -146,17 +166,20 @@ TEST_F(Identities, ValuesAreReleasedAfterTheWalkHasAdvanced) {
                           "free(values)", "cfg_memfree(\"CN=CONFIGURATION\")"));
 }
 
+// The values that were being visited go after the line of the step that failed.
 TEST_F(Identities, IdentityThatIsDiscardedIsReleasedAfterItsLine) {
   file(kConfiguration, {{"orv-slapdAdminDN", {"CN=A"}}, {"cn", {"x"}}});
+  platform.name_allocation(4, "values");
   platform.name_allocation_in("replace_DN", 1, "made");
   platform.fail("cfg_next_attribute", 1, 80);
   EXPECT_EQ(admin_dn(), "null");
   const std::vector<std::string> story =
       platform.story({"cfg_ber_free", "cfg_msgfree", "cfg_memfree", "free"});
-  ASSERT_GT(story.size(), 5U);
+  ASSERT_GT(story.size(), 8U);
   EXPECT_THAT(
-      std::vector<std::string>(story.end() - 5, story.end()),
-      ElementsAre("cfg_ber_free(cursor)", "cfg_msgfree(chain)", "cfg_memfree(\"CN=CONFIGURATION\")",
+      std::vector<std::string>(story.end() - 8, story.end()),
+      ElementsAre("debug: cfg_first_attribute error ! \n", "free(one of values)", "free(values)",
+                  "cfg_ber_free(cursor)", "cfg_msgfree(chain)", "cfg_memfree(\"CN=CONFIGURATION\")",
                   "debug: Retrieving orv-slapdAdminDN FAILED rc = 1\n", "free(made)"));
 }
 
@@ -252,6 +275,12 @@ TEST_F(Identities, FailedSearchGivesNullAndItsCode) {
   platform.fail("cfg_search_s", 3, 80);
   EXPECT_EQ(kerberos_id(), "null");
   EXPECT_EQ(last_line(), error("Retrieving orv-slapdKrbAdminDN FAILED rc = 80\n"));
+
+  platform.forget();
+  platform.fail("cfg_search_s", 1, -1);
+  EXPECT_EQ(admin_dn(), "null");
+  EXPECT_THAT(platform.debug_lines(),
+              ElementsAre(error("Retrieving orv-slapdAdminDN FAILED rc = -1\n")));
 }
 
 TEST_F(Identities, EntryWhoseDnCannotBeReadGives90) {
@@ -505,6 +534,19 @@ TEST_F(Identities, MemberWhoseEntryCannotBeTakenIsReported) {
     EXPECT_THAT(platform.calls({"cfg_perror"}),
                 ElementsAre("cfg_perror(session, \"cfg_first_entry\")"));
     expect_released_and_free_of_locks();
+  }
+}
+
+TEST_F(Identities, MemberWhoseEntryCannotBeTakenIsReportedWithoutTheTraceToo) {
+  debug_off();
+  file(kMember, {{"orv-slapdAdminDN", {"CN=M"}}});
+  for (const int code : {1, 0}) {
+    platform.forget();
+    platform.fail("cfg_first_entry", 1, code);
+    EXPECT_EQ(member_dn(), "null");
+    EXPECT_THAT(platform.calls({"cfg_perror"}),
+                ElementsAre("cfg_perror(session, \"cfg_first_entry\")"));
+    EXPECT_THAT(platform.debug_lines(), IsEmpty());
   }
 }
 

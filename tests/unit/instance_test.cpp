@@ -177,6 +177,25 @@ TEST_F(Instance, EmptyLinkWithTheErrorNumberOfAPlainFileIsTakenForOne) {
   release_state();
 }
 
+TEST_F(Instance, LinkOfOneByteIsNotTakenForAPlainFile) {
+  errno = EINVAL;
+  platform.link_target = "a";
+  EXPECT_EQ(start("/b"), 0);
+  EXPECT_STREQ(made().config_file, "a");
+  EXPECT_STREQ(made().save_file, "a.save");
+  EXPECT_THAT(platform.debug_lines(),
+              ElementsAre(detail("Readlink rc: 1\nPath:a\n"), detail("Save file name: a.save\n")));
+  release_state();
+}
+
+TEST_F(Instance, PathOfOneByteStarts) {
+  platform.link_errno = EINVAL;
+  EXPECT_EQ(start("c"), 0);
+  EXPECT_STREQ(made().config_file, "c");
+  EXPECT_STREQ(made().save_file, "c.save");
+  release_state();
+}
+
 TEST_F(Instance, LongestPathThatFitsStarts) {
   platform.link_errno = EINVAL;
   const std::string path(4095, 'p');
@@ -351,11 +370,14 @@ TEST_F(Closing, IgnoresThatTheMutexIsBusy) {
 }
 
 TEST_F(Closing, UnreadableBackendGivesMinusOne) {
-  platform.fail("slapi_pblock_get", 1, -1);
-  EXPECT_EQ(close(), -1);
-  EXPECT_THAT(platform.debug_lines(), ElementsAre(info("calling config_close...\n"),
-                                                  info("config_close: Could not get backend\n")));
-  EXPECT_EQ(platform.count("pthread_mutex_destroy"), 0);
+  for (const int code : {-1, 1}) {
+    platform.forget();
+    platform.fail("slapi_pblock_get", 1, code);
+    EXPECT_EQ(close(), -1);
+    EXPECT_THAT(platform.debug_lines(), ElementsAre(info("calling config_close...\n"),
+                                                    info("config_close: Could not get backend\n")));
+    EXPECT_EQ(platform.count("pthread_mutex_destroy"), 0);
+  }
 }
 
 TEST_F(Closing, NullBackendGives17) {

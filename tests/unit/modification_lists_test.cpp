@@ -125,6 +125,18 @@ TEST_F(ListForTheFile, CodeOfTheConversionComesBackAndTheRecordStays) {
   EXPECT_THAT(records(), ElementsAre("0 cn=a", "1 cn="));
 }
 
+TEST_F(ListForTheFile, ConversionThatTouchesNoResultLeavesTheValuesTerminated) {
+  platform.results_left_alone = true;
+  platform.fail("xlate_utf8_to_localcp", 1, 21);
+  EXPECT_EQ(add(0, "cn", "a"), 21);
+  EXPECT_THAT(records(), ElementsAre("0 cn="));
+  EXPECT_EQ(add(0, "cn", "a"), 0);
+  platform.forget();
+  platform.fail("xlate_utf8_to_localcp", 1, 21);
+  EXPECT_EQ(add(0, "cn", "b"), 21);
+  EXPECT_THAT(records(), ElementsAre("0 cn=a"));
+}
+
 // What is in the list after the n-th allocation failed, and what was told.
 TEST_F(ListForTheFile, EachAllocationOfANewRecordFailsWithItsText) {
   const struct {
@@ -267,7 +279,7 @@ TEST_F(ChangedEntry, ReplaceOfAnAttributeThatIsMissingSucceeds) {
 }
 
 TEST_F(ChangedEntry, ReplaceThatCannotRemoveAddsNothing) {
-  for (const auto& [given, code] : {std::pair{-1, 1}, {80, 80}, {2, 2}}) {
+  for (const auto& [given, code] : {std::pair{-1, 1}, {-2, -2}, {80, 80}, {2, 2}}) {
     platform.forget();
     platform.fail("attr_delete", 1, given);
     EXPECT_EQ(apply({{kReplace, "cn", {{"c"}}}}), code);
@@ -281,7 +293,7 @@ TEST_F(ChangedEntry, AddWithoutValuesIsPassedOver) {
 }
 
 TEST_F(ChangedEntry, CodeOfTheMergeComesBackAndMinusOneIsOne) {
-  for (const auto& [given, code] : {std::pair{-1, 1}, {20, 20}, {90, 90}}) {
+  for (const auto& [given, code] : {std::pair{-1, 1}, {-2, -2}, {20, 20}, {90, 90}}) {
     platform.forget();
     platform.fail("attr_merge", 1, given);
     EXPECT_EQ(apply({{kAdd, "cn", {{"c"}}}}), code);
@@ -433,12 +445,14 @@ TEST_F(ChangeCheck, ResultThatCannotBeCountedHoldsNoEntry) {
 TEST_F(ChangeCheck, EntryThatCannotBeTakenGives80AndIsReported) {
   for (const std::uint32_t debug : {kTraceDebug, 0U}) {
     trcEvents = debug;
-    platform.forget();
-    platform.fail("cfg_first_entry", 1, 5);
-    EXPECT_EQ(check({}), 80);
-    EXPECT_THAT(platform.calls({"cfg_perror", "CFGMessage2Entry", "cfg_msgfree"}),
-                ElementsAre("cfg_perror(session, \"cfg_first_entry\")", "cfg_msgfree(chain)"));
-    EXPECT_THAT(platform.debug_lines(), IsEmpty());
+    for (const int number : {5, -1}) {
+      platform.forget();
+      platform.fail("cfg_first_entry", 1, number);
+      EXPECT_EQ(check({}), 80);
+      EXPECT_THAT(platform.calls({"cfg_perror", "CFGMessage2Entry", "cfg_msgfree"}),
+                  ElementsAre("cfg_perror(session, \"cfg_first_entry\")", "cfg_msgfree(chain)"));
+      EXPECT_THAT(platform.debug_lines(), IsEmpty());
+    }
   }
 }
 

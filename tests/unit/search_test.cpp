@@ -65,7 +65,7 @@ TEST_F(SearchAuthority, MarkedCallerOnServerOfKindThreeIsJudgedByItsFlags) {
 }
 
 TEST_F(SearchAuthority, MarkerDoesNotMatterOnOtherServers) {
-  for (const int kind : {0, 1, 2}) {
+  for (const int kind : {0, 1, 2, 4, -1}) {
     g_srvType = kind;
     EXPECT_EQ(authority_of(kPrimary), 0);
   }
@@ -214,6 +214,21 @@ TEST_F(Sending, ErrorAtTheNextEntryIsReportedAndEndsTheEntries) {
   EXPECT_THAT(platform.calls({"cfg_perror"}),
               ElementsAre("cfg_perror(session, \"cfg_next_entry\")"));
   EXPECT_EQ(final_result(), "send_search_result(connection, operation, 0, null, null, 1)");
+}
+
+TEST_F(Sending, ErrorsOfTheWalkAreReportedWithoutTheTraceToo) {
+  debug_off();
+  found({{"cn=a", {}}, {"cn=b", {}}});
+  for (const char* function : {"cfg_first_entry", "cfg_next_entry"}) {
+    SCOPED_TRACE(function);
+    platform.forget();
+    platform.fail(function, 1, 1);
+    EXPECT_EQ(send(), 0);
+    EXPECT_THAT(platform.calls({"cfg_perror"}),
+                ElementsAre("cfg_perror(session, \"" + std::string(function) + "\")"));
+    EXPECT_THAT(platform.debug_lines(), IsEmpty());
+    if (function == std::string("cfg_first_entry")) cfg_msgfree(chain);  // kept there
+  }
 }
 
 TEST_F(Sending, SenderThatRefusesEndsTheSearchAndItsEntryCounts) {

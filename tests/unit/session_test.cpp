@@ -16,6 +16,25 @@ class Session : public BackendTest {
   void end() {
     platform.run([&] { config_end(&state); });
   }
+  // Opens, with a bind that fails with 81, and looks at everything that is done from the bind on.
+  void expect_failed_bind_told_in_its_order() {
+    platform.fail("cfg_bind_s", 1, 81);
+    EXPECT_EQ(open(), 1);
+    const auto told =
+        platform.story({"cfg_bind_s", "cfg_set_option", "cfg_get_option", "cfg_dump_exception"});
+    ASSERT_GT(told.size(), 10U);
+    EXPECT_THAT(
+        std::vector<std::string>(std::next(told.begin(), 10), told.end()),
+        ElementsAre("cfg_bind_s(session, null, null, 128)",
+                    "stderr: Binding to config failed! rc = 81 \n",
+                    "stderr: Turn on ldtrc for detail errors\n", "debug: unable to bind! \n",
+                    "cfg_set_option(session, 1001, 1)", "cfg_set_option(session, 1002, 1)",
+                    "cfg_get_option(session, 1005)", "cfg_dump_exception(session)",
+                    "debug: line 7, column 3: not an attribute\n",
+                    "debug: Error using filename : /file/in/use\n"));
+    for (const DebugLine& line : platform.debug_lines()) EXPECT_EQ(line.category, 0xC80D0000U);
+    rest();
+  }
   // Gives back what a test's session left.
   void rest() {
     if (connection.config_session != nullptr) close_session();
@@ -181,28 +200,25 @@ TEST_F(Session, NullHandleIsStoredAndGives90WithTheLockHeld) {
 }
 
 TEST_F(Session, FailedBindGives1AndKeepsHandleAndLock) {
-  platform.fail("cfg_bind_s", 1, 90);
-  EXPECT_EQ(open(), 1);
-  EXPECT_TRUE(locked());
-  EXPECT_NE(connection.config_session, nullptr);
-  rest();
+  for (const int code : {90, -1}) {
+    platform.forget();
+    platform.fail("cfg_bind_s", 1, code);
+    EXPECT_EQ(open(), 1);
+    EXPECT_TRUE(locked());
+    EXPECT_NE(connection.config_session, nullptr);
+    EXPECT_EQ(platform.standard_error(), "Binding to config failed! rc = " + std::to_string(code) +
+                                             " \nTurn on ldtrc for detail errors\n");
+    rest();
+  }
 }
 
 TEST_F(Session, FailedBindIsToldInItsOrder) {
-  platform.fail("cfg_bind_s", 1, 81);
-  EXPECT_EQ(open(), 1);
-  const auto told =
-      platform.story({"cfg_bind_s", "cfg_set_option", "cfg_get_option", "cfg_dump_exception"});
-  EXPECT_THAT(std::vector<std::string>(std::next(told.begin(), 10), told.end()),
-              ElementsAre("cfg_bind_s(session, null, null, 128)",
-                          "stderr: Binding to config failed! rc = 81 \n",
-                          "stderr: Turn on ldtrc for detail errors\n", "debug: unable to bind! \n",
-                          "cfg_set_option(session, 1001, 1)", "cfg_set_option(session, 1002, 1)",
-                          "cfg_get_option(session, 1005)", "cfg_dump_exception(session)",
-                          "debug: line 7, column 3: not an attribute\n",
-                          "debug: Error using filename : /file/in/use\n"));
-  for (const DebugLine& line : platform.debug_lines()) EXPECT_EQ(line.category, 0xC80D0000U);
-  rest();
+  expect_failed_bind_told_in_its_order();
+}
+
+TEST_F(Session, FailedBindIsToldInItsOrderAlsoWhereNoOptionIsTaken) {
+  platform.fail("cfg_set_option", 0, 1);
+  expect_failed_bind_told_in_its_order();
 }
 
 TEST_F(Session, FailedBindIsToldOnStandardErrorWithoutTraceButNotDumped) {

@@ -145,7 +145,7 @@ class Platform {
   bool empty_lists_are_null = false;  // entries have a null list where there are no values
   bool keeps_letter_case = false;     // replace_DN does not fold
   bool failed_text_is_left = false;   // a conversion that fails by the script gives a text as well
-  bool results_left_alone = false;    // such a conversion does not touch its results
+  bool results_left_alone = false;    // such a conversion touches no result
   bool real_mutexes = false;          // mutexes are taken, and not only modelled
   bool admin_policy = false;          // pwdIsAdminPolicyOn()
   bool password_is_overwritten = false;  // verify_admin_password leaves nothing of a new one

@@ -191,8 +191,10 @@ namespace {
 
 int convert(const Call& call, const char* text, const char* from, const char* to, char** result,
             std::size_t* length) {
-  *result = nullptr;
-  *length = 0;
+  if (!call.failure() || !platform().results_left_alone) {
+    *result = nullptr;
+    *length = 0;
+  }
   const auto failure = call.failure_or_no_memory();
   if (failure && !(call.failure() && platform().failed_text_is_left)) return *failure;
   std::string converted = text;
