@@ -50,8 +50,11 @@ struct Identity {
   const char* attribute;
   Take take;
   SecondValue second_value = SecondValue::ignored;
-  const char* untraced = nullptr;  // attribute whose values stay out of the trace
-  bool announced = true;           // each attribute is traced before its values are read
+  // Attribute whose values are not traced. Only the look-up of the administrator's DN leaves the
+  // password out; elsewhere the trace's writer masks it.
+  const char* untraced = nullptr;
+  // Each attribute is traced before its values are read.
+  bool announced = true;
   const char* value_text = trace::name_and_value;  // how each value is traced
 };
 

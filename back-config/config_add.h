@@ -127,9 +127,9 @@ int checkForRep(entry* e);
 // Makes a list of attributes with their values in the local code page, in the same order, for
 // `cleanup_attrs`. Names are shared with `source`; lengths of values count the NUL.
 // The result is that of the **last** value: one that failed before it is passed on as it is (null).
-// 90, with no list, when there is no memory for an array, a record, or the text of the last value.
-// Without memory for an attribute the list ends before it and the result is that of the last value
-// before.
+// 90, with no list, when there is no memory for an array of values, a value, or the text of the
+// last value. Without memory for an attribute the list ends before it and the result is that of the
+// last value before.
 int xlate_attrs(attr* source, attr** result);
 
 // Releases such a list and makes it empty; a null argument is a no-op. Returns 0.

@@ -19,7 +19,7 @@ namespace orv {
 namespace {
 
 constexpr std::size_t kPathBuffer = 4096;
-constexpr std::size_t kLongestLink = 4086;  // leaves room for the suffix of the save file
+constexpr std::size_t kLongestLink = 4086;  // of a longer link only that much is read
 constexpr const char* kSaveSuffix = ".save";
 constexpr std::size_t kSaveSuffixRoom = 6;  // with the NUL
 
@@ -104,13 +104,13 @@ int config_back_init(Backend* backend) {
   MallocText save;
   StatePtr state = make_state(*startup);
   if (state == nullptr) {
-    // The one failure after which the start-up record is gone.
+    // The one failure without a state after which the start-up record is gone.
     std::free(startup);
     return trace.exit(result::no_memory);
   }
 
-  // 3. The file. Failures from here on leave the start-up record where it is: it still says what to
-  // start.
+  // 3. The file. Failures here and in 4. leave the start-up record where it is: it still says what
+  // to start.
   MallocText path = zeroed_text(kPathBuffer);
   if (path == nullptr) return trace.exit(result::no_memory);
   std::size_t length = 0;
