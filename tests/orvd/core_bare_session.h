@@ -69,12 +69,18 @@ class BareSession final : public Session {
       work();
     }
   }
+  // How much was posted and waits for that.
+  std::size_t posts() {
+    const std::lock_guard lock(mutex_);
+    return posted_.size();
+  }
   void fail_to_post(int times) { failing_ = times; }
   int failed_posts() const { return failed_; }
 
   bool lost_interest(PendingOperation&) noexcept override { return false; }
   std::string sent;
   bool ended = false;
+  int resumed = 0;  // how often what it had not handled yet was asked for
 
  protected:
   const Settings& settings() const noexcept override { return settings_; }
@@ -96,7 +102,7 @@ class BareSession final : public Session {
   void flush() override {}
   void disconnect(int, std::string_view) override { ended = true; }
   void drop() override { ended = true; }
-  void resume() override {}
+  void resume() override { ++resumed; }
   void settled() override {}
 
  private:

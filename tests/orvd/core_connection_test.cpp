@@ -38,16 +38,19 @@ class ConnectionTest : public test::BlockedServer {};
 
 TEST_F(ConnectionTest, MessageIdThatIsStillOutstandingEndsTheConnection) {
   block();
-  WireClient client(port());
-  bind_as_root(client);
-  client.send(test::search(2, kTop) + test::search(2, kTop));
-  const std::optional<Reply> notice = client.receive();
-  ASSERT_TRUE(notice);
-  EXPECT_EQ(notice->id, 0);
-  EXPECT_EQ(notice->tag, kNotice);
-  EXPECT_EQ(notice->code, 2);
-  EXPECT_TRUE(client.closed());
-  EXPECT_TRUE(wait_for_waiters(0));
+  // A search, and one that is refused for its form.
+  for (const std::string& again : {test::search(2, kTop), test::search(2, kTop, 9)}) {
+    WireClient client(port());
+    bind_as_root(client);
+    client.send(test::search(2, kTop) + again);
+    const std::optional<Reply> notice = client.receive();
+    ASSERT_TRUE(notice);
+    EXPECT_EQ(notice->id, 0);
+    EXPECT_EQ(notice->tag, kNotice);
+    EXPECT_EQ(notice->code, 2);
+    EXPECT_TRUE(client.closed());
+    EXPECT_TRUE(wait_for_waiters(0));
+  }
 }
 
 TEST_F(ConnectionTest, MessageIdMayBeUsedAgainAfterTheAnswerAndAfterAnAbandon) {
@@ -304,6 +307,63 @@ TEST_F(ConnectionTest, BackendThatFailedWithItsLockHeldIsNotAskedToUnbind) {
   EXPECT_EQ(status, 1);
   EXPECT_LT(Clock::now() - begun, 5s);
   EXPECT_EQ(backend.calls(parameter::unbind_function), 0);
+}
+
+// What is behind an operation that waits for the client to read is not done before it, though the
+// client has read by then.
+TEST_F(BareSessionTest, ChangesAreMadeInTheirOrderThoughTheFirstWasTurnedBack) {
+  std::string order;
+  backend.on_change = [&](pblock* parameters) {
+    order += test::target_of(parameters).substr(3, 1);
+    return test::finish_change(parameters, 0);
+  };
+  bind_as_root();
+  for (int i = 0; i < 20; ++i) {
+    order.clear();
+    ASSERT_EQ(test::enter_at_once(host.gate()), Gate::Entry::inside);
+    session->handle(test::delete_entry(2, "cn=a,cn=configuration"));
+    session->handle(test::delete_entry(3, "cn=b,cn=configuration"));
+    session->output().answered(OutputShare::kMark);
+    host.leave_gate();
+    const auto end = Clock::now() + 10s;
+    while (session->posts() < 2 && Clock::now() < end) std::this_thread::yield();
+    session->output().settled(OutputShare::kMark);
+    session->handle(test::delete_entry(4, "cn=c,cn=configuration"));
+    ASSERT_TRUE(session->run_until([this] { return session->idle(); }));
+    EXPECT_EQ(order, "ABC");
+    session->sent.clear();
+    session->output_is(0);
+  }
+}
+
+TEST_F(BareSessionTest, ChangesBehindOneThatIsHeldAreHeld) {
+  std::string order;
+  backend.on_change = [&](pblock* parameters) {
+    order += test::target_of(parameters).substr(3, 1);
+    return test::finish_change(parameters, 0);
+  };
+  bind_as_root();
+  session->output().answered(OutputShare::kMark);
+  session->handle(test::delete_entry(2, "cn=a,cn=configuration"));
+  session->output_is(0);  // what waited is started later, when others had their turn
+  session->output().settled(OutputShare::kMark);
+  session->handle(test::delete_entry(3, "cn=b,cn=configuration"));
+  ASSERT_TRUE(session->run_until([this] { return session->idle(); }));
+  EXPECT_EQ(order, "AB");
+}
+
+TEST_F(BareSessionTest, RequestsBehindABindThatWaitedForWhatWasHeldAreHandled) {
+  bind_as_root();
+  session->output().answered(OutputShare::kMark);
+  session->handle(test::search(2, kTop, 0));
+  session->handle(test::bind(3, "", ""));
+  EXPECT_FALSE(session->idle());
+  session->resumed = 0;
+  session->output().settled(OutputShare::kMark);
+  session->output_is(0);
+  session->run_posted();
+  EXPECT_TRUE(session->idle());
+  EXPECT_GT(session->resumed, 0);
 }
 
 TEST_F(BareSessionTest, BindWhoseOutcomeCannotBePostedIsPickedUpLater) {

@@ -269,6 +269,46 @@ TEST_F(UnreadAnswers, KeepTheConnectionsOtherOperationsFromBeingStarted) {
   EXPECT_EQ(answered, kRequests);
 }
 
+TEST_F(UnreadAnswers, LeaveTheChangesBehindThemInTheirOrder) {
+  constexpr int kChanges = 12;
+  settings.max_pending_operations = 4;
+  std::string made;
+  std::string expected;
+  backend.on_search = [this](pblock* parameters) {
+    go_on.wait();
+    const EntryPtr entry = test::make_test_entry("CN=CONFIGURATION", 1 << 20);
+    int code = 0;
+    for (int i = 0; i < 14 && code == 0; ++i) code = test::send_test_entry(parameters, *entry);
+    return test::finish_search(parameters, code, 14);
+  };
+  backend.on_change = [&](pblock* parameters) {
+    made += test::target_of(parameters) + " ";
+    return test::finish_change(parameters, 0);
+  };
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  std::string all = test::search(2, kTop, 2);
+  for (int i = 0; i < kChanges; ++i) {
+    const std::string name = "CN=" + std::to_string(i) + ",CN=CONFIGURATION";
+    all += test::delete_entry(3 + i, name);
+    expected += name + " ";
+  }
+  client.send(all);
+  ASSERT_TRUE(wait_for_waiters(3));
+  go_on.happen();
+  ASSERT_TRUE(wait_for_waiters(0));
+  EXPECT_EQ(client.receive_result().back().code, 0);
+  for (int i = 0; i < kChanges; ++i) {
+    const std::vector<Reply> replies = client.receive_result();
+    ASSERT_EQ(replies.size(), 1U);
+    EXPECT_EQ(replies[0].id, 3 + i);
+    EXPECT_EQ(replies[0].code, 0);
+  }
+  stop();
+  EXPECT_EQ(made, expected);
+}
+
 TEST_F(UnreadAnswers, OfAClientThatLeavesAreForgottenWithItsOtherOperations) {
   Event unbound;
   backend.on_unbind = [&](pblock*) {

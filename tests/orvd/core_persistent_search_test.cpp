@@ -533,6 +533,34 @@ TEST_F(PersistentWire, ABindEndsItAlsoWhileANoticeWaitsForItsTurn) {
   stop();  // what the handler refers to goes out of scope here
 }
 
+// The limits of the request were for its first part.
+TEST_F(PersistentWire, ANoticeThatWaitsLongerThanTheTimeLimitIsStillTold) {
+  settings.time_limit = 1;
+  test::Event goes_on;
+  std::atomic<int> changes{0};
+  backend.on_change = [&](pblock* parameters) {
+    if (changes.fetch_add(1) == 1) goes_on.wait();
+    return test::finish_change(parameters, 0);
+  };
+  start();
+  WireClient listener(port());
+  WireClient changer(port());
+  for (WireClient* const client : {&listener, &changer}) bind_as_root(*client);
+  listener.send(persistent_search(7));
+  ASSERT_TRUE(taken(listener, 8));
+  changer.send(test::add_entry(2, kMember, "cn", "x") + test::add_entry(3, kMember, "cn", "x"));
+  ASSERT_TRUE(wait_for_waiters(1)) << "the notice of the first waits behind the second";
+  const auto later = Clock::now() + std::chrono::milliseconds(1200);
+  while (Clock::now() < later) std::this_thread::yield();
+  goes_on.happen();
+  for (int i = 0; i < 2; ++i) {
+    const auto notice = listener.receive();
+    ASSERT_TRUE(notice);
+    EXPECT_EQ(notice->tag, kEntryTag);
+  }
+  stop();  // what the handler refers to goes out of scope here
+}
+
 TEST_F(PersistentWire, TheBoundsHold) {
   settings.max_persistent_searches = 2;
   settings.max_persistent_searches_per_connection = 1;

@@ -183,8 +183,9 @@ TEST_F(SaslTest, ClientIsAnonymousFromTheFirstStepOn) {
 
 TEST_F(SaslTest, OtherRequestBetweenTheStepsIsRefusedAndEndsTheExchange) {
   start();
-  const auto requests = {test::search(2, ""), test::delete_entry(2, kTop), test::compare(2, kTop),
-                         test::extended(2, kStartTlsOid), test::extended(2, "1.2.3")};
+  const auto requests = {test::search(2, ""),        test::delete_entry(2, kTop),
+                         test::compare(2, kTop),     test::extended(2, kStartTlsOid),
+                         test::extended(2, "1.2.3"), test::search(2, "", 9)};  // no such scope
   for (const std::string& request : requests) {
     WireClient client(port());
     EXPECT_EQ(step(client, 1, "QUESTION", "hello").code, kInProgress);

@@ -132,6 +132,8 @@ class PendingOperation final : public GateWaiter,
 
   // For the connection's thread: it waits until the client has read.
   bool held = false;
+  // It was not turned back at the gate. Written by whoever has the operation in hand.
+  std::atomic<bool> begun{false};
   // The next step, and whether it could not be posted, for want of memory. Written by whoever has
   // the operation in hand.
   std::atomic<Step> step{Step::run};

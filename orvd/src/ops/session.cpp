@@ -96,25 +96,42 @@ void Session::handle(std::string_view frame) {
   const Decoded decoded = decode(frame, decoder_limits(settings()), message);
   if (decoded.state == DecodeState::fatal) return disconnect(decoded.code, decoded.text);
   if (decoded.state == DecodeState::decoded) return take(message);
-  audit_refused(message, decoded.code);
+  refuse_form(message, decoded);
+}
+
+// What can be told is the kind of request and its message id.
+void Session::refuse_form(Message& message, const Decoded& decoded) {
+  if (is_in_use(message.id)) return end_for_message_id(message);
   // Also a bind that is refused for its form leaves the connection anonymous.
   if (decoded.response_tag == tag::bind_response) {
+    audit_refused(message, decoded.code);
     BindRequest none;
     return receive_bind(message.id, none, {decoded.code, decoded.text});
   }
-  respond(message.id, decoded.response_tag, decoded.code, decoded.text,
+  Refusal refusal = refuse_within_bind();
+  if (!refusal) refusal = {decoded.code, decoded.text};
+  audit_refused(message, refusal.code);
+  respond(message.id, decoded.response_tag, refusal.code, refusal.text,
           operation_name(decoded.response_tag));
+}
+
+// RFC 4511, 4.1.1.1: answers could not be told apart.
+void Session::end_for_message_id(const Message& message) {
+  audit_refused(message, result::protocol_error);
+  disconnect(result::protocol_error, "message ID is in use");
+}
+
+// RFC 4511, 4.2.1: nothing may come between the steps of a bind. Whatever does ends it.
+Refusal Session::refuse_within_bind() {
+  if (!std::exchange(exchange_, nullptr)) return {};
+  return {result::operations_error, "a bind is under way"};
 }
 
 void Session::take(Message& message) {
   const std::int32_t id = message.id;
   Request& request = message.request;
   if (std::holds_alternative<UnbindRequest>(request)) return drop();
-  // RFC 4511, 4.1.1.1: answers could not be told apart.
-  if (is_in_use(id)) {
-    audit_refused(message, result::protocol_error);
-    return disconnect(result::protocol_error, "message ID is in use");
-  }
+  if (is_in_use(id)) return end_for_message_id(message);
   RequestControls controls;
   Refusal refusal = read_controls(message, controls);
   if (const auto* given_up = std::get_if<AbandonRequest>(&request)) {
@@ -125,9 +142,7 @@ void Session::take(Message& message) {
   const int answer_tag = response_tag(request);
   if (auto* bind = std::get_if<BindRequest>(&request))
     return receive_bind(id, *bind, std::move(refusal));
-  // RFC 4511, 4.2.1: nothing may come between the steps of a bind.
-  if (std::exchange(exchange_, nullptr))
-    refusal = {result::operations_error, "a bind is under way"};
+  if (Refusal within = refuse_within_bind()) refusal = std::move(within);
   if (refusal) {
     audit_refused(message, refusal.code);
     return respond(id, answer_tag, refusal.code, refusal.text, described(request));
@@ -345,7 +360,7 @@ void Session::submit(const OperationPtr& operation, const Refusal& refusal) {
 
 // Goes to the gate, or waits for the client to read.
 void Session::start(const OperationPtr& operation) {
-  if (output_.full()) return hold(operation);
+  if (output_.full() || (held_ > 0 && !starting_held_)) return hold(operation);
   Gate& gate = services_.backend.gate();
   // A notice waits as long as it takes: its client would hear of nothing more without it.
   const auto deadline = operation->notice_of
@@ -367,11 +382,20 @@ void Session::answer_and_complete(const OperationPtr& operation, int code, std::
   complete(operation);
 }
 
-void Session::run_here(const OperationPtr& operation) {
-  if (output_.full()) {
-    services_.backend.leave_gate();
-    return hold(operation);
+// Inside the gate, on any thread. Whether the operation must wait for the client to read; what is
+// behind it then waits as well, though the client may have read by its turn.
+bool Session::turn_back(PendingOperation& operation) noexcept {
+  if (operation.answer().is_given_up() || !(output_.full() || turned_back_.load())) {
+    operation.begun.store(true);
+    return false;
   }
+  turned_back_.store(true);
+  services_.backend.leave_gate();
+  return true;
+}
+
+void Session::run_here(const OperationPtr& operation) {
+  if (turn_back(*operation)) return hold(operation);
   try {
     if (operation->long_running()) flush();
   } catch (...) {
@@ -403,10 +427,7 @@ void Session::run_on_worker(const OperationPtr& operation) noexcept {
 
 // On a worker, inside the gate.
 void Session::work(const OperationPtr& operation) noexcept {
-  if (output_.full() && !operation->answer().is_given_up()) {
-    services_.backend.leave_gate();
-    return hand_back(operation, Step::hold);
-  }
+  if (turn_back(*operation)) return hand_back(operation, Step::hold);
   operation->run(services_, false);
   // Before the settings, which may name another audit log, or none.
   const std::uint64_t record = audit(*operation);
@@ -538,8 +559,29 @@ void Session::hold(const OperationPtr& operation) {
   start_held_later();
 }
 
+// Whether all operations that have not begun are held: those that wait at the gate are taken from
+// there. One that a thread has in hand comes back by itself.
+bool Session::hold_all() {
+  bool all = true;
+  for (const OperationPtr& operation : outstanding_) {
+    if (operation->held || operation->begun.load()) continue;
+    if (services_.backend.gate().withdraw(*operation)) {
+      operation->held = true;
+      ++held_;
+    } else {
+      all = false;
+    }
+  }
+  return all;
+}
+
+// In the order in which they came, so none may be ahead of those that were turned back.
 void Session::start_held() {
-  if (starting_held_) return;
+  if (starting_held_ || held_ == 0 || output_.full()) return;
+  if (turned_back_.load()) {
+    if (!hold_all()) return;
+    turned_back_.store(false);
+  }
   struct Flag {
     explicit Flag(bool& f) : flag(f) { flag = true; }
     ~Flag() { flag = false; }
@@ -561,6 +603,7 @@ void Session::start_held_later() noexcept {
     post([this, self = shared_from_this()] {
       try {
         start_held();
+        resume();
       } catch (...) {
         end_for_want_of_memory();
       }
@@ -597,6 +640,7 @@ void Session::pick_up_stranded() {
   try {
     if (bind_ && bind_->verified.load()) verified(bind_);
     start_held();
+    resume();
   } catch (...) {
     end_for_want_of_memory();
   }

@@ -152,6 +152,9 @@ class Session : public OperationHome,
   using BindPtr = std::shared_ptr<Bind>;
   using OperationPtr = std::shared_ptr<PendingOperation>;
 
+  void refuse_form(Message& message, const Decoded& decoded);
+  void end_for_message_id(const Message& message);
+  Refusal refuse_within_bind();
   void take(Message& message);
   OperationPtr outstanding(std::int32_t message_id) const noexcept;
   // For the access log; "" when that is off.
@@ -196,7 +199,9 @@ class Session : public OperationHome,
   Delivered deliver(PendingOperation& operation);
   void transmit_answer(Answer& answer);
   bool give_up(const OperationPtr& operation) noexcept;
+  bool turn_back(PendingOperation& operation) noexcept;
   void hold(const OperationPtr& operation);
+  bool hold_all();
   void start_held();
   void start_held_later() noexcept;
   void pick_up_stranded();
@@ -316,8 +321,9 @@ class Session : public OperationHome,
   Clock::time_point unauthenticated_since_{};
   bool gone_ = false;
   bool starting_held_ = false;
-  std::size_t held_ = 0;               // of the outstanding ones
-  std::atomic<bool> stranded_{false};  // something could not be posted
+  std::size_t held_ = 0;                  // of the outstanding ones
+  std::atomic<bool> turned_back_{false};  // at the gate, by an operation that has not begun since
+  std::atomic<bool> stranded_{false};     // something could not be posted
 };
 
 }  // namespace orv::server

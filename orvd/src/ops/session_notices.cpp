@@ -134,9 +134,10 @@ void Session::next_notice_later() noexcept {
   }
 }
 
+// No limits: those of the client were for the first part, and time that passes at the gate is not
+// the search's.
 void Session::search_for_notice(const PersistentSearchPtr& search, const ChangePtr& change) {
-  const OperationPtr operation =
-      make_operation(search->message_id, tag::search_done, settings().time_limit, 0);
+  const OperationPtr operation = make_operation(search->message_id, tag::search_done, 0, 0);
   operation->persistent = search;
   operation->notice_of = change;
   operation->answer().keep_open(true);
