@@ -7,6 +7,7 @@
 #include <array>
 #include <cerrno>
 #include <climits>
+#include <csignal>
 #include <cstdio>
 #include <cstdlib>
 #include <ctime>
@@ -112,6 +113,28 @@ int FileCalls::lock(int file) {
 void FileCalls::pause() {
   const timespec time{0, 10'000'000};
   ::nanosleep(&time, nullptr);
+}
+
+int FileCalls::hold_writers_off(int file) {
+  // The signal that says that a writer waits would end the process. Nobody needs to hear it: a
+  // reader is done in no time. This one is ignored by whoever does not ask for it.
+  if (::fcntl(file, F_SETSIG, SIGURG) != 0) return -1;
+  return ::fcntl(file, F_SETLEASE, F_RDLCK);
+}
+
+void FileCalls::let_writers_in(int file) {
+  ::fcntl(file, F_SETLEASE, F_UNLCK);
+}
+
+void FileCalls::pause_for_writer() {
+  const timespec time{0, 1'000'000};
+  ::nanosleep(&time, nullptr);
+}
+
+timespec FileCalls::now() {
+  timespec time{};
+  ::clock_gettime(CLOCK_REALTIME, &time);
+  return time;
 }
 
 FileCalls& system_file_calls() noexcept {

@@ -1,5 +1,6 @@
 // The file calls of a save, in one place: what writes, flushes and renames the configuration goes
-// through this seam, so that a test can stand in for a disk that is full, broken or cut off.
+// through this seam, so that a test can stand in for a disk that is full, broken or cut off. So
+// does what a reader asks about those who write the file in place.
 //
 // Functions answer as the system calls they stand for: -1 with the cause in errno. They do not
 // repeat an interrupted call. Thread-safe.
@@ -10,6 +11,7 @@
 #include <sys/types.h>
 
 #include <cstddef>
+#include <ctime>
 #include <string>
 
 namespace orv::cfg {
@@ -52,6 +54,17 @@ class FileCalls {
   virtual int lock(int file);
   // Between two attempts to get a lock: 10 milliseconds.
   virtual void pause();
+
+  // From here on, whoever opens this file for writing waits (or gets EWOULDBLOCK, if that is how he
+  // opens it), until `let_writers_in`, the end of the descriptor, or the time that the system sets
+  // for that (/proc/sys/fs/lease-break-time). The file is open for reading alone. EAGAIN when
+  // somebody has it open for writing. Other errors where that cannot be told: EACCES for a file of
+  // another user, EINVAL on file systems of the network; some of these say EAGAIN too.
+  virtual int hold_writers_off(int file);
+  virtual void let_writers_in(int file);
+  // Between two attempts to read: one millisecond.
+  virtual void pause_for_writer();
+  virtual timespec now();  // by the clock that the times of files are of
 };
 
 // Those of the system.

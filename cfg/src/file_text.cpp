@@ -10,6 +10,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <new>
+#include <optional>
 #include <utility>
 
 #include "file_descriptor.h"
@@ -120,30 +121,70 @@ ssize_t read_fully(int file, char* to, std::size_t wanted) noexcept {
   return static_cast<ssize_t>(done);
 }
 
+// Whether somebody who wrote the file then may not be done with it. A clock that was set back a
+// little leaves times that lie ahead.
+bool is_recent(const struct stat& status, const timespec& now) noexcept {
+  constexpr long kSecond = 1'000'000'000;
+  const timespec& written = status.st_mtim;
+  if (written.tv_sec < now.tv_sec - 1 || written.tv_sec > now.tv_sec + 1) return false;
+  const long age = (now.tv_sec - written.tv_sec) * kSecond + now.tv_nsec - written.tv_nsec;
+  const long pause = status.st_size == 0 ? FileText::kEmptyPause : FileText::kWriterPause;
+  return age < pause && age > -pause;
+}
+
+// While this stands, nobody begins to write the file; should the system be able to see to that.
+class HeldWriters {
+ public:
+  HeldWriters(FileCalls& files, int file)
+      : files_(files), file_(file), error_(files.hold_writers_off(file) == 0 ? 0 : errno) {}
+  ~HeldWriters() {
+    if (error_ == 0) files_.let_writers_in(file_);
+  }
+  HeldWriters(const HeldWriters&) = delete;
+  HeldWriters& operator=(const HeldWriters&) = delete;
+
+  // Whether somebody began before.
+  [[nodiscard]] bool are_at_work() const noexcept { return error_ == EAGAIN; }
+
+ private:
+  FileCalls& files_;
+  const int file_;
+  const int error_;
+};
+
 }  // namespace
 
-bool FileText::read(const char* path, std::string& cause) {
+bool FileText::read(FileCalls& files, const char* path, std::string& cause) {
   constexpr int kAttempts = 20;
-  for (int attempt = 0; attempt < kAttempts; ++attempt) {
-    const Outcome outcome = read_once(path, cause);
+  int pauses = kWriterPauses;
+  for (int attempt = 0; attempt < kAttempts;) {
+    const Outcome outcome = read_once(files, path, pauses > 0, cause);
+    if (outcome == Outcome::being_written) {
+      --pauses;
+      files.pause_for_writer();
+      continue;
+    }
     if (outcome != Outcome::changed) return outcome == Outcome::read;
+    ++attempt;
     ::sched_yield();
   }
   cause = "the file kept changing while it was read";
   return false;
 }
 
-FileText::Outcome FileText::read_once(const char* path, std::string& cause) {
+FileText::Outcome FileText::read_once(FileCalls& files, const char* path, bool patient,
+                                      std::string& cause) {
   // O_NONBLOCK: opening a pipe that nobody writes to must not stop the server.
   const FileDescriptor file(::open(path, O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
   if (!file.is_open()) {
     cause = system_cause("cannot be opened", errno);
     return Outcome::failed;
   }
-  return read_open(file.get(), cause);
+  return read_settled(files, file.get(), patient, cause);
 }
 
-FileText::Outcome FileText::read_open(int file, std::string& cause) {
+FileText::Outcome FileText::read_settled(FileCalls& files, int file, bool patient,
+                                         std::string& cause) {
   struct stat before {};
   if (::fstat(file, &before) != 0) {
     cause = system_cause("cannot be examined", errno);
@@ -154,11 +195,20 @@ FileText::Outcome FileText::read_open(int file, std::string& cause) {
         S_ISDIR(before.st_mode) ? "is a directory, not a regular file" : "is not a regular file";
     return Outcome::failed;
   }
-  const auto expected = static_cast<std::size_t>(before.st_size);
-  if (expected > kMaxSize) {
+  if (static_cast<std::size_t>(before.st_size) > kMaxSize) {
     cause = "is larger than 1 GiB";
     return Outcome::failed;
   }
+  std::optional<HeldWriters> writers;
+  if (is_recent(before, files.now())) {
+    writers.emplace(files, file);
+    if (patient && writers->are_at_work()) return Outcome::being_written;
+  }
+  return read_open(file, before, cause);
+}
+
+FileText::Outcome FileText::read_open(int file, const struct stat& before, std::string& cause) {
+  const auto expected = static_cast<std::size_t>(before.st_size);
   memory_.reserve(expected + kPadding, 0);
   // One byte more than expected shows a file that has grown.
   const ssize_t got = read_fully(file, static_cast<char*>(memory_.data()), expected + 1);

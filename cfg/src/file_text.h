@@ -10,6 +10,8 @@
 #include <string>
 #include <string_view>
 
+#include "file_calls.h"
+
 namespace orv::cfg {
 
 // Memory that one thread uses again and again: each operation of a server reads the configuration
@@ -74,7 +76,17 @@ class FileText {
   // Reads the file at `path`, following symbolic links; only a regular file will do. A file that
   // changes while it is read is read again, a few times. False with the cause in words; throws
   // std::bad_alloc.
-  bool read(const char* path, std::string& cause);
+  //
+  // A file that somebody writes in place is waited for, so that it is not taken for whole while
+  // half of it is there: as long as he has it open for writing and his last write is younger than
+  // kWriterPause (kEmptyPause while the file is empty: to free what was in it may take a busy disk
+  // that long), but for no more than kWriterPauses attempts. Then what is there is read. Where the
+  // system cannot tell who has it open (FileCalls::hold_writers_off), it is read at once. Of a file
+  // that was not written lately only the time is looked at.
+  bool read(FileCalls& files, const char* path, std::string& cause);
+  static constexpr long kWriterPause = 200'000'000;   // nanoseconds
+  static constexpr long kEmptyPause = 1'000'000'000;  // the longest that may be
+  static constexpr int kWriterPauses = 1000;          // of a millisecond each
 
   // Takes a text that is in memory already.
   void assign(const char* text, std::size_t size);
@@ -90,9 +102,10 @@ class FileText {
   void set_identity(const FileIdentity& identity) noexcept { identity_ = identity; }
 
  private:
-  enum class Outcome { read, changed, failed };
-  Outcome read_once(const char* path, std::string& cause);
-  Outcome read_open(int file, std::string& cause);
+  enum class Outcome { read, changed, being_written, failed };
+  Outcome read_once(FileCalls& files, const char* path, bool patient, std::string& cause);
+  Outcome read_settled(FileCalls& files, int file, bool patient, std::string& cause);
+  Outcome read_open(int file, const struct stat& before, std::string& cause);
   void terminate(std::size_t size) noexcept;
 
   RecycledMemory memory_{MemoryKind::text};

@@ -119,7 +119,8 @@ class Saver {
         save_directory_(directory_of(save_)),
         lock_file_(files),
         old_file_(files),
-        new_file_(files) {}
+        new_file_(files),
+        kept_open_(files) {}
 
   // Every step that can be refused by the disk but one comes before the exchange: a failure is then
   // nothing but a leftover to remove.
@@ -399,7 +400,18 @@ class Saver {
     wrote_new_ = new_file_.get() >= 0;
     if (failure.happened()) return failure;
     failure = check_new();
-    return failure.happened() ? failure : flush_version(new_, new_file_, new_status_);
+    if (!failure.happened()) failure = flush_version(new_, new_file_, new_status_);
+    return failure.happened() ? failure : stop_writing();
+  }
+
+  // The file stays open, lest its number becomes another file's while it is compared; but not for
+  // writing: whoever reads it in its place would wait for us.
+  Failure stop_writing() {
+    if (!kept_open_.open(new_.c_str(), kReadFlags | O_NOFOLLOW)) {
+      return failed(new_, "cannot be opened");
+    }
+    new_file_.close();
+    return kNone;
   }
 
   Failure check_new() noexcept try {
@@ -419,9 +431,8 @@ class Saver {
     return keep_permissions(path, file.get());
   }
 
-  // The file stays open: its number must not become another file's while it is compared. After a
-  // failed flush what is on the disk is unknown, and another flush would only say that nothing is
-  // left to write; the file is given up.
+  // After a failed flush what is on the disk is unknown, and another flush would only say that
+  // nothing is left to write; the file is given up.
   Failure flush_version(const std::string& path, const OpenFile& file, struct stat& status) {
     if (files_.flush(file.get()) != 0) return failed(path, "cannot be flushed");
     if (files_.status(file.get(), status) != 0) return failed(path, "cannot be examined");
@@ -586,6 +597,7 @@ class Saver {
   OpenFile lock_file_;
   OpenFile old_file_;
   OpenFile new_file_;
+  OpenFile kept_open_;  // the same file
   struct stat old_status_ {};
   struct stat new_status_ {};
   bool wrote_new_ = false;

@@ -66,7 +66,7 @@ int read_config_file(Session& session) {
   }
   std::string cause;
   const auto snapshot = std::make_shared<Snapshot>();
-  if (!snapshot->text.read(session.config_file.c_str(), cause)) {
+  if (!snapshot->text.read(*session.files, session.config_file.c_str(), cause)) {
     return fail_bind(session, session.config_file, {std::move(cause), 0, 0});
   }
   FileFault fault;

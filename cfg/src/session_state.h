@@ -58,7 +58,7 @@ struct Session : _CFG {
   std::string fault_file;  // the file the fault is about
   std::string dump;
   Chain* chains = nullptr;
-  FileCalls* files = &system_file_calls();  // with which changes are written
+  FileCalls* files = &system_file_calls();  // with which it waits for writers, and writes changes
 };
 
 // Which attributes a search asked for.

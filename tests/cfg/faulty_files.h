@@ -64,6 +64,14 @@ class ObservedFiles : public cfg::FileCalls {
   }
   int lock(int file) override { return refused("lock") ? -1 : FileCalls::lock(file); }
   void pause() override { refused("pause"); }
+  int hold_writers_off(int file) override {
+    return refused("hold_writers_off") ? -1 : FileCalls::hold_writers_off(file);
+  }
+  void let_writers_in(int file) override {
+    refused("let_writers_in");
+    FileCalls::let_writers_in(file);
+  }
+  void pause_for_writer() override { refused("pause_for_writer"); }
 
  private:
   bool refused(const char* name, const std::string& subject = {}) {

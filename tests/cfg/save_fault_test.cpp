@@ -259,7 +259,7 @@ TEST_F(SaveFaultTest, AVersionThatIsNotAcceptableIsNotPutInPlace) {
     cfg::FileText before;
     cfg::FileText after;
     std::string why;
-    ASSERT_TRUE(before.read(path_.c_str(), why)) << why;
+    ASSERT_TRUE(before.read(cfg::system_file_calls(), path_.c_str(), why)) << why;
     after.assign(kAfter, std::strlen(kAfter));
     const cfg::SaveJob job{path_.c_str(), save_.c_str(), before, after, [throws] {
                              if (throws) throw std::bad_alloc();

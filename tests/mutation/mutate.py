@@ -42,12 +42,15 @@ SUITES = {
         "folders": ("cfg", "tests/cfg"),
         "target": "cfg_test",
         "arguments": ["--gtest_filter=Add*:Delete*:Modify*:Secret*:FileModel*:Concurrent*:SaveFault*:"
-                      "Crash*:ChangeModel*"],
+                      "Crash*:ChangeModel*:WrittenInPlace*"],
         # For these files fewer tests are quicker; that others would notice too is no matter.
         "arguments_of": {
+            "cfg/src/file_calls.cpp": ["--gtest_filter=WrittenInPlace*"],
+            "cfg/src/file_text.cpp": ["--gtest_filter=WrittenInPlace*"],
             "cfg/src/secret.cpp": ["--gtest_filter=Secret*:Modify*"],
             "cfg/src/modify.cpp": ["--gtest_filter=Modify*:FileModel*"],
-            "cfg/src/save.cpp": ["--gtest_filter=*EditedSave*:Concurrent*:SaveFault*:Crash*"]}},
+            "cfg/src/save.cpp": ["--gtest_filter=*EditedSave*:Concurrent*:SaveFault*:Crash*:"
+                                 "WrittenInPlace*"]}},
 }
 
 # Only what the tests need; no warnings, since a fault may well leave something unused.

@@ -5,7 +5,10 @@
 //
 // What a session sees: `cfg_bind_s` reads the file whole into private memory and checks that it is
 // well formed; all searches of the session answer from that text, none of which is kept for others.
-// Readers take no lock on the file.
+// Readers take no lock on the file, but a file that somebody is writing in place is waited for: up
+// to a second in all, as long as he has it open and goes on writing. Somebody who opens it for
+// writing while it is read may wait for the reader in turn. SIGURG, which is ignored by default,
+// may be sent to the process then.
 //
 // Errors: functions return LDAP result codes; those that return a pointer give null and leave the
 // code to `cfg_get_errno`, which always tells the outcome of the *last* call on the handle (0 after
