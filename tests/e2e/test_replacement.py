@@ -105,7 +105,7 @@ def test_every_answer_is_one_version_of_the_file_whole(instance):
 
 
 def test_file_written_in_place_is_never_answered_in_part(instance):
-    """An editor that writes the file in place shows searches a cut file: 1, or a whole version."""
+    """Searches wait for who writes the file in place; if he goes on for too long: 1, never a part."""
     base = instance.config.read()
     texts = [version(base, number) for number in (0, 25)]
     instance.config.replace(texts[0])
