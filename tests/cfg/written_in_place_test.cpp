@@ -2,6 +2,7 @@
 #include <fcntl.h>
 
 #include <cerrno>
+#include <chrono>
 #include <condition_variable>
 #include <functional>
 #include <mutex>
@@ -65,14 +66,9 @@ class ReadersCalls : public ObservedFiles {
     EXPECT_EQ(::stat(path_.c_str(), &status), 0);
     constexpr long kSecond = 1'000'000'000;
     timespec time = status.st_mtim;
-    time.tv_nsec += age_;
-    if (time.tv_nsec >= kSecond) {
-      time.tv_nsec -= kSecond;
-      ++time.tv_sec;
-    } else if (time.tv_nsec < 0) {
-      time.tv_nsec += kSecond;
-      --time.tv_sec;
-    }
+    const long part = time.tv_nsec + age_ % kSecond;  // less than a second to either side
+    time.tv_sec += age_ / kSecond + (part >= kSecond ? 1 : 0) - (part < 0 ? 1 : 0);
+    time.tv_nsec = (part + kSecond) % kSecond;
     return time;
   }
 
@@ -165,6 +161,19 @@ TEST_F(WrittenInPlaceTest, AFileThatIsOpenButWasNotWrittenLatelyIsReadAtOnce) {
     EXPECT_EQ(calls.holds, 0) << age;
     EXPECT_EQ(calls.pauses, 0) << age;
   }
+}
+
+TEST_F(WrittenInPlaceTest, AWriterWhoStopsWritingIsWaitedForByTheSystemsClock) {
+  write_file(path_, kWhole);
+  const InPlaceWriter writer(path_);
+  writer.write(kHalf);
+  EXPECT_EQ(entries_read(cfg::system_file_calls()), half_);
+}
+
+TEST_F(WrittenInPlaceTest, APauseLastsAMillisecond) {
+  const auto begin = std::chrono::steady_clock::now();
+  cfg::system_file_calls().pause_for_writer();
+  EXPECT_GE(std::chrono::steady_clock::now() - begin, std::chrono::milliseconds(1));
 }
 
 TEST_F(WrittenInPlaceTest, AnEmptyFileIsWaitedForLonger) {
