@@ -6,6 +6,7 @@ import os
 import re
 import shutil
 import signal
+import socket
 import stat
 import subprocess
 
@@ -112,11 +113,24 @@ def test_port_and_address_of_the_file_hold_without_options(instance):
     assert instance.url == "ldap://127.0.0.1:%d" % port
 
 
+@pytest.mark.skipif(not socket.has_ipv6 or not os.path.exists("/proc/net/if_inet6"),
+                    reason="this host has no IPv6")
+def test_port_that_another_program_has_at_the_ipv6_addresses_is_refused(instance):
+    instance.config.set(clients.BASE, "orv-slapdIpAddress")
+    with socket.create_server(("::", 0), family=socket.AF_INET6) as other:
+        port = str(other.getsockname()[1])
+        refused = subprocess.run(
+            [programs.orvd(), "--config", instance.config.path, "--key-stash", instance.key_stash,
+             "--port", port], stdout=subprocess.PIPE, stderr=subprocess.PIPE, text=True,
+            check=False, timeout=programs.DEADLINE)
+    assert (refused.returncode, refused.stdout) == (1, "")
+    assert "orvd: cannot listen on :: port %s: Address already in use" % port in refused.stderr
+
+
 class clients_port:  # pylint: disable=invalid-name
     """A port that was free a moment ago."""
 
     def __enter__(self):
-        import socket  # pylint: disable=import-outside-toplevel
         self.socket = socket.socket()
         self.socket.bind(("127.0.0.1", 0))
         return self.socket.getsockname()[1]

@@ -20,9 +20,10 @@ struct ListeningSocket {
   int family = 0;  // AF_INET, AF_INET6 or AF_UNIX
 };
 
-// Opens a socket on each address (literal IPv4 or IPv6; none: every address of the host), for
-// connections that begin in clear or with TLS, and appends them. With port 0 the kernel chooses
-// one, which then serves for all addresses. False with the cause; what was opened until then stays.
+// Opens a socket on each address (literal IPv4 or IPv6; none: every address of the host, of IPv4
+// alone where there is no IPv6), for connections that begin in clear or with TLS, and appends them.
+// With port 0 the kernel chooses one that is free at all of them. False with the cause, also when
+// somebody else has the port at one of the addresses; what was opened until then stays.
 bool open_tcp(const std::vector<std::string>& addresses, std::uint16_t port, bool secure,
               std::vector<ListeningSocket>& sockets, std::string& error);
 
