@@ -1,5 +1,6 @@
 #include "check.h"
 
+#include <sys/types.h>
 #include <unistd.h>
 
 #include <fstream>
@@ -23,7 +24,9 @@ constexpr const char* kSuffix = "CN=CONFIGURATION";
 
 class FileCheck {
  public:
-  FileCheck(const cfg::Key* key, std::ostream& out) : key_(key), out_(out) {}
+  // `user` is the one that the server will run as.
+  FileCheck(const cfg::Key* key, uid_t user, std::ostream& out)
+      : key_(key), user_(user), out_(out) {}
 
   void check(const FileEntry& entry) {
     for (const std::string& problem : schema_problems(builtin_schema(), entry)) {
@@ -31,6 +34,7 @@ class FileCheck {
     }
     check_secrets(entry);
     check_addresses(entry);
+    check_authorities(entry);
     check_identity(entry, "orv-slapdAdminDN");
     check_identity(entry, "orv-slapdMasterDN");
   }
@@ -82,6 +86,13 @@ class FileCheck {
     }
   }
 
+  void check_authorities(const FileEntry& entry) {
+    for (const char* const type :
+         {"orv-slapdTlsCaFile", "orv-slapdTlsCrlFile", "orv-slapdKrbKeytab"})
+      for (const std::string& file : entry.values(type))
+        if (const std::string why = distrust_of_authority(file, user_); !why.empty()) report(why);
+  }
+
   void check_identity(const FileEntry& entry, const char* type) {
     for (const std::string& value : entry.values(type)) {
       std::string name;
@@ -97,6 +108,7 @@ class FileCheck {
   }
 
   const cfg::Key* key_;
+  uid_t user_;
   std::ostream& out_;
   std::map<std::string, std::string> owners_;  // normalised bind DN, entry that has it
   int problems_ = 0;
@@ -115,14 +127,19 @@ std::string text_of(const std::string& file) {
   return {std::istreambuf_iterator<char>(in), {}};
 }
 
-// As the server would, which runs as the owner of the file.
+// The server runs as the owner of the file.
+uid_t user_of(const std::string& file) {
+  return owner_of(file, ::geteuid());
+}
+
+// As the server would.
 std::vector<std::string> distrust(const std::string& file, const std::string& key_stash) {
-  return distrusted_files(file, key_stash, owner_of(file, ::geteuid()));
+  return distrusted_files(file, key_stash, user_of(file));
 }
 
 bool check_entries(const std::string& file, const std::string& key_stash,
                    const std::vector<FileEntry>& entries, const cfg::Key* key, std::ostream& out) {
-  FileCheck check(key, out);
+  FileCheck check(key, user_of(file), out);
   const std::string prefix = file + ": ";
   for (const std::string& line : distrust(file, key_stash)) check.report(line);
   for (const std::string& line : numbered_types(text_of(file))) check.report(prefix + line);

@@ -312,11 +312,14 @@ bool report_problems(const std::vector<std::string>& problems) {
 }
 
 // Root may check the files of another user's instance, but does not serve them.
-std::vector<std::string> distrusted_files(const Options& options) {
+uid_t user_of_files(const Options& options) {
   const bool may_be_anybodys = options.check && geteuid() == 0;
-  return orv::distrusted_files(
-      options.named_config_file, options.named_key_stash,
-      may_be_anybodys ? owner_of(options.config_file, geteuid()) : geteuid());
+  return may_be_anybodys ? owner_of(options.config_file, geteuid()) : geteuid();
+}
+
+std::vector<std::string> distrusted_files(const Options& options) {
+  return orv::distrusted_files(options.named_config_file, options.named_key_stash,
+                               user_of_files(options));
 }
 
 // Reports them, and to root also that it need not be the one to serve them.
@@ -484,9 +487,11 @@ void tell_of_exchange(Logs& logs, std::string_view what) noexcept {
   }
 }
 
-bool can_use_certificate(const Settings& settings) {
+bool can_use_certificate(const Options& options, const Settings& settings) {
   std::string error;
-  if (settings.tls.certificate_file.empty() || TlsContext::load(settings.tls, error)) return true;
+  if (settings.tls.certificate_file.empty() ||
+      TlsContext::load(settings.tls, error, user_of_files(options)))
+    return true;
   std::fprintf(stderr, "orvd: %s\n", error.c_str());
   return false;
 }
@@ -655,7 +660,7 @@ int run(const Options& options, const FileIdentity& standard_error, Inheritance&
       for (const std::string& doubt :
            doubts_about_file(options.config_file, options.key_stash_file))
         logs.warning(doubt);
-      if (options.check && !can_use_certificate(settings)) {
+      if (options.check && !can_use_certificate(options, settings)) {
         status = 1;
       } else if (options.check) {
         std::printf("%s: good\n", options.config_file.c_str());

@@ -3,6 +3,7 @@
 #include <grp.h>
 #include <pwd.h>
 
+#include <array>
 #include <charconv>
 #include <system_error>
 
@@ -51,8 +52,11 @@ bool find_account(const std::string& user, const std::string& group, Account& ac
 }
 
 std::string user_name(uid_t user) {
-  const passwd* const found = ::getpwuid(user);
-  return found ? found->pw_name : std::to_string(user);
+  std::array<char, 8192> room{};
+  passwd record{};
+  passwd* found = nullptr;
+  const int failure = ::getpwuid_r(user, &record, room.data(), room.size(), &found);
+  return failure == 0 && found ? found->pw_name : std::to_string(user);
 }
 
 }  // namespace orv

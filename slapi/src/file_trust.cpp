@@ -27,6 +27,9 @@ constexpr Rule kConfiguration{"the configuration file", S_IRWXO | S_IWGRP,
 constexpr Rule kKeyStash{"the key stash", S_IRWXG | S_IRWXO, "is open to others than its owner",
                          "chmod 600 "};
 
+constexpr Rule kAuthority{"what says whom the server believes", S_IWGRP | S_IWOTH,
+                          "can be changed by others", "chmod go-w "};
+
 using Problem = std::optional<std::string>;
 
 std::string folder_of(const std::string& path) {
@@ -98,6 +101,10 @@ std::vector<std::string> distrusted_files(const std::string& config_file,
   if (of_stash && (problems.empty() || problems.front() != *of_stash))
     problems.push_back(*std::move(of_stash));
   return problems;
+}
+
+std::string distrust_of_authority(const std::string& file, uid_t user) {
+  return problem_at(file, kAuthority, user).value_or("");
 }
 
 uid_t owner_of(const std::string& file, uid_t otherwise) noexcept {

@@ -10,6 +10,9 @@ import ldap
 import pytest
 
 from orv_e2e import clients, programs, users
+from orv_e2e.certificates import Authority
+from orv_e2e.changes import GROUP
+from orv_e2e.instance import Instance
 
 NO_RIGHTS = ["0" * 16]
 
@@ -282,6 +285,79 @@ def test_file_that_is_opened_to_others_meanwhile_is_told_of(server):
     server.config.path.chmod(0o644)
     server.process.send_signal(signal.SIGHUP)
     server.stderr.wait_for(lambda line: "can be read or changed by others" in line)
+
+
+# ---- files that say whom the server believes
+
+@pytest.fixture(name="believing")
+def believing_instance(open_folder):
+    """An instance that takes certificates of clients, and the files that say which, by setting."""
+    made = Instance.create(open_folder / "instance")
+    authority = Authority(open_folder / "ca")
+    files = {"orv-slapdTlsCaFile": authority.certificate,
+             "orv-slapdTlsCrlFile": authority.revocations()}
+    for name, path in files.items():
+        path.chmod(0o644)
+        made.config.set(GROUP, name, str(path))
+    made.config.set(GROUP, "orv-slapdTlsClientCertificate", "optional")
+    yield made, files
+    made.stop()
+
+
+AUTHORITIES = ["orv-slapdTlsCaFile", "orv-slapdTlsCrlFile"]
+
+
+@pytest.mark.parametrize("mode", [0o666, 0o664])
+@pytest.mark.parametrize("name", AUTHORITIES)
+def test_authorities_that_others_could_change_are_refused(believing, name, mode):
+    instance, files = believing
+    files[name].chmod(mode)
+    line = refused(instance)
+    assert line == ("%s: what says whom the server believes can be changed by others; chmod go-w %s"
+                    % (files[name], files[name]))
+    checked = subprocess.run(instance.command("--check"), stdout=subprocess.PIPE, text=True,
+                             stderr=subprocess.PIPE, timeout=programs.DEADLINE, check=False)
+    assert checked.returncode == 1 and line in checked.stderr
+    subprocess.run(line.partition("; ")[2], shell=True, check=True)  # what it says helps
+    instance.start()
+
+
+@pytest.mark.parametrize("name", AUTHORITIES)
+def test_authorities_in_a_folder_of_others_are_refused(believing, name):
+    instance, files = believing
+    folder = files[name].parent
+    folder.chmod(0o777)
+    assert refused(instance).startswith("%s: this folder can be written by others" % folder)
+    folder.chmod(0o755)
+    instance.start()
+
+
+def test_authorities_that_are_opened_to_others_meanwhile_are_not_taken_over(believing):
+    instance, files = believing
+    instance.start()
+    path = files["orv-slapdTlsCaFile"]
+    path.chmod(0o666)
+    instance.process.send_signal(signal.SIGHUP)
+    instance.stderr.wait_for(lambda line: "TLS stays as it was: %s: what says whom" % path in line)
+    root = clients.bind(instance)
+    with pytest.raises(ldap.UNWILLING_TO_PERFORM) as refusal:
+        root.modify_s(GROUP, [(ldap.MOD_REPLACE, "orv-slapdTlsClientCertificate", [b"required"])])
+    assert str(path) in refusal.value.args[0]["info"]
+
+
+@users.needs_root
+def test_authorities_may_be_the_servers_own_and_nobody_elses(believing):
+    instance, files = believing
+    path = files["orv-slapdTlsCaFile"]
+    users.give(path)
+    code, told = instance.start_refused()
+    assert code == 1
+    assert "%s: what says whom the server believes belongs to %d" % (path, users.USER) in told
+    for own in [instance.directory, *instance.directory.rglob("*"), path.parent]:
+        users.give(own)
+    subprocess.run(instance.command("--check"), check=True, stdout=subprocess.PIPE,
+                   timeout=programs.DEADLINE)  # root may look at what belongs to another server
+    instance.start(*users.options())
 
 
 # ---- orvcfg init

@@ -348,12 +348,16 @@ def test_keytab_that_cannot_be_used_is_told_and_gssapi_not_announced(instance, r
     open_to_all = realm.keytab("ldap/localhost", "open.keytab")
     open_to_all.chmod(0o644)
     of_another = realm.keytab("host/localhost", "other.keytab")
+    (realm.folder / "open").mkdir()
+    replaceable = realm.keytab("ldap/localhost", "open/own.keytab")
+    replaceable.parent.chmod(0o777)
     rubbish = tmp_path / "rubbish"
     rubbish.write_bytes(b"not a keytab")
     rubbish.chmod(0o600)
     for keytab, cause in ((open_to_all, "others may read"), (of_another, "no key of a service"),
                           (rubbish, "no key of a service"), (tmp_path / "none", "No such file"),
-                          (tmp_path, "not a regular file")):
+                          (tmp_path, "not a regular file"),
+                          (replaceable, "this folder can be written by others")):
         with_keytab = instance.config.path.read_text()
         with_kerberos(instance, keytab)
         instance.start(environment=realm.environment)

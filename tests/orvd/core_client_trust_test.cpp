@@ -2,6 +2,8 @@
 // time has passed, or nobody asks for certificates.
 #include <gtest/gtest.h>
 
+#include <sys/stat.h>
+
 #include <atomic>
 #include <ctime>
 #include <filesystem>
@@ -276,6 +278,50 @@ class Revoked : public ClientTrust {
   Pair issuer;
   Pair bob;
 };
+
+// ---- files that others could change
+
+// Whoever added an authority could sign himself a certificate with any subject.
+TEST_F(Revoked, FilesThatOthersMayChangeAreRefused) {
+  for (const std::string& file : {settings.tls.ca_file, settings.tls.crl_file}) {
+    for (const mode_t mode : {0666U, 0664U, 0646U, 0622U}) {
+      ASSERT_EQ(::chmod(file.c_str(), mode), 0);
+      EXPECT_EQ(refusal(), file +
+                               ": what says whom the server believes can be changed by others; "
+                               "chmod go-w " +
+                               file)
+          << mode;
+    }
+    for (const mode_t mode : {0644U, 0444U, 0640U, 0600U}) {
+      ASSERT_EQ(::chmod(file.c_str(), mode), 0);
+      EXPECT_EQ(refusal(), "") << mode;
+    }
+  }
+}
+
+TEST_F(Revoked, FilesThatOthersMayReplaceAreRefused) {
+  const std::string folder = certificates.path("folder");
+  std::filesystem::create_directory(folder);
+  const TlsSettings good = settings.tls;
+  for (std::string TlsSettings::*const name : {&TlsSettings::ca_file, &TlsSettings::crl_file}) {
+    settings.tls = good;
+    std::string& file = settings.tls.*name;
+    std::filesystem::copy_file(file, folder + "/file",
+                               std::filesystem::copy_options::overwrite_existing);
+    std::filesystem::remove(certificates.path("link"));
+    std::filesystem::create_symlink("folder/file", certificates.path("link"));
+    for (const std::string& named : {folder + "/file", certificates.path("link")}) {
+      file = named;
+      ASSERT_EQ(::chmod(folder.c_str(), 0777), 0);
+      EXPECT_NE(refusal().find("folder: this folder can be written by others"), std::string::npos)
+          << refusal();
+      ASSERT_EQ(::chmod(folder.c_str(), 01777), 0);
+      EXPECT_EQ(refusal(), "");
+    }
+  }
+}
+
+// ---- certificates on the list
 
 TEST_F(Revoked, CertificateIsRefusedAndOthersOfItsAuthorityAreNot) {
   publish(certificates.revoked_by(issuer, {bob}));

@@ -54,6 +54,11 @@ Wording named(const std::string& name, const char* constraint = "CA:FALSE") {
 
 }  // namespace
 
+// Files of authorities that others could change are refused, however whoever runs this makes his.
+Certificates::Certificates() {
+  ::umask(S_IWGRP | S_IWOTH);
+}
+
 Pair Certificates::make(const Wording& wording, const Pair* issuer) {
   EVP_PKEY* const key = EVP_EC_gen("P-256");
   X509* const certificate = X509_new();

@@ -39,6 +39,8 @@ struct Wording {
 // Makes pairs in a folder of its own, which goes with it.
 class Certificates {
  public:
+  Certificates();
+
   Pair self_signed(const std::string& name);
   Pair self_signed(const Wording& wording) { return make(wording, nullptr); }
   // By an authority that is made with the first of them.

@@ -5,11 +5,14 @@
 #include <gssapi/gssapi_ext.h>
 #include <gssapi/gssapi_krb5.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <cstring>
 #include <new>
 #include <string_view>
+
+#include "slapi/file_trust.h"
 
 namespace orv::server {
 namespace {
@@ -65,7 +68,9 @@ bool may_be_used(const std::string& keytab, std::string& error) {
     error =
         keytab + ": others may read the keys, or change them; take these rights away (chmod 600)";
   } else {
-    return true;
+    // In a folder of others it could be replaced by one whose keys they know.
+    error = distrust_of_authority(keytab, geteuid());
+    return error.empty();
   }
   return false;
 }

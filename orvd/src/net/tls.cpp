@@ -130,8 +130,8 @@ TlsContext::~TlsContext() {
   SSL_CTX_free(context_);
 }
 
-std::shared_ptr<const TlsContext> TlsContext::load(const TlsSettings& settings,
-                                                   std::string& error) {
+std::shared_ptr<const TlsContext> TlsContext::load(const TlsSettings& settings, std::string& error,
+                                                   uid_t user) {
   ERR_clear_error();
   Context made(SSL_CTX_new(TLS_server_method()));
   if (!made) throw std::bad_alloc();
@@ -142,7 +142,8 @@ std::shared_ptr<const TlsContext> TlsContext::load(const TlsSettings& settings,
     return nullptr;
   }
   Trust trust;
-  if (!load_own(made.get(), settings, error) || !load_trust(made.get(), settings, trust, error))
+  if (!load_own(made.get(), settings, error) ||
+      !load_trust(made.get(), settings, user, trust, error))
     return nullptr;
   const std::shared_ptr<TlsContext> context(new TlsContext(made.release()));
   context->trust_ = std::move(trust);

@@ -9,6 +9,8 @@
 #pragma once
 
 #include <openssl/types.h>
+#include <sys/types.h>
+#include <unistd.h>
 
 #include <cstddef>
 #include <ctime>
@@ -27,8 +29,10 @@ class TlsContext {
  public:
   // Reads certificate, key and authorities. Null, with the cause and the file in `error`, when one
   // of them is missing, damaged or too weak, when the key is not the certificate's or others may
-  // read it, or when clients' certificates are asked for and nobody is named who may sign them.
-  static std::shared_ptr<const TlsContext> load(const TlsSettings& settings, std::string& error);
+  // read it, or when clients' certificates are asked for and nobody is named who may sign them, or
+  // others than root and `user` could change who that is.
+  static std::shared_ptr<const TlsContext> load(const TlsSettings& settings, std::string& error,
+                                                uid_t user = ::geteuid());
   ~TlsContext();
   TlsContext(const TlsContext&) = delete;
   TlsContext& operator=(const TlsContext&) = delete;

@@ -15,6 +15,7 @@
 
 #include "cfg/openssl_owners.h"
 #include "net/pem.h"
+#include "slapi/file_trust.h"
 
 namespace orv::server {
 namespace {
@@ -93,11 +94,19 @@ Lists add_revocations(SSL_CTX* context, BIO* from, std::time_t& good_until) {
   return Lists::added;
 }
 
+// Whoever can change the file could let himself in.
+bool read_trusted(const std::string& file, uid_t user, off_t most, PemText& text,
+                  std::string& error) {
+  if (!text.read(file, PemText::Holds::certificates, most, error)) return false;
+  error = distrust_of_authority(file, user);
+  return error.empty();
+}
+
 // From now on each authority up to the root must have said what it has revoked.
-bool load_revocations(SSL_CTX* context, const std::string& file, Trust& trust, std::string& error) {
+bool load_revocations(SSL_CTX* context, const std::string& file, uid_t user, Trust& trust,
+                      std::string& error) {
   PemText text;
-  if (!text.read(file, PemText::Holds::certificates, PemText::kMostOfRevocations, error))
-    return false;
+  if (!read_trusted(file, user, PemText::kMostOfRevocations, text, error)) return false;
   const Bio bio = text.bio();
   if (!bio) throw std::bad_alloc();
   switch (add_revocations(context, bio.get(), trust.revocations_good_until)) {
@@ -114,10 +123,10 @@ bool load_revocations(SSL_CTX* context, const std::string& file, Trust& trust, s
   return true;
 }
 
-bool load_authorities(SSL_CTX* context, const std::string& file, Trust& trust, std::string& error) {
+bool load_authorities(SSL_CTX* context, const std::string& file, uid_t user, Trust& trust,
+                      std::string& error) {
   PemText text;
-  if (!text.read(file, PemText::Holds::certificates, PemText::kMostOfAuthorities, error))
-    return false;
+  if (!read_trusted(file, user, PemText::kMostOfAuthorities, text, error)) return false;
   const Bio bio = text.bio();
   if (!bio || !add_authorities(context, bio.get()))
     return fail(error, file, "no usable certificates");
@@ -134,15 +143,17 @@ std::time_t first_end(const STACK_OF(X509) * chain) {
 
 }  // namespace
 
-bool load_trust(SSL_CTX* context, const TlsSettings& settings, Trust& trust, std::string& error) {
+bool load_trust(SSL_CTX* context, const TlsSettings& settings, uid_t user, Trust& trust,
+                std::string& error) {
   if (settings.client_certificates == ClientCertificates::none) return true;
   if (settings.ca_file.empty()) {
     error =
         "clients' certificates are asked for, but orv-slapdTlsCaFile does not say who signs them";
     return false;
   }
-  if (!load_authorities(context, settings.ca_file, trust, error)) return false;
-  if (!settings.crl_file.empty() && !load_revocations(context, settings.crl_file, trust, error))
+  if (!load_authorities(context, settings.ca_file, user, trust, error)) return false;
+  if (!settings.crl_file.empty() &&
+      !load_revocations(context, settings.crl_file, user, trust, error))
     return false;
   const bool required = settings.client_certificates == ClientCertificates::required;
   SSL_CTX_set_verify(context, SSL_VERIFY_PEER | (required ? SSL_VERIFY_FAIL_IF_NO_PEER_CERT : 0),

@@ -4,6 +4,7 @@
 #pragma once
 
 #include <openssl/types.h>
+#include <sys/types.h>
 
 #include <ctime>
 #include <limits>
@@ -25,9 +26,11 @@ struct Trust {
 
 // Has `context` ask clients for certificates as the settings say, and believe those that the
 // authorities of the file have signed and not revoked; where there is a file for that, each
-// authority up to the root must have a list there. False with the cause and the file in `error`.
+// authority up to the root must have a list there. Others than `user` and root must not be able to
+// change these files (slapi/file_trust.h). False with the cause and the file in `error`.
 // Throws std::bad_alloc.
-bool load_trust(ssl_ctx_st* context, const TlsSettings& settings, Trust& trust, std::string& error);
+bool load_trust(ssl_ctx_st* context, const TlsSettings& settings, uid_t user, Trust& trust,
+                std::string& error);
 
 // What there is to say about the certificate that a client has shown.
 struct Judgement {

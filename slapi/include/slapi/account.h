@@ -1,7 +1,7 @@
 // Users and groups of the host, by name or number: for the server, which can become one of them,
 // and for the tools that make files for it.
 //
-// Threads: not thread-safe, the functions read the databases of the host.
+// Threads: find_account() is not thread-safe, it reads the databases of the host; user_name() is.
 #pragma once
 
 #include <sys/types.h>

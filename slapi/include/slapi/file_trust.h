@@ -1,7 +1,7 @@
 // Whether the files of an instance are safe from others on the host: for the server, which does not
 // start with files that others could read or put something else in the place of, and for the tools.
 //
-// Thread-safe but for the names of users in messages. Throws std::bad_alloc and nothing else.
+// Thread-safe. Throws std::bad_alloc and nothing else.
 #pragma once
 
 #include <sys/types.h>
@@ -20,6 +20,10 @@ namespace orv {
 // replaced. `key_stash` may be "". A file that is not there is no matter of this.
 std::vector<std::string> distrusted_files(const std::string& config_file,
                                           const std::string& key_stash, uid_t user);
+
+// The same of one file that says whom the server believes, such as the authorities that sign
+// certificates of clients; "" when nothing is wrong with it. It may be read by everybody.
+std::string distrust_of_authority(const std::string& file, uid_t user);
 
 // The owner of the file; `otherwise` when there is none.
 uid_t owner_of(const std::string& file, uid_t otherwise) noexcept;

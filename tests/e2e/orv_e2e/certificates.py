@@ -15,11 +15,12 @@ class Authority:
 
     def __init__(self, folder):
         self.folder = folder
-        folder.mkdir()
+        folder.mkdir(mode=0o755)
         self.certificate, self.key = self._paths("ca")
         _openssl("req", "-x509", "-newkey", "rsa:2048", "-nodes", "-days", "2", "-subj",
                  "/O=Orv Tests/CN=Authority", "-keyout", self.key, "-out", self.certificate)
         self.key.chmod(0o600)
+        self.certificate.chmod(0o644)  # whatever the umask
 
     def _paths(self, name):
         return self.folder / (name + ".crt"), self.folder / (name + ".key")
@@ -46,4 +47,5 @@ class Authority:
         for certificate in certificates:
             _openssl(*own, "-revoke", certificate)
         _openssl(*own, "-gencrl", "-out", result)
+        result.chmod(0o644)
         return result
