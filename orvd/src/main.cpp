@@ -509,6 +509,20 @@ std::vector<FileInUse> files_of_keys(const Settings& settings) {
   return files;
 }
 
+// Files besides its own that the server reads with these settings.
+std::vector<std::string> files_to_read(const Settings& settings) {
+  const TlsSettings& tls = settings.tls;
+  const std::vector<std::string>& allowed = settings.sasl.mechanisms;
+  std::vector<std::string> files;
+  if (allowed.empty() || std::find(allowed.begin(), allowed.end(), "GSSAPI") != allowed.end())
+    files.push_back(settings.sasl.keytab);
+  if (tls.certificate_file.empty()) return files;
+  files.insert(files.end(), {tls.certificate_file, tls.key_file});
+  if (tls.client_certificates != ClientCertificates::none)
+    files.insert(files.end(), {tls.ca_file, tls.crl_file});
+  return files;
+}
+
 // The audit log first: what is its file then, wanted or not, is kept from the other logs.
 void open_logs(const Settings& settings, GuardedFiles guarded, Logs& logs, AuditLog& audit) {
   std::vector<FileInUse> others = files_of_keys(settings);
@@ -584,7 +598,8 @@ int serve(const Options& options, const Settings& settings, const GuardedFiles& 
                      logs.error("settings not taken over: " + error);
                      return false;
                    }
-                   for (const std::string& problem : distrusted_files(options)) logs.error(problem);
+                   report(logs, distrusted_files(options));
+                   report(logs, missing_read_access(files_to_read(wanted)));
                    renew_all(options, logs);
                    report(logs, sasl.configure(wanted.sasl));
                    open_logs(wanted, guarded, logs, audit);
@@ -632,9 +647,10 @@ int run(const Options& options, const FileIdentity& standard_error, Inheritance&
     std::fprintf(stderr, "orvd: %s\n", error.c_str());
     return 1;
   }
-  if (!report_problems(missing_write_access(options.config_file, settings,
-                                            more_listeners(options, settings).local_socket)))
-    return 1;
+  const bool may_read = report_problems(missing_read_access(files_to_read(settings)));
+  const bool may_write = report_problems(missing_write_access(
+      options.config_file, settings, more_listeners(options, settings).local_socket));
+  if (!may_read || !may_write) return 1;
   if (!options.check && !open_sockets(options, settings, inherited.sockets, error)) {
     std::fprintf(stderr, "orvd: %s\n", error.c_str());
     return 1;

@@ -160,12 +160,59 @@ def test_what_the_user_cannot_write_is_named(owned, name, purpose):
                for line in told.splitlines()), told
 
 
+def file_of_setting(owned, name):
+    """A file of the server's user, in the place of what the setting names."""
+    path = owned.directory / name
+    path.touch(mode=0o600)
+    users.give(path)
+    owned.config.set(GROUP, name, str(path))
+    owned.config.set(GROUP, "orv-slapdTlsClientCertificate", "optional")
+    users.give(owned.config.path)
+    return path
+
+
+READ = ["orv-slapdTlsCertificateFile", "orv-slapdTlsKeyFile", "orv-slapdTlsCaFile",
+        "orv-slapdTlsCrlFile", "orv-slapdKrbKeytab"]
+
+
 @users.needs_root
-def test_files_that_the_user_cannot_read_are_named(owned):
-    users.give(owned.key_stash, 0, 0)
-    code, told = owned.start_refused(*users.options())
+@pytest.mark.parametrize("name", ["key.stash", *READ])
+@pytest.mark.parametrize("checked", [False, True])
+def test_files_that_the_user_cannot_read_are_named(owned, name, checked):
+    path = owned.key_stash if name == "key.stash" else file_of_setting(owned, name)
+    users.give(path, 0, 0)
+    code, told = owned.start_refused(*users.options(), *(["--check"] if checked else []))
     assert code == 1
-    assert "%s: the server runs as %d, which may not read it" % (owned.key_stash, users.USER) in told
+    assert ("orvd: %s: the server runs as %d, which may not read it (Permission denied); give it to "
+            "that user (chown %d %s)" % (path, users.USER, users.USER, path)) in told
+
+
+@users.needs_root
+@pytest.mark.parametrize("name, without", [
+    ("orv-slapdTlsCaFile", ("orv-slapdTlsClientCertificate", "none")),
+    ("orv-slapdTlsCrlFile", ("orv-slapdTlsClientCertificate", "none")),
+    ("orv-slapdKrbKeytab", ("orv-slapdSaslMechanisms", "EXTERNAL")),
+    ("orv-slapdTlsKeyFile", ("orv-slapdTlsCertificateFile",)),
+])
+def test_files_of_settings_that_do_not_count_are_not_read(owned, name, without):
+    path = file_of_setting(owned, name)
+    owned.config.set(GROUP, "orv-slapdTlsClientCertificate", "none")
+    owned.config.set(GROUP, *without)
+    users.give(owned.config.path)
+    users.give(path, 0, 0)
+    owned.start(*users.options())
+
+
+@users.needs_root
+@pytest.mark.parametrize("name", READ)
+def test_files_that_the_user_may_not_read_any_more_are_named(owned, name):
+    owned.start(*users.options())
+    path = file_of_setting(owned, name)
+    users.give(path, 0, 0)
+    owned.process.send_signal(signal.SIGHUP)
+    owned.stderr.wait_for(lambda line: "%s: the server runs as %d, which may not read it" %
+                          (path, users.USER) in line)
+    clients.bind(owned).unbind_s()
 
 
 @users.needs_root
