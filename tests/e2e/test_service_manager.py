@@ -294,6 +294,22 @@ def test_unit_is_understood(unit):
     assert result.returncode == 0 and not about_it, result.stdout
 
 
+def lines_of(unit, name):
+    return re.findall("^%s=(.*)$" % name, unit.read_text(), re.MULTILINE)
+
+
+def test_unit_waits_for_the_addresses_of_the_host(unit):
+    assert lines_of(unit, "Wants") == ["network-online.target"]
+    assert "network-online.target" in lines_of(unit, "After")[0].split()
+
+
+def test_unit_starts_again_for_as_long_as_it_takes(unit):
+    assert lines_of(unit, "Restart") == ["on-failure"]
+    # The manager gives up after 5 starts within 10 seconds, unless the unit says otherwise.
+    assert int(lines_of(unit, "RestartSec")[0]) > 10 / 5
+    assert not lines_of(unit, "StartLimit[A-Za-z]*")
+
+
 @needs_analysis
 def test_unit_leaves_little_exposed(unit):
     result = analyze("security", "--offline=yes", "--threshold=20", str(unit))

@@ -46,6 +46,8 @@ const char* advice(int failure) noexcept {
              "manager";
     case EADDRINUSE:
       return "; another program has the port there: end that, or choose another port or address";
+    case EADDRNOTAVAIL:
+      return "; this host does not have the address, or not yet: see orv-slapdIpAddress";
     default:
       return "";
   }
