@@ -11,6 +11,7 @@ import sys
 import time
 
 import ldap
+import ldap.sasl
 import pytest
 
 from orv_e2e import clients, programs, wire
@@ -37,6 +38,19 @@ def places_of(pid, wanted):
                     yield flags
             except OSError:  # pages that cannot be read
                 continue
+
+
+def copies_of(pid, wanted):
+    """How often writable memory of the process contains the bytes."""
+    copies = 0
+    with open("/proc/%d/mem" % pid, "rb", buffering=0) as memory:
+        for begin, end, _ in mappings(pid):
+            memory.seek(begin)
+            try:
+                copies += memory.read(end - begin).count(wanted)
+            except OSError:  # pages that cannot be read
+                continue
+    return copies
 
 
 def holds(pid, wanted):
@@ -80,10 +94,15 @@ def reader(request, tmp_path):
     return request.getfixturevalue("server")
 
 
+def middle_of(password):
+    """Enough of it to give it away; the ends may be overwritten by the allocator."""
+    quarter = len(password) // 4
+    return password[quarter:-quarter]
+
+
 def remains(pid, password):
     """Whether enough of a password to give it away is in the process's memory."""
-    quarter = len(password) // 4  # the ends may be overwritten by the allocator
-    return holds(pid, password[quarter:-quarter])
+    return holds(pid, middle_of(password))
 
 
 def test_passwords_sent_to_bind_are_wiped(request, tmp_path):
@@ -141,26 +160,47 @@ def test_passwords_that_prove_user_names_are_wiped(request, tmp_path):
 
 
 def bound(server, transport, name, password):
-    """A client that is bound over TLS or in clear."""
+    """A client that is bound over TLS, in clear, or with a layer that signs what it leaves in clear."""
     client = ldap.initialize(server.secure_url if transport == "ldaps" else server.url)
     client.set_option(ldap.OPT_X_TLS_CACERTFILE, str(server.certificate))
     client.set_option(ldap.OPT_X_TLS_NEWCTX, 0)
     client.set_option(ldap.OPT_TIMEOUT, programs.DEADLINE)
     if transport == "starttls":
         client.start_tls_s()
-    client.simple_bind_s(name, password)
+    if transport == "layer":
+        client.set_option(ldap.OPT_X_SASL_SECPROPS, "minssf=1,maxssf=1")
+        client.sasl_interactive_bind_s("", ldap.sasl.sasl(
+            {ldap.sasl.CB_AUTHNAME: name.partition("=")[2], ldap.sasl.CB_PASS: password},
+            "DIGEST-MD5"))
+    else:
+        client.simple_bind_s(name, password)
     return client
 
 
-@pytest.mark.parametrize("transport", ["clear", "ldaps", "starttls"])
+@pytest.mark.parametrize("transport", ["clear", "ldaps", "starttls", "layer"])
 def test_passwords_that_changes_set_are_wiped(request, tmp_path, transport):
     """What is stored is protected; the clear text is nowhere once the change is made or refused."""
     server = reader(request, tmp_path)
     if server is None:
         return
 
+    connected = []
+
     def client_of(name, password):
-        return bound(server, transport, name, password)
+        connected.append(bound(server, transport, name, password))
+        return connected[-1]
+
+    def check_what_the_layers_keep():
+        """The SASL library's own packets: wiped by what is longer, and when the connection ends."""
+        for password in passwords:
+            assert copies_of(pid, middle_of(password)) <= 2, password
+        root.search_s("", ldap.SCOPE_BASE, "(cn=%s)" % ("x" * 1000))
+        assert not remains(pid, refused)
+        while connected:
+            connected.pop().unbind_s()
+        until = time.monotonic() + programs.DEADLINE
+        while any(remains(pid, password) for password in passwords):
+            assert time.monotonic() < until
 
     pid = server.process.pid
     letters = (string.ascii_letters + string.digits + "!#$%&*+-./<=>?@").encode()
@@ -170,6 +210,7 @@ def test_passwords_that_changes_set_are_wiped(request, tmp_path, transport):
     long, other = shuffled[::2], shuffled[1::2]
     added, changed = [b"Ka1#Tz8!mBn4", long], [b"Mo9#Qw2!vCx7", other]
     own, refused = b"Ri5#Hy3!sDf6", b"Lu4#Gp8!jEk2"
+    passwords = (*added, *changed, own, refused)
 
     def change_password(client, name, password):
         client.modify_s(dn(name), [(ldap.MOD_REPLACE, "orv-slapdAdminPW", [password])])
@@ -180,8 +221,11 @@ def test_passwords_that_changes_set_are_wiped(request, tmp_path, transport):
     def member(name, password):
         return [("objectClass", [b"top", b"orv-slapdConfigEntry", b"orv-slapdAdminGroupMember"]),
                 ("cn", name.encode()), ("orv-slapdAdminDN", b"cn=" + name.encode()),
+                ("orv-slapdDigestAdminUser", name.encode()),
                 ("orv-slapdAdminRole", b"SchemaAdmin"), ("orv-slapdAdminPW", password)]
 
+    bound(server, "clear", "cn=root", server.password).modify_s(
+        "cn=digest,cn=configuration", [(ldap.MOD_REPLACE, "orv-slapdDigestAdminUser", [b"root"])])
     root = client_of("cn=root", server.password)
     for name, first, second in zip(("short", "long"), added, changed):
         root.add_s(dn(name), member(name, first))
@@ -195,7 +239,9 @@ def test_passwords_that_changes_set_are_wiped(request, tmp_path, transport):
     with pytest.raises(ldap.INVALID_CREDENTIALS):
         client_of("cn=short", changed[0].decode())
     clients.connect(server).search_s("", ldap.SCOPE_BASE)
-    for password in (*added, *changed, own, refused):
+    if transport == "layer":
+        check_what_the_layers_keep()
+    for password in passwords:
         assert not remains(pid, password), password
     assert holds(pid, server.config.path.name.encode())  # the search itself works
 

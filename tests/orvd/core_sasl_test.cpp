@@ -4,6 +4,7 @@
 
 #include <sys/socket.h>
 
+#include <cstdint>
 #include <sstream>
 
 #include "../temporary_directory.h"
@@ -398,6 +399,49 @@ TEST_F(LayerTest, PartOfAFrameEndsTheConnectionInTime) {
   ASSERT_GE(notice.size(), 10U);
   EXPECT_EQ(notice[4], 0);
   EXPECT_EQ(notice[9], 52);
+}
+
+// Whether memory that is left out of core dumps, as that is into which connections read, holds it.
+bool is_where_connections_read(std::string_view wanted) {
+  std::ifstream maps("/proc/self/smaps");
+  std::ifstream memory("/proc/self/mem", std::ios::binary);
+  std::uintptr_t begin = 0;
+  std::uintptr_t end = 0;
+  for (std::string line; std::getline(maps, line);) {
+    std::istringstream bounds(line);
+    std::uintptr_t first = 0;
+    std::uintptr_t last = 0;
+    char dash = 0;
+    if (bounds >> std::hex >> first >> dash >> last && dash == '-') {
+      begin = first;
+      end = last;
+    }
+    if (!line.starts_with("VmFlags:") || (line + " ").find(" dd ") == std::string::npos) continue;
+    std::string bytes(end - begin, '\0');
+    memory.clear();
+    memory.seekg(static_cast<std::streamoff>(begin));
+    memory.read(bytes.data(), static_cast<std::streamsize>(bytes.size()));
+    if (bytes.find(wanted) != std::string::npos) return true;
+  }
+  return false;
+}
+
+TEST_F(LayerTest, PartsOfMessagesThatMoveLeaveNothingBehind) {
+  const std::string password = "a password";
+  start();
+  WireClient client(port());
+  bind_with_layer(client);
+  const std::string request = test::modify(4, kTop, "cn", password + " and more");
+  const std::size_t part = request.size() - 3;
+  client.send(
+      MaskLayer::frame(test::delete_entry(3, std::string(200, 'x')) + request.substr(0, part)));
+  EXPECT_EQ(frame(client).at(4), 3);
+  EXPECT_TRUE(is_where_connections_read(password));
+  client.send(MaskLayer::frame(request.substr(part)));
+  EXPECT_EQ(frame(client).at(4), 4);
+  client.send(MaskLayer::frame(test::delete_entry(5, kTop)));  // the other is done with
+  EXPECT_EQ(frame(client).at(4), 5);
+  EXPECT_FALSE(is_where_connections_read(password));
 }
 
 TEST_F(LayerTest, NoticeOfDisconnectionIsProtected) {

@@ -197,6 +197,29 @@ class CyrusLayer final : public SecurityLayer {
   }
 
  private:
+  // The library's buffer, until its next call. Passwords would stay in it for as long as nothing
+  // longer follows; what it keeps beside it is wiped with the connection only.
+  static void take_from(const char* converted, unsigned length, std::string& to) {
+    struct Wiper {
+      ~Wiper() { cfg::wipe(const_cast<char*>(from), length); }
+      const char* from;
+      unsigned length;
+    } const wiper{converted, length};
+    append_wiping(to, {converted, length});
+  }
+
+  // What outgrows its place leaves nothing there.
+  static void append_wiping(std::string& to, std::string_view more) {
+    if (to.capacity() - to.size() < more.size()) {
+      std::string larger;
+      larger.reserve(std::max(2 * to.size(), to.size() + more.size()));
+      larger += to;
+      to.swap(larger);
+      cfg::wipe(larger);
+    }
+    to += more;
+  }
+
   template <typename Convert>
   bool convert(Convert function, std::string_view from, std::string& to) {
     while (!from.empty()) {
@@ -208,7 +231,7 @@ class CyrusLayer final : public SecurityLayer {
                                 static_cast<unsigned>(part.size()), &converted, &length);
       if (code == SASL_NOMEM || sasl_lacked_memory()) throw std::bad_alloc();
       if (code != SASL_OK) return false;
-      if (length > 0) to.append(converted, length);
+      if (length > 0) take_from(converted, length, to);
       from.remove_prefix(part.size());
     }
     return true;

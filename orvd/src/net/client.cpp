@@ -3,6 +3,7 @@
 #include <sys/socket.h>
 
 #include <algorithm>
+#include <array>
 #include <asio/buffer.hpp>
 #include <asio/error.hpp>
 #include <asio/ip/tcp.hpp>
@@ -46,6 +47,17 @@ bool later(const asio::error_code& error) {
   return error == asio::error::would_block || error == asio::error::try_again ||
          error == asio::error::interrupted;
 }
+
+// A layer may only sign: what it takes and what it gives may both hold passwords in clear.
+struct WipedText {
+  ~WipedText() { cfg::wipe(text); }
+  std::string text;
+};
+struct WipedBytes {
+  ~WipedBytes() { cfg::wipe(bytes.data(), used); }
+  std::array<char, kReadBytes> bytes;
+  std::size_t used = 0;
+};
 
 }  // namespace
 
@@ -246,11 +258,11 @@ bool Client::transport_holds() {
 
 // The layer protects what follows the bind: what came in clear behind it is nobody's message.
 void Client::protect(std::unique_ptr<SecurityLayer> layer) {
-  const std::string rest(layer_ ? std::string_view() : unread());
+  const WipedText rest{std::string(layer_ ? std::string_view() : unread())};
   layer_ = std::move(layer);
-  if (rest.empty()) return;
-  begin_ = end_ = 0;
-  if (!unwrap(rest)) close("not protected by the security layer");
+  if (rest.text.empty()) return;
+  forget_input();
+  if (!unwrap(rest.text)) close("not protected by the security layer");
 }
 
 // ---- reading
@@ -279,14 +291,16 @@ void Client::readable() {
 }
 
 void Client::read() {
-  char wire[kReadBytes];
+  WipedBytes wire;
   if (!layer_) make_room();
-  char* const to = layer_ ? wire : in_.data() + end_;
-  const std::size_t room = layer_ ? sizeof wire : in_.size() - end_;
+  char* const to = layer_ ? wire.bytes.data() : in_.data() + end_;
+  const std::size_t room = layer_ ? wire.bytes.size() : in_.size() - end_;
   std::size_t length = 0;
   switch (receive_some(to, room, length)) {
     case Flow::moved:
-      return layer_ ? received_wrapped({wire, length}) : received(length);
+      if (!layer_) return received(length);
+      wire.used = length;
+      return received_wrapped({wire.bytes.data(), length});
     case Flow::needs_input:
       return nothing_yet();
     case Flow::needs_output:
@@ -318,16 +332,23 @@ void Client::received_wrapped(std::string_view wire) {
 
 // Adds what is in it to what is to be handled.
 bool Client::unwrap(std::string_view wire) {
-  std::string clear;
-  if (!layer_->unwrap(wire, clear)) return false;
-  std::memmove(in_.data(), in_.data() + begin_, end_ - begin_);
-  end_ -= std::exchange(begin_, 0);
+  WipedText unwrapped;
+  const std::string& clear = unwrapped.text;
+  if (!layer_->unwrap(wire, unwrapped.text)) return false;
+  move_to_front();
   if (end_ == 0) make_room();
   if (in_.size() - end_ < clear.size()) in_.resize(end_ + clear.size(), end_);
   std::memcpy(in_.data() + end_, clear.data(), clear.size());
   end_ += clear.size();
-  cfg::wipe(clear);
   return true;
+}
+
+// What moves leaves no password behind.
+void Client::move_to_front() noexcept {
+  const std::size_t end = std::exchange(end_, end_ - begin_);
+  std::memmove(in_.data(), in_.data() + begin_, end_);
+  cfg::wipe(in_.data() + end_, end - end_);
+  begin_ = 0;
 }
 
 // Keeps room for reading: the message at hand moves to the front, and only what has really arrived
@@ -338,15 +359,10 @@ void Client::make_room() {
     if (in_.size() > kReadBytes) in_.resize(kReadBytes, 0);
   }
   if (end_ < in_.size()) return;
-  // What moves leaves no password behind.
-  if (begin_ > 0) {
-    const std::size_t end = std::exchange(end_, end_ - begin_);
-    std::memmove(in_.data(), in_.data() + begin_, end_);
-    cfg::wipe(in_.data() + end_, end - end_);
-    begin_ = 0;
-  } else {
+  if (begin_ > 0)
+    move_to_front();
+  else
     in_.resize(in_.size() * 2, end_);
-  }
 }
 
 // Gives up what has been read and not handled.

@@ -109,6 +109,7 @@ class Client final : public Session {
   void process();
   bool process_one();
   void make_room();
+  void move_to_front() noexcept;
   bool unwrap(std::string_view wire);
   void nothing_yet();
   void consume(std::size_t length);
