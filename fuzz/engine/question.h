@@ -24,6 +24,7 @@ class OpenLayer final : public server::SecurityLayer {
     clear += wire;
     return true;
   }
+  bool has_part() const noexcept override { return false; }
 };
 
 class QuestionExchange final : public server::SaslExchange {

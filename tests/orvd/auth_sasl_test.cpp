@@ -462,6 +462,21 @@ TEST_F(LayerOfDigest, TakesFramesFromTheClientHoweverTheyAreCut) {
   EXPECT_EQ(clear, text);
 }
 
+TEST_F(LayerOfDigest, TellsWhetherTheClientOwesTheRestOfAFrame) {
+  const std::string one = peer.encode("some text");
+  const std::string two = one + peer.encode("some other text");
+  std::string clear;
+  for (std::size_t i = 0; i < two.size(); ++i) {
+    EXPECT_EQ(layer->has_part(), i != 0 && i != one.size()) << i;
+    ASSERT_TRUE(layer->unwrap(two.substr(i, 1), clear));
+  }
+  EXPECT_FALSE(layer->has_part());
+  EXPECT_EQ(clear, "some textsome other text");
+  const std::string third = peer.encode("the last text");
+  ASSERT_TRUE(layer->unwrap(third + third.substr(0, 2), clear));
+  EXPECT_TRUE(layer->has_part());
+}
+
 TEST_F(LayerOfDigest, RefusesWhatIsDamaged) {
   std::string wire = peer.encode("some text").value();
   wire[wire.size() / 2] = static_cast<char>(wire[wire.size() / 2] ^ 1);

@@ -46,6 +46,7 @@ class MaskLayer final : public SecurityLayer {
     }
     return true;
   }
+  bool has_part() const noexcept override { return !rest_.empty(); }
   static std::string frame(std::string_view clear) {
     std::string wire;
     for (int shift = 24; shift >= 0; shift -= 8)
@@ -389,16 +390,64 @@ TEST_F(LayerTest, StartTlsIsRefusedUnderALayer) {
   EXPECT_EQ(frame(client).at(9), 1);
 }
 
-TEST_F(LayerTest, PartOfAFrameEndsTheConnectionInTime) {
-  settings.message_timeout = 1;
+class PartOfAFrame : public LayerTest {
+ protected:
+  PartOfAFrame() {
+    settings.message_timeout = 1;
+    settings.idle_timeout = 10;
+  }
+  static void expect_notice(WireClient& client, std::string_view why) {
+    const std::string notice = frame(client);
+    ASSERT_GE(notice.size(), 10U);
+    EXPECT_EQ(notice[4], 0);
+    EXPECT_EQ(notice[9], 52);
+    EXPECT_NE(notice.find(why), std::string::npos) << notice;
+  }
+  static constexpr std::string_view kUnfinished = "message not finished in time";
+  const std::string part{"\0\0\1\0half", 8};
+};
+
+TEST_F(PartOfAFrame, EndsTheConnectionInTime) {
   start();
   WireClient client(port());
   bind_with_layer(client);
-  client.send(std::string("\0\0\1\0half", 8));
-  const std::string notice = frame(client);
-  ASSERT_GE(notice.size(), 10U);
-  EXPECT_EQ(notice[4], 0);
-  EXPECT_EQ(notice[9], 52);
+  client.send(part);
+  expect_notice(client, kUnfinished);
+}
+
+TEST_F(PartOfAFrame, EndsTheConnectionInTimeAlsoBehindAWholeOne) {
+  start();
+  WireClient clients[] = {WireClient(port()), WireClient(port()), WireClient(port())};
+  const std::size_t cuts[] = {1, 4, part.size()};
+  for (std::size_t i = 0; i < 3; ++i) {
+    bind_with_layer(clients[i]);
+    clients[i].send(MaskLayer::frame(test::delete_entry(3, kTop)) + part.substr(0, cuts[i]));
+    EXPECT_EQ(frame(clients[i]).at(4), 3);
+  }
+  for (WireClient& client : clients) expect_notice(client, kUnfinished);
+}
+
+TEST_F(PartOfAFrame, EndsTheConnectionInTimeAlsoBehindTheLastStep) {
+  start();
+  WireClient client(port());
+  ASSERT_EQ(step(client, 1, "QUESTION", "layer").code, kInProgress);
+  client.send(test::sasl_bind(2, "QUESTION", kSecret) + part);
+  ASSERT_EQ(client.receive()->code, 0);
+  expect_notice(client, kUnfinished);
+}
+
+TEST_F(PartOfAFrame, IsWaitedForAnewAfterEachMessage) {
+  settings.message_timeout = 3600;
+  settings.idle_timeout = 1;
+  start();
+  WireClient client(port());
+  bind_with_layer(client);
+  const std::string whole = MaskLayer::frame(test::delete_entry(3, kTop));
+  client.send(whole + whole.substr(0, 7));
+  EXPECT_EQ(frame(client).at(4), 3);
+  client.send(whole.substr(7));
+  EXPECT_EQ(frame(client).at(4), 3);
+  expect_notice(client, "idle for too long");  // nothing is in pieces any more
 }
 
 // Whether memory that is left out of core dumps, as that is into which connections read, holds it.

@@ -55,6 +55,8 @@ class SecurityLayer {
   // keeps the beginning of what is not whole yet. False when they are damaged, or longer than what
   // was negotiated: the connection ends.
   virtual bool unwrap(std::string_view wire, std::string& clear) = 0;
+  // Whether such a beginning is kept: the client owes its other half.
+  virtual bool has_part() const noexcept = 0;
 };
 
 // What one step came to.

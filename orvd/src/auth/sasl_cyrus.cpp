@@ -13,6 +13,7 @@
 #include "auth/digest_response.h"
 #include "auth/kerberos.h"
 #include "auth/sasl_callbacks.h"
+#include "auth/sasl_frames.h"
 #include "auth/sasl_memory.h"
 #include "cfg/secret.h"
 
@@ -193,8 +194,10 @@ class CyrusLayer final : public SecurityLayer {
     return convert(sasl_encode, clear, wire);
   }
   bool unwrap(std::string_view wire, std::string& clear) override {
+    frames_.pass(wire);
     return convert(sasl_decode, wire, clear);
   }
+  bool has_part() const noexcept override { return frames_.has_part(); }
 
  private:
   // The library's buffer, until its next call. Passwords would stay in it for as long as nothing
@@ -239,6 +242,7 @@ class CyrusLayer final : public SecurityLayer {
 
   const std::shared_ptr<Exchange> exchange_;
   const unsigned longest_;
+  SaslFrames frames_;  // from the client
 };
 
 // ---- One exchange, as the protocol engine sees it

@@ -260,9 +260,12 @@ bool Client::transport_holds() {
 void Client::protect(std::unique_ptr<SecurityLayer> layer) {
   const WipedText rest{std::string(layer_ ? std::string_view() : unread())};
   layer_ = std::move(layer);
-  if (rest.text.empty()) return;
-  forget_input();
-  if (!unwrap(rest.text)) close("not protected by the security layer");
+  if (!rest.text.empty()) {
+    forget_input();
+    if (!unwrap(rest.text)) return close("not protected by the security layer");
+    message_begun_ = Clock::now();
+  }
+  in_pieces_ = layer_->has_part();
 }
 
 // ---- reading
@@ -313,7 +316,8 @@ void Client::read() {
   }
 }
 
-// Whoever sends half a record has as long for the other half as for that of a message.
+// Whoever sends half a record, or half a frame of a layer, has as long for the other half as for
+// that of a message.
 void Client::nothing_yet() {
   if (!stream_) return;
   const bool in_pieces = stream_->has_part_of_record();
@@ -326,7 +330,7 @@ void Client::received_wrapped(std::string_view wire) {
   const bool waited = in_pieces_ || begin_ != end_;
   if (!unwrap(wire)) return close("not protected by the security layer");
   if (!waited) message_begun_ = Clock::now();
-  in_pieces_ = begin_ == end_;
+  in_pieces_ = layer_->has_part();
   process();
 }
 

@@ -165,7 +165,7 @@ class Client final : public Session {
   bool processing_ = false;
   bool last_here_ = false;   // the message at hand is the last one that is here
   bool continuing_ = false;  // a continuation of process() is posted
-  bool in_pieces_ = false;   // part of a record is here that nothing can be told from
+  bool in_pieces_ = false;   // part of a record or frame is here that nothing can be told from
 
   std::string out_;  // bytes from out_sent_ on are to be written
   std::size_t out_sent_ = 0;
