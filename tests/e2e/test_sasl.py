@@ -378,6 +378,21 @@ def test_keytab_is_taken_over_by_hangup(instance, realm):
     assert is_root(by_ticket(instance, realm.ticket("admin")))
 
 
+def test_kerberos_works_without_the_name_service_that_its_settings_ask(instance, realm, tmp_path):
+    """The serving process reaches none; at the start it may."""
+    settings = tmp_path / "krb5.conf"
+    settings.write_text((realm.folder / "krb5.conf").read_text()
+                        .replace("dns_canonicalize_hostname = false", "dns_canonicalize_hostname = true")
+                        .replace("rdns = false", "rdns = true")
+                        .replace("dns_lookup_realm = false", "dns_lookup_realm = true"))
+    with_kerberos(instance, realm.folder / "afterwards.keytab")
+    instance.start(environment={**realm.environment, "KRB5_CONFIG": str(settings)})
+    assert announced(clients.connect(instance)) == []
+    realm.keytab("ldap/localhost", "afterwards.keytab")
+    reload(instance)
+    assert is_root(by_ticket(instance, realm.ticket("admin")))
+
+
 def test_connection_ends_when_the_kerberos_identity_is_taken_away(kerberized, realm, monkeypatch):
     for name, value in realm.ticket("admin").items():
         monkeypatch.setenv(name, value)

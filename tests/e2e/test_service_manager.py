@@ -310,6 +310,15 @@ def test_unit_starts_again_for_as_long_as_it_takes(unit):
     assert not lines_of(unit, "StartLimit[A-Za-z]*")
 
 
+def test_unit_lets_nothing_be_executed_that_the_server_can_write(unit):
+    settings = dict(re.findall(r"^(\w+)=(.*)$", unit.read_text(), re.MULTILINE))
+    assert settings["ProtectSystem"] == "strict" and settings["PrivateTmp"] == "yes"
+    assert "ReadWritePaths" not in settings and "RuntimeDirectory" not in settings
+    assert set(settings["NoExecPaths"].split()) == {
+        "%S/" + settings["StateDirectory"], "%L/" + settings["LogsDirectory"], "/tmp", "/var/tmp",
+        "-/dev/shm"}
+
+
 @needs_analysis
 def test_unit_leaves_little_exposed(unit):
     result = analyze("security", "--offline=yes", "--threshold=20", str(unit))

@@ -1,6 +1,7 @@
 // The filter of system calls, each time in a process of its own: there is no way back from it.
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <ifaddrs.h>
 #include <netinet/in.h>
 #include <signal.h>
 #include <sys/ioctl.h>
@@ -20,6 +21,7 @@
 #include <string>
 #include <thread>
 
+#include "descriptor.h"
 #include "process/call_filter.h"
 
 namespace orv::server {
@@ -116,24 +118,79 @@ TEST(CallFilterTest, MemoryIsWrittenOrExecuted) {
             0);
 }
 
-TEST(CallFilterTest, NoStreamLeavesTheHost) {
-  for (const int family : {AF_INET, AF_INET6}) {
-    EXPECT_EQ(end_of([family] { return is_missing(socket(family, SOCK_STREAM, 0)); }), 0);
-    EXPECT_EQ(end_of([family] {
-                return is_missing(socket(family, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
-              }),
-              0);
-    EXPECT_EQ(end_of([family] { return is_missing(socket(family, SOCK_RAW, IPPROTO_RAW)); }), 0);
+TEST(CallFilterTest, NoSocketIsMadeButForTheListOfTheHostsAddresses) {
+  for (const int family : {AF_INET, AF_INET6, AF_UNIX, AF_PACKET})
+    for (const int type : {SOCK_STREAM, SOCK_DGRAM, SOCK_RAW, SOCK_SEQPACKET})
+      for (const int flags : {0, SOCK_CLOEXEC | SOCK_NONBLOCK})
+        EXPECT_EQ(end_of([=] { return is_missing(socket(family, type | flags, 0)); }), 0)
+            << family << ' ' << type;
+  EXPECT_EQ(end_of([] {
+              ifaddrs* found = nullptr;
+              return getifaddrs(&found) == 0 && found != nullptr ? 0 : 1;
+            }),
+            0);
+}
+
+// A connection that a client has made, and the address at which it was accepted.
+class CallFilterAtAConnection : public testing::Test {
+ protected:
+  void SetUp() override {
+    ASSERT_EQ(bind(listener.number(), plain(), size), 0);
+    ASSERT_EQ(listen(listener.number(), 4), 0);
+    ASSERT_EQ(getsockname(listener.number(), plain(), &size), 0);
+    ASSERT_EQ(connect(client.number(), plain(), size), 0);
+    served = Descriptor(accept(listener.number(), nullptr, nullptr));
+    ASSERT_TRUE(served);
   }
-  EXPECT_EQ(end_of([] { return is_missing(socket(AF_PACKET, SOCK_RAW, 0)); }), 0);
+  sockaddr* plain() { return reinterpret_cast<sockaddr*>(&address); }
+
+  sockaddr_in address{
+      .sin_family = AF_INET, .sin_port = 0, .sin_addr = {htonl(INADDR_LOOPBACK)}, .sin_zero = {}};
+  socklen_t size = sizeof address;
+  Descriptor listener{socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0)};
+  Descriptor client{socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0)};
+  Descriptor served;
+};
+
+TEST_F(CallFilterAtAConnection, ItBecomesNoneToSomebodyElse) {
+  EXPECT_EQ(end_of([this] {
+              address.sin_family = AF_UNSPEC;
+              return is_missing(connect(served.number(), plain(), size));
+            }),
+            0);
+  EXPECT_EQ(end_of([this] { return is_missing(connect(served.number(), plain(), size)); }), 0);
+}
+
+TEST_F(CallFilterAtAConnection, NothingIsSentThatConnectsOnTheWay) {
+  const Descriptor unused(socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  const int to = unused.number();
+  char text[] = "x";
+  iovec part{text, 1};
+  mmsghdr several{};
+  several.msg_hdr.msg_name = &address;
+  several.msg_hdr.msg_namelen = size;
+  several.msg_hdr.msg_iov = &part;
+  several.msg_hdr.msg_iovlen = 1;
+  EXPECT_EQ(end_of([&] { return is_missing(sendto(to, text, 1, MSG_FASTOPEN, plain(), size)); }),
+            0);
+  EXPECT_EQ(end_of([&] { return is_missing(sendmsg(to, &several.msg_hdr, MSG_FASTOPEN)); }), 0);
+  EXPECT_EQ(end_of([&] { return is_missing(sendmmsg(to, &several, 1, MSG_FASTOPEN)); }), 0);
+}
+
+TEST_F(CallFilterAtAConnection, ItIsAnswered) {
+  EXPECT_EQ(end_of([this] {
+              const int to = served.number();
+              return send(to, "a", 1, MSG_NOSIGNAL) == 1 && write(to, "b", 1) == 1 ? 0 : 1;
+            }),
+            0);
+  char text[3] = {};
+  EXPECT_EQ(recv(client.number(), text, 2, MSG_WAITALL), 2);
+  EXPECT_STREQ(text, "ab");
 }
 
 TEST(CallFilterTest, NothingNewIsListenedAt) {
-  EXPECT_EQ(end_of([] {
-              const int made = socket(AF_UNIX, SOCK_STREAM, 0);
-              return made < 0 ? 2 : listen(made, 1);
-            }),
-            -SIGSYS);
+  const Descriptor made(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  EXPECT_EQ(end_of([&made] { return listen(made.number(), 1); }), -SIGSYS);
 }
 
 TEST(CallFilterTest, TerminalsAreNotWrittenInto) {

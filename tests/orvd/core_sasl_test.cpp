@@ -5,6 +5,7 @@
 #include <sys/socket.h>
 
 #include <cstdint>
+#include <fstream>
 #include <sstream>
 
 #include "../temporary_directory.h"

@@ -1,7 +1,13 @@
 // The system calls that the serving process has left.
 //
 // A process that was taken over from outside can do no more than this: it cannot start programs,
-// look into others, connect to another host over TCP, or make memory executable that it wrote.
+// look into others, connect to anybody, listen anew, or make memory executable that it wrote. The
+// connections that clients have made are the only ones it has; there is no name service either.
+//
+// A filter sees the numbers that a call is given, and no names of files. So it does not keep such a
+// process from what belongs to the server: its files, the connections and what is known to it. Nor
+// from executing a file: a library that is loaded looks like a file that the process wrote itself.
+// That has to be kept out by where it can write, as packaging/orvd.service.in does.
 //
 // Threads: any; in force for all of them.
 #pragma once
