@@ -10,6 +10,7 @@
 #include "cfg/dn.h"
 #include "cfg/text.h"
 #include "config/setting_ranges.h"
+#include "slapi/password_method.h"
 
 namespace orv::orvcfg {
 
@@ -69,6 +70,9 @@ constexpr Vocabulary kVocabularies[] = {{"orv-slapdLogLevel", kLogLevels},
                                         {"orv-slapdAdminRole", kAdminRoles}};
 
 std::string word_problem(std::string_view name, const std::string& value) {
+  if (name == "orv-slapdPwEncryption" || name == "orv-slapdPwEncryptionAllowed") {
+    return password_method_problem(value);
+  }
   for (const Vocabulary& known : kVocabularies) {
     if (known.name != name) continue;
     const auto is_value = [&](std::string_view word) {

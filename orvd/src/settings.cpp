@@ -238,6 +238,7 @@ std::string value_problem(std::string_view name, std::string_view value) {
   if (name == "orv-slapdTlsClientCertificate") return none_of(kClientCertificates);
   if (name == "orv-slapdTlsMinimumVersion") return none_of(kTlsVersions);
   if (name == kSaslMechanismSetting) return none_of(kSaslMechanisms);
+  if (name == kAllowedMethods) return password_method_problem(value);
   if (name == kDigestRealm && !is_digest_realm(value))
     return "is not 1 to 255 characters of ASCII without quotes and backslashes";
   CertificateMapping mapping;

@@ -87,9 +87,14 @@ struct SettingRow {
 // All integer settings, in the order of the documentation.
 std::span<const SettingRow> setting_rows() noexcept;
 
+// Attribute of the methods of storing passwords that may be used.
+inline constexpr std::string_view kAllowedMethods = "orv-slapdPwEncryptionAllowed";
+
 // What is wrong with a value of a setting that is a word or a realm, or of a map of certificates;
 // "" when nothing is, or the setting is another one. With such a word or realm the server would not
-// start; of a map it would leave the value out, and warn.
+// start; of a map it would leave the value out, and warn; a list of methods with such a name in it
+// (orv-slapdPwEncryptionAllowed) would not be put in force. The method itself is looked at by the
+// rules.
 std::string value_problem(std::string_view name, std::string_view value);
 
 // Takes one value over. False, with the reason in `error`, when `value` is not an integer within

@@ -186,6 +186,14 @@ int try_method(const Method& method) noexcept {
 
 }  // namespace
 
+std::string password_method_problem(std::string_view name) {
+  if (find_method(name) != nullptr) return "";
+  std::string problem = "is none of the methods";
+  for (const Method& method : kMethods)
+    if (cfg::can_make_secret(method.stored)) problem.append(" ").append(method.name);
+  return problem;
+}
+
 int load_password_methods(_CFG* session) noexcept {
   stage(password_method::none_converted);
   Rules rules;

@@ -3,8 +3,8 @@
 import ldap
 import pytest
 
-from orv_e2e import clients
-from orv_e2e.changes import GROUP, PASSWORD, add, member, refusal
+from orv_e2e import changes, clients
+from orv_e2e.changes import GROUP, PASSWORD, add, added, member, modify, refusal, replaced
 
 TOP = clients.BASE
 CAROL = "cn=carol," + GROUP
@@ -85,6 +85,25 @@ def test_unknown_method_is_refused_with_its_message_and_the_old_one_stays(carol,
     assert carol.config.read() == before
     assert set_password(root, "Qm4&wt8?Lb6%") == (0, "")
     assert stored(carol).startswith("{AES256}")
+
+
+def test_unknown_method_among_those_allowed_is_refused_and_the_list_goes_on_to_hold(carol, root):
+    allowed = "orv-slapdPwEncryptionAllowed"
+    assert modify(root, GROUP, added(allowed, "AES256", "ssha512")) == 0
+    before = carol.config.read()
+    number = changes.numbers_of_classes()[allowed]
+    for change in (added(allowed, "bogus"), replaced(allowed, "AES256", "SSHA-512"),
+                   added(number, "bogus"), added(allowed.upper(), "{SSHA512}"),
+                   added(allowed, "SSHA512 ")):
+        code, text = refusal(root, GROUP, change)
+        assert code == 21, change
+        assert allowed in text and "SSHA512" in text
+        assert carol.config.read() == before
+    # What the list says is in force.
+    assert modify(root, TOP, replaced("orv-slapdPwEncryption", "SSHA256")) == 53
+    assert modify(root, TOP, replaced("orv-slapdPwEncryption", "SSHA512")) == 0
+    assert set_password(root, "Qm4&wt8?Lb6%") == (0, "")
+    assert stored(carol).startswith("{SSHA512}")
 
 
 def test_forbidden_method_is_refused_with_53_and_the_old_one_stays(carol, root):

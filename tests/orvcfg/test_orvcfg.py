@@ -242,6 +242,11 @@ class Check(Tool):
                  "orv-slapdIpAddress holds characters outside ASCII"),
                 ("orv-slapdLogLevel: info\n", "orv-slapdLogLevel: loud\n",
                  "orv-slapdLogLevel is none of"),
+                ("orv-slapdPwEncryption: AES256\n", "orv-slapdPwEncryption: SHA1\n",
+                 "orv-slapdPwEncryption is none of the methods none AES256 SSHA256"),
+                ("orv-slapdTlsForPasswords: TRUE\n",
+                 "orv-slapdTlsForPasswords: TRUE\norv-slapdPwEncryptionAllowed: bogus\n",
+                 "orv-slapdPwEncryptionAllowed is none of the methods none AES256"),
                 (f"orv-slapdLog: {self.path('i', 'log', 'audit.log')}\n",
                  "orv-slapdLog: audit.log\n",
                  "orv-slapdLog is not an absolute path")):

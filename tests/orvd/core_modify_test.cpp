@@ -178,6 +178,27 @@ TEST(ValueGuards, LookAtAddedEntriesToo) {
   EXPECT_EQ(code_of_adding({"objectClass", {"orv-slapdAdminGroupSettings"}}), 53);
 }
 
+TEST_F(ModifyServer, RefusesMethodsOfStoringPasswordsThatAreNone) {
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  const auto code_of_change = [&](int id, int operation, const std::vector<std::string>& values) {
+    return code_of(client, modify_with(id, "cn=admingroup,cn=configuration",
+                                       {{operation, "ORV-slapdPwEncryptionAllowed", values}}));
+  };
+  EXPECT_EQ(code_of_change(2, 0, {"bogus"}), 21);
+  EXPECT_EQ(code_of_change(3, 2, {"AES256", "{SSHA512}"}), 21);
+  EXPECT_EQ(code_of_change(4, 2, {"aes256", "None", "SSHA512", "pbkdf2-sha256"}), 0);
+  EXPECT_EQ(code_of_change(5, 1, {"bogus"}), 0) << "what an editor has put in can be taken out";
+  stop();
+  EXPECT_EQ(backend.calls(parameter::modify_function), 2);
+}
+
+TEST(ValueGuards, LookAtAddedMethodsOfStoringPasswordsToo) {
+  EXPECT_EQ(code_of_adding({"orv-slapdPwEncryptionAllowed", {"AES256", "bogus"}}), 21);
+  EXPECT_EQ(code_of_adding({"orv-slapdPwEncryptionAllowed", {"AES256"}}), 0);
+}
+
 // ---- modifications that fail
 
 class FailingModifies : public ModifyServer {

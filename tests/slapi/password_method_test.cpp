@@ -141,6 +141,18 @@ TEST_F(PasswordMethods, OfADamagedFileAreNotPutInForce) {
   }
 }
 
+TEST_F(PasswordMethods, AreKnownByTheirNamesWhetherAllowedOrNot) {
+  for (const char* const name : {"none", "AES256", "ssha512", "PBKDF2-sha256"})
+    EXPECT_EQ(password_method_problem(name), "") << name;
+  EXPECT_EQ(password_method_problem("crypt").empty(),
+            cfg::can_make_secret(cfg::SecretMethod::crypt));
+  for (const char* const name : {"", "bogus", "{SSHA512}", "SSHA512 ", "AES256,SSHA512"})
+    EXPECT_THAT(password_method_problem(name),
+                testing::StartsWith("is none of the methods none AES256 SSHA256 SSHA384 SSHA512 "
+                                    "PBKDF2-SHA256 PBKDF2-SHA512"))
+        << name;
+}
+
 TEST_F(PasswordMethods, WithoutASessionAreNotPutInForce) {
   ASSERT_EQ(load("orv-slapdPwEncryption: SSHA512\n"), 0);
   EXPECT_EQ(load_password_methods(nullptr), 1);

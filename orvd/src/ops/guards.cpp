@@ -54,10 +54,15 @@ Refusal refuse_class(std::string_view normal_dn, std::string_view name) {
   return {};
 }
 
+// A method that nobody knows is answered as the rules answer it where it is to be used.
+int code_of_problem(std::string_view type) noexcept {
+  return type == kAllowedMethods ? result::invalid_attribute_syntax : result::constraint_violation;
+}
+
 Refusal refuse_value(std::string_view normal_dn, std::string_view type, std::string_view value) {
   if (type == kObjectClass) return refuse_class(normal_dn, value);
   if (const std::string problem = value_problem(type, value); !problem.empty())
-    return {result::constraint_violation, std::string(type) + " " + problem};
+    return {code_of_problem(type), std::string(type) + " " + problem};
   for (const SettingRow& row : setting_rows()) {
     Settings scratch;
     std::string error;

@@ -20,8 +20,11 @@
 // `load_password_methods`. A write that failed leaves the method before. Passwords that are stored
 // already are not rewritten.
 //
-// Threads: thread-safe. Nothing throws.
+// Threads: thread-safe. Nothing throws but std::bad_alloc, and that only `password_method_problem`.
 #pragma once
+
+#include <string>
+#include <string_view>
 
 #include "cfg/session.h"
 
@@ -39,6 +42,10 @@ inline constexpr int crypt = 7;
 inline constexpr int aes256 = 8;
 inline constexpr int none_converted = 16;
 }  // namespace password_method
+
+// What is wrong with a value of these two settings, in words that follow the setting's name and
+// list the methods that this host can make; "" for one of them, allowed or not.
+std::string password_method_problem(std::string_view name);
 
 // Reads method and restrictions with a bound session and puts them in force, for this interface and
 // for the library that writes (cfg/secret.h). Without the attribute the method is AES256, which
