@@ -129,6 +129,23 @@ def test_second_identity_with_the_same_name_is_refused(root, refuse):
     assert refuse("cn=digest," + TOP, added("orv-slapdDigestAdminUser", "dave")) == 68
 
 
+def test_name_inside_the_configuration_is_refused_since_nobody_could_bind_with_it(server, root,
+                                                                                  refuse):
+    supplier, attributes = changes.supplier("near")
+    assert add(root, supplier, attributes) == 0
+    assert add(root, *member("carol")) == 0
+    for name in ("cn=foo,cn=configuration", "CN = Configuration", "cn=foo,2.5.4.3=\\43onfiguration"):
+        assert refuse(TOP, replaced("orv-slapdAdminDN", name)) == 19, name
+        assert refuse("cn=carol," + GROUP, replaced("orv-slapdAdminDN", name)) == 19
+        assert refuse(supplier, replaced("orv-slapdMasterDN", name)) == 19
+        assert add(root, *member("dave", bind_dn=name)) == 19
+        assert add(root, *changes.supplier("far", bind_dn=name)) == 19
+    _, text = refusal(root, TOP, replaced("orv-slapdAdminDN", name))
+    assert "orv-slapdAdminDN" in text and "CN=CONFIGURATION" in text
+    clients.bind(server).unbind_s()
+    clients.bind(server, "cn=carol", PASSWORD).unbind_s()
+
+
 def test_kerberos_identity_of_the_administrator_is_held_to_the_same(root, refuse):
     assert add(root, *member("dave", KrbAdminDN="orv-kn=dave@EXAMPLE.COM")) == 0
     dn = "cn=kerberos," + TOP

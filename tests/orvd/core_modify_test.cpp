@@ -199,6 +199,40 @@ TEST(ValueGuards, LookAtAddedMethodsOfStoringPasswordsToo) {
   EXPECT_EQ(code_of_adding({"orv-slapdPwEncryptionAllowed", {"AES256"}}), 0);
 }
 
+constexpr const char* kNamesOfNobody[] = {
+    "cn=foo,cn=configuration", "CN = Configuration", "cn=a,2.5.4.3=\\43onfiguration",
+    "cn=a+cn=b,cn=digest,commonName=#040D436F6E66696775726174696F6E"};
+
+TEST_F(ModifyServer, RefusesNamesWithWhichNobodyCouldBind) {
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  for (const char* const name : kNamesOfNobody) {
+    EXPECT_EQ(code_of(client, modify_with(2, kTop, {{2, "orv-slapdAdminDN", {name}}})), 19) << name;
+    EXPECT_EQ(code_of(client, modify_with(3, "cn=master server,cn=configuration",
+                                          {{0, "orv-slapdMasterDN", {name}}})),
+              19)
+        << name;
+  }
+  const char* const number = "2.25.83817390626969804497818767862655265745.1.1";
+  EXPECT_EQ(builtin_schema().canonical_attribute(number), "orv-slapdAdminDN");
+  EXPECT_EQ(code_of(client, modify_with(4, kTop, {{2, number, {"cn=foo,cn=configuration"}}})), 19);
+  EXPECT_EQ(code_of(client, modify_with(5, kTop, {{1, "orv-slapdAdminDN", {kNamesOfNobody[0]}}})),
+            0)
+      << "what an editor has put in can be taken out";
+  for (const char* const name : {"cn=configuration,o=x", "cn=configurations", "cn=foo"})
+    EXPECT_EQ(code_of(client, modify_with(6, kTop, {{2, "orv-slapdAdminDN", {name}}})), 0) << name;
+}
+
+TEST(ValueGuards, LookAtAddedNamesToo) {
+  for (const char* const type : {"orv-slapdAdminDN", "orv-slapdMasterDN"}) {
+    for (const char* const name : kNamesOfNobody) EXPECT_EQ(code_of_adding({type, {name}}), 19);
+    EXPECT_EQ(code_of_adding({type, {"cn=foo"}}), 0);
+    for (const char* const name : {"", " ", "no dn"})
+      EXPECT_EQ(code_of_adding({type, {name}}), 0) << "the schema has an answer to that";
+  }
+}
+
 // ---- modifications that fail
 
 class FailingModifies : public ModifyServer {

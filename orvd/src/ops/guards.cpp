@@ -1,7 +1,10 @@
 #include "ops/guards.h"
 
+#include <new>
 #include <string>
 
+#include "auth/identity_reader.h"
+#include "cfg/dn.h"
 #include "cfg/result_codes.h"
 #include "cfg/text.h"
 #include "net/tls.h"
@@ -15,6 +18,8 @@ constexpr std::string_view kPolicy = "CN=PWDPOLICY ADMIN,CN=CONFIGURATION";
 constexpr std::string_view kPassThrough = "CN=PASSTHROUGH AUTHENTICATION,CN=CONFIGURATION";
 constexpr std::string_view kAdminGroup = "CN=ADMINGROUP,CN=CONFIGURATION";
 constexpr std::string_view kObjectClass = "objectClass";
+constexpr std::string_view kAdminDn = "orv-slapdAdminDN";
+constexpr std::string_view kMasterDn = "orv-slapdMasterDN";
 
 constexpr Guard kGuards[] = {
     // With a policy of their own making, members could set any password they like.
@@ -54,6 +59,15 @@ Refusal refuse_class(std::string_view normal_dn, std::string_view name) {
   return {};
 }
 
+// The empty name, and what is none, are for the schema to refuse.
+Refusal refuse_bind_dn(std::string_view type, std::string_view value) {
+  std::string normal;
+  if (cfg::normalize_dn(value, normal) == result::no_memory) throw std::bad_alloc();
+  if (normal.empty() || may_be_bound(normal)) return {};
+  return {result::constraint_violation,
+          std::string(type) + " lies inside CN=CONFIGURATION, so nobody could bind with it"};
+}
+
 // A method that nobody knows is answered as the rules answer it where it is to be used.
 int code_of_problem(std::string_view type) noexcept {
   return type == kAllowedMethods ? result::invalid_attribute_syntax : result::constraint_violation;
@@ -61,6 +75,7 @@ int code_of_problem(std::string_view type) noexcept {
 
 Refusal refuse_value(std::string_view normal_dn, std::string_view type, std::string_view value) {
   if (type == kObjectClass) return refuse_class(normal_dn, value);
+  if (type == kAdminDn || type == kMasterDn) return refuse_bind_dn(type, value);
   if (const std::string problem = value_problem(type, value); !problem.empty())
     return {code_of_problem(type), std::string(type) + " " + problem};
   for (const SettingRow& row : setting_rows()) {

@@ -32,8 +32,9 @@ std::span<const Guard> entry_guards() noexcept;
 // guard stands in the way. `added` is the entry to add, null for a delete. 50 or 53 by the table;
 // 53 an object class out of its place; 19 a value with which the server would not start, nor take
 // over any settings while it runs (an integer setting out of its bounds, or another whose value
-// is none of the words that it may be), or a map of certificates that maps nothing; 21 a method of
-// storing passwords to allow that is none.
+// is none of the words that it may be), a map of certificates that maps nothing, or a name to bind
+// with that lies inside the configuration, where nobody is found; 21 a method of storing passwords
+// to allow that is none.
 Refusal guarded(GuardedChange change, std::string_view normal_dn, unsigned authority,
                 const entry* added);
 
