@@ -13,6 +13,7 @@
 #include "cfg/secret.h"
 #include "file_session.h"
 #include "schema_check.h"
+#include "slapi/admin_policy.h"
 #include "slapi/file_doubts.h"
 #include "slapi/file_trust.h"
 
@@ -29,9 +30,9 @@ class FileCheck {
       : key_(key), user_(user), out_(out) {}
 
   void check(const FileEntry& entry) {
-    for (const std::string& problem : schema_problems(builtin_schema(), entry)) {
-      report(entry, problem);
-    }
+    const std::vector<std::string> misfits = schema_problems(builtin_schema(), entry);
+    for (const std::string& problem : misfits) report(entry, problem);
+    if (misfits.empty()) check_policy(entry);
     check_secrets(entry);
     check_addresses(entry);
     check_authorities(entry);
@@ -91,6 +92,18 @@ class FileCheck {
          {"orv-slapdTlsCaFile", "orv-slapdTlsCrlFile", "orv-slapdKrbKeytab"})
       for (const std::string& file : entry.values(type))
         if (const std::string why = distrust_of_authority(file, user_); !why.empty()) report(why);
+  }
+
+  void check_policy(const FileEntry& entry) {
+    std::string name;
+    if (cfg::normalize_dn(entry.dn, name) != 0 || name != kAdminPolicyEntry) return;
+    AdminPolicySettings settings;
+    for (const std::string_view type : admin_policy_types()) {
+      const std::vector<std::string>& values = entry.values(type);
+      if (!values.empty()) settings.emplace(type, values.front());
+    }
+    const std::string problem = admin_policy_problem(settings);
+    if (!problem.empty()) report(entry, problem);
   }
 
   void check_identity(const FileEntry& entry, const char* type) {

@@ -616,6 +616,9 @@ int serve(const Options& options, const Settings& settings, const GuardedFiles& 
                  [&options](Settings& now) {
                    std::string error;
                    return read_settings(options.config_file, options.key_stash_file, now, error);
+                 },
+                 [&options](AdminPolicySettings& now) {
+                   return read_policy_settings(options.config_file, options.key_stash_file, now);
                  }});
   if (!server.take(std::move(inherited.sockets), error) ||
       !server.listen({}, 0, error, more_listeners(options, settings))) {

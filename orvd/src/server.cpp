@@ -91,6 +91,7 @@ Server::Server(ServerParts parts)
   services_.changes_made = parts_.changes_made;
   services_.renew_settings = [this] { renew_settings(); };
   services_.read_settings = parts_.read_settings;
+  services_.read_policy = parts_.read_policy;
   services_.mechanisms = parts_.mechanisms;
   services_.local_verifiers = &own_work_;
   services_.tls = &tls_;

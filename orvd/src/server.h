@@ -56,7 +56,8 @@ struct ServerParts {
   const SaslMechanisms* mechanisms = nullptr;      // null: none
   const ServiceManager* manager = nullptr;         // who is told how the server is; null: nobody
   std::function<bool(Settings&)> read_settings{};  // Services::read_settings
-  std::function<std::time_t()> wall_time{};        // Services::wall_time; empty: the system's clock
+  std::function<bool(AdminPolicySettings&)> read_policy{};  // Services::read_policy
+  std::function<std::time_t()> wall_time{};  // Services::wall_time; empty: the system's clock
 };
 
 // Where a server listens, besides its addresses for connections in clear.

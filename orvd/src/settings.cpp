@@ -294,6 +294,19 @@ int renew_password_policy(const std::string& config_file, const std::string& key
   return session ? load_admin_password_policy(session.get()) : result::operations_error;
 }
 
+bool read_policy_settings(const std::string& config_file, const std::string& key_stash_file,
+                          AdminPolicySettings& settings) {
+  std::string error;
+  const CfgSession session = open_session(config_file, key_stash_file, error);
+  if (!session) return false;
+  const FileEntry entry(session.get(), std::string(kAdminPolicyEntry).c_str());
+  if (entry.code() != result::success) return entry.code() == result::no_such_object;
+  for (const std::string_view type : admin_policy_types())
+    if (std::optional<std::string> value = entry.first(std::string(type).c_str()))
+      settings.insert_or_assign(std::string(type), std::move(*value));
+  return true;
+}
+
 int renew_administrators(const std::string& config_file, const std::string& key_stash_file,
                          std::string& error) {
   const CfgSession session = open_session(config_file, key_stash_file, error);

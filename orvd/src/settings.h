@@ -11,6 +11,7 @@
 #include <vector>
 
 #include "auth/sasl_settings.h"
+#include "slapi/admin_policy.h"
 
 namespace orv::server {
 
@@ -134,5 +135,10 @@ int renew_administrators(const std::string& config_file, const std::string& key_
                          std::string& error);
 int renew_password_methods(const std::string& config_file, const std::string& key_stash_file,
                            std::string& error);
+
+// The settings of the policy entry as they stand in the file; none where it lacks the entry. False
+// when it cannot be read.
+bool read_policy_settings(const std::string& config_file, const std::string& key_stash_file,
+                          AdminPolicySettings& settings);
 
 }  // namespace orv::server

@@ -4,6 +4,7 @@
 #include <locale.h>
 
 #include <algorithm>
+#include <array>
 #include <charconv>
 #include <cstdio>
 #include <cwctype>
@@ -18,6 +19,7 @@
 #include "cfg/result_codes.h"
 #include "cfg/secret.h"
 #include "messages.h"
+#include "slapi/admin_policy.h"
 #include "slapi/services.h"
 
 namespace orv {
@@ -25,7 +27,7 @@ namespace {
 
 using Policy = _Admin_pwdPolicy;
 
-constexpr const char* kPolicyEntry = "CN=PWDPOLICY ADMIN,CN=CONFIGURATION";
+constexpr const char* kPolicyEntry = kAdminPolicyEntry.data();  // of a literal
 
 constexpr int kMaxNumber = 1000000;
 constexpr int kMaxLength = 256;
@@ -70,6 +72,14 @@ constexpr Number kNumbers[] = {
     {"passwordMinDiffChars", &Policy::passwordMinDiffChars, kMaxLength},
 };
 
+constexpr auto kTypes = [] {
+  std::array<std::string_view, std::size(kFlags) + std::size(kNumbers)> types{};
+  auto next = types.begin();
+  for (const Flag& flag : kFlags) *next++ = flag.name;
+  for (const Number& number : kNumbers) *next++ = number.name;
+  return types;
+}();
+
 // ---- In force --------------------------------------------------------------------------------
 
 // Copied under a mutex of its own, which nobody holds for longer than the copy takes.
@@ -108,9 +118,25 @@ const char* contradiction(const Policy& policy) noexcept {
   return nullptr;
 }
 
+// Null for a policy that can be put in force.
+const char* problem_of(const Policy& policy) noexcept {
+  return is_in_range(policy) ? contradiction(policy) : "a number is out of range";
+}
+
 // ---- Reading ---------------------------------------------------------------------------------
 
 constexpr const char* kUnreadable = "the entry cannot be read";
+
+bool take(const Flag& flag, std::string_view text, Policy& policy) noexcept {
+  policy.*flag.member = text == "TRUE" ? 1 : 0;
+  return text == "TRUE" || text == "FALSE";
+}
+
+bool take(const Number& number, std::string_view text, Policy& policy) noexcept {
+  const auto [end, status] =
+      std::from_chars(text.data(), text.data() + text.size(), policy.*number.member);
+  return status == std::errc() && end == text.data() + text.size();
+}
 
 int refuse_policy(int code, const char* reason) noexcept {
   PrintMessage(0, message::password_set, message::policy_refused, reason);
@@ -136,9 +162,9 @@ class PolicyEntry {
 
   int read(Policy& policy) noexcept {
     for (const Flag& flag : kFlags)
-      if (const int rc = read_flag(flag, policy); rc != result::success) return rc;
+      if (const int rc = read_setting(flag, policy); rc != result::success) return rc;
     for (const Number& number : kNumbers)
-      if (const int rc = read_number(number, policy); rc != result::success) return rc;
+      if (const int rc = read_setting(number, policy); rc != result::success) return rc;
     return result::success;
   }
 
@@ -156,28 +182,14 @@ class PolicyEntry {
                                               : refuse_policy(error, kUnreadable);
   }
 
-  int read_flag(const Flag& flag, Policy& policy) noexcept {
+  template <typename Setting>
+  int read_setting(const Setting& setting, Policy& policy) noexcept {
     CfgValues values;
     const char* value = nullptr;
-    const int rc = first_value(flag.name, values, value);
+    const int rc = first_value(setting.name, values, value);
     if (rc != result::success || value == nullptr) return rc;
-    const std::string_view text(value);
-    if (text != "TRUE" && text != "FALSE") return refuse_value(flag.name);
-    policy.*flag.member = text == "TRUE" ? 1 : 0;
-    return result::success;
-  }
-
-  int read_number(const Number& number, Policy& policy) noexcept {
-    CfgValues values;
-    const char* value = nullptr;
-    const int rc = first_value(number.name, values, value);
-    if (rc != result::success || value == nullptr) return rc;
-    const std::string_view text(value);
-    int read = 0;
-    const auto [end, status] = std::from_chars(text.data(), text.data() + text.size(), read);
-    if (status != std::errc() || end != text.data() + text.size()) return refuse_value(number.name);
-    policy.*number.member = read;
-    return result::success;
+    return take(setting, value, policy) ? static_cast<int>(result::success)
+                                        : refuse_value(setting.name);
   }
 
   static int refuse_value(const char* name) noexcept {
@@ -190,6 +202,17 @@ class PolicyEntry {
   CfgResult chain_;
   _CFGMessage* record_ = nullptr;
 };
+
+// Settings of an entry that is not in the file, or not yet. The first one that cannot be read.
+template <typename Setting>
+const char* take_all(std::span<const Setting> all, const AdminPolicySettings& settings,
+                     Policy& policy) {
+  for (const Setting& setting : all) {
+    const auto found = settings.find(std::string_view(setting.name));
+    if (found != settings.end() && !take(setting, found->second, policy)) return setting.name;
+  }
+  return nullptr;
+}
 
 // ---- Passwords -------------------------------------------------------------------------------
 
@@ -378,12 +401,24 @@ int load_admin_password_policy(_CFG* session) noexcept {
     return refuse_policy(rc, rc == result::no_such_object ? "there is no such entry" : kUnreadable);
   Policy policy = kStrict;
   if (const int rc = entry.read(policy); rc != result::success) return rc;
-  if (!is_in_range(policy))
-    return refuse_policy(result::constraint_violation, "a number is out of range");
-  if (const char* const reason = contradiction(policy); reason != nullptr)
+  if (const char* const reason = problem_of(policy); reason != nullptr)
     return refuse_policy(result::constraint_violation, reason);
   put_in_force(policy);
   return result::success;
+}
+
+std::span<const std::string_view> admin_policy_types() noexcept {
+  return kTypes;
+}
+
+std::string admin_policy_problem(const AdminPolicySettings& settings) {
+  Policy policy = kStrict;
+  const char* unreadable = take_all(std::span<const Flag>(kFlags), settings, policy);
+  if (unreadable == nullptr)
+    unreadable = take_all(std::span<const Number>(kNumbers), settings, policy);
+  if (unreadable != nullptr) return std::string("the value of ") + unreadable + " cannot be read";
+  const char* const problem = problem_of(policy);
+  return problem == nullptr ? "" : problem;
 }
 
 int verify_admin_password(char* new_password, char* old_password, Operation* operation) try {

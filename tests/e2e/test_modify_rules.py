@@ -198,6 +198,54 @@ def test_policy_is_in_force_with_the_next_password(root, refuse):
     assert modify(root, dn, replaced("orv-slapdAdminPW", "short")) == 0
 
 
+def test_policy_that_contradicts_itself_is_refused_while_it_is_off_too(server, root, refuse):
+    """Else it would be switched on with success, and the one before would go on to hold."""
+    enabled = "orv-slapdAdminPolicyEnabled"
+    assert modify(root, POLICY, replaced(enabled, "FALSE")) == 0
+    number = changes.numbers_of_classes()["pwdMinLength"]
+    for change in ([replaced("pwdMinLength", "3")], [replaced(number, "3")],
+                   [deleted("pwdMinLength", "12"), added("PWDMINLENGTH", "3")],
+                   [replaced("passwordMinAlphaChars", "7"), replaced("passwordMinOtherChars", "6")],
+                   [replaced("pwdMinLength", "257")], [replaced("pwdMinLength", "99999999999")],
+                   [replaced("pwdMaxFailure", "0"), replaced(enabled, "TRUE")]):
+        assert refuse(POLICY, *change) == 19, change
+    code, text = refusal(root, POLICY, replaced("pwdMinLength", "3"))
+    assert code == 19
+    assert "passwordMinAlphaChars and passwordMinOtherChars together exceed pwdMinLength" in text
+    assert refuse(POLICY, replaced("pwdMinLength", "ten")) == 21
+    # It is prepared while it is off, in one request what belongs together, and then holds.
+    assert modify(root, POLICY, replaced("pwdMinLength", "3"), replaced("passwordMinAlphaChars", "1"),
+                  replaced("passwordMinDiffChars", "3")) == 0
+    assert add(root, *member("carol", password="a")) == 0
+    assert modify(root, POLICY, replaced(enabled, "TRUE")) == 0
+    assert add(root, *member("dave", password="a")) == 19
+    assert add(root, *member("dave", password="a--")) == 0
+
+
+def test_settings_that_are_taken_from_the_policy_leave_none_that_contradict(root, refuse):
+    """What is not there has its default."""
+    assert modify(root, POLICY, replaced("pwdMinLength", "30"),
+                  replaced("passwordMinAlphaChars", "20")) == 0
+    assert refuse(POLICY, deleted("pwdMinLength")) == 19
+    assert refuse(POLICY, deleted("pwdMinLength", "30")) == 19
+    assert refuse(POLICY, replaced("pwdMinLength")) == 19
+    assert modify(root, POLICY, deleted("pwdMinLength"), deleted("passwordMinAlphaChars")) == 0
+    assert modify(root, POLICY, replaced("description", "defaults")) == 0
+
+
+def test_policy_that_contradicts_itself_is_not_added(server, root):
+    assert changes.delete(root, POLICY) == 0
+    policy = {"objectClass": ["top", "orv-slapdConfigEntry", "orv-slapdAdminPolicy"],
+              "cn": ["PwdPolicy Admin"], "orv-slapdAdminPolicyEnabled": ["FALSE"],
+              "pwdMinLength": ["3"]}
+    before = server.config.read()
+    assert add(root, POLICY, policy) == 19
+    assert server.config.read() == before
+    policy["passwordMinAlphaChars"] = ["1"]
+    assert add(root, POLICY, policy) == 0
+    assert add(root, *member("carol", password="a")) == 0
+
+
 # ---- pass-through entries
 
 def test_pass_through_entry_is_held_to_the_rules_of_its_adding(root, refuse):

@@ -253,6 +253,23 @@ class Check(Tool):
             with self.subTest(new):
                 self.assertIn(text, self.found(old, new))
 
+    def test_finds_a_password_policy_that_contradicts_itself(self):
+        self.config = self.config.replace("PolicyEnabled: TRUE\n", "PolicyEnabled: FALSE\n")
+        kinds = "passwordMinAlphaChars and passwordMinOtherChars together exceed pwdMinLength"
+        for old, new, text in (
+                ("pwdMinLength: 12\npasswordMinAlphaChars: 2\n",
+                 "pwdMinLength: 3\npasswordMinAlphaChars: 2\n", kinds),
+                ("pwdMinLength: 12\npasswordMinAlphaChars: 2\n",  # which is 12 all the same
+                 "passwordMinAlphaChars: 11\n", kinds),
+                ("passwordMinDiffChars: 3\n", "passwordMinDiffChars: 13\n",
+                 "passwordMinDiffChars exceeds pwdMinLength"),
+                ("pwdMaxFailure: 10\n", "pwdMaxFailure: 0\n",
+                 "pwdLockout is TRUE and pwdMaxFailure is 0")):
+            with self.subTest(new):
+                self.assertIn(f"CN=PWDPOLICY ADMIN,CN=CONFIGURATION: {text}", self.found(old, new))
+        # Out of its range, a number is found once.
+        self.assertRegex(self.found("pwdMinLength: 12\n", "pwdMinLength: 257\n"), ", 1 problem\\n")
+
     def test_finds_a_role_that_nobody_knows(self):
         self.assertIn("orv-slapdAdminRole is none of",
                       self.added(self.member("cn=m", "x").replace("AuditAdmin", "Wizard")))

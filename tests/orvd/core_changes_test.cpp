@@ -75,6 +75,39 @@ TEST(Guards, EveryGuardIsInTheDocumentation) {
   }
 }
 
+// ---- the password policy
+
+// The code of adding a policy entry with these attributes.
+int code_of_adding_policy(std::vector<Attribute> attributes, unsigned authority = kPrimary) {
+  EntryPtr made;
+  EXPECT_EQ(make_entry(builtin_schema(), {kPolicy, std::move(attributes)}, made).code, 0);
+  return guarded_policy(builtin_schema(), kPolicy, *made, authority).code;
+}
+
+TEST(PolicyGuard, RefusesAnAddedPolicyThatCouldNotBePutInForce) {
+  const Attribute off{"orv-slapdAdminPolicyEnabled", {"FALSE"}};
+  EXPECT_EQ(code_of_adding_policy({off}), 0);
+  EXPECT_EQ(code_of_adding_policy({off, {"pwdMinLength", {"3"}}}), 19);
+  EXPECT_EQ(code_of_adding_policy({{"PWDMINLENGTH", {"3"}}}), 19);
+  EXPECT_EQ(code_of_adding_policy({{"pwdMinLength", {"3"}}, {"passwordMinAlphaChars", {"1"}}}), 0);
+  EXPECT_EQ(code_of_adding_policy({{"pwdMaxFailure", {"0"}}}), 19);
+  EXPECT_EQ(code_of_adding_policy({{"pwdMaxFailure", {"0"}}, {"pwdLockout", {"FALSE"}}}), 0);
+  EXPECT_EQ(code_of_adding_policy({{"pwdMaxFailure", {"99999999999"}}}), 19);
+}
+
+TEST(PolicyGuard, LeavesToOthersWhatTheyRefuse) {
+  EXPECT_EQ(code_of_adding_policy({{"pwdMinLength", {"3"}}}, kGroupMember), 0);
+  EXPECT_EQ(code_of_adding_policy({{"pwdMinLength", {"ten"}}}), 0);
+  EXPECT_EQ(code_of_adding_policy({{"pwdLockout", {"yes"}}, {"pwdMinLength", {"3"}}}), 0);
+  EntryPtr elsewhere;
+  ASSERT_EQ(
+      make_entry(builtin_schema(), {"cn=x,cn=configuration", {{"pwdMinLength", {"3"}}}}, elsewhere)
+          .code,
+      0);
+  EXPECT_EQ(guarded_policy(builtin_schema(), "CN=X,CN=CONFIGURATION", *elsewhere, kPrimary).code,
+            0);
+}
+
 // ---- consequences
 
 class OneIdentity final : public Authenticator {

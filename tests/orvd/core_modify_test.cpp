@@ -233,6 +233,76 @@ TEST(ValueGuards, LookAtAddedNamesToo) {
   }
 }
 
+// ---- the password policy
+
+class PolicyServer : public ModifyServer {
+ protected:
+  PolicyServer() {
+    read_policy = [this](AdminPolicySettings& settings) {
+      const std::lock_guard lock(mutex);
+      settings = in_file;
+      return readable;
+    };
+  }
+  ~PolicyServer() override { stop(); }
+
+  int change(WireClient& client, const std::vector<Change>& changes) {
+    return code_of(client,
+                   modify_with(++last_id, "cn = PwdPolicy Admin, cn=configuration", changes));
+  }
+  void file_holds(AdminPolicySettings settings) {
+    const std::lock_guard lock(mutex);
+    in_file = std::move(settings);
+  }
+
+  bool readable = true;
+
+ private:
+  std::mutex mutex;
+  AdminPolicySettings in_file;
+  int last_id = 1;
+};
+
+TEST_F(PolicyServer, RefusesWhatWouldNotBePutInForce) {
+  file_holds({{"orv-slapdAdminPolicyEnabled", "FALSE"}, {"pwdMinLength", "12"}});
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  EXPECT_EQ(change(client, {{2, "pwdMinLength", {"3"}}}), 19);
+  EXPECT_EQ(change(client, {{1, "pwdMinLength", {"12"}}, {0, "pwdMinLength", {"3"}}}), 19);
+  EXPECT_EQ(change(client, {{1, "pwdMinLength", {}}, {2, "passwordMinDiffChars", {"13"}}}), 19);
+  EXPECT_EQ(change(client, {{2, "pwdMaxFailure", {"1000001"}}}), 19);
+  EXPECT_EQ(change(client, {{1, "pwdMaxFailure", {"ten"}}, {2, "pwdMinLength", {"3"}}}), 19);
+  EXPECT_EQ(backend.calls(parameter::modify_function), 0);
+  EXPECT_EQ(change(client, {{2, "pwdMinLength", {"3"}}, {0, "passwordMinAlphaChars", {"1"}}}), 0);
+  EXPECT_EQ(change(client, {{1, "pwdMinLength", {}}}), 0);
+}
+
+TEST_F(PolicyServer, LooksAtWhatTheFileHoldsWhenTheChangeIsAdmitted) {
+  file_holds({{"pwdMinLength", "3"}, {"passwordMinAlphaChars", "1"}});
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  EXPECT_EQ(change(client, {{1, "passwordMinAlphaChars", {}}}), 19) << "2 is the default";
+  EXPECT_EQ(change(client, {{0, "orv-slapdAdminPolicyEnabled", {"TRUE"}}}), 0);
+  file_holds({{"pwdMinLength", "3"}});
+  EXPECT_EQ(change(client, {{0, "orv-slapdAdminPolicyEnabled", {"TRUE"}}}), 19);
+  EXPECT_EQ(change(client, {{2, "description", {"x"}}}), 0) << "nothing of the policy";
+}
+
+TEST_F(PolicyServer, LeavesToTheBackendWhatItRefuses) {
+  start();
+  WireClient client(port());
+  bind_as_root(client);
+  EXPECT_EQ(change(client, {{2, "pwdMinLength", {"three"}}}), 0);
+  WireClient member(port());
+  bind_as(member, kMember);
+  EXPECT_EQ(change(member, {{2, "pwdMinLength", {"3"}}}), 0);
+  readable = false;
+  EXPECT_EQ(change(client, {{2, "pwdMinLength", {"3"}}}), 0);
+  EXPECT_EQ(backend.calls(parameter::modify_function), 3);
+}
+
 // ---- modifications that fail
 
 class FailingModifies : public ModifyServer {

@@ -92,6 +92,7 @@ class LoopbackServer : public testing::Test {
     parts.mechanisms = &mechanisms;
     parts.manager = manager;
     parts.wall_time = wall_time;
+    parts.read_policy = read_policy;
     server.emplace(std::move(parts));
     std::string error;
     ASSERT_TRUE(server->listen(addresses, 0, error, more)) << error;
@@ -143,6 +144,7 @@ class LoopbackServer : public testing::Test {
   SaslMechanisms mechanisms;
   const ServiceManager* manager = nullptr;
   std::function<std::time_t()> wall_time;
+  std::function<bool(AdminPolicySettings&)> read_policy;
   unsigned loops = 1;
   std::optional<Server> server;
   std::thread control;

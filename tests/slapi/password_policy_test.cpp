@@ -12,6 +12,8 @@
 #include "cfg/secret.h"
 #include "configuration_file.h"
 #include "messages.h"
+#include "slapi/admin_policy.h"
+#include "slapi/schema.h"
 #include "slapi/services.h"
 
 namespace orv {
@@ -383,6 +385,36 @@ TEST_F(PolicyFile, ThatIsDamagedLeavesThePolicyBeforeInForce) {
                             std::string(row.reason) + ". The one before stays."));
     EXPECT_EQ(getGlobalAdminPWDPolicyLocal().pwdMinLength, 30);
   }
+}
+
+TEST(PolicyEntry, IsExaminedWithoutBeingPutInForce) {
+  const struct {
+    AdminPolicySettings settings;
+    const char* problem;
+  } rows[] = {
+      {{}, ""},
+      {{{"orv-slapdAdminPolicyEnabled", "FALSE"}, {"pwdMinLength", "4"}}, ""},
+      {{{"description", "x"}}, ""},
+      {{{"pwdMinLength", "ten"}}, "the value of pwdMinLength cannot be read"},
+      {{{"pwdMinLength", "10 "}}, "the value of pwdMinLength cannot be read"},
+      {{{"pwdLockout", "yes"}}, "the value of pwdLockout cannot be read"},
+      {{{"pwdMinLength", "257"}}, "a number is out of range"},
+      {{{"pwdMinLength", "3"}},
+       "passwordMinAlphaChars and passwordMinOtherChars together exceed pwdMinLength"},
+      {{{"passwordMinDiffChars", "13"}}, "passwordMinDiffChars exceeds pwdMinLength"},
+      {{{"pwdMaxFailure", "0"}}, "pwdLockout is TRUE and pwdMaxFailure is 0"},
+      {{{"pwdMaxFailure", "0"}, {"pwdLockout", "FALSE"}}, ""},
+  };
+  for (const auto& row : rows) EXPECT_EQ(admin_policy_problem(row.settings), row.problem);
+  EXPECT_EQ(getGlobalAdminPWDPolicyLocal().pwdMinLength, 12);
+}
+
+TEST(PolicyEntry, HasTheSettingsOfItsClass) {
+  const ObjectClass* const policy = builtin_schema().object_class("orv-slapdAdminPolicy");
+  ASSERT_NE(policy, nullptr);
+  for (const std::string_view type : admin_policy_types())
+    EXPECT_THAT(policy->may, testing::Contains(type)) << type;
+  EXPECT_EQ(admin_policy_types().size(), 10U);
 }
 
 TEST_F(PolicyFile, WithoutTheEntryLeavesThePolicyBeforeInForce) {

@@ -1,5 +1,6 @@
 #include "ops/guards.h"
 
+#include <algorithm>
 #include <new>
 #include <string>
 
@@ -10,11 +11,12 @@
 #include "net/tls.h"
 #include "settings.h"
 #include "slapi/connection.h"
+#include "slapi/value_syntax.h"
 
 namespace orv::server {
 namespace {
 
-constexpr std::string_view kPolicy = "CN=PWDPOLICY ADMIN,CN=CONFIGURATION";
+constexpr std::string_view kPolicy = kAdminPolicyEntry;
 constexpr std::string_view kPassThrough = "CN=PASSTHROUGH AUTHENTICATION,CN=CONFIGURATION";
 constexpr std::string_view kAdminGroup = "CN=ADMINGROUP,CN=CONFIGURATION";
 constexpr std::string_view kObjectClass = "objectClass";
@@ -31,6 +33,10 @@ constexpr Guard kGuards[] = {
     {GuardedChange::remove, kPassThrough, false, result::unwilling_to_perform,
      "the container of pass-through entries could not be added again"},
 };
+
+std::string_view text_of(const berval* value) noexcept {
+  return {value->bv_val, value->bv_len};
+}
 
 bool is_primary(unsigned flags) noexcept {
   return flags == authority::primary_administrator;
@@ -95,9 +101,40 @@ Refusal refuse_values(std::string_view normal_dn, std::string_view type,
   return {};
 }
 
-std::string_view text_of(const berval* value) noexcept {
-  return {value->bv_val, value->bv_len};
+// ---- the password policy
+
+// Whether a value is put into one of its settings.
+enum class PolicyValue { none, good, refused_by_schema };
+
+PolicyValue policy_value(const Schema& schema, std::string_view type, const berval* const* values) {
+  const auto types = admin_policy_types();
+  if (std::find(types.begin(), types.end(), type) == types.end()) return PolicyValue::none;
+  for (; values && *values; ++values)
+    if (check_value(*schema.attribute(type), text_of(*values), nullptr) != result::success)
+      return PolicyValue::refused_by_schema;
+  return PolicyValue::good;
 }
+
+Refusal refuse_policy(const AdminPolicySettings& settings) {
+  const std::string problem = admin_policy_problem(settings);
+  if (problem.empty()) return {};
+  return {result::constraint_violation,
+          "the password policy could not be put in force: " + problem +
+              "; change settings that belong together in one request"};
+}
+
+// One value each; as of the settings of TLS, what is taken away goes first.
+void apply_policy_changes(const ldapmod* first, AdminPolicySettings& settings) {
+  for (const ldapmod* change = first; change; change = change->mod_next)
+    if (change->operation() != kModAdd) settings.erase(change->mod_type);
+  for (const ldapmod* change = first; change; change = change->mod_next) {
+    const berval* const* const values = change->mod_vals.modv_bvals;
+    if (change->operation() != kModDelete && values && *values)
+      settings.insert_or_assign(change->mod_type, std::string(text_of(*values)));
+  }
+}
+
+// ---- the files of TLS
 
 // The settings have one value each. What is taken away goes first, as the order of a folded list
 // does not matter. Whether there is anything for them.
@@ -138,6 +175,37 @@ Refusal guarded_modification(std::string_view normal_dn, const ldapmod* first) {
       return refusal;
   }
   return {};
+}
+
+Refusal guarded_policy(const Schema& schema, std::string_view normal_dn, const ldapmod* first,
+                       unsigned authority,
+                       const std::function<bool(AdminPolicySettings&)>& read_policy) {
+  if (!read_policy || normal_dn != kPolicy || !is_primary(authority)) return {};
+  bool any = false;
+  for (const ldapmod* change = first; change; change = change->mod_next) {
+    const bool puts_in = change->operation() != kModDelete;
+    const PolicyValue value =
+        policy_value(schema, change->mod_type, puts_in ? change->mod_vals.modv_bvals : nullptr);
+    if (value == PolicyValue::refused_by_schema) return {};
+    any |= value == PolicyValue::good;
+  }
+  AdminPolicySettings settings;
+  if (!any || !read_policy(settings)) return {};
+  apply_policy_changes(first, settings);
+  return refuse_policy(settings);
+}
+
+Refusal guarded_policy(const Schema& schema, std::string_view normal_dn, const entry& added,
+                       unsigned authority) {
+  if (normal_dn != kPolicy || !is_primary(authority)) return {};
+  AdminPolicySettings settings;
+  for (const attr* a = added.attributes; a; a = a->next) {
+    const PolicyValue value = policy_value(schema, a->type, a->values);
+    if (value == PolicyValue::refused_by_schema) return {};
+    if (value == PolicyValue::good && a->values && *a->values)
+      settings.insert_or_assign(a->type, std::string(text_of(*a->values)));
+  }
+  return refuse_policy(settings);
 }
 
 Refusal guarded_tls_files(std::string_view normal_dn, const ldapmod* first, unsigned authority,

@@ -41,6 +41,19 @@ Refusal guarded(GuardedChange change, std::string_view normal_dn, unsigned autho
 // The same for what a modification puts in.
 Refusal guarded_modification(std::string_view normal_dn, const ldapmod* first);
 
+// 19 when the settings that a folded list of modifications leaves at CN=PWDPOLICY ADMIN could not
+// be put in force: it would succeed, and the policy before would go on to hold. Switched off, too:
+// it would be switched on later. `read_policy` reads what the file says now, so this belongs inside
+// the gate; where it is empty or fails nothing is refused, to others than the primary administrator
+// neither, and not for what the schema refuses.
+Refusal guarded_policy(const Schema& schema, std::string_view normal_dn, const ldapmod* first,
+                       unsigned authority,
+                       const std::function<bool(AdminPolicySettings&)>& read_policy);
+
+// The same for that entry as it is to be added.
+Refusal guarded_policy(const Schema& schema, std::string_view normal_dn, const entry& added,
+                       unsigned authority);
+
 // 53 when the files of TLS that a folded list of modifications leaves at CN=ADMINGROUP cannot be
 // used, with which the server would not start: they are loaded to see. `read_settings` reads what
 // the file says now; where it is empty or fails nothing is refused, and to others than the primary

@@ -13,6 +13,7 @@
 #include "ops/log_text.h"
 #include "slapi/administrators.h"
 #include "slapi/reserves.h"
+#include "slapi/services.h"
 
 namespace orv::server {
 namespace {
@@ -366,6 +367,31 @@ bool PendingOperation::conditions_hold(Services& services) noexcept {
   return false;
 }
 
+Refusal PendingOperation::refuse_policy(Services& services) {
+  if (!services.guards) return {};
+  const unsigned authority = operation_.authority;
+  if (handler_ == parameter::add_function)
+    return guarded_policy(services.schema, changed_dn_, *entry_, authority);
+  ldapmod* first = nullptr;
+  if (handler_ == parameter::modify_function)
+    slapi_pblock_get(parameters_.get(), parameter::modifications, &first);
+  return guarded_policy(services.schema, changed_dn_, first, authority, services.read_policy);
+}
+
+// Looked at here, since it depends on what the changes before this one have left. While the policy
+// is on the rules refuse most of this themselves, without a text: the answer is the same then.
+bool PendingOperation::policy_holds(Services& services) noexcept try {
+  if (!is_change()) return true;
+  const Refusal refusal = refuse_policy(services);
+  if (!refusal) return true;
+  services.logs.warning(refusal.text);
+  answer_.result(refusal.code, "", pwdIsAdminPolicyOn() ? "" : refusal.text);
+  return false;
+} catch (...) {
+  answer_.result(result::no_memory, "", "");
+  return false;
+}
+
 // The change is made, so nothing here can fail it any more: without a copy the result goes alone,
 // also when it would take too long. Whoever is not any more who they were sees a name and nothing
 // else.
@@ -389,7 +415,7 @@ void PendingOperation::run(Services& services, bool on_home_thread) noexcept {
     next_look_ = Clock::now() + kLookInterval;
     std::optional<cfg::InterruptScope> scope;
     if (!is_change()) scope.emplace(&PendingOperation::interrupted, this);
-    if (conditions_hold(services)) audience = perform(services);
+    if (conditions_hold(services) && policy_holds(services)) audience = perform(services);
     // A search that could not join would miss changes.
     if (persistent && !notice_of && answer_.code() == result::success &&
         !services.persistent_searches.join(persistent))

@@ -155,6 +155,8 @@ class PendingOperation final : public GateWaiter,
   bool may_begin(Services& services) noexcept;
   int test_conditions(Services& services) noexcept;
   bool conditions_hold(Services& services) noexcept;
+  Refusal refuse_policy(Services& services);
+  bool policy_holds(Services& services) noexcept;
   bool take_copy(SideSearch& search, const char* oid) noexcept;
   void copy_afterwards(Services& services) noexcept;
   PersistentSearches::Audience perform(Services& services) noexcept;

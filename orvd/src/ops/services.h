@@ -24,6 +24,7 @@
 #include "ops/paged_results.h"
 #include "ops/persistent_search.h"
 #include "ops/search_cost.h"
+#include "slapi/admin_policy.h"
 #include "slapi/owners.h"
 #include "slapi/schema.h"
 
@@ -92,6 +93,8 @@ struct Services {
   std::function<void()> renew_settings{};
   // Reads the settings that the file has now, of whoever asks. May be empty.
   std::function<bool(Settings&)> read_settings{};
+  // Reads the settings of the password policy that the file has now. Inside the gate. May be empty.
+  std::function<bool(AdminPolicySettings&)> read_policy{};
   bool guards = true;  // the server's own, in front of the backend
   // How many changes this thread has made to the file, as the library counts them: a backend that
   // reports a change without having made one is not believed. Null: it always is.
