@@ -432,6 +432,27 @@ def test_files_that_the_server_would_not_start_with_are_refused(root, tmp_path, 
     assert clients.read(root, GROUP) == before
 
 
+def test_group_is_not_added_with_files_that_the_server_would_not_start_with(server, root, tmp_path):
+    group = {name: [value.decode() for value in values]
+             for name, values in clients.read(root, GROUP).items()
+             if not name.startswith("orv-slapdTls")}
+    certificate, key = Authority(tmp_path / "ca").pair("renewed")
+    root.delete_s(GROUP)
+    before = server.config.read()
+    for settings in ({"orv-slapdTlsCertificateFile": [str(tmp_path / "nothing")]},
+                     {"ORV-SLAPDTLSCERTIFICATEFILE": [str(certificate)]},  # without its key
+                     {"orv-slapdTlsCertificateFile": [str(certificate)],
+                      "orv-slapdTlsKeyFile": [str(key)],
+                      "orv-slapdTlsClientCertificate": ["required"]}):  # nobody says who signs them
+        assert add(root, "CN = AdminGroup, cn=configuration", {**group, **settings}) == 53
+        assert server.config.read() == before
+    assert add(root, GROUP, {**group, "orv-slapdTlsCertificateFile": [str(certificate)],
+                             "orv-slapdTlsKeyFile": [str(key)]}) == 0
+    server.stop()
+    server.start()
+    presented(server)
+
+
 def test_certificate_and_key_change_in_one_request(server, root, tmp_path):
     certificate, key = Authority(tmp_path / "ca").pair("renewed")
     with pytest.raises(ldap.UNWILLING_TO_PERFORM):

@@ -108,6 +108,28 @@ TEST(PolicyGuard, LeavesToOthersWhatTheyRefuse) {
             0);
 }
 
+// ---- the files of TLS
+
+// The code of adding an entry with these attributes.
+int code_of_adding_files(const std::string& dn, std::vector<Attribute> attributes,
+                         unsigned authority = kPrimary) {
+  EntryPtr made;
+  EXPECT_EQ(make_entry(builtin_schema(), {dn, std::move(attributes)}, made).code, 0);
+  return guarded_tls_files(dn, *made, authority).code;
+}
+
+TEST(TlsFilesGuard, RefusesAnAddedEntryWithWhichTheServerWouldNotStart) {
+  constexpr const char* kGroup = "CN=ADMINGROUP,CN=CONFIGURATION";
+  const Attribute nothing{"orv-slapdTlsCertificateFile", {"/nonexistent/tls.crt"}};
+  EXPECT_EQ(code_of_adding_files(kGroup, {nothing}), 53);
+  EXPECT_EQ(code_of_adding_files(kGroup, {{"ORV-slapdTlsCertificateFile", nothing.values}}), 53);
+  EXPECT_EQ(code_of_adding_files(kGroup, {{"orv-slapdTlsKeyFile", nothing.values}}), 0)
+      << "without a certificate there is no TLS";
+  EXPECT_EQ(code_of_adding_files(kGroup, {{"cn", {"AdminGroup"}}}), 0);
+  EXPECT_EQ(code_of_adding_files(kGroup, {nothing}, kGroupMember), 0) << "the rules refuse those";
+  EXPECT_EQ(code_of_adding_files("CN=X,CN=CONFIGURATION", {nothing}), 0);
+}
+
 // ---- consequences
 
 class OneIdentity final : public Authenticator {

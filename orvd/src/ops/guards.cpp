@@ -150,6 +150,14 @@ bool apply_tls_changes(const ldapmod* first, TlsSettings& tls) {
   return any;
 }
 
+Refusal refuse_files(const TlsSettings& tls) {
+  std::string error;
+  if (tls.certificate_file.empty() || TlsContext::load(tls, error)) return {};
+  return {result::unwilling_to_perform,
+          "the server could not start with these files of TLS: " + error +
+              "; change those that belong together in one request"};
+}
+
 }  // namespace
 
 std::span<const Guard> entry_guards() noexcept {
@@ -216,11 +224,15 @@ Refusal guarded_tls_files(std::string_view normal_dn, const ldapmod* first, unsi
       !apply_tls_changes(first, scratch) || !read_settings(wanted))
     return {};
   apply_tls_changes(first, wanted.tls);
-  std::string error;
-  if (wanted.tls.certificate_file.empty() || TlsContext::load(wanted.tls, error)) return {};
-  return {result::unwilling_to_perform,
-          "the server could not start with these files of TLS: " + error +
-              "; change those that belong together in one request"};
+  return refuse_files(wanted.tls);
+}
+
+Refusal guarded_tls_files(std::string_view normal_dn, const entry& added, unsigned authority) {
+  if (normal_dn != kAdminGroup || !is_primary(authority)) return {};
+  TlsSettings wanted;
+  for (const attr* a = added.attributes; a; a = a->next)
+    if (a->values && *a->values) apply_tls_file(a->type, text_of(*a->values), wanted);
+  return refuse_files(wanted);
 }
 
 }  // namespace orv::server

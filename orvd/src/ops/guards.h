@@ -62,4 +62,7 @@ Refusal guarded_policy(const Schema& schema, std::string_view normal_dn, const e
 Refusal guarded_tls_files(std::string_view normal_dn, const ldapmod* first, unsigned authority,
                           const std::function<bool(Settings&)>& read_settings);
 
+// The same for that entry as it is to be added: none of those files is in use then.
+Refusal guarded_tls_files(std::string_view normal_dn, const entry& added, unsigned authority);
+
 }  // namespace orv::server

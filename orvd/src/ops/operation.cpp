@@ -108,10 +108,12 @@ Refusal PendingOperation::prepare(Services& services, const AddRequest& request,
                                   std::string_view normal_dn) {
   begin(services, parameter::add_function, normal_dn);
   if (Refusal refusal = make_entry(services.schema, request, entry_)) return refusal;
-  if (services.guards)
-    if (Refusal refusal =
-            guarded(GuardedChange::add, normal_dn, operation_.authority, entry_.get()))
+  if (services.guards) {
+    const unsigned authority = operation_.authority;
+    if (Refusal refusal = guarded(GuardedChange::add, normal_dn, authority, entry_.get()))
       return refusal;
+    if (Refusal refusal = guarded_tls_files(normal_dn, *entry_, authority)) return refusal;
+  }
   consequences_ = consequences_of_add(normal_dn, *entry_);
   set(parameter::add_entry, entry_.get());
   return {};
