@@ -478,6 +478,24 @@ TEST_F(LimitedServer, ClientsForWhomNoDescriptorIsLeftAreToldAndOthersAreServedL
   EXPECT_LE(count(lines, "cannot accept a connection"), CutOffLog::kLines);
 }
 
+// Those who open files at that moment may get the descriptor by which clients are told.
+TEST_F(LimitedServer, ClientsAreToldThatNoDescriptorIsLeftWhateverElseIsOpened) {
+  start();
+  std::vector<LateClient> clients(20);
+  const AllDescriptors all;
+  std::atomic<bool> enough{false};
+  std::thread opener([&] {
+    while (!enough) Descriptor(::dup(0)).close();
+  });
+  for (LateClient& client : clients) {
+    EXPECT_TRUE(client.connect(port()));
+    EXPECT_NE(client.rest().find("no descriptor is left"), std::string::npos);
+    if (HasFailure()) break;
+  }
+  enough = true;
+  opener.join();
+}
+
 // Clients of the Unix socket wait for the next descriptor instead: among them is who administers
 // the server.
 class LocalLateClient final : public WireClient {

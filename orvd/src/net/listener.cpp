@@ -158,6 +158,7 @@ void Listeners::start(std::shared_ptr<const Settings> settings) {
 }
 
 void Listeners::accept(Listener& listener) {
+  if (listener.kind != Kind::local && !has_reserve()) return pause(listener);
   listener.acceptor.async_accept(
       listener.waiting.keep([this, &listener](const asio::error_code& error, Socket socket) {
         if (error == asio::error::operation_aborted) return;
@@ -186,6 +187,17 @@ void Listeners::cannot_accept(Listener& listener, const asio::error_code& error)
     // Without memory the line is lost.
   }
   if (no_descriptors_left(error) && listener.kind != Kind::local) turn_away(listener);
+  pause(listener);
+}
+
+// Another thread that opened a file may have got the number that was given back for a moment. A
+// client must not have it next: nobody could be turned away until he leaves.
+bool Listeners::has_reserve() noexcept {
+  if (!reserve_) reserve_ = open_reserve();
+  return static_cast<bool>(reserve_);
+}
+
+void Listeners::pause(Listener& listener) {
   listener.pause.expires_after(kAcceptPause);
   listener.pause.async_wait(
       listener.waiting.keep([this, &listener](const asio::error_code& stopped) {

@@ -74,6 +74,8 @@ class Listeners {
   void accept(Listener& listener);
   void accepted(const Listener& listener, Socket socket);
   void cannot_accept(Listener& listener, const asio::error_code& error);
+  bool has_reserve() noexcept;
+  void pause(Listener& listener);
   void turn_away(Listener& listener) noexcept;
   std::string admit(Arrival& arrival, const std::string& counted);
   std::string url(const Listener& listener) const;
