@@ -14,7 +14,7 @@ import ldap
 import ldap.sasl
 import pytest
 
-from orv_e2e import clients, programs, wire
+from orv_e2e import clients, kerberos, programs, wire
 
 
 def mappings(pid):
@@ -82,7 +82,7 @@ def test_memory_is_closed_to_other_processes_of_the_same_user(instance):
         other.stdin.close()
 
 
-def reader(request, tmp_path):
+def reader(request, tmp_path, fixture="server"):
     """The server of a test that reads its memory; None when it has been run as somebody who may."""
     if os.geteuid() != 0:
         # In a user namespace of its own this very test is root over the daemon that it starts.
@@ -91,7 +91,7 @@ def reader(request, tmp_path):
                         "%s::%s" % (__file__, request.node.name)], check=True,
                        timeout=2 * programs.DEADLINE)
         return None
-    return request.getfixturevalue("server")
+    return request.getfixturevalue(fixture)
 
 
 def middle_of(password):
@@ -243,6 +243,44 @@ def test_passwords_that_changes_set_are_wiped(request, tmp_path, transport):
         check_what_the_layers_keep()
     for password in passwords:
         assert not remains(pid, password), password
+    assert holds(pid, server.config.path.name.encode())  # the search itself works
+
+
+@pytest.fixture
+def kerberized(instance, tmp_path, monkeypatch):
+    """A server whose primary administrator has a ticket, which this process shows."""
+    realm = kerberos.Realm(tmp_path / "realm")
+    instance.config.set(clients.BASE, "orv-slapdMaxUnauthenticatedMessageSize", str(1 << 20))
+    kerberos.with_kerberos(instance, realm.keytab("ldap/localhost"))
+    for name, value in realm.ticket("admin").items():
+        monkeypatch.setenv(name, value)
+    yield instance.start(environment=realm.environment)
+    realm.stop()
+
+
+@pytest.mark.parametrize("strength", ["minssf=1,maxssf=1", "minssf=56"])
+def test_passwords_under_a_layer_of_kerberos_are_wiped(request, tmp_path, strength):
+    server = reader(request, tmp_path, "kerberized")
+    if server is None:
+        return
+    pid = server.process.pid
+    password = b"Ri5#Hy3!sDf6Wq8&xkcJu"
+    client = ldap.initialize("ldap://localhost:%d" % server.port)
+    client.set_option(ldap.OPT_X_SASL_NOCANON, 1)
+    client.set_option(ldap.OPT_X_SASL_SECPROPS, strength)
+    client.sasl_interactive_bind_s("", ldap.sasl.gssapi())
+    with pytest.raises(ldap.UNDEFINED_TYPE):
+        client.add_s("cn=third,cn=admingroup,cn=configuration", [
+            ("objectClass", [b"top", b"orv-slapdConfigEntry", b"orv-slapdAdminGroupMember"]),
+            ("cn", b"third"), ("orv-slapdAdminPW", password), ("orv-none", b"x")])
+    client.add_s("cn=third,cn=admingroup,cn=configuration", [
+        ("objectClass", [b"top", b"orv-slapdConfigEntry", b"orv-slapdAdminGroupMember"]),
+        ("cn", b"third"), ("orv-slapdAdminDN", b"cn=third"),
+        ("orv-slapdAdminRole", b"SchemaAdmin"), ("orv-slapdAdminPW", password)])
+    # What the SASL library keeps is wiped by what is longer.
+    assert copies_of(pid, middle_of(password)) <= 2
+    client.search_s("", ldap.SCOPE_BASE, "(cn=%s)" % ("x" * 1000))
+    assert not remains(pid, password)
     assert holds(pid, server.config.path.name.encode())  # the search itself works
 
 

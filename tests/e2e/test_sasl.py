@@ -10,6 +10,7 @@ import pytest
 
 from orv_e2e import clients, kerberos, wire
 from orv_e2e.changes import GROUP, PASSWORD, add, member, modify, replaced
+from orv_e2e.kerberos import with_kerberos
 from orv_e2e.programs import DEADLINE, orvcfg
 
 BY_PASSWORD = ["DIGEST-MD5", "SCRAM-SHA-256"]
@@ -248,16 +249,6 @@ def realm(tmp_path_factory):
     made = kerberos.Realm(tmp_path_factory.mktemp("kerberos") / "realm")
     yield made
     made.stop()
-
-
-def with_kerberos(instance, keytab, name="orv-kn=admin@EXAMPLE.COM"):
-    """Has the keytab and the primary administrator's Kerberos identity in the file."""
-    instance.config.append(
-        ("\ndn: CN=KERBEROS,CN=CONFIGURATION\nobjectClass: top\nobjectClass: orv-slapdConfigEntry\n"
-         "objectClass: orv-slapdKerberos\ncn: Kerberos\norv-slapdKrbAdminDN: %s\n" % name).encode())
-    text = instance.config.path.read_text()
-    instance.config.path.write_text(text.replace(
-        "\ncn: AdminGroup\n", "\ncn: AdminGroup\norv-slapdKrbKeytab: %s\n" % keytab))
 
 
 def by_ticket(server, ticket, *more):

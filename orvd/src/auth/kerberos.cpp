@@ -12,7 +12,19 @@
 #include <new>
 #include <string_view>
 
+#include "cfg/secret.h"
 #include "slapi/file_trust.h"
+
+// The Kerberos library gives back what it has decrypted for a security layer as it is, and takes no
+// other functions for its memory. The plug-in of the SASL library releases it by this function, of
+// which the program's own is found first.
+extern "C" __attribute__((visibility("default"))) OM_uint32 gss_release_buffer(
+    OM_uint32* minor, gss_buffer_t buffer) {
+  static const auto release =
+      reinterpret_cast<decltype(&gss_release_buffer)>(dlsym(RTLD_NEXT, "gss_release_buffer"));
+  if (buffer != nullptr && buffer->value != nullptr) orv::cfg::wipe(buffer->value, buffer->length);
+  return release(minor, buffer);
+}
 
 namespace orv::server {
 namespace {

@@ -106,3 +106,13 @@ class Realm:
         cache = str(self.folder / (user.replace("/", "_") + ".cache"))
         self._run("kinit", "-k", "-t", str(self.keytab(user)), user, KRB5CCNAME=cache)
         return {**self.environment, "KRB5CCNAME": cache}
+
+
+def with_kerberos(instance, keytab, name="orv-kn=admin@EXAMPLE.COM"):
+    """Has the keytab and the primary administrator's Kerberos identity in the file."""
+    instance.config.append(
+        ("\ndn: CN=KERBEROS,CN=CONFIGURATION\nobjectClass: top\nobjectClass: orv-slapdConfigEntry\n"
+         "objectClass: orv-slapdKerberos\ncn: Kerberos\norv-slapdKrbAdminDN: %s\n" % name).encode())
+    text = instance.config.path.read_text()
+    instance.config.path.write_text(text.replace(
+        "\ncn: AdminGroup\n", "\ncn: AdminGroup\norv-slapdKrbKeytab: %s\n" % keytab))
