@@ -467,6 +467,7 @@ bool is_where_connections_read(std::string_view wanted) {
       end = last;
     }
     if (!line.starts_with("VmFlags:") || (line + " ").find(" dd ") == std::string::npos) continue;
+    if (end - begin > (std::size_t{64} << 20)) continue;  // a sanitizer's own
     std::string bytes(end - begin, '\0');
     memory.clear();
     memory.seekg(static_cast<std::streamoff>(begin));
