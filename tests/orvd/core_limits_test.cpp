@@ -471,8 +471,14 @@ TEST_F(LimitedServer, ClientsForWhomNoDescriptorIsLeftAreToldAndOthersAreServedL
     const double elapsed = std::chrono::duration<double>(Clock::now() - begun).count();
     EXPECT_LT(processor_seconds() - before, 0.5 + elapsed / 2);
   }
-  WireClient after(port());
-  EXPECT_EQ(code_of(after, test::search(1, "")), 0);
+  // The server may still be looking for another client to turn away.
+  const auto end = Clock::now() + 10s;
+  int code = 51;
+  while (code == 51 && Clock::now() < end) {
+    WireClient after(port());
+    code = code_of(after, test::search(1, ""));
+  }
+  EXPECT_EQ(code, 0);
   const std::string lines = log();
   EXPECT_GE(count(lines, "cannot accept a connection"), 1);
   EXPECT_LE(count(lines, "cannot accept a connection"), CutOffLog::kLines);
