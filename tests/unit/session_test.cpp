@@ -271,6 +271,7 @@ TEST_F(Session, EndThatCannotUnlockSaysSo) {
   platform.fail("pthread_mutex_unlock", 1, 1);
   end();
   EXPECT_THAT(platform.debug_lines(), ElementsAre(info("Could not unlock config mutex\n")));
+  EXPECT_EQ(platform.count("pthread_mutex_unlock"), 1) << "it is not tried again";
 }
 
 TEST_F(Session, DebugLinesNeedTheirTraceBit) {
