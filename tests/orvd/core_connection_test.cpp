@@ -309,14 +309,30 @@ TEST_F(ConnectionTest, BackendThatFailedWithItsLockHeldIsNotAskedToUnbind) {
   EXPECT_EQ(backend.calls(parameter::unbind_function), 0);
 }
 
+// ---- changes of a session by itself
+
+// Of the names of the targets, in the order in which they are changed.
+auto noting_first_letters(std::string& order) {
+  return [&order](pblock* parameters) {
+    order += test::target_of(parameters).substr(3, 1);
+    return test::finish_change(parameters, 0);
+  };
+}
+
+// Those of whoever is bound, as the change is made.
+auto taking_the_rights_away(test::ScriptedAuthenticator& authenticator) {
+  return [&authenticator](pblock* parameters) {
+    const int code = test::finish_change(parameters, 0);
+    authenticator.change(false);
+    return code;
+  };
+}
+
 // What is behind an operation that waits for the client to read is not done before it, though the
 // client has read by then.
 TEST_F(BareSessionTest, ChangesAreMadeInTheirOrderThoughTheFirstWasTurnedBack) {
   std::string order;
-  backend.on_change = [&](pblock* parameters) {
-    order += test::target_of(parameters).substr(3, 1);
-    return test::finish_change(parameters, 0);
-  };
+  backend.on_change = noting_first_letters(order);
   bind_as_root();
   for (int i = 0; i < 20; ++i) {
     order.clear();
@@ -338,10 +354,7 @@ TEST_F(BareSessionTest, ChangesAreMadeInTheirOrderThoughTheFirstWasTurnedBack) {
 
 TEST_F(BareSessionTest, ChangesBehindOneThatIsHeldAreHeld) {
   std::string order;
-  backend.on_change = [&](pblock* parameters) {
-    order += test::target_of(parameters).substr(3, 1);
-    return test::finish_change(parameters, 0);
-  };
+  backend.on_change = noting_first_letters(order);
   bind_as_root();
   session->output().answered(OutputShare::kMark);
   session->handle(test::delete_entry(2, "cn=a,cn=configuration"));
@@ -399,11 +412,7 @@ TEST_F(BareSessionTest, AdmissionThatCannotBePostedKeepsTheGateAndIsPickedUpLate
 // Some clients throw away what they have not read when they find the connection ended.
 TEST_F(BareSessionTest, WhoChangedTheirOwnRightsHaveTimeToReadTheAnswerAndNothingElse) {
   bind_as_root();
-  backend.on_change = [this](pblock* parameters) {
-    const int code = test::finish_change(parameters, 0);
-    authenticator.change(false);
-    return code;
-  };
+  backend.on_change = taking_the_rights_away(authenticator);
   session->handle(test::modify(2, kTop, "description", "x"));
   ASSERT_TRUE(session->run_until([this] { return session->idle(); }));
   EXPECT_EQ(result_in(session->sent).code, 0);
@@ -417,11 +426,7 @@ TEST_F(BareSessionTest, WhoChangedTheirOwnRightsHaveTimeToReadTheAnswerAndNothin
 
 TEST_F(BareSessionTest, WhoChangedTheirOwnRightsAreDisconnectedAMomentLater) {
   bind_as_root();
-  backend.on_change = [this](pblock* parameters) {
-    const int code = test::finish_change(parameters, 0);
-    authenticator.change(false);
-    return code;
-  };
+  backend.on_change = taking_the_rights_away(authenticator);
   session->handle(test::modify(2, kTop, "description", "x"));
   EXPECT_TRUE(session->run_until([this] { return session->ended; }));
 }

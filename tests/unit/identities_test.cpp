@@ -46,6 +46,16 @@ class Identities : public BackendTest {
     EXPECT_EQ(platform.count("pthread_mutex_lock"), 0);
   }
 
+  // `code` is what the library says of the first entry: an error, or that there is none.
+  void expect_report_of_a_member_not_taken(int code) {
+    platform.forget();
+    file(kMember, {{"orv-slapdAdminDN", {"CN=M"}}});
+    platform.fail("cfg_first_entry", 1, code);
+    EXPECT_EQ(member_dn(), "null");
+    EXPECT_THAT(platform.calls({"cfg_perror"}),
+                ElementsAre("cfg_perror(session, \"cfg_first_entry\")"));
+  }
+
   [[nodiscard]] DebugLine last_line() const { return platform.debug_lines().back(); }
 
   _CFG* session;
@@ -526,26 +536,16 @@ TEST_F(Identities, MemberSearchThatFailsWithEntriesStillGivesNull) {
 }
 
 TEST_F(Identities, MemberWhoseEntryCannotBeTakenIsReported) {
-  file(kMember, {{"orv-slapdAdminDN", {"CN=M"}}});
   for (const int code : {1, 0}) {
-    platform.forget();
-    platform.fail("cfg_first_entry", 1, code);
-    EXPECT_EQ(member_dn(), "null");
-    EXPECT_THAT(platform.calls({"cfg_perror"}),
-                ElementsAre("cfg_perror(session, \"cfg_first_entry\")"));
+    expect_report_of_a_member_not_taken(code);
     expect_released_and_free_of_locks();
   }
 }
 
 TEST_F(Identities, MemberWhoseEntryCannotBeTakenIsReportedWithoutTheTraceToo) {
   debug_off();
-  file(kMember, {{"orv-slapdAdminDN", {"CN=M"}}});
   for (const int code : {1, 0}) {
-    platform.forget();
-    platform.fail("cfg_first_entry", 1, code);
-    EXPECT_EQ(member_dn(), "null");
-    EXPECT_THAT(platform.calls({"cfg_perror"}),
-                ElementsAre("cfg_perror(session, \"cfg_first_entry\")"));
+    expect_report_of_a_member_not_taken(code);
     EXPECT_THAT(platform.debug_lines(), IsEmpty());
   }
 }
